@@ -1,0 +1,488 @@
+#include "plist/PropertyListFormat.h"
+
+#include <fcntl.h>
+#include <plist/plist.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cctype>
+#include <cerrno>
+#include <cmath>
+#include <cstdint>
+#include <cstdlib>
+#include <cstring>
+#include <limits>
+#include <memory>
+#include <vector>
+
+#include "util/UniqueFd.h"
+
+namespace tavrix::plist {
+namespace {
+
+struct NodeDeleter {
+    void operator()(void* node) const { plist_free(node); }
+};
+using Node = std::unique_ptr<void, NodeDeleter>;
+
+struct XmlBufferDeleter {
+    void operator()(char* buffer) const { plist_to_xml_free(buffer); }
+};
+struct BinaryBufferDeleter {
+    void operator()(char* buffer) const { plist_to_bin_free(buffer); }
+};
+struct MallocDeleter {
+    void operator()(char* buffer) const { std::free(buffer); }
+};
+
+// Deeper documents are refused rather than risking the stack on hostile input.
+constexpr int kMaxDepth = 512;
+// libplist takes 32-bit lengths.
+constexpr std::size_t kMaxInputBytes = std::numeric_limits<std::uint32_t>::max();
+constexpr std::int64_t kMicrosPerSecond = 1000000;
+
+// libplist 2.2 keeps whole seconds of XML dates only; the fractions are taken from the date texts,
+// which appear in the document in the same order as libplist's tree holds them.
+std::vector<std::string_view> xmlDateTexts(std::string_view xml) {
+    static constexpr std::string_view kOpen = "<date>";
+    static constexpr std::string_view kClose = "</date>";
+    std::vector<std::string_view> texts;
+    for (std::size_t at = xml.find(kOpen); at != std::string_view::npos;
+         at = xml.find(kOpen, at)) {
+        at += kOpen.size();
+        std::size_t end = xml.find(kClose, at);
+        if (end == std::string_view::npos) {
+            break;
+        }
+        texts.push_back(xml.substr(at, end - at));
+        at = end + kClose.size();
+    }
+    return texts;
+}
+
+// Microseconds in the fraction of an XML date text such as "2001-01-01T00:00:00.25Z".
+std::int64_t fractionMicros(std::string_view text) {
+    std::size_t dot = text.find('.');
+    if (dot == std::string_view::npos) {
+        return 0;
+    }
+    std::int64_t micros = 0;
+    std::int64_t scale = kMicrosPerSecond / 10;
+    for (std::size_t i = dot + 1; i < text.size() && text[i] >= '0' && text[i] <= '9'; ++i) {
+        micros += (text[i] - '0') * scale;
+        scale /= 10;
+    }
+    return micros;
+}
+
+Date dateFromParts(std::int64_t seconds, std::int64_t micros) {
+    // One division of an exact integer gives the double nearest to the decimal value.
+    return Date{static_cast<double>(seconds * kMicrosPerSecond + micros) / kMicrosPerSecond};
+}
+
+std::size_t countDates(plist_t node, int depth) {
+    if (depth > kMaxDepth) {
+        return 0;
+    }
+    std::size_t count = 0;
+    switch (plist_get_node_type(node)) {
+        case PLIST_DATE: return 1;
+        case PLIST_ARRAY:
+            for (uint32_t i = 0, n = plist_array_get_size(node); i < n; ++i) {
+                count += countDates(plist_array_get_item(node, i), depth + 1);
+            }
+            return count;
+        case PLIST_DICT: {
+            plist_dict_iter iter = nullptr;
+            plist_dict_new_iter(node, &iter);
+            for (;;) {
+                char* key = nullptr;
+                plist_t child = nullptr;
+                plist_dict_next_item(node, iter, &key, &child);
+                std::free(key);
+                if (child == nullptr) {
+                    break;
+                }
+                count += countDates(child, depth + 1);
+            }
+            std::free(iter);
+            return count;
+        }
+        default: return 0;
+    }
+}
+
+class NodeReader {
+public:
+    explicit NodeReader(std::vector<std::string_view> dateTexts)
+        : dateTexts_(std::move(dateTexts)) {}
+
+    std::optional<Value> read(plist_t node, int depth) {
+        if (depth > kMaxDepth || node == nullptr) {
+            return std::nullopt;
+        }
+        switch (plist_get_node_type(node)) {
+            case PLIST_BOOLEAN: {
+                uint8_t value = 0;
+                plist_get_bool_val(node, &value);
+                return Value(value != 0);
+            }
+            case PLIST_UINT:
+            case PLIST_UID: {
+                uint64_t value = 0;
+                if (plist_get_node_type(node) == PLIST_UID) {
+                    plist_get_uid_val(node, &value);
+                    return Value(Integer::fromUnsigned(value));
+                }
+                plist_get_uint_val(node, &value);
+                return Value(isLargeUnsigned(node, value) ? Integer::fromUnsigned(value)
+                                                          : Integer(static_cast<int64_t>(value)));
+            }
+            case PLIST_REAL: {
+                double value = 0;
+                plist_get_real_val(node, &value);
+                return Value(value);
+            }
+            case PLIST_STRING:
+            case PLIST_KEY: {
+                uint64_t length = 0;
+                const char* text = plist_get_string_ptr(node, &length);
+                return Value(std::string(text == nullptr ? "" : text, text == nullptr ? 0 : length));
+            }
+            case PLIST_DATA: {
+                uint64_t length = 0;
+                const char* bytes = plist_get_data_ptr(node, &length);
+                const auto* begin = reinterpret_cast<const std::uint8_t*>(bytes);
+                return Value(bytes == nullptr ? Data{} : Data(begin, begin + length));
+            }
+            case PLIST_DATE: {
+                int32_t seconds = 0;
+                int32_t micros = 0;
+                plist_get_date_val(node, &seconds, &micros);
+                // libplist answers the truncated seconds and the fraction's magnitude.
+                if (seconds < 0) {
+                    micros = -micros;
+                }
+                if (nextDate_ < dateTexts_.size()) {
+                    micros += static_cast<int32_t>(fractionMicros(dateTexts_[nextDate_++]));
+                }
+                return Value(dateFromParts(seconds, micros));
+            }
+            case PLIST_ARRAY: {
+                Array array;
+                uint32_t size = plist_array_get_size(node);
+                array.reserve(size);
+                for (uint32_t i = 0; i < size; ++i) {
+                    auto item = read(plist_array_get_item(node, i), depth + 1);
+                    if (!item) {
+                        return std::nullopt;
+                    }
+                    array.push_back(std::move(*item));
+                }
+                return Value(std::move(array));
+            }
+            case PLIST_DICT: return readDictionary(node, depth);
+            default: return std::nullopt;
+        }
+    }
+
+private:
+    // libplist marks integers read as unsigned above INT64_MAX with a 16-byte length; that length is
+    // not public, but such a node serializes without a minus sign, which is what tells them apart.
+    static bool isLargeUnsigned(plist_t node, uint64_t value) {
+        if (value <= static_cast<uint64_t>(std::numeric_limits<int64_t>::max())) {
+            return false;
+        }
+        Node wrapper(plist_new_array());
+        plist_array_append_item(wrapper.get(), plist_copy(node));
+        char* xml = nullptr;
+        uint32_t length = 0;
+        plist_to_xml(wrapper.get(), &xml, &length);
+        std::unique_ptr<char, XmlBufferDeleter> owned(xml);
+        return xml != nullptr && std::strstr(xml, "<integer>-") == nullptr;
+    }
+
+    std::optional<Value> readDictionary(plist_t node, int depth) {
+        Dictionary dictionary;
+        plist_dict_iter iter = nullptr;
+        plist_dict_new_iter(node, &iter);
+        std::unique_ptr<void, decltype(&std::free)> iterOwner(iter, &std::free);
+        for (;;) {
+            char* rawKey = nullptr;
+            plist_t child = nullptr;
+            plist_dict_next_item(node, iter, &rawKey, &child);
+            std::unique_ptr<char, MallocDeleter> key(rawKey);
+            if (child == nullptr) {
+                break;
+            }
+            auto value = read(child, depth + 1);
+            if (!value || key == nullptr) {
+                return std::nullopt;
+            }
+            dictionary.insert_or_assign(std::string(key.get()), std::move(*value));
+        }
+        return Value(std::move(dictionary));
+    }
+
+    std::vector<std::string_view> dateTexts_;
+    std::size_t nextDate_ = 0;
+};
+
+// Builds libplist's tree; records the microsecond fraction of every date in document order so the
+// XML writer can put them back.
+class NodeWriter {
+public:
+    // With wholeSecondDates, dates go to libplist without their fractions (its XML writer mangles
+    // fractions of dates before the reference date); the fractions are patched in afterwards.
+    explicit NodeWriter(bool wholeSecondDates) : wholeSecondDates_(wholeSecondDates) {}
+
+    Node write(const Value& value) { return Node(build(value)); }
+    const std::vector<std::int64_t>& dateFractions() const { return dateFractions_; }
+    bool hasFractionalDate() const { return hasFractionalDate_; }
+
+private:
+    plist_t build(const Value& value) {
+        switch (value.type()) {
+            case Type::Dictionary: {
+                plist_t dictionary = plist_new_dict();
+                for (const auto& [key, child] : *value.asDictionary()) {
+                    plist_dict_set_item(dictionary, key.c_str(), build(child));
+                }
+                return dictionary;
+            }
+            case Type::Array: {
+                plist_t array = plist_new_array();
+                for (const auto& child : *value.asArray()) {
+                    plist_array_append_item(array, build(child));
+                }
+                return array;
+            }
+            case Type::String: return plist_new_string(value.asString()->c_str());
+            case Type::Integer: return buildInteger(*value.asInteger());
+            case Type::Real: return plist_new_real(*value.asReal());
+            case Type::Boolean: return plist_new_bool(*value.asBoolean() ? 1 : 0);
+            case Type::Date: return buildDate(*value.asDate());
+            case Type::Data: {
+                const Data& data = *value.asData();
+                return plist_new_data(reinterpret_cast<const char*>(data.data()), data.size());
+            }
+        }
+        return plist_new_bool(0);
+    }
+
+    // plist_new_uint marks every value as signed; an unsigned value above INT64_MAX gets its
+    // unsigned marking only from libplist's own XML reader.
+    static plist_t buildInteger(const Integer& integer) {
+        if (integer.isLargeUnsigned()) {
+            std::string xml =
+                "<plist><integer>" + std::to_string(integer.unsignedValue()) + "</integer></plist>";
+            plist_t node = nullptr;
+            plist_from_xml(xml.data(), static_cast<uint32_t>(xml.size()), &node);
+            if (node != nullptr) {
+                return node;
+            }
+        }
+        return plist_new_uint(integer.unsignedValue());
+    }
+
+    plist_t buildDate(const Date& date) {
+        double totalMicros = std::round(date.secondsSinceReferenceDate * kMicrosPerSecond);
+        // libplist holds dates as 32-bit seconds; later or earlier dates are clamped to its range.
+        constexpr double kMinMicros = static_cast<double>(INT32_MIN) * kMicrosPerSecond;
+        constexpr double kMaxMicros = static_cast<double>(INT32_MAX) * kMicrosPerSecond;
+        if (!(totalMicros >= kMinMicros)) {
+            totalMicros = kMinMicros;
+        }
+        if (totalMicros > kMaxMicros) {
+            totalMicros = kMaxMicros;
+        }
+        auto micros = static_cast<std::int64_t>(totalMicros);
+        std::int64_t seconds = micros / kMicrosPerSecond;
+        std::int64_t fraction = micros % kMicrosPerSecond;
+        if (fraction < 0) {
+            fraction += kMicrosPerSecond;
+            seconds -= 1;
+        }
+        dateFractions_.push_back(fraction);
+        hasFractionalDate_ = hasFractionalDate_ || fraction != 0;
+        return plist_new_date(static_cast<int32_t>(seconds),
+                              wholeSecondDates_ ? 0 : static_cast<int32_t>(fraction));
+    }
+
+    bool wholeSecondDates_;
+    std::vector<std::int64_t> dateFractions_;
+    bool hasFractionalDate_ = false;
+};
+
+// libplist's XML carries a DOCTYPE naming an outside document; a property list needs none.
+void removeDoctype(std::string& xml) {
+    std::size_t start = xml.find("<!DOCTYPE");
+    if (start == std::string::npos || start > 256) {
+        return;
+    }
+    std::size_t end = xml.find('>', start);
+    if (end == std::string::npos) {
+        return;
+    }
+    end += 1;
+    if (end < xml.size() && xml[end] == '\n') {
+        end += 1;
+    }
+    xml.erase(start, end - start);
+}
+
+// Puts the fractions back into the date texts, which libplist writes as whole seconds.
+std::string insertDateFractions(std::string_view xml, const std::vector<std::int64_t>& fractions) {
+    static constexpr std::string_view kOpen = "<date>";
+    std::string out;
+    out.reserve(xml.size() + fractions.size() * 7);
+    std::size_t copied = 0;
+    std::size_t index = 0;
+    for (std::size_t at = xml.find(kOpen); at != std::string_view::npos && index < fractions.size();
+         at = xml.find(kOpen, at)) {
+        std::size_t zone = xml.find("Z</date>", at);
+        if (zone == std::string_view::npos) {
+            break;
+        }
+        std::int64_t fraction = fractions[index++];
+        at = zone;
+        if (fraction == 0) {
+            continue;
+        }
+        out.append(xml.substr(copied, zone - copied));
+        char digits[16];
+        std::snprintf(digits, sizeof digits, ".%06lld", static_cast<long long>(fraction));
+        std::string_view text(digits);
+        while (text.back() == '0') {
+            text.remove_suffix(1);
+        }
+        out.append(text);
+        copied = zone;
+    }
+    out.append(xml.substr(copied));
+    return out;
+}
+
+bool endsWithClosingTag(std::string_view xml) {
+    while (!xml.empty() && (xml.back() == '\0' || std::isspace(static_cast<unsigned char>(xml.back())))) {
+        xml.remove_suffix(1);
+    }
+    return xml.ends_with("</plist>");
+}
+
+}  // namespace
+
+std::optional<Value> parse(std::string_view bytes) {
+    if (bytes.empty() || bytes.size() > kMaxInputBytes) {
+        return std::nullopt;
+    }
+    plist_t raw = nullptr;
+    bool binary = plist_is_binary(bytes.data(), static_cast<uint32_t>(bytes.size())) != 0;
+    // libplist accepts a document cut off before its closing tag; a truncated file is no value.
+    if (!binary && !endsWithClosingTag(bytes)) {
+        return std::nullopt;
+    }
+    plist_from_memory(bytes.data(), static_cast<uint32_t>(bytes.size()), &raw);
+    Node root(raw);
+    if (!root) {
+        return std::nullopt;
+    }
+    std::vector<std::string_view> dateTexts;
+    if (!binary) {
+        dateTexts = xmlDateTexts(bytes);
+        if (dateTexts.size() != countDates(root.get(), 0)) {
+            dateTexts.clear();
+        }
+    }
+    return NodeReader(std::move(dateTexts)).read(root.get(), 0);
+}
+
+std::optional<std::string> readFileBytes(const std::string& path) {
+    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    if (!fd) {
+        return std::nullopt;
+    }
+    struct stat info {};
+    if (::fstat(fd.get(), &info) != 0 || !S_ISREG(info.st_mode)) {
+        return std::nullopt;
+    }
+    std::string bytes;
+    bytes.resize(static_cast<std::size_t>(info.st_size));
+    std::size_t filled = 0;
+    for (;;) {
+        if (filled == bytes.size()) {
+            // The file may have grown since fstat.
+            bytes.resize(bytes.size() + 4096);
+        }
+        ssize_t got = ::read(fd.get(), bytes.data() + filled, bytes.size() - filled);
+        if (got < 0 && errno == EINTR) {
+            continue;
+        }
+        if (got < 0) {
+            return std::nullopt;
+        }
+        if (got == 0) {
+            break;
+        }
+        filled += static_cast<std::size_t>(got);
+    }
+    bytes.resize(filled);
+    return bytes;
+}
+
+std::optional<Value> readFile(const std::string& path) {
+    auto bytes = readFileBytes(path);
+    if (!bytes) {
+        return std::nullopt;
+    }
+    return parse(*bytes);
+}
+
+std::string serialize(const Value& value, Format format) {
+    NodeWriter writer(format == Format::Xml);
+    Node root = writer.write(value);
+    uint32_t length = 0;
+    if (format == Format::Binary) {
+        char* bytes = nullptr;
+        plist_to_bin(root.get(), &bytes, &length);
+        std::unique_ptr<char, BinaryBufferDeleter> owned(bytes);
+        return bytes == nullptr ? std::string() : std::string(bytes, length);
+    }
+    char* xml = nullptr;
+    plist_to_xml(root.get(), &xml, &length);
+    std::unique_ptr<char, XmlBufferDeleter> owned(xml);
+    if (xml == nullptr) {
+        return {};
+    }
+    std::string text(xml, length);
+    removeDoctype(text);
+    if (writer.hasFractionalDate()) {
+        return insertDateFractions(text, writer.dateFractions());
+    }
+    return text;
+}
+
+bool writeFile(const std::string& path, const Value& value, Format format) {
+    std::string bytes = serialize(value, format);
+    if (bytes.empty()) {
+        return false;
+    }
+    UniqueFd fd(::open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644));
+    if (!fd) {
+        return false;
+    }
+    std::size_t written = 0;
+    while (written < bytes.size()) {
+        ssize_t put = ::write(fd.get(), bytes.data() + written, bytes.size() - written);
+        if (put < 0 && errno == EINTR) {
+            continue;
+        }
+        if (put <= 0) {
+            return false;
+        }
+        written += static_cast<std::size_t>(put);
+    }
+    return true;
+}
+
+}  // namespace tavrix::plist

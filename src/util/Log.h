@@ -1,0 +1,20 @@
+// The daemon's three log wrappers. Each writes its message unchanged (no prefix, level or time
+// stamp) to the system log.
+//
+// Object formats are printf formats plus "%@", whose argument is a `const tavrix::plist::Value*`
+// rendered by its description, or "(null)" for a null pointer.
+#pragma once
+
+#include <cstdarg>
+#include <string>
+
+namespace tavrix {
+
+void logObjectFormat(const char* format, ...);
+void logObjectFormatV(const char* format, va_list arguments);
+void logCFormat(const char* format, ...) __attribute__((format(printf, 1, 2)));
+
+// The message an object format produces, without logging it.
+std::string formatObjectMessage(const char* format, va_list arguments);
+
+}  // namespace tavrix
