@@ -1,0 +1,47 @@
+#include "plist/CachedPropertyListFile.h"
+
+#include <sys/stat.h>
+
+#include "plist/PropertyListFormat.h"
+
+namespace tavrix::plist {
+
+bool CachedPropertyListFile::Identity::operator==(const Identity& other) const {
+    return device == other.device && inode == other.inode && size == other.size &&
+           modified.tv_sec == other.modified.tv_sec && modified.tv_nsec == other.modified.tv_nsec;
+}
+
+CachedPropertyListFile::CachedPropertyListFile(std::string path) : path_(std::move(path)) {}
+
+CachedPropertyListFile::Snapshot CachedPropertyListFile::read() {
+    struct stat info {};
+    Identity current;
+    if (::stat(path_.c_str(), &info) == 0) {
+        current = {info.st_dev, info.st_ino, info.st_size, info.st_mtim};
+    }
+    std::lock_guard lock(mutex_);
+    if (cached_ && current == identity_) {
+        return {state_, value_, false};
+    }
+    cached_ = true;
+    identity_ = current;
+    value_.reset();
+    if (current.size < 0) {
+        state_ = State::Missing;
+        return {state_, nullptr, true};
+    }
+    auto parsed = readFile(path_);
+    state_ = parsed ? State::Valid : State::Damaged;
+    if (parsed) {
+        value_ = std::make_shared<const Value>(std::move(*parsed));
+    }
+    return {state_, value_, true};
+}
+
+void CachedPropertyListFile::invalidate() {
+    std::lock_guard lock(mutex_);
+    cached_ = false;
+    value_.reset();
+}
+
+}  // namespace tavrix::plist

@@ -1,0 +1,56 @@
+// A property-list file whose parsed value is kept until the file changes. Reading checks the
+// file's identity and modification time (following symbolic links) and parses only when they
+// differ from the cached ones. Safe to use from several threads.
+#pragma once
+
+#include <sys/types.h>
+
+#include <ctime>
+#include <memory>
+#include <mutex>
+#include <string>
+
+#include "plist/Value.h"
+
+namespace tavrix::plist {
+
+class CachedPropertyListFile {
+public:
+    enum class State { Missing, Damaged, Valid };
+
+    struct Snapshot {
+        State state = State::Missing;
+        // The file's value when Valid, else null.
+        std::shared_ptr<const Value> value;
+        // True when this read parsed the file (the first read of a new version of it).
+        bool freshlyRead = false;
+    };
+
+    explicit CachedPropertyListFile(std::string path);
+
+    const std::string& path() const { return path_; }
+
+    // The file's current value, parsed again only when the file changed since the last read.
+    Snapshot read();
+
+    // Forgets the cached value so that the next read parses the file.
+    void invalidate();
+
+private:
+    struct Identity {
+        dev_t device = 0;
+        ino_t inode = 0;
+        off_t size = -1;
+        timespec modified{};
+        bool operator==(const Identity& other) const;
+    };
+
+    std::string path_;
+    std::mutex mutex_;
+    bool cached_ = false;
+    Identity identity_;
+    State state_ = State::Missing;
+    std::shared_ptr<const Value> value_;
+};
+
+}  // namespace tavrix::plist
