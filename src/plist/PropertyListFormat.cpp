@@ -187,19 +187,14 @@ public:
     }
 
 private:
-    // libplist marks integers read as unsigned above INT64_MAX with a 16-byte length; that length is
-    // not public, but such a node serializes without a minus sign, which is what tells them apart.
+    // libplist marks integers read as unsigned above INT64_MAX with a 16-byte length, which is not
+    // public; its node comparison does look at the length, so a signed twin tells them apart.
     static bool isLargeUnsigned(plist_t node, uint64_t value) {
         if (value <= static_cast<uint64_t>(std::numeric_limits<int64_t>::max())) {
             return false;
         }
-        Node wrapper(plist_new_array());
-        plist_array_append_item(wrapper.get(), plist_copy(node));
-        char* xml = nullptr;
-        uint32_t length = 0;
-        plist_to_xml(wrapper.get(), &xml, &length);
-        std::unique_ptr<char, XmlBufferDeleter> owned(xml);
-        return xml != nullptr && std::strstr(xml, "<integer>-") == nullptr;
+        Node signedTwin(plist_new_uint(value));
+        return plist_compare_node_value(node, signedTwin.get()) == 0;
     }
 
     std::optional<Value> readDictionary(plist_t node, int depth) {
@@ -219,7 +214,8 @@ private:
             if (!value || key == nullptr) {
                 return std::nullopt;
             }
-            dictionary.insert_or_assign(std::string(key.get()), std::move(*value));
+            // Files this process writes hold their keys sorted, so the end is usually the spot.
+            dictionary.insert_or_assign(dictionary.end(), std::string(key.get()), std::move(*value));
         }
         return Value(std::move(dictionary));
     }
@@ -390,7 +386,7 @@ std::optional<Value> parse(std::string_view bytes) {
     std::vector<std::string_view> dateTexts;
     if (!binary) {
         dateTexts = xmlDateTexts(bytes);
-        if (dateTexts.size() != countDates(root.get(), 0)) {
+        if (!dateTexts.empty() && dateTexts.size() != countDates(root.get(), 0)) {
             dateTexts.clear();
         }
     }
