@@ -33,7 +33,7 @@ test-asan: deps $(ASAN_BUILD)/build.ninja
 	    ctest --test-dir $(ASAN_BUILD) -j $(JOBS) --output-on-failure
 
 fuzz: deps $(FUZZ_BUILD)/build.ninja
-	cmake --build $(FUZZ_BUILD) -j $(JOBS)
+	cmake --build $(FUZZ_BUILD) -j $(JOBS) --target fuzz_targets
 	tests/fuzz/run.sh $(FUZZ_BUILD) $(FUZZ_SECONDS)
 
 bench: build

@@ -6,6 +6,7 @@
 
 #include <cerrno>
 #include <filesystem>
+#include <initializer_list>
 #include <vector>
 
 #include "platform/PlatformRoot.h"
@@ -82,8 +83,8 @@ bool isKeyName(std::string_view key) {
         return false;
     }
     for (char c : key) {
-        bool ok = (c >= 'A' && c <= 'Z') || (c >= 'a' && c <= 'z') || (c >= '0' && c <= '9') ||
-                  c == '_';
+        bool ok =
+            (c >= 'A' && c <= 'Z') || (c >= 'a' && c <= 'z') || (c >= '0' && c <= '9') || c == '_';
         if (!ok) {
             return false;
         }
@@ -130,8 +131,7 @@ std::optional<std::string> osReleaseValue(std::string_view root, std::string_vie
 // Calls visit with each entry of a sysfs class directory until it answers true. Nothing when
 // the directory cannot be read, so that a system without it stays "unknown".
 template <typename Visit>
-std::optional<bool> anyClassEntry(std::string_view root, std::string_view classPath,
-                                  Visit visit) {
+std::optional<bool> anyClassEntry(std::string_view root, std::string_view classPath, Visit visit) {
     std::error_code error;
     std::filesystem::directory_iterator entries(resolvePathUnder(root, classPath), error);
     if (error) {
@@ -247,10 +247,12 @@ std::optional<plist::Value> runningSystemAnswer(std::string_view root, std::stri
     // The product is what the machine is sold as, the hardware model the board inside it; a
     // device tree names only one model, which then stands for both.
     if (key == "ProductType") {
-        return stringAnswer(firstAttribute(root, {kDeviceTreeModel, kDmiProductName, kDmiBoardName}));
+        return stringAnswer(
+            firstAttribute(root, {kDeviceTreeModel, kDmiProductName, kDmiBoardName}));
     }
     if (key == "HWModelStr") {
-        return stringAnswer(firstAttribute(root, {kDeviceTreeModel, kDmiBoardName, kDmiProductName}));
+        return stringAnswer(
+            firstAttribute(root, {kDeviceTreeModel, kDmiBoardName, kDmiProductName}));
     }
     if (key == "SerialNumber") {
         return stringAnswer(firstAttribute(root, {kDmiSerial, kDeviceTreeSerial}));

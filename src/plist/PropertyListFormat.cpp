@@ -75,6 +75,70 @@ std::int64_t fractionMicros(std::string_view text) {
     return micros;
 }
 
+// Strings are UTF-8 text; bytes that are not cannot be written back as XML, so such a string makes
+// the document damaged.
+bool isValidUtf8(std::string_view text) {
+    std::size_t i = 0;
+    while (i < text.size()) {
+        auto byte = static_cast<unsigned char>(text[i]);
+        std::size_t extra = 0;
+        std::uint32_t codePoint = 0;
+        if (byte < 0x80) {
+            ++i;
+            continue;
+        } else if ((byte & 0xE0) == 0xC0) {
+            extra = 1;
+            codePoint = byte & 0x1F;
+        } else if ((byte & 0xF0) == 0xE0) {
+            extra = 2;
+            codePoint = byte & 0x0F;
+        } else if ((byte & 0xF8) == 0xF0) {
+            extra = 3;
+            codePoint = byte & 0x07;
+        } else {
+            return false;
+        }
+        if (extra >= text.size() - i) {
+            return false;  // cut off inside a sequence
+        }
+        for (std::size_t k = 1; k <= extra; ++k) {
+            auto next = static_cast<unsigned char>(text[i + k]);
+            if ((next & 0xC0) != 0x80) {
+                return false;
+            }
+            codePoint = (codePoint << 6) | (next & 0x3F);
+        }
+        static constexpr std::uint32_t kSmallest[] = {0, 0x80, 0x800, 0x10000};
+        if (codePoint < kSmallest[extra] || codePoint > 0x10FFFF ||
+            (codePoint >= 0xD800 && codePoint <= 0xDFFF)) {
+            return false;
+        }
+        i += extra + 1;
+    }
+    return true;
+}
+
+// Calls visit(key node, value node) for every entry of a dictionary node; false when an entry is
+// malformed. Keys are checked before libplist reads them: it asserts on a key that is no key,
+// which a damaged binary file can produce.
+template <typename Visit>
+bool forEachEntry(plist_t dictionary, Visit&& visit) {
+    plist_dict_iter iter = nullptr;
+    plist_dict_new_iter(dictionary, &iter);
+    std::unique_ptr<void, decltype(&std::free)> iterOwner(iter, &std::free);
+    for (;;) {
+        plist_t child = nullptr;
+        plist_dict_next_item(dictionary, iter, nullptr, &child);
+        if (child == nullptr) {
+            return true;
+        }
+        plist_t key = plist_dict_item_get_key(child);
+        if (key == nullptr || plist_get_node_type(key) != PLIST_KEY || !visit(key, child)) {
+            return false;
+        }
+    }
+}
+
 Date dateFromParts(std::int64_t seconds, std::int64_t micros) {
     // One division of an exact integer gives the double nearest to the decimal value.
     return Date{static_cast<double>(seconds * kMicrosPerSecond + micros) / kMicrosPerSecond};
@@ -92,22 +156,12 @@ std::size_t countDates(plist_t node, int depth) {
                 count += countDates(plist_array_get_item(node, i), depth + 1);
             }
             return count;
-        case PLIST_DICT: {
-            plist_dict_iter iter = nullptr;
-            plist_dict_new_iter(node, &iter);
-            for (;;) {
-                char* key = nullptr;
-                plist_t child = nullptr;
-                plist_dict_next_item(node, iter, &key, &child);
-                std::free(key);
-                if (child == nullptr) {
-                    break;
-                }
+        case PLIST_DICT:
+            forEachEntry(node, [&](plist_t, plist_t child) {
                 count += countDates(child, depth + 1);
-            }
-            std::free(iter);
+                return true;
+            });
             return count;
-        }
         default: return 0;
     }
 }
@@ -147,7 +201,11 @@ public:
             case PLIST_KEY: {
                 uint64_t length = 0;
                 const char* text = plist_get_string_ptr(node, &length);
-                return Value(std::string(text == nullptr ? "" : text, text == nullptr ? 0 : length));
+                std::string_view view(text == nullptr ? "" : text, text == nullptr ? 0 : length);
+                if (!isValidUtf8(view)) {
+                    return std::nullopt;
+                }
+                return Value(view);
             }
             case PLIST_DATA: {
                 uint64_t length = 0;
@@ -199,23 +257,20 @@ private:
 
     std::optional<Value> readDictionary(plist_t node, int depth) {
         Dictionary dictionary;
-        plist_dict_iter iter = nullptr;
-        plist_dict_new_iter(node, &iter);
-        std::unique_ptr<void, decltype(&std::free)> iterOwner(iter, &std::free);
-        for (;;) {
-            char* rawKey = nullptr;
-            plist_t child = nullptr;
-            plist_dict_next_item(node, iter, &rawKey, &child);
-            std::unique_ptr<char, MallocDeleter> key(rawKey);
-            if (child == nullptr) {
-                break;
-            }
+        bool complete = forEachEntry(node, [&](plist_t keyNode, plist_t child) {
             auto value = read(child, depth + 1);
-            if (!value || key == nullptr) {
-                return std::nullopt;
+            char* rawKey = nullptr;
+            plist_get_key_val(keyNode, &rawKey);
+            std::unique_ptr<char, MallocDeleter> key(rawKey);
+            if (!value || key == nullptr || !isValidUtf8(key.get())) {
+                return false;
             }
             // Files this process writes hold their keys sorted, so the end is usually the spot.
             dictionary.insert_or_assign(dictionary.end(), std::string(key.get()), std::move(*value));
+            return true;
+        });
+        if (!complete) {
+            return std::nullopt;
         }
         return Value(std::move(dictionary));
     }
@@ -359,6 +414,17 @@ std::string insertDateFractions(std::string_view xml, const std::vector<std::int
     return out;
 }
 
+// A binary file can hold a key or string with a NUL inside. libplist reads such a key only by
+// failing an assertion, which would end the process; its XML writer does copy the whole key, so a
+// NUL in that text gives the damage away before any key is read.
+bool hasEmbeddedNul(plist_t root) {
+    char* xml = nullptr;
+    uint32_t length = 0;
+    plist_to_xml(root, &xml, &length);
+    std::unique_ptr<char, XmlBufferDeleter> owned(xml);
+    return xml == nullptr || std::memchr(xml, '\0', length) != nullptr;
+}
+
 bool endsWithClosingTag(std::string_view xml) {
     while (!xml.empty() && (xml.back() == '\0' || std::isspace(static_cast<unsigned char>(xml.back())))) {
         xml.remove_suffix(1);
@@ -381,6 +447,9 @@ std::optional<Value> parse(std::string_view bytes) {
     plist_from_memory(bytes.data(), static_cast<uint32_t>(bytes.size()), &raw);
     Node root(raw);
     if (!root) {
+        return std::nullopt;
+    }
+    if (binary && hasEmbeddedNul(root.get())) {
         return std::nullopt;
     }
     std::vector<std::string_view> dateTexts;

@@ -1,5 +1,5 @@
 // Every unit-test process gets a device root of its own in a temporary directory: a user
-// database with the "mobile" user whose home is /var/mobile, and an empty device table.
+// database with the "mobile" user whose home is /var/mobile, and no device table.
 #include <gtest/gtest.h>
 #include <unistd.h>
 

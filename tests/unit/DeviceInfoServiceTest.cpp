@@ -1,0 +1,171 @@
+#include <gtest/gtest.h>
+
+#include <filesystem>
+
+#include "TestSupport.h"
+#include "UnitTestRoot.h"
+#include "platform/DeviceInfoService.h"
+#include "platform/RunningSystemFacts.h"
+#include "platform/SystemLog.h"
+#include "plist/PropertyListFormat.h"
+
+namespace tavrix::platform {
+namespace {
+
+using plist::Value;
+
+std::string tablePath() {
+    return (test::unitTestRoot() / "etc/tavrix/DeviceInfo.plist").string();
+}
+
+// Replaced by rename, so every version is a new file to the cache.
+void writeTableBytes(const std::string& bytes) {
+    std::string staging = tablePath() + ".new";
+    test::writeText(staging, bytes);
+    std::filesystem::rename(staging, tablePath());
+}
+
+void writeTable(const Value& table) {
+    writeTableBytes(plist::serialize(table));
+}
+
+class DeviceInfoTable : public testing::Test {
+  protected:
+    CapturingLogSink sink;
+    ScopedLogSink guard{sink};
+};
+
+TEST_F(DeviceInfoTable, AnswersEachTypeFromTheTable) {
+    writeTable(plist::Dictionary{{"DeviceClass", Value("Tablet")},
+                                 {"wi-fi", Value(true)},
+                                 {"contains-cellular-radio", Value(false)},
+                                 {"ReleaseType", Value(3)}});
+    EXPECT_EQ(copyDeviceStringAnswer("DeviceClass"), "Tablet");
+    EXPECT_TRUE(deviceBooleanAnswer("wi-fi"));
+    EXPECT_FALSE(deviceBooleanAnswer("contains-cellular-radio"));
+    EXPECT_EQ(copyDeviceAnswer("ReleaseType"), Value(3));
+    // Answers of another type do not pass as strings or booleans.
+    EXPECT_EQ(copyDeviceStringAnswer("ReleaseType"), std::nullopt);
+    EXPECT_FALSE(deviceBooleanAnswer("DeviceClass"));
+    EXPECT_EQ(copyDeviceAnswer("NoSuchKey"), std::nullopt);
+
+    auto answers = copyDeviceAnswers({"DeviceClass", "wi-fi", "NoSuchKey", "ReleaseType"});
+    EXPECT_EQ(answers, (plist::Dictionary{{"DeviceClass", Value("Tablet")},
+                                          {"wi-fi", Value(true)},
+                                          {"ReleaseType", Value(3)}}));
+    EXPECT_TRUE(sink.messages().empty());
+}
+
+TEST_F(DeviceInfoTable, FollowsChangesToTheFile) {
+    writeTable(plist::Dictionary{{"DeviceClass", Value("Tablet")}});
+    EXPECT_EQ(copyDeviceStringAnswer("DeviceClass"), "Tablet");
+    writeTable(plist::Dictionary{{"DeviceClass", Value("Phone")}});
+    EXPECT_EQ(copyDeviceStringAnswer("DeviceClass"), "Phone");
+    std::filesystem::remove(tablePath());
+    EXPECT_EQ(copyDeviceStringAnswer("DeviceClass"), std::nullopt);
+}
+
+TEST_F(DeviceInfoTable, UnusableTableIsLoggedOncePerVersionAndAnswersNothing) {
+    writeTableBytes("<?xml version=\"1.0\"?><plist><dict><key>DeviceClass</key>");
+    EXPECT_EQ(copyDeviceStringAnswer("DeviceClass"), std::nullopt);
+    EXPECT_EQ(copyDeviceAnswers({"DeviceClass", "ReleaseType"}), plist::Dictionary{});
+    std::string damaged = "Device information table " + tablePath() + " is damaged; ignoring it";
+    EXPECT_EQ(sink.messages(), std::vector<std::string>{damaged});
+
+    sink.clear();
+    writeTable(plist::Array{Value("DeviceClass")});
+    EXPECT_EQ(copyDeviceStringAnswer("DeviceClass"), std::nullopt);
+    EXPECT_EQ(copyDeviceStringAnswer("DeviceClass"), std::nullopt);
+    EXPECT_EQ(sink.messages(), std::vector<std::string>{"Device information table " + tablePath() +
+                                                        " is not a dictionary; ignoring it"});
+
+    sink.clear();
+    writeTable(plist::Dictionary{{"DeviceClass", Value("Phone")}});
+    EXPECT_EQ(copyDeviceStringAnswer("DeviceClass"), "Phone");
+    EXPECT_TRUE(sink.messages().empty());
+}
+
+TEST_F(DeviceInfoTable, MissingKeysComeFromTheRunningSystemAndTheTableWins) {
+    test::writeText((test::unitTestRoot() / "etc/os-release").string(),
+                    "NAME=\"Test OS\"\nVERSION_ID=\"4.2\"\nBUILD_ID=21A100\n");
+    writeTable(plist::Dictionary{{"BuildVersion", Value("TableBuild")}});
+    EXPECT_EQ(copyDeviceStringAnswer("ProductVersion"), "4.2");
+    EXPECT_EQ(copyDeviceStringAnswer("BuildVersion"), "TableBuild");
+    // A damaged table still leaves the running system's answers.
+    writeTableBytes("not a property list");
+    EXPECT_EQ(copyDeviceStringAnswer("BuildVersion"), "21A100");
+}
+
+TEST(DeviceInfoOsRelease, ReadsQuotedAndPlainValuesAndSkipsMalformedLines) {
+    auto values = parseOsRelease(
+        "# a comment\n"
+        "\n"
+        "NAME=\"Test \\\"OS\\\" \\$HOME \\n\"\n"
+        "VERSION_ID=12\r\n"
+        "ID_LIKE='debian ubuntu'\n"
+        "  PRETTY_NAME=\"padded\"  \n"
+        "EMPTY=\n"
+        "UNTERMINATED=\"abc\n"
+        "TRAILING=\"abc\" junk\n"
+        "not a line\n"
+        "BAD-KEY=1\n"
+        "=novalue\n"
+        "VERSION_ID=13");
+    EXPECT_EQ(values,
+              (std::map<std::string, std::string, std::less<>>{{"NAME", "Test \"OS\" $HOME \\n"},
+                                                               {"VERSION_ID", "13"},
+                                                               {"ID_LIKE", "debian ubuntu"},
+                                                               {"PRETTY_NAME", "padded"},
+                                                               {"EMPTY", ""}}));
+}
+
+TEST(DeviceInfoRunningSystem, ReadsReleaseFileDeviceTreeAndNetworkDevices) {
+    test::TempDir root;
+    std::string dir = root.path().string();
+    EXPECT_EQ(runningSystemAnswer(dir, "ProductVersion"), std::nullopt);
+    EXPECT_EQ(runningSystemAnswer(dir, "wi-fi"), std::nullopt);
+    EXPECT_EQ(runningSystemAnswer(dir, "contains-cellular-radio"), std::nullopt);
+
+    test::writeText(root / "usr/lib/os-release", "VERSION_ID=1\n");
+    EXPECT_EQ(runningSystemAnswer(dir, "ProductVersion"), Value("1"));
+    test::writeText(root / "etc/os-release", "VERSION_ID=2\n");
+    EXPECT_EQ(runningSystemAnswer(dir, "ProductVersion"), Value("2"));
+    EXPECT_EQ(runningSystemAnswer(dir, "BuildVersion"), std::nullopt);
+
+    test::writeText(root / "sys/firmware/devicetree/base/model", std::string("Board X\0", 8));
+    test::writeText(root / "sys/firmware/devicetree/base/serial-number",
+                    std::string("0123abc\0", 8));
+    test::writeText(root / "sys/class/dmi/id/product_serial", "\n");
+    EXPECT_EQ(runningSystemAnswer(dir, "ProductType"), Value("Board X"));
+    EXPECT_EQ(runningSystemAnswer(dir, "HWModelStr"), Value("Board X"));
+    EXPECT_EQ(runningSystemAnswer(dir, "SerialNumber"), Value("0123abc"));
+
+    std::filesystem::create_directories(root / "sys/class/net/lo");
+    test::writeText(root / "sys/class/net/eth0/uevent", "INTERFACE=eth0\nIFINDEX=2\n");
+    EXPECT_EQ(runningSystemAnswer(dir, "wi-fi"), Value(false));
+    EXPECT_EQ(runningSystemAnswer(dir, "contains-cellular-radio"), Value(false));
+    std::filesystem::create_directories(root / "sys/class/net/wlan0/wireless");
+    test::writeText(root / "sys/class/net/wwan0/uevent", "DEVTYPE=wwan\nINTERFACE=wwan0\n");
+    EXPECT_EQ(runningSystemAnswer(dir, "wi-fi"), Value(true));
+    EXPECT_EQ(runningSystemAnswer(dir, "contains-cellular-radio"), Value(true));
+    EXPECT_EQ(runningSystemAnswer(dir, "DeviceClass"), std::nullopt);
+}
+
+TEST(DeviceInfoRunningSystem, ReadsDmiAndModemClassWithoutDeviceTree) {
+    test::TempDir root;
+    std::string dir = root.path().string();
+    test::writeText(root / "sys/class/dmi/id/product_name", "Laptop 13\n");
+    test::writeText(root / "sys/class/dmi/id/board_name", "  MB-7  \n");
+    test::writeText(root / "sys/class/dmi/id/product_serial", "SN42\n");
+    EXPECT_EQ(runningSystemAnswer(dir, "ProductType"), Value("Laptop 13"));
+    EXPECT_EQ(runningSystemAnswer(dir, "HWModelStr"), Value("MB-7"));
+    EXPECT_EQ(runningSystemAnswer(dir, "SerialNumber"), Value("SN42"));
+
+    std::filesystem::create_directories(root / "sys/class/wwan");
+    EXPECT_EQ(runningSystemAnswer(dir, "contains-cellular-radio"), Value(false));
+    std::filesystem::create_directories(root / "sys/class/wwan/wwan0");
+    EXPECT_EQ(runningSystemAnswer(dir, "contains-cellular-radio"), Value(true));
+}
+
+}  // namespace
+}  // namespace tavrix::platform

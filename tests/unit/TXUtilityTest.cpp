@@ -1,0 +1,232 @@
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <climits>
+#include <clocale>
+#include <cstdint>
+#include <cstdlib>
+#include <ctime>
+#include <filesystem>
+
+#include "TestSupport.h"
+#include "UnitTestRoot.h"
+#include "platform/SystemLog.h"
+#include "plist/PropertyListFormat.h"
+#include "util/TXUtility.h"
+
+namespace tavrix {
+namespace {
+
+using plist::Value;
+
+void writeDeviceTable(const plist::Dictionary& table) {
+    std::string path = (test::unitTestRoot() / "etc/tavrix/DeviceInfo.plist").string();
+    std::filesystem::create_directories(std::filesystem::path(path).parent_path());
+    ASSERT_TRUE(plist::writeFile(path + ".new", Value(table)));
+    std::filesystem::rename(path + ".new", path);
+}
+
+TEST(TXUtilityFacts, StringFactsComeFromTheTableAndAreKeptForTheProcess) {
+    writeDeviceTable({{"SerialNumber", Value("C02XYZ")},
+                      {"DeviceClass", Value("Tablet")},
+                      {"ProductType", Value("Tab1,2")},
+                      {"ProductVersion", Value("3.1")},
+                      {"BuildVersion", Value("3B12")},
+                      {"ReleaseType", Value(7)},
+                      {"HWModelStr", Value("T12AP")}});
+    EXPECT_EQ(TXUtility::serialNumber(), "C02XYZ");
+    EXPECT_EQ(TXUtility::currentProductCategory(), "Tablet");
+    EXPECT_EQ(TXUtility::currentProductType(), "Tab1,2");
+    EXPECT_EQ(TXUtility::currentProductVersion(), "3.1");
+    EXPECT_EQ(TXUtility::currentProductBuild(), "3B12");
+    EXPECT_EQ(TXUtility::currentReleaseType(), std::nullopt);
+    EXPECT_EQ(TXUtility::currentHardwareModel(), "T12AP");
+
+    writeDeviceTable({{"DeviceClass", Value("Phone")}, {"ReleaseType", Value("Beta")}});
+    EXPECT_EQ(TXUtility::currentProductCategory(), "Tablet");
+    EXPECT_EQ(TXUtility::currentReleaseType(), std::nullopt);
+    EXPECT_EQ(TXUtility::serialNumber(), "C02XYZ");
+}
+
+TEST(TXUtilityFacts, RadioCapabilitiesFollowTheTable) {
+    EXPECT_FALSE(TXUtility::hasCellularRadio());
+    writeDeviceTable({{"contains-cellular-radio", Value(true)}, {"wi-fi", Value(true)}});
+    EXPECT_TRUE(TXUtility::hasCellularRadio());
+    EXPECT_TRUE(TXUtility::isWiFiCapable());
+    writeDeviceTable({{"contains-cellular-radio", Value("yes")}, {"wi-fi", Value(false)}});
+    EXPECT_FALSE(TXUtility::hasCellularRadio());
+    EXPECT_FALSE(TXUtility::isWiFiCapable());
+}
+
+TEST(TXUtilityFacts, DaemonFlagIsOffUntilSet) {
+    EXPECT_FALSE(TXUtility::isDaemon());
+    TXUtility::setIsDaemon(true);
+    EXPECT_TRUE(TXUtility::isDaemon());
+    TXUtility::setIsDaemon(false);
+    EXPECT_FALSE(TXUtility::isDaemon());
+}
+
+TEST(TXUtilityFacts, TaskQueueIsOneLabelledQueue) {
+    SerialQueue& queue = TXUtility::taskQueue();
+    EXPECT_EQ(&queue, &TXUtility::taskQueue());
+    EXPECT_EQ(queue.label(), "com.zandor.tavrixservices.operationTaskQueue");
+    bool ran = false;
+    EXPECT_TRUE(queue.dispatchSync([&] { ran = true; }));
+    EXPECT_TRUE(ran);
+}
+
+TEST(TXUtilityDiskSpace, NeedsStrictlyMoreFreeBytesThanAsked) {
+    EXPECT_FALSE(TXUtility::freeSpaceExceeds(4096, 10, 40960));
+    EXPECT_TRUE(TXUtility::freeSpaceExceeds(4096, 10, 40959));
+    EXPECT_FALSE(TXUtility::freeSpaceExceeds(4096, 0, 0));
+    EXPECT_FALSE(TXUtility::freeSpaceExceeds(1, UINT64_MAX, UINT64_MAX));
+    EXPECT_TRUE(TXUtility::freeSpaceExceeds(1, UINT64_MAX, UINT64_MAX - 1));
+    // Past 64 bits is more than any request, not a wrapped small number.
+    EXPECT_TRUE(
+        TXUtility::freeSpaceExceeds(UINT64_C(1) << 32, (UINT64_C(1) << 32) + 1, UINT64_MAX));
+}
+
+TEST(TXUtilityDiskSpace, AsksTheHomeFileSystem) {
+    EXPECT_TRUE(TXUtility::hasEnoughDiskSpace(0));
+    EXPECT_FALSE(TXUtility::hasEnoughDiskSpace(UINT64_MAX));
+    // A home that cannot be asked answers NO.
+    const char* saved = std::getenv("HOME");
+    std::string previous = saved == nullptr ? "" : saved;
+    ::setenv("HOME", "/nonexistent/tavrix-home", 1);
+    EXPECT_FALSE(TXUtility::hasEnoughDiskSpace(0));
+    if (saved != nullptr) {
+        ::setenv("HOME", previous.c_str(), 1);
+    } else {
+        ::unsetenv("HOME");
+    }
+}
+
+TEST(TXUtilityFiles, URLIfFileExistsAnswersExistingPathsOnly) {
+    test::TempDir dir;
+    std::string file = dir / "present";
+    test::writeText(file, "x");
+    EXPECT_EQ(TXUtility::URLIfFileExists(file), file);
+    EXPECT_EQ(TXUtility::URLIfFileExists(dir.path().string()), dir.path().string());
+    EXPECT_EQ(TXUtility::URLIfFileExists(dir / "absent"), std::nullopt);
+    EXPECT_EQ(TXUtility::URLIfFileExists(""), std::nullopt);
+    std::filesystem::create_symlink(dir / "absent", dir / "dangling");
+    EXPECT_EQ(TXUtility::URLIfFileExists(dir / "dangling"), std::nullopt);
+}
+
+TEST(TXUtilityFiles, RunStateNames) {
+    EXPECT_EQ(TXUtility::runStateName(1), "Foreground");
+    EXPECT_EQ(TXUtility::runStateName(0), "Background");
+    EXPECT_EQ(TXUtility::runStateName(2), std::nullopt);
+    EXPECT_EQ(TXUtility::runStateName(-1), std::nullopt);
+}
+
+// Runs in the given zone and puts the previous one back afterwards.
+class CalendarInZone : public testing::Test {
+  protected:
+    // False (and the test marked skipped) when the zone's data is not installed.
+    bool useZone(const char* zone) {
+        if (!std::filesystem::exists(std::string("/usr/share/zoneinfo/") + zone)) {
+            skipWithout(zone);
+            return false;
+        }
+        ::setenv("TZ", zone, 1);
+        ::tzset();
+        return true;
+    }
+    static void skipWithout(const char* zone) {
+        GTEST_SKIP() << "time zone data for " << zone << " is not installed (tzdata)";
+    }
+    void TearDown() override {
+        if (saved_) {
+            ::setenv("TZ", saved_->c_str(), 1);
+        } else {
+            ::unsetenv("TZ");
+        }
+        ::tzset();
+    }
+
+    static plist::Date localDate(int year, int month, int day, int hour, int minute) {
+        std::tm fields{};
+        fields.tm_year = year - 1900;
+        fields.tm_mon = month - 1;
+        fields.tm_mday = day;
+        fields.tm_hour = hour;
+        fields.tm_min = minute;
+        fields.tm_isdst = -1;
+        return plist::Date::fromUnixTime(static_cast<double>(std::mktime(&fields)));
+    }
+
+    platform::CapturingLogSink sink;
+    platform::ScopedLogSink guard{sink};
+
+  private:
+    std::optional<std::string> saved_ = [] {
+        const char* tz = std::getenv("TZ");
+        return tz == nullptr ? std::nullopt : std::optional<std::string>(tz);
+    }();
+};
+
+TEST_F(CalendarInZone, DaysFollowTheWallClockAcrossDaylightSaving) {
+    if (!useZone("America/New_York")) {
+        return;
+    }
+    plist::Date before = localDate(2026, 3, 7, 12, 0);
+    auto after = TXUtility::addToDate(before, 1);
+    ASSERT_TRUE(after.has_value());
+    EXPECT_EQ(*after, localDate(2026, 3, 8, 12, 0));
+    EXPECT_DOUBLE_EQ(after->secondsSinceReferenceDate - before.secondsSinceReferenceDate,
+                     23 * 3600.0);
+
+    auto back = TXUtility::addToDate(*after, -1);
+    ASSERT_TRUE(back.has_value());
+    EXPECT_EQ(*back, before);
+    // Autumn: the day has 25 hours.
+    auto autumn = TXUtility::addToDate(localDate(2026, 10, 31, 12, 0), 1);
+    ASSERT_TRUE(autumn.has_value());
+    EXPECT_EQ(*autumn, localDate(2026, 11, 1, 12, 0));
+    EXPECT_DOUBLE_EQ(autumn->secondsSinceReferenceDate -
+                         localDate(2026, 10, 31, 12, 0).secondsSinceReferenceDate,
+                     25 * 3600.0);
+    EXPECT_TRUE(sink.messages().empty());
+}
+
+TEST_F(CalendarInZone, MovesBackAndAcrossMonthsKeepingFractions) {
+    if (!useZone("UTC")) {
+        return;
+    }
+    plist::Date start{800000000.25};  // 2026-05-09 06:13:20.25 UTC
+    auto earlier = TXUtility::addToDate(start, -40);
+    ASSERT_TRUE(earlier.has_value());
+    EXPECT_DOUBLE_EQ(earlier->secondsSinceReferenceDate, 800000000.25 - 40 * 86400.0);
+    auto same = TXUtility::addToDate(start, 0);
+    ASSERT_TRUE(same.has_value());
+    EXPECT_EQ(*same, start);
+    // Before the Unix epoch the fraction still counts forward from the whole second.
+    auto old = TXUtility::addToDate(plist::Date::fromUnixTime(-0.75), 1);
+    ASSERT_TRUE(old.has_value());
+    EXPECT_DOUBLE_EQ(old->unixTime(), 86400 - 0.75);
+}
+
+TEST_F(CalendarInZone, UnrepresentableResultsAreLogged) {
+    if (!useZone("UTC")) {
+        return;
+    }
+    EXPECT_EQ(TXUtility::addToDate(plist::Date{100.5}, LONG_MAX), std::nullopt);
+    EXPECT_EQ(TXUtility::addToDate(plist::Date{1e300}, 1), std::nullopt);
+    EXPECT_EQ(sink.messages(),
+              (std::vector<std::string>{"addToDate:numberOfDays: unable to add " +
+                                            std::to_string(LONG_MAX) + " days to date: 100.500000",
+                                        "addToDate:numberOfDays: unable to add 1 days to date: " +
+                                            std::to_string(1e300)}));
+}
+
+TEST_F(CalendarInZone, PrettyPrintUsesShortDateAndTimeInLocalTime) {
+    if (!useZone("America/New_York")) {
+        return;
+    }
+    std::setlocale(LC_TIME, "C");
+    EXPECT_EQ(TXUtility::prettyPrintDate(localDate(2026, 3, 7, 9, 5)), "03/07/26 09:05");
+}
+
+}  // namespace
+}  // namespace tavrix
