@@ -49,7 +49,8 @@ void compare(const char* label, const plist::Value& document, plist::Format form
     }
     double oursRead = bench::medianMicros(kRuns, [&] { (void)plist::parse(bytes); });
     double peerRead = bench::medianMicros(kRuns, [&] { plist_free(libplistParse(bytes)); });
-    double oursWrite = bench::medianMicros(kRuns, [&] { (void)plist::serialize(document, format); });
+    double oursWrite =
+        bench::medianMicros(kRuns, [&] { (void)plist::serialize(document, format); });
     double peerWrite = bench::medianMicros(kRuns, [&] {
         char* out = nullptr;
         uint32_t length = 0;

@@ -1,5 +1,5 @@
-// Small synchronous file-system utilities shared by the bundle manager, the payload unpacker and the
-// over-the-air installer, plus a few conversions. Error codes are 0 for success, else an errno
+// Small synchronous file-system utilities shared by the bundle manager, the payload unpacker and
+// the over-the-air installer, plus a few conversions. Error codes are 0 for success, else an errno
 // value; 5 (EIO) and 17 (EEXIST) are the two fixed codes some operations answer on their own.
 // Nothing here logs.
 #pragma once

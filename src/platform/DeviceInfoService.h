@@ -1,7 +1,8 @@
 // The device information service: answers questions about the device by key.
 // Answers come from the table <root>/etc/tavrix/DeviceInfo.plist (a dictionary, re-read when the
 // file changes); a key missing from the table is answered from the running system where one is
-// known (for example "ProductVersion" from <root>/etc/os-release, "wi-fi" from the network devices).
+// known (for example "ProductVersion" from <root>/etc/os-release, "wi-fi" from the network
+// devices).
 #pragma once
 
 #include <optional>

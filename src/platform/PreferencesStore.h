@@ -21,7 +21,7 @@
 namespace tavrix::platform {
 
 class PreferencesStore {
-public:
+  public:
     // The process-wide store.
     static PreferencesStore& shared();
 
@@ -44,14 +44,15 @@ public:
     // others are seen. False when the domain could not be written; its pending values are kept.
     bool synchronize(std::string_view domain, std::string_view user);
 
-private:
+  private:
     struct Domain;
     using UserDomains = std::map<std::string, std::unique_ptr<Domain>, std::less<>>;
 
     // The domain's state, created on first use; null (logged) for an invalid name or unknown user.
     Domain* domainFor(std::string_view domain, std::string_view user);
     bool writePending(Domain& domain);
-    void logDamage(Domain& domain, const std::string& path);
+    // Logs that the domain's file is damaged, once per version of the file.
+    void logDamage(Domain& domain);
 
     std::mutex mutex_;
     std::map<std::string, UserDomains, std::less<>> users_;

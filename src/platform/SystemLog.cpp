@@ -41,7 +41,7 @@ void writeAll(int fd, std::string_view bytes) {
 }
 
 class StderrSink : public LogSink {
-public:
+  public:
     explicit StderrSink(bool withPriorityPrefix) : withPriorityPrefix_(withPriorityPrefix) {}
 
     void write(int priority, std::string_view message) override {
@@ -57,12 +57,12 @@ public:
         writeAll(STDERR_FILENO, line);  // one write per line keeps lines whole across threads
     }
 
-private:
+  private:
     bool withPriorityPrefix_;
 };
 
 class SyslogSink : public LogSink {
-public:
+  public:
     SyslogSink() { ::openlog(kIdent, LOG_PID, LOG_DAEMON); }
     void write(int priority, std::string_view message) override {
         ::syslog(priority, "%.*s", static_cast<int>(message.size()), message.data());
@@ -96,7 +96,9 @@ void writeSystemLog(int priority, std::string_view message) {
 ScopedLogSink::ScopedLogSink(LogSink& sink)
     : previous_(overridingSink.exchange(&sink, std::memory_order_acq_rel)) {}
 
-ScopedLogSink::~ScopedLogSink() { overridingSink.store(previous_, std::memory_order_release); }
+ScopedLogSink::~ScopedLogSink() {
+    overridingSink.store(previous_, std::memory_order_release);
+}
 
 void CapturingLogSink::write(int, std::string_view message) {
     std::lock_guard lock(mutex_);

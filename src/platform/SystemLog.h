@@ -13,7 +13,7 @@
 namespace tavrix::platform {
 
 class LogSink {
-public:
+  public:
     virtual ~LogSink() = default;
     // Receives one message with its syslog priority; called from any thread.
     virtual void write(int priority, std::string_view message) = 0;
@@ -24,25 +24,25 @@ void writeSystemLog(int priority, std::string_view message);
 
 // Sends every message to the given sink while the guard lives (tests). Guards nest.
 class ScopedLogSink {
-public:
+  public:
     explicit ScopedLogSink(LogSink& sink);
     ~ScopedLogSink();
     ScopedLogSink(const ScopedLogSink&) = delete;
     ScopedLogSink& operator=(const ScopedLogSink&) = delete;
 
-private:
+  private:
     LogSink* previous_;
 };
 
 // A sink that keeps every message, for tests that assert exact lines.
 class CapturingLogSink : public LogSink {
-public:
+  public:
     void write(int priority, std::string_view message) override;
     std::vector<std::string> messages() const;
     bool contains(std::string_view message) const;
     void clear();
 
-private:
+  private:
     mutable std::mutex mutex_;
     std::vector<std::string> messages_;
 };

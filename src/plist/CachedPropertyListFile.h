@@ -15,7 +15,7 @@
 namespace tavrix::plist {
 
 class CachedPropertyListFile {
-public:
+  public:
     enum class State { Missing, Damaged, Valid };
 
     struct Snapshot {
@@ -36,7 +36,7 @@ public:
     // Forgets the cached value so that the next read parses the file.
     void invalidate();
 
-private:
+  private:
     struct Identity {
         dev_t device = 0;
         ino_t inode = 0;

@@ -47,8 +47,7 @@ std::vector<std::string_view> xmlDateTexts(std::string_view xml) {
     static constexpr std::string_view kOpen = "<date>";
     static constexpr std::string_view kClose = "</date>";
     std::vector<std::string_view> texts;
-    for (std::size_t at = xml.find(kOpen); at != std::string_view::npos;
-         at = xml.find(kOpen, at)) {
+    for (std::size_t at = xml.find(kOpen); at != std::string_view::npos; at = xml.find(kOpen, at)) {
         at += kOpen.size();
         std::size_t end = xml.find(kClose, at);
         if (end == std::string_view::npos) {
@@ -150,7 +149,8 @@ std::size_t countDates(plist_t node, int depth) {
     }
     std::size_t count = 0;
     switch (plist_get_node_type(node)) {
-        case PLIST_DATE: return 1;
+        case PLIST_DATE:
+            return 1;
         case PLIST_ARRAY:
             for (uint32_t i = 0, n = plist_array_get_size(node); i < n; ++i) {
                 count += countDates(plist_array_get_item(node, i), depth + 1);
@@ -162,12 +162,13 @@ std::size_t countDates(plist_t node, int depth) {
                 return true;
             });
             return count;
-        default: return 0;
+        default:
+            return 0;
     }
 }
 
 class NodeReader {
-public:
+  public:
     explicit NodeReader(std::vector<std::string_view> dateTexts)
         : dateTexts_(std::move(dateTexts)) {}
 
@@ -239,12 +240,14 @@ public:
                 }
                 return Value(std::move(array));
             }
-            case PLIST_DICT: return readDictionary(node, depth);
-            default: return std::nullopt;
+            case PLIST_DICT:
+                return readDictionary(node, depth);
+            default:
+                return std::nullopt;
         }
     }
 
-private:
+  private:
     // libplist marks integers read as unsigned above INT64_MAX with a 16-byte length, which is not
     // public; its node comparison does look at the length, so a signed twin tells them apart.
     static bool isLargeUnsigned(plist_t node, uint64_t value) {
@@ -266,7 +269,8 @@ private:
                 return false;
             }
             // Files this process writes hold their keys sorted, so the end is usually the spot.
-            dictionary.insert_or_assign(dictionary.end(), std::string(key.get()), std::move(*value));
+            dictionary.insert_or_assign(dictionary.end(), std::string(key.get()),
+                                        std::move(*value));
             return true;
         });
         if (!complete) {
@@ -282,7 +286,7 @@ private:
 // Builds libplist's tree; records the microsecond fraction of every date in document order so the
 // XML writer can put them back.
 class NodeWriter {
-public:
+  public:
     // With wholeSecondDates, dates go to libplist without their fractions (its XML writer mangles
     // fractions of dates before the reference date); the fractions are patched in afterwards.
     explicit NodeWriter(bool wholeSecondDates) : wholeSecondDates_(wholeSecondDates) {}
@@ -291,7 +295,7 @@ public:
     const std::vector<std::int64_t>& dateFractions() const { return dateFractions_; }
     bool hasFractionalDate() const { return hasFractionalDate_; }
 
-private:
+  private:
     plist_t build(const Value& value) {
         switch (value.type()) {
             case Type::Dictionary: {
@@ -308,11 +312,16 @@ private:
                 }
                 return array;
             }
-            case Type::String: return plist_new_string(value.asString()->c_str());
-            case Type::Integer: return buildInteger(*value.asInteger());
-            case Type::Real: return plist_new_real(*value.asReal());
-            case Type::Boolean: return plist_new_bool(*value.asBoolean() ? 1 : 0);
-            case Type::Date: return buildDate(*value.asDate());
+            case Type::String:
+                return plist_new_string(value.asString()->c_str());
+            case Type::Integer:
+                return buildInteger(*value.asInteger());
+            case Type::Real:
+                return plist_new_real(*value.asReal());
+            case Type::Boolean:
+                return plist_new_bool(*value.asBoolean() ? 1 : 0);
+            case Type::Date:
+                return buildDate(*value.asDate());
             case Type::Data: {
                 const Data& data = *value.asData();
                 return plist_new_data(reinterpret_cast<const char*>(data.data()), data.size());
@@ -426,7 +435,8 @@ bool hasEmbeddedNul(plist_t root) {
 }
 
 bool endsWithClosingTag(std::string_view xml) {
-    while (!xml.empty() && (xml.back() == '\0' || std::isspace(static_cast<unsigned char>(xml.back())))) {
+    while (!xml.empty() &&
+           (xml.back() == '\0' || std::isspace(static_cast<unsigned char>(xml.back())))) {
         xml.remove_suffix(1);
     }
     return xml.ends_with("</plist>");

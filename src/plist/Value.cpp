@@ -46,11 +46,20 @@ void appendQuotedIfNeeded(std::string& out, std::string_view text) {
     out += '"';
     for (char c : text) {
         switch (c) {
-            case '"': out += "\\\""; break;
-            case '\\': out += "\\\\"; break;
-            case '\n': out += "\\n"; break;
-            case '\t': out += "\\t"; break;
-            default: out += c;
+            case '"':
+                out += "\\\"";
+                break;
+            case '\\':
+                out += "\\\\";
+                break;
+            case '\n':
+                out += "\\n";
+                break;
+            case '\t':
+                out += "\\t";
+                break;
+            default:
+                out += c;
         }
     }
     out += '"';
@@ -134,10 +143,18 @@ void appendDescription(std::string& out, const Value& value, std::size_t depth, 
                                              : std::to_string(integer.signedValue());
             break;
         }
-        case Type::Real: appendReal(out, *value.asReal()); break;
-        case Type::Boolean: out += *value.asBoolean() ? "true" : "false"; break;
-        case Type::Date: appendDate(out, *value.asDate()); break;
-        case Type::Data: appendData(out, *value.asData()); break;
+        case Type::Real:
+            appendReal(out, *value.asReal());
+            break;
+        case Type::Boolean:
+            out += *value.asBoolean() ? "true" : "false";
+            break;
+        case Type::Date:
+            appendDate(out, *value.asDate());
+            break;
+        case Type::Data:
+            appendData(out, *value.asData());
+            break;
     }
 }
 

@@ -31,7 +31,7 @@ struct Date {
 // A 64-bit integer that remembers whether it was read as an unsigned value above INT64_MAX,
 // so that such values are written back unchanged.
 class Integer {
-public:
+  public:
     constexpr Integer(std::int64_t value = 0) : bits_(static_cast<std::uint64_t>(value)) {}
     static constexpr Integer fromUnsigned(std::uint64_t value) {
         Integer result;
@@ -46,7 +46,7 @@ public:
     constexpr bool isLargeUnsigned() const { return isLargeUnsigned_; }
     bool operator==(const Integer&) const = default;
 
-private:
+  private:
     std::uint64_t bits_ = 0;
     bool isLargeUnsigned_ = false;
 };
@@ -54,7 +54,7 @@ private:
 using Data = std::vector<std::uint8_t>;
 
 class Value {
-public:
+  public:
     using Array = std::vector<Value>;
     using Dictionary = std::map<std::string, Value, std::less<>>;
 
@@ -102,7 +102,7 @@ public:
     // A readable rendering for logs: strings as they are at the top level, containers in braces.
     std::string description() const;
 
-private:
+  private:
     // The order of the alternatives is the order of Type.
     std::variant<Dictionary, Array, std::string, Integer, double, bool, Date, Data> storage_;
 };

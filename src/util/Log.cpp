@@ -36,25 +36,47 @@ void appendFormatted(std::string& out, const std::string& spec, T value) {
 
 void appendSigned(std::string& out, const std::string& spec, Length length, va_list& arguments) {
     switch (length) {
-        case Length::Long: appendFormatted(out, spec, va_arg(arguments, long)); break;
-        case Length::LongLong: appendFormatted(out, spec, va_arg(arguments, long long)); break;
-        case Length::IntMax: appendFormatted(out, spec, va_arg(arguments, intmax_t)); break;
-        case Length::Size: appendFormatted(out, spec, va_arg(arguments, ssize_t)); break;
-        case Length::PtrDiff: appendFormatted(out, spec, va_arg(arguments, ptrdiff_t)); break;
-        default: appendFormatted(out, spec, va_arg(arguments, int)); break;
+        case Length::Long:
+            appendFormatted(out, spec, va_arg(arguments, long));
+            break;
+        case Length::LongLong:
+            appendFormatted(out, spec, va_arg(arguments, long long));
+            break;
+        case Length::IntMax:
+            appendFormatted(out, spec, va_arg(arguments, intmax_t));
+            break;
+        case Length::Size:
+            appendFormatted(out, spec, va_arg(arguments, ssize_t));
+            break;
+        case Length::PtrDiff:
+            appendFormatted(out, spec, va_arg(arguments, ptrdiff_t));
+            break;
+        default:
+            appendFormatted(out, spec, va_arg(arguments, int));
+            break;
     }
 }
 
 void appendUnsigned(std::string& out, const std::string& spec, Length length, va_list& arguments) {
     switch (length) {
-        case Length::Long: appendFormatted(out, spec, va_arg(arguments, unsigned long)); break;
+        case Length::Long:
+            appendFormatted(out, spec, va_arg(arguments, unsigned long));
+            break;
         case Length::LongLong:
             appendFormatted(out, spec, va_arg(arguments, unsigned long long));
             break;
-        case Length::IntMax: appendFormatted(out, spec, va_arg(arguments, uintmax_t)); break;
-        case Length::Size: appendFormatted(out, spec, va_arg(arguments, size_t)); break;
-        case Length::PtrDiff: appendFormatted(out, spec, va_arg(arguments, ptrdiff_t)); break;
-        default: appendFormatted(out, spec, va_arg(arguments, unsigned int)); break;
+        case Length::IntMax:
+            appendFormatted(out, spec, va_arg(arguments, uintmax_t));
+            break;
+        case Length::Size:
+            appendFormatted(out, spec, va_arg(arguments, size_t));
+            break;
+        case Length::PtrDiff:
+            appendFormatted(out, spec, va_arg(arguments, ptrdiff_t));
+            break;
+        default:
+            appendFormatted(out, spec, va_arg(arguments, unsigned int));
+            break;
     }
 }
 
@@ -100,14 +122,30 @@ std::string formatObjectMessage(const char* format, va_list arguments) {
         std::size_t lengthStart = spec.size();
         for (bool more = true; more && *p != '\0';) {
             switch (*p) {
-                case 'h': length = length == Length::Short ? Length::Char : Length::Short; break;
-                case 'l': length = length == Length::Long ? Length::LongLong : Length::Long; break;
-                case 'q': length = Length::LongLong; break;
-                case 'j': length = Length::IntMax; break;
-                case 'z': length = Length::Size; break;
-                case 't': length = Length::PtrDiff; break;
-                case 'L': length = Length::LongDouble; break;
-                default: more = false; continue;
+                case 'h':
+                    length = length == Length::Short ? Length::Char : Length::Short;
+                    break;
+                case 'l':
+                    length = length == Length::Long ? Length::LongLong : Length::Long;
+                    break;
+                case 'q':
+                    length = Length::LongLong;
+                    break;
+                case 'j':
+                    length = Length::IntMax;
+                    break;
+                case 'z':
+                    length = Length::Size;
+                    break;
+                case 't':
+                    length = Length::PtrDiff;
+                    break;
+                case 'L':
+                    length = Length::LongDouble;
+                    break;
+                default:
+                    more = false;
+                    continue;
             }
             spec += *p++;
         }
@@ -121,7 +159,9 @@ std::string formatObjectMessage(const char* format, va_list arguments) {
             conversion = 'd';
         }
         switch (conversion) {
-            case '%': out += '%'; break;
+            case '%':
+                out += '%';
+                break;
             case '@': {
                 const auto* value = va_arg(cursor, const plist::Value*);
                 out += plist::describe(value);
@@ -214,7 +254,8 @@ void logCFormat(const char* format, ...) {
     }
     if (static_cast<std::size_t>(needed) < sizeof small) {
         va_end(copy);
-        platform::writeSystemLog(kPriority, std::string_view(small, static_cast<std::size_t>(needed)));
+        platform::writeSystemLog(kPriority,
+                                 std::string_view(small, static_cast<std::size_t>(needed)));
         return;
     }
     std::string large(static_cast<std::size_t>(needed) + 1, '\0');

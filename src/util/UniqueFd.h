@@ -8,7 +8,7 @@
 namespace tavrix {
 
 class UniqueFd {
-public:
+  public:
     UniqueFd() = default;
     // Takes ownership of fd (negative means none).
     explicit UniqueFd(int fd) : fd_(fd) {}
@@ -36,7 +36,7 @@ public:
     // Gives up ownership without closing.
     int release() { return std::exchange(fd_, -1); }
 
-private:
+  private:
     int fd_ = -1;
 };
 

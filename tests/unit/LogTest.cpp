@@ -8,7 +8,7 @@ namespace tavrix {
 namespace {
 
 class LogTest : public testing::Test {
-protected:
+  protected:
     platform::CapturingLogSink sink;
     platform::ScopedLogSink guard{sink};
 

@@ -69,8 +69,7 @@ TEST(PropertyListXml, ReadsValuesWrittenByOthers) {
     EXPECT_DOUBLE_EQ(value->find("whole")->asDate()->secondsSinceReferenceDate, 60.0);
     EXPECT_EQ(*value->find("blob")->asData(), (Data{0, 1, 2}));
     // The large unsigned value is written back as it was read.
-    EXPECT_NE(serialize(*value).find("<integer>18446744073709551615</integer>"),
-              std::string::npos);
+    EXPECT_NE(serialize(*value).find("<integer>18446744073709551615</integer>"), std::string::npos);
 }
 
 TEST(PropertyListXml, WritesNoDoctype) {
@@ -83,16 +82,19 @@ TEST(PropertyListDamage, TruncatedOrGarbageInputIsNoValue) {
     Value tree = sampleTree();
     for (Format format : {Format::Xml, Format::Binary}) {
         std::string bytes = serialize(tree, format);
-        for (std::size_t cut : {std::size_t{1}, bytes.size() / 3, bytes.size() / 2, bytes.size() - 9}) {
+        for (std::size_t cut :
+             {std::size_t{1}, bytes.size() / 3, bytes.size() / 2, bytes.size() - 9}) {
             EXPECT_FALSE(parse(std::string_view(bytes).substr(0, cut)).has_value())
                 << "format " << static_cast<int>(format) << " cut at " << cut;
         }
     }
     for (std::string_view garbage :
-         {std::string_view(""), std::string_view("bplist00"), std::string_view("<plist><dict><key>a"),
-          std::string_view("\x00\x01\x02\x03", 4), std::string_view("<plist><integer>x</integer>")}) {
+         {std::string_view(""), std::string_view("bplist00"),
+          std::string_view("<plist><dict><key>a"), std::string_view("\x00\x01\x02\x03", 4),
+          std::string_view("<plist><integer>x</integer>")}) {
         auto value = parse(garbage);
-        // Either nothing or some value, but never a crash; the empty and truncated ones are nothing.
+        // Either nothing or some value, but never a crash; the empty and truncated ones are
+        // nothing.
         if (garbage.size() < 20) {
             EXPECT_FALSE(value.has_value()) << garbage;
         }

@@ -15,7 +15,8 @@ const std::filesystem::path& unitTestRoot() {
         auto* dir = new TempDir();
         writeText(*dir / "etc/passwd",
                   "root:x:0:0:root:/root:/bin/sh\n"
-                  "mobile:x:" + std::to_string(::getuid()) + ":" + std::to_string(::getgid()) +
+                  "mobile:x:" +
+                      std::to_string(::getuid()) + ":" + std::to_string(::getgid()) +
                       ":Mobile User:/var/mobile:/usr/sbin/nologin\n");
         std::filesystem::create_directories(*dir / "var/mobile");
         return dir;
@@ -25,7 +26,7 @@ const std::filesystem::path& unitTestRoot() {
 
 namespace {
 class RootEnvironment : public testing::Environment {
-public:
+  public:
     void TearDown() override {
         std::error_code ignored;
         std::filesystem::remove_all(unitTestRoot(), ignored);

@@ -1,0 +1,352 @@
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cstdint>
+#include <filesystem>
+#include <functional>
+#include <thread>
+
+#include "TestSupport.h"
+#include "UnitTestRoot.h"
+#include "daemon/BehaviorPreferences.h"
+#include "platform/PreferencesStore.h"
+#include "platform/SystemLog.h"
+#include "plist/PropertyListFormat.h"
+
+namespace tavrix {
+namespace {
+
+namespace fs = std::filesystem;
+using platform::PreferencesStore;
+using plist::Value;
+
+constexpr const char* kUser = "mobile";
+
+std::string preferencesDirectory() {
+    return (test::unitTestRoot() / "var/mobile/Library/Preferences").string();
+}
+
+std::string domainPath(const std::string& domain) {
+    return preferencesDirectory() + "/" + domain + ".plist";
+}
+
+// Runs body in a forked child that exits 0 when body answers true. The child's logs and stores
+// are its own; it never returns into the test.
+pid_t startChild(const std::function<bool()>& body) {
+    pid_t pid = ::fork();
+    if (pid == 0) {
+        ::_exit(body() ? 0 : 1);
+    }
+    return pid;
+}
+
+int waitChild(pid_t pid) {
+    int status = 0;
+    if (pid < 0 || ::waitpid(pid, &status, 0) != pid || !WIFEXITED(status)) {
+        return -1;
+    }
+    return WEXITSTATUS(status);
+}
+
+// What another process sees: a store with nothing cached, reading the file from disk.
+std::optional<Value> readFresh(const std::string& key, const std::string& domain) {
+    PreferencesStore fresh;
+    return fresh.copyValue(key, domain, kUser);
+}
+
+class PreferencesStoreTest : public testing::Test {
+  protected:
+    // Tests may share one device root when run in one process.
+    void SetUp() override { fs::remove_all(preferencesDirectory()); }
+
+    platform::CapturingLogSink sink;
+    platform::ScopedLogSink guard{sink};
+    PreferencesStore store;
+};
+
+TEST_F(PreferencesStoreTest, PendingValuesShadowTheFileUntilSynchronized) {
+    const std::string domain = "test.pending";
+    store.setValue("a", Value(1), domain, kUser);
+    EXPECT_EQ(store.copyValue("a", domain, kUser), Value(1));
+    EXPECT_FALSE(fs::exists(domainPath(domain)));
+    EXPECT_EQ(readFresh("a", domain), std::nullopt);
+
+    ASSERT_TRUE(store.synchronize(domain, kUser));
+    EXPECT_EQ(readFresh("a", domain), Value(1));
+
+    // A pending removal hides the stored value at once and deletes it on synchronize.
+    store.setValue("a", std::nullopt, domain, kUser);
+    store.setValue("never-stored", std::nullopt, domain, kUser);
+    EXPECT_EQ(store.copyValue("a", domain, kUser), std::nullopt);
+    EXPECT_EQ(readFresh("a", domain), Value(1));
+    ASSERT_TRUE(store.synchronize(domain, kUser));
+    EXPECT_EQ(readFresh("a", domain), std::nullopt);
+    EXPECT_EQ(plist::readFile(domainPath(domain)), Value(plist::Dictionary{}));
+    EXPECT_TRUE(sink.messages().empty());
+}
+
+TEST_F(PreferencesStoreTest, EveryValueTypeSurvivesTheFileWhichIsXmlAndReadable) {
+    const std::string domain = "test.types";
+    plist::Dictionary nested{
+        {"deep", Value(plist::Array{Value(1), Value("two"), Value(plist::Dictionary{})})},
+        {"empty", Value(plist::Array{})}};
+    plist::Dictionary values{{"string", Value("é ✓ <&>")},
+                             {"empty string", Value("")},
+                             {"negative", Value(-7)},
+                             {"large unsigned", Value(plist::Integer::fromUnsigned(UINT64_MAX))},
+                             {"real", Value(2.5)},
+                             {"false", Value(false)},
+                             {"date", Value(plist::Date{700000000.25})},
+                             {"early date", Value(plist::Date{-1000.5})},
+                             {"data", Value(plist::Data{0, 1, 0x7f, 0xff})},
+                             {"nested", Value(nested)}};
+    for (const auto& [key, value] : values) {
+        store.setValue(key, value, domain, kUser);
+    }
+    ASSERT_TRUE(store.synchronize(domain, kUser));
+
+    PreferencesStore fresh;
+    for (const auto& [key, value] : values) {
+        EXPECT_EQ(fresh.copyValue(key, domain, kUser), value) << key;
+    }
+    EXPECT_EQ(test::readText(domainPath(domain)).rfind("<?xml", 0), 0u);
+    struct stat info {};
+    ASSERT_EQ(::stat(domainPath(domain).c_str(), &info), 0);
+    EXPECT_EQ(info.st_mode & 07777, 0644u);
+    ASSERT_EQ(::stat(preferencesDirectory().c_str(), &info), 0);
+    EXPECT_EQ(info.st_mode & 07777, 0755u);
+}
+
+TEST_F(PreferencesStoreTest, ReadsAreCachedUntilSynchronize) {
+    const std::string domain = "test.cache";
+    const std::string path = domainPath(domain);
+    test::writeText(path, plist::serialize(Value(plist::Dictionary{{"k", Value("old")}})));
+    EXPECT_EQ(store.copyValue("k", domain, kUser), Value("old"));
+
+    // Same size, same inode, same modification time: only synchronize makes the store look again.
+    struct stat before {};
+    ASSERT_EQ(::stat(path.c_str(), &before), 0);
+    std::string text = test::readText(path);
+    text.replace(text.find("old"), 3, "new");
+    { std::ofstream(path, std::ios::in | std::ios::out | std::ios::binary) << text; }
+    timespec times[2] = {before.st_atim, before.st_mtim};
+    ASSERT_EQ(::utimensat(AT_FDCWD, path.c_str(), times, 0), 0);
+
+    EXPECT_EQ(store.copyValue("k", domain, kUser), Value("old"));
+    EXPECT_TRUE(store.synchronize(domain, kUser));
+    EXPECT_EQ(store.copyValue("k", domain, kUser), Value("new"));
+}
+
+TEST_F(PreferencesStoreTest, DamagedFileReadsEmptyIsLoggedOncePerVersionAndIsRepaired) {
+    const std::string domain = "test.damaged";
+    const std::string path = domainPath(domain);
+    const std::string logLine = "Preferences file " + path + " is damaged; reading it as empty";
+    std::string good = plist::serialize(Value(plist::Dictionary{{"old", Value(1)}}));
+    const std::vector<std::string> damaged = {
+        "not a property list at all", good.substr(0, good.size() / 2), std::string(),
+        plist::serialize(Value(plist::Array{Value("not"), Value("a dictionary")})),
+        std::string("\0\1\2", 3)};
+
+    for (const auto& bytes : damaged) {
+        SCOPED_TRACE(testing::PrintToString(bytes));
+        test::writeText(path, bytes);
+        ASSERT_TRUE(store.synchronize(domain, kUser));
+        sink.clear();
+
+        EXPECT_EQ(store.copyValue("old", domain, kUser), std::nullopt);
+        EXPECT_EQ(store.copyValue("old", domain, kUser), std::nullopt);
+        ASSERT_TRUE(store.synchronize(domain, kUser));
+        EXPECT_EQ(store.copyValue("old", domain, kUser), std::nullopt);
+        EXPECT_EQ(sink.messages(), std::vector<std::string>{logLine});
+
+        // Writing replaces the damaged file with a good one holding only the new value.
+        store.setValue("new", Value("repaired"), domain, kUser);
+        ASSERT_TRUE(store.synchronize(domain, kUser));
+        EXPECT_EQ(plist::readFile(path), Value(plist::Dictionary{{"new", Value("repaired")}}));
+        EXPECT_EQ(sink.messages(), std::vector<std::string>{logLine});
+    }
+    // No temporary file is left behind.
+    EXPECT_EQ(std::distance(fs::directory_iterator(preferencesDirectory()), {}), 1);
+}
+
+TEST_F(PreferencesStoreTest, SymbolicLinkDomainIsReadAndWrittenThroughAndRepointed) {
+    const std::string domain = "test.linked";
+    const std::string link = domainPath(domain);
+    const std::string first = (test::unitTestRoot() / "elsewhere/first.plist").string();
+    const std::string second = (test::unitTestRoot() / "elsewhere/second.plist").string();
+    test::writeText(first, plist::serialize(Value(plist::Dictionary{{"k", Value("first")}})));
+    test::writeText(second, plist::serialize(Value(plist::Dictionary{{"k", Value("second")}})));
+    fs::create_directories(preferencesDirectory());
+    fs::create_symlink(first, link);
+    EXPECT_EQ(store.copyValue("k", domain, kUser), Value("first"));
+
+    // Re-pointed with a relative link, as a rename over the old one.
+    fs::create_symlink("../../../../elsewhere/second.plist", link + ".new");
+    fs::rename(link + ".new", link);
+    ASSERT_TRUE(store.synchronize(domain, kUser));
+    EXPECT_EQ(store.copyValue("k", domain, kUser), Value("second"));
+
+    store.setValue("added", Value(true), domain, kUser);
+    ASSERT_TRUE(store.synchronize(domain, kUser));
+    EXPECT_TRUE(fs::is_symlink(link));
+    EXPECT_EQ(plist::readFile(second),
+              Value(plist::Dictionary{{"added", Value(true)}, {"k", Value("second")}}));
+    EXPECT_EQ(plist::readFile(first), Value(plist::Dictionary{{"k", Value("first")}}));
+}
+
+TEST_F(PreferencesStoreTest, InvalidDomainsAndUsersAnswerNothingAndAreLogged) {
+    const std::vector<std::string> domains = {
+        "", ".", "..", "a/b", "../escape", std::string("a\0b", 3), std::string(300, 'x')};
+    for (const auto& domain : domains) {
+        SCOPED_TRACE(domain);
+        sink.clear();
+        store.setValue("k", Value(1), domain, kUser);
+        EXPECT_EQ(store.copyValue("k", domain, kUser), std::nullopt);
+        EXPECT_FALSE(store.synchronize(domain, kUser));
+        // The name is logged as a C string: up to an embedded NUL.
+        std::string line =
+            "Preferences: invalid domain name \"" + std::string(domain.c_str()) + "\"";
+        EXPECT_EQ(sink.messages(), std::vector<std::string>(3, line));
+    }
+
+    sink.clear();
+    store.setValue("k", Value(1), "test.users", "nobody-here");
+    EXPECT_EQ(store.copyValue("k", "test.users", "nobody-here"), std::nullopt);
+    EXPECT_FALSE(store.synchronize("test.users", "nobody-here"));
+    EXPECT_TRUE(sink.contains("Preferences: no home directory for user \"nobody-here\""));
+    EXPECT_FALSE(store.synchronize("test.users", "../mobile"));
+    EXPECT_TRUE(sink.contains("Preferences: invalid user name \"../mobile\""));
+    // Nothing was written anywhere under the device root's Preferences.
+    EXPECT_FALSE(fs::exists(preferencesDirectory()));
+}
+
+TEST_F(PreferencesStoreTest, FailedWritesAreLoggedAndKeepThePendingValues) {
+    const std::string domain = "test.failing";
+    const std::string directory = preferencesDirectory();
+    const std::string path = domainPath(domain);
+    struct Case {
+        std::function<void()> breakIt;
+        std::string logStart;
+        std::function<void()> repair;
+    };
+    const std::vector<Case> cases = {
+        {[&] { test::writeText(directory, "a file, not a directory"); },
+         "Preferences: cannot open directory " + directory + ": ", [&] { fs::remove(directory); }},
+        {[&] { fs::create_directories(path + "/inside"); },
+         "Preferences: " + path + " is not a regular file", [&] { fs::remove_all(path); }},
+        {[&] {
+             fs::create_directories(directory);
+             fs::create_symlink(domain + ".plist", path);
+         },
+         "Preferences: cannot follow the symbolic links at " + path + ": ",
+         [&] { fs::remove(path); }},
+    };
+    for (std::size_t i = 0; i < cases.size(); ++i) {
+        SCOPED_TRACE(i);
+        std::string key = "k" + std::to_string(i);
+        cases[i].breakIt();
+        sink.clear();
+        store.setValue(key, Value("kept"), domain, kUser);
+        EXPECT_FALSE(store.synchronize(domain, kUser));
+        ASSERT_EQ(sink.messages().size(), 1u);
+        EXPECT_EQ(sink.messages()[0].rfind(cases[i].logStart, 0), 0u) << sink.messages()[0];
+        EXPECT_EQ(store.copyValue(key, domain, kUser), Value("kept"));
+
+        cases[i].repair();
+        EXPECT_TRUE(store.synchronize(domain, kUser));
+        EXPECT_EQ(readFresh(key, domain), Value("kept"));
+        fs::remove(path);
+    }
+}
+
+// Writers in other processes each add keys of their own to one domain; none may be lost.
+TEST_F(PreferencesStoreTest, ConcurrentWritersInTwoProcessesLoseNoUpdate) {
+    const std::string domain = "test.concurrent";
+    constexpr int kWrites = 60;
+    auto writer = [&](const std::string& prefix) {
+        return [=] {
+            PreferencesStore own;
+            for (int i = 0; i < kWrites; ++i) {
+                own.setValue(prefix + std::to_string(i), Value(i), domain, kUser);
+                if (!own.synchronize(domain, kUser)) {
+                    return false;
+                }
+            }
+            return true;
+        };
+    };
+    pid_t first = startChild(writer("a"));
+    pid_t second = startChild(writer("b"));
+    EXPECT_EQ(waitChild(first), 0);
+    EXPECT_EQ(waitChild(second), 0);
+
+    auto stored = plist::readFile(domainPath(domain));
+    ASSERT_TRUE(stored && stored->isDictionary());
+    std::vector<std::string> missing;
+    for (int i = 0; i < kWrites; ++i) {
+        for (const char* prefix : {"a", "b"}) {
+            if (stored->find(prefix + std::to_string(i)) == nullptr) {
+                missing.push_back(prefix + std::to_string(i));
+            }
+        }
+    }
+    EXPECT_EQ(missing, std::vector<std::string>{});
+}
+
+TEST_F(PreferencesStoreTest, ThreadsSharingOneStoreLoseNoUpdate) {
+    const std::string domain = "test.threads";
+    constexpr int kWrites = 40;
+    auto writer = [&](const std::string& prefix) {
+        for (int i = 0; i < kWrites; ++i) {
+            store.setValue(prefix + std::to_string(i), Value(i), domain, kUser);
+            EXPECT_TRUE(store.synchronize(domain, kUser));
+            EXPECT_EQ(store.copyValue(prefix + std::to_string(i), domain, kUser), Value(i));
+        }
+    };
+    std::thread first(writer, "a");
+    std::thread second(writer, "b");
+    first.join();
+    second.join();
+    auto stored = plist::readFile(domainPath(domain));
+    ASSERT_TRUE(stored && stored->isDictionary());
+    EXPECT_EQ(stored->asDictionary()->size(), 2u * kWrites);
+}
+
+class BehaviorPreferencesTest : public testing::Test {
+  protected:
+    platform::CapturingLogSink sink;
+    platform::ScopedLogSink guard{sink};
+};
+
+TEST_F(BehaviorPreferencesTest, SetValueIsOnDiskForAFreshProcess) {
+    ASSERT_TRUE(setBehaviorPreference(kTavrixIDKey, Value("abc")));
+    EXPECT_EQ(copyBehaviorPreference(kTavrixIDKey), Value("abc"));
+
+    pid_t reader = startChild(
+        [] { return readFresh("TavrixID", "com.zandor.tavrixservices") == Value("abc"); });
+    EXPECT_EQ(waitChild(reader), 0);
+    auto stored = plist::readFile(domainPath("com.zandor.tavrixservices"));
+    ASSERT_TRUE(stored);
+    ASSERT_NE(stored->find("TavrixID"), nullptr);
+    EXPECT_EQ(*stored->find("TavrixID"), Value("abc"));
+    EXPECT_TRUE(sink.messages().empty());
+}
+
+TEST_F(BehaviorPreferencesTest, KeysKeepTheirTypesAndNothingRemoves) {
+    Value next(plist::Date::fromUnixTime(1700000000.5));
+    ASSERT_TRUE(setBehaviorPreference(kNextUpdateKey, next));
+    ASSERT_TRUE(setBehaviorPreference(kEnableSupportKey, Value(false)));
+    EXPECT_EQ(copyBehaviorPreference(kNextUpdateKey), next);
+    EXPECT_EQ(copyBehaviorPreference(kEnableSupportKey), Value(false));
+
+    ASSERT_TRUE(setBehaviorPreference(kNextUpdateKey, std::nullopt));
+    EXPECT_EQ(copyBehaviorPreference(kNextUpdateKey), std::nullopt);
+    EXPECT_EQ(readFresh("NextUpdate", "com.zandor.tavrixservices"), std::nullopt);
+    EXPECT_EQ(readFresh("EnableSupport", "com.zandor.tavrixservices"), Value(false));
+}
+
+}  // namespace
+}  // namespace tavrix
