@@ -131,7 +131,7 @@ TEST_F(PreferencesStoreTest, ReadsAreCachedUntilSynchronize) {
     ASSERT_EQ(::stat(path.c_str(), &before), 0);
     std::string text = test::readText(path);
     text.replace(text.find("old"), 3, "new");
-    { std::ofstream(path, std::ios::in | std::ios::out | std::ios::binary) << text; }
+    { std::ofstream(path, std::ofstream::in | std::ofstream::out | std::ofstream::binary) << text; }
     timespec times[2] = {before.st_atim, before.st_mtim};
     ASSERT_EQ(::utimensat(AT_FDCWD, path.c_str(), times, 0), 0);
 

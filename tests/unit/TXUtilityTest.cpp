@@ -58,14 +58,6 @@ TEST(TXUtilityFacts, RadioCapabilitiesFollowTheTable) {
     EXPECT_FALSE(TXUtility::isWiFiCapable());
 }
 
-TEST(TXUtilityFacts, DaemonFlagIsOffUntilSet) {
-    EXPECT_FALSE(TXUtility::isDaemon());
-    TXUtility::setIsDaemon(true);
-    EXPECT_TRUE(TXUtility::isDaemon());
-    TXUtility::setIsDaemon(false);
-    EXPECT_FALSE(TXUtility::isDaemon());
-}
-
 TEST(TXUtilityFacts, TaskQueueIsOneLabelledQueue) {
     SerialQueue& queue = TXUtility::taskQueue();
     EXPECT_EQ(&queue, &TXUtility::taskQueue());
@@ -111,13 +103,6 @@ TEST(TXUtilityFiles, URLIfFileExistsAnswersExistingPathsOnly) {
     EXPECT_EQ(TXUtility::URLIfFileExists(""), std::nullopt);
     std::filesystem::create_symlink(dir / "absent", dir / "dangling");
     EXPECT_EQ(TXUtility::URLIfFileExists(dir / "dangling"), std::nullopt);
-}
-
-TEST(TXUtilityFiles, RunStateNames) {
-    EXPECT_EQ(TXUtility::runStateName(1), "Foreground");
-    EXPECT_EQ(TXUtility::runStateName(0), "Background");
-    EXPECT_EQ(TXUtility::runStateName(2), std::nullopt);
-    EXPECT_EQ(TXUtility::runStateName(-1), std::nullopt);
 }
 
 // Runs in the given zone and puts the previous one back afterwards.

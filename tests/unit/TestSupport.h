@@ -34,11 +34,11 @@ class TempDir {
 
 inline void writeText(const std::string& path, const std::string& text) {
     std::filesystem::create_directories(std::filesystem::path(path).parent_path());
-    std::ofstream(path, std::ios::binary) << text;
+    std::ofstream(path, std::ofstream::binary) << text;
 }
 
 inline std::string readText(const std::string& path) {
-    std::ifstream in(path, std::ios::binary);
+    std::ifstream in(path, std::ofstream::binary);
     return std::string(std::istreambuf_iterator<char>(in), {});
 }
 
