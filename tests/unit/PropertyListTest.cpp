@@ -50,7 +50,10 @@ TEST_P(RoundTrip, KeepsScalarsAtTheTop) {
     }
 }
 
-INSTANTIATE_TEST_SUITE_P(BothFormats, RoundTrip, testing::Values(Format::Xml, Format::Binary));
+INSTANTIATE_TEST_SUITE_P(BothFormats, RoundTrip, testing::Values(Format::Xml, Format::Binary),
+                         [](const testing::TestParamInfo<Format>& info) {
+                             return info.param == Format::Xml ? "Xml" : "Binary";
+                         });
 
 TEST(PropertyListXml, ReadsValuesWrittenByOthers) {
     auto value = parse(

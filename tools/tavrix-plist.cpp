@@ -1,0 +1,47 @@
+// tavrix-plist: prints a property-list file readably, or converts it between XML and binary.
+//   tavrix-plist FILE               print the value
+//   tavrix-plist --xml FILE OUT     write FILE as XML to OUT
+//   tavrix-plist --binary FILE OUT  write FILE as a binary property list to OUT
+#include <cstdio>
+#include <cstring>
+#include <string>
+
+#include "plist/PropertyListFormat.h"
+
+namespace {
+
+int usage() {
+    std::fprintf(stderr,
+                 "usage: tavrix-plist FILE\n"
+                 "       tavrix-plist --xml|--binary FILE OUT\n");
+    return 2;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    using namespace tavrix::plist;
+    if (argc == 2 && std::strcmp(argv[1], "--help") != 0) {
+        auto value = readFile(argv[1]);
+        if (!value) {
+            std::fprintf(stderr, "tavrix-plist: %s is missing or not a property list\n", argv[1]);
+            return 1;
+        }
+        std::printf("%s\n", value->description().c_str());
+        return 0;
+    }
+    if (argc == 4 && (std::strcmp(argv[1], "--xml") == 0 || std::strcmp(argv[1], "--binary") == 0)) {
+        auto value = readFile(argv[2]);
+        if (!value) {
+            std::fprintf(stderr, "tavrix-plist: %s is missing or not a property list\n", argv[2]);
+            return 1;
+        }
+        Format format = argv[1][2] == 'x' ? Format::Xml : Format::Binary;
+        if (!writeFile(argv[3], *value, format)) {
+            std::fprintf(stderr, "tavrix-plist: cannot write %s\n", argv[3]);
+            return 1;
+        }
+        return 0;
+    }
+    return usage();
+}
