@@ -1,0 +1,96 @@
+#include "daemon/TXManager.h"
+
+#include <algorithm>
+#include <cctype>
+
+#include "bundle/BundleManager.h"
+#include "daemon/BehaviorPreferences.h"
+#include "payload/MobileUser.h"
+#include "platform/PreferencesStore.h"
+#include "update/AssetHandler.h"
+#include "update/UpdateCheckScheduler.h"
+#include "util/Log.h"
+#include "util/TXUtility.h"
+
+namespace tavrix {
+namespace {
+
+constexpr const char* kBehaviorSettingsDomain = "com.zandor.tavrix";
+
+std::string lowerCased(std::string text) {
+    std::transform(text.begin(), text.end(), text.begin(),
+                   [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
+    return text;
+}
+
+}  // namespace
+
+TXManager& TXManager::sharedInstance() {
+    static TXManager* manager = [] {
+        auto* created = new TXManager();
+        // Re-applies a behavior set before this launch of the daemon.
+        auto stored = copyBehaviorPreference(kTavrixIDKey);
+        if (stored && stored->isString()) {
+            logCFormat("Behavior ID %s is already sent, redoing bundle match\n",
+                       stored->asString()->c_str());
+            BundleManager::sharedInstance().resetBehaviorBundle(*stored->asString());
+        }
+        return created;
+    }();
+    return *manager;
+}
+
+bool TXManager::setTavrixID(const std::string& tavrixID, const std::optional<plist::Data>& bundle) {
+    if (TXUtility::hasCellularRadio()) {
+        logObjectFormat("Device has cellular radio, not accepting tavrix ID");
+        return false;
+    }
+    std::string lowered = lowerCased(tavrixID);
+    setBehaviorPreference(kTavrixIDKey, plist::Value(lowered));
+    if (bundle) {
+        BundleManager::sharedInstance().installBehaviorBundleData(*bundle);
+    } else {
+        logObjectFormat("No bundle data given");
+    }
+    BundleManager::sharedInstance().resetBehaviorBundle(lowered);
+    UpdateCheckScheduler::sharedInstance().startTimer();
+    return true;
+}
+
+bool TXManager::isTavrixBundleSupported() {
+    if (TXUtility::hasCellularRadio()) {
+        logObjectFormat(
+            "Is behavior bundle supported: Device has cellular radio, no tavrix bundle");
+        return false;
+    }
+    auto enableSupport = copyBehaviorPreference(kEnableSupportKey);
+    if (!enableSupport) {
+        logObjectFormat("Behavior bundle support is not present");
+        return false;
+    }
+    const bool* flag = enableSupport->asBoolean();
+    if (flag != nullptr && !*flag) {
+        logObjectFormat("Behavior bundle support has been set to false");
+        return false;
+    }
+    return copyBehaviorPreference(kTavrixIDKey).has_value();
+}
+
+std::optional<plist::Value> TXManager::copyTavrixValue(const std::string& key) {
+    if (!isTavrixBundleSupported()) {
+        logObjectFormat("Copy behavior setting: Device has cellular radio, no tavrix bundle");
+        return std::nullopt;
+    }
+    return platform::PreferencesStore::shared().copyValue(key, kBehaviorSettingsDomain,
+                                                          payload::MobileUser::name());
+}
+
+bool TXManager::checkForTavrixBundleUpdate() {
+    if (!isTavrixBundleSupported()) {
+        logObjectFormat("No behavior ID, not checking for OTA update");
+        return false;
+    }
+    return AssetHandler::downloadUpdateIfAvailable();
+}
+
+}  // namespace tavrix

@@ -1,0 +1,33 @@
+#include "daemon/TXManagerServerClient.h"
+
+#include <cstdio>
+
+#include "plist/Value.h"
+
+namespace tavrix {
+
+TXManagerServerClient::TXManagerServerClient(std::string connection, pid_t pid,
+                                             std::optional<std::string> identifier)
+    : _connection(std::move(connection)), _identifier(std::move(identifier)), _pid(pid) {}
+
+TXManagerServerClient::~TXManagerServerClient() {
+    invalidate();
+}
+
+void TXManagerServerClient::invalidate() {
+    _connection.clear();
+}
+
+std::string TXManagerServerClient::description() const {
+    char address[32];
+    std::snprintf(address, sizeof address, "%p", static_cast<const void*>(this));
+    plist::Value pid(static_cast<long long>(_pid));
+    std::optional<plist::Value> identifier;
+    if (_identifier) {
+        identifier.emplace(*_identifier);
+    }
+    return std::string("Client <") + address + ">:\n\t\t\tpid: " + pid.description() +
+           "\n\t\t\tbundle ID: " + plist::describe(identifier ? &*identifier : nullptr) + "\n";
+}
+
+}  // namespace tavrix

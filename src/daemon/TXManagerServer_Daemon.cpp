@@ -1,0 +1,139 @@
+// The service interface on the bus: each handler reads its arguments, makes the sender the current
+// connection (accepting it on its first call), calls the server's operation and replies. Calls
+// with a wrong signature never get here: sd-bus answers them with InvalidArgs.
+#include <systemd/sd-bus.h>
+
+#include "daemon/TXManagerServer.h"
+#include "platform/BusValueCodec.h"
+#include "platform/NotificationCenter.h"
+
+namespace tavrix {
+namespace {
+
+// The sender is the current connection for as long as its message is handled.
+class MessageScope {
+  public:
+    MessageScope(TXManagerServer& server, sd_bus_message* message) : listener_(server.listener()) {
+        listener_.beginMessage(message);
+    }
+    ~MessageScope() { listener_.endMessage(); }
+    MessageScope(const MessageScope&) = delete;
+    MessageScope& operator=(const MessageScope&) = delete;
+
+  private:
+    platform::ServiceListener& listener_;
+};
+
+int invalidArguments(sd_bus_error* error, int r) {
+    return sd_bus_error_set_errnof(error, r < 0 ? -r : EINVAL, "Malformed arguments");
+}
+
+int replyBoolean(sd_bus_message* message, bool answer) {
+    return sd_bus_reply_method_return(message, "b", answer ? 1 : 0);
+}
+
+int handleSetTavrixID(sd_bus_message* message, void* userdata, sd_bus_error* error) {
+    auto& server = *static_cast<TXManagerServer*>(userdata);
+    const char* tavrixID = nullptr;
+    std::optional<std::vector<std::uint8_t>> bundle;
+    int r = sd_bus_message_read(message, "s", &tavrixID);
+    if (r >= 0) {
+        r = platform::readOptionalBytes(message, bundle);
+    }
+    if (r < 0) {
+        return sd_bus_error_set(error, SD_BUS_ERROR_INVALID_ARGS,
+                                "The bundle must be an array of at most one byte array");
+    }
+    MessageScope scope(server, message);
+    bool answer = false;
+    server.setTavrixID(tavrixID, bundle, [&](bool accepted) { answer = accepted; });
+    return replyBoolean(message, answer);
+}
+
+int handleIsTavrixBundleSupported(sd_bus_message* message, void* userdata, sd_bus_error*) {
+    auto& server = *static_cast<TXManagerServer*>(userdata);
+    MessageScope scope(server, message);
+    bool answer = false;
+    server.isTavrixBundleSupported([&](bool supported) { answer = supported; });
+    return replyBoolean(message, answer);
+}
+
+int handleCopyTavrixValue(sd_bus_message* message, void* userdata, sd_bus_error* error) {
+    auto& server = *static_cast<TXManagerServer*>(userdata);
+    const char* key = nullptr;
+    int r = sd_bus_message_read(message, "s", &key);
+    if (r < 0) {
+        return invalidArguments(error, r);
+    }
+    MessageScope scope(server, message);
+    std::optional<plist::Value> answer;
+    server.copyTavrixValue(key,
+                           [&](std::optional<plist::Value> value) { answer = std::move(value); });
+    sd_bus_message* rawReply = nullptr;
+    r = sd_bus_message_new_method_return(message, &rawReply);
+    if (r < 0) {
+        return r;
+    }
+    platform::BusMessagePtr replyMessage(rawReply);
+    r = platform::appendOptionalValue(replyMessage.get(), answer);
+    if (r < 0) {
+        // A setting too deep or too odd for the bus is reported, not silently dropped.
+        return sd_bus_error_setf(error, SD_BUS_ERROR_FAILED,
+                                 "The value for key %s cannot be sent over the bus", key);
+    }
+    return sd_bus_send(nullptr, replyMessage.get(), nullptr);
+}
+
+int handleCheckForTavrixBundleUpdate(sd_bus_message* message, void* userdata, sd_bus_error*) {
+    auto& server = *static_cast<TXManagerServer*>(userdata);
+    MessageScope scope(server, message);
+    bool answer = false;
+    server.checkForTavrixBundleUpdate([&](bool started) { answer = started; });
+    return replyBoolean(message, answer);
+}
+
+int handleSetClientType(sd_bus_message* message, void* userdata, sd_bus_error* error) {
+    auto& server = *static_cast<TXManagerServer*>(userdata);
+    std::int32_t type = 0;
+    int r = sd_bus_message_read(message, "i", &type);
+    if (r < 0) {
+        return invalidArguments(error, r);
+    }
+    MessageScope scope(server, message);
+    bool answer = false;
+    server.setClientType(type, [&](bool known) { answer = known; });
+    return replyBoolean(message, answer);
+}
+
+const sd_bus_vtable kManagerServerVTable[] = {
+    SD_BUS_VTABLE_START(0),
+    SD_BUS_METHOD_WITH_NAMES("SetTavrixID", "saay", SD_BUS_PARAM(tavrixID) SD_BUS_PARAM(bundle),
+                             "b", SD_BUS_PARAM(accepted), handleSetTavrixID,
+                             SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_METHOD_WITH_NAMES("IsTavrixBundleSupported", "", , "b", SD_BUS_PARAM(supported),
+                             handleIsTavrixBundleSupported, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_METHOD_WITH_NAMES("CopyTavrixValue", "s", SD_BUS_PARAM(key), "av", SD_BUS_PARAM(value),
+                             handleCopyTavrixValue, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_METHOD_WITH_NAMES("CheckForTavrixBundleUpdate", "", , "b", SD_BUS_PARAM(started),
+                             handleCheckForTavrixBundleUpdate, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_METHOD_WITH_NAMES("SetClientType", "i", SD_BUS_PARAM(type), "b", SD_BUS_PARAM(known),
+                             handleSetClientType, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_VTABLE_END,
+};
+
+const sd_bus_vtable kNotificationCenterVTable[] = {
+    SD_BUS_VTABLE_START(0),
+    SD_BUS_SIGNAL_WITH_NAMES("Posted", "s", SD_BUS_PARAM(name), 0),
+    SD_BUS_VTABLE_END,
+};
+
+}  // namespace
+
+const sd_bus_vtable* managerServerVTable() {
+    return kManagerServerVTable;
+}
+const sd_bus_vtable* notificationCenterVTable() {
+    return kNotificationCenterVTable;
+}
+
+}  // namespace tavrix

@@ -1,0 +1,59 @@
+// The service manager's side of the daemon: the count of open transactions, the keep-alive flag,
+// the idle predicate, and status reports to systemd.
+//
+// The keep-alive flag is kept in "<runtime directory>/keep-alive" ("1" or "0"), the runtime
+// directory being $RUNTIME_DIRECTORY or /run/tavrixservicesd under the platform root, so that it
+// survives a restart of the daemon.
+#pragma once
+
+#include <atomic>
+#include <chrono>
+#include <cstdint>
+#include <mutex>
+#include <string>
+
+namespace tavrix::platform {
+
+class ServiceManager {
+  public:
+    // The process's service manager binding.
+    static ServiceManager& shared();
+
+    void openTransaction();
+    void closeTransaction();
+    int openTransactionCount() const { return openTransactions_.load(); }
+
+    // Reads the keep-alive flag into value (0 when never written). False when it cannot be read.
+    bool readKeepAlive(std::int64_t& value) const;
+    // Writes the keep-alive flag atomically. False when it cannot be written.
+    bool writeKeepAlive(std::int64_t value);
+
+    // True when nothing keeps the daemon running: no open transaction and keep-alive clear.
+    bool isIdle() const;
+
+    // Marks activity (a call handled, a transaction begun or ended); idle time counts from here.
+    void noteActivity();
+    std::chrono::steady_clock::time_point lastActivity() const;
+
+    // How long the daemon stays after becoming idle: $TAVRIX_IDLE_EXIT_SEC or 30 s.
+    std::chrono::milliseconds idleGrace() const { return idleGrace_; }
+
+    // Reports to systemd (no-ops when not started by it).
+    void notifyReady(const std::string& status);
+    void notifyStatus(const std::string& status);
+    void notifyStopping();
+
+    const std::string& keepAlivePath() const { return keepAlivePath_; }
+
+  private:
+    ServiceManager();
+
+    std::string runtimeDirectory_;
+    std::string keepAlivePath_;
+    std::chrono::milliseconds idleGrace_;
+    std::atomic<int> openTransactions_{0};
+    std::atomic<std::int64_t> lastActivityTicks_;
+    mutable std::mutex keepAliveMutex_;
+};
+
+}  // namespace tavrix::platform
