@@ -7,6 +7,7 @@
 
 #include <cerrno>
 #include <cstdlib>
+#include <filesystem>
 #include <string_view>
 
 #include "platform/PlatformRoot.h"
@@ -95,7 +96,9 @@ bool ServiceManager::readKeepAlive(std::int64_t& value) const {
 
 bool ServiceManager::writeKeepAlive(std::int64_t value) {
     std::lock_guard lock(keepAliveMutex_);
-    if (::mkdir(runtimeDirectory_.c_str(), 0755) != 0 && errno != EEXIST) {
+    std::error_code error;
+    std::filesystem::create_directories(runtimeDirectory_, error);
+    if (error) {
         return false;
     }
     std::string temporary = keepAlivePath_ + ".new";
