@@ -6,6 +6,7 @@
 #include "daemon/TXManagerServer.h"
 #include "platform/BusValueCodec.h"
 #include "platform/NotificationCenter.h"
+#include "util/Log.h"
 
 namespace tavrix {
 namespace {
@@ -58,6 +59,15 @@ int handleIsTavrixBundleSupported(sd_bus_message* message, void* userdata, sd_bu
     return replyBoolean(message, answer);
 }
 
+platform::BusMessagePtr valueReply(sd_bus_message* call, const std::optional<plist::Value>& value) {
+    sd_bus_message* raw = nullptr;
+    if (sd_bus_message_new_method_return(call, &raw) < 0) {
+        return nullptr;
+    }
+    platform::BusMessagePtr reply(raw);
+    return platform::appendOptionalValue(reply.get(), value) < 0 ? nullptr : std::move(reply);
+}
+
 int handleCopyTavrixValue(sd_bus_message* message, void* userdata, sd_bus_error* error) {
     auto& server = *static_cast<TXManagerServer*>(userdata);
     const char* key = nullptr;
@@ -69,17 +79,15 @@ int handleCopyTavrixValue(sd_bus_message* message, void* userdata, sd_bus_error*
     std::optional<plist::Value> answer;
     server.copyTavrixValue(key,
                            [&](std::optional<plist::Value> value) { answer = std::move(value); });
-    sd_bus_message* rawReply = nullptr;
-    r = sd_bus_message_new_method_return(message, &rawReply);
-    if (r < 0) {
-        return r;
+    platform::BusMessagePtr replyMessage = valueReply(message, answer);
+    if (!replyMessage && answer) {
+        // A setting the bus cannot carry (too deep, or text that is not UTF-8) is answered as no
+        // value: every well-formed call gets a normal reply.
+        logCFormat("The value for key %s cannot be sent over the bus; answering no value\n", key);
+        replyMessage = valueReply(message, std::nullopt);
     }
-    platform::BusMessagePtr replyMessage(rawReply);
-    r = platform::appendOptionalValue(replyMessage.get(), answer);
-    if (r < 0) {
-        // A setting too deep or too odd for the bus is reported, not silently dropped.
-        return sd_bus_error_setf(error, SD_BUS_ERROR_FAILED,
-                                 "The value for key %s cannot be sent over the bus", key);
+    if (!replyMessage) {
+        return -ENOMEM;
     }
     return sd_bus_send(nullptr, replyMessage.get(), nullptr);
 }

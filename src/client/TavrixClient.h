@@ -1,0 +1,113 @@
+// The client side of tavrixservicesd: synchronous calls of the five operations over D-Bus and
+// delivery of the notifications that daemon instances post.
+//
+// A TavrixClient is one bus connection, used from one thread at a time; a moved-from client may
+// only be destroyed or assigned to. Every failure (no bus,
+// a daemon that cannot be activated, an error reply, a reply of the wrong shape) throws a
+// ClientError whose what() is one line naming the operation and the reason.
+#pragma once
+
+#include <chrono>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <stdexcept>
+#include <string>
+#include <vector>
+
+#include "platform/BusHandles.h"
+#include "plist/Value.h"
+
+namespace tavrix::client {
+
+inline constexpr const char* kServiceName = "com.zandor.tavrixservicesd";
+inline constexpr const char* kObjectPath = "/com/zandor/tavrixservicesd";
+inline constexpr const char* kServerInterface = "com.zandor.TXManagerServerInterface";
+inline constexpr const char* kNotificationInterface = "com.zandor.NotificationCenter";
+inline constexpr const char* kNotificationMember = "Posted";
+
+// Long enough for the bus to activate the daemon and for it to install a bundle.
+inline constexpr std::chrono::seconds kCallTimeout{60};
+
+class ClientError : public std::runtime_error {
+  public:
+    using std::runtime_error::runtime_error;
+};
+
+using NotificationHandler = std::function<void(const std::string& name)>;
+
+// Keeps a notification handler registered; destroying (or resetting) it unsubscribes.
+class NotificationSubscription {
+  public:
+    // What the bus slot points to: the handler and where deliveries are counted.
+    struct Target;
+
+    NotificationSubscription();
+    NotificationSubscription(NotificationSubscription&&) noexcept;
+    NotificationSubscription& operator=(NotificationSubscription&&) noexcept;
+    NotificationSubscription(const NotificationSubscription&) = delete;
+    NotificationSubscription& operator=(const NotificationSubscription&) = delete;
+    ~NotificationSubscription();
+
+    bool active() const { return slot_ != nullptr; }
+    void reset() noexcept;
+
+  private:
+    friend class TavrixClient;
+
+    // Declared before the slot, so that the slot is released before the target it points to.
+    std::unique_ptr<Target> target_;
+    platform::BusSlotPtr slot_;
+};
+
+class TavrixClient {
+  public:
+    // The system bus ($DBUS_SYSTEM_BUS_ADDRESS when set).
+    static TavrixClient connectToSystemBus();
+    // The message bus at a D-Bus address such as "unix:path=/run/test/bus".
+    static TavrixClient connectToAddress(const std::string& address);
+
+    TavrixClient(TavrixClient&&) noexcept;
+    TavrixClient& operator=(TavrixClient&&) noexcept;
+    TavrixClient(const TavrixClient&) = delete;
+    TavrixClient& operator=(const TavrixClient&) = delete;
+    ~TavrixClient();
+
+    // Sets the behavior ID with an optional packed bundle; false when the daemon refused.
+    bool setTavrixID(const std::string& tavrixID,
+                     const std::optional<std::vector<std::uint8_t>>& bundle);
+    bool isTavrixBundleSupported();
+    // The behavior setting for key, or nothing when there is none.
+    std::optional<plist::Value> copyTavrixValue(const std::string& key);
+    // True when an update check was started.
+    bool checkForTavrixBundleUpdate();
+    // True when the daemon knows this connection as a client.
+    bool setClientType(std::int32_t type);
+
+    // Calls handler with the name of every notification posted from now on, by any daemon
+    // instance, while the subscription lives. Handlers run inside processFor and runUntil; an
+    // exception a handler throws comes out of those.
+    NotificationSubscription subscribe(NotificationHandler handler);
+
+    // Handles incoming messages for the given time; true when a notification was delivered.
+    bool processFor(std::chrono::milliseconds duration);
+    // Handles incoming messages until done() holds (true) or the timeout passes (false). done()
+    // is checked after every message and at least every 100 ms, so that a flag set from a signal
+    // handler is seen promptly.
+    bool runUntil(const std::function<bool()>& done, std::chrono::milliseconds timeout);
+
+    // This connection's unique name on the bus.
+    std::string uniqueName() const;
+
+  private:
+    struct State;
+    explicit TavrixClient(std::unique_ptr<State> state);
+
+    // Handles one message or waits up to timeout for one; answers whether one was delivered.
+    bool processOnce(std::chrono::steady_clock::duration timeout);
+
+    std::unique_ptr<State> state_;
+};
+
+}  // namespace tavrix::client

@@ -1,0 +1,228 @@
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <cstdlib>
+#include <functional>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "PrivateBusDaemon.h"
+#include "client/TavrixClient.h"
+#include "platform/BusValueCodec.h"
+
+namespace tavrix::client {
+namespace {
+
+using namespace std::chrono_literals;
+using platform::BusMessagePtr;
+using platform::BusPtr;
+using plist::Value;
+using testing::HasSubstr;
+
+// What the stub answers for CopyTavrixValue.
+Value sampleValue() {
+    return plist::Dictionary{{"name", Value("\xc3\xa9t\xc3\xa9")},
+                             {"when", Value(plist::Date{1.5})},
+                             {"blob", Value(plist::Data{})}};
+}
+
+// Stands in for the daemon under its bus name, on a thread of its own, with answers chosen to
+// exercise the client: right ones, error replies and replies of the wrong shape.
+class StubService {
+  public:
+    explicit StubService(const test::PrivateBusDaemon& daemon) : bus_(daemon.connect()) {
+        if (sd_bus_request_name(bus_.get(), kServiceName, 0) < 0) {
+            throw std::runtime_error("cannot own the service name");
+        }
+        thread_ = std::thread([this] { serve(); });
+    }
+    ~StubService() {
+        stop_ = true;
+        thread_.join();
+    }
+    StubService(const StubService&) = delete;
+    StubService& operator=(const StubService&) = delete;
+
+    // Posts a notification as the daemon does, with a body of the given signature.
+    template <typename... Arguments>
+    void post(const char* signature, Arguments... arguments) {
+        std::lock_guard lock(mutex_);
+        sd_bus_emit_signal(bus_.get(), kObjectPath, kNotificationInterface, kNotificationMember,
+                           signature, arguments...);
+        sd_bus_flush(bus_.get());
+    }
+
+  private:
+    void serve() {
+        while (!stop_) {
+            std::unique_lock lock(mutex_);
+            sd_bus_message* raw = nullptr;
+            int r = sd_bus_process(bus_.get(), &raw);
+            BusMessagePtr call(raw);
+            if (call && sd_bus_message_is_method_call(call.get(), kServerInterface, nullptr)) {
+                answer(call.get());
+            }
+            lock.unlock();
+            if (r == 0) {
+                sd_bus_wait(bus_.get(), 20'000);
+            } else if (r < 0) {
+                return;
+            }
+        }
+    }
+
+    void answer(sd_bus_message* call) {
+        const std::string member = sd_bus_message_get_member(call);
+        sd_bus_message* raw = nullptr;
+        if (member == "SetTavrixID") {
+            // Answers whether a bundle came, so that absent and empty can be told apart.
+            const char* id = nullptr;
+            std::optional<std::vector<std::uint8_t>> bundle;
+            sd_bus_message_read_basic(call, 's', &id);
+            int r = platform::readOptionalBytes(call, bundle);
+            sd_bus_reply_method_return(call, "b", r >= 0 && bundle.has_value());
+        } else if (member == "IsTavrixBundleSupported") {
+            sd_bus_reply_method_errorf(call, SD_BUS_ERROR_ACCESS_DENIED, "Not for you");
+        } else if (member == "CopyTavrixValue") {
+            const char* key = nullptr;
+            sd_bus_message_read_basic(call, 's', &key);
+            sd_bus_message_new_method_return(call, &raw);
+            BusMessagePtr reply(raw);
+            if (std::string(key) == "two values") {
+                sd_bus_message_append(reply.get(), "av", 2, "s", "a", "s", "b");
+            } else if (std::string(key) == "missing") {
+                platform::appendOptionalValue(reply.get(), std::nullopt);
+            } else {
+                platform::appendOptionalValue(reply.get(), sampleValue());
+            }
+            sd_bus_send(nullptr, reply.get(), nullptr);
+        } else if (member == "CheckForTavrixBundleUpdate") {
+            sd_bus_reply_method_return(call, "s", "not a boolean");
+        } else if (member == "SetClientType") {
+            // Known is the caller that sent type 7, the only one the tests expect.
+            std::int32_t type = 0;
+            sd_bus_message_read_basic(call, 'i', &type);
+            sd_bus_reply_method_return(call, "b", type == 7);
+        }
+    }
+
+    BusPtr bus_;
+    std::mutex mutex_;
+    std::atomic<bool> stop_{false};
+    std::thread thread_;
+};
+
+std::string failureOf(const std::function<void()>& operation) {
+    try {
+        operation();
+    } catch (const ClientError& error) {
+        return error.what();
+    }
+    return "(no error)";
+}
+
+TEST(TavrixClient, ConnectingWhereNothingListensNamesTheProblem) {
+    test::PrivateBusDaemon bus;
+    EXPECT_THAT(failureOf([&] { TavrixClient::connectToAddress(bus.deadAddress()); }),
+                HasSubstr("cannot connect to " + bus.deadAddress() + ": No such file"));
+    ::setenv("DBUS_SYSTEM_BUS_ADDRESS", bus.deadAddress().c_str(), 1);
+    EXPECT_THAT(failureOf([] { TavrixClient::connectToSystemBus(); }),
+                HasSubstr("cannot connect to the system bus: No such file"));
+    // And the system bus is the one the variable names.
+    ::setenv("DBUS_SYSTEM_BUS_ADDRESS", bus.address().c_str(), 1);
+    EXPECT_NO_THROW(TavrixClient::connectToSystemBus());
+}
+
+TEST(TavrixClient, EveryOperationReportsAMissingDaemon) {
+    test::PrivateBusDaemon bus;
+    TavrixClient client = TavrixClient::connectToAddress(bus.address());
+    const std::pair<const char*, std::function<void()>> operations[] = {
+        {"SetTavrixID", [&] { client.setTavrixID("id", std::nullopt); }},
+        {"IsTavrixBundleSupported", [&] { client.isTavrixBundleSupported(); }},
+        {"CopyTavrixValue", [&] { client.copyTavrixValue("key"); }},
+        {"CheckForTavrixBundleUpdate", [&] { client.checkForTavrixBundleUpdate(); }},
+        {"SetClientType", [&] { client.setClientType(1); }},
+    };
+    for (const auto& [name, operation] : operations) {
+        EXPECT_EQ(failureOf(operation),
+                  std::string(name) +
+                      " failed: org.freedesktop.DBus.Error.ServiceUnknown: The name "
+                      "com.zandor.tavrixservicesd was not provided by any .service files");
+    }
+}
+
+TEST(TavrixClient, DecodesRepliesAndRefusesMalformedOnes) {
+    test::PrivateBusDaemon bus;
+    StubService stub(bus);
+    TavrixClient client = TavrixClient::connectToAddress(bus.address());
+
+    EXPECT_FALSE(client.setTavrixID("id", std::nullopt));
+    EXPECT_TRUE(client.setTavrixID("id", std::vector<std::uint8_t>{}));
+    EXPECT_TRUE(client.setClientType(7));
+    EXPECT_FALSE(client.setClientType(-7));
+    EXPECT_EQ(client.copyTavrixValue("sample"), sampleValue());
+    EXPECT_EQ(client.copyTavrixValue("missing"), std::nullopt);
+
+    EXPECT_EQ(failureOf([&] { client.isTavrixBundleSupported(); }),
+              "IsTavrixBundleSupported failed: org.freedesktop.DBus.Error.AccessDenied: Not for "
+              "you");
+    EXPECT_EQ(failureOf([&] { client.checkForTavrixBundleUpdate(); }),
+              "CheckForTavrixBundleUpdate failed: malformed reply: signature \"s\", expected "
+              "\"b\"");
+    EXPECT_THAT(failureOf([&] { client.copyTavrixValue("two values"); }),
+                HasSubstr("CopyTavrixValue failed: malformed reply"));
+    // Refused before sending: the bus would carry the text only up to the NUL.
+    EXPECT_EQ(failureOf([&] { client.copyTavrixValue(std::string("k\0ey", 4)); }),
+              "CopyTavrixValue failed: key contains a NUL character");
+    // The connection is still good after all of that.
+    EXPECT_TRUE(client.setClientType(7));
+}
+
+TEST(TavrixClient, DeliversNotificationsWhileSubscribed) {
+    test::PrivateBusDaemon bus;
+    StubService stub(bus);
+    TavrixClient client = TavrixClient::connectToAddress(bus.address());
+    std::vector<std::string> names;
+    auto subscription = client.subscribe([&](const std::string& name) { names.push_back(name); });
+
+    stub.post("s", "TXDaemonStartedNotification");
+    stub.post("i", 42);  // a matching signal without a name is skipped
+    stub.post("s", "kTVXBehaviorBundleChangedNotification");
+    EXPECT_TRUE(client.runUntil([&] { return names.size() >= 2; }, 10s));
+    EXPECT_EQ(names, (std::vector<std::string>{"TXDaemonStartedNotification",
+                                               "kTVXBehaviorBundleChangedNotification"}));
+
+    subscription.reset();
+    stub.post("s", "TXDaemonStartedNotification");
+    EXPECT_FALSE(client.processFor(200ms));
+    EXPECT_EQ(names.size(), 2u);
+}
+
+TEST(TavrixClient, HandlerExceptionsComeOutOfProcessing) {
+    struct HandlerBroke {};
+    test::PrivateBusDaemon bus;
+    StubService stub(bus);
+    TavrixClient client = TavrixClient::connectToAddress(bus.address());
+    auto subscription = client.subscribe([](const std::string&) { throw HandlerBroke{}; });
+    stub.post("s", "TXDaemonStartedNotification");
+    EXPECT_THROW(client.runUntil([] { return false; }, 10s), HandlerBroke);
+}
+
+TEST(TavrixClient, ReportsALostBus) {
+    test::PrivateBusDaemon bus;
+    TavrixClient client = TavrixClient::connectToAddress(bus.address());
+    std::optional<NotificationSubscription> subscription =
+        client.subscribe([](const std::string&) {});
+    bus.stop();
+    EXPECT_THAT(failureOf([&] { client.processFor(5s); }), HasSubstr("connection to the bus lost"));
+    EXPECT_THAT(failureOf([&] { client.setClientType(1); }), HasSubstr("SetClientType failed: "));
+    // A subscription may outlive its client.
+    { TavrixClient gone = std::move(client); }
+    subscription.reset();
+}
+
+}  // namespace
+}  // namespace tavrix::client

@@ -1,0 +1,399 @@
+// tavrixctl: calls tavrixservicesd from the command line and watches its notifications.
+// Results go to stdout plainly; a failure is one line on stderr and exit status 1, a usage
+// mistake exit status 2.
+#include <fcntl.h>
+#include <signal.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <chrono>
+#include <cmath>
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <functional>
+#include <initializer_list>
+#include <limits>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "client/TavrixClient.h"
+#include "util/UniqueFd.h"
+
+namespace {
+
+using tavrix::client::ClientError;
+using tavrix::client::TavrixClient;
+
+constexpr int kFailure = 1;
+constexpr int kUsage = 2;
+
+constexpr const char* kOverallHelp =
+    "usage: tavrixctl [--address ADDRESS] COMMAND [ARGUMENTS]\n"
+    "\n"
+    "Calls tavrixservicesd on the system bus.\n"
+    "\n"
+    "Commands:\n"
+    "  set-id ID [--bundle FILE]  set the behavior ID, optionally with a packed bundle\n"
+    "  supported                  tell whether behavior bundles are supported\n"
+    "  value KEY                  print the behavior setting for KEY\n"
+    "  check-update               look for a newer behavior bundle and install it\n"
+    "  client-type N              announce this client's type N\n"
+    "  watch [--count N] [--timeout SECONDS]\n"
+    "                             print the names of posted notifications\n"
+    "\n"
+    "Options:\n"
+    "  --address ADDRESS  use the message bus at this D-Bus address instead\n"
+    "  --help             show this help; 'tavrixctl COMMAND --help' shows a command's\n"
+    "\n"
+    "Exit status: 0 on success (whatever the answer), 1 on failure, 2 on a usage mistake.\n";
+
+struct Command {
+    const char* name;
+    const char* help;
+};
+
+constexpr Command kCommands[] = {
+    {"set-id",
+     "usage: tavrixctl set-id ID [--bundle FILE]\n"
+     "\n"
+     "Sets the behavior ID (the daemon stores it lower-cased). With --bundle, FILE is a\n"
+     "gzip- or compress-compressed tar or cpio archive sent as the behavior bundle.\n"
+     "Prints \"yes\" when the daemon accepted the ID, \"no\" when it refused it.\n"},
+    {"supported",
+     "usage: tavrixctl supported\n"
+     "\n"
+     "Prints \"yes\" when behavior bundles are enabled on this device and a behavior ID is set,\n"
+     "else \"no\".\n"},
+    {"value",
+     "usage: tavrixctl value KEY\n"
+     "\n"
+     "Prints the behavior setting for KEY (strings as they are, other values readably), or\n"
+     "\"(no value)\" when there is none.\n"},
+    {"check-update",
+     "usage: tavrixctl check-update\n"
+     "\n"
+     "Asks the daemon to look for a newer behavior bundle and install it. Prints \"yes\" when\n"
+     "an update was found and started, else \"no\".\n"},
+    {"client-type",
+     "usage: tavrixctl client-type N\n"
+     "\n"
+     "Announces this client's type, a signed 32-bit number. Prints \"yes\" when the daemon\n"
+     "knows this connection as a client, else \"no\".\n"},
+    {"watch",
+     "usage: tavrixctl watch [--count N] [--timeout SECONDS]\n"
+     "\n"
+     "Prints the name of every notification posted by the daemon, one a line, until\n"
+     "interrupted (SIGINT, SIGTERM), after N notifications, or after SECONDS. Exits 1 when\n"
+     "the timeout passes before N notifications arrived. \"Watching for notifications\" on\n"
+     "stderr means the subscription is in place.\n"},
+};
+
+// A usage mistake: the reason, reported with exit status 2.
+struct UsageError {
+    std::string reason;
+};
+
+// A failure that is not the bus's: the reason, reported with exit status 1.
+struct Failure {
+    std::string reason;
+};
+
+const Command* findCommand(std::string_view name) {
+    for (const Command& command : kCommands) {
+        if (name == command.name) {
+            return &command;
+        }
+    }
+    return nullptr;
+}
+
+std::optional<long long> parseInteger(const std::string& text, long long min, long long max) {
+    if (text.empty()) {
+        return std::nullopt;
+    }
+    errno = 0;
+    char* end = nullptr;
+    long long value = std::strtoll(text.c_str(), &end, 10);
+    if (errno != 0 || *end != '\0' || value < min || value > max) {
+        return std::nullopt;
+    }
+    return value;
+}
+
+std::optional<double> parseSeconds(const std::string& text) {
+    if (text.empty()) {
+        return std::nullopt;
+    }
+    errno = 0;
+    char* end = nullptr;
+    double value = std::strtod(text.c_str(), &end);
+    // Up to a year, so that the conversion to milliseconds cannot overflow.
+    if (errno != 0 || *end != '\0' || !std::isfinite(value) || value < 0 ||
+        value > 366.0 * 24 * 3600) {
+        return std::nullopt;
+    }
+    return value;
+}
+
+std::vector<std::uint8_t> readWholeFile(const std::string& path) {
+    tavrix::UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    if (!fd) {
+        throw Failure{"cannot read " + path + ": " + std::strerror(errno)};
+    }
+    std::vector<std::uint8_t> bytes;
+    std::uint8_t buffer[65536];
+    for (;;) {
+        ssize_t got = ::read(fd.get(), buffer, sizeof buffer);
+        if (got == 0) {
+            return bytes;
+        }
+        if (got < 0) {
+            if (errno == EINTR) {
+                continue;
+            }
+            throw Failure{"cannot read " + path + ": " + std::strerror(errno)};
+        }
+        bytes.insert(bytes.end(), buffer, buffer + got);
+    }
+}
+
+// The arguments of one command, with the command's own options taken out.
+class Arguments {
+  public:
+    Arguments(const Command& command, std::vector<std::string> words)
+        : command_(command), words_(std::move(words)) {}
+
+    // The value of option (given as "--option VALUE" or "--option=VALUE"), removed from the
+    // words.
+    std::optional<std::string> takeOption(const std::string& option) {
+        for (auto it = words_.begin(); it != words_.end(); ++it) {
+            if (*it == option) {
+                if (it + 1 == words_.end()) {
+                    throw UsageError{std::string(command_.name) + ": " + option + " needs a value"};
+                }
+                std::string value = *(it + 1);
+                words_.erase(it, it + 2);
+                return value;
+            }
+            if (it->rfind(option + "=", 0) == 0) {
+                std::string value = it->substr(option.size() + 1);
+                words_.erase(it);
+                return value;
+            }
+        }
+        return std::nullopt;
+    }
+
+    // The remaining words, which must be exactly the named operands.
+    std::vector<std::string> operands(std::initializer_list<const char*> names) const {
+        for (const std::string& word : words_) {
+            // A negative number is an operand, anything else with a dash a mistaken option.
+            if (word.size() > 1 && word[0] == '-' && !parseInteger(word, INT64_MIN, INT64_MAX)) {
+                throw UsageError{std::string(command_.name) + ": unknown option " + word};
+            }
+        }
+        if (words_.size() != names.size()) {
+            std::string expected;
+            for (const char* name : names) {
+                expected += std::string(" ") + name;
+            }
+            throw UsageError{
+                std::string(command_.name) +
+                (names.size() == 0 ? " takes no arguments" : " expects the arguments" + expected)};
+        }
+        return words_;
+    }
+
+  private:
+    const Command& command_;
+    std::vector<std::string> words_;
+};
+
+void printBoolean(bool answer) {
+    std::printf("%s\n", answer ? "yes" : "no");
+}
+
+// What a command does once connected; answers the exit status.
+using Action = std::function<int(TavrixClient&)>;
+
+int watch(TavrixClient& client, std::optional<long long> count,
+          std::optional<std::chrono::milliseconds> timeout) {
+    // Blocked, the stop signals stay pending instead of ending the process, and the wait loop
+    // sees them without a handler.
+    sigset_t stopSignals;
+    sigemptyset(&stopSignals);
+    sigaddset(&stopSignals, SIGINT);
+    sigaddset(&stopSignals, SIGTERM);
+    if (sigprocmask(SIG_BLOCK, &stopSignals, nullptr) != 0) {
+        throw Failure{std::string("cannot block signals: ") + std::strerror(errno)};
+    }
+    auto stopRequested = [] {
+        sigset_t pending;
+        sigemptyset(&pending);
+        return sigpending(&pending) == 0 &&
+               (sigismember(&pending, SIGINT) == 1 || sigismember(&pending, SIGTERM) == 1);
+    };
+
+    long long seen = 0;
+    auto subscription = client.subscribe([&](const std::string& name) {
+        ++seen;
+        std::printf("%s\n", name.c_str());
+        std::fflush(stdout);
+    });
+    std::fprintf(stderr, "Watching for notifications\n");
+
+    auto finished = [&] { return stopRequested() || (count && seen >= *count); };
+    if (!timeout) {
+        // Without a timeout, wait in day-long rounds until finished.
+        while (!client.runUntil(finished, std::chrono::hours(24))) {
+        }
+        return 0;
+    }
+    if (!client.runUntil(finished, *timeout) && count) {
+        throw Failure{"watch timed out after " + std::to_string(seen) + " of " +
+                      std::to_string(*count) + " notifications"};
+    }
+    return 0;
+}
+
+Action parseWatch(Arguments& arguments) {
+    std::optional<long long> count;
+    if (auto text = arguments.takeOption("--count")) {
+        count = parseInteger(*text, 1, std::numeric_limits<long long>::max());
+        if (!count) {
+            throw UsageError{"watch: --count needs a positive whole number, not '" + *text + "'"};
+        }
+    }
+    std::optional<std::chrono::milliseconds> timeout;
+    if (auto text = arguments.takeOption("--timeout")) {
+        auto seconds = parseSeconds(*text);
+        if (!seconds) {
+            throw UsageError{"watch: --timeout needs a number of seconds, not '" + *text + "'"};
+        }
+        timeout = std::chrono::milliseconds(std::llround(*seconds * 1000));
+    }
+    arguments.operands({});
+    return [count, timeout](TavrixClient& client) { return watch(client, count, timeout); };
+}
+
+// Checks the command's arguments (and reads its files) before anything is sent.
+Action parseCommand(const Command& command, Arguments& arguments) {
+    const std::string_view name = command.name;
+    if (name == "set-id") {
+        auto file = arguments.takeOption("--bundle");
+        auto id = arguments.operands({"ID"})[0];
+        std::optional<std::vector<std::uint8_t>> bundle;
+        if (file) {
+            bundle = readWholeFile(*file);
+        }
+        return [id, bundle = std::move(bundle)](TavrixClient& client) {
+            printBoolean(client.setTavrixID(id, bundle));
+            return 0;
+        };
+    }
+    if (name == "supported") {
+        arguments.operands({});
+        return [](TavrixClient& client) {
+            printBoolean(client.isTavrixBundleSupported());
+            return 0;
+        };
+    }
+    if (name == "value") {
+        auto key = arguments.operands({"KEY"})[0];
+        return [key](TavrixClient& client) {
+            auto value = client.copyTavrixValue(key);
+            std::printf("%s\n", value ? value->description().c_str() : "(no value)");
+            return 0;
+        };
+    }
+    if (name == "check-update") {
+        arguments.operands({});
+        return [](TavrixClient& client) {
+            printBoolean(client.checkForTavrixBundleUpdate());
+            return 0;
+        };
+    }
+    if (name == "client-type") {
+        auto text = arguments.operands({"N"})[0];
+        auto type = parseInteger(text, INT32_MIN, INT32_MAX);
+        if (!type) {
+            throw UsageError{"client-type: N must be a signed 32-bit number, not '" + text + "'"};
+        }
+        return [type = static_cast<std::int32_t>(*type)](TavrixClient& client) {
+            printBoolean(client.setClientType(type));
+            return 0;
+        };
+    }
+    return parseWatch(arguments);
+}
+
+int run(int argc, char** argv) {
+    std::vector<std::string> words(argv + 1, argv + argc);
+    std::optional<std::string> address;
+    std::size_t next = 0;
+    // Global options come before the command.
+    for (; next < words.size() && words[next].rfind("--", 0) == 0; ++next) {
+        const std::string& word = words[next];
+        if (word == "--help") {
+            std::fputs(kOverallHelp, stdout);
+            return 0;
+        }
+        if (word == "--address") {
+            if (next + 1 == words.size()) {
+                throw UsageError{"--address needs a value"};
+            }
+            address = words[++next];
+        } else if (word.rfind("--address=", 0) == 0) {
+            address = word.substr(std::strlen("--address="));
+        } else {
+            throw UsageError{"unknown option " + word};
+        }
+    }
+    if (next == words.size()) {
+        throw UsageError{"no command given"};
+    }
+    const Command* command = findCommand(words[next]);
+    if (command == nullptr) {
+        throw UsageError{"unknown command '" + words[next] + "'"};
+    }
+    std::vector<std::string> rest(words.begin() + static_cast<std::ptrdiff_t>(next) + 1,
+                                  words.end());
+    for (const std::string& word : rest) {
+        if (word == "--help") {
+            std::fputs(command->help, stdout);
+            return 0;
+        }
+    }
+    if (address && address->empty()) {
+        throw UsageError{"--address needs a value"};
+    }
+    Arguments arguments(*command, std::move(rest));
+    Action action = parseCommand(*command, arguments);
+    TavrixClient client =
+        address ? TavrixClient::connectToAddress(*address) : TavrixClient::connectToSystemBus();
+    return action(client);
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    try {
+        return run(argc, argv);
+    } catch (const UsageError& error) {
+        std::fprintf(stderr, "tavrixctl: %s (see tavrixctl --help)\n", error.reason.c_str());
+        return kUsage;
+    } catch (const Failure& error) {
+        std::fprintf(stderr, "tavrixctl: %s\n", error.reason.c_str());
+        return kFailure;
+    } catch (const ClientError& error) {
+        std::fprintf(stderr, "tavrixctl: %s\n", error.what());
+        return kFailure;
+    } catch (const std::exception& error) {
+        std::fprintf(stderr, "tavrixctl: %s\n", error.what());
+        return kFailure;
+    }
+}
