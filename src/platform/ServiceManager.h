@@ -31,7 +31,8 @@ class ServiceManager {
     // True when nothing keeps the daemon running: no open transaction and keep-alive clear.
     bool isIdle() const;
 
-    // Marks activity (a call handled, a transaction begun or ended); idle time counts from here.
+    // Marks activity (a transaction begun or ended, the keep-alive flag written); idle time
+    // counts from the last one.
     void noteActivity();
     std::chrono::steady_clock::time_point lastActivity() const;
 

@@ -1,0 +1,117 @@
+// The behavior façade as clients see it through the bus: who may set an ID, how it is stored,
+// what decides support, and where behavior settings come from.
+#include "BusFixture.h"
+#include "plist/PropertyListFormat.h"
+
+namespace tavrix::integration {
+namespace {
+
+using DaemonBehaviorTest = BusFixture;
+
+std::optional<plist::Value> storedTavrixID(const DeviceRoot& device) {
+    auto preferences = device.readDaemonPreferences();
+    if (!preferences) {
+        return std::nullopt;
+    }
+    const plist::Value* id = preferences->find("TavrixID");
+    return id == nullptr ? std::nullopt : std::optional<plist::Value>(*id);
+}
+
+TEST_F(DaemonBehaviorTest, CellularDeviceRefusesTheIdAndSupportsNothing) {
+    device().setCellularRadio(true);
+    device().writeDaemonPreferences({{"EnableSupport", true}});
+    device().writeBehaviorSettings({{"CarrierName", "Zed"}});
+    auto caller = client();
+
+    EXPECT_FALSE(caller.setTavrixID("abc", std::nullopt));
+    EXPECT_TRUE(waitForLogLine("Handling Set Tavrix ID with abc"));
+    EXPECT_TRUE(waitForLogLine("Device has cellular radio, not accepting tavrix ID"));
+    EXPECT_EQ(storedTavrixID(device()), std::nullopt);
+
+    EXPECT_FALSE(caller.isTavrixBundleSupported());
+    EXPECT_TRUE(waitForLogLine(
+        "Is behavior bundle supported: Device has cellular radio, no tavrix bundle"));
+    EXPECT_EQ(caller.copyTavrixValue("CarrierName"), std::nullopt);
+    EXPECT_FALSE(caller.checkForTavrixBundleUpdate());
+    EXPECT_TRUE(waitForLogLine("No behavior ID, not checking for OTA update"));
+}
+
+// Setting the ID checks only the radio: without "EnableSupport" it is still stored, lower-cased.
+// A missing bundle and an empty one stay different on their way to the daemon.
+TEST_F(DaemonBehaviorTest, IdIsStoredLowerCasedWhetherOrNotSupportIsEnabled) {
+    auto caller = client();
+    EXPECT_TRUE(caller.setTavrixID("AbC", std::nullopt));
+    EXPECT_TRUE(waitForLogLine("Handling Set Tavrix ID with AbC"));
+    EXPECT_TRUE(waitForLogLine("No bundle data given"));
+    EXPECT_EQ(storedTavrixID(device()), std::optional<plist::Value>("abc"));
+
+    EXPECT_FALSE(caller.isTavrixBundleSupported());
+    EXPECT_TRUE(waitForLogLine("Behavior bundle support is not present"));
+
+    EXPECT_TRUE(caller.setTavrixID("XY-Z", std::vector<std::uint8_t>{}));
+    EXPECT_EQ(storedTavrixID(device()), std::optional<plist::Value>("xy-z"));
+    EXPECT_EQ(countLogLines("No bundle data given"), 1);
+}
+
+TEST_F(DaemonBehaviorTest, EnableSupportDecidesSupportOnceAnIdIsSet) {
+    struct Case {
+        const char* what;
+        std::optional<plist::Value> enableSupport;
+        bool withID;
+        bool supported;
+    };
+    const Case cases[] = {
+        {"absent", std::nullopt, true, false},
+        {"false", plist::Value(false), true, false},
+        {"true", plist::Value(true), true, true},
+        {"the string NO", plist::Value("NO"), true, true},
+        {"the integer 0", plist::Value(0), true, true},
+        {"true without an ID", plist::Value(true), false, false},
+    };
+    auto caller = client();
+    for (const Case& test : cases) {
+        plist::Dictionary preferences;
+        if (test.enableSupport) {
+            preferences.emplace("EnableSupport", *test.enableSupport);
+        }
+        if (test.withID) {
+            preferences.emplace("TavrixID", "abc");
+        }
+        device().writeDaemonPreferences(preferences);
+        EXPECT_EQ(caller.isTavrixBundleSupported(), test.supported)
+            << "EnableSupport " << test.what;
+    }
+    EXPECT_EQ(countLogLines("Behavior bundle support is not present"), 1);
+    EXPECT_EQ(countLogLines("Behavior bundle support has been set to false"), 1);
+}
+
+// Every type of value comes back as it is in the file, and only while bundles are supported.
+TEST_F(DaemonBehaviorTest, BehaviorSettingsAreReadOnlyWhileSupported) {
+    const plist::Dictionary settings = {
+        {"CarrierName", "Zed"},
+        {"MaxRate", 42},
+        {"Ratio", 0.25},
+        {"Roaming", false},
+        {"Since", plist::Date{123456.5}},
+        {"Token", plist::Data{0, 1, 2, 255}},
+        {"Bands", plist::Array{"b1", 3}},
+        {"Limits", plist::Dictionary{{"daily", 10}, {"note", ""}}},
+        {"Nothing", plist::Array{}},
+    };
+    device().writeBehaviorSettings(settings);
+    auto caller = client();
+
+    EXPECT_EQ(caller.copyTavrixValue("CarrierName"), std::nullopt);
+    EXPECT_TRUE(
+        waitForLogLine("Copy behavior setting: Device has cellular radio, no tavrix bundle"));
+
+    device().writeDaemonPreferences({{"TavrixID", "abc"}, {"EnableSupport", true}});
+    for (const auto& [key, value] : settings) {
+        EXPECT_EQ(caller.copyTavrixValue(key), std::optional<plist::Value>(value)) << key;
+    }
+    EXPECT_EQ(caller.copyTavrixValue("Missing"), std::nullopt);
+    EXPECT_TRUE(waitForLogLine("Handling Copy Tavrix Value for key Missing"));
+}
+
+}  // namespace
+}  // namespace tavrix::integration

@@ -1,0 +1,86 @@
+// The daemon's life on the bus: started by the first call, held by its launch transaction, gone
+// when idle, started again by the next call; SIGTERM ends it cleanly.
+#include <signal.h>
+
+#include <algorithm>
+
+#include "BusFixture.h"
+
+namespace tavrix::integration {
+namespace {
+
+constexpr const char* kLaunchBegun =
+    "*********** Beginning Corvex transaction : TXMinimumLaunchTransaction ***********";
+constexpr const char* kLaunchEnded =
+    "*********** Ended Corvex transaction : TXMinimumLaunchTransaction ***********";
+constexpr const char* kStartedNotification = "TXDaemonStartedNotification";
+
+class DaemonLifecycleTest : public BusFixture {
+  protected:
+    DaemonLifecycleTest() { busOptions.idleExitSeconds = 1; }
+
+    // Position of the first whole line equal to text, or the line count when there is none.
+    std::size_t lineIndex(const std::string& text) const {
+        auto lines = daemonLogLines();
+        return static_cast<std::size_t>(std::find(lines.begin(), lines.end(), text) -
+                                        lines.begin());
+    }
+};
+
+// One wait for the launch transaction covers the whole cycle: activation, the start-up order,
+// staying for the transaction although idle exit is 1 s, leaving with 0, and activation again.
+TEST_F(DaemonLifecycleTest, StartsOnCallStaysForLaunchTransactionLeavesWhenIdleAndRestarts) {
+    ASSERT_TRUE(watcher().nameOwner().empty());
+    auto caller = client();
+    EXPECT_FALSE(caller.isTavrixBundleSupported());
+    ASSERT_TRUE(waitForNameOwner());
+    const std::string firstOwner = watcher().nameOwner();
+    const auto firstPid = daemonPid();
+    ASSERT_TRUE(firstPid);
+    EXPECT_TRUE(watcher().waitForNotification(kStartedNotification, 1, 5s));
+
+    const std::size_t starting = lineIndex("Starting the server: keepAlive = DISABLED");
+    const std::size_t begun = lineIndex(kLaunchBegun);
+    const std::size_t notifying = lineIndex("Notifying observers of start");
+    const std::size_t lineCount = daemonLogLines().size();
+    EXPECT_LT(starting, begun);
+    EXPECT_LT(begun, notifying);
+    EXPECT_LT(notifying, lineCount);
+    EXPECT_EQ(countLogLines("Starting the server."), 0);
+
+    ASSERT_TRUE(waitForLogLine(kLaunchEnded, 20s));
+    watcher().waitUntil([] { return false; }, 0ms);  // take in what the bus has reported so far
+    EXPECT_EQ(watcher().nameReleaseCount(), 0) << "left while the launch transaction was open";
+
+    ASSERT_TRUE(waitForNoNameOwner(10s));
+    EXPECT_EQ(waitForDaemonExit(*firstPid), std::optional<int>(0));
+
+    EXPECT_FALSE(caller.isTavrixBundleSupported());
+    ASSERT_TRUE(waitForNameOwner());
+    EXPECT_NE(watcher().nameOwner(), firstOwner);
+    EXPECT_NE(daemonPid(), firstPid);
+    EXPECT_TRUE(watcher().waitForNotification(kStartedNotification, 2, 5s));
+    EXPECT_EQ(watcher().notificationCount(kStartedNotification), 2);
+    EXPECT_EQ(countLogLines(kLaunchBegun), 2);
+}
+
+// A keep-alive flag left set by an earlier run is seen at start and cleared once started;
+// SIGTERM, even with the launch transaction open, ends the daemon with 0 and the flag clear.
+TEST_F(DaemonLifecycleTest, KeepAliveLeftByEarlierRunIsClearedAndSigtermExitsCleanly) {
+    device().setKeepAliveFlag("1");
+    auto caller = client();
+    EXPECT_TRUE(caller.setClientType(0));
+    const auto pid = daemonPid();
+    ASSERT_TRUE(pid);
+    EXPECT_TRUE(waitForLogLine("Starting the server: keepAlive = ENABLED"));
+    EXPECT_TRUE(waitForLogLine("Keep alive status: Disabled"));
+    EXPECT_EQ(device().keepAliveFlag(), std::optional<std::string>("0"));
+
+    ASSERT_EQ(::kill(*pid, SIGTERM), 0);
+    EXPECT_TRUE(waitForNoNameOwner());
+    EXPECT_EQ(waitForDaemonExit(*pid), std::optional<int>(0));
+    EXPECT_EQ(device().keepAliveFlag(), std::optional<std::string>("0"));
+}
+
+}  // namespace
+}  // namespace tavrix::integration

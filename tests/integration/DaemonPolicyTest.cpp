@@ -1,0 +1,127 @@
+// The packaged bus policy, loaded by a bus that denies by default as the system bus does: anyone
+// may ask, only root and the policy's group may change the ID or start an update, and only the
+// daemon's user may own the name. Clients run as other users, so this needs root.
+#include <gmock/gmock.h>
+#include <grp.h>
+#include <pwd.h>
+#include <unistd.h>
+
+#include <fstream>
+
+#include "BusFixture.h"
+#include "CommandRunner.h"
+
+namespace tavrix::integration {
+namespace {
+
+using ::testing::HasSubstr;
+using ::testing::Not;
+
+constexpr uid_t kNobody = 65534;
+// Stands in for the "tavrix" group, which the machine running the tests need not have.
+constexpr const char* kStandInGroup = "users";
+
+std::string replaceOnce(std::string text, const std::string& from, const std::string& to) {
+    auto at = text.find(from);
+    if (at == std::string::npos || text.find(from, at + 1) != std::string::npos) {
+        throw std::runtime_error("the policy should name " + from + " exactly once");
+    }
+    return text.replace(at, from.size(), to);
+}
+
+class DaemonPolicyTest : public BusFixture {
+  protected:
+    void SetUp() override {
+        if (::geteuid() != 0) {
+            GTEST_SKIP() << "running clients as other users needs root";
+        }
+        const group* standIn = ::getgrnam(kStandInGroup);
+        if (standIn == nullptr) {
+            GTEST_SKIP() << "no group \"" << kStandInGroup << "\" to stand in for \"tavrix\"";
+        }
+        standInGid_ = standIn->gr_gid;
+        busOptions.policyFile = adaptedPolicy();
+        BusFixture::SetUp();
+    }
+
+    // The packaged policy, with the daemon's user being whoever runs the tests (the bus starts
+    // the daemon as that user) and the stand-in group for "tavrix".
+    std::filesystem::path adaptedPolicy() {
+        std::ifstream in(TAVRIX_POLICY_PATH, std::ios::binary);
+        std::string policy(std::istreambuf_iterator<char>(in), {});
+        const passwd* self = ::getpwuid(::geteuid());
+        policy =
+            replaceOnce(policy, "user=\"mobile\"", std::string("user=\"") + self->pw_name + "\"");
+        policy =
+            replaceOnce(policy, "group=\"tavrix\"", std::string("group=\"") + kStandInGroup + "\"");
+        std::filesystem::path path = device().base() / "policy.conf";
+        std::ofstream(path, std::ios::binary) << policy;
+        return path;
+    }
+
+    // command run as the user nobody with the given primary group and no other groups.
+    static CommandResult asNobody(gid_t gid, const std::vector<std::string>& command) {
+        std::vector<std::string> argv = {"/usr/bin/setpriv", "--reuid=" + std::to_string(kNobody),
+                                         "--regid=" + std::to_string(gid), "--clear-groups"};
+        argv.insert(argv.end(), command.begin(), command.end());
+        return runCommand(argv);
+    }
+
+    CommandResult tavrixctlAs(gid_t gid, const std::vector<std::string>& arguments) {
+        std::vector<std::string> command = {TAVRIX_CTL_PATH, "--address", busAddress()};
+        command.insert(command.end(), arguments.begin(), arguments.end());
+        return asNobody(gid, command);
+    }
+
+    gid_t standInGid_ = 0;
+};
+
+TEST_F(DaemonPolicyTest, AnyoneMayAskButOnlyPrivilegedCallersMayChange) {
+    const gid_t nogroup = kNobody;
+    auto setID = tavrixctlAs(nogroup, {"set-id", "x"});
+    EXPECT_NE(setID.status, 0) << setID.output;
+    EXPECT_THAT(setID.output, HasSubstr("AccessDenied"));
+    auto update = tavrixctlAs(nogroup, {"check-update"});
+    EXPECT_NE(update.status, 0) << update.output;
+    EXPECT_THAT(update.output, HasSubstr("AccessDenied"));
+
+    for (const std::vector<std::string>& question :
+         {std::vector<std::string>{"supported"}, {"value", "CarrierName"}, {"client-type", "1"}}) {
+        auto answer = tavrixctlAs(nogroup, question);
+        EXPECT_EQ(answer.status, 0) << question.front() << ": " << answer.output;
+        EXPECT_THAT(answer.output, Not(HasSubstr("AccessDenied"))) << question.front();
+    }
+    // Refused calls never reached the daemon.
+    EXPECT_EQ(countLogLines("Handling Set Tavrix ID with x"), 0);
+
+    auto asGroup = tavrixctlAs(standInGid_, {"set-id", "y"});
+    EXPECT_EQ(asGroup.status, 0) << asGroup.output;
+    EXPECT_TRUE(waitForLogLine("Handling Set Tavrix ID with y"));
+
+    EXPECT_TRUE(client().setTavrixID("z", std::nullopt));
+}
+
+TEST_F(DaemonPolicyTest, OnlyTheDaemonsUserMayOwnTheName) {
+    const std::vector<std::string> requestName = {"call",
+                                                  "org.freedesktop.DBus",
+                                                  "/org/freedesktop/DBus",
+                                                  "org.freedesktop.DBus",
+                                                  "RequestName",
+                                                  "su",
+                                                  kDaemonBusName,
+                                                  "0"};
+    std::vector<std::string> busctl = {"/usr/bin/busctl", "--address=" + busAddress()};
+    busctl.insert(busctl.end(), requestName.begin(), requestName.end());
+
+    auto refused = asNobody(kNobody, busctl);
+    EXPECT_NE(refused.status, 0) << refused.output;
+    EXPECT_THAT(refused.output, HasSubstr("Access denied"));
+
+    // The daemon's user (here the test's own) gets it: busctl becomes the primary owner (1).
+    auto owned = runCommand(busctl);
+    EXPECT_EQ(owned.status, 0) << owned.output;
+    EXPECT_EQ(owned.output, "u 1\n");
+}
+
+}  // namespace
+}  // namespace tavrix::integration

@@ -1,0 +1,271 @@
+#include "PrivateBus.h"
+
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
+#include <spawn.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <chrono>
+#include <fstream>
+#include <map>
+#include <sstream>
+#include <stdexcept>
+#include <thread>
+
+#include "util/UniqueFd.h"
+
+extern char** environ;
+
+namespace tavrix::integration {
+namespace {
+
+namespace fs = std::filesystem;
+using namespace std::chrono_literals;
+
+constexpr auto kStartTimeout = 10s;
+constexpr auto kStopTimeout = 5s;
+
+std::string readWholeFile(const fs::path& path) {
+    std::ifstream in(path, std::ios::binary);
+    return std::string(std::istreambuf_iterator<char>(in), {});
+}
+
+void writeWholeFile(const fs::path& path, const std::string& text) {
+    std::ofstream out(path, std::ios::binary | std::ios::trunc);
+    out << text;
+    if (!out.flush()) {
+        throw std::runtime_error("cannot write " + path.string());
+    }
+}
+
+std::string quoted(const fs::path& path) {
+    return "'" + path.string() + "'";
+}
+
+// The rules of the system bus's default context: nothing may be owned or called unless a policy
+// file opens it; signals and replies pass.
+constexpr const char* kSystemDefaultPolicy = R"(  <policy context="default">
+    <allow user="*"/>
+    <deny own="*"/>
+    <deny send_type="method_call"/>
+    <allow send_type="signal"/>
+    <allow send_requested_reply="true" send_type="method_return"/>
+    <allow send_requested_reply="true" send_type="error"/>
+    <allow receive_type="method_call"/>
+    <allow receive_type="method_return"/>
+    <allow receive_type="error"/>
+    <allow receive_type="signal"/>
+    <allow send_destination="org.freedesktop.DBus" send_interface="org.freedesktop.DBus"/>
+    <allow send_destination="org.freedesktop.DBus"
+           send_interface="org.freedesktop.DBus.Introspectable"/>
+  </policy>
+)";
+
+// The rules of a session bus: everything may be owned, sent and received.
+constexpr const char* kOpenPolicy = R"(  <policy context="default">
+    <allow send_destination="*" eavesdrop="true"/>
+    <allow eavesdrop="true"/>
+    <allow own="*"/>
+  </policy>
+)";
+
+// The environment of the bus and so of the daemon: the test's own, without anything that could
+// point the daemon at another bus or another root.
+std::vector<std::string> busEnvironment() {
+    std::vector<std::string> result;
+    for (char** entry = environ; *entry != nullptr; ++entry) {
+        std::string_view text(*entry);
+        if (!text.starts_with("DBUS_") && !text.starts_with("TAVRIX_") &&
+            !text.starts_with("RUNTIME_DIRECTORY=")) {
+            result.emplace_back(text);
+        }
+    }
+    return result;
+}
+
+std::string readAddress(int fd) {
+    std::string address;
+    auto deadline = std::chrono::steady_clock::now() + kStartTimeout;
+    while (address.find('\n') == std::string::npos) {
+        auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+            deadline - std::chrono::steady_clock::now());
+        if (left <= 0ms) {
+            return {};
+        }
+        pollfd entry{fd, POLLIN, 0};
+        int ready = ::poll(&entry, 1, static_cast<int>(left.count()));
+        if (ready < 0 && errno != EINTR) {
+            return {};
+        }
+        if (ready <= 0) {
+            continue;
+        }
+        char buffer[256];
+        ssize_t got = ::read(fd, buffer, sizeof buffer);
+        if (got == 0 || (got < 0 && errno != EINTR)) {
+            return {};
+        }
+        if (got > 0) {
+            address.append(buffer, static_cast<std::size_t>(got));
+        }
+    }
+    address.erase(address.find('\n'));
+    return address;
+}
+
+class SpawnActions {
+  public:
+    SpawnActions() { posix_spawn_file_actions_init(&actions_); }
+    ~SpawnActions() { posix_spawn_file_actions_destroy(&actions_); }
+    SpawnActions(const SpawnActions&) = delete;
+    SpawnActions& operator=(const SpawnActions&) = delete;
+    posix_spawn_file_actions_t* get() { return &actions_; }
+
+  private:
+    posix_spawn_file_actions_t actions_;
+};
+
+}  // namespace
+
+PrivateBus::PrivateBus(const DeviceRoot& device, const BusOptions& options)
+    : directory_(device.base() / "bus"),
+      logPath_(device.base() / "daemon.log"),
+      launchesPath_(directory_ / "launches") {
+    fs::create_directories(directory_ / "services");
+    writeConfiguration(device, options);
+    start();
+}
+
+PrivateBus::~PrivateBus() {
+    stop();
+}
+
+void PrivateBus::writeConfiguration(const DeviceRoot& device, const BusOptions& options) {
+    // The daemon runs as a child of this script rather than in its place, so that its exit
+    // status is recorded: the bus only ever sees the script's.
+    const fs::path launcher = directory_ / "launch-daemon";
+    writeWholeFile(launcher,
+                   "#!/bin/sh\n"
+                   "/usr/bin/env TAVRIX_ROOT=" +
+                       quoted(device.root()) + " TAVRIX_LOG_STDERR=1 TAVRIX_IDLE_EXIT_SEC=" +
+                       std::to_string(options.idleExitSeconds) +
+                       " RUNTIME_DIRECTORY=" + quoted(device.runtimeDirectory()) + " " +
+                       quoted(TAVRIX_DAEMON_PATH) + " >>" + quoted(logPath_) + " 2>&1 &\n" +
+                       "daemon=$!\n"
+                       "echo \"started $daemon\" >>" +
+                       quoted(launchesPath_) + "\n" +
+                       "wait \"$daemon\"\n"
+                       "echo \"exited $daemon $?\" >>" +
+                       quoted(launchesPath_) + "\n");
+
+    writeWholeFile(directory_ / "services" / "com.zandor.tavrixservicesd.service",
+                   "[D-BUS Service]\n"
+                   "Name=com.zandor.tavrixservicesd\n"
+                   "Exec=/bin/sh " +
+                       launcher.string() + "\n");
+
+    std::string policy = kOpenPolicy;
+    if (options.policyFile) {
+        policy = std::string(kSystemDefaultPolicy) + "  <include>" + options.policyFile->string() +
+                 "</include>\n";
+    }
+    writeWholeFile(directory_ / "bus.conf",
+                   "<!DOCTYPE busconfig PUBLIC \"-//freedesktop//DTD D-Bus Bus Configuration "
+                   "1.0//EN\"\n \"http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd\">\n"
+                   "<busconfig>\n"
+                   "  <type>session</type>\n"
+                   "  <listen>unix:path=" +
+                       (directory_ / "socket").string() + "</listen>\n" +
+                       "  <auth>EXTERNAL</auth>\n"
+                       "  <servicedir>" +
+                       (directory_ / "services").string() + "</servicedir>\n" + policy +
+                       "</busconfig>\n");
+}
+
+void PrivateBus::start() {
+    UniqueFd logFd(::open(logPath_.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644));
+    int ends[2];
+    if (!logFd || ::pipe2(ends, O_CLOEXEC) != 0) {
+        throw std::runtime_error("cannot prepare the bus's log or address pipe");
+    }
+    UniqueFd addressRead(ends[0]);
+    UniqueFd addressWriteLow(ends[1]);
+    // Above the descriptors the child is given, so that no dup2 below overwrites it.
+    UniqueFd addressWrite(::fcntl(addressWriteLow.get(), F_DUPFD_CLOEXEC, 10));
+    addressWriteLow.reset();
+
+    SpawnActions actions;
+    posix_spawn_file_actions_addopen(actions.get(), 0, "/dev/null", O_RDONLY, 0);
+    posix_spawn_file_actions_adddup2(actions.get(), logFd.get(), 1);
+    posix_spawn_file_actions_adddup2(actions.get(), logFd.get(), 2);
+    posix_spawn_file_actions_adddup2(actions.get(), addressWrite.get(), 3);
+
+    std::string configOption = "--config-file=" + (directory_ / "bus.conf").string();
+    std::vector<char*> arguments = {const_cast<char*>("dbus-daemon"), configOption.data(),
+                                    const_cast<char*>("--nofork"),
+                                    const_cast<char*>("--print-address=3"), nullptr};
+    std::vector<std::string> environment = busEnvironment();
+    std::vector<char*> environmentPointers;
+    for (std::string& entry : environment) {
+        environmentPointers.push_back(entry.data());
+    }
+    environmentPointers.push_back(nullptr);
+
+    if (::posix_spawnp(&pid_, "dbus-daemon", actions.get(), nullptr, arguments.data(),
+                       environmentPointers.data()) != 0) {
+        pid_ = -1;
+        throw std::runtime_error("cannot start dbus-daemon");
+    }
+    addressWrite.reset();
+    address_ = readAddress(addressRead.get());
+    if (address_.empty()) {
+        stop();
+        throw std::runtime_error("dbus-daemon did not report its address:\n" + log());
+    }
+}
+
+void PrivateBus::stop() {
+    if (pid_ <= 0) {
+        return;
+    }
+    ::kill(pid_, SIGTERM);
+    auto deadline = std::chrono::steady_clock::now() + kStopTimeout;
+    while (::waitpid(pid_, nullptr, WNOHANG) == 0) {
+        if (std::chrono::steady_clock::now() > deadline) {
+            ::kill(pid_, SIGKILL);
+            ::waitpid(pid_, nullptr, 0);
+            break;
+        }
+        std::this_thread::sleep_for(10ms);
+    }
+    pid_ = -1;
+}
+
+std::string PrivateBus::log() const {
+    return readWholeFile(logPath_);
+}
+
+std::vector<DaemonLaunch> PrivateBus::launches() const {
+    std::vector<DaemonLaunch> result;
+    std::map<pid_t, std::size_t> indexOfPid;
+    std::istringstream lines(readWholeFile(launchesPath_));
+    std::string what;
+    pid_t pid = -1;
+    while (lines >> what >> pid) {
+        if (what == "started") {
+            indexOfPid[pid] = result.size();
+            result.push_back({pid, std::nullopt});
+        } else if (int status = 0; what == "exited" && lines >> status) {
+            auto found = indexOfPid.find(pid);
+            if (found != indexOfPid.end()) {
+                result[found->second].exitStatus = status;
+            }
+        }
+    }
+    return result;
+}
+
+}  // namespace tavrix::integration
