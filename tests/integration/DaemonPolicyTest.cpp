@@ -47,7 +47,7 @@ class DaemonPolicyTest : public BusFixture {
     // The packaged policy, with the daemon's user being whoever runs the tests (the bus starts
     // the daemon as that user) and the stand-in group for "tavrix".
     std::filesystem::path adaptedPolicy() {
-        std::ifstream in(TAVRIX_POLICY_PATH, std::ios::binary);
+        std::ifstream in(TAVRIX_POLICY_PATH, std::fstream::binary);
         std::string policy(std::istreambuf_iterator<char>(in), {});
         const passwd* self = ::getpwuid(::geteuid());
         policy =
@@ -55,7 +55,7 @@ class DaemonPolicyTest : public BusFixture {
         policy =
             replaceOnce(policy, "group=\"tavrix\"", std::string("group=\"") + kStandInGroup + "\"");
         std::filesystem::path path = device().base() / "policy.conf";
-        std::ofstream(path, std::ios::binary) << policy;
+        std::ofstream(path, std::fstream::binary) << policy;
         return path;
     }
 

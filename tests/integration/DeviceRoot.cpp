@@ -21,7 +21,7 @@ constexpr std::string_view kBehaviorSettings =
 
 void writeText(const fs::path& path, std::string_view text) {
     fs::create_directories(path.parent_path());
-    std::ofstream out(path, std::ios::binary | std::ios::trunc);
+    std::ofstream out(path, std::fstream::binary | std::fstream::trunc);
     out << text;
     if (!out.flush()) {
         throw std::runtime_error("cannot write " + path.string());
@@ -90,7 +90,7 @@ void DeviceRoot::writeBehaviorSettings(const plist::Dictionary& values) {
 }
 
 std::optional<std::string> DeviceRoot::keepAliveFlag() const {
-    std::ifstream in(runtimeDirectory() / "keep-alive", std::ios::binary);
+    std::ifstream in(runtimeDirectory() / "keep-alive", std::fstream::binary);
     if (!in) {
         return std::nullopt;
     }

@@ -29,12 +29,12 @@ constexpr auto kStartTimeout = 10s;
 constexpr auto kStopTimeout = 5s;
 
 std::string readWholeFile(const fs::path& path) {
-    std::ifstream in(path, std::ios::binary);
+    std::ifstream in(path, std::fstream::binary);
     return std::string(std::istreambuf_iterator<char>(in), {});
 }
 
 void writeWholeFile(const fs::path& path, const std::string& text) {
-    std::ofstream out(path, std::ios::binary | std::ios::trunc);
+    std::ofstream out(path, std::fstream::binary | std::fstream::trunc);
     out << text;
     if (!out.flush()) {
         throw std::runtime_error("cannot write " + path.string());
