@@ -10,6 +10,7 @@
 #include <string>
 #include <vector>
 
+#include "DbusDaemonProcess.h"
 #include "DeviceRoot.h"
 
 namespace tavrix::integration {
@@ -36,7 +37,7 @@ class PrivateBus {
     PrivateBus(const PrivateBus&) = delete;
     PrivateBus& operator=(const PrivateBus&) = delete;
 
-    const std::string& address() const { return address_; }
+    const std::string& address() const { return process_->address(); }
     const std::filesystem::path& logPath() const { return logPath_; }
     std::string log() const;
     // Every daemon start so far, oldest first.
@@ -50,8 +51,7 @@ class PrivateBus {
     std::filesystem::path directory_;
     std::filesystem::path logPath_;
     std::filesystem::path launchesPath_;
-    std::string address_;
-    pid_t pid_ = -1;
+    std::optional<test::DbusDaemonProcess> process_;
 };
 
 }  // namespace tavrix::integration
