@@ -1,17 +1,16 @@
+// Placeholder until the bundle manager lands.
 #include "bundle/BundleManager.h"
 
 namespace tavrix {
+
+BundleManager::BundleManager() = default;
 
 BundleManager& BundleManager::sharedInstance() {
     static BundleManager* manager = new BundleManager();
     return *manager;
 }
 
-// The payload unpacker and the reset flow are not part of the daemon yet; these entry points keep
-// the façade's order of calls in place until they are.
-void BundleManager::installBehaviorBundleData(const plist::Data&) {}
-
-BundleChangeType BundleManager::resetBehaviorBundle(const std::string&) {
+BundleChangeType BundleManager::resetBehaviorBundle(const std::optional<std::string>&) {
     return kBundleChangeTypeUnknown;
 }
 

@@ -1,31 +1,57 @@
-// The bundle manager: knows the bundle locations, installs received bundle payloads and redoes the
-// bundle match for a behavior ID. Callers must not overlap; they run on the main thread or on the
-// update scheduler's queue.
+// The bundle manager: knows which behavior bundle the device uses, installs received bundle
+// payloads and redoes the bundle match for a behavior ID. It has no lock: callers must not
+// overlap (they run on the main thread or on the update scheduler's queue).
 #pragma once
 
+#include <optional>
 #include <string>
 
+#include "bundle/BundleTypes.h"
+#include "bundle/CarrierBundle.h"
 #include "plist/Value.h"
 
 namespace tavrix {
 
-enum BundleChangeType {
-    kBundleChangeTypeUnknown = -1,
-    kBundleChangeTypeNoChange = 0,
-    kBundleChangeTypeUpdate = 1,
-    kBundleChangeTypeOverrideSwitch = 2,
-};
-
 class BundleManager {
   public:
-    // The process's bundle manager, created on first use and never destroyed.
+    // The process's bundle manager: sets the bundle locations once, then creates the manager on
+    // first use (reading the existing links); never destroyed.
     static BundleManager& sharedInstance();
 
-    // Unpacks a received bundle payload into the user bundle directory.
+    BundleManager(const BundleManager&) = delete;
+    BundleManager& operator=(const BundleManager&) = delete;
+
+    // Replaces the user bundle with the one packed in data (a gzip- or compress-compressed tar or
+    // cpio archive). Failures are logged only; the old user bundle is gone even then.
     void installBehaviorBundleData(const plist::Data& data);
 
-    // Finds the carrier file for the behavior ID, re-links it when it changed and tells everyone.
-    BundleChangeType resetBehaviorBundle(const std::string& tavrixID);
+    // Keeps behaviorID and runs the reset flow for it.
+    BundleChangeType resetBehaviorBundle(const std::optional<std::string>& behaviorID);
+    // Finds and overlays the carrier file for the kept behavior ID, compares it with the linked
+    // one and, when it changed, re-links it and tells every process.
+    BundleChangeType runBundleReset();
+
+    // Resets out to the newer of the system and the user bundle (the user one on equal versions).
+    // False when neither has a version.
+    bool findBundle(CarrierBundle& out) const;
+    // The linked bundle's version, or nothing when unknown.
+    std::optional<std::string> copyBundleVersion() const;
+    // What going from current to matched changes.
+    BundleChangeType compareBundles(const CarrierBundle& current,
+                                    const CarrierBundle& matched) const;
+
+    // The bundle and carrier file linked now.
+    const CarrierBundle& currentBundle() const { return currentBundle_; }
+    const std::string& bundleLinkPath() const { return bundleLinkPath_; }
+    const std::string& preferencesLinkPath() const { return preferencesLinkPath_; }
+
+  private:
+    BundleManager();
+
+    std::optional<std::string> behaviorID_;
+    std::string bundleLinkPath_;
+    std::string preferencesLinkPath_;
+    CarrierBundle currentBundle_;
 };
 
 }  // namespace tavrix

@@ -1,0 +1,25 @@
+// The two links in the mobile user's home that make a bundle and its carrier file current, and
+// the small path helpers the bundle core uses everywhere. None of the helpers logs.
+#pragma once
+
+#include <string>
+
+#include "bundle/CarrierBundle.h"
+
+namespace tavrix {
+
+// Points bundleLink at bundle.bundlePath and preferencesLink at bundle.carrierFilePath (each
+// replacing what was there), verifies both and re-reads the bundle version. The record takes the
+// two link paths. True when both links are in place.
+bool establishBundleLinks(CarrierBundle& bundle, const std::string& bundleLink,
+                          const std::string& preferencesLink);
+
+// POSIX basename / dirname of the path (cut at 1023 bytes); "." for an empty path.
+std::string baseNameOfPath(const std::string& path);
+std::string dirNameOfPath(const std::string& path);
+// The resolved real path, or empty when it cannot be resolved.
+std::string realPathOf(const std::string& path);
+// A symbolic link's text (at most 1023 bytes), or empty when path is no readable link.
+std::string readLinkTarget(const std::string& path);
+
+}  // namespace tavrix
