@@ -1,5 +1,6 @@
 // Placeholder until the bundle manager lands.
 #include "bundle/BundleManager.h"
+#include "bundle/OverlayContext.h"
 
 namespace tavrix {
 
@@ -14,4 +15,11 @@ BundleChangeType BundleManager::resetBehaviorBundle(const std::optional<std::str
     return kBundleChangeTypeUnknown;
 }
 
+}  // namespace tavrix
+
+namespace tavrix {
+void findBaseBundle(OverlayContext& context, OverlayType overlayType) {
+    context = OverlayContext{};
+    context.overlayType = overlayType;
+}
 }  // namespace tavrix
