@@ -1,6 +1,8 @@
 #!/usr/bin/env bash
 # The demo: lays out a device root in demo-root/ from examples/, starts a private message bus that
-# activates the freshly built daemon on demand, and talks to it with tavrixctl.
+# activates the freshly built daemon on demand, and walks through the daemon's main job with
+# tavrixctl: a behavior ID set with a packed bundle, the bundle match, the links, the generated
+# overlay file, the notification, and a repeated call that changes nothing.
 # usage: scripts/demo.sh BUILD_DIR
 set -euo pipefail
 build=$(cd "${1:-build}" && pwd)
@@ -8,50 +10,73 @@ top=$(cd "$(dirname "$0")/.." && pwd)
 root="$top/demo-root"
 work=$(mktemp -d /tmp/tavrix-demo-XXXXXX)
 ctl="$build/tools/tavrixctl"
+plist="$build/tools/tavrix-plist"
+home="$root/var/mobile"
 . "$top/scripts/private-bus.sh"
 trap 'stop_private_bus; rm -rf "$work"' EXIT
 
 step() { printf '\n\033[1m== %s\033[0m\n' "$*"; }
 run() { printf '$ %s\n' "$*"; "$@" || true; }
+# The daemon's log lines since the mark, without the bus's own.
+log_since() { tail -n +"$(($1 + 1))" "$work/daemon.log" | grep -v '^dbus-daemon\[' | sed 's/^/   /'; }
+log_mark() { wc -l < "$work/daemon.log"; }
+show_links() {
+    for link in "$home/Library/Tavrix.bundle" "$home/Library/Preferences/com.zandor.tavrix.plist"; do
+        printf '   %s -> %s\n' "${link#"$root"}" "$(readlink "$link" | sed "s|^$root||")"
+    done
+}
 
 rm -rf "$root"
 cp -a "$top/examples/demo-root" "$root"
-step "Device root $root"
+step "Device root $root (a tablet, hardware model DT1, with a system bundle of version 9)"
 (cd "$root" && find . -type f | sort | sed 's/^\./   /')
 
 start_private_bus "$work" "$build/src/daemon/tavrixservicesd" "$root" 5
-step "Private bus at $DBUS_SYSTEM_BUS_ADDRESS; the daemon is not running yet"
+step "Private bus at $DBUS_SYSTEM_BUS_ADDRESS; the first call starts the daemon"
+run "$ctl" supported
 
-step "Watching notifications while the first call starts the daemon"
-"$ctl" watch --count 1 --timeout 15 > "$work/watch.out" &
+step "A newer bundle (version 10) packed as a payload"
+run "$ctl" pack "$top/examples/bundles/Default.bundle" -o "$work/Default.bundle.tgz"
+bsdtar -tvzf "$work/Default.bundle.tgz" | sed 's/^/   /'
+
+step "Setting the behavior ID with the bundle, while tavrixctl watch listens"
+"$ctl" watch --count 1 --timeout 20 > "$work/watch.out" 2>/dev/null &
 watcher=$!
 sleep 0.3
-run "$ctl" supported
+mark=$(log_mark)
+run "$ctl" set-id Demo-Carrier --bundle "$work/Default.bundle.tgz"
 wait "$watcher" || true
-printf 'notification seen: %s\n' "$(cat "$work/watch.out")"
+printf 'notification seen by watch: %s\n' "$(cat "$work/watch.out")"
 
-step "Setting a behavior ID (stored lower-cased)"
-run "$ctl" set-id Demo-Carrier
-run "$ctl" supported
+step "What the daemon did"
+log_since "$mark"
+
+step "The links in the mobile home"
+show_links
+
+step "The generated overlay file (device overlay for DT1, then the behavior overlay)"
+for file in "$home"/Library/TavrixBundles/Overlay/*; do
+    printf '   %s\n' "${file#"$root"}"
+done
+"$plist" "$(readlink "$home/Library/Preferences/com.zandor.tavrix.plist")" | sed 's/^/   /'
+
+step "Behavior settings as clients read them"
 run "$ctl" value CarrierName
-run "$ctl" client-type 1
+run "$ctl" value DataSettings
 
-step "The daemon's preferences on disk"
-"$build/tools/tavrix-plist" "$root/var/mobile/Library/Preferences/com.zandor.tavrixservices.plist"
+step "The same call again changes nothing: no notification, links untouched"
+"$ctl" watch --count 1 --timeout 3 > "$work/watch.out" 2>/dev/null &
+watcher=$!
+sleep 0.3
+before=$(stat -c %i "$home/Library/Tavrix.bundle" "$home/Library/Preferences/com.zandor.tavrix.plist")
+mark=$(log_mark)
+run "$ctl" set-id Demo-Carrier --bundle "$work/Default.bundle.tgz"
+wait "$watcher" && echo "unexpected notification: $(cat "$work/watch.out")" || echo "no notification"
+log_since "$mark" | grep -E 'Match Result|already exists'
+after=$(stat -c %i "$home/Library/Tavrix.bundle" "$home/Library/Preferences/com.zandor.tavrix.plist")
+[ "$before" = "$after" ] && echo "links untouched" || echo "links were replaced"
 
 step "A call with the wrong arguments is refused and the daemon keeps serving"
 run busctl --address="$DBUS_SYSTEM_BUS_ADDRESS" call com.zandor.tavrixservicesd \
     /com/zandor/tavrixservicesd com.zandor.TXManagerServerInterface SetTavrixID i 5
 run "$ctl" supported
-
-step "Waiting for the daemon to leave when idle (10 s launch hold + 5 s grace)"
-for _ in $(seq 40); do
-    busctl --address="$DBUS_SYSTEM_BUS_ADDRESS" status com.zandor.tavrixservicesd >/dev/null 2>&1 || break
-    sleep 0.5
-done
-busctl --address="$DBUS_SYSTEM_BUS_ADDRESS" list --acquired | grep -q com.zandor.tavrixservicesd \
-    && echo "still running" || echo "the daemon has exited"
-run "$ctl" supported
-
-step "The daemon's log"
-grep -v '^dbus-daemon\[' "$work/daemon.log" | sed 's/^/   /'

@@ -1,0 +1,313 @@
+// The daemon's main job as clients see it: a behavior ID set with a packed bundle ends with the
+// right carrier file linked into the mobile home and one notification, and nothing changes when
+// nothing changed.
+#include <signal.h>
+#include <sys/stat.h>
+
+#include <fstream>
+
+#include "BusFixture.h"
+#include "CommandRunner.h"
+#include "plist/PropertyListFormat.h"
+
+namespace tavrix::integration {
+namespace {
+
+namespace fs = std::filesystem;
+
+constexpr const char* kChanged = "kTVXBehaviorBundleChangedNotification";
+constexpr const char* kSystemBundle = "/System/Library/TavrixBundles/Tablet/Default.bundle";
+constexpr const char* kUserBundle = "/var/mobile/Library/TavrixBundles/Default.bundle";
+constexpr const char* kOverlayDirectory = "/var/mobile/Library/TavrixBundles/Overlay";
+constexpr const char* kBundleLink = "/var/mobile/Library/Tavrix.bundle";
+constexpr const char* kPreferencesLink = "/var/mobile/Library/Preferences/com.zandor.tavrix.plist";
+
+std::string matchResult(const char* changeType) {
+    return std::string("Carrier Bundle Match Result: ") + changeType;
+}
+
+// A base carrier file whose overlay section lists "abc" and "Listed-Too".
+plist::Dictionary baseCarrierFile(const std::string& name) {
+    plist::Dictionary economy = {
+        {"SupportedBehaviorIDs", plist::Array{"ABC", "Listed-Too"}},
+        {"OverrideConfiguration",
+         plist::Dictionary{
+             {"CarrierName", name + " Economy"},
+             {"Data", plist::Dictionary{{"MaxRate", 1}, {"_Exclude", plist::Array{"Boost"}}}}}},
+    };
+    return {
+        {"CarrierName", name},
+        {"Data", plist::Dictionary{{"MaxRate", 5}, {"Boost", true}}},
+        {"BehaviorOverrides", plist::Dictionary{{"Economy", economy}}},
+    };
+}
+
+class BundleFlowTest : public BusFixture {
+  protected:
+    BundleFlowTest() { busOptions.idleExitSeconds = 30; }
+
+    fs::path at(const char* absolutePath) { return device().path(absolutePath); }
+
+    // A bundle directory: Info.plist with the version, the base carrier file, and an
+    // "overrides_" file for the test device's hardware model when asked.
+    fs::path writeBundle(const fs::path& directory, const std::string& version,
+                         bool deviceOverlay = false) {
+        fs::create_directories(directory);
+        plist::Dictionary info = {{"QZBundleIdentifier", "com.zandor.tavrix.bundle.test"},
+                                  {"QZBundleVersion", version}};
+        EXPECT_TRUE(plist::writeFile((directory / "Info.plist").string(), plist::Value(info)));
+        EXPECT_TRUE(plist::writeFile((directory / "behavior.plist").string(),
+                                     plist::Value(baseCarrierFile("Bundle " + version))));
+        if (deviceOverlay) {
+            plist::Dictionary overlay = {{"Data", plist::Dictionary{{"MaxRate", 8}}}};
+            EXPECT_TRUE(plist::writeFile((directory / "overrides_T71AP_X1.plist").string(),
+                                         plist::Value(overlay)));
+        }
+        return directory;
+    }
+
+    // The bundle packed by bsdtar in the given format ("tgz", "tar.Z", "cpio.gz", "cpio.Z").
+    std::vector<std::uint8_t> packBundle(const std::string& version, const std::string& format,
+                                         bool deviceOverlay = false) {
+        fs::path source = device().base() / ("src-" + version + "-" + format);
+        fs::remove_all(source);
+        writeBundle(source, version, deviceOverlay);
+        fs::path archive = device().base() / ("bundle-" + version + "." + format);
+        std::vector<std::string> argv = {"/usr/bin/bsdtar", "-c"};
+        argv.push_back(format.ends_with(".Z") ? "-Z" : "-z");
+        if (format.starts_with("cpio")) {
+            argv.insert(argv.end(), {"--format", "cpio"});
+        }
+        argv.insert(argv.end(), {"-f", archive.string(), "-C", source.string(), "."});
+        CommandResult packed = runCommand(argv);
+        EXPECT_EQ(packed.status, 0) << packed.output;
+        return readBytes(archive);
+    }
+
+    static std::vector<std::uint8_t> readBytes(const fs::path& path) {
+        std::ifstream in(path, std::fstream::binary);
+        return {std::istreambuf_iterator<char>(in), {}};
+    }
+
+    std::string linkTarget(const char* link) {
+        std::error_code error;
+        fs::path target = fs::read_symlink(at(link), error);
+        return error ? std::string() : target.string();
+    }
+
+    std::optional<plist::Value> linkedCarrierFile() {
+        return plist::readFile(at(kPreferencesLink).string());
+    }
+
+    // The change type of the last bundle match in the log.
+    std::string lastMatchResult() const {
+        const std::string prefix = "Carrier Bundle Match Result: ";
+        auto lines = daemonLogLines();
+        for (auto line = lines.rbegin(); line != lines.rend(); ++line) {
+            if (line->starts_with(prefix)) {
+                return line->substr(prefix.size());
+            }
+        }
+        return {};
+    }
+
+    struct stat linkStat(const char* link) {
+        struct stat info {};
+        EXPECT_EQ(::lstat(at(link).c_str(), &info), 0) << link;
+        return info;
+    }
+};
+
+// The main flow through tavrixctl: the first set installs, overlays, links and notifies once;
+// the same call again reports no change, posts nothing and leaves the links alone.
+TEST_F(BundleFlowTest, FirstSetLinksTheOverlaidCarrierFileAndRepeatingItChangesNothing) {
+    device().writeDaemonPreferences({{"EnableSupport", true}});
+    auto payload = packBundle("10", "tgz");
+    fs::path payloadFile = device().base() / "payload.tgz";
+    std::ofstream(payloadFile, std::fstream::binary)
+        .write(reinterpret_cast<const char*>(payload.data()),
+               static_cast<std::streamsize>(payload.size()));
+    const std::vector<std::string> setID = {
+        TAVRIX_CTL_PATH, "--address", busAddress(),        "set-id",
+        "AbC",           "--bundle",  payloadFile.string()};
+
+    CommandResult first = runCommand(setID);
+    ASSERT_EQ(first.status, 0) << first.output;
+    EXPECT_EQ(first.output, "yes\n");
+    EXPECT_TRUE(waitForLogLine(matchResult("kBundleChangeTypeUpdate")));
+    EXPECT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
+
+    const fs::path overlayFile = at(kOverlayDirectory) / "id+behavior+Default.bundle+abc+10.plist";
+    EXPECT_EQ(linkTarget(kBundleLink), at(kUserBundle).string());
+    EXPECT_EQ(linkTarget(kPreferencesLink), overlayFile.string());
+    auto linked = linkedCarrierFile();
+    ASSERT_TRUE(linked);
+    EXPECT_EQ(linked->find("BehaviorOverrides"), nullptr);
+    EXPECT_EQ(*linked->find("CarrierName"), plist::Value("Bundle 10 Economy"));
+    EXPECT_EQ(*linked->find("Data"), plist::Value(plist::Dictionary{{"MaxRate", 1}}));
+    // Clients read the linked carrier file as the behavior settings.
+    EXPECT_EQ(client().copyTavrixValue("CarrierName"),
+              std::optional<plist::Value>("Bundle 10 Economy"));
+
+    const struct stat bundleLinkBefore = linkStat(kBundleLink);
+    const struct stat preferencesLinkBefore = linkStat(kPreferencesLink);
+    CommandResult second = runCommand(setID);
+    ASSERT_EQ(second.status, 0) << second.output;
+    EXPECT_TRUE(waitForLogLine(matchResult("kBundleChangeTypeNoChange")));
+    EXPECT_TRUE(waitForLogLine("Overridden file " + overlayFile.string() +
+                               " already exists, not generating again"));
+    EXPECT_FALSE(watcher().waitForNotification(kChanged, 2, 1s));
+    EXPECT_EQ(linkStat(kBundleLink).st_ino, bundleLinkBefore.st_ino);
+    EXPECT_EQ(linkStat(kPreferencesLink).st_ino, preferencesLinkBefore.st_ino);
+}
+
+// Only the behavior bit differs between an unlisted ID (the base carrier file) and a listed one:
+// an override switch. Two listed IDs differ by the ID in the file name: an update.
+TEST_F(BundleFlowTest, BehaviorOverlayTransitionsSwitchOrUpdate) {
+    auto caller = client();
+    const fs::path overlays = at(kOverlayDirectory);
+    const std::string baseFile = (at(kUserBundle) / "behavior.plist").string();
+    struct Step {
+        const char* id;
+        const char* changeType;
+        std::string carrierFile;
+    };
+    const Step steps[] = {
+        {"not-listed", "kBundleChangeTypeUpdate", baseFile},
+        {"abc", "kBundleChangeTypeOverrideSwitch",
+         (overlays / "id+behavior+Default.bundle+abc+10.plist").string()},
+        {"listed-too", "kBundleChangeTypeUpdate",
+         (overlays / "id+behavior+Default.bundle+listed-too+10.plist").string()},
+        {"not-listed", "kBundleChangeTypeOverrideSwitch", baseFile},
+    };
+    auto payload = packBundle("10", "tgz");
+    bool first = true;
+    for (const Step& expected : steps) {
+        ASSERT_TRUE(caller.setTavrixID(expected.id, first ? std::optional(payload) : std::nullopt));
+        first = false;
+        EXPECT_EQ(linkTarget(kPreferencesLink), expected.carrierFile) << expected.id;
+        EXPECT_EQ(lastMatchResult(), expected.changeType) << expected.id;
+    }
+    EXPECT_TRUE(watcher().waitForNotification(kChanged, 4, 5s));
+}
+
+// The device overlay file for this hardware model is merged first and keeps the overlay
+// section; a listed ID then overlays it, and that file drops the section.
+TEST_F(BundleFlowTest, DeviceOverlayKeepsTheSectionAndBehaviorOverlayBuildsOnIt) {
+    auto caller = client();
+    const fs::path overlays = at(kOverlayDirectory);
+    ASSERT_TRUE(caller.setTavrixID("not-listed", packBundle("10", "tgz", /*deviceOverlay=*/true)));
+    EXPECT_EQ(linkTarget(kPreferencesLink),
+              (overlays / "device+behavior+Default.bundle+T71AP+10.plist").string());
+    auto deviceOverlaid = linkedCarrierFile();
+    ASSERT_TRUE(deviceOverlaid);
+    EXPECT_NE(deviceOverlaid->find("BehaviorOverrides"), nullptr);
+    EXPECT_EQ(*deviceOverlaid->find("Data"),
+              plist::Value(plist::Dictionary{{"MaxRate", 8}, {"Boost", true}}));
+
+    ASSERT_TRUE(caller.setTavrixID("abc", std::nullopt));
+    EXPECT_EQ(lastMatchResult(), "kBundleChangeTypeUpdate");
+    EXPECT_EQ(linkTarget(kPreferencesLink),
+              (overlays / "device+id+behavior+Default.bundle+abc+T71AP+10.plist").string());
+    auto both = linkedCarrierFile();
+    ASSERT_TRUE(both);
+    EXPECT_EQ(both->find("BehaviorOverrides"), nullptr);
+    EXPECT_EQ(*both->find("Data"), plist::Value(plist::Dictionary{{"MaxRate", 1}}));
+}
+
+// Versions compare as numbers: a user bundle "10" beats a system bundle "9", equal versions
+// choose the user bundle, a newer system bundle wins. Every payload format senders use unpacks.
+TEST_F(BundleFlowTest, NewerBundleWinsByNumericVersionInEveryPayloadFormat) {
+    const std::string foundUser = "Found bundle " + at(kUserBundle).string();
+    const std::string foundSystem = "Found bundle " + at(kSystemBundle).string();
+    writeBundle(at(kSystemBundle), "9");
+    auto caller = client();
+
+    int found = 0;
+    for (const char* format : {"cpio.Z", "tar.Z", "cpio.gz", "tgz"}) {
+        ASSERT_TRUE(caller.setTavrixID("other", packBundle("10", format)));
+        EXPECT_EQ(countLogLines(foundUser), ++found) << format;
+        EXPECT_TRUE(fs::exists(at(kUserBundle) / "behavior.plist")) << format;
+        EXPECT_EQ(linkTarget(kBundleLink), at(kUserBundle).string()) << format;
+    }
+
+    writeBundle(at(kSystemBundle), "10");
+    ASSERT_TRUE(caller.setTavrixID("other", packBundle("10", "tgz")));
+    EXPECT_EQ(countLogLines(foundUser), ++found);
+
+    writeBundle(at(kSystemBundle), "11");
+    ASSERT_TRUE(caller.setTavrixID("other", packBundle("9", "tgz")));
+    EXPECT_EQ(countLogLines(foundSystem), 1);
+    EXPECT_EQ(linkTarget(kBundleLink), at(kSystemBundle).string());
+    EXPECT_EQ(linkTarget(kPreferencesLink), (at(kSystemBundle) / "behavior.plist").string());
+}
+
+// Payloads that are no usable archive still get an answer; the daemon falls back to the system
+// bundle and keeps serving, and a good payload afterwards works.
+TEST_F(BundleFlowTest, BadPayloadsAreAnsweredAndTheDaemonKeepsServing) {
+    writeBundle(at(kSystemBundle), "9");
+    auto caller = client();
+    auto good = packBundle("10", "tgz");
+    std::vector<std::uint8_t> truncated(good.begin(), good.begin() + good.size() / 2);
+    std::vector<std::uint8_t> notAnArchive = {'n', 'o', 't', ' ', 'a', 'n', ' ', 'a', 'r', 'c'};
+    auto bzip2 = [&] {
+        fs::path archive = device().base() / "bundle.tbz";
+        EXPECT_EQ(runCommand({"/usr/bin/bsdtar", "-cjf", archive.string(), "-C",
+                              device().base().string(), "root/etc"})
+                      .status,
+                  0);
+        return readBytes(archive);
+    }();
+
+    for (const auto& payload : {std::vector<std::uint8_t>{}, truncated, notAnArchive, bzip2}) {
+        EXPECT_TRUE(caller.setTavrixID("abc", payload)) << payload.size();
+        EXPECT_EQ(linkTarget(kBundleLink), at(kSystemBundle).string()) << payload.size();
+        EXPECT_TRUE(linkedCarrierFile().has_value());
+    }
+    EXPECT_TRUE(caller.setTavrixID("abc", good));
+    EXPECT_EQ(linkTarget(kBundleLink), at(kUserBundle).string());
+}
+
+// A real directory where the bundle link belongs cannot be replaced: logged, answered, and the
+// daemon goes on; once it is gone the next call links.
+TEST_F(BundleFlowTest, DirectoryInPlaceOfTheBundleLinkIsReportedAndLeftAlone) {
+    fs::create_directories(at(kBundleLink) / "keep");
+    auto caller = client();
+    ASSERT_TRUE(caller.setTavrixID("abc", packBundle("10", "tgz")));
+    EXPECT_TRUE(waitForLogLine("Could not link bundle file!"));
+    EXPECT_TRUE(fs::is_directory(at(kBundleLink) / "keep"));
+    EXPECT_EQ(watcher().notificationCount(kChanged), 0);
+
+    fs::remove_all(at(kBundleLink));
+    ASSERT_TRUE(caller.setTavrixID("abc", std::nullopt));
+    EXPECT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
+    EXPECT_EQ(linkTarget(kBundleLink), at(kUserBundle).string());
+}
+
+// Every launch re-applies the stored ID: links lost while the daemon was away come back, and a
+// launch with the links in place changes nothing.
+TEST_F(BundleFlowTest, RestartRedoesTheBundleMatchFromTheStoredID) {
+    auto caller = client();
+    ASSERT_TRUE(caller.setTavrixID("abc", packBundle("10", "tgz")));
+    const std::string carrierFile = linkTarget(kPreferencesLink);
+    ASSERT_FALSE(carrierFile.empty());
+
+    for (bool removeLinks : {true, false}) {
+        auto pid = daemonPid();
+        ASSERT_TRUE(pid);
+        ASSERT_EQ(::kill(*pid, SIGTERM), 0);
+        ASSERT_EQ(waitForDaemonExit(*pid), std::optional<int>(0));
+        if (removeLinks) {
+            fs::remove(at(kBundleLink));
+            fs::remove(at(kPreferencesLink));
+        }
+        EXPECT_FALSE(caller.isTavrixBundleSupported());
+        EXPECT_EQ(linkTarget(kPreferencesLink), carrierFile);
+    }
+    EXPECT_EQ(countLogLines("Behavior ID abc is already sent, redoing bundle match"), 2);
+    EXPECT_EQ(countLogLines(matchResult("kBundleChangeTypeUpdate")), 2);
+    EXPECT_EQ(countLogLines(matchResult("kBundleChangeTypeNoChange")), 1);
+}
+
+}  // namespace
+}  // namespace tavrix::integration
