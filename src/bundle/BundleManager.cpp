@@ -1,25 +1,182 @@
-// Placeholder until the bundle manager lands.
 #include "bundle/BundleManager.h"
+
+#include <sys/stat.h>
+
+#include <cstdio>
+
+#include "bundle/BundleComparison.h"
+#include "bundle/BundleInfo.h"
+#include "bundle/BundleLinks.h"
+#include "bundle/BundleLocations.h"
 #include "bundle/OverlayContext.h"
+#include "bundle/OverrideGeneration.h"
+#include "bundle/VersionCompare.h"
+#include "payload/MobileUser.h"
+#include "platform/NotificationCenter.h"
+#include "platform/PreferencesStore.h"
+#include "util/Log.h"
 
 namespace tavrix {
+namespace {
 
-BundleManager::BundleManager() = default;
+constexpr const char* kBundleLinkFormat = "%s/Library/Tavrix.bundle";
+constexpr const char* kPreferencesLinkFormat = "%s/Library/Preferences/com.zandor.tavrix.plist";
+constexpr const char* kBehaviorPreferencesDomain = "com.zandor.tavrix";
+constexpr const char* kBundleChangedNotification = "kTVXBehaviorBundleChangedNotification";
+constexpr std::size_t kPathBufferSize = 1024;
+
+// The home directory formatted into format, cut at kPathBufferSize - 1 bytes; empty without a
+// home, so that no link is ever made relative to the working directory.
+std::string homeLinkPath(const char* home, const char* format) {
+    if (home == nullptr) {
+        return {};
+    }
+    char buffer[kPathBufferSize];
+    std::snprintf(buffer, sizeof buffer, format, home);
+    return buffer;
+}
+
+// The path a chosen bundle location converts to; nothing when it does not fit a path buffer.
+std::optional<std::string> fileSystemPathOf(const std::string& location) {
+    if (location.size() >= kPathBufferSize) {
+        return std::nullopt;
+    }
+    return location;
+}
+
+}  // namespace
+
+BundleManager::BundleManager() {
+    const char* home = payload::MobileUser::homeDirectory();
+    bundleLinkPath_ = homeLinkPath(home, kBundleLinkFormat);
+    preferencesLinkPath_ = homeLinkPath(home, kPreferencesLinkFormat);
+
+    // The link itself, not its target: a dangling link still describes the last linked state.
+    struct stat linkInfo {};
+    if (bundleLinkPath_.empty() || ::lstat(bundleLinkPath_.c_str(), &linkInfo) != 0) {
+        return;
+    }
+    currentBundle_.initFromLinks(bundleLinkPath_, preferencesLinkPath_);
+    currentBundle_.carrierFilePath = readLinkTarget(preferencesLinkPath_);
+    currentBundle_.overlayType |=
+        overlayTypeOfCarrierFileName(baseNameOfPath(currentBundle_.carrierFilePath));
+    logCFormat("Is carrier bundle's plist file overridden: %s\n",
+               overlayTypeName(currentBundle_.overlayType));
+    logCFormat("Carrier bundle state on BundleManager initialization\n");
+}
 
 BundleManager& BundleManager::sharedInstance() {
+    initializeBundleLocations();
+    // Never destroyed: the update queue may still use it while the process exits.
     static BundleManager* manager = new BundleManager();
     return *manager;
 }
 
-BundleChangeType BundleManager::resetBehaviorBundle(const std::optional<std::string>&) {
-    return kBundleChangeTypeUnknown;
+bool BundleManager::findBundle(CarrierBundle& out) const {
+    const std::string& systemLocation = systemBundleLocation();
+    const std::string& userLocation = userBundleLocation();
+
+    std::optional<plist::Value> systemVersion;
+    if (systemLocation.empty()) {
+        logCFormat("Failed to create QZ URL for system bundle directory\n");
+    } else {
+        systemVersion = copyBundleVersionAtURL(systemLocation);
+    }
+
+    const std::string* chosen = nullptr;
+    if (userLocation.empty()) {
+        logCFormat("Failed to create QZ URL for user bundle directory\n");
+        if (systemVersion) {
+            chosen = &systemLocation;
+        }
+    } else {
+        std::optional<plist::Value> userVersion = copyBundleVersionAtURL(userLocation);
+        if (systemVersion && userVersion) {
+            // The user bundle wins unless the system one is strictly newer.
+            bool systemNewer = compareVersionStrings(bundleInfoValueText(systemVersion),
+                                                     bundleInfoValueText(userVersion)) == 1;
+            chosen = systemNewer ? &systemLocation : &userLocation;
+        } else if (systemVersion) {
+            chosen = &systemLocation;
+        } else if (userVersion) {
+            chosen = &userLocation;
+        }
+    }
+
+    if (chosen == nullptr) {
+        logCFormat("Could not find either of the bundle locations\n");
+        return false;
+    }
+    std::optional<std::string> path = fileSystemPathOf(*chosen);
+    if (!path) {
+        return false;
+    }
+    logCFormat("Found bundle %s\n", path->c_str());
+    out.resetWithPath(*path);
+    return true;
 }
 
-}  // namespace tavrix
+std::optional<std::string> BundleManager::copyBundleVersion() const {
+    if (currentBundle_.bundleVersion.empty()) {
+        return std::nullopt;
+    }
+    return currentBundle_.bundleVersion;
+}
 
-namespace tavrix {
+BundleChangeType BundleManager::resetBehaviorBundle(const std::optional<std::string>& behaviorID) {
+    behaviorID_ = behaviorID;
+    return runBundleReset();
+}
+
+BundleChangeType BundleManager::runBundleReset() {
+    BundleChangeType result = kBundleChangeTypeNoChange;
+    if (!behaviorID_) {
+        logCFormat("There is no tavrix ID provided\n");
+        logCFormat("Carrier Bundle Match Result: %s\n", changeTypeName(result));
+        return result;
+    }
+    logCFormat("\n");
+    logCFormat(
+        "=========================== Potentially Resetting Behavior Bundle "
+        "===========================\n");
+    logCFormat("\n");
+    logCFormat("Behavior ID provided: %s", behaviorID_->c_str());
+
+    CarrierBundle matched;
+    OverrideResult deviceResult = makeDeviceOverlayDecision(matched, behaviorID_);
+    logCFormat("Device overlay decision: %s\n", overrideResultName(deviceResult));
+    logCFormat("Is the matching bundle found: %s\n", matched.bundleName().empty() ? "No" : "Yes");
+
+    OverrideResult behaviorResult = applyMultimodeOverlay(matched, behaviorID_);
+    logCFormat("Device overlay decision: %s\n", overrideResultName(behaviorResult));
+    logCFormat("Dump state for the bundle after multimode overlay\n");
+
+    result = compareBundles(currentBundle_, matched);
+    if (result != kBundleChangeTypeNoChange) {
+        logCFormat("Bundle Compare decision %s\n", changeTypeName(result));
+        currentBundle_ = matched;
+        if (!establishBundleLinks(currentBundle_, bundleLinkPath_, preferencesLinkPath_)) {
+            logCFormat("Could not link bundle file!\n");
+            return kBundleChangeTypeNoChange;
+        }
+        platform::PreferencesStore::shared().synchronize(kBehaviorPreferencesDomain,
+                                                         payload::MobileUser::name());
+        platform::postNotification(kBundleChangedNotification);
+    }
+    logCFormat("Carrier Bundle Match Result: %s\n", changeTypeName(result));
+    return result;
+}
+
 void findBaseBundle(OverlayContext& context, OverlayType overlayType) {
     context = OverlayContext{};
     context.overlayType = overlayType;
+    if (!BundleManager::sharedInstance().findBundle(context.bundle)) {
+        logCFormat("Failed to find a bundle\n");
+        return;
+    }
+    logCFormat("Found the base bundle successfully with name %s\n",
+               context.bundle.bundleName().c_str());
+    context.bundle.carrierFilePath = context.bundle.bundlePath + "/" + kBaseCarrierFileName;
 }
+
 }  // namespace tavrix

@@ -1,0 +1,106 @@
+#include "bundle/BundleLinks.h"
+
+#include <libgen.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <memory>
+
+#include "bundle/BundleInfo.h"
+#include "util/Log.h"
+
+namespace tavrix {
+namespace {
+
+constexpr std::size_t kPathBufferSize = 1024;
+
+struct FreeDeleter {
+    void operator()(char* pointer) const { std::free(pointer); }
+};
+
+// Copies path into buffer, cut at kPathBufferSize - 1 bytes, for the POSIX calls that may write
+// into their argument.
+void copyCut(const std::string& path, char (&buffer)[kPathBufferSize]) {
+    std::size_t length = std::min(path.size(), kPathBufferSize - 1);
+    std::memcpy(buffer, path.data(), length);
+    buffer[length] = '\0';
+}
+
+bool linkPathTo(const std::string& linkPath, const std::string& target) {
+    // Whatever is there goes first; a non-empty directory stays and makes symlink fail.
+    std::remove(linkPath.c_str());
+    if (::symlink(target.c_str(), linkPath.c_str()) == -1) {
+        logCFormat("Failed to establish link from %s to %s\n", linkPath.c_str(), target.c_str());
+        return false;
+    }
+    return true;
+}
+
+bool linkBundle(CarrierBundle& bundle) {
+    logCFormat("Establishing bundle %s. Symlink points to %s\n", bundle.bundleLinkPath.c_str(),
+               bundle.bundlePath.c_str());
+    if (!linkPathTo(bundle.bundleLinkPath, bundle.bundlePath)) {
+        return false;
+    }
+    if (readLinkTarget(bundle.bundleLinkPath) != bundle.bundlePath) {
+        logCFormat("Problem linking the bundle, %s does not link to %s, instead it links to %s\n",
+                   bundle.bundleLinkPath.c_str(), bundle.bundlePath.c_str(),
+                   readLinkTarget(bundle.bundleLinkPath).c_str());
+        return false;
+    }
+    logCFormat("Establishing pref %s. Symlink points to %s\n", bundle.preferencesLinkPath.c_str(),
+               bundle.carrierFilePath.c_str());
+    if (!linkPathTo(bundle.preferencesLinkPath, bundle.carrierFilePath)) {
+        return false;
+    }
+    bool linked = readLinkTarget(bundle.preferencesLinkPath) == bundle.carrierFilePath;
+    // The version is re-read only for a bundle that is fully linked.
+    bundle.bundleVersion.clear();
+    if (linked) {
+        bundle.bundleVersion = bundleInfoValueText(copyBundleVersionAtPath(bundle.bundlePath));
+    }
+    return linked;
+}
+
+}  // namespace
+
+bool establishBundleLinks(CarrierBundle& bundle, const std::string& bundleLink,
+                          const std::string& preferencesLink) {
+    bundle.bundleLinkPath = bundleLink;
+    bundle.preferencesLinkPath = preferencesLink;
+    bool linked = linkBundle(bundle);
+    logCFormat("Dump state of the bundle being linked\n");
+    return linked;
+}
+
+std::string baseNameOfPath(const std::string& path) {
+    char buffer[kPathBufferSize];
+    copyCut(path, buffer);
+    return basename(buffer);
+}
+
+std::string dirNameOfPath(const std::string& path) {
+    char buffer[kPathBufferSize];
+    copyCut(path, buffer);
+    return dirname(buffer);
+}
+
+std::string realPathOf(const std::string& path) {
+    // Allocated by realpath itself: a fixed buffer smaller than PATH_MAX is not safe here.
+    std::unique_ptr<char, FreeDeleter> resolved(::realpath(path.c_str(), nullptr));
+    return resolved ? std::string(resolved.get()) : std::string();
+}
+
+std::string readLinkTarget(const std::string& path) {
+    char buffer[kPathBufferSize];
+    ssize_t length = ::readlink(path.c_str(), buffer, kPathBufferSize - 1);
+    if (length < 0) {
+        return {};
+    }
+    return std::string(buffer, static_cast<std::size_t>(length));
+}
+
+}  // namespace tavrix

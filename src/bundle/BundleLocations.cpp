@@ -1,0 +1,57 @@
+#include "bundle/BundleLocations.h"
+
+#include "payload/MobileUser.h"
+#include "platform/PlatformRoot.h"
+#include "util/Log.h"
+#include "util/TXUtility.h"
+
+namespace tavrix {
+namespace {
+
+struct BundleLocations {
+    std::string system;
+    std::string user;
+};
+
+BundleLocations computeLocations() {
+    const std::optional<std::string>& deviceClass = TXUtility::currentProductCategory();
+    BundleLocations computed;
+    computed.system = platform::resolvePath(std::string(kSystemBundlesDirectory) +
+                                            deviceClass.value_or("") + "/" + kDefaultBundleName);
+    // Without a known home there is no user bundle; an empty location keeps every install and
+    // removal away from paths outside the device root.
+    if (const char* home = payload::MobileUser::homeDirectory()) {
+        computed.user = std::string(home) + kUserBundlesDirectory + kDefaultBundleName;
+    }
+    return computed;
+}
+
+// Computed and logged by the first caller from any thread; fixed for the process's life.
+const BundleLocations& locations() {
+    static const BundleLocations instance = [] {
+        logCFormat("Initializing Carrier Bundle Locations\n");
+        BundleLocations computed = computeLocations();
+        logCFormat("Using %s and %s for respective locations\n", computed.system.c_str(),
+                   computed.user.c_str());
+        return computed;
+    }();
+    return instance;
+}
+
+}  // namespace
+
+void initializeBundleLocations() {
+    locations();
+}
+
+const std::string& systemBundleLocation() {
+    initializeBundleLocations();
+    return locations().system;
+}
+
+const std::string& userBundleLocation() {
+    initializeBundleLocations();
+    return locations().user;
+}
+
+}  // namespace tavrix

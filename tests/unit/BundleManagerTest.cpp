@@ -1,0 +1,405 @@
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <algorithm>
+#include <chrono>
+#include <cstdlib>
+#include <filesystem>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "PrivateBusDaemon.h"
+#include "TestSupport.h"
+#include "UnitTestRoot.h"
+#include "bundle/BundleLinks.h"
+#include "bundle/BundleLocations.h"
+#include "bundle/BundleManager.h"
+#include "client/TavrixClient.h"
+#include "platform/NotificationCenter.h"
+#include "platform/PlatformRoot.h"
+#include "platform/PreferencesStore.h"
+#include "platform/SystemLog.h"
+#include "plist/PropertyListFormat.h"
+
+namespace tavrix {
+namespace {
+
+namespace fs = std::filesystem;
+using client::TavrixClient;
+using plist::Value;
+using ::testing::ElementsAre;
+using ::testing::StartsWith;
+
+constexpr const char* kResetBanner =
+    "=========================== Potentially Resetting Behavior Bundle "
+    "===========================\n";
+
+// A device in the test's own root: a device class, the mobile user's home, the two bundle
+// locations and the two links.
+class BundleDevice : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        // Posting must never reach a bus outside the test.
+        ::setenv("DBUS_SYSTEM_BUS_ADDRESS", ("unix:path=" + root() + "/no-bus").c_str(), 1);
+        ::unsetenv("DBUS_STARTER_ADDRESS");
+    }
+
+    static std::string root() { return test::unitTestRoot().string(); }
+    static std::string home() { return root() + "/var/mobile"; }
+    static std::string systemBundle() {
+        return platform::resolvePath("/System/Library/TavrixBundles/Tablet/Default.bundle");
+    }
+    static std::string userBundle() { return home() + "/Library/TavrixBundles/Default.bundle"; }
+    static std::string bundleLink() { return home() + "/Library/Tavrix.bundle"; }
+    static std::string preferencesLink() {
+        return home() + "/Library/Preferences/com.zandor.tavrix.plist";
+    }
+
+    static void writeDeviceTable() {
+        std::string path = root() + "/etc/tavrix/DeviceInfo.plist";
+        fs::create_directories(fs::path(path).parent_path());
+        ASSERT_TRUE(plist::writeFile(
+            path, Value(plist::Dictionary{{"DeviceClass", Value("Tablet")},
+                                          {"HWModelStr", Value("T12AP")},
+                                          {"contains-cellular-radio", Value(false)}})));
+        fs::create_directories(home() + "/Library/Preferences");
+    }
+
+    // A bundle directory with a base carrier file; the version is left out when not given.
+    static void writeBundle(const std::string& path, const std::optional<Value>& version,
+                            plist::Format format = plist::Format::Xml) {
+        plist::Dictionary info{{"QZBundleIdentifier", Value("com.zandor.default")}};
+        if (version) {
+            info.emplace("QZBundleVersion", *version);
+        }
+        fs::create_directories(path);
+        ASSERT_TRUE(plist::writeFile(path + "/Info.plist", Value(info), format));
+        ASSERT_TRUE(plist::writeFile(path + "/behavior.plist",
+                                     Value(plist::Dictionary{{"Source", Value(path)}})));
+    }
+
+    std::vector<std::string> lines() const { return sink_.messages(); }
+    bool logged(const std::string& line) const { return sink_.contains(line); }
+
+    platform::CapturingLogSink sink_;
+    platform::ScopedLogSink scope_{sink_};
+};
+
+struct LinkState {
+    ino_t inode = 0;
+    timespec modified{};
+};
+
+LinkState linkState(const std::string& path) {
+    struct stat info {};
+    EXPECT_EQ(::lstat(path.c_str(), &info), 0) << path;
+    return {info.st_ino, info.st_mtim};
+}
+
+// --- Locations and the choice of bundle ---
+
+using BundleLocationsTest = BundleDevice;
+
+TEST_F(BundleLocationsTest, ComeFromTheDeviceClassAndTheHomeOnce) {
+    writeDeviceTable();
+    EXPECT_EQ(systemBundleLocation(), systemBundle());
+    EXPECT_EQ(userBundleLocation(), userBundle());
+    initializeBundleLocations();
+    EXPECT_THAT(lines(), ElementsAre("Initializing Carrier Bundle Locations\n",
+                                     "Using " + systemBundle() + " and " + userBundle() +
+                                         " for respective locations\n"));
+}
+
+TEST_F(BundleLocationsTest, FindBundleTakesTheNewerAndTheUserOneOnATie) {
+    writeDeviceTable();
+    BundleManager& manager = BundleManager::sharedInstance();
+    CarrierBundle found;
+
+    // Numeric, not textual: 10 is newer than 9.
+    writeBundle(systemBundle(), Value("9"));
+    writeBundle(userBundle(), Value("10"), plist::Format::Binary);
+    sink_.clear();
+    ASSERT_TRUE(manager.findBundle(found));
+    EXPECT_EQ(found.bundlePath, userBundle());
+    EXPECT_EQ(found.bundleRealPath, fs::canonical(userBundle()).string());
+    EXPECT_EQ(found.bundleVersion, "10");
+    EXPECT_EQ(found.carrierFilePath, "");
+    EXPECT_THAT(lines(),
+                ElementsAre("Found bundle " + userBundle() + "\n", "Resetting bundle object\n"));
+
+    writeBundle(systemBundle(), Value("1.10"));
+    writeBundle(userBundle(), Value("1.9"));
+    ASSERT_TRUE(manager.findBundle(found));
+    EXPECT_EQ(found.bundlePath, systemBundle());
+
+    writeBundle(systemBundle(), Value("2.0"));
+    writeBundle(userBundle(), Value("2.0"));
+    ASSERT_TRUE(manager.findBundle(found));
+    EXPECT_EQ(found.bundlePath, userBundle());
+
+    // A version that is no string still counts, by its text.
+    writeBundle(userBundle(), Value(3));
+    ASSERT_TRUE(manager.findBundle(found));
+    EXPECT_EQ(found.bundlePath, userBundle());
+    EXPECT_EQ(found.bundleVersion, "3");
+
+    // A bundle without a readable version is no candidate.
+    writeBundle(userBundle(), std::nullopt);
+    ASSERT_TRUE(manager.findBundle(found));
+    EXPECT_EQ(found.bundlePath, systemBundle());
+    test::writeText(userBundle() + "/Info.plist", "<plist><dict><key>QZBundle");
+    ASSERT_TRUE(manager.findBundle(found));
+    EXPECT_EQ(found.bundlePath, systemBundle());
+
+    fs::remove_all(systemBundle());
+    sink_.clear();
+    EXPECT_FALSE(manager.findBundle(found));
+    EXPECT_THAT(lines(), ElementsAre("Could not find either of the bundle locations\n"));
+}
+
+TEST_F(BundleLocationsTest, WithoutAHomeNothingIsLinkedOrInstalledAnywhere) {
+    // No "mobile" user and no device table: the user location and both link paths are empty.
+    test::writeText(root() + "/etc/passwd", "root:x:0:0:root:/root:/bin/sh\n");
+    const std::string system =
+        platform::resolvePath("/System/Library/TavrixBundles//Default.bundle");
+    writeBundle(system, Value("5"));
+
+    BundleManager& manager = BundleManager::sharedInstance();
+    EXPECT_EQ(userBundleLocation(), "");
+    EXPECT_EQ(manager.bundleLinkPath(), "");
+    EXPECT_EQ(manager.preferencesLinkPath(), "");
+
+    CarrierBundle found;
+    sink_.clear();
+    ASSERT_TRUE(manager.findBundle(found));
+    EXPECT_EQ(found.bundlePath, system);
+    EXPECT_EQ(lines().front(), "Failed to create QZ URL for user bundle directory\n");
+
+    const fs::path workingDirectory = fs::current_path();
+    EXPECT_EQ(manager.resetBehaviorBundle("ab12"), kBundleChangeTypeNoChange);
+    EXPECT_TRUE(logged("Failed to establish link from  to " + system + "\n"));
+    EXPECT_EQ(lines().back(), "Could not link bundle file!\n");
+    EXPECT_FALSE(fs::exists(fs::symlink_status(workingDirectory / "Library")));
+    EXPECT_FALSE(fs::exists(fs::symlink_status(workingDirectory / "(null)")));
+}
+
+// --- Links ---
+
+using BundleLinksTest = BundleDevice;
+
+TEST_F(BundleLinksTest, ReplacesBothLinksAndRereadsTheVersion) {
+    writeBundle(userBundle(), Value("10"));
+    writeBundle(systemBundle(), Value("9"));
+    fs::create_directories(home() + "/Library/Preferences");
+
+    for (const std::string& path : {systemBundle(), userBundle()}) {
+        SCOPED_TRACE(path);
+        CarrierBundle bundle;
+        bundle.bundlePath = path;
+        bundle.carrierFilePath = path + "/behavior.plist";
+        bundle.bundleVersion = "stale";
+        sink_.clear();
+        ASSERT_TRUE(establishBundleLinks(bundle, bundleLink(), preferencesLink()));
+        EXPECT_EQ(readLinkTarget(bundleLink()), path);
+        EXPECT_EQ(readLinkTarget(preferencesLink()), path + "/behavior.plist");
+        EXPECT_EQ(bundle.bundleLinkPath, bundleLink());
+        EXPECT_EQ(bundle.preferencesLinkPath, preferencesLink());
+        EXPECT_EQ(bundle.bundleVersion, path == userBundle() ? "10" : "9");
+        EXPECT_THAT(lines(), ElementsAre("Establishing bundle " + bundleLink() +
+                                             ". Symlink points to " + path + "\n",
+                                         "Establishing pref " + preferencesLink() +
+                                             ". Symlink points to " + path + "/behavior.plist\n",
+                                         "Dump state of the bundle being linked\n"));
+    }
+}
+
+TEST_F(BundleLinksTest, ANonEmptyDirectoryInTheWayIsKept) {
+    writeBundle(userBundle(), Value("10"));
+    test::writeText(bundleLink() + "/keep.txt", "kept");
+    CarrierBundle bundle;
+    bundle.bundlePath = userBundle();
+    bundle.carrierFilePath = userBundle() + "/behavior.plist";
+
+    EXPECT_FALSE(establishBundleLinks(bundle, bundleLink(), preferencesLink()));
+    EXPECT_THAT(lines(), ElementsAre("Establishing bundle " + bundleLink() +
+                                         ". Symlink points to " + userBundle() + "\n",
+                                     "Failed to establish link from " + bundleLink() + " to " +
+                                         userBundle() + "\n",
+                                     "Dump state of the bundle being linked\n"));
+    EXPECT_EQ(test::readText(bundleLink() + "/keep.txt"), "kept");
+    EXPECT_FALSE(fs::exists(fs::symlink_status(preferencesLink())));
+}
+
+TEST_F(BundleLinksTest, LinkTextsThatDoNotReadBackFail) {
+    // Link texts are read back at most 1023 bytes long, so a longer target never verifies.
+    writeBundle(userBundle(), Value("10"));
+    fs::create_directories(home() + "/Library/Preferences");
+    const std::string longTarget = "/" + std::string(1100, 'x');
+
+    CarrierBundle bundle;
+    bundle.bundlePath = longTarget;
+    bundle.carrierFilePath = userBundle() + "/behavior.plist";
+    EXPECT_FALSE(establishBundleLinks(bundle, bundleLink(), preferencesLink()));
+    EXPECT_TRUE(logged("Problem linking the bundle, " + bundleLink() + " does not link to " +
+                       longTarget + ", instead it links to " + longTarget.substr(0, 1023) + "\n"));
+    EXPECT_EQ(lines().back(), "Dump state of the bundle being linked\n");
+
+    // A preferences link that does not verify fails without a message of its own and leaves the
+    // version empty; the new bundle link stays.
+    bundle.bundlePath = userBundle();
+    bundle.carrierFilePath = longTarget;
+    bundle.bundleVersion = "stale";
+    sink_.clear();
+    EXPECT_FALSE(establishBundleLinks(bundle, bundleLink(), preferencesLink()));
+    EXPECT_EQ(bundle.bundleVersion, "");
+    EXPECT_EQ(readLinkTarget(bundleLink()), userBundle());
+    EXPECT_EQ(lines().size(), 3u);
+    EXPECT_EQ(lines().back(), "Dump state of the bundle being linked\n");
+}
+
+// --- Start-up and the reset flow ---
+
+using BundleManagerStartUp = BundleDevice;
+
+TEST_F(BundleManagerStartUp, ReadsDanglingLinksAsTheyAre) {
+    writeDeviceTable();
+    const std::string carrierFile =
+        userBundle() + "/Overlay/device+id+behavior+Default.bundle+T12AP+ab12+1.plist";
+    fs::create_directories(home() + "/Library/Preferences");
+    fs::create_symlink(home() + "/gone.bundle", bundleLink());
+    fs::create_symlink(carrierFile, preferencesLink());
+
+    BundleManager& manager = BundleManager::sharedInstance();
+    const CarrierBundle& current = manager.currentBundle();
+    EXPECT_EQ(current.bundlePath, home() + "/gone.bundle");
+    EXPECT_EQ(current.bundleRealPath, "");
+    EXPECT_EQ(current.bundleVersion, "");
+    EXPECT_EQ(current.bundleLinkPath, bundleLink());
+    EXPECT_EQ(current.preferencesLinkPath, preferencesLink());
+    EXPECT_EQ(current.carrierFilePath, carrierFile);
+    EXPECT_EQ(current.overlayType, kDeviceBehaviorOverlay);
+    EXPECT_EQ(manager.copyBundleVersion(), std::nullopt);
+    EXPECT_THAT(lines(),
+                ElementsAre("Initializing Carrier Bundle Locations\n", StartsWith("Using "),
+                            "Is carrier bundle's plist file overridden: kDeviceBehaviorOverlay\n",
+                            "Carrier bundle state on BundleManager initialization\n"));
+}
+
+TEST_F(BundleManagerStartUp, LinksInPlaceNeedNoRelinkForTheSameID) {
+    writeDeviceTable();
+    writeBundle(userBundle(), Value("10"));
+    CarrierBundle linked;
+    linked.bundlePath = userBundle();
+    linked.carrierFilePath = userBundle() + "/behavior.plist";
+    ASSERT_TRUE(establishBundleLinks(linked, bundleLink(), preferencesLink()));
+    const LinkState before = linkState(bundleLink());
+
+    BundleManager& manager = BundleManager::sharedInstance();
+    EXPECT_EQ(manager.currentBundle().bundleRealPath, fs::canonical(userBundle()).string());
+    EXPECT_EQ(manager.copyBundleVersion(), "10");
+    EXPECT_TRUE(logged("Is carrier bundle's plist file overridden: kNoOverlay\n"));
+
+    EXPECT_EQ(manager.resetBehaviorBundle("ab12"), kBundleChangeTypeNoChange);
+    EXPECT_FALSE(logged("Bundle Compare decision kBundleChangeTypeUpdate\n"));
+    EXPECT_EQ(linkState(bundleLink()).inode, before.inode);
+}
+
+using BundleReset = BundleDevice;
+
+TEST_F(BundleReset, WithoutAnIDNothingRuns) {
+    BundleManager& manager = BundleManager::sharedInstance();
+    sink_.clear();
+    EXPECT_EQ(manager.resetBehaviorBundle(std::nullopt), kBundleChangeTypeNoChange);
+    EXPECT_THAT(lines(), ElementsAre("There is no tavrix ID provided\n",
+                                     "Carrier Bundle Match Result: kBundleChangeTypeNoChange\n"));
+    EXPECT_FALSE(fs::exists(fs::symlink_status(bundleLink())));
+}
+
+// Expects the given lines to appear in this order, others in between.
+void expectInOrder(const std::vector<std::string>& lines,
+                   const std::vector<std::string>& expected) {
+    auto position = lines.begin();
+    for (const std::string& line : expected) {
+        position = std::find(position, lines.end(), line);
+        ASSERT_NE(position, lines.end()) << "missing in order: " << line;
+        ++position;
+    }
+}
+
+TEST_F(BundleReset, LinksOnceAndTellsEveryoneOnce) {
+    using namespace std::chrono_literals;
+    writeDeviceTable();
+    writeBundle(systemBundle(), Value("9"));
+    writeBundle(userBundle(), Value("10"));
+
+    test::PrivateBusDaemon bus;
+    ::setenv("DBUS_STARTER_ADDRESS", bus.address().c_str(), 1);
+    TavrixClient listener = TavrixClient::connectToAddress(bus.address());
+    std::vector<std::string> posted;
+    auto subscription =
+        listener.subscribe([&](const std::string& name) { posted.push_back(name); });
+
+    BundleManager& manager = BundleManager::sharedInstance();
+    sink_.clear();
+    EXPECT_EQ(manager.resetBehaviorBundle("ab12"), kBundleChangeTypeUpdate);
+    EXPECT_EQ(readLinkTarget(bundleLink()), userBundle());
+    EXPECT_EQ(readLinkTarget(preferencesLink()), userBundle() + "/behavior.plist");
+    EXPECT_EQ(manager.currentBundle().bundlePath, userBundle());
+    EXPECT_EQ(manager.copyBundleVersion(), "10");
+    const std::vector<std::string> firstRun = lines();
+    expectInOrder(firstRun, {"\n", kResetBanner, "\n", "Behavior ID provided: ab12",
+                             "Is the matching bundle found: Yes\n",
+                             "Dump state for the bundle after multimode overlay\n",
+                             "Bundle Compare decision kBundleChangeTypeUpdate\n",
+                             "Dump state of the bundle being linked\n",
+                             "Carrier Bundle Match Result: kBundleChangeTypeUpdate\n"});
+    EXPECT_EQ(std::count_if(firstRun.begin(), firstRun.end(),
+                            [](const std::string& line) {
+                                return line.starts_with("Device overlay decision: ");
+                            }),
+              2);
+    // The behavior settings are now the carrier file's, read through the preferences link.
+    EXPECT_EQ(
+        platform::PreferencesStore::shared().copyValue("Source", "com.zandor.tavrix", "mobile"),
+        Value(userBundle()));
+
+    const LinkState bundleBefore = linkState(bundleLink());
+    const LinkState preferencesBefore = linkState(preferencesLink());
+    sink_.clear();
+    EXPECT_EQ(manager.resetBehaviorBundle("ab12"), kBundleChangeTypeNoChange);
+    EXPECT_EQ(lines().back(), "Carrier Bundle Match Result: kBundleChangeTypeNoChange\n");
+    EXPECT_FALSE(logged("Bundle Compare decision kBundleChangeTypeNoChange\n"));
+    for (const auto& [path, before] :
+         {std::pair{bundleLink(), bundleBefore}, std::pair{preferencesLink(), preferencesBefore}}) {
+        const LinkState after = linkState(path);
+        EXPECT_EQ(after.inode, before.inode) << path;
+        EXPECT_EQ(after.modified.tv_sec, before.modified.tv_sec) << path;
+        EXPECT_EQ(after.modified.tv_nsec, before.modified.tv_nsec) << path;
+    }
+
+    // A marker posted after both runs: once it arrives, every earlier post has arrived too.
+    ASSERT_TRUE(platform::postNotification("marker"));
+    ASSERT_TRUE(
+        listener.runUntil([&] { return !posted.empty() && posted.back() == "marker"; }, 10s));
+    EXPECT_THAT(posted, ElementsAre("kTVXBehaviorBundleChangedNotification", "marker"));
+}
+
+TEST_F(BundleReset, AFailedLinkAnswersNoChangeAndStopsThere) {
+    writeDeviceTable();
+    writeBundle(userBundle(), Value("10"));
+    test::writeText(bundleLink() + "/keep.txt", "kept");
+
+    BundleManager& manager = BundleManager::sharedInstance();
+    sink_.clear();
+    EXPECT_EQ(manager.resetBehaviorBundle("ab12"), kBundleChangeTypeNoChange);
+    EXPECT_THAT(lines(), ::testing::Contains("Bundle Compare decision kBundleChangeTypeUpdate\n"));
+    EXPECT_EQ(lines().back(), "Could not link bundle file!\n");
+    // The matched record is kept even so, and the next attempt compares against it.
+    EXPECT_EQ(manager.currentBundle().bundlePath, userBundle());
+    EXPECT_EQ(test::readText(bundleLink() + "/keep.txt"), "kept");
+}
+
+}  // namespace
+}  // namespace tavrix
