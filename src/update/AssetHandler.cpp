@@ -1,10 +1,207 @@
 #include "update/AssetHandler.h"
 
-namespace tavrix {
+#include <algorithm>
+#include <string>
 
-// No asset catalog is configured in this build of the daemon, so there is never an update.
+#include "bundle/BundleLocations.h"
+#include "bundle/BundleManager.h"
+#include "bundle/VersionCompare.h"
+#include "daemon/BehaviorPreferences.h"
+#include "payload/FileSystemHelper.h"
+#include "update/UpdateCheckScheduler.h"
+#include "util/Log.h"
+#include "util/TXUtility.h"
+
+namespace tavrix {
+namespace {
+
+// Attribute values are compared as text; the catalog lists versions as strings.
+std::string versionText(const plist::Value& value) {
+    const std::string* text = value.asString();
+    return text != nullptr ? *text : value.description();
+}
+
+std::optional<plist::Value> optionalText(const std::optional<std::string>& text) {
+    return text ? std::optional<plist::Value>(*text) : std::nullopt;
+}
+
+bool listsProductType(const plist::Value& supported, const std::optional<std::string>& product) {
+    const plist::Array* types = supported.asArray();
+    if (types == nullptr || !product) {
+        return false;
+    }
+    return std::any_of(types->begin(), types->end(), [&](const plist::Value& type) {
+        return type.asString() != nullptr && *type.asString() == *product;
+    });
+}
+
+// Whether the asset fits this device: its OS version within the bounds (inclusive) and its
+// product type listed, when the asset says so. Logs why not.
+bool fitsThisDevice(const plist::Dictionary& attributes, const plist::Value& productVersion,
+                    const std::optional<std::string>& productType) {
+    const std::string current = versionText(productVersion);
+    if (auto minimum = attributes.find(kAssetAttributeMinimumOSVersion);
+        minimum != attributes.end() &&
+        compareVersionStrings(versionText(minimum->second), current) == 1) {
+        logObjectFormat("Current product version %@ is lower than min %@", &productVersion,
+                        &minimum->second);
+        return false;
+    }
+    if (auto maximum = attributes.find(kAssetAttributeMaximumOSVersion);
+        maximum != attributes.end() &&
+        compareVersionStrings(versionText(maximum->second), current) == -1) {
+        logObjectFormat("Current product version %@ is higher than max %@", &productVersion,
+                        &maximum->second);
+        return false;
+    }
+    auto supported = attributes.find(kAssetAttributeSupportedProductTypes);
+    if (supported == attributes.end()) {
+        logCFormat(
+            "Supported device classes attribute is not present, assuming all are supported\n");
+    } else if (!listsProductType(supported->second, productType)) {
+        logCFormat("Supported device classes are mentioned, but this product is not supported\n");
+        return false;
+    } else {
+        logCFormat("This product is present is the supported devices\n");
+    }
+    return true;
+}
+
+}  // namespace
+
+std::optional<std::vector<AssetHandler::AssetPtr>> AssetHandler::downloadAvailableAssets() {
+    platform::AssetQuery query(kAssetTypeTavrixBundles);
+    query.setQueriesLocalInformationOnly(false);
+    logCFormat("Issuing query\n");
+    auto results = query.runQuery();
+    logCFormat("Query returned back with %d items\n",
+               results ? static_cast<int>(results->size()) : 0);
+    return results;
+}
+
+AssetHandler::AssetPtr AssetHandler::findTheBestAsset() {
+    std::optional<std::string> installed = BundleManager::sharedInstance().copyBundleVersion();
+    if (!installed) {
+        logObjectFormat("No bundle version available, initializing with 0.0");
+    }
+    plist::Value bestVersion(installed.value_or("0.0"));
+    // An unknown OS version is the empty text: any minimum is then above it.
+    const plist::Value productVersion(TXUtility::currentProductVersion().value_or(""));
+    const auto productType = optionalText(TXUtility::currentProductType());
+    logObjectFormat("Current version: %@\n", &bestVersion);
+    logObjectFormat("Current Product version: %@\n", &productVersion);
+    logObjectFormat("Product Type: %@\n", productType ? &*productType : nullptr);
+
+    AssetPtr best;
+    auto assets = downloadAvailableAssets();
+    if (!assets) {
+        return best;
+    }
+    for (std::size_t index = 0; index < assets->size(); ++index) {
+        const AssetPtr& asset = (*assets)[index];
+        const plist::Dictionary& attributes = asset->attributes();
+        logCFormat("Index: %d\n", static_cast<int>(index));
+        for (const auto& [key, value] : attributes) {
+            const plist::Value keyValue(key);
+            logObjectFormat("key: %@, value: %@", &keyValue, &value);
+        }
+        auto version = attributes.find(kAssetAttributeVersion);
+        if (version == attributes.end()) {
+            logObjectFormat("No asset version available");
+            continue;
+        }
+        if (!fitsThisDevice(attributes, productVersion, TXUtility::currentProductType())) {
+            continue;
+        }
+        if (compareVersionStrings(versionText(version->second), versionText(bestVersion)) == 1) {
+            logObjectFormat("A higher version is available, downloading it");
+            best = asset;
+            bestVersion = version->second;
+        } else {
+            logObjectFormat("No higher update available");
+        }
+    }
+    return best;
+}
+
 bool AssetHandler::downloadUpdateIfAvailable() {
-    return false;
+    AssetPtr asset = findTheBestAsset();
+    if (!asset) {
+        logObjectFormat("Best candidate passed in is nil");
+        return false;
+    }
+    for (const auto& [key, value] : asset->attributes()) {
+        const plist::Value keyValue(key);
+        logObjectFormat("Best Candidate: key: %@, value: %@", &keyValue, &value);
+    }
+    asset->beginDownload();
+    // The handler keeps the asset alive until the catalog drops it after the last report.
+    asset->setProgressHandler(
+        [asset](const plist::Dictionary& progress) { handleDownloadProgress(asset, progress); });
+    return true;
+}
+
+void AssetHandler::handleDownloadProgress(const AssetPtr& asset,
+                                          const plist::Dictionary& progress) {
+    auto& scheduler = UpdateCheckScheduler::sharedInstance();
+    auto operation = progress.find(platform::kAssetProgressOperationKey);
+    if (operation == progress.end()) {
+        logObjectFormat("Operation is not available?");
+        scheduler.rescheduleAndEndCheck(kInstallRetryDelaySeconds);
+        return;
+    }
+    logObjectFormat("Current operation: %@", &operation->second);
+    const std::string* name = operation->second.asString();
+    if (name == nullptr || *name != platform::kAssetOperationCompleted) {
+        // Every report but the last ends the check and re-arms it a day ahead; the last one
+        // re-arms it again.
+        scheduler.rescheduleAndEndCheck(kInstallRetryDelaySeconds);
+        return;
+    }
+    std::optional<std::string> url = asset->localURL();
+    if (!url) {
+        logObjectFormat("Local URL is not available?");
+        scheduler.rescheduleAndEndCheck(kInstallRetryDelaySeconds);
+        return;
+    }
+    const plist::Value urlPath(*url);
+    logObjectFormat("URL string: %@", &urlPath);
+    installDownloadedBundle(*url);
+    asset->purge([](bool) { logObjectFormat("Best candidate asset has been purged"); });
+    scheduler.rescheduleAndEndCheck(kInstallDoneDelaySeconds);
+}
+
+void AssetHandler::installDownloadedBundle(const std::string& source) {
+    const std::string& destination = userBundleLocation();
+    if (destination.empty()) {
+        logCFormat("The mobile user's home directory is unknown, not installing the bundle\n");
+        return;
+    }
+    {
+        payload::FileSystemHelper files;
+        logCFormat("Removing the directory %s\n", destination.c_str());
+        files.removeItem(destination);
+        logCFormat("Copying the directory %s to %s\n", source.c_str(), destination.c_str());
+        files.createDirectory(destination, 0755, true);
+        std::vector<std::string> names;
+        if (files.listDirectory(source, names, false) == 0) {
+            logCFormat("There are %ld files in directory %s\n", static_cast<long>(names.size()),
+                       source.c_str());
+            for (const std::string& name : names) {
+                const std::string entry = source + "/" + name;
+                logCFormat("Copying %s\n", entry.c_str());
+                files.copyItem(entry, destination);
+            }
+        }
+    }
+    auto behaviorID = copyBehaviorPreference(kTavrixIDKey);
+    if (!behaviorID || !behaviorID->isString()) {
+        logObjectFormat("Behavior ID is not set yet in the preferences, no action is being taken");
+        return;
+    }
+    logCFormat("Behavior ID %s is already sent, redoing bundle match\n",
+               behaviorID->asString()->c_str());
+    BundleManager::sharedInstance().resetBehaviorBundle(*behaviorID->asString());
 }
 
 }  // namespace tavrix

@@ -1,0 +1,162 @@
+#include "platform/AssetCatalog.h"
+
+#include <sys/stat.h>
+
+#include <cerrno>
+#include <cstring>
+
+#include "payload/FileSystemUtilities.h"
+#include "platform/AssetCatalogService.h"
+#include "platform/AssetDownload.h"
+#include "platform/CatalogLoader.h"
+#include "util/Log.h"
+
+namespace tavrix::platform {
+namespace {
+
+bool isFinalReport(const plist::Dictionary& progress) {
+    auto operation = progress.find(kAssetProgressOperationKey);
+    if (operation == progress.end() || operation->second.asString() == nullptr) {
+        return false;
+    }
+    const std::string& name = *operation->second.asString();
+    return name == kAssetOperationCompleted || name == kAssetOperationFailed;
+}
+
+}  // namespace
+
+Asset::Asset(CatalogEntry entry, std::string typeCacheDirectory)
+    : entry_(std::move(entry)),
+      directory_(AssetCacheLocation::forEntry(typeCacheDirectory, entry_).directory),
+      typeCacheDirectory_(std::move(typeCacheDirectory)) {}
+
+void Asset::beginDownload(const plist::Dictionary& /*options*/) {
+    {
+        std::lock_guard lock(mutex_);
+        if (downloading_) {
+            logCFormat("Asset catalog: the download of %s is already running",
+                       entry_.archiveURL.c_str());
+            return;
+        }
+        downloading_ = true;
+    }
+    // The task holds the asset until its download is over.
+    auto self = shared_from_this();
+    if (!AssetCatalogService::shared().workerQueue().dispatchAsync(
+            [self] { self->runDownload(); })) {
+        std::lock_guard lock(mutex_);
+        downloading_ = false;
+    }
+}
+
+void Asset::runDownload() {
+    logCFormat("Asset catalog: downloading %s", entry_.archiveURL.c_str());
+    AssetCacheLocation location = AssetCacheLocation::forEntry(typeCacheDirectory_, entry_);
+    std::optional<std::string> failure = downloadAndInstallAsset(
+        entry_, location, [this](plist::Dictionary progress) { report(std::move(progress)); });
+    plist::Dictionary last;
+    if (failure) {
+        logCFormat("Asset catalog: download of %s failed: %s", entry_.archiveURL.c_str(),
+                   failure->c_str());
+        last = {{kAssetProgressOperationKey, plist::Value(kAssetOperationFailed)},
+                {kAssetProgressErrorKey, plist::Value(*failure)}};
+    } else {
+        logCFormat("Asset catalog: installed %s in %s", entry_.archiveURL.c_str(),
+                   directory_.c_str());
+        last = {{kAssetProgressOperationKey, plist::Value(kAssetOperationCompleted)}};
+    }
+    {
+        std::lock_guard lock(mutex_);
+        downloading_ = false;
+    }
+    report(std::move(last));
+}
+
+void Asset::report(plist::Dictionary progress) {
+    {
+        std::lock_guard lock(mutex_);
+        undelivered_.push_back(std::move(progress));
+    }
+    auto self = shared_from_this();
+    AssetCatalogService::shared().deliveryQueue().dispatchAsync([self] { self->deliverReports(); });
+}
+
+void Asset::setProgressHandler(ProgressHandler handler) {
+    {
+        std::lock_guard lock(mutex_);
+        handler_ = std::move(handler);
+    }
+    auto self = shared_from_this();
+    AssetCatalogService::shared().deliveryQueue().dispatchAsync([self] { self->deliverReports(); });
+}
+
+// Runs only on the delivery queue, so reports reach the handler one at a time and in order.
+void Asset::deliverReports() {
+    for (;;) {
+        ProgressHandler handler;
+        plist::Dictionary progress;
+        {
+            std::lock_guard lock(mutex_);
+            if (!handler_ || undelivered_.empty()) {
+                return;
+            }
+            handler = handler_;
+            progress = std::move(undelivered_.front());
+            undelivered_.pop_front();
+            if (isFinalReport(progress)) {
+                // The handler usually captures this asset; dropping it breaks that cycle.
+                handler_ = nullptr;
+            }
+        }
+        handler(progress);
+    }
+}
+
+std::optional<std::string> Asset::localURL() const {
+    struct stat info {};
+    if (::stat(directory_.c_str(), &info) != 0 || !S_ISDIR(info.st_mode)) {
+        return std::nullopt;
+    }
+    return directory_;
+}
+
+void Asset::purge(PurgeCompletion completion) {
+    auto self = shared_from_this();
+    AssetCatalogService::shared().workerQueue().dispatchAsync(
+        [self, completion = std::move(completion)] {
+            int error = payload::removeItemTree(self->directory_);
+            bool purged = error == 0 || error == ENOENT;
+            if (!purged) {
+                logCFormat("Asset catalog: cannot purge %s: %s", self->directory_.c_str(),
+                           std::strerror(error));
+            }
+            if (completion) {
+                completion(purged);
+            }
+        });
+}
+
+AssetQuery::AssetQuery(std::string assetType) : assetType_(std::move(assetType)) {}
+
+std::optional<std::vector<std::shared_ptr<Asset>>> AssetQuery::runQuery() const {
+    std::vector<std::shared_ptr<Asset>> assets;
+    std::optional<AssetTypeSettings> settings =
+        AssetCatalogService::shared().settingsFor(assetType_);
+    if (!settings) {
+        return assets;
+    }
+    std::string whyNot;
+    std::optional<std::vector<CatalogEntry>> entries =
+        loadCatalogEntries(*settings, localOnly_, whyNot);
+    if (!entries) {
+        logCFormat("Asset catalog: refusing the catalog %s: %s", settings->catalogURL.c_str(),
+                   whyNot.c_str());
+        return std::nullopt;
+    }
+    for (CatalogEntry& entry : *entries) {
+        assets.push_back(std::make_shared<Asset>(std::move(entry), settings->cacheDirectory));
+    }
+    return assets;
+}
+
+}  // namespace tavrix::platform

@@ -1,0 +1,101 @@
+// The asset catalog service: which assets of a type a catalog lists, and downloading one into the
+// local cache. Settings are described in AssetCatalogSettings.h, the catalog in
+// AssetCatalogFormat.h.
+//
+// Downloads run one at a time on the service's worker thread. Progress reports reach the handler
+// on the service's delivery thread, in order; reports made before a handler is set wait for it.
+// After the last report (completed or failed) the handler is dropped, so a handler may capture
+// its asset.
+#pragma once
+
+#include <cstdint>
+#include <deque>
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/AssetCatalogFormat.h"
+#include "plist/Value.h"
+
+namespace tavrix::platform {
+
+// The key of a progress report's current operation, a string with one of the values below.
+inline constexpr const char* kAssetProgressOperationKey = "Operation";
+inline constexpr const char* kAssetOperationStarted = "Started";
+inline constexpr const char* kAssetOperationDownloading = "Downloading";
+inline constexpr const char* kAssetOperationInstalling = "Installing";
+// The last report of a download that succeeded: the asset's local URL is now set.
+inline constexpr const char* kAssetOperationCompleted = "Completed";
+// The last report of a download that failed; kAssetProgressErrorKey says why.
+inline constexpr const char* kAssetOperationFailed = "Failed";
+
+// Integers in Started and Downloading reports.
+inline constexpr const char* kAssetProgressBytesWrittenKey = "BytesWritten";
+inline constexpr const char* kAssetProgressTotalBytesKey = "TotalBytes";
+// A string in Failed reports.
+inline constexpr const char* kAssetProgressErrorKey = "Error";
+
+class Asset : public std::enable_shared_from_this<Asset> {
+  public:
+    using ProgressHandler = std::function<void(const plist::Dictionary& progress)>;
+    using PurgeCompletion = std::function<void(bool purged)>;
+
+    // Assets come from AssetQuery; typeCacheDirectory is the asset type's directory in the cache.
+    Asset(CatalogEntry entry, std::string typeCacheDirectory);
+    Asset(const Asset&) = delete;
+    Asset& operator=(const Asset&) = delete;
+
+    // The attributes the catalog gives for this asset, as it gives them.
+    const plist::Dictionary& attributes() const { return entry_.attributes; }
+
+    // Queues the download. No options are recognised yet; unknown ones are ignored. A call while
+    // this asset's download is still running is logged and ignored.
+    void beginDownload(const plist::Dictionary& options = {});
+
+    // Sets the handler for this download's reports, including those already made.
+    void setProgressHandler(ProgressHandler handler);
+
+    // The directory holding the extracted asset, or nothing while it has not been downloaded.
+    std::optional<std::string> localURL() const;
+
+    // Removes the downloaded asset (after a download still queued or running), then calls
+    // completion, when given, on the worker thread: true when nothing of it is left.
+    void purge(PurgeCompletion completion);
+
+  private:
+    void report(plist::Dictionary progress);
+    void deliverReports();
+    void runDownload();
+
+    const CatalogEntry entry_;
+    const std::string directory_;
+    const std::string typeCacheDirectory_;
+
+    std::mutex mutex_;
+    bool downloading_ = false;
+    ProgressHandler handler_;
+    std::deque<plist::Dictionary> undelivered_;
+};
+
+// A query for the assets of one type. Without settings for the type it answers no assets and logs
+// why once.
+class AssetQuery {
+  public:
+    explicit AssetQuery(std::string assetType);
+
+    // True: answer from the copy of the last catalog fetched, without asking the server.
+    void setQueriesLocalInformationOnly(bool localOnly) { localOnly_ = localOnly; }
+
+    // Runs the query on the calling thread (it blocks while the catalog is fetched). The assets in
+    // the catalog's order, or nothing when the catalog cannot be fetched or is refused (logged).
+    std::optional<std::vector<std::shared_ptr<Asset>>> runQuery() const;
+
+  private:
+    std::string assetType_;
+    bool localOnly_ = false;
+};
+
+}  // namespace tavrix::platform

@@ -1,0 +1,50 @@
+#include "platform/AssetCatalogService.h"
+
+#include "platform/PlatformRoot.h"
+#include "util/Log.h"
+
+namespace tavrix::platform {
+
+AssetCatalogService& AssetCatalogService::shared() {
+    static AssetCatalogService* service = new AssetCatalogService();
+    return *service;
+}
+
+AssetCatalogService::AssetCatalogService()
+    : settingsFile_(resolvePath(kAssetCatalogSettingsPath)),
+      worker_("com.zandor.tavrixservicesd.AssetDownloads"),
+      delivery_("com.zandor.tavrixservicesd.AssetProgress") {}
+
+std::optional<AssetTypeSettings> AssetCatalogService::settingsFor(std::string_view assetType) {
+    plist::CachedPropertyListFile::Snapshot snapshot = settingsFile_.read();
+    std::string reason;
+    std::optional<AssetTypeSettings> settings;
+    if (snapshot.state == plist::CachedPropertyListFile::State::Missing) {
+        reason = "there is no settings file";
+    } else if (snapshot.state == plist::CachedPropertyListFile::State::Damaged) {
+        reason = "the settings file is not a property list";
+    } else {
+        settings = parseAssetTypeSettings(*snapshot.value, assetType, reason);
+    }
+    if (settings) {
+        reason.clear();
+    }
+    noteSettingsProblem(assetType, reason);
+    return settings;
+}
+
+void AssetCatalogService::noteSettingsProblem(std::string_view assetType,
+                                              const std::string& reason) {
+    std::lock_guard lock(mutex_);
+    auto known = loggedProblems_.find(assetType);
+    if (known != loggedProblems_.end() && known->second == reason) {
+        return;
+    }
+    loggedProblems_[std::string(assetType)] = reason;
+    if (!reason.empty()) {
+        logCFormat("Asset catalog: no assets of type %s: %s (%s)", std::string(assetType).c_str(),
+                   reason.c_str(), settingsFile_.path().c_str());
+    }
+}
+
+}  // namespace tavrix::platform

@@ -1,0 +1,152 @@
+#include "platform/AssetDownload.h"
+
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+
+#include "payload/FileSystemUtilities.h"
+#include "payload/PayloadUnpack.h"
+#include "platform/AssetCatalog.h"
+#include "platform/CatalogCrypto.h"
+#include "platform/HttpTransfer.h"
+#include "util/UniqueFd.h"
+
+namespace tavrix::platform {
+namespace {
+
+// Downloading reports come at each further quarter of the archive, not for every chunk.
+constexpr std::uint64_t kDownloadReportSteps = 4;
+
+// Removes a staging file or directory when the step that made it is over.
+class StagedPath {
+  public:
+    explicit StagedPath(std::string path) : path_(std::move(path)) {
+        payload::removeItemTree(path_);
+    }
+    ~StagedPath() { payload::removeItemTree(path_); }
+    StagedPath(const StagedPath&) = delete;
+    StagedPath& operator=(const StagedPath&) = delete;
+
+    const std::string& path() const { return path_; }
+
+  private:
+    std::string path_;
+};
+
+std::string errnoText(const char* action, const std::string& path, int error) {
+    return std::string("cannot ") + action + " " + path + ": " + std::strerror(error);
+}
+
+bool writeAll(int fd, std::string_view bytes) {
+    while (!bytes.empty()) {
+        ssize_t written = ::write(fd, bytes.data(), bytes.size());
+        if (written < 0 && errno == EINTR) {
+            continue;
+        }
+        if (written <= 0) {
+            return false;
+        }
+        bytes.remove_prefix(static_cast<std::size_t>(written));
+    }
+    return true;
+}
+
+plist::Dictionary progress(const char* operation) {
+    return plist::Dictionary{{kAssetProgressOperationKey, plist::Value(operation)}};
+}
+
+plist::Dictionary byteProgress(const char* operation, std::uint64_t written, std::uint64_t total) {
+    plist::Dictionary report = progress(operation);
+    report.emplace(kAssetProgressBytesWrittenKey, plist::Value(static_cast<long long>(written)));
+    report.emplace(kAssetProgressTotalBytesKey, plist::Value(static_cast<long long>(total)));
+    return report;
+}
+
+// Streams the archive into fd, hashing it on the way. Nothing on success, else why not.
+std::optional<std::string> downloadArchive(const CatalogEntry& entry, int fd,
+                                           const AssetProgressReporter& report) {
+    Sha256Digest digest;
+    std::uint64_t received = 0;
+    const std::uint64_t step = std::max<std::uint64_t>(entry.archiveSize / kDownloadReportSteps, 1);
+    std::uint64_t nextReport = step;
+    HttpBodyReceiver receiver = [&](std::string_view bytes, std::string& refusal) {
+        if (bytes.size() > entry.archiveSize - received) {
+            refusal = "the server sent more than the catalog's " +
+                      std::to_string(entry.archiveSize) + " bytes";
+            return false;
+        }
+        if (!writeAll(fd, bytes)) {
+            refusal = std::string("cannot write the archive: ") + std::strerror(errno);
+            return false;
+        }
+        digest.update(bytes);
+        received += bytes.size();
+        if (received >= nextReport) {
+            report(byteProgress(kAssetOperationDownloading, received, entry.archiveSize));
+            nextReport = (received / step + 1) * step;
+        }
+        return true;
+    };
+    std::string error;
+    if (!transferHttpBody(entry.archiveURL, receiver, {}, error)) {
+        return "cannot download " + entry.archiveURL + ": " + error;
+    }
+    if (received != entry.archiveSize) {
+        return "the archive is " + std::to_string(received) + " bytes, the catalog says " +
+               std::to_string(entry.archiveSize);
+    }
+    std::string actual = digest.finishHex();
+    if (actual != entry.archiveSHA256) {
+        return "the archive's SHA-256 is " + actual + ", the catalog says " + entry.archiveSHA256;
+    }
+    return std::nullopt;
+}
+
+}  // namespace
+
+AssetCacheLocation AssetCacheLocation::forEntry(const std::string& typeCacheDirectory,
+                                                const CatalogEntry& entry) {
+    std::string base = typeCacheDirectory + "/";
+    return {base + entry.archiveSHA256, base + "." + entry.archiveSHA256 + ".download",
+            base + "." + entry.archiveSHA256 + ".extracting"};
+}
+
+std::optional<std::string> downloadAndInstallAsset(const CatalogEntry& entry,
+                                                   const AssetCacheLocation& location,
+                                                   const AssetProgressReporter& report) {
+    report(byteProgress(kAssetOperationStarted, 0, entry.archiveSize));
+    std::string cacheDirectory = location.directory.substr(0, location.directory.rfind('/'));
+    if (int error = payload::createDirectoryAt(cacheDirectory, 0755, true)) {
+        return errnoText("create", cacheDirectory, error);
+    }
+    StagedPath archive(location.archiveFile);
+    {
+        UniqueFd fd(::open(archive.path().c_str(),
+                           O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, 0600));
+        if (!fd) {
+            return errnoText("create", archive.path(), errno);
+        }
+        if (std::optional<std::string> failure = downloadArchive(entry, fd.get(), report)) {
+            return failure;
+        }
+    }
+    report(progress(kAssetOperationInstalling));
+    StagedPath extraction(location.extractionDirectory);
+    if (!payload::extractArchive(archive.path(), extraction.path(),
+                                 payload::ExtractionSafety::PathSafe)) {
+        return "the archive could not be extracted";
+    }
+    int error = payload::removeItemTree(location.directory);
+    if (error != 0 && error != ENOENT) {
+        return errnoText("replace", location.directory, error);
+    }
+    if (::rename(extraction.path().c_str(), location.directory.c_str()) != 0) {
+        return errnoText("install into", location.directory, errno);
+    }
+    return std::nullopt;
+}
+
+}  // namespace tavrix::platform

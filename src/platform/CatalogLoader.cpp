@@ -1,0 +1,115 @@
+#include "platform/CatalogLoader.h"
+
+#include <cerrno>
+#include <cstring>
+
+#include "payload/AtomicFile.h"
+#include "payload/FileSystemUtilities.h"
+#include "platform/HttpTransfer.h"
+#include "plist/PropertyListFormat.h"
+#include "util/Log.h"
+
+namespace tavrix::platform {
+namespace {
+
+constexpr long kCatalogTimeoutSeconds = 120;
+constexpr const char* kLocalCopyName = "/catalog.plist";
+
+struct SignedCatalog {
+    std::string bytes;
+    // Empty when no key is configured.
+    std::string signature;
+};
+
+bool verify(const AssetTypeSettings& settings, const SignedCatalog& catalog, std::string& whyNot) {
+    if (!settings.publicKey) {
+        return true;
+    }
+    if (!verifyCatalogSignature(catalog.bytes, catalog.signature, *settings.publicKey)) {
+        whyNot = "its signature does not verify with the configured key";
+        return false;
+    }
+    return true;
+}
+
+std::optional<SignedCatalog> fetchFromServer(const AssetTypeSettings& settings,
+                                             std::string& whyNot) {
+    std::string error;
+    SignedCatalog catalog;
+    std::optional<std::string> bytes =
+        fetchHttpBody(settings.catalogURL, kMaxCatalogBytes, kCatalogTimeoutSeconds, error);
+    if (!bytes) {
+        whyNot = "cannot fetch it: " + error;
+        return std::nullopt;
+    }
+    catalog.bytes = std::move(*bytes);
+    if (settings.publicKey) {
+        std::string signatureURL = settings.catalogURL + kCatalogSignatureSuffix;
+        std::optional<std::string> signature =
+            fetchHttpBody(signatureURL, kCatalogSignatureBytes, kCatalogTimeoutSeconds, error);
+        if (!signature) {
+            whyNot = "cannot fetch its signature " + signatureURL + ": " + error;
+            return std::nullopt;
+        }
+        catalog.signature = std::move(*signature);
+    }
+    return catalog;
+}
+
+// Keeps the verified pair for local queries. Failing to keep it costs only those queries.
+void keepLocalCopy(const AssetTypeSettings& settings, const SignedCatalog& catalog) {
+    std::string path = settings.cacheDirectory + kLocalCopyName;
+    std::string signaturePath = path + kCatalogSignatureSuffix;
+    int error = payload::createDirectoryAt(settings.cacheDirectory, 0755, true);
+    if (error == 0 &&
+        !payload::writeFileAtomically(path, catalog.bytes.data(), catalog.bytes.size(), 0644)) {
+        error = errno;
+    }
+    if (error == 0 && settings.publicKey &&
+        !payload::writeFileAtomically(signaturePath, catalog.signature.data(),
+                                      catalog.signature.size(), 0644)) {
+        error = errno;
+    }
+    if (error == 0 && !settings.publicKey) {
+        payload::removeItemTree(signaturePath);  // a stale signature would only mislead
+    }
+    if (error != 0) {
+        logCFormat("Asset catalog: cannot keep a local copy of the catalog in %s: %s",
+                   settings.cacheDirectory.c_str(), std::strerror(error));
+    }
+}
+
+}  // namespace
+
+std::optional<std::vector<CatalogEntry>> loadCatalogEntries(const AssetTypeSettings& settings,
+                                                            bool localOnly, std::string& whyNot) {
+    std::optional<SignedCatalog> catalog;
+    if (localOnly) {
+        std::string path = settings.cacheDirectory + kLocalCopyName;
+        std::optional<std::string> bytes = plist::readFileBytes(path);
+        if (!bytes) {
+            return std::vector<CatalogEntry>();
+        }
+        catalog = SignedCatalog{std::move(*bytes), {}};
+        if (settings.publicKey) {
+            catalog->signature =
+                plist::readFileBytes(path + kCatalogSignatureSuffix).value_or(std::string());
+        }
+    } else {
+        catalog = fetchFromServer(settings, whyNot);
+        if (!catalog) {
+            return std::nullopt;
+        }
+    }
+    if (!verify(settings, *catalog, whyNot)) {
+        return std::nullopt;
+    }
+    std::optional<std::vector<CatalogEntry>> entries =
+        readCatalogEntries(catalog->bytes, settings.catalogURL, settings.assetType, whyNot);
+    if (entries && !localOnly) {
+        keepLocalCopy(settings, *catalog);
+    }
+    return entries;
+}
+
+}  // namespace tavrix::platform

@@ -1,0 +1,133 @@
+#include "platform/HttpTransfer.h"
+
+#include <strings.h>
+
+#include "platform/CurlHandles.h"
+
+namespace tavrix::platform {
+namespace {
+
+constexpr long kConnectTimeoutSeconds = 30;
+// A transfer slower than one byte a second for this long has stalled.
+constexpr long kStallSeconds = 60;
+constexpr long kMaxRedirects = 5;
+constexpr const char* kAllowedProtocols = "http,https";
+
+bool curlReady() {
+    // Reference-counted and thread-safe in the libcurl this builds against; done once anyway.
+    static const bool ready = curl_global_init(CURL_GLOBAL_DEFAULT) == CURLE_OK;
+    return ready;
+}
+
+struct TransferState {
+    const HttpBodyReceiver* receiver = nullptr;
+    std::string refusal;
+    bool refused = false;
+};
+
+std::size_t receiveBody(char* bytes, std::size_t size, std::size_t count, void* context) {
+    auto* state = static_cast<TransferState*>(context);
+    std::size_t length = size * count;
+    if (!(*state->receiver)(std::string_view(bytes, length), state->refusal)) {
+        state->refused = true;
+        return CURL_WRITEFUNC_ERROR;
+    }
+    return length;
+}
+
+bool isHttpScheme(const char* scheme) {
+    return scheme != nullptr &&
+           (strcasecmp(scheme, "http") == 0 || strcasecmp(scheme, "https") == 0);
+}
+
+}  // namespace
+
+bool transferHttpBody(const std::string& url, const HttpBodyReceiver& receiver,
+                      const HttpTransferLimits& limits, std::string& error) {
+    if (!curlReady()) {
+        error = "libcurl could not be initialised";
+        return false;
+    }
+    CurlEasy handle(curl_easy_init());
+    if (!handle) {
+        error = "libcurl could not create a transfer";
+        return false;
+    }
+    CURL* curl = handle.get();
+    TransferState state{&receiver, {}, false};
+    char errorText[CURL_ERROR_SIZE] = {};
+    bool configured =
+        curl_easy_setopt(curl, CURLOPT_URL, url.c_str()) == CURLE_OK &&
+        curl_easy_setopt(curl, CURLOPT_PROTOCOLS_STR, kAllowedProtocols) == CURLE_OK &&
+        curl_easy_setopt(curl, CURLOPT_REDIR_PROTOCOLS_STR, kAllowedProtocols) == CURLE_OK &&
+        curl_easy_setopt(curl, CURLOPT_FOLLOWLOCATION, 1L) == CURLE_OK &&
+        curl_easy_setopt(curl, CURLOPT_MAXREDIRS, kMaxRedirects) == CURLE_OK &&
+        curl_easy_setopt(curl, CURLOPT_FAILONERROR, 1L) == CURLE_OK &&
+        curl_easy_setopt(curl, CURLOPT_NOSIGNAL, 1L) == CURLE_OK &&
+        curl_easy_setopt(curl, CURLOPT_CONNECTTIMEOUT, kConnectTimeoutSeconds) == CURLE_OK &&
+        curl_easy_setopt(curl, CURLOPT_LOW_SPEED_LIMIT, 1L) == CURLE_OK &&
+        curl_easy_setopt(curl, CURLOPT_LOW_SPEED_TIME, kStallSeconds) == CURLE_OK &&
+        curl_easy_setopt(curl, CURLOPT_TIMEOUT, limits.totalTimeoutSeconds) == CURLE_OK &&
+        curl_easy_setopt(curl, CURLOPT_ERRORBUFFER, errorText) == CURLE_OK &&
+        curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, receiveBody) == CURLE_OK &&
+        curl_easy_setopt(curl, CURLOPT_WRITEDATA, &state) == CURLE_OK;
+    if (!configured) {
+        error = "libcurl refused the transfer options";
+        return false;
+    }
+    CURLcode result = curl_easy_perform(curl);
+    if (result == CURLE_OK) {
+        return true;
+    }
+    if (state.refused) {
+        error = state.refusal;
+    } else if (result == CURLE_HTTP_RETURNED_ERROR) {
+        long status = 0;
+        curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &status);
+        error = "the server answered HTTP status " + std::to_string(status);
+    } else {
+        error = errorText[0] != '\0' ? errorText : curl_easy_strerror(result);
+    }
+    return false;
+}
+
+std::optional<std::string> fetchHttpBody(const std::string& url, std::size_t maxBytes,
+                                         long totalTimeoutSeconds, std::string& error) {
+    std::string body;
+    HttpBodyReceiver collect = [&](std::string_view bytes, std::string& refusal) {
+        if (bytes.size() > maxBytes - body.size()) {
+            refusal = "the body is longer than " + std::to_string(maxBytes) + " bytes";
+            return false;
+        }
+        body.append(bytes);
+        return true;
+    };
+    if (!transferHttpBody(url, collect, {totalTimeoutSeconds}, error)) {
+        return std::nullopt;
+    }
+    return body;
+}
+
+std::optional<std::string> resolveHttpURL(const std::string& base, const std::string& reference) {
+    CurlUrl handle(curl_url());
+    if (!handle || curl_url_set(handle.get(), CURLUPART_URL, base.c_str(), 0) != CURLUE_OK ||
+        curl_url_set(handle.get(), CURLUPART_URL, reference.c_str(), 0) != CURLUE_OK) {
+        return std::nullopt;
+    }
+    char* rawScheme = nullptr;
+    if (curl_url_get(handle.get(), CURLUPART_SCHEME, &rawScheme, 0) != CURLUE_OK) {
+        return std::nullopt;
+    }
+    CurlString scheme(rawScheme);
+    if (!isHttpScheme(scheme.get())) {
+        return std::nullopt;
+    }
+    char* rawURL = nullptr;
+    if (curl_url_get(handle.get(), CURLUPART_URL, &rawURL, 0) != CURLUE_OK) {
+        return std::nullopt;
+    }
+    CurlString resolved(rawURL);
+    return std::string(resolved.get());
+}
+
+}  // namespace tavrix::platform

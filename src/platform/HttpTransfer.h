@@ -1,0 +1,36 @@
+// Plain HTTP(S) GET transfers for the asset catalog: a whole body into memory, or a body streamed
+// to a receiver. Only http and https are followed, including on redirects; a server's error status
+// is a failure.
+#pragma once
+
+#include <cstddef>
+#include <functional>
+#include <optional>
+#include <string>
+#include <string_view>
+
+namespace tavrix::platform {
+
+// Receives the body piece by piece. Answering false stops the transfer; refusal then says why.
+using HttpBodyReceiver = std::function<bool(std::string_view bytes, std::string& refusal)>;
+
+struct HttpTransferLimits {
+    // 0 means no limit on the whole transfer; a stalled one is still ended.
+    long totalTimeoutSeconds = 0;
+};
+
+// Runs a GET of url, handing the body to receiver. True when the whole body arrived; otherwise
+// false with error saying why (the receiver's refusal when it stopped the transfer).
+bool transferHttpBody(const std::string& url, const HttpBodyReceiver& receiver,
+                      const HttpTransferLimits& limits, std::string& error);
+
+// The whole body of url, or nothing (with error set) when the transfer fails or the body is
+// longer than maxBytes.
+std::optional<std::string> fetchHttpBody(const std::string& url, std::size_t maxBytes,
+                                         long totalTimeoutSeconds, std::string& error);
+
+// reference resolved against base (an absolute reference is kept as it is), or nothing when the
+// result is not a valid http or https URL.
+std::optional<std::string> resolveHttpURL(const std::string& base, const std::string& reference);
+
+}  // namespace tavrix::platform

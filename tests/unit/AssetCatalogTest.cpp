@@ -1,0 +1,509 @@
+// The asset catalog binding against a real HTTP server on 127.0.0.1 serving what the publishing
+// tool produced.
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <condition_variable>
+#include <filesystem>
+#include <functional>
+#include <future>
+#include <mutex>
+#include <random>
+#include <thread>
+
+#include "CatalogToolRunner.h"
+#include "LocalHttpServer.h"
+#include "TestSupport.h"
+#include "UnitTestRoot.h"
+#include "payload/Archive.h"
+#include "platform/AssetCatalog.h"
+#include "platform/AssetCatalogSettings.h"
+#include "platform/CatalogCrypto.h"
+#include "platform/PlatformRoot.h"
+#include "platform/SystemLog.h"
+#include "plist/PropertyListFormat.h"
+
+namespace tavrix::platform {
+namespace {
+
+namespace fs = std::filesystem;
+using test::LocalHttpServer;
+using test::readText;
+using test::writeText;
+
+constexpr const char* kAssetType = "com.zandor.Grellas.TavrixBundles";
+constexpr auto kPatience = std::chrono::seconds(60);
+
+using Assets = std::vector<std::shared_ptr<Asset>>;
+
+std::string incompressibleBytes(std::size_t count) {
+    std::mt19937 generator(7);
+    std::string bytes(count, '\0');
+    for (char& byte : bytes) {
+        byte = static_cast<char>(generator());
+    }
+    return bytes;
+}
+
+LocalHttpServer::Response bodyResponse(std::string body,
+                                       std::optional<std::size_t> cutAfter = std::nullopt) {
+    LocalHttpServer::Response response;
+    response.body = std::move(body);
+    response.cutAfterBodyBytes = cutAfter;
+    return response;
+}
+
+LocalHttpServer::Response statusResponse(int status, std::string reason) {
+    LocalHttpServer::Response response;
+    response.status = status;
+    response.reason = std::move(reason);
+    return response;
+}
+
+// Collects the reports a handler receives, for waiting on the last one.
+class ProgressLog {
+  public:
+    // The operations received until a completed or failed one, in order.
+    std::vector<std::string> waitForLast() {
+        std::unique_lock lock(mutex_);
+        if (!changed_.wait_for(lock, kPatience, [&] { return finished_; })) {
+            ADD_FAILURE() << "no final progress report";
+        }
+        return operations_;
+    }
+
+    std::vector<plist::Dictionary> reports() {
+        std::lock_guard lock(mutex_);
+        return reports_;
+    }
+
+    void record(const plist::Dictionary& progress) {
+        std::lock_guard lock(mutex_);
+        reports_.push_back(progress);
+        auto operation = progress.find(kAssetProgressOperationKey);
+        std::string name = operation != progress.end() && operation->second.asString() != nullptr
+                               ? *operation->second.asString()
+                               : "(none)";
+        operations_.push_back(name);
+        finished_ = name == kAssetOperationCompleted || name == kAssetOperationFailed;
+        changed_.notify_all();
+    }
+
+  private:
+    std::mutex mutex_;
+    std::condition_variable changed_;
+    std::vector<plist::Dictionary> reports_;
+    std::vector<std::string> operations_;
+    bool finished_ = false;
+};
+
+// A handler that captures its asset, as an update client's does, so that a kept cycle would show.
+Asset::ProgressHandler recordingHandler(const std::shared_ptr<ProgressLog>& log,
+                                        const std::shared_ptr<Asset>& asset) {
+    return [log, asset](const plist::Dictionary& progress) { log->record(progress); };
+}
+
+class AssetCatalogTest : public testing::Test {
+  protected:
+    void SetUp() override {
+        std::error_code ignored;
+        fs::remove_all(resolvePath("/etc/tavrix"), ignored);
+        fs::remove_all(resolvePath("/var/cache"), ignored);
+        ASSERT_EQ(tool({"keygen", work / "secret.key", work / "public.key"}), 0);
+        publicKey = readText(work / "public.key");
+        publicKey.pop_back();  // the line break
+        server.serveDirectory("/catalog/", work.path() / "out");
+    }
+
+    int tool(const std::vector<std::string>& arguments) {
+        test::ToolRun run = test::runCatalogTool(arguments);
+        EXPECT_EQ(run.status, 0) << run.errors;
+        return run.status;
+    }
+
+    void writeSettings(const std::optional<std::string>& key) {
+        plist::Dictionary type{{kSettingsCatalogURLKey, plist::Value(catalogURL())}};
+        if (key) {
+            type.emplace(kSettingsPublicKeyKey, plist::Value(*key));
+        }
+        writeSettingsValue(plist::Value(plist::Dictionary{
+            {kSettingsAssetTypesKey, plist::Value(plist::Dictionary{{kAssetType, type}})}}));
+    }
+
+    void writeSettingsValue(const plist::Value& settings) {
+        std::string path = resolvePath(kAssetCatalogSettingsPath);
+        fs::create_directories(fs::path(path).parent_path());
+        ASSERT_TRUE(plist::writeFile(path, settings));
+    }
+
+    std::string catalogURL() const { return server.url("/catalog/catalog.plist"); }
+    std::string out(const std::string& relative) const { return work / ("out/" + relative); }
+    std::string typeCache() const {
+        return resolvePath(kDefaultAssetCacheDirectory) + "/" + kAssetType;
+    }
+
+    std::optional<Assets> query(bool localOnly = false) {
+        AssetQuery assetQuery(kAssetType);
+        assetQuery.setQueriesLocalInformationOnly(localOnly);
+        return assetQuery.runQuery();
+    }
+
+    // The single asset the catalog answers.
+    std::shared_ptr<Asset> onlyAsset() {
+        std::optional<Assets> assets = query();
+        if (!assets || assets->size() != 1) {
+            ADD_FAILURE() << "expected one asset";
+            return nullptr;
+        }
+        return assets->front();
+    }
+
+    // Starts the download, sets a handler and waits for the last report.
+    std::vector<std::string> download(const std::shared_ptr<Asset>& asset) {
+        auto progress = std::make_shared<ProgressLog>();
+        asset->beginDownload();
+        asset->setProgressHandler(recordingHandler(progress, asset));
+        return progress->waitForLast();
+    }
+
+    std::size_t logLinesContaining(std::string_view text) const {
+        std::size_t count = 0;
+        for (const std::string& line : sink.messages()) {
+            count += line.find(text) != std::string::npos ? 1 : 0;
+        }
+        return count;
+    }
+
+    // What the cache holds for the type besides the kept catalog.
+    std::vector<std::string> cachedAssetEntries() const {
+        std::vector<std::string> names;
+        std::error_code ignored;
+        for (const auto& entry : fs::directory_iterator(typeCache(), ignored)) {
+            std::string name = entry.path().filename().string();
+            if (!name.starts_with("catalog.plist")) {
+                names.push_back(name);
+            }
+        }
+        return names;
+    }
+
+    test::TempDir work;
+    LocalHttpServer server;
+    std::string publicKey;
+    CapturingLogSink sink;
+    ScopedLogSink guard{sink};
+};
+
+TEST_F(AssetCatalogTest, QueryAnswersPublishedAssetsInOrderAndKeepsThemForLocalQueries) {
+    test::makeBundle(work / "one/Default.bundle", "1.0", {{"a.plist", "<plist/>"}});
+    test::makeBundle(work / "two/Default.bundle", "2.0", {{"a.plist", "two"}});
+    tool({"publish", work / "out", "--key", work / "secret.key", work / "one/Default.bundle",
+          "--product-type", "iPhone9,1", "--product-type", "iPad7,1", "--min-os", "7.0", "--max-os",
+          "9.3", work / "two/Default.bundle"});
+    writeSettings(publicKey);
+
+    std::optional<Assets> local = query(true);
+    ASSERT_TRUE(local.has_value());
+    EXPECT_TRUE(local->empty()) << "nothing is known locally before the first fetch";
+
+    std::optional<Assets> assets = query();
+    ASSERT_TRUE(assets.has_value());
+    ASSERT_EQ(assets->size(), 2u);
+    plist::Dictionary first{
+        {"Version", plist::Value("1.0")},
+        {"SupportedProductTypes",
+         plist::Value(plist::Array{plist::Value("iPhone9,1"), plist::Value("iPad7,1")})},
+        {"MinimumOSVersion", plist::Value("7.0")},
+        {"MaximumOSVersion", plist::Value("9.3")}};
+    EXPECT_EQ(assets->at(0)->attributes(), first);
+    EXPECT_EQ(assets->at(1)->attributes(), (plist::Dictionary{{"Version", plist::Value("2.0")}}));
+    EXPECT_FALSE(assets->at(0)->localURL().has_value());
+
+    // The local answer comes from the kept copy: the server is not asked again.
+    std::size_t requestsBefore = server.requests().size();
+    local = query(true);
+    ASSERT_TRUE(local.has_value());
+    ASSERT_EQ(local->size(), 2u);
+    EXPECT_EQ(local->at(0)->attributes(), first);
+    EXPECT_EQ(server.requests().size(), requestsBefore);
+}
+
+TEST_F(AssetCatalogTest, WithoutUsableSettingsQueriesAnswerNoAssetsAndSayWhyOnce) {
+    struct Case {
+        const char* name;
+        std::function<void()> arrange;
+        const char* reason;
+    };
+    std::vector<Case> cases{
+        {"no file", [] {}, "there is no settings file"},
+        {"damaged file",
+         [] { writeText(resolvePath(kAssetCatalogSettingsPath), "<plist><dict><key>"); },
+         "not a property list"},
+        {"other type only",
+         [this] {
+             writeSettingsValue(plist::Value(plist::Dictionary{
+                 {kSettingsAssetTypesKey,
+                  plist::Value(plist::Dictionary{
+                      {"other.type",
+                       plist::Value(plist::Dictionary{
+                           {kSettingsCatalogURLKey, plist::Value("http://x/")}})}})}}));
+         },
+         "no settings for this asset type"},
+        {"URL of the wrong type",
+         [this] {
+             writeSettingsValue(plist::Value(plist::Dictionary{
+                 {kSettingsAssetTypesKey,
+                  plist::Value(plist::Dictionary{
+                      {kAssetType, plist::Value(plist::Dictionary{
+                                       {kSettingsCatalogURLKey, plist::Value(3)}})}})}}));
+         },
+         "no CatalogURL"},
+        // A key that cannot be read must not quietly turn verification off.
+        {"short key",
+         [this] { writeSettings(base64Encode(reinterpret_cast<const std::uint8_t*>("short"), 5)); },
+         "PublicKey is not 32 bytes"},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
+        sink.clear();
+        c.arrange();
+        for (int attempt = 0; attempt < 2; ++attempt) {
+            std::optional<Assets> assets = query();
+            ASSERT_TRUE(assets.has_value());
+            EXPECT_TRUE(assets->empty());
+        }
+        EXPECT_EQ(logLinesContaining(c.reason), 1u);
+    }
+    EXPECT_TRUE(server.requests().empty());
+}
+
+TEST_F(AssetCatalogTest, CatalogsThatFailVerificationAreRefusedAndTheKeptCopySurvives) {
+    test::makeBundle(work / "b/Default.bundle", "1.0", {{"a.plist", "one"}});
+    tool({"publish", work / "out", "--key", work / "secret.key", work / "b/Default.bundle"});
+    writeSettings(publicKey);
+    ASSERT_EQ(query().value_or(Assets()).size(), 1u);
+    std::string catalog = readText(out("catalog.plist"));
+    std::string signature = readText(out("catalog.plist.sig"));
+
+    struct Case {
+        const char* name;
+        std::string catalog;
+        std::optional<std::string> signature;
+        const char* reason;
+    };
+    std::string altered = catalog;
+    altered.replace(altered.find("<string>1.0</string>"), 20, "<string>9.0</string>");
+    std::vector<Case> cases{
+        {"altered catalog", altered, signature, "signature does not verify"},
+        {"zeroed signature", catalog, std::string(64, '\0'), "signature does not verify"},
+        {"long signature", catalog, signature + "x", "cannot fetch its signature"},
+        {"no signature", catalog, std::nullopt, "cannot fetch its signature"},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
+        sink.clear();
+        writeText(out("catalog.plist"), c.catalog);
+        fs::remove(out("catalog.plist.sig"));
+        if (c.signature) {
+            writeText(out("catalog.plist.sig"), *c.signature);
+        }
+        EXPECT_FALSE(query().has_value());
+        EXPECT_EQ(logLinesContaining(c.reason), 1u);
+    }
+    // Refused catalogs never replace the copy kept from the last good one.
+    std::optional<Assets> kept = query(true);
+    ASSERT_TRUE(kept.has_value());
+    ASSERT_EQ(kept->size(), 1u);
+    EXPECT_EQ(*kept->front()->attributes().find("Version")->second.asString(), "1.0");
+}
+
+TEST_F(AssetCatalogTest, DamagedCatalogsAreRefusedAndMalformedEntriesSkipped) {
+    writeSettings(std::nullopt);
+    plist::Dictionary good{{"ArchiveURL", plist::Value("a.tgz")},
+                           {"ArchiveSize", plist::Value(10)},
+                           {"ArchiveSHA256", plist::Value(std::string(64, 'A'))},
+                           {"Attributes", plist::Value(plist::Dictionary{{"Version", "1"}})}};
+    auto with = [&](const char* key, plist::Value value) {
+        plist::Dictionary entry = good;
+        entry.insert_or_assign(key, std::move(value));
+        return plist::Value(entry);
+    };
+    plist::Array entries{
+        plist::Value(good),
+        plist::Value("not a dictionary"),
+        with("ArchiveSize", plist::Value("10")),
+        with("ArchiveSize", plist::Value(plist::Integer::fromUnsigned(UINT64_MAX))),
+        with("ArchiveSize", plist::Value(0)),
+        with("ArchiveSHA256", plist::Value("abc")),
+        with("ArchiveURL", plist::Value("file:///etc/passwd")),
+        with("ArchiveURL", plist::Value(plist::Data{1, 2})),
+        with("Attributes", plist::Value(plist::Array{})),
+    };
+    auto catalogWith = [&](plist::Value type, plist::Value assets) {
+        return plist::serialize(plist::Value(
+            plist::Dictionary{{"AssetType", std::move(type)}, {"Assets", std::move(assets)}}));
+    };
+    server.serve("/catalog/catalog.plist", bodyResponse(catalogWith(kAssetType, entries)));
+    std::optional<Assets> assets = query();
+    ASSERT_TRUE(assets.has_value());
+    ASSERT_EQ(assets->size(), 1u);
+    EXPECT_EQ(assets->front()->attributes(), *good.at("Attributes").asDictionary());
+    EXPECT_EQ(logLinesContaining("skipping entry"), entries.size() - 1);
+
+    std::vector<std::pair<const char*, std::string>> refused{
+        {"not a property list", "\x89PNG garbage"},
+        {"another type", catalogWith("other.type", entries)},
+        {"assets of the wrong type", catalogWith(kAssetType, plist::Value("x"))},
+        {"over the size cap", std::string(9u << 20, ' ')},
+    };
+    for (const auto& [name, body] : refused) {
+        SCOPED_TRACE(name);
+        server.serve("/catalog/catalog.plist", bodyResponse(body));
+        EXPECT_FALSE(query().has_value());
+    }
+    server.serve("/catalog/catalog.plist", statusResponse(500, "Oops"));
+    EXPECT_FALSE(query().has_value());
+    EXPECT_EQ(logLinesContaining("HTTP status 500"), 1u);
+}
+
+TEST_F(AssetCatalogTest, DownloadReportsStepsInOrderInstallsIdenticalFilesAndPurges) {
+    std::string payload = incompressibleBytes(300 * 1024);
+    test::makeBundle(work / "b/Default.bundle", "1.0",
+                     {{"a.plist", "<plist/>"}, {"b/deep/payload.bin", payload}});
+    tool({"publish", work / "out", "--key", work / "secret.key", work / "b/Default.bundle"});
+    writeSettings(publicKey);
+    std::shared_ptr<Asset> asset = onlyAsset();
+    ASSERT_TRUE(asset);
+
+    // Reports made before a handler exists wait for it.
+    asset->beginDownload();
+    auto deadline = std::chrono::steady_clock::now() + kPatience;
+    while (!asset->localURL() && std::chrono::steady_clock::now() < deadline) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    auto progress = std::make_shared<ProgressLog>();
+    asset->setProgressHandler(recordingHandler(progress, asset));
+    std::vector<std::string> operations = progress->waitForLast();
+
+    ASSERT_GE(operations.size(), 4u);
+    EXPECT_EQ(operations.front(), kAssetOperationStarted);
+    EXPECT_EQ(operations[operations.size() - 2], kAssetOperationInstalling);
+    EXPECT_EQ(operations.back(), kAssetOperationCompleted);
+    std::int64_t lastBytes = 0;
+    std::size_t downloading = 0;
+    for (const plist::Dictionary& report : progress->reports()) {
+        if (*report.at(kAssetProgressOperationKey).asString() != kAssetOperationDownloading) {
+            continue;
+        }
+        ++downloading;
+        std::int64_t bytes = report.at(kAssetProgressBytesWrittenKey).asInteger()->signedValue();
+        EXPECT_GT(bytes, lastBytes);
+        lastBytes = bytes;
+    }
+    EXPECT_GE(downloading, 1u);
+    EXPECT_LE(downloading, 4u) << "a few reports, not one per chunk";
+    EXPECT_EQ(lastBytes, static_cast<std::int64_t>(fs::file_size(out("archives/Default-1.0.tgz"))));
+
+    std::optional<std::string> local = asset->localURL();
+    ASSERT_TRUE(local.has_value());
+    EXPECT_EQ(readText(*local + "/b/deep/payload.bin"), payload);
+    EXPECT_EQ(readText(*local + "/a.plist"), "<plist/>");
+    EXPECT_EQ(readText(*local + "/Info.plist"), readText(work / "b/Default.bundle/Info.plist"));
+    EXPECT_EQ(cachedAssetEntries().size(), 1u) << "no staging files are left";
+
+    std::promise<bool> purged;
+    asset->purge([&](bool done) { purged.set_value(done); });
+    ASSERT_EQ(purged.get_future().wait_for(kPatience), std::future_status::ready);
+    EXPECT_FALSE(asset->localURL().has_value());
+    EXPECT_FALSE(fs::exists(*local));
+
+    // The handler captured the asset; once the last report is delivered nothing keeps it.
+    std::weak_ptr<Asset> weak = asset;
+    asset.reset();
+    deadline = std::chrono::steady_clock::now() + kPatience;
+    while (!weak.expired() && std::chrono::steady_clock::now() < deadline) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    EXPECT_TRUE(weak.expired());
+}
+
+TEST_F(AssetCatalogTest, FailedDownloadsReportFailureAndLeaveNothingBehind) {
+    test::makeBundle(work / "b/Default.bundle", "1.0",
+                     {{"payload.bin", incompressibleBytes(64 * 1024)}});
+    tool({"publish", work / "out", "--key", work / "secret.key", work / "b/Default.bundle"});
+    writeSettings(publicKey);
+    const std::string archivePath = "/catalog/archives/Default-1.0.tgz";
+    const std::string archive = readText(out("archives/Default-1.0.tgz"));
+    std::string flipped = archive;
+    flipped[flipped.size() / 2] ^= 0x55;
+
+    struct Case {
+        const char* name;
+        LocalHttpServer::Response response;
+        const char* reason;
+    };
+    std::vector<Case> cases{
+        {"altered archive", bodyResponse(flipped), "SHA-256"},
+        {"cut connection", bodyResponse(archive, archive.size() / 2), "cannot download"},
+        {"longer than listed", bodyResponse(archive + "tail"), "more than the catalog's"},
+        {"not found", statusResponse(404, "Not Found"), "HTTP status 404"},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
+        sink.clear();
+        server.serve(archivePath, c.response);
+        std::shared_ptr<Asset> asset = onlyAsset();
+        ASSERT_TRUE(asset);
+        std::vector<std::string> operations = download(asset);
+        ASSERT_FALSE(operations.empty());
+        EXPECT_EQ(operations.back(), kAssetOperationFailed);
+        EXPECT_EQ(logLinesContaining(c.reason), 1u);
+        EXPECT_FALSE(asset->localURL().has_value());
+        EXPECT_TRUE(cachedAssetEntries().empty());
+    }
+}
+
+TEST_F(AssetCatalogTest, ArchiveEntriesCannotLeaveTheCache) {
+    writeText(work / "file.txt", "x");
+    fs::create_directories(out(""));
+    auto archive = payload::Archive::initWithArchiveType(payload::kArchiveTypeGzip, "hostile");
+    ASSERT_TRUE(archive);
+    // The absolute entry points into the test's own directory, so a fault cannot litter "/".
+    for (const std::string& name :
+         {std::string("../../../escape.txt"), std::string("../up.txt"),
+          std::string("a/../../up.txt"), work / "absolute.txt", std::string("kept.txt")}) {
+        ASSERT_TRUE(archive->addFile(work / "file.txt", name));
+    }
+    ASSERT_TRUE(archive->close());
+    ASSERT_TRUE(archive->writeToFile(out("hostile.tgz")));
+    std::string bytes = readText(out("hostile.tgz"));
+    Sha256Digest digest;
+    digest.update(bytes);
+    plist::Dictionary entry{{"ArchiveURL", plist::Value("hostile.tgz")},
+                            {"ArchiveSize", plist::Value(static_cast<long long>(bytes.size()))},
+                            {"ArchiveSHA256", plist::Value(digest.finishHex())}};
+    ASSERT_TRUE(plist::writeFile(
+        out("catalog.plist"), plist::Value(plist::Dictionary{
+                                  {"AssetType", plist::Value(kAssetType)},
+                                  {"Assets", plist::Value(plist::Array{plist::Value(entry)})}})));
+    writeSettings(std::nullopt);
+    std::shared_ptr<Asset> asset = onlyAsset();
+    ASSERT_TRUE(asset);
+
+    download(asset);
+
+    std::vector<std::string> escaped;
+    for (const fs::path& top : {test::unitTestRoot(), work.path()}) {
+        std::error_code ignored;
+        for (const auto& found : fs::recursive_directory_iterator(top, ignored)) {
+            std::string name = found.path().filename().string();
+            if (name == "escape.txt" || name == "up.txt" || name == "absolute.txt") {
+                escaped.push_back(found.path().string());
+            }
+        }
+    }
+    EXPECT_TRUE(escaped.empty()) << escaped.front();
+}
+
+}  // namespace
+}  // namespace tavrix::platform

@@ -1,0 +1,127 @@
+// The publishing tool, run as publishers run it.
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <filesystem>
+
+#include "CatalogToolRunner.h"
+#include "TestSupport.h"
+#include "platform/AssetCatalogFormat.h"
+#include "platform/CatalogCrypto.h"
+#include "plist/PropertyListFormat.h"
+
+namespace tavrix::test {
+namespace {
+
+namespace fs = std::filesystem;
+
+class CatalogToolTest : public testing::Test {
+  protected:
+    void SetUp() override {
+        ASSERT_EQ(runCatalogTool({"keygen", work / "secret.key", work / "public.key"}).status, 0);
+        makeBundle(work / "a/Default.bundle", "1.0", {{"a.plist", "a"}});
+        makeBundle(work / "b/Default.bundle", "2.0", {{"sub/b.plist", "b"}});
+    }
+
+    int publish(std::vector<std::string> arguments) {
+        arguments.insert(arguments.begin(), {"publish", work / "out"});
+        ToolRun run = runCatalogTool(arguments);
+        EXPECT_EQ(run.errors.empty(), run.status == 0) << run.errors;
+        return run.status;
+    }
+
+    // Versions listed by the catalog, in order.
+    std::vector<std::string> listedVersions() {
+        std::vector<std::string> versions;
+        std::optional<plist::Value> catalog = plist::readFile(work / "out/catalog.plist");
+        const plist::Value* assets = catalog ? catalog->find("Assets") : nullptr;
+        for (const plist::Value& asset : assets ? *assets->asArray() : plist::Array()) {
+            versions.push_back(*asset.find("Attributes")->find("Version")->asString());
+        }
+        return versions;
+    }
+
+    bool signatureVerifies() {
+        std::string key = readText(work / "public.key");
+        std::optional<std::string> keyBytes = platform::base64Decode(key);
+        platform::CatalogPublicKey publicKey{};
+        if (!keyBytes || keyBytes->size() != publicKey.size()) {
+            return false;
+        }
+        std::copy(keyBytes->begin(), keyBytes->end(), publicKey.begin());
+        return platform::verifyCatalogSignature(readText(work / "out/catalog.plist"),
+                                                readText(work / "out/catalog.plist.sig"),
+                                                publicKey);
+    }
+
+    TempDir work;
+};
+
+TEST_F(CatalogToolTest, PublishingAddsReplacesAndStartsFreshWithAValidSignatureEachTime) {
+    struct stat info {};
+    ASSERT_EQ(::stat((work / "secret.key").c_str(), &info), 0);
+    EXPECT_EQ(info.st_mode & 0777, 0600u);
+
+    ASSERT_EQ(publish({"--key", work / "secret.key", work / "a/Default.bundle"}), 0);
+    ASSERT_EQ(publish({"--key", work / "secret.key", work / "b/Default.bundle"}), 0);
+    EXPECT_EQ(listedVersions(), (std::vector<std::string>{"1.0", "2.0"}));
+    EXPECT_TRUE(signatureVerifies());
+
+    // The same archive name replaces its entry in place.
+    ASSERT_EQ(publish({"--key", work / "secret.key", work / "b/Default.bundle", "--product-type",
+                       "iPhone9,1"}),
+              0);
+    std::optional<plist::Value> catalog = plist::readFile(work / "out/catalog.plist");
+    ASSERT_TRUE(catalog);
+    const plist::Value& replaced = catalog->find("Assets")->asArray()->at(1);
+    EXPECT_EQ(*replaced.find("Attributes")->find("SupportedProductTypes"),
+              plist::Value(plist::Array{plist::Value("iPhone9,1")}));
+    EXPECT_EQ(listedVersions().size(), 2u);
+    EXPECT_TRUE(signatureVerifies());
+
+    ASSERT_EQ(publish({"--unsigned", "--fresh", work / "a/Default.bundle", "--version", "1.1"}), 0);
+    EXPECT_EQ(listedVersions(), (std::vector<std::string>{"1.1"}));
+    EXPECT_FALSE(fs::exists(work / "out/catalog.plist.sig")) << "a stale signature is removed";
+}
+
+TEST_F(CatalogToolTest, MistakesFailClearlyAndChangeNothing) {
+    ASSERT_EQ(publish({"--key", work / "secret.key", work / "a/Default.bundle"}), 0);
+    std::string catalog = readText(work / "out/catalog.plist");
+    std::string secret = readText(work / "secret.key");
+    makeBundle(work / "unversioned", "", {{"x", "x"}});
+
+    struct Case {
+        const char* name;
+        std::vector<std::string> arguments;
+        int status;
+    };
+    std::vector<Case> cases{
+        {"keygen over a secret key", {"keygen", work / "secret.key", work / "other.pub"}, 1},
+        {"no version", {"publish", work / "out", "--unsigned", work / "unversioned"}, 1},
+        {"public key given as secret",
+         {"publish", work / "out", "--key", work / "public.key", work / "a/Default.bundle"},
+         1},
+        {"catalog of another type",
+         {"publish", work / "out", "--unsigned", "--asset-type", "other",
+          work / "a/Default.bundle"},
+         1},
+        {"missing bundle", {"publish", work / "out", "--unsigned", work / "nowhere"}, 1},
+        {"neither key nor unsigned", {"publish", work / "out", work / "a/Default.bundle"}, 2},
+        {"option before its bundle",
+         {"publish", work / "out", "--unsigned", "--version", "1", work / "a/Default.bundle"},
+         2},
+        {"unknown command", {"sign"}, 2},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
+        ToolRun run = runCatalogTool(c.arguments);
+        EXPECT_EQ(run.status, c.status);
+        EXPECT_FALSE(run.errors.empty());
+    }
+    EXPECT_EQ(readText(work / "out/catalog.plist"), catalog);
+    EXPECT_EQ(readText(work / "secret.key"), secret);
+    EXPECT_TRUE(signatureVerifies());
+}
+
+}  // namespace
+}  // namespace tavrix::test
