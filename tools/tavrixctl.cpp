@@ -1,10 +1,12 @@
-// tavrixctl: calls tavrixservicesd from the command line and watches its notifications.
+// tavrixctl: calls tavrixservicesd from the command line, watches its notifications and packs
+// bundle payloads.
 // Results go to stdout plainly; a failure is one line on stderr and exit status 1, a usage
 // mistake exit status 2.
 #include <fcntl.h>
 #include <signal.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <cmath>
@@ -12,6 +14,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <filesystem>
 #include <functional>
 #include <initializer_list>
 #include <limits>
@@ -21,6 +24,7 @@
 #include <vector>
 
 #include "client/TavrixClient.h"
+#include "payload/Archive.h"
 #include "util/UniqueFd.h"
 
 namespace {
@@ -44,6 +48,8 @@ constexpr const char* kOverallHelp =
     "  client-type N              announce this client's type N\n"
     "  watch [--count N] [--timeout SECONDS]\n"
     "                             print the names of posted notifications\n"
+    "  pack DIR -o FILE           pack the files below DIR into a bundle payload FILE\n"
+    "                             (works offline: the daemon is not called)\n"
     "\n"
     "Options:\n"
     "  --address ADDRESS  use the message bus at this D-Bus address instead\n"
@@ -90,6 +96,14 @@ constexpr Command kCommands[] = {
      "interrupted (SIGINT, SIGTERM), after N notifications, or after SECONDS. Exits 1 when\n"
      "the timeout passes before N notifications arrived. \"Watching for notifications\" on\n"
      "stderr means the subscription is in place.\n"},
+    {"pack",
+     "usage: tavrixctl pack DIR -o FILE\n"
+     "\n"
+     "Packs every regular file below DIR, named by its path relative to DIR, into a\n"
+     "gzip-compressed tar archive for 'set-id --bundle'. Together the files may hold at most\n"
+     "10000000 bytes. Each file that cannot be packed (unreadable, or over that limit) is\n"
+     "named on stderr and nothing is written; otherwise FILE is replaced whole. Other kinds\n"
+     "of entries (symbolic links, devices) are named and left out. The daemon is not called.\n"},
 };
 
 // A usage mistake: the reason, reported with exit status 2.
@@ -212,6 +226,106 @@ class Arguments {
     const Command& command_;
     std::vector<std::string> words_;
 };
+
+namespace fs = std::filesystem;
+
+// A regular file to pack: where it is, and its entry name relative to the packed directory.
+struct FileToPack {
+    fs::path path;
+    std::string name;
+};
+
+// Collects the regular files below directory (recursively), naming them relative to it. What
+// cannot be read, or is neither a file nor a directory, goes to problems.
+void collectFiles(const fs::path& directory, const std::string& prefix,
+                  std::vector<FileToPack>& files, std::vector<std::string>& problems) {
+    std::error_code error;
+    fs::directory_iterator entries(directory, error);
+    for (; !error && entries != fs::directory_iterator(); entries.increment(error)) {
+        const fs::path& path = entries->path();
+        const std::string name = prefix + path.filename().string();
+        std::error_code statusError;
+        fs::file_status status = entries->symlink_status(statusError);
+        if (statusError) {
+            problems.push_back(path.string() + ": " + statusError.message());
+        } else if (fs::is_directory(status)) {
+            collectFiles(path, name + "/", files, problems);
+        } else if (fs::is_regular_file(status)) {
+            files.push_back({path, name});
+        } else {
+            std::fprintf(stderr, "tavrixctl: pack: leaving out %s: not a regular file\n",
+                         path.c_str());
+        }
+    }
+    if (error) {
+        problems.push_back(directory.string() + ": " + error.message());
+    }
+}
+
+bool samePath(const fs::path& a, const fs::path& b) {
+    std::error_code error;
+    return fs::weakly_canonical(a, error) == fs::weakly_canonical(b, error) && !error;
+}
+
+int pack(Arguments& arguments) {
+    using tavrix::payload::Archive;
+    auto output = arguments.takeOption("-o");
+    if (!output) {
+        output = arguments.takeOption("--output");
+    }
+    const std::string directory = arguments.operands({"DIR"})[0];
+    if (!output || output->empty()) {
+        throw UsageError{"pack: -o FILE is required"};
+    }
+    std::error_code error;
+    if (!fs::is_directory(directory, error)) {
+        throw Failure{"pack: " + directory + " is not a directory"};
+    }
+
+    std::vector<FileToPack> files;
+    std::vector<std::string> problems;
+    collectFiles(directory, "", files, problems);
+    // A previous result inside the directory is not packed into the next one.
+    std::erase_if(files, [&](const FileToPack& file) { return samePath(file.path, *output); });
+    std::sort(files.begin(), files.end(),
+              [](const FileToPack& a, const FileToPack& b) { return a.name < b.name; });
+
+    auto archive = Archive::initWithArchiveType(tavrix::payload::kArchiveTypeGzip, *output);
+    if (!archive) {
+        throw Failure{"pack: cannot set up the archive writer"};
+    }
+    for (const FileToPack& file : files) {
+        if (archive->addFile(file.path.string(), file.name)) {
+            continue;
+        }
+        std::uint64_t size = Archive::sizeOnDiskForPath(file.path.string());
+        if (archive->uncompressedSize() + size > archive->maxUncompressedSize()) {
+            problems.push_back(file.path.string() + ": " + std::to_string(size) +
+                               " bytes would take the bundle over the " +
+                               std::to_string(archive->maxUncompressedSize()) + "-byte limit");
+        } else {
+            problems.push_back(file.path.string() + ": cannot be read");
+        }
+    }
+    for (const std::string& problem : problems) {
+        std::fprintf(stderr, "tavrixctl: pack: refused %s\n", problem.c_str());
+    }
+    if (!problems.empty()) {
+        throw Failure{"pack: nothing written to " + *output};
+    }
+    if (archive->files().empty()) {
+        throw Failure{"pack: no files below " + directory + "; nothing written to " + *output};
+    }
+    if (!archive->close()) {
+        throw Failure{"pack: cannot finish the archive"};
+    }
+    if (!archive->writeToFile(*output)) {
+        throw Failure{"pack: cannot write " + *output + ": " + std::strerror(errno)};
+    }
+    std::printf("packed %zu files (%u bytes) into %s (%zu bytes)\n", archive->files().size(),
+                archive->uncompressedSize(), output->c_str(), archive->archiveData().size());
+    return 0;
+}
 
 void printBoolean(bool answer) {
     std::printf("%s\n", answer ? "yes" : "no");
@@ -372,6 +486,10 @@ int run(int argc, char** argv) {
         throw UsageError{"--address needs a value"};
     }
     Arguments arguments(*command, std::move(rest));
+    // Packing works on local files only; it needs no bus.
+    if (std::string_view(command->name) == "pack") {
+        return pack(arguments);
+    }
     Action action = parseCommand(*command, arguments);
     TavrixClient client =
         address ? TavrixClient::connectToAddress(*address) : TavrixClient::connectToSystemBus();

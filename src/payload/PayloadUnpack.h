@@ -1,5 +1,5 @@
 // Turning a received bundle payload into files: the staged archive file and its extraction.
-// BundleManager::installBehaviorBundleData (defined with these) drives them.
+// BundleManager::installBehaviorBundleData (in PayloadUnpack.cpp) drives them.
 #pragma once
 
 #include <string>
@@ -18,10 +18,14 @@ bool writeDataToFile(const plist::Data& data, const std::string& path);
 // archives from the network are refused entries that would leave the destination.
 enum class ExtractionSafety { AsArchived, PathSafe };
 
-// Extracts a gzip- or compress-compressed tar or cpio archive into destinationDirectory (created
-// when missing), restoring permissions, times, ACLs and file flags but not owners. True when the
-// archive was read to its end; false when it could not be opened or a header could not be read.
-// Never changes the process's working directory.
+// Extracts a gzip- or compress-compressed tar or cpio archive file into destinationDirectory
+// (created when missing), restoring permissions, times, ACLs and file flags but not owners.
+// Relative entry paths land below destinationDirectory. AsArchived writes absolute and ".." paths
+// where they point; PathSafe refuses those entries (and hard links to such targets), and anything
+// that would be written through a symbolic link, and extracts the rest.
+// True when the archive was read to its end; false when it could not be opened or a header could
+// not be read (entries before the damage stay extracted). archivePath names a file; standard input
+// is never read. Never changes the process's working directory.
 bool extractArchive(const std::string& archivePath, const std::string& destinationDirectory,
                     ExtractionSafety safety = ExtractionSafety::AsArchived);
 

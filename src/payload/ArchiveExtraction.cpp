@@ -1,0 +1,183 @@
+// extractArchive: libarchive's reader feeding its disk writer. Entry paths are prefixed with the
+// destination instead of changing the process-wide working directory, which other threads share.
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "payload/ArchiveHandles.h"
+#include "payload/FileSystemHelper.h"
+#include "payload/PayloadUnpack.h"
+#include "util/Log.h"
+
+namespace tavrix::payload {
+namespace {
+
+constexpr size_t kReadBlockSize = 10240;
+constexpr mode_t kDestinationMode = 0755;
+
+// Permissions, times, ACLs and file flags; owners are not restored and existing files may be
+// replaced.
+constexpr int kRestoredAttributes =
+    ARCHIVE_EXTRACT_PERM | ARCHIVE_EXTRACT_TIME | ARCHIVE_EXTRACT_ACL | ARCHIVE_EXTRACT_FFLAGS;
+static_assert(kRestoredAttributes == 0x66);
+// Never write through a symbolic link or to a path with "..". Absolute paths are refused before
+// the destination is prefixed (after which every path is absolute).
+constexpr int kPathSafetyFlags = ARCHIVE_EXTRACT_SECURE_SYMLINKS | ARCHIVE_EXTRACT_SECURE_NODOTDOT;
+// Archives from the network get no file flags either: an immutable or append-only file would
+// stop the next install from removing the bundle it replaces.
+constexpr int kNetworkArchiveOptions =
+    (kRestoredAttributes & ~ARCHIVE_EXTRACT_FFLAGS) | kPathSafetyFlags;
+
+struct FreeDeleter {
+    void operator()(char* pointer) const { std::free(pointer); }
+};
+
+std::optional<std::string> resolvedPath(const std::string& path) {
+    std::unique_ptr<char, FreeDeleter> resolved(::realpath(path.c_str(), nullptr));
+    if (!resolved) {
+        return std::nullopt;
+    }
+    return std::string(resolved.get());
+}
+
+const char* errorText(archive* handle) {
+    const char* text = archive_error_string(handle);
+    return text != nullptr ? text : "unknown error";
+}
+
+bool hasParentComponent(std::string_view path) {
+    while (!path.empty()) {
+        auto slash = path.find('/');
+        if (path.substr(0, slash) == "..") {
+            return true;
+        }
+        if (slash == std::string_view::npos) {
+            break;
+        }
+        path.remove_prefix(slash + 1);
+    }
+    return false;
+}
+
+bool leavesDestination(std::string_view path) {
+    return path.front() == '/' || hasParentComponent(path);
+}
+
+// Points the entry's path and its hard-link target (when relative) below destination, as if the
+// archive were extracted inside it. False, logged, when the entry must be skipped.
+bool placeEntry(archive_entry* entry, const std::string& destination, ExtractionSafety safety) {
+    const char* name = archive_entry_pathname(entry);
+    if (name == nullptr || name[0] == '\0') {
+        logCFormat("Skipping an archive entry without a usable name\n");
+        return false;
+    }
+    const char* linkTarget = archive_entry_hardlink(entry);
+    if (safety == ExtractionSafety::PathSafe &&
+        (leavesDestination(name) ||
+         (linkTarget != nullptr && linkTarget[0] != '\0' && leavesDestination(linkTarget)))) {
+        logCFormat("Refusing the archive entry %s: it leads outside %s\n", name,
+                   destination.c_str());
+        return false;
+    }
+    if (name[0] != '/') {
+        archive_entry_copy_pathname(entry, (destination + "/" + name).c_str());
+    }
+    if (linkTarget != nullptr && linkTarget[0] != '\0' && linkTarget[0] != '/') {
+        archive_entry_copy_hardlink(entry, (destination + "/" + linkTarget).c_str());
+    }
+    return true;
+}
+
+// Copies the current entry's data block by block (sparse entries keep their holes); stops at the
+// entry's end or at the first failure on either side.
+void copyEntryData(archive* reader, archive* writer) {
+    for (;;) {
+        const void* block = nullptr;
+        size_t size = 0;
+        la_int64_t offset = 0;
+        if (archive_read_data_block(reader, &block, &size, &offset) != ARCHIVE_OK) {
+            return;
+        }
+        if (archive_write_data_block(writer, block, size, offset) != ARCHIVE_OK) {
+            return;
+        }
+    }
+}
+
+}  // namespace
+
+bool extractArchive(const std::string& archivePath, const std::string& destinationDirectory,
+                    ExtractionSafety safety) {
+    // Empty names would mean standard input and the file-system root to libarchive.
+    if (archivePath.empty() || destinationDirectory.empty()) {
+        logCFormat("Cannot extract the archive '%s' into '%s'\n", archivePath.c_str(),
+                   destinationDirectory.c_str());
+        return false;
+    }
+    FileSystemHelper helper;
+    if (!helper.fileExists(destinationDirectory)) {
+        helper.createDirectory(destinationDirectory, kDestinationMode, true);
+    }
+    std::string destination = destinationDirectory;
+    if (safety == ExtractionSafety::PathSafe) {
+        // Symbolic links in the destination itself are the caller's; only those the archive
+        // brings are refused.
+        auto resolved = resolvedPath(destinationDirectory);
+        if (!resolved) {
+            logCFormat("Cannot extract into %s: %s\n", destinationDirectory.c_str(),
+                       std::strerror(errno));
+            return false;
+        }
+        destination = *resolved;
+    }
+
+    ArchiveReader reader(archive_read_new());
+    ArchiveWriter writer(archive_write_disk_new());
+    if (!reader || !writer) {
+        logCFormat("Cannot extract %s: out of memory\n", archivePath.c_str());
+        return false;
+    }
+    archive_write_disk_set_options(writer.get(), safety == ExtractionSafety::PathSafe
+                                                     ? kNetworkArchiveOptions
+                                                     : kRestoredAttributes);
+    archive_read_support_filter_gzip(reader.get());
+    archive_read_support_filter_compress(reader.get());
+    archive_read_support_format_tar(reader.get());
+    archive_read_support_format_cpio(reader.get());
+    archive_write_disk_set_standard_lookup(writer.get());
+
+    if (archive_read_open_filename(reader.get(), archivePath.c_str(), kReadBlockSize) !=
+        ARCHIVE_OK) {
+        logCFormat("Cannot open the archive %s: %s\n", archivePath.c_str(),
+                   errorText(reader.get()));
+        return false;
+    }
+    for (;;) {
+        archive_entry* entry = nullptr;
+        int status = archive_read_next_header(reader.get(), &entry);
+        if (status == ARCHIVE_EOF) {
+            archive_read_close(reader.get());
+            return true;
+        }
+        if (status != ARCHIVE_OK) {
+            logCFormat("Cannot read the archive %s: %s\n", archivePath.c_str(),
+                       errorText(reader.get()));
+            return false;
+        }
+        if (!placeEntry(entry, destination, safety)) {
+            continue;
+        }
+        if (archive_write_header(writer.get(), entry) < ARCHIVE_WARN) {
+            logCFormat("%s", "");
+            continue;
+        }
+        copyEntryData(reader.get(), writer.get());
+        archive_write_finish_entry(writer.get());
+    }
+}
+
+}  // namespace tavrix::payload

@@ -1,0 +1,28 @@
+// Owners of libarchive handles: each handle is wrapped the moment it is created and freed (which
+// also closes it) on every path.
+#pragma once
+
+#include <archive.h>
+#include <archive_entry.h>
+
+#include <memory>
+
+namespace tavrix::payload {
+
+struct ArchiveReadFree {
+    void operator()(archive* handle) const { archive_read_free(handle); }
+};
+struct ArchiveWriteFree {
+    void operator()(archive* handle) const { archive_write_free(handle); }
+};
+struct ArchiveEntryFree {
+    void operator()(archive_entry* entry) const { archive_entry_free(entry); }
+};
+
+// A reader from archive_read_new.
+using ArchiveReader = std::unique_ptr<archive, ArchiveReadFree>;
+// A writer from archive_write_new or archive_write_disk_new.
+using ArchiveWriter = std::unique_ptr<archive, ArchiveWriteFree>;
+using ArchiveEntry = std::unique_ptr<archive_entry, ArchiveEntryFree>;
+
+}  // namespace tavrix::payload

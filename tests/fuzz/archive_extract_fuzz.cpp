@@ -1,0 +1,124 @@
+// Feeds arbitrary bytes to the payload extractor as an archive file, in the mode used for
+// archives from the network, into a fresh directory that is removed afterwards. Whatever the
+// bytes, nothing may be written outside that directory.
+#include <fcntl.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cstddef>
+#include <cstdint>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include "payload/PayloadUnpack.h"
+#include "platform/SystemLog.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+
+// A directory of this process's, on a memory file system when there is one (the extractor's many
+// small files are made and removed far faster there); removed when the process exits.
+class WorkDirectory {
+  public:
+    WorkDirectory() {
+        fs::path base =
+            fs::is_directory("/dev/shm") ? fs::path("/dev/shm") : fs::temp_directory_path();
+        std::string pattern = (base / "archive-extract-fuzz-XXXXXX").string();
+        if (::mkdtemp(pattern.data()) == nullptr) {
+            std::abort();
+        }
+        path_ = pattern;
+    }
+    ~WorkDirectory() {
+        std::error_code error;
+        fs::remove_all(path_, error);
+    }
+    const fs::path& path() const { return path_; }
+
+  private:
+    fs::path path_;
+};
+
+// Undoes what an entry may have set that would stop its removal: file flags such as immutable
+// or append-only, and directories without search or write permission.
+void makeRemovable(const fs::path& path) {
+    struct stat info {};
+    if (::lstat(path.c_str(), &info) != 0 || !(S_ISREG(info.st_mode) || S_ISDIR(info.st_mode))) {
+        return;
+    }
+    int fd = ::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
+    if (fd >= 0) {
+        int flags = 0;
+        ::ioctl(fd, FS_IOC_SETFLAGS, &flags);
+        ::close(fd);
+    }
+    if (S_ISDIR(info.st_mode)) {
+        ::chmod(path.c_str(), 0700);
+        std::error_code error;
+        for (fs::directory_iterator it(path, error), end; !error && it != end;
+             it.increment(error)) {
+            makeRemovable(it->path());
+        }
+    }
+}
+
+// The extractor logs refused entries; a fuzzing run would drown in them.
+class DiscardingLogSink : public tavrix::platform::LogSink {
+  public:
+    void write(int, std::string_view) override {}
+};
+
+}  // namespace
+
+// libarchive 3.6's cpio reader reserves a buffer as large as a header's declared name length (up
+// to 4 GiB) before it knows the input is that long; only the input's own bytes are ever written
+// to it. Such a reservation is the library's, not a fault of the extractor, so single allocations
+// may be that large here; the limit on memory actually used still applies.
+extern "C" int LLVMFuzzerInitialize(int* argc, char*** argv) {
+    static std::vector<char*> arguments(*argv, *argv + *argc);
+    static std::string mallocLimit = "-malloc_limit_mb=10240";
+    for (char* argument : arguments) {
+        if (std::string_view(argument).starts_with("-malloc_limit_mb=")) {
+            return 0;
+        }
+    }
+    arguments.push_back(mallocLimit.data());
+    *argc = static_cast<int>(arguments.size());
+    arguments.push_back(nullptr);
+    *argv = arguments.data();
+    return 0;
+}
+
+extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
+    static DiscardingLogSink sink;
+    static tavrix::platform::ScopedLogSink quiet(sink);
+    static WorkDirectory workDirectory;
+    const fs::path& work = workDirectory.path();
+    const fs::path archivePath = work / "payload";
+    // Two levels down, so that entries climbing out with ".." are seen in the levels above.
+    const fs::path levels = work / "level";
+    const fs::path destination = levels / "destination";
+    {
+        std::ofstream out(archivePath, std::ofstream::binary | std::ofstream::trunc);
+        out.write(reinterpret_cast<const char*>(data), static_cast<std::streamsize>(size));
+    }
+    tavrix::payload::extractArchive(archivePath, destination,
+                                    tavrix::payload::ExtractionSafety::PathSafe);
+    makeRemovable(destination);
+    std::error_code error;
+    fs::remove_all(destination, error);
+    // Anything left besides the payload and the emptied level means an entry escaped.
+    for (const auto& entry : fs::recursive_directory_iterator(work)) {
+        if (entry.path() != archivePath && entry.path() != levels) {
+            std::abort();
+        }
+    }
+    return 0;
+}

@@ -1,0 +1,180 @@
+// Archives made and read in the tests with libarchive itself, so that the unpacker is checked
+// against the real formats rather than against bytes of our own making.
+#pragma once
+
+#include <archive.h>
+#include <archive_entry.h>
+#include <sys/stat.h>
+
+#include <cstdint>
+#include <ctime>
+#include <random>
+#include <stdexcept>
+#include <string>
+#include <vector>
+
+#include "payload/ArchiveHandles.h"
+
+namespace tavrix::test {
+
+enum class Container { Tar, Cpio };
+enum class Compression { Gzip, Compress, Bzip2 };
+
+struct ArchiveItem {
+    enum class Kind { File, Directory, Symlink, Hardlink };
+    Kind kind = Kind::File;
+    std::string path;
+    std::string content;
+    mode_t mode = 0644;
+    std::time_t mtime = 1500000000;
+    // The target of a symbolic or hard link.
+    std::string linkTarget;
+};
+
+inline ArchiveItem fileItem(std::string path, std::string content, mode_t mode = 0644,
+                            std::time_t mtime = 1500000000) {
+    return {ArchiveItem::Kind::File, std::move(path), std::move(content), mode, mtime, {}};
+}
+inline ArchiveItem directoryItem(std::string path, mode_t mode = 0755,
+                                 std::time_t mtime = 1500000000) {
+    return {ArchiveItem::Kind::Directory, std::move(path), {}, mode, mtime, {}};
+}
+inline ArchiveItem symlinkItem(std::string path, std::string target) {
+    return {ArchiveItem::Kind::Symlink, std::move(path), {}, 0777, 1500000000, std::move(target)};
+}
+inline ArchiveItem hardlinkItem(std::string path, std::string target) {
+    return {ArchiveItem::Kind::Hardlink, std::move(path), {}, 0644, 1500000000, std::move(target)};
+}
+
+// Bytes that do not compress.
+inline std::string randomBytes(std::size_t size, unsigned seed) {
+    std::mt19937 generator(seed);
+    std::string bytes(size, '\0');
+    for (char& byte : bytes) {
+        byte = static_cast<char>(generator());
+    }
+    return bytes;
+}
+
+// The archive holding items, in order, as a file's bytes.
+inline std::string buildArchive(Container container, Compression compression,
+                                const std::vector<ArchiveItem>& items) {
+    payload::ArchiveWriter writer(archive_write_new());
+    archive* handle = writer.get();
+    if (container == Container::Tar) {
+        archive_write_set_format_pax_restricted(handle);
+    } else {
+        archive_write_set_format_cpio_newc(handle);
+    }
+    switch (compression) {
+        case Compression::Gzip:
+            archive_write_add_filter_gzip(handle);
+            break;
+        case Compression::Compress:
+            archive_write_add_filter_compress(handle);
+            break;
+        case Compression::Bzip2:
+            archive_write_add_filter_bzip2(handle);
+            break;
+    }
+    std::string bytes;
+    auto write = [](archive*, void* out, const void* buffer, size_t length) -> la_ssize_t {
+        static_cast<std::string*>(out)->append(static_cast<const char*>(buffer), length);
+        return static_cast<la_ssize_t>(length);
+    };
+    if (archive_write_open(handle, &bytes, nullptr, write, nullptr) != ARCHIVE_OK) {
+        throw std::runtime_error(archive_error_string(handle));
+    }
+    for (const ArchiveItem& item : items) {
+        payload::ArchiveEntry entry(archive_entry_new());
+        archive_entry_copy_pathname(entry.get(), item.path.c_str());
+        archive_entry_set_perm(entry.get(), item.mode);
+        archive_entry_set_mtime(entry.get(), item.mtime, 0);
+        // cpio wants a size on every entry; a symbolic link's is its target's length.
+        archive_entry_set_size(entry.get(), 0);
+        switch (item.kind) {
+            case ArchiveItem::Kind::File:
+                archive_entry_set_filetype(entry.get(), AE_IFREG);
+                archive_entry_set_size(entry.get(), static_cast<la_int64_t>(item.content.size()));
+                break;
+            case ArchiveItem::Kind::Directory:
+                archive_entry_set_filetype(entry.get(), AE_IFDIR);
+                break;
+            case ArchiveItem::Kind::Symlink:
+                archive_entry_set_filetype(entry.get(), AE_IFLNK);
+                archive_entry_copy_symlink(entry.get(), item.linkTarget.c_str());
+                archive_entry_set_size(entry.get(),
+                                       static_cast<la_int64_t>(item.linkTarget.size()));
+                break;
+            case ArchiveItem::Kind::Hardlink:
+                archive_entry_set_filetype(entry.get(), AE_IFREG);
+                archive_entry_copy_hardlink(entry.get(), item.linkTarget.c_str());
+                break;
+        }
+        if (archive_write_header(handle, entry.get()) != ARCHIVE_OK) {
+            throw std::runtime_error(archive_error_string(handle));
+        }
+        if (!item.content.empty()) {
+            archive_write_data(handle, item.content.data(), item.content.size());
+        }
+    }
+    archive_write_close(handle);
+    return bytes;
+}
+
+// One entry of an archive as libarchive reads it back.
+struct ReadEntry {
+    std::string path;
+    mode_t type = 0;
+    mode_t permissions = 0;
+    std::int64_t size = 0;
+    std::time_t mtime = 0;
+    bool hasOwnerNames = false;
+    std::int64_t uid = 0;
+    std::string content;
+};
+
+struct ReadArchive {
+    // The first filter's code (ARCHIVE_FILTER_GZIP, ...) and the format code.
+    int filter = 0;
+    int format = 0;
+    std::vector<ReadEntry> entries;
+};
+
+// Every entry of an archive given as bytes, compressed by any filter libarchive knows.
+inline ReadArchive readArchive(const void* bytes, std::size_t size) {
+    payload::ArchiveReader reader(archive_read_new());
+    archive_read_support_filter_all(reader.get());
+    archive_read_support_format_all(reader.get());
+    if (archive_read_open_memory(reader.get(), bytes, size) != ARCHIVE_OK) {
+        throw std::runtime_error(archive_error_string(reader.get()));
+    }
+    ReadArchive result;
+    archive_entry* entry = nullptr;
+    int status = ARCHIVE_OK;
+    while ((status = archive_read_next_header(reader.get(), &entry)) == ARCHIVE_OK) {
+        ReadEntry read;
+        read.path = archive_entry_pathname(entry);
+        read.type = archive_entry_filetype(entry);
+        read.permissions = archive_entry_perm(entry);
+        read.size = archive_entry_size(entry);
+        read.mtime = archive_entry_mtime(entry);
+        auto present = [](const char* name) { return name != nullptr && name[0] != '\0'; };
+        read.hasOwnerNames =
+            present(archive_entry_uname(entry)) || present(archive_entry_gname(entry));
+        read.uid = archive_entry_uid(entry);
+        read.content.resize(static_cast<std::size_t>(read.size));
+        if (read.size > 0) {
+            archive_read_data(reader.get(), read.content.data(), read.content.size());
+        }
+        result.entries.push_back(std::move(read));
+    }
+    if (status != ARCHIVE_EOF) {
+        throw std::runtime_error(archive_error_string(reader.get()));
+    }
+    result.filter = archive_filter_code(reader.get(), 0);
+    result.format = archive_format(reader.get());
+    return result;
+}
+
+}  // namespace tavrix::test

@@ -1,0 +1,283 @@
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <map>
+
+#include "ArchiveFixtures.h"
+#include "TestSupport.h"
+#include "UnitTestRoot.h"
+#include "bundle/BundleLocations.h"
+#include "bundle/BundleManager.h"
+#include "payload/PayloadUnpack.h"
+#include "platform/SystemLog.h"
+
+namespace tavrix::payload {
+namespace {
+
+namespace fs = std::filesystem;
+using test::ArchiveItem;
+using test::buildArchive;
+using test::Compression;
+using test::Container;
+using test::randomBytes;
+using test::readText;
+using test::TempDir;
+using test::writeText;
+using Tree = std::map<std::string, std::string>;
+
+// Every entry below root: directories as "/", links as "-> target", files by their content.
+Tree snapshot(const fs::path& root) {
+    Tree tree;
+    if (!fs::exists(fs::symlink_status(root))) {
+        return tree;
+    }
+    for (const auto& entry : fs::recursive_directory_iterator(root)) {
+        std::string relative = entry.path().lexically_relative(root).string();
+        if (entry.is_symlink()) {
+            tree[relative] = "-> " + fs::read_symlink(entry.path()).string();
+        } else if (entry.is_directory()) {
+            tree[relative] = "/";
+        } else {
+            tree[relative] = readText(entry.path().string());
+        }
+    }
+    return tree;
+}
+
+struct stat statOf(const std::string& path) {
+    struct stat info {};
+    EXPECT_EQ(::lstat(path.c_str(), &info), 0) << path;
+    return info;
+}
+
+std::string currentDirectory() {
+    return fs::current_path().string();
+}
+
+class PayloadExtraction : public testing::Test {
+  protected:
+    TempDir dir;
+    std::string destination = dir / "dest";
+    platform::CapturingLogSink log;
+    platform::ScopedLogSink logGuard{log};
+
+    // Writes bytes as the archive file and extracts it into destination.
+    bool extract(const std::string& bytes, ExtractionSafety safety = ExtractionSafety::AsArchived) {
+        writeText(dir / "payload", bytes);
+        return extractArchive(dir / "payload", destination, safety);
+    }
+};
+
+struct FormatCase {
+    const char* name;
+    Container container;
+    Compression compression;
+    friend void PrintTo(const FormatCase& c, std::ostream* out) { *out << c.name; }
+};
+
+class PayloadFormats : public PayloadExtraction, public testing::WithParamInterface<FormatCase> {};
+
+// Every format a sender may use unpacks to the same layout, bytes, modes and times, and the
+// process's working directory is left alone.
+TEST_P(PayloadFormats, ExtractLayoutBytesModesAndTimes) {
+    const std::string binary = randomBytes(70000, 7);
+    const std::string before = currentDirectory();
+    ASSERT_TRUE(extract(buildArchive(GetParam().container, GetParam().compression,
+                                     {
+                                         test::directoryItem("sub", 0750, 1400000000),
+                                         test::fileItem("sub/data.bin", binary, 0600, 1300000000),
+                                         test::fileItem("Info.plist", "<plist/>", 0644),
+                                         test::fileItem("run.sh", "#!/bin/sh\n", 0755),
+                                         test::fileItem("deep/er/empty", "", 0640),
+                                         test::symlinkItem("link", "Info.plist"),
+                                     })));
+
+    EXPECT_EQ(snapshot(destination), (Tree{{"sub", "/"},
+                                           {"sub/data.bin", binary},
+                                           {"Info.plist", "<plist/>"},
+                                           {"run.sh", "#!/bin/sh\n"},
+                                           {"deep", "/"},
+                                           {"deep/er", "/"},
+                                           {"deep/er/empty", ""},
+                                           {"link", "-> Info.plist"}}));
+    EXPECT_EQ(statOf(dir / "dest/sub/data.bin").st_mode & 07777, 0600u);
+    EXPECT_EQ(statOf(dir / "dest/sub/data.bin").st_mtime, 1300000000);
+    EXPECT_EQ(statOf(dir / "dest/run.sh").st_mode & 07777, 0755u);
+    EXPECT_EQ(statOf(dir / "dest/deep/er/empty").st_mode & 07777, 0640u);
+    // Directory times are restored after their contents were written.
+    EXPECT_EQ(statOf(dir / "dest/sub").st_mode & 07777, 0750u);
+    EXPECT_EQ(statOf(dir / "dest/sub").st_mtime, 1400000000);
+    EXPECT_EQ(currentDirectory(), before);
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    SenderFormats, PayloadFormats,
+    testing::Values(FormatCase{"TarGzip", Container::Tar, Compression::Gzip},
+                    FormatCase{"CpioGzip", Container::Cpio, Compression::Gzip},
+                    FormatCase{"TarCompress", Container::Tar, Compression::Compress},
+                    FormatCase{"CpioCompress", Container::Cpio, Compression::Compress}),
+    [](const testing::TestParamInfo<FormatCase>& info) { return std::string(info.param.name); });
+
+// Bytes that are no readable archive answer false and leave an empty destination behind, and the
+// working directory where it was.
+TEST_F(PayloadExtraction, UnreadablePayloadsAnswerFalseWithAnEmptyDestination) {
+    const std::string before = currentDirectory();
+    const std::map<std::string, std::string> payloads = {
+        {"empty", ""},
+        {"not an archive", "this is plainly not an archive\n" + randomBytes(3000, 1)},
+        {"bzip2",
+         buildArchive(Container::Tar, Compression::Bzip2, {test::fileItem("Info.plist", "x")})},
+        {"gzip of no archive",
+         "\x1f\x8b\x08\x00\x00\x00\x00\x00\x00\x03\x03\x00\x00\x00\x00\x00"
+         "\x00\x00\x00\x00"},
+    };
+    for (const auto& [name, bytes] : payloads) {
+        SCOPED_TRACE(name);
+        fs::remove_all(destination);
+        EXPECT_FALSE(extract(bytes));
+        EXPECT_TRUE(fs::is_directory(destination));
+        EXPECT_TRUE(fs::is_empty(destination));
+    }
+    EXPECT_FALSE(extractArchive(dir / "missing.tgz", destination));
+    EXPECT_EQ(currentDirectory(), before);
+}
+
+// Damage part way keeps what came before it; the answer is false.
+TEST_F(PayloadExtraction, TruncatedArchiveKeepsTheEntriesBeforeTheDamage) {
+    const std::string large = randomBytes(300000, 3);
+    std::string bytes =
+        buildArchive(Container::Tar, Compression::Gzip,
+                     {test::fileItem("first.txt", "first"), test::fileItem("large.bin", large),
+                      test::fileItem("last.txt", "last")});
+    bytes.resize(bytes.size() / 2);
+
+    EXPECT_FALSE(extract(bytes));
+    EXPECT_EQ(readText(dir / "dest/first.txt"), "first");
+    EXPECT_FALSE(fs::exists(dir / "dest/last.txt"));
+}
+
+// An entry that cannot be created logs an empty line; the others are still extracted.
+TEST_F(PayloadExtraction, EntryThatCannotBeCreatedIsSkipped) {
+    EXPECT_TRUE(extract(buildArchive(
+        Container::Tar, Compression::Gzip,
+        {test::fileItem("before.txt", "before"), test::hardlinkItem("orphan", "no-such-target"),
+         test::fileItem("after.txt", "after")})));
+    EXPECT_EQ(snapshot(destination), (Tree{{"before.txt", "before"}, {"after.txt", "after"}}));
+    EXPECT_TRUE(log.contains(""));
+}
+
+// The client's own payload is written where its entries point, outside the destination too.
+TEST_F(PayloadExtraction, AsArchivedWritesEscapingEntriesWhereTheyPoint) {
+    const std::string absolute = dir / "absolute/placed.txt";
+    EXPECT_TRUE(extract(buildArchive(
+        Container::Tar, Compression::Gzip,
+        {test::fileItem("../beside.txt", "beside"), test::fileItem(absolute, "absolute"),
+         test::fileItem("inside.txt", "inside"), test::hardlinkItem("linked.txt", "inside.txt")})));
+    EXPECT_EQ(readText(dir / "beside.txt"), "beside");
+    EXPECT_EQ(readText(absolute), "absolute");
+    EXPECT_EQ(readText(dir / "dest/linked.txt"), "inside");
+    EXPECT_EQ(statOf(dir / "dest/linked.txt").st_ino, statOf(dir / "dest/inside.txt").st_ino);
+}
+
+// Network archives never reach outside their destination: not by "..", an absolute path, a
+// hard link to such a path, or a symbolic link the archive itself brings. The rest extracts.
+TEST_F(PayloadExtraction, PathSafeRefusesEntriesLeavingTheDestination) {
+    const std::string outside = dir / "outside";
+    fs::create_directories(outside);
+    writeText(outside + "/secret", "secret");
+
+    EXPECT_TRUE(extract(buildArchive(Container::Tar, Compression::Gzip,
+                                     {
+                                         test::fileItem("../beside.txt", "beside"),
+                                         test::fileItem("sub/../../up.txt", "up"),
+                                         test::fileItem(outside + "/absolute.txt", "absolute"),
+                                         test::hardlinkItem("hard", "../outside/secret"),
+                                         test::hardlinkItem("hard2", outside + "/secret"),
+                                         test::symlinkItem("escape", outside),
+                                         test::fileItem("escape/through.txt", "through"),
+                                         test::fileItem("inside.txt", "inside"),
+                                     }),
+                        ExtractionSafety::PathSafe));
+
+    EXPECT_EQ(snapshot(outside), (Tree{{"secret", "secret"}}));
+    EXPECT_FALSE(fs::exists(dir / "beside.txt"));
+    EXPECT_FALSE(fs::exists(dir / "up.txt"));
+    EXPECT_EQ(snapshot(destination), (Tree{{"escape", "-> " + outside}, {"inside.txt", "inside"}}));
+    EXPECT_TRUE(log.contains("Refusing the archive entry ../beside.txt: it leads outside " +
+                             fs::canonical(destination).string() + "\n"));
+}
+
+// A destination reached through a symbolic link of the caller's is fine in PathSafe mode.
+TEST_F(PayloadExtraction, PathSafeFollowsSymbolicLinksInTheDestinationItself) {
+    fs::create_directories(dir / "real");
+    fs::create_directory_symlink(dir / "real", dir / "via");
+    destination = dir / "via/bundle";
+    EXPECT_TRUE(
+        extract(buildArchive(Container::Cpio, Compression::Gzip, {test::fileItem("a/b.txt", "b")}),
+                ExtractionSafety::PathSafe));
+    EXPECT_EQ(readText(dir / "real/bundle/a/b.txt"), "b");
+}
+
+class BundleInstall : public testing::Test {
+  protected:
+    platform::CapturingLogSink log;
+    platform::ScopedLogSink logGuard{log};
+    const fs::path root = test::unitTestRoot();
+    const fs::path bundle = root / "var/mobile/Library/TavrixBundles/Default.bundle";
+    const fs::path staged = root / "tmp/behaviorbundle_zipped.tgz";
+
+    void install(const std::string& bytes) {
+        BundleManager::sharedInstance().installBehaviorBundleData(
+            plist::Data(bytes.begin(), bytes.end()));
+    }
+};
+
+// Each payload replaces the user bundle completely and the staged file is gone afterwards.
+TEST_F(BundleInstall, EachPayloadReplacesTheUserBundle) {
+    ASSERT_EQ(userBundleLocation(), bundle.string());
+    log.clear();
+    const std::string first = buildArchive(
+        Container::Tar, Compression::Gzip,
+        {test::fileItem("Info.plist", "one"), test::fileItem("Overlay/old.plist", "old")});
+    install(first);
+    EXPECT_EQ(snapshot(bundle),
+              (Tree{{"Info.plist", "one"}, {"Overlay", "/"}, {"Overlay/old.plist", "old"}}));
+    EXPECT_EQ(log.messages(),
+              (std::vector<std::string>{
+                  "Behavior bundle data is received " + std::to_string(first.size()) + "\n",
+                  "Writing the zipped file into: /tmp/behaviorbundle_zipped.tgz\n",
+                  "Successfully wrote the KW Data to file: " + staged.string() + "\n"}));
+    EXPECT_FALSE(fs::exists(staged));
+
+    install(buildArchive(Container::Cpio, Compression::Compress,
+                         {test::fileItem("Info.plist", "two")}));
+    EXPECT_EQ(snapshot(bundle), (Tree{{"Info.plist", "two"}}));
+
+    // An empty payload still removes the old bundle and leaves an empty one.
+    install("");
+    EXPECT_TRUE(fs::is_directory(bundle));
+    EXPECT_TRUE(fs::is_empty(bundle));
+    EXPECT_FALSE(fs::exists(staged));
+}
+
+TEST(WriteDataToFile, ReplacesTheFileAndLogsEitherWay) {
+    platform::CapturingLogSink log;
+    platform::ScopedLogSink logGuard{log};
+    TempDir dir;
+    const std::string path = dir / "staged.tgz";
+    writeText(path, "older and longer content");
+    EXPECT_TRUE(writeDataToFile(plist::Data{'n', 'e', 'w'}, path));
+    EXPECT_EQ(readText(path), "new");
+    EXPECT_TRUE(log.contains("Successfully wrote the KW Data to file: " + path + "\n"));
+    // Nothing but the file itself is left in the directory.
+    EXPECT_EQ(snapshot(dir.path()), (Tree{{"staged.tgz", "new"}}));
+
+    const std::string unwritable = dir / "missing/staged.tgz";
+    EXPECT_TRUE(writeDataToFile(plist::Data{'x'}, unwritable));
+    EXPECT_TRUE(log.contains("Failed to write the zipped file: " + unwritable + "\n"));
+}
+
+}  // namespace
+}  // namespace tavrix::payload
