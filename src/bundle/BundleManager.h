@@ -1,8 +1,9 @@
 // The bundle manager: knows which behavior bundle the device uses, installs received bundle
-// payloads and redoes the bundle match for a behavior ID. It has no lock: callers must not
-// overlap (they run on the main thread or on the update scheduler's queue).
+// payloads and redoes the bundle match for a behavior ID. Callers that change the bundles hold
+// operationLock() so that they never overlap.
 #pragma once
 
+#include <mutex>
 #include <optional>
 #include <string>
 
@@ -40,6 +41,11 @@ class BundleManager {
     BundleChangeType compareBundles(const CarrierBundle& current,
                                     const CarrierBundle& matched) const;
 
+    // Held by each caller across a change of the bundles (a client's payload and bundle match, an
+    // over-the-air install and its match), which may come from the main thread and the update
+    // download's thread at once.
+    std::recursive_mutex& operationLock() { return operationLock_; }
+
     // The bundle and carrier file linked now.
     const CarrierBundle& currentBundle() const { return currentBundle_; }
     const std::string& bundleLinkPath() const { return bundleLinkPath_; }
@@ -52,6 +58,7 @@ class BundleManager {
     std::string bundleLinkPath_;
     std::string preferencesLinkPath_;
     CarrierBundle currentBundle_;
+    std::recursive_mutex operationLock_;
 };
 
 }  // namespace tavrix

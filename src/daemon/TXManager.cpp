@@ -2,6 +2,7 @@
 
 #include <algorithm>
 #include <cctype>
+#include <mutex>
 
 #include "bundle/BundleManager.h"
 #include "daemon/BehaviorPreferences.h"
@@ -33,7 +34,9 @@ TXManager& TXManager::sharedInstance() {
         if (stored && stored->isString()) {
             logCFormat("Behavior ID %s is already sent, redoing bundle match\n",
                        stored->asString()->c_str());
-            BundleManager::sharedInstance().resetBehaviorBundle(*stored->asString());
+            BundleManager& bundles = BundleManager::sharedInstance();
+            std::lock_guard lock(bundles.operationLock());
+            bundles.resetBehaviorBundle(*stored->asString());
         }
         return created;
     }();
@@ -47,12 +50,16 @@ bool TXManager::setTavrixID(const std::string& tavrixID, const std::optional<pli
     }
     std::string lowered = lowerCased(tavrixID);
     setBehaviorPreference(kTavrixIDKey, plist::Value(lowered));
-    if (bundle) {
-        BundleManager::sharedInstance().installBehaviorBundleData(*bundle);
-    } else {
-        logObjectFormat("No bundle data given");
+    BundleManager& bundles = BundleManager::sharedInstance();
+    {
+        std::lock_guard lock(bundles.operationLock());
+        if (bundle) {
+            bundles.installBehaviorBundleData(*bundle);
+        } else {
+            logObjectFormat("No bundle data given");
+        }
+        bundles.resetBehaviorBundle(lowered);
     }
-    BundleManager::sharedInstance().resetBehaviorBundle(lowered);
     UpdateCheckScheduler::sharedInstance().startTimer();
     return true;
 }

@@ -1,6 +1,7 @@
 #include "update/AssetHandler.h"
 
 #include <algorithm>
+#include <mutex>
 #include <string>
 
 #include "bundle/BundleLocations.h"
@@ -177,6 +178,8 @@ void AssetHandler::installDownloadedBundle(const std::string& source) {
         logCFormat("The mobile user's home directory is unknown, not installing the bundle\n");
         return;
     }
+    BundleManager& bundles = BundleManager::sharedInstance();
+    std::lock_guard lock(bundles.operationLock());
     {
         payload::FileSystemHelper files;
         logCFormat("Removing the directory %s\n", destination.c_str());
@@ -201,7 +204,7 @@ void AssetHandler::installDownloadedBundle(const std::string& source) {
     }
     logCFormat("Behavior ID %s is already sent, redoing bundle match\n",
                behaviorID->asString()->c_str());
-    BundleManager::sharedInstance().resetBehaviorBundle(*behaviorID->asString());
+    bundles.resetBehaviorBundle(*behaviorID->asString());
 }
 
 }  // namespace tavrix
