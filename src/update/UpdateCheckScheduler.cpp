@@ -1,15 +1,102 @@
 #include "update/UpdateCheckScheduler.h"
 
+#include "daemon/BehaviorPreferences.h"
+#include "daemon/TXManager.h"
+#include "daemon/TXTransactionManager.h"
+#include "platform/Clock.h"
+#include "util/Log.h"
+
 namespace tavrix {
 
 UpdateCheckScheduler& UpdateCheckScheduler::sharedInstance() {
+    // Never destroyed: the download path may call in while the process exits.
     static UpdateCheckScheduler* scheduler = new UpdateCheckScheduler();
     return *scheduler;
 }
 
-// Over-the-air checks are not part of the daemon yet: the scheduler has no timer to arm.
-UpdateCheckScheduler::UpdateCheckScheduler() = default;
+UpdateCheckScheduler::UpdateCheckScheduler() : _schedulerQueue(kUpdateCheckQueueLabel) {
+    logObjectFormat("Initializing Timers Manager");
+    // Created on the queue: a job due at launch is queued by the binding's constructor, and so
+    // reaches onJobFired only once the binding is in place.
+    _schedulerQueue.dispatchSync([this] {
+        _jobScheduler.emplace(kUpdateCheckClientName, _schedulerQueue,
+                              [this](const std::string& jobName, const plist::Dictionary* job) {
+                                  onJobFired(jobName, job);
+                              });
+    });
+    startTimer();
+}
 
-void UpdateCheckScheduler::startTimer() {}
+void UpdateCheckScheduler::startTimer() {
+    if (!TXManager::sharedInstance().isTavrixBundleSupported()) {
+        // A job registered earlier stays: it finds the device unsupported when it fires.
+        logObjectFormat("Behavior bundle is not supported, not starting the update check timer");
+        return;
+    }
+    auto stored = copyBehaviorPreference(kNextUpdateKey);
+    const plist::Date* nextUpdate = stored ? stored->asDate() : nullptr;
+    if (nextUpdate == nullptr) {
+        logObjectFormat("No previous update time in the preferences list");
+        setUpNewTimer(kUpdateCheckIntervalSeconds);
+    } else if (nextUpdate->secondsSinceReferenceDate < platform::Clock::absoluteTimeNow()) {
+        // A missed check is not run now but pushed a whole interval ahead.
+        logObjectFormat("Previous update time present is past, resetting it");
+        setUpNewTimer(kUpdateCheckIntervalSeconds);
+    } else {
+        scheduleJob();
+    }
+}
+
+void UpdateCheckScheduler::setUpNewTimer(double seconds) {
+    std::lock_guard lock(_rearmLock);
+    logObjectFormat("Setting up a new update check timer");
+    plist::Date nextUpdate{platform::Clock::absoluteTimeNow() + seconds};
+    setBehaviorPreference(kNextUpdateKey, plist::Value(nextUpdate));
+    scheduleJob();
+}
+
+void UpdateCheckScheduler::scheduleJob() {
+    std::lock_guard lock(_rearmLock);
+    auto stored = copyBehaviorPreference(kNextUpdateKey);
+    const plist::Date* nextUpdate = stored ? stored->asDate() : nullptr;
+    if (nextUpdate == nullptr) {
+        logObjectFormat(
+            "No update time in the preferences list, the update check is not scheduled");
+        return;
+    }
+    const double start = nextUpdate->secondsSinceReferenceDate;
+    plist::Dictionary criteria{
+        {std::string(platform::kJobWindowStartDate), start},
+        {std::string(platform::kJobWindowEndDate), start + kUpdateCheckWindowSeconds},
+        {std::string(platform::kJobPowerOptimizationLevel), plist::Integer(1)},
+        {std::string(platform::kJobAllowedDuringVoiceCall), true},
+    };
+    // Removed first, so that at most one such job exists.
+    _jobScheduler->removeJob(kUpdateCheckJobName);
+    _jobScheduler->addJob(kUpdateCheckJobName, criteria);
+}
+
+void UpdateCheckScheduler::onJobFired(const std::string& /*jobName*/,
+                                      const plist::Dictionary* job) {
+    auto& transactions = TXTransactionManager::sharedInstance();
+    // Keep-alive, so that the daemon stays for the download that may follow.
+    transactions.beginTransaction(TXUpdateCheckTransaction, true);
+    if (job == nullptr) {
+        logObjectFormat("Invalid Corvex job object received in the call back");
+    } else if (TXManager::sharedInstance().checkForTavrixBundleUpdate()) {
+        // The download path ends the transaction through rescheduleAndEndCheck.
+        return;
+    }
+    logObjectFormat("Update check has failed, rescheduling the next update");
+    setUpNewTimer(kUpdateCheckIntervalSeconds);
+    // Ended twice, as this path always has; the second end finds the name closed and does nothing.
+    transactions.endTransaction(TXUpdateCheckTransaction);
+    transactions.endTransaction(TXUpdateCheckTransaction);
+}
+
+void UpdateCheckScheduler::rescheduleAndEndCheck(double seconds) {
+    setUpNewTimer(seconds);
+    TXTransactionManager::sharedInstance().endTransaction(TXUpdateCheckTransaction);
+}
 
 }  // namespace tavrix

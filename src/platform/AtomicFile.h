@@ -1,0 +1,16 @@
+// Replacing a file in one step: readers see either the old file or the new one whole, and after
+// a crash or power loss the file is one of the two, never a mix.
+#pragma once
+
+#include <sys/types.h>
+
+#include <string>
+#include <string_view>
+
+namespace tavrix::platform {
+
+// Writes bytes to a temporary file beside path, flushes it to disk, gives it mode and renames it
+// over path. Answers 0, or the errno of the step that failed (nothing is left behind then).
+int replaceFileAtomically(const std::string& path, std::string_view bytes, mode_t mode);
+
+}  // namespace tavrix::platform
