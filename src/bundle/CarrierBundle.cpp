@@ -12,9 +12,11 @@ void CarrierBundle::reset() {
 }
 
 void CarrierBundle::resetWithPath(const std::string& path) {
+    // path may be this record's own bundlePath, which reset() empties.
+    std::string kept = path;
     reset();
-    bundlePath = path;
-    bundleRealPath = realPathOf(path);
+    bundlePath = std::move(kept);
+    bundleRealPath = realPathOf(bundlePath);
     bundleVersion = bundleInfoValueText(copyBundleVersionAtPath(bundlePath));
 }
 

@@ -9,8 +9,8 @@
 #include <limits>
 #include <new>
 
-#include "payload/AtomicFile.h"
 #include "payload/FileSystemHelper.h"
+#include "platform/AtomicFile.h"
 #include "util/Log.h"
 #include "util/UniqueFd.h"
 
@@ -232,7 +232,7 @@ bool Archive::close() {
 }
 
 bool Archive::writeToFile(const std::string& path) const {
-    return writeFileAtomically(path, archiveData_.data(), archiveData_.size(), kArchiveFileMode);
+    return platform::replaceFileAtomically(path, archiveData_, kArchiveFileMode) == 0;
 }
 
 std::uint64_t Archive::sizeOnDiskForPath(const std::string& path) {

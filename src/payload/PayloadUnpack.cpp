@@ -4,8 +4,8 @@
 
 #include "bundle/BundleLocations.h"
 #include "bundle/BundleManager.h"
-#include "payload/AtomicFile.h"
 #include "payload/FileSystemHelper.h"
+#include "platform/AtomicFile.h"
 #include "platform/PlatformRoot.h"
 #include "util/Log.h"
 
@@ -18,7 +18,7 @@ constexpr mode_t kStagedFileMode = 0600;
 constexpr mode_t kTemporaryDirectoryMode = 01777;
 
 bool writeDataToFile(const plist::Data& data, const std::string& path) {
-    if (writeFileAtomically(path, data.data(), data.size(), kStagedFileMode)) {
+    if (platform::replaceFileAtomically(path, data, kStagedFileMode) == 0) {
         logCFormat("Successfully wrote the KW Data to file: %s\n", path.c_str());
     } else {
         logCFormat("Failed to write the zipped file: %s\n", path.c_str());

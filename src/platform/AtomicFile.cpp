@@ -1,6 +1,7 @@
 #include "platform/AtomicFile.h"
 
 #include <fcntl.h>
+#include <stdio.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -52,11 +53,29 @@ class TemporaryPath {
     std::string path_;
 };
 
-}  // namespace
+// A rename that fails with EEXIST instead of replacing; file systems without that flag get a
+// plain rename after checking that nothing is there.
+int renameWithoutReplacing(const std::string& from, const std::string& to) {
+    if (::renameat2(AT_FDCWD, from.c_str(), AT_FDCWD, to.c_str(), RENAME_NOREPLACE) == 0) {
+        return 0;
+    }
+    if (errno != EINVAL && errno != ENOSYS) {
+        return errno;
+    }
+    struct stat existing {};
+    if (::lstat(to.c_str(), &existing) == 0) {
+        return EEXIST;
+    }
+    return ::rename(from.c_str(), to.c_str()) == 0 ? 0 : errno;
+}
 
-int replaceFileAtomically(const std::string& path, std::string_view bytes, mode_t mode) {
+int writeAtomically(const std::string& path, std::string_view bytes, mode_t mode, bool replace) {
+    if (path.empty() || path.back() == '/') {
+        return EISDIR;
+    }
     const std::string directory = directoryOf(path);
-    std::string pattern = path + ".XXXXXX";
+    // A fixed short name, so that a file name near the length limit still gets a temporary.
+    std::string pattern = directory + "/.tavrix-write-XXXXXX";
     UniqueFd fd(::mkostemp(pattern.data(), O_CLOEXEC));
     if (!fd) {
         return errno;
@@ -71,16 +90,32 @@ int replaceFileAtomically(const std::string& path, std::string_view bytes, mode_
     if (::close(fd.release()) != 0) {
         return errno;
     }
-    if (::rename(temporary.path().c_str(), path.c_str()) != 0) {
+    if (replace && ::rename(temporary.path().c_str(), path.c_str()) != 0) {
         return errno;
+    }
+    if (!replace) {
+        if (int error = renameWithoutReplacing(temporary.path(), path); error != 0) {
+            return error;
+        }
     }
     temporary.keep();
-    // The rename itself must reach the disk too.
+    // The rename is durable only once the directory is flushed; a failure there leaves the new
+    // file in place, so it does not count against the write.
     UniqueFd directoryFd(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (!directoryFd || ::fsync(directoryFd.get()) != 0) {
-        return errno;
+    if (directoryFd) {
+        ::fsync(directoryFd.get());
     }
     return 0;
+}
+
+}  // namespace
+
+int replaceFileAtomically(const std::string& path, std::string_view bytes, mode_t mode) {
+    return writeAtomically(path, bytes, mode, /*replace=*/true);
+}
+
+int createFileAtomically(const std::string& path, std::string_view bytes, mode_t mode) {
+    return writeAtomically(path, bytes, mode, /*replace=*/false);
 }
 
 }  // namespace tavrix::platform

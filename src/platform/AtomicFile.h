@@ -4,13 +4,23 @@
 
 #include <sys/types.h>
 
+#include <cstdint>
 #include <string>
 #include <string_view>
+#include <vector>
 
 namespace tavrix::platform {
 
 // Writes bytes to a temporary file beside path, flushes it to disk, gives it mode and renames it
 // over path. Answers 0, or the errno of the step that failed (nothing is left behind then).
 int replaceFileAtomically(const std::string& path, std::string_view bytes, mode_t mode);
+// The same, except that an existing file at path is never replaced (EEXIST).
+int createFileAtomically(const std::string& path, std::string_view bytes, mode_t mode);
+// replaceFileAtomically for binary data.
+inline int replaceFileAtomically(const std::string& path, const std::vector<std::uint8_t>& bytes,
+                                 mode_t mode) {
+    return replaceFileAtomically(
+        path, std::string_view(reinterpret_cast<const char*>(bytes.data()), bytes.size()), mode);
+}
 
 }  // namespace tavrix::platform

@@ -3,8 +3,8 @@
 #include <cerrno>
 #include <cstring>
 
-#include "payload/AtomicFile.h"
 #include "payload/FileSystemUtilities.h"
+#include "platform/AtomicFile.h"
 #include "platform/HttpTransfer.h"
 #include "plist/PropertyListFormat.h"
 #include "util/Log.h"
@@ -61,14 +61,11 @@ void keepLocalCopy(const AssetTypeSettings& settings, const SignedCatalog& catal
     std::string path = settings.cacheDirectory + kLocalCopyName;
     std::string signaturePath = path + kCatalogSignatureSuffix;
     int error = payload::createDirectoryAt(settings.cacheDirectory, 0755, true);
-    if (error == 0 &&
-        !payload::writeFileAtomically(path, catalog.bytes.data(), catalog.bytes.size(), 0644)) {
-        error = errno;
+    if (error == 0) {
+        error = replaceFileAtomically(path, catalog.bytes, 0644);
     }
-    if (error == 0 && settings.publicKey &&
-        !payload::writeFileAtomically(signaturePath, catalog.signature.data(),
-                                      catalog.signature.size(), 0644)) {
-        error = errno;
+    if (error == 0 && settings.publicKey) {
+        error = replaceFileAtomically(signaturePath, catalog.signature, 0644);
     }
     if (error == 0 && !settings.publicKey) {
         payload::removeItemTree(signaturePath);  // a stale signature would only mislead

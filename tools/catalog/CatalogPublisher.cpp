@@ -11,8 +11,8 @@
 #include <system_error>
 
 #include "payload/Archive.h"
-#include "payload/AtomicFile.h"
 #include "platform/AssetCatalogFormat.h"
+#include "platform/AtomicFile.h"
 #include "plist/PropertyListFormat.h"
 #include "util/UniqueFd.h"
 
@@ -211,7 +211,7 @@ void addOrReplace(plist::Array& entries, plist::Value entry) {
 }
 
 bool writeFile(const std::string& path, const std::string& bytes, mode_t mode) {
-    return payload::writeFileAtomically(path, bytes.data(), bytes.size(), mode);
+    return platform::replaceFileAtomically(path, bytes, mode) == 0;
 }
 
 // Writes the catalog and, with a key, its detached signature of exactly those bytes.

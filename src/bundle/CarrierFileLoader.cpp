@@ -1,0 +1,65 @@
+#include "bundle/CarrierFileLoader.h"
+
+#include <syslog.h>
+
+#include <string_view>
+
+#include "bundle/FileURL.h"
+#include "platform/SystemLog.h"
+#include "plist/PropertyListFormat.h"
+
+namespace tavrix {
+namespace {
+
+std::optional<plist::Data> readLocalURL(const std::string& url) {
+    std::optional<std::string> path = pathFromFileURL(url);
+    if (!path) {
+        return std::nullopt;
+    }
+    std::optional<std::string> bytes = plist::readFileBytes(*path);
+    if (!bytes) {
+        return std::nullopt;
+    }
+    return plist::Data(bytes->begin(), bytes->end());
+}
+
+}  // namespace
+
+std::optional<plist::Value> copyDictionaryFromFile(const std::string& path) {
+    std::optional<std::string> url = fileURLFromPath(path);
+    if (!url) {
+        // As a C string, the way a printf-style "%s" would show it.
+        platform::writeSystemLog(
+            LOG_ERR, "Failed to get the URL for the file " + std::string(path.c_str()) + "\n");
+        return std::nullopt;
+    }
+    std::optional<plist::Value> value = copyPropertyListFromURL(*url, kCarrierFileSourceLocal);
+    if (!value || !value->isDictionary()) {
+        return std::nullopt;
+    }
+    return value;
+}
+
+std::optional<plist::Value> copyPropertyListFromURL(const std::string& url,
+                                                    CarrierFileSource source) {
+    std::optional<plist::Data> data;
+    bool loaded = false;
+    if (source == kCarrierFileSourceLocal) {
+        data = readLocalURL(url);
+        loaded = data.has_value();
+    } else {
+        loaded = copyDataFromHTTP(url, &data);
+    }
+    if (!loaded) {
+        platform::writeSystemLog(LOG_ERR, "Failed to load the file\n");
+        return std::nullopt;
+    }
+    // A fetch may succeed without data (an encoding other than gzip); that parses to nothing.
+    if (!data || data->empty()) {
+        return std::nullopt;
+    }
+    return plist::parse(
+        std::string_view(reinterpret_cast<const char*>(data->data()), data->size()));
+}
+
+}  // namespace tavrix

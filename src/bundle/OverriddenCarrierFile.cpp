@@ -1,0 +1,113 @@
+#include "bundle/OverriddenCarrierFile.h"
+
+#include <algorithm>
+#include <iterator>
+#include <vector>
+
+#include "bundle/BundleLinks.h"
+#include "bundle/BundleLocations.h"
+#include "bundle/FileURL.h"
+#include "payload/FileSystemHelper.h"
+#include "payload/MobileUser.h"
+#include "platform/AtomicFile.h"
+#include "plist/PropertyListFormat.h"
+#include "util/Log.h"
+
+namespace tavrix {
+namespace {
+
+constexpr char kFieldSeparator = '+';
+constexpr const char* kPropertyListExtension = ".plist";
+constexpr mode_t kOverlayDirectoryMode = 0755;
+constexpr mode_t kOverriddenFileMode = 0644;
+
+std::vector<std::string> sortedFields(const std::string& name) {
+    std::vector<std::string> fields;
+    std::size_t start = 0;
+    for (;;) {
+        std::size_t end = name.find(kFieldSeparator, start);
+        fields.push_back(name.substr(start, end - start));
+        if (end == std::string::npos) {
+            break;
+        }
+        start = end + 1;
+    }
+    std::sort(fields.begin(), fields.end());
+    return fields;
+}
+
+std::string fileNameFor(const std::string& prefix, const std::string& bundleVersion) {
+    return prefix + kFieldSeparator + bundleVersion + kPropertyListExtension;
+}
+
+std::string overlayDirectory() {
+    const char* home = payload::MobileUser::homeDirectory();
+    return std::string(home != nullptr ? home : "") + kUserBundlesDirectory + kOverlayDirectoryName;
+}
+
+}  // namespace
+
+std::optional<std::string> overriddenFilePath(OverlayContext& context) {
+    context.overriddenFilePrefix.clear();
+    std::string bundleName = context.bundle.bundleName();
+    if (bundleName.empty()) {
+        logCFormat("There is no valid carrier bundle name\n");
+        return std::nullopt;
+    }
+    std::string prefix = std::string(overlayTypeWord(context.overlayType)) + kFieldSeparator +
+                         bundleName + kFieldSeparator + context.overlayKey;
+    logCFormat("Overridden filename prefix: %s\n", prefix.c_str());
+    const std::string& currentPath = context.bundle.carrierFilePath;
+    logCFormat("Current carrier file path name: %s\n", currentPath.c_str());
+
+    const std::string& version = context.bundle.bundleVersion;
+    if (currentPath.find(kFieldSeparator) != std::string::npos) {
+        std::vector<std::string> current = sortedFields(baseNameOfPath(currentPath));
+        std::vector<std::string> overridden = sortedFields(fileNameFor(prefix, version));
+        std::vector<std::string> extra;
+        std::set_difference(current.begin(), current.end(), overridden.begin(), overridden.end(),
+                            std::back_inserter(extra));
+        for (const std::string& field : extra) {
+            logCFormat("Adding the extra identifier %s to the file name\n", field.c_str());
+            prefix += kFieldSeparator + field;
+        }
+        logCFormat("Overridden carrier file path name: %s\n",
+                   (overlayDirectory() + fileNameFor(prefix, version)).c_str());
+    }
+    context.overriddenFilePrefix = prefix;
+
+    std::string fileName = fileNameFor(prefix, version);
+    if (payload::MobileUser::homeDirectory() == nullptr ||
+        fileName.find_first_of(std::string_view("/\0", 2)) != std::string::npos) {
+        return std::nullopt;
+    }
+    return overlayDirectory() + fileName;
+}
+
+bool writeOverriddenCarrierFile(const plist::Value& dictionary,
+                                const std::optional<std::string>& path) {
+    std::string xml = plist::serialize(dictionary, plist::Format::Xml);
+    if (xml.empty()) {
+        logCFormat("Failed to serialize the overridden dictionary\n");
+        return false;
+    }
+    payload::FileSystemHelper fileSystem;
+    if (path) {
+        std::string directory = dirNameOfPath(*path);
+        if (!fileSystem.fileExists(directory)) {
+            fileSystem.createDirectory(directory, kOverlayDirectoryMode, true);
+        }
+    }
+    if (!path || !fileURLFromPath(*path)) {
+        logCFormat("Failed to create the file URL\n");
+        return false;
+    }
+    if (int error = platform::createFileAtomically(*path, xml, kOverriddenFileMode); error != 0) {
+        logCFormat("Failed to write the overridden carrier bundle with error code: %d\n", error);
+        return false;
+    }
+    logCFormat("The overridden file was successfully written to %s\n", path->c_str());
+    return true;
+}
+
+}  // namespace tavrix

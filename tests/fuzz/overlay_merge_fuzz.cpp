@@ -1,0 +1,154 @@
+// Feeds arbitrary property lists to the overlay configuration: the override map, the lookup for a
+// few behavior IDs, and merges both ways. A top-level array of two dictionaries is merged as base
+// and overlay; any other input is merged with its own override configurations.
+#include <cmath>
+#include <cstddef>
+#include <cstdint>
+#include <cstdlib>
+#include <string_view>
+#include <vector>
+
+#include "bundle/OverlayConfiguration.h"
+#include "platform/SystemLog.h"
+#include "plist/PropertyListFormat.h"
+
+namespace {
+
+using tavrix::plist::Dictionary;
+using tavrix::plist::Value;
+
+class SilentSink : public tavrix::platform::LogSink {
+  public:
+    void write(int, std::string_view) override {}
+};
+
+void check(bool condition) {
+    if (!condition) {
+        std::abort();
+    }
+}
+
+// Equality in which a real that is not a number equals itself, so that copies compare equal.
+bool identical(const Value& a, const Value& b);
+
+bool identical(const Dictionary& a, const Dictionary& b) {
+    if (a.size() != b.size()) {
+        return false;
+    }
+    for (auto x = a.begin(), y = b.begin(); x != a.end(); ++x, ++y) {
+        if (x->first != y->first || !identical(x->second, y->second)) {
+            return false;
+        }
+    }
+    return true;
+}
+
+bool identical(const Value& a, const Value& b) {
+    if (a.type() != b.type()) {
+        return false;
+    }
+    if (a.asDictionary() != nullptr) {
+        return identical(*a.asDictionary(), *b.asDictionary());
+    }
+    if (a.asArray() != nullptr) {
+        const auto& x = *a.asArray();
+        const auto& y = *b.asArray();
+        if (x.size() != y.size()) {
+            return false;
+        }
+        for (std::size_t i = 0; i < x.size(); ++i) {
+            if (!identical(x[i], y[i])) {
+                return false;
+            }
+        }
+        return true;
+    }
+    if (a.asReal() != nullptr && std::isnan(*a.asReal())) {
+        return std::isnan(*b.asReal());
+    }
+    return a == b;
+}
+
+// The merge rules that hold whatever the input: overlay entries win unless excluded, an
+// "_Exclude" array removes its names and itself, and neither input changes.
+void mergeAndCheck(const Dictionary& base, const Dictionary& overlay) {
+    const Dictionary baseBefore = base;
+    const Dictionary overlayBefore = overlay;
+    Dictionary merged = tavrix::mergeDictionaries(base, overlay);
+    check(identical(base, baseBefore) && identical(overlay, overlayBefore));
+
+    std::vector<std::string_view> excluded;
+    auto entry = overlay.find(tavrix::kExcludeKey);
+    const Value* exclude = entry != overlay.end() ? &entry->second : nullptr;
+    if (exclude != nullptr && exclude->asArray() != nullptr) {
+        check(!merged.contains(tavrix::kExcludeKey));
+        for (const Value& name : *exclude->asArray()) {
+            if (const std::string* key = name.asString()) {
+                check(!merged.contains(*key));
+                excluded.push_back(*key);
+            }
+        }
+    }
+    for (const auto& [key, value] : overlay) {
+        bool isExcluded = key == tavrix::kExcludeKey && exclude->asArray() != nullptr;
+        for (std::string_view name : excluded) {
+            isExcluded = isExcluded || name == key;
+        }
+        if (isExcluded) {
+            continue;
+        }
+        check(merged.contains(key));
+        if (!value.isDictionary() || !base.contains(key)) {
+            check(identical(merged.at(key), value));
+        }
+    }
+    for (const auto& [key, value] : base) {
+        if (!overlay.contains(key) && merged.contains(key)) {
+            check(identical(merged.at(key), value));
+        }
+    }
+    check(!tavrix::removeBehaviorOverrides(merged).contains(tavrix::kBehaviorOverridesKey));
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
+    static SilentSink sink;
+    static tavrix::platform::ScopedLogSink quiet(sink);
+    auto value = tavrix::plist::parse(std::string_view(reinterpret_cast<const char*>(data), size));
+    if (!value) {
+        return 0;
+    }
+    const auto* pair = value->asArray();
+    if (pair != nullptr && pair->size() == 2 && (*pair)[0].isDictionary() &&
+        (*pair)[1].isDictionary()) {
+        mergeAndCheck(*(*pair)[0].asDictionary(), *(*pair)[1].asDictionary());
+        mergeAndCheck(*(*pair)[1].asDictionary(), *(*pair)[0].asDictionary());
+        return 0;
+    }
+
+    auto map = tavrix::copyBehaviorOverrides(*value);
+    for (const char* id : {"abc", "", "ABC", "42"}) {
+        tavrix::BehaviorOverlayConfiguration configuration(id, *value);
+        check(configuration.overlayKey().empty() == (!map || *id == '\0'));
+        check(!configuration.overrideConfiguration() || map->contains(id));
+    }
+    if (!value->isDictionary()) {
+        return 0;
+    }
+    const Dictionary& base = *value->asDictionary();
+    mergeAndCheck(base, Dictionary{});
+    check(identical(tavrix::mergeDictionaries(base, Dictionary{}), base));
+    if (map) {
+        // Many IDs may share one configuration; a few are enough.
+        std::size_t merges = 0;
+        for (const auto& [id, configuration] : *map) {
+            if (++merges > 4) {
+                break;
+            }
+            mergeAndCheck(base, *configuration.asDictionary());
+            mergeAndCheck(*configuration.asDictionary(), base);
+        }
+    }
+    return 0;
+}

@@ -1,0 +1,95 @@
+// A small HTTP server on 127.0.0.1 for tests that need a real peer: canned responses per path
+// with chosen headers, files served from a directory, the requests it received, and connections
+// cut or held in the middle of a body. Each connection is answered once and closed (HTTP/1.0
+// style).
+#pragma once
+
+#include <chrono>
+#include <condition_variable>
+#include <cstddef>
+#include <cstdint>
+#include <filesystem>
+#include <map>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <thread>
+#include <utility>
+#include <vector>
+
+#include "util/UniqueFd.h"
+
+namespace tavrix::test {
+
+class LocalHttpServer {
+  public:
+    struct Response {
+        int status = 200;
+        std::string reason = "OK";
+        // Sent in order. A "Content-Length" is added unless one is given here.
+        std::vector<std::pair<std::string, std::string>> headers;
+        std::string body;
+        // When set, only this many body bytes are sent (after the full Content-Length was
+        // announced) before the connection is closed.
+        std::optional<std::size_t> cutAfterBodyBytes;
+        // When set, only this many body bytes are sent until releaseHeldResponses() (or the
+        // server's end); then the rest follows. For work that must stay pending a while.
+        std::optional<std::size_t> holdAfterBodyBytes;
+    };
+
+    struct Request {
+        std::string method;
+        std::string target;
+        std::string version;  // "HTTP/1.0"
+        std::vector<std::pair<std::string, std::string>> headers;
+        // The first header of that name (any letter case), or nothing.
+        std::optional<std::string> header(std::string_view name) const;
+    };
+
+    // Listens on 127.0.0.1 at a port the kernel chooses; throws std::runtime_error when it cannot.
+    LocalHttpServer();
+    // Stops listening and waits for the connections in progress.
+    ~LocalHttpServer();
+    LocalHttpServer(const LocalHttpServer&) = delete;
+    LocalHttpServer& operator=(const LocalHttpServer&) = delete;
+
+    std::uint16_t port() const { return port_; }
+    // "http://127.0.0.1:<port>" + path.
+    std::string url(std::string_view path) const;
+
+    // Answers requests for exactly this path (query included) with response.
+    void serve(const std::string& path, Response response);
+    // Answers requests for urlPrefix + name with the file directory/name (200, or 404 when it
+    // cannot be read; names holding ".." are refused).
+    void serveDirectory(const std::string& urlPrefix, const std::filesystem::path& directory);
+    // Every request received so far, in arrival order.
+    std::vector<Request> requests() const;
+
+    // Waits until a response is being held: true, or false at the timeout.
+    bool waitForHeldResponse(std::chrono::milliseconds timeout);
+    // Lets every held response finish; responses asked for later are not held.
+    void releaseHeldResponses();
+
+  private:
+    void acceptLoop();
+    void handleConnection(int fd);
+    Response responseFor(const Request& request) const;
+
+    UniqueFd listenFd_;
+    // Written to on destruction, to wake the accept loop.
+    UniqueFd wakeReadFd_;
+    UniqueFd wakeWriteFd_;
+    std::uint16_t port_ = 0;
+    mutable std::mutex mutex_;
+    std::map<std::string, Response> responses_;
+    std::vector<std::pair<std::string, std::filesystem::path>> directories_;
+    std::vector<Request> requests_;
+    std::condition_variable holdChanged_;
+    int heldResponses_ = 0;
+    bool released_ = false;
+    std::vector<std::thread> connections_;
+    std::thread acceptThread_;
+};
+
+}  // namespace tavrix::test

@@ -1,0 +1,185 @@
+#include <gtest/gtest.h>
+
+#include <string>
+#include <vector>
+
+#include "bundle/OverlayConfiguration.h"
+#include "platform/SystemLog.h"
+#include "plist/Value.h"
+
+namespace tavrix {
+namespace {
+
+using plist::Array;
+using plist::Dictionary;
+using plist::Value;
+
+Value group(Array ids, Dictionary configuration) {
+    return Dictionary{{"SupportedBehaviorIDs", std::move(ids)},
+                      {"OverrideConfiguration", std::move(configuration)}};
+}
+
+Value baseWith(Dictionary overrides) {
+    return Dictionary{{"CarrierName", "Base"}, {"BehaviorOverrides", std::move(overrides)}};
+}
+
+class OverlayConfigurationTest : public testing::Test {
+  protected:
+    platform::CapturingLogSink sink;
+    platform::ScopedLogSink guard{sink};
+};
+
+// ---- the override map ----
+
+TEST_F(OverlayConfigurationTest, MapsEveryListedIDLowercasedToItsGroupsConfiguration) {
+    Dictionary first{{"Name", "First"}};
+    Dictionary second{{"Name", "Second"}};
+    Value base = baseWith({
+        {"a-group", group({"ABC", "MiXeD-\xC3\x89t\xC3\xA9", "shared"}, first)},
+        // Enumerated after "a-group": its "shared" wins.
+        {"b-group", group({"shared", 42, true}, second)},
+        {"c-empty", group({}, second)},
+    });
+    std::optional<Dictionary> map = copyBehaviorOverrides(base);
+    ASSERT_TRUE(map);
+    // Only ASCII letters are lowered; non-string IDs are rendered as text.
+    EXPECT_EQ(*map, (Dictionary{{"abc", first},
+                                {"mixed-\xC3\x89t\xC3\xA9", first},
+                                {"shared", second},
+                                {"42", second},
+                                {"true", second}}));
+    EXPECT_TRUE(sink.messages().empty());
+}
+
+TEST_F(OverlayConfigurationTest, MalformedGroupsAreLoggedAndSkipped) {
+    Dictionary good{{"Name", "Good"}};
+    Value base = baseWith({
+        {"1", "not a group"},
+        {"2", Dictionary{{"OverrideConfiguration", good}}},
+        {"3", Dictionary{{"SupportedBehaviorIDs", "abc"}, {"OverrideConfiguration", good}}},
+        {"4", Dictionary{{"SupportedBehaviorIDs", Array{"abc"}}}},
+        {"5", Dictionary{{"SupportedBehaviorIDs", Array{"abc"}}, {"OverrideConfiguration", 1}}},
+        {"6", group({"ok"}, good)},
+    });
+    std::optional<Dictionary> map = copyBehaviorOverrides(base);
+    ASSERT_TRUE(map);
+    EXPECT_EQ(*map, (Dictionary{{"ok", good}}));
+    EXPECT_EQ(sink.messages(),
+              (std::vector<std::string>{
+                  "Failed to get the config dictionary in Allowed Multimode SIMs section\n",
+                  "No Supported Behavior IDs found in the config dictionary\n",
+                  "No Supported Behavior IDs found in the config dictionary\n",
+                  "No Override Configuration found in the config dictionary\n",
+                  "No Override Configuration found in the config dictionary\n",
+              }));
+}
+
+TEST_F(OverlayConfigurationTest, NoUsableSectionMeansNoMapAndNoKey) {
+    for (const Value& base : {Value(Dictionary{{"CarrierName", "Base"}}),
+                              Value(Dictionary{{"BehaviorOverrides", Array{}}}), Value("text")}) {
+        sink.clear();
+        BehaviorOverlayConfiguration configuration("abc", base);
+        EXPECT_TRUE(configuration.overlayKey().empty());
+        EXPECT_FALSE(configuration.overrideConfiguration());
+        EXPECT_EQ(configuration.baseDictionary(), base);
+        EXPECT_EQ(sink.messages(),
+                  (std::vector<std::string>{
+                      "There are no behavior overrides in the base bundle\n",
+                      "There is no merged allowed Behavior overlay configuration\n"}));
+    }
+    // A section without groups is a section: the key is set, nothing matches.
+    BehaviorOverlayConfiguration empty("abc", baseWith({}));
+    EXPECT_EQ(empty.overlayKey(), "abc");
+    EXPECT_FALSE(empty.overrideConfiguration());
+}
+
+TEST_F(OverlayConfigurationTest, TheBehaviorIDIsLookedUpAsGiven) {
+    Dictionary configuration{{"Name", "Abc"}};
+    Value base = baseWith({{"g", group({"ABC"}, configuration)}});
+    BehaviorOverlayConfiguration listed("abc", base);
+    EXPECT_EQ(listed.overlayKey(), "abc");
+    EXPECT_EQ(listed.overrideConfiguration(), configuration);
+    // IDs reach this point lowercased already; an upper-case ID is a different one.
+    BehaviorOverlayConfiguration upper("ABC", base);
+    EXPECT_EQ(upper.overlayKey(), "ABC");
+    EXPECT_FALSE(upper.overrideConfiguration());
+    BehaviorOverlayConfiguration unlisted("xyz", base);
+    EXPECT_EQ(unlisted.overlayKey(), "xyz");
+    EXPECT_FALSE(unlisted.overrideConfiguration());
+    BehaviorOverlayConfiguration none("", base);
+    EXPECT_TRUE(none.overlayKey().empty());
+}
+
+// ---- merging ----
+
+struct MergeCase {
+    const char* name;
+    Dictionary base;
+    Dictionary overlay;
+    Dictionary expected;
+};
+
+TEST(MergeDictionariesTest, FollowsTheMergeRulesAndLeavesInputsAlone) {
+    const std::vector<MergeCase> cases = {
+        {"nested dictionaries merge",
+         {{"a", 1}, {"d", Dictionary{{"x", 1}, {"y", 2}}}},
+         {{"a", 2}, {"d", Dictionary{{"y", 3}, {"z", 4}}}},
+         {{"a", 2}, {"d", Dictionary{{"x", 1}, {"y", 3}, {"z", 4}}}}},
+        {"arrays replace whole", {{"a", Array{1, 2}}}, {{"a", Array{3}}}, {{"a", Array{3}}}},
+        {"scalars replace containers and back",
+         {{"a", Dictionary{{"x", 1}}}, {"b", "text"}},
+         {{"a", false}, {"b", Array{}}},
+         {{"a", false}, {"b", Array{}}}},
+        {"exclusion removes base and new keys",
+         {{"a", 1}, {"b", 2}},
+         {{"c", 3}, {"_Exclude", Array{"a", "c", "missing", 7}}},
+         {{"b", 2}}},
+        {"an _Exclude that is no array stays",
+         {{"a", 1}},
+         {{"_Exclude", "a"}},
+         {{"a", 1}, {"_Exclude", "a"}}},
+        {"nested _Exclude acts only on an existing dictionary",
+         {{"kept", Dictionary{{"x", 1}, {"y", 2}}}},
+         {{"kept", Dictionary{{"_Exclude", Array{"x"}}}},
+          {"new", Dictionary{{"x", 1}, {"_Exclude", Array{"x"}}}}},
+         {{"kept", Dictionary{{"y", 2}}}, {"new", Dictionary{{"x", 1}, {"_Exclude", Array{"x"}}}}}},
+        {"a dictionary onto a non-dictionary merges onto nothing",
+         {{"d", 5}},
+         {{"d", Dictionary{{"x", 1}, {"y", 2}, {"_Exclude", Array{"y"}}}}},
+         {{"d", Dictionary{{"x", 1}}}}},
+        {"empty overlay", {{"a", 1}}, {}, {{"a", 1}}},
+    };
+    for (const MergeCase& c : cases) {
+        Dictionary base = c.base;
+        Dictionary overlay = c.overlay;
+        EXPECT_EQ(mergeDictionaries(base, overlay), c.expected) << c.name;
+        EXPECT_EQ(base, c.base) << c.name;
+        EXPECT_EQ(overlay, c.overlay) << c.name;
+    }
+}
+
+// Builds {n: {n: ... {leaf: leaf} ...}, key: level} depth levels deep.
+Dictionary nested(int depth, const char* key, int leaf) {
+    Dictionary root;
+    Dictionary* level = &root;
+    for (int i = 0; i < depth; ++i) {
+        level->emplace(key, i);
+        level = level->emplace("n", Dictionary{}).first->second.asDictionary();
+    }
+    level->emplace("leaf", leaf);
+    return root;
+}
+
+TEST(MergeDictionariesTest, DeepNestingIsMergedWithoutRunningAway) {
+    // Deeper than any file can hold: past the depth guard the overlay's value is taken whole.
+    Dictionary merged = mergeDictionaries(nested(2000, "b", 1), nested(2000, "o", 2));
+    const Dictionary* level = &merged;
+    for (int depth = 0; depth < 100; ++depth) {
+        EXPECT_EQ(level->size(), 3u) << depth;  // n, b and o merged near the top
+        level = level->at("n").asDictionary();
+        ASSERT_NE(level, nullptr);
+    }
+}
+
+}  // namespace
+}  // namespace tavrix

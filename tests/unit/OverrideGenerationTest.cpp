@@ -1,0 +1,276 @@
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <cstdlib>
+#include <filesystem>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "TestSupport.h"
+#include "UnitTestRoot.h"
+#include "bundle/OverrideGeneration.h"
+#include "platform/PlatformRoot.h"
+#include "platform/SystemLog.h"
+#include "plist/PropertyListFormat.h"
+
+namespace tavrix {
+namespace {
+
+namespace fs = std::filesystem;
+using plist::Array;
+using plist::Dictionary;
+using plist::Value;
+using ::testing::ElementsAre;
+using ::testing::IsSupersetOf;
+
+// A device in the test's own root with one system bundle (version 1.0) whose base carrier file
+// lists behavior overrides for "ABC".
+class OverrideGenerationTest : public testing::Test {
+  protected:
+    void TearDown() override {
+        std::error_code ignored;
+        fs::remove_all(platform::resolvePath("/System"), ignored);
+        fs::remove_all(platform::resolvePath("/etc/tavrix"), ignored);
+        fs::remove_all(home() + "/Library", ignored);
+    }
+
+    static std::string home() { return test::unitTestRoot().string() + "/var/mobile"; }
+    static std::string bundle() {
+        return platform::resolvePath("/System/Library/TavrixBundles/Phone/Default.bundle");
+    }
+    static std::string baseFile() { return bundle() + "/behavior.plist"; }
+    static std::string overlayFile(const std::string& name) {
+        return home() + "/Library/TavrixBundles/Overlay/" + name;
+    }
+
+    static Dictionary behaviorSection() {
+        return Dictionary{{"abc-group", Dictionary{{"SupportedBehaviorIDs", Array{"ABC"}},
+                                                   {"OverrideConfiguration",
+                                                    Dictionary{{"Name", "Abc"},
+                                                               {"_Exclude", Array{"Dropped"}}}}}}};
+    }
+
+    static Dictionary baseCarrier() {
+        return Dictionary{{"Name", "Base"},
+                          {"Dropped", true},
+                          {"Model", "generic"},
+                          {"BehaviorOverrides", behaviorSection()}};
+    }
+
+    static void writeDevice(const std::optional<std::string>& model) {
+        Dictionary table{{"DeviceClass", "Phone"}};
+        if (model) {
+            table.emplace("HWModelStr", *model);
+        }
+        std::string path = platform::resolvePath("/etc/tavrix/DeviceInfo.plist");
+        fs::create_directories(fs::path(path).parent_path());
+        ASSERT_TRUE(plist::writeFile(path, Value(table)));
+    }
+
+    static void writeBundle(const Value& carrier) {
+        fs::create_directories(bundle());
+        ASSERT_TRUE(plist::writeFile(bundle() + "/Info.plist",
+                                     Value(Dictionary{{"QZBundleVersion", "1.0"}})));
+        ASSERT_TRUE(plist::writeFile(baseFile(), carrier));
+    }
+
+    // The device decision leaves the base bundle in the record, as the reset flow would have it.
+    CarrierBundle baseBundle() {
+        CarrierBundle record;
+        makeDeviceOverlayDecision(record, std::nullopt);
+        sink.clear();
+        return record;
+    }
+
+    platform::CapturingLogSink sink;
+    platform::ScopedLogSink guard{sink};
+};
+
+struct FileIdentity {
+    ino_t inode = 0;
+    timespec modified{};
+};
+
+FileIdentity identityOf(const std::string& path) {
+    struct stat info {};
+    EXPECT_EQ(::stat(path.c_str(), &info), 0) << path;
+    return {info.st_ino, info.st_mtim};
+}
+
+TEST_F(OverrideGenerationTest, BehaviorOverlayIsWrittenOnceWithoutItsSection) {
+    writeDevice("T12AP");
+    writeBundle(Value(baseCarrier()));
+    CarrierBundle record = baseBundle();
+    ASSERT_EQ(record.carrierFilePath, baseFile());
+
+    const std::string written = overlayFile("id+behavior+Default.bundle+abc+1.0.plist");
+    EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kOverrideBundleSuccess);
+    EXPECT_THAT(
+        sink.messages(),
+        ElementsAre("Loading carrier file " + baseFile() + "\n", "Overlay key: 'abc'\n",
+                    "Overridden filename prefix: id+behavior+Default.bundle+abc\n",
+                    "Current carrier file path name: " + baseFile() + "\n",
+                    "Overridden file does not exist\n",
+                    "The overridden file was successfully written to " + written + "\n",
+                    "Resetting bundle object\n", "Successfully generated the carrier plist\n"));
+    EXPECT_EQ(record.carrierFilePath, written);
+    EXPECT_EQ(record.overlayType, kBehaviorOverlay);
+    EXPECT_EQ(record.bundlePath, bundle());
+    EXPECT_EQ(record.bundleVersion, "1.0");
+    EXPECT_EQ(plist::readFile(written), Value(Dictionary{{"Name", "Abc"}, {"Model", "generic"}}));
+    EXPECT_EQ(fs::status(fs::path(written).parent_path()).permissions(), fs::perms(0755));
+
+    // A changed base does not bring a new file: the one there is taken as it is.
+    FileIdentity before = identityOf(written);
+    Dictionary changed = baseCarrier();
+    changed.insert_or_assign("Name", "Changed");
+    writeBundle(Value(changed));
+    CarrierBundle again = baseBundle();
+    sink.clear();
+    EXPECT_EQ(applyMultimodeOverlay(again, std::string("abc")), kOverrideBundleSuccess);
+    EXPECT_TRUE(
+        sink.contains("Overridden file " + written + " already exists, not generating again\n"));
+    EXPECT_FALSE(sink.contains("Overridden file does not exist\n"));
+    EXPECT_EQ(again.carrierFilePath, written);
+    EXPECT_EQ(again.overlayType, kBehaviorOverlay);
+    FileIdentity after = identityOf(written);
+    EXPECT_EQ(after.inode, before.inode);
+    EXPECT_EQ(after.modified.tv_sec, before.modified.tv_sec);
+    EXPECT_EQ(after.modified.tv_nsec, before.modified.tv_nsec);
+    EXPECT_EQ(plist::readFile(written)->find("Name")->description(), "Abc");
+}
+
+TEST_F(OverrideGenerationTest, WithoutAMatchTheRecordKeepsTheBaseFile) {
+    writeDevice("T12AP");
+    writeBundle(Value(baseCarrier()));
+    CarrierBundle record = baseBundle();
+
+    EXPECT_EQ(applyMultimodeOverlay(record, std::string("xyz")), kNoMatchForOverlay);
+    EXPECT_TRUE(sink.contains("No match for overlay\n"));
+    EXPECT_EQ(applyMultimodeOverlay(record, std::string("")), kOverrideNotRequired);
+    EXPECT_EQ(applyMultimodeOverlay(record, std::nullopt), kOverrideNotRequired);
+
+    writeBundle(Value(Dictionary{{"Name", "Base"}}));
+    sink.clear();
+    EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kOverrideNotRequired);
+    EXPECT_THAT(sink.messages(),
+                ElementsAre("Loading carrier file " + baseFile() + "\n",
+                            "There are no behavior overrides in the base bundle\n",
+                            "There is no merged allowed Behavior overlay configuration\n",
+                            "Failed to get overlay matching key, marking override not required\n"));
+    EXPECT_EQ(record.carrierFilePath, baseFile());
+    EXPECT_EQ(record.overlayType, kNoOverlay);
+    EXPECT_FALSE(fs::exists(home() + "/Library/TavrixBundles/Overlay"));
+}
+
+TEST_F(OverrideGenerationTest, DeviceOverlayKeepsTheSectionAndTheBehaviorOverlayBuildsOnIt) {
+    writeDevice("T12AP");
+    writeBundle(Value(baseCarrier()));
+    // Only the name with the model as a whole '_' field and the right extension counts.
+    ASSERT_TRUE(plist::writeFile(bundle() + "/overrides_T12.plist", Value(Dictionary{})));
+    ASSERT_TRUE(plist::writeFile(bundle() + "/overrides_T12AP.txt", Value(Dictionary{})));
+    ASSERT_TRUE(plist::writeFile(bundle() + "/overrides_X1_T12AP.plist",
+                                 Value(Dictionary{{"Model", "T12AP"}})));
+
+    CarrierBundle record;
+    EXPECT_EQ(makeDeviceOverlayDecision(record, std::string("ignored")), kOverrideBundleSuccess);
+    const std::string deviceFile = overlayFile("device+behavior+Default.bundle+T12AP+1.0.plist");
+    EXPECT_THAT(sink.messages(),
+                IsSupersetOf({std::string("Overlay key: 'T12AP'\n"),
+                              std::string("Found a file with the prefix matching: "
+                                          "overrides_T12.plist\n"),
+                              std::string("Found match, file overrides_X1_T12AP.plist contains "
+                                          "this device's specific carrier plist\n")}));
+    EXPECT_EQ(record.carrierFilePath, deviceFile);
+    EXPECT_EQ(record.overlayType, kDeviceOverlay);
+    Dictionary deviceCarrier = baseCarrier();
+    deviceCarrier.insert_or_assign("Model", "T12AP");
+    EXPECT_EQ(plist::readFile(deviceFile), Value(deviceCarrier));
+
+    // The behavior overlay reads the device file and keeps the model in its name.
+    sink.clear();
+    EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kOverrideBundleSuccess);
+    const std::string bothFile =
+        overlayFile("device+id+behavior+Default.bundle+abc+T12AP+1.0.plist");
+    EXPECT_TRUE(sink.contains("Adding the extra identifier T12AP to the file name\n"));
+    EXPECT_TRUE(sink.contains("Overridden carrier file path name: " + bothFile + "\n"));
+    EXPECT_EQ(record.carrierFilePath, bothFile);
+    EXPECT_EQ(record.overlayType, kDeviceBehaviorOverlay);
+    EXPECT_EQ(plist::readFile(bothFile), Value(Dictionary{{"Name", "Abc"}, {"Model", "T12AP"}}));
+}
+
+TEST_F(OverrideGenerationTest, WithoutADeviceFileTheBaseBundleIsLeftInTheRecord) {
+    writeDevice("T12AP");
+    writeBundle(Value(baseCarrier()));
+    CarrierBundle record;
+    record.carrierFilePath = "/stale";
+    EXPECT_EQ(makeDeviceOverlayDecision(record, std::nullopt), kNoMatchForOverlay);
+    EXPECT_TRUE(sink.contains("No device specific overlay file name found in the base bundle\n"));
+    EXPECT_EQ(record.bundlePath, bundle());
+    EXPECT_EQ(record.carrierFilePath, baseFile());
+    EXPECT_EQ(record.overlayType, kNoOverlay);
+}
+
+TEST_F(OverrideGenerationTest, AnUnknownModelNeedsNoOverride) {
+    writeDevice(std::nullopt);
+    writeBundle(Value(baseCarrier()));
+    CarrierBundle record;
+    EXPECT_EQ(makeDeviceOverlayDecision(record, std::nullopt), kOverrideNotRequired);
+    EXPECT_TRUE(sink.contains("Model name is empty\n"));
+    EXPECT_TRUE(
+        sink.contains("Failed to get overlay matching key, marking override not required\n"));
+    EXPECT_EQ(record.carrierFilePath, baseFile());
+}
+
+TEST_F(OverrideGenerationTest, AnUnreadableBaseMeansNoCarrierInfo) {
+    writeDevice("T12AP");
+    const std::string noInfo =
+        "Failed to load the base bundle carrier file itself, carrier info not present\n";
+    // No bundle at all: the empty carrier path cannot be loaded.
+    CarrierBundle record;
+    EXPECT_EQ(makeDeviceOverlayDecision(record, std::nullopt), kCarrierInfoNotPresent);
+    EXPECT_TRUE(sink.contains("Failed to find a bundle\n"));
+    EXPECT_TRUE(sink.contains(noInfo));
+    EXPECT_TRUE(record.bundlePath.empty());
+
+    // A base carrier file that holds no dictionary.
+    writeBundle(Value(Array{"ABC"}));
+    record = baseBundle();
+    EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kCarrierInfoNotPresent);
+    EXPECT_THAT(sink.messages(), ElementsAre("Loading carrier file " + baseFile() + "\n", noInfo));
+    EXPECT_EQ(record.carrierFilePath, baseFile());
+}
+
+TEST_F(OverrideGenerationTest, AFileThatCannotBeWrittenLeavesTheRecordAlone) {
+    writeDevice("T12AP");
+    Dictionary carrier = baseCarrier();
+    // Only listed IDs are ever written, but a listed one must still stay a plain file name.
+    carrier.insert_or_assign(
+        "BehaviorOverrides",
+        Dictionary{{"g", Dictionary{{"SupportedBehaviorIDs", Array{"abc", "x/../../../escape"}},
+                                    {"OverrideConfiguration", Dictionary{{"Name", "X"}}}}}});
+    writeBundle(Value(carrier));
+    CarrierBundle record = baseBundle();
+
+    EXPECT_EQ(applyMultimodeOverlay(record, std::string("x/../../../escape")),
+              kOverrideBundleFailure);
+    EXPECT_THAT(sink.messages(),
+                IsSupersetOf({std::string("Failed to create the file URL\n"),
+                              std::string("Failed to generate overridden carrier plist\n")}));
+    EXPECT_EQ(record.carrierFilePath, baseFile());
+    EXPECT_FALSE(fs::exists(home() + "/Library/escape+1.0.plist"));
+
+    // A file where the Overlay directory belongs.
+    test::writeText(home() + "/Library/TavrixBundles/Overlay", "in the way");
+    sink.clear();
+    EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kOverrideBundleFailure);
+    EXPECT_TRUE(
+        sink.contains("Failed to write the overridden carrier bundle with error code: 20\n"));
+    EXPECT_EQ(record.carrierFilePath, baseFile());
+    EXPECT_EQ(record.overlayType, kNoOverlay);
+}
+
+}  // namespace
+}  // namespace tavrix
