@@ -144,13 +144,15 @@ void benchPayloads(const fs::path& work) {
     fs::create_directories(work / "services");
     writeBytes(work / "services/com.zandor.tavrixservicesd.service",
                "[D-BUS Service]\nName=com.zandor.tavrixservicesd\nExec=/usr/bin/env TAVRIX_ROOT=" +
-                   root.string() + " TAVRIX_IDLE_EXIT_SEC=300 RUNTIME_DIRECTORY=" +
+                   root.string() +
+                   " TAVRIX_LOG_STDERR=1 TAVRIX_IDLE_EXIT_SEC=300 RUNTIME_DIRECTORY=" +
                    (work / "run").string() + " " + TAVRIX_DAEMON_PATH + "\n");
     writeBytes(work / "bus.conf",
-               "<busconfig><type>session</type><listen>unix:tmpdir=" + work.string() +
+               "<busconfig><type>session</type><listen>unix:path=" + (work / "socket").string() +
                    "</listen><servicedir>" + (work / "services").string() +
                    "</servicedir><auth>EXTERNAL</auth><policy context=\"default\">"
-                   "<allow send_destination=\"*\"/><allow own=\"*\"/></policy></busconfig>\n");
+                   "<allow send_destination=\"*\" eavesdrop=\"true\"/><allow eavesdrop=\"true\"/>"
+                   "<allow own=\"*\"/></policy></busconfig>\n");
     test::DbusDaemonProcess bus(work / "bus.conf", work / "bus.log");
     auto client = client::TavrixClient::connectToAddress(bus.address());
 
