@@ -4,7 +4,7 @@
 
 #include <string_view>
 
-#include "bundle/FileURL.h"
+#include "util/FileURL.h"
 #include "platform/SystemLog.h"
 #include "plist/PropertyListFormat.h"
 

@@ -6,7 +6,7 @@
 
 #include "bundle/BundleLinks.h"
 #include "bundle/BundleLocations.h"
-#include "bundle/FileURL.h"
+#include "util/FileURL.h"
 #include "payload/FileSystemHelper.h"
 #include "payload/MobileUser.h"
 #include "platform/AtomicFile.h"

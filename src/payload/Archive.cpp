@@ -11,6 +11,7 @@
 
 #include "payload/FileSystemHelper.h"
 #include "platform/AtomicFile.h"
+#include "util/FileURL.h"
 #include "util/Log.h"
 #include "util/UniqueFd.h"
 
@@ -87,56 +88,15 @@ std::string lastPathComponent(const std::string& path) {
     return slash == std::string::npos ? path : path.substr(slash + 1);
 }
 
-int hexDigitValue(char digit) {
-    if (digit >= '0' && digit <= '9') {
-        return digit - '0';
-    }
-    if (digit >= 'a' && digit <= 'f') {
-        return digit - 'a' + 10;
-    }
-    if (digit >= 'A' && digit <= 'F') {
-        return digit - 'A' + 10;
-    }
-    return -1;
-}
-
 // The file-system path of a file URL, or the text itself when it has no scheme.
 std::optional<std::string> pathOfFileURL(const std::string& url) {
-    constexpr std::string_view kScheme = "file://";
-    if (url.rfind(kScheme, 0) != 0) {
-        if (url.find("://") != std::string::npos) {
-            return std::nullopt;
-        }
-        return url;
+    if (url.rfind("file://", 0) == 0) {
+        return pathFromFileURL(url);
     }
-    std::string_view rest = std::string_view(url).substr(kScheme.size());
-    auto pathStart = rest.find('/');
-    if (pathStart == std::string_view::npos) {
+    if (url.find("://") != std::string::npos) {
         return std::nullopt;
     }
-    std::string_view host = rest.substr(0, pathStart);
-    if (!host.empty() && host != "localhost") {
-        return std::nullopt;
-    }
-    std::string_view encoded = rest.substr(pathStart);
-    std::string path;
-    for (std::size_t index = 0; index < encoded.size(); ++index) {
-        if (encoded[index] != '%') {
-            path += encoded[index];
-            continue;
-        }
-        if (index + 2 >= encoded.size()) {
-            return std::nullopt;
-        }
-        int high = hexDigitValue(encoded[index + 1]);
-        int low = hexDigitValue(encoded[index + 2]);
-        if (high < 0 || low < 0 || (high == 0 && low == 0)) {
-            return std::nullopt;
-        }
-        path += static_cast<char>(high * 16 + low);
-        index += 2;
-    }
-    return path;
+    return url;
 }
 
 }  // namespace

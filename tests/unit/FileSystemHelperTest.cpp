@@ -19,27 +19,10 @@ namespace {
 namespace fs = std::filesystem;
 using test::readText;
 using test::TempDir;
+using test::Tree;
 using test::writeText;
-using Tree = std::map<std::string, std::string>;
 
-// Every entry below root: directories as "/", links as "-> target", files by their content.
-Tree snapshot(const std::string& root) {
-    Tree tree;
-    if (!fs::exists(fs::symlink_status(root))) {
-        return tree;
-    }
-    for (const auto& entry : fs::recursive_directory_iterator(root)) {
-        std::string relative = entry.path().lexically_relative(root).string();
-        if (entry.is_symlink()) {
-            tree[relative] = "-> " + fs::read_symlink(entry.path()).string();
-        } else if (entry.is_directory()) {
-            tree[relative] = "/";
-        } else {
-            tree[relative] = readText(entry.path().string());
-        }
-    }
-    return tree;
-}
+using test::snapshotTree;
 
 mode_t modeOf(const std::string& path) {
     struct stat info {};
@@ -72,16 +55,16 @@ class FileSystemHelperTransfer : public testing::Test {
 TEST_F(FileSystemHelperTransfer, MoveIntoExistingDirectoryMergesAndRemovesTheSource) {
     makeOverlappingTrees();
     EXPECT_EQ(helper.moveItem(source, destination), 0);
-    EXPECT_EQ(snapshot(destination + "/payload"), mergedTree);
+    EXPECT_EQ(snapshotTree(destination + "/payload"), mergedTree);
     EXPECT_FALSE(fs::exists(source));
 }
 
 TEST_F(FileSystemHelperTransfer, CopyIntoExistingDirectoryMergesAndKeepsTheSource) {
     makeOverlappingTrees();
-    Tree before = snapshot(source);
+    Tree before = snapshotTree(source);
     EXPECT_EQ(helper.copyItem(source, destination), 0);
-    EXPECT_EQ(snapshot(destination + "/payload"), mergedTree);
-    EXPECT_EQ(snapshot(source), before);
+    EXPECT_EQ(snapshotTree(destination + "/payload"), mergedTree);
+    EXPECT_EQ(snapshotTree(source), before);
 }
 
 TEST_F(FileSystemHelperTransfer, CopyKeepsModesAndLinksAndPlacesTheSourceInsideADirectory) {
@@ -91,7 +74,7 @@ TEST_F(FileSystemHelperTransfer, CopyKeepsModesAndLinksAndPlacesTheSourceInsideA
     fs::create_directory_symlink("../elsewhere", source + "/link");
     fs::create_directories(destination);
     EXPECT_EQ(helper.copyItem(source, destination + "/"), 0);
-    EXPECT_EQ(snapshot(destination + "/payload"),
+    EXPECT_EQ(snapshotTree(destination + "/payload"),
               (Tree{{"script", "#!/bin/sh\n"}, {"link", "-> ../elsewhere"}}));
     EXPECT_EQ(modeOf(destination + "/payload/script"), 0750u);
     EXPECT_EQ(modeOf(destination + "/payload"), 0705u);
@@ -101,16 +84,16 @@ TEST_F(FileSystemHelperTransfer, NonDirectoryInsideTheDestinationIsReplaced) {
     writeText(source + "/x", "x");
     writeText(destination + "/payload", "a file in the way");
     EXPECT_EQ(helper.moveItemWithOwner(source, destination, ::getuid(), ::getgid()), 0);
-    EXPECT_EQ(snapshot(destination), (Tree{{"payload", "/"}, {"payload/x", "x"}}));
+    EXPECT_EQ(snapshotTree(destination), (Tree{{"payload", "/"}, {"payload/x", "x"}}));
 }
 
 TEST_F(FileSystemHelperTransfer, DirectoryOntoRegularFileAnswers17AndChangesNothing) {
     writeText(source + "/x", "x");
     writeText(destination, "file");
-    Tree before = snapshot(dir.path());
+    Tree before = snapshotTree(dir.path());
     EXPECT_EQ(helper.moveItem(source, destination), 17);
     EXPECT_EQ(helper.copyItem(source, destination), 17);
-    EXPECT_EQ(snapshot(dir.path()), before);
+    EXPECT_EQ(snapshotTree(dir.path()), before);
 }
 
 TEST_F(FileSystemHelperTransfer, FileOntoRegularFileReplacesIt) {
@@ -156,7 +139,7 @@ TEST(FileSystemPrimitives, MoveAcrossFileSystemsCopiesAndRemoves) {
     writeText(local / "tree/f", "f");
     fs::create_symlink("f", local / "tree/l");
     ASSERT_EQ(moveItemTree(local / "tree", target), 0);
-    EXPECT_EQ(snapshot(target), (Tree{{"f", "f"}, {"l", "-> f"}}));
+    EXPECT_EQ(snapshotTree(target), (Tree{{"f", "f"}, {"l", "-> f"}}));
     EXPECT_FALSE(fs::exists(local / "tree"));
     EXPECT_EQ(moveItemTree(target, target), EEXIST);
     fs::remove_all(target);

@@ -24,27 +24,10 @@ using test::Container;
 using test::randomBytes;
 using test::readText;
 using test::TempDir;
+using test::Tree;
 using test::writeText;
-using Tree = std::map<std::string, std::string>;
 
-// Every entry below root: directories as "/", links as "-> target", files by their content.
-Tree snapshot(const fs::path& root) {
-    Tree tree;
-    if (!fs::exists(fs::symlink_status(root))) {
-        return tree;
-    }
-    for (const auto& entry : fs::recursive_directory_iterator(root)) {
-        std::string relative = entry.path().lexically_relative(root).string();
-        if (entry.is_symlink()) {
-            tree[relative] = "-> " + fs::read_symlink(entry.path()).string();
-        } else if (entry.is_directory()) {
-            tree[relative] = "/";
-        } else {
-            tree[relative] = readText(entry.path().string());
-        }
-    }
-    return tree;
-}
+using test::snapshotTree;
 
 struct stat statOf(const std::string& path) {
     struct stat info {};
@@ -94,14 +77,14 @@ TEST_P(PayloadFormats, ExtractLayoutBytesModesAndTimes) {
                                          test::symlinkItem("link", "Info.plist"),
                                      })));
 
-    EXPECT_EQ(snapshot(destination), (Tree{{"sub", "/"},
-                                           {"sub/data.bin", binary},
-                                           {"Info.plist", "<plist/>"},
-                                           {"run.sh", "#!/bin/sh\n"},
-                                           {"deep", "/"},
-                                           {"deep/er", "/"},
-                                           {"deep/er/empty", ""},
-                                           {"link", "-> Info.plist"}}));
+    EXPECT_EQ(snapshotTree(destination), (Tree{{"sub", "/"},
+                                               {"sub/data.bin", binary},
+                                               {"Info.plist", "<plist/>"},
+                                               {"run.sh", "#!/bin/sh\n"},
+                                               {"deep", "/"},
+                                               {"deep/er", "/"},
+                                               {"deep/er/empty", ""},
+                                               {"link", "-> Info.plist"}}));
     EXPECT_EQ(statOf(dir / "dest/sub/data.bin").st_mode & 07777, 0600u);
     EXPECT_EQ(statOf(dir / "dest/sub/data.bin").st_mtime, 1300000000);
     EXPECT_EQ(statOf(dir / "dest/run.sh").st_mode & 07777, 0755u);
@@ -164,7 +147,7 @@ TEST_F(PayloadExtraction, EntryThatCannotBeCreatedIsSkipped) {
         Container::Tar, Compression::Gzip,
         {test::fileItem("before.txt", "before"), test::hardlinkItem("orphan", "no-such-target"),
          test::fileItem("after.txt", "after")})));
-    EXPECT_EQ(snapshot(destination), (Tree{{"before.txt", "before"}, {"after.txt", "after"}}));
+    EXPECT_EQ(snapshotTree(destination), (Tree{{"before.txt", "before"}, {"after.txt", "after"}}));
     EXPECT_TRUE(log.contains(""));
 }
 
@@ -201,10 +184,11 @@ TEST_F(PayloadExtraction, PathSafeRefusesEntriesLeavingTheDestination) {
                                      }),
                         ExtractionSafety::PathSafe));
 
-    EXPECT_EQ(snapshot(outside), (Tree{{"secret", "secret"}}));
+    EXPECT_EQ(snapshotTree(outside), (Tree{{"secret", "secret"}}));
     EXPECT_FALSE(fs::exists(dir / "beside.txt"));
     EXPECT_FALSE(fs::exists(dir / "up.txt"));
-    EXPECT_EQ(snapshot(destination), (Tree{{"escape", "-> " + outside}, {"inside.txt", "inside"}}));
+    EXPECT_EQ(snapshotTree(destination),
+              (Tree{{"escape", "-> " + outside}, {"inside.txt", "inside"}}));
     EXPECT_TRUE(log.contains("Refusing the archive entry ../beside.txt: it leads outside " +
                              fs::canonical(destination).string() + "\n"));
 }
@@ -242,7 +226,7 @@ TEST_F(BundleInstall, EachPayloadReplacesTheUserBundle) {
         Container::Tar, Compression::Gzip,
         {test::fileItem("Info.plist", "one"), test::fileItem("Overlay/old.plist", "old")});
     install(first);
-    EXPECT_EQ(snapshot(bundle),
+    EXPECT_EQ(snapshotTree(bundle),
               (Tree{{"Info.plist", "one"}, {"Overlay", "/"}, {"Overlay/old.plist", "old"}}));
     EXPECT_EQ(log.messages(),
               (std::vector<std::string>{
@@ -253,7 +237,7 @@ TEST_F(BundleInstall, EachPayloadReplacesTheUserBundle) {
 
     install(buildArchive(Container::Cpio, Compression::Compress,
                          {test::fileItem("Info.plist", "two")}));
-    EXPECT_EQ(snapshot(bundle), (Tree{{"Info.plist", "two"}}));
+    EXPECT_EQ(snapshotTree(bundle), (Tree{{"Info.plist", "two"}}));
 
     // An empty payload still removes the old bundle and leaves an empty one.
     install("");
@@ -272,7 +256,7 @@ TEST(WriteDataToFile, ReplacesTheFileAndLogsEitherWay) {
     EXPECT_EQ(readText(path), "new");
     EXPECT_TRUE(log.contains("Successfully wrote the KW Data to file: " + path + "\n"));
     // Nothing but the file itself is left in the directory.
-    EXPECT_EQ(snapshot(dir.path()), (Tree{{"staged.tgz", "new"}}));
+    EXPECT_EQ(snapshotTree(dir.path()), (Tree{{"staged.tgz", "new"}}));
 
     const std::string unwritable = dir / "missing/staged.tgz";
     EXPECT_TRUE(writeDataToFile(plist::Data{'x'}, unwritable));

@@ -3,6 +3,7 @@
 
 #include <filesystem>
 #include <fstream>
+#include <map>
 #include <string>
 
 namespace tavrix::test {
@@ -40,6 +41,28 @@ inline void writeText(const std::string& path, const std::string& text) {
 inline std::string readText(const std::string& path) {
     std::ifstream in(path, std::ofstream::binary);
     return std::string(std::istreambuf_iterator<char>(in), {});
+}
+
+// Every entry below root by its path relative to root: directories as "/", links as
+// "-> target", files by their content. Empty when root does not exist.
+using Tree = std::map<std::string, std::string>;
+inline Tree snapshotTree(const std::filesystem::path& root) {
+    namespace fs = std::filesystem;
+    Tree tree;
+    if (!fs::exists(fs::symlink_status(root))) {
+        return tree;
+    }
+    for (const auto& entry : fs::recursive_directory_iterator(root)) {
+        std::string relative = entry.path().lexically_relative(root).string();
+        if (entry.is_symlink()) {
+            tree[relative] = "-> " + fs::read_symlink(entry.path()).string();
+        } else if (entry.is_directory()) {
+            tree[relative] = "/";
+        } else {
+            tree[relative] = readText(entry.path().string());
+        }
+    }
+    return tree;
 }
 
 }  // namespace tavrix::test

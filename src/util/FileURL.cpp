@@ -1,4 +1,4 @@
-#include "bundle/FileURL.h"
+#include "util/FileURL.h"
 
 #include <unistd.h>
 

@@ -1,4 +1,4 @@
-// File URLs for the carrier file loader: a path turned into a "file://" URL and back.
+// File URLs: a path turned into a "file://" URL and back.
 #pragma once
 
 #include <optional>
