@@ -2,7 +2,8 @@
 # The demo: lays out a device root in demo-root/ from examples/, starts a private message bus that
 # activates the freshly built daemon on demand, and walks through the daemon's main job with
 # tavrixctl: a behavior ID set with a packed bundle, the bundle match, the links, the generated
-# overlay file, the notification, and a repeated call that changes nothing.
+# overlay file, the notification, a repeated call that changes nothing, and an over-the-air
+# update from a signed catalog served on 127.0.0.1.
 # usage: scripts/demo.sh BUILD_DIR
 set -euo pipefail
 build=$(cd "${1:-build}" && pwd)
@@ -12,8 +13,16 @@ work=$(mktemp -d /tmp/tavrix-demo-XXXXXX)
 ctl="$build/tools/tavrixctl"
 plist="$build/tools/tavrix-plist"
 home="$root/var/mobile"
+catalog_tool="$build/tools/tavrix-catalog"
 . "$top/scripts/private-bus.sh"
-trap 'stop_private_bus; rm -rf "$work"' EXIT
+http_server=
+stop_http_server() {
+    [ -n "$http_server" ] || return 0
+    kill "$http_server" 2>/dev/null || true
+    wait "$http_server" 2>/dev/null || true
+    http_server=
+}
+trap 'stop_http_server; stop_private_bus; rm -rf "$work"' EXIT
 
 step() { printf '\n\033[1m== %s\033[0m\n' "$*"; }
 run() { printf '$ %s\n' "$*"; "$@" || true; }
@@ -80,3 +89,50 @@ step "A call with the wrong arguments is refused and the daemon keeps serving"
 run busctl --address="$DBUS_SYSTEM_BUS_ADDRESS" call com.zandor.tavrixservicesd \
     /com/zandor/tavrixservicesd com.zandor.TXManagerServerInterface SetTavrixID i 5
 run "$ctl" supported
+
+step "Over-the-air update from a local catalog"
+# The published bundle says version 11 in its own Info.plist too: the version the daemon compares
+# after installing is the bundle's, not the catalog's.
+mkdir -p "$work/v11"
+cp -a "$top/examples/bundles/Default.bundle" "$work/v11/"
+sed -i 's|<string>10</string>|<string>11</string>|' "$work/v11/Default.bundle/Info.plist"
+run "$catalog_tool" keygen "$work/signing.key" "$work/signing.pub"
+run "$catalog_tool" publish "$work/site" --key "$work/signing.key" "$work/v11/Default.bundle" \
+    --version 11
+port=$(python3 -c 'import socket; s = socket.socket(); s.bind(("127.0.0.1", 0)); print(s.getsockname()[1])')
+python3 -m http.server --bind 127.0.0.1 --directory "$work/site" "$port" > "$work/http.log" 2>&1 &
+http_server=$!
+for _ in $(seq 100); do
+    curl -s -o /dev/null "http://127.0.0.1:$port/catalog.plist" && break
+    sleep 0.05
+done
+printf 'serving %s at http://127.0.0.1:%s/\n' "$work/site" "$port"
+cat > "$root/etc/tavrix/AssetCatalog.plist" <<SETTINGS
+<?xml version="1.0" encoding="UTF-8"?>
+<plist version="1.0">
+<dict>
+	<key>AssetTypes</key>
+	<dict>
+		<key>com.zandor.Grellas.TavrixBundles</key>
+		<dict>
+			<key>CatalogURL</key>
+			<string>http://127.0.0.1:$port/catalog.plist</string>
+			<key>PublicKey</key>
+			<string>$(cat "$work/signing.pub")</string>
+		</dict>
+	</dict>
+</dict>
+</plist>
+SETTINGS
+printf '%s:\n' "/etc/tavrix/AssetCatalog.plist"
+"$plist" "$root/etc/tavrix/AssetCatalog.plist" | sed 's/^/   /'
+mark=$(log_mark)
+run "$ctl" check-update --wait 20
+
+step "What the daemon did for the update"
+log_since "$mark" | grep -E 'Current version|Query returned|A higher version|Best Candidate|Asset catalog: (downloading|installed|download of|refusing)|Current operation: (Completed|Failed)|Copying the directory|redoing bundle match|Match Result|purged'
+
+step "The links and the bundle version now linked"
+show_links
+printf '   linked bundle: %s\n' \
+    "$("$plist" "$home/Library/Tavrix.bundle/Info.plist" | grep QZBundleVersion | sed 's/^ *//')"

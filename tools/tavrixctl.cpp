@@ -35,6 +35,9 @@ using tavrix::client::TavrixClient;
 constexpr int kFailure = 1;
 constexpr int kUsage = 2;
 
+// Posted by the daemon after it linked a changed bundle.
+constexpr const char* kBundleChangedNotification = "kTVXBehaviorBundleChangedNotification";
+
 constexpr const char* kOverallHelp =
     "usage: tavrixctl [--address ADDRESS] COMMAND [ARGUMENTS]\n"
     "\n"
@@ -44,7 +47,8 @@ constexpr const char* kOverallHelp =
     "  set-id ID [--bundle FILE]  set the behavior ID, optionally with a packed bundle\n"
     "  supported                  tell whether behavior bundles are supported\n"
     "  value KEY                  print the behavior setting for KEY\n"
-    "  check-update               look for a newer behavior bundle and install it\n"
+    "  check-update [--wait SECONDS]\n"
+    "                             look for a newer behavior bundle and install it\n"
     "  client-type N              announce this client's type N\n"
     "  watch [--count N] [--timeout SECONDS]\n"
     "                             print the names of posted notifications\n"
@@ -80,10 +84,13 @@ constexpr Command kCommands[] = {
      "Prints the behavior setting for KEY (strings as they are, other values readably), or\n"
      "\"(no value)\" when there is none.\n"},
     {"check-update",
-     "usage: tavrixctl check-update\n"
+     "usage: tavrixctl check-update [--wait SECONDS]\n"
      "\n"
      "Asks the daemon to look for a newer behavior bundle and install it. Prints \"yes\" when\n"
-     "an update was found and started, else \"no\".\n"},
+     "an update was found and its download started, else \"no\". The download and the\n"
+     "installation go on in the daemon after the answer. With --wait, after a \"yes\" it waits\n"
+     "up to SECONDS for the daemon to announce the installed bundle and prints the\n"
+     "notification's name; exits 1 when none came in time.\n"},
     {"client-type",
      "usage: tavrixctl client-type N\n"
      "\n"
@@ -374,6 +381,32 @@ int watch(TavrixClient& client, std::optional<long long> count,
     return 0;
 }
 
+// The update is installed after the answer, on the daemon's own time; waiting shows its end.
+int checkUpdate(TavrixClient& client, std::optional<std::chrono::milliseconds> wait) {
+    bool announced = false;
+    tavrix::client::NotificationSubscription subscription;
+    if (wait) {
+        // Subscribed before asking, so that a quick installation is not missed.
+        subscription = client.subscribe([&](const std::string& name) {
+            announced = announced || name == kBundleChangedNotification;
+        });
+    }
+    const bool started = client.checkForTavrixBundleUpdate();
+    printBoolean(started);
+    if (!wait || !started) {
+        return 0;
+    }
+    std::fflush(stdout);
+    if (!client.runUntil([&] { return announced; }, *wait)) {
+        char seconds[32];
+        std::snprintf(seconds, sizeof seconds, "%g", static_cast<double>(wait->count()) / 1000);
+        throw Failure{std::string("check-update: no new bundle was announced within ") + seconds +
+                      " seconds"};
+    }
+    std::printf("%s\n", kBundleChangedNotification);
+    return 0;
+}
+
 Action parseWatch(Arguments& arguments) {
     std::optional<long long> count;
     if (auto text = arguments.takeOption("--count")) {
@@ -425,11 +458,17 @@ Action parseCommand(const Command& command, Arguments& arguments) {
         };
     }
     if (name == "check-update") {
+        std::optional<std::chrono::milliseconds> wait;
+        if (auto text = arguments.takeOption("--wait")) {
+            auto seconds = parseSeconds(*text);
+            if (!seconds) {
+                throw UsageError{"check-update: --wait needs a number of seconds, not '" + *text +
+                                 "'"};
+            }
+            wait = std::chrono::milliseconds(std::llround(*seconds * 1000));
+        }
         arguments.operands({});
-        return [](TavrixClient& client) {
-            printBoolean(client.checkForTavrixBundleUpdate());
-            return 0;
-        };
+        return [wait](TavrixClient& client) { return checkUpdate(client, wait); };
     }
     if (name == "client-type") {
         auto text = arguments.operands({"N"})[0];

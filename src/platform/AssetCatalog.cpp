@@ -39,6 +39,9 @@ void Asset::beginDownload(const plist::Dictionary& /*options*/) {
             return;
         }
         downloading_ = true;
+        if (!unfinished_) {
+            unfinished_.emplace();
+        }
     }
     // The task holds the asset until its download is over.
     auto self = shared_from_this();
@@ -46,6 +49,7 @@ void Asset::beginDownload(const plist::Dictionary& /*options*/) {
             [self] { self->runDownload(); })) {
         std::lock_guard lock(mutex_);
         downloading_ = false;
+        unfinished_.reset();
     }
 }
 
@@ -95,6 +99,7 @@ void Asset::deliverReports() {
     for (;;) {
         ProgressHandler handler;
         plist::Dictionary progress;
+        bool last = false;
         {
             std::lock_guard lock(mutex_);
             if (!handler_ || undelivered_.empty()) {
@@ -103,12 +108,20 @@ void Asset::deliverReports() {
             handler = handler_;
             progress = std::move(undelivered_.front());
             undelivered_.pop_front();
-            if (isFinalReport(progress)) {
+            last = isFinalReport(progress);
+            if (last) {
                 // The handler usually captures this asset; dropping it breaks that cycle.
                 handler_ = nullptr;
             }
         }
         handler(progress);
+        if (last) {
+            // The handler has installed what was downloaded: the process may leave now.
+            std::lock_guard lock(mutex_);
+            if (!downloading_) {
+                unfinished_.reset();
+            }
+        }
     }
 }
 
@@ -122,8 +135,9 @@ std::optional<std::string> Asset::localURL() const {
 
 void Asset::purge(PurgeCompletion completion) {
     auto self = shared_from_this();
+    auto unfinished = std::make_shared<ScopedServiceTransaction>();
     AssetCatalogService::shared().workerQueue().dispatchAsync(
-        [self, completion = std::move(completion)] {
+        [self, unfinished, completion = std::move(completion)] {
             int error = payload::removeItemTree(self->directory_);
             bool purged = error == 0 || error == ENOENT;
             if (!purged) {

@@ -6,6 +6,10 @@
 // on the service's delivery thread, in order; reports made before a handler is set wait for it.
 // After the last report (completed or failed) the handler is dropped, so a handler may capture
 // its asset.
+//
+// The download runs in this process, so from its start until its last report has been handled
+// (or the asset is dropped) it holds a service-manager transaction: the daemon does not leave for
+// idleness in the middle of it. A purge holds one until its completion has run.
 #pragma once
 
 #include <cstdint>
@@ -18,6 +22,7 @@
 #include <vector>
 
 #include "platform/AssetCatalogFormat.h"
+#include "platform/ServiceManager.h"
 #include "plist/Value.h"
 
 namespace tavrix::platform {
@@ -78,6 +83,8 @@ class Asset : public std::enable_shared_from_this<Asset> {
     bool downloading_ = false;
     ProgressHandler handler_;
     std::deque<plist::Dictionary> undelivered_;
+    // Open from beginDownload until the last report has been handled.
+    std::optional<ScopedServiceTransaction> unfinished_;
 };
 
 // A query for the assets of one type. Without settings for the type it answers no assets and logs

@@ -57,4 +57,14 @@ class ServiceManager {
     mutable std::mutex keepAliveMutex_;
 };
 
+// One service-manager transaction, open while the object lives: work the process must finish
+// before it may leave for idleness.
+class ScopedServiceTransaction {
+  public:
+    ScopedServiceTransaction() { ServiceManager::shared().openTransaction(); }
+    ~ScopedServiceTransaction() { ServiceManager::shared().closeTransaction(); }
+    ScopedServiceTransaction(const ScopedServiceTransaction&) = delete;
+    ScopedServiceTransaction& operator=(const ScopedServiceTransaction&) = delete;
+};
+
 }  // namespace tavrix::platform

@@ -1,0 +1,407 @@
+// Over-the-air bundle updates as a device sees them: a catalog made and signed by the publishing
+// tool, served over HTTP on 127.0.0.1, a newer bundle installed over the user bundle and linked,
+// and downloads that go wrong leaving the linked bundle as it was.
+#include <signal.h>
+#include <sodium.h>
+
+#include <cmath>
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <thread>
+
+#include "BusFixture.h"
+#include "CommandRunner.h"
+#include "LocalHttpServer.h"
+#include "platform/BackgroundJobScheduler.h"
+#include "platform/Clock.h"
+#include "plist/PropertyListFormat.h"
+#include "update/UpdateCheckScheduler.h"
+
+namespace tavrix::integration {
+namespace {
+
+namespace fs = std::filesystem;
+
+constexpr const char* kChanged = "kTVXBehaviorBundleChangedNotification";
+constexpr const char* kUserBundle = "/var/mobile/Library/TavrixBundles/Default.bundle";
+constexpr const char* kBundleLink = "/var/mobile/Library/Tavrix.bundle";
+constexpr const char* kPreferencesLink = "/var/mobile/Library/Preferences/com.zandor.tavrix.plist";
+constexpr const char* kAssetCache = "/var/cache/tavrixservicesd/com.zandor.Grellas.TavrixBundles";
+constexpr const char* kBehaviorID = "acme.default";
+
+constexpr double kOneDay = 86400.0;
+constexpr double kFifteenDays = 1296000.0;
+
+std::string readFile(const fs::path& path) {
+    std::ifstream in(path, std::fstream::binary);
+    return {std::istreambuf_iterator<char>(in), {}};
+}
+
+void writeFile(const fs::path& path, const std::string& bytes) {
+    fs::create_directories(path.parent_path());
+    std::ofstream(path, std::fstream::binary | std::fstream::trunc) << bytes;
+}
+
+class OverTheAirUpdateTest : public BusFixture {
+  protected:
+    OverTheAirUpdateTest() { busOptions.idleExitSeconds = 30; }
+
+    void SetUp() override {
+        BusFixture::SetUp();
+        fs::create_directories(keys_);
+        CommandResult keys = runCommand(
+            {TAVRIX_CATALOG_TOOL, "keygen", secretKey().string(), (keys_ / "public").string()});
+        ASSERT_EQ(keys.status, 0) << keys.output;
+        std::string publicKey = readFile(keys_ / "public");
+        while (!publicKey.empty() && publicKey.back() == '\n') {
+            publicKey.pop_back();
+        }
+        server.serveDirectory("/updates/", site());
+        ASSERT_TRUE(plist::writeFile(
+            at("/etc/tavrix/AssetCatalog.plist").string(),
+            plist::Value(plist::Dictionary{
+                {"AssetTypes",
+                 plist::Dictionary{{"com.zandor.Grellas.TavrixBundles",
+                                    plist::Dictionary{
+                                        {"CatalogURL", server.url("/updates/catalog.plist")},
+                                        {"PublicKey", publicKey},
+                                    }}}}})));
+        // A check already armed a few days ahead, so that every re-arm shows.
+        device().writeDaemonPreferences(
+            {{"EnableSupport", true}, {"NextUpdate", plist::Date{now() + 3 * kOneDay}}});
+    }
+
+    static double now() { return platform::Clock::absoluteTimeNow(); }
+    fs::path at(const char* absolutePath) { return device().path(absolutePath); }
+    fs::path site() { return device().base() / "site"; }
+    fs::path secretKey() { return keys_ / "secret"; }
+
+    // A bundle: its Info.plist, the base carrier file naming the version, and one file of its own.
+    fs::path writeBundle(const std::string& version) {
+        const fs::path directory = device().base() / ("bundles/" + version + "/Default.bundle");
+        fs::create_directories(directory);
+        EXPECT_TRUE(plist::writeFile(
+            (directory / "Info.plist").string(),
+            plist::Value(plist::Dictionary{{"QZBundleIdentifier", "com.zandor.tavrix.bundle.ota"},
+                                           {"QZBundleVersion", version}})));
+        EXPECT_TRUE(plist::writeFile(
+            (directory / "behavior.plist").string(),
+            plist::Value(plist::Dictionary{{"CarrierName", "Bundle " + version}})));
+        writeFile(directory / ("Resources/only-in-" + version + ".txt"), version);
+        return directory;
+    }
+
+    // Sets the behavior ID with the bundle of this version, packed as senders pack it.
+    void setIDWithBundle(const std::string& version) {
+        const fs::path archive = device().base() / ("payload-" + version + ".tgz");
+        CommandResult packed = runCommand({"/usr/bin/bsdtar", "-czf", archive.string(), "-C",
+                                           writeBundle(version).string(), "."});
+        ASSERT_EQ(packed.status, 0) << packed.output;
+        const std::string bytes = readFile(archive);
+        ASSERT_TRUE(client().setTavrixID(kBehaviorID,
+                                         std::vector<std::uint8_t>(bytes.begin(), bytes.end())));
+    }
+
+    // Publishes the bundle of this version, signed, as the only asset of the catalog; answers
+    // the archive's URL path.
+    std::string publish(const std::string& version) {
+        CommandResult run =
+            runCommand({TAVRIX_CATALOG_TOOL, "publish", site().string(), "--key",
+                        secretKey().string(), "--fresh", writeBundle(version).string()});
+        EXPECT_EQ(run.status, 0) << run.output;
+        return "/updates/archives/Default-" + version + ".tgz";
+    }
+
+    fs::path published(const std::string& urlPath) {
+        return site() / urlPath.substr(std::string("/updates/").size());
+    }
+
+    // Every file of the user bundle with its content.
+    std::map<std::string, std::string> userBundleFiles() {
+        std::map<std::string, std::string> files;
+        std::error_code error;
+        for (auto it = fs::recursive_directory_iterator(at(kUserBundle), error);
+             !error && it != fs::recursive_directory_iterator(); it.increment(error)) {
+            if (it->is_regular_file()) {
+                files[fs::relative(it->path(), at(kUserBundle)).string()] = readFile(it->path());
+            }
+        }
+        return files;
+    }
+
+    std::string linkTarget(const char* link) {
+        std::error_code error;
+        fs::path target = fs::read_symlink(at(link), error);
+        return error ? std::string() : target.string();
+    }
+
+    // What the cache holds besides the kept catalog: downloads, staging and installed assets.
+    std::vector<std::string> cachedAssets() {
+        std::vector<std::string> names;
+        std::error_code error;
+        for (const auto& entry : fs::directory_iterator(at(kAssetCache), error)) {
+            if (!entry.path().filename().string().starts_with("catalog.plist")) {
+                names.push_back(entry.path().filename().string());
+            }
+        }
+        return names;
+    }
+
+    std::optional<double> nextUpdate() {
+        auto preferences = device().readDaemonPreferences();
+        const plist::Value* value = preferences ? preferences->find("NextUpdate") : nullptr;
+        return value != nullptr && value->asDate() != nullptr
+                   ? std::optional(value->asDate()->secondsSinceReferenceDate)
+                   : std::nullopt;
+    }
+
+    // Waits until "NextUpdate" is within a minute of now + seconds.
+    bool waitForNextUpdateIn(double seconds, std::chrono::milliseconds timeout = 10s) {
+        const auto deadline = std::chrono::steady_clock::now() + timeout;
+        for (;;) {
+            auto next = nextUpdate();
+            if (next && std::fabs(*next - (now() + seconds)) < 60.0) {
+                return true;
+            }
+            if (std::chrono::steady_clock::now() > deadline) {
+                return false;
+            }
+            std::this_thread::sleep_for(20ms);
+        }
+    }
+
+    void setNextUpdate(double when) {
+        auto preferences = device().readDaemonPreferences();
+        ASSERT_TRUE(preferences && preferences->isDictionary());
+        plist::Dictionary values = *preferences->asDictionary();
+        values.insert_or_assign("NextUpdate", plist::Date{when});
+        device().writeDaemonPreferences(values);
+    }
+
+    int countLogLinesContaining(const std::string& text) const {
+        int count = 0;
+        for (const std::string& line : daemonLogLines()) {
+            count += line.find(text) != std::string::npos ? 1 : 0;
+        }
+        return count;
+    }
+
+    bool waitForLogLinesContaining(const std::string& text, int count,
+                                   std::chrono::milliseconds timeout = 30s) const {
+        const auto deadline = std::chrono::steady_clock::now() + timeout;
+        while (countLogLinesContaining(text) < count) {
+            if (std::chrono::steady_clock::now() > deadline) {
+                return false;
+            }
+            std::this_thread::sleep_for(20ms);
+        }
+        return true;
+    }
+
+    // The installed bundle of this version is linked and read as the behavior settings.
+    void expectInstalled(const std::string& version) {
+        auto files = userBundleFiles();
+        EXPECT_EQ(files.count("Resources/only-in-" + version + ".txt"), 1u) << version;
+        EXPECT_EQ(files.size(), 3u) << "entries of the previous bundle are gone";
+        EXPECT_EQ(linkTarget(kBundleLink), at(kUserBundle).string());
+        EXPECT_EQ(linkTarget(kPreferencesLink), (at(kUserBundle) / "behavior.plist").string());
+        EXPECT_EQ(client().copyTavrixValue("CarrierName"),
+                  std::optional<plist::Value>("Bundle " + version));
+    }
+
+    test::LocalHttpServer server;
+
+  private:
+    fs::path keys_ = device().base() / "keys";
+};
+
+// Version 2 published over an installed version 1: downloaded, copied over the user bundle,
+// matched, linked and announced once; the download is purged and the next check is 15 days on.
+// The check after that finds nothing newer than what is installed now.
+TEST_F(OverTheAirUpdateTest, NewerPublishedBundleIsInstalledLinkedAndAnnounced) {
+    setIDWithBundle("1");
+    ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
+    expectInstalled("1");
+
+    publish("2");
+    // As an operator asks for it: tavrixctl waits for the installed bundle's announcement.
+    CommandResult check =
+        runCommand({TAVRIX_CTL_PATH, "--address", busAddress(), "check-update", "--wait", "30"});
+    EXPECT_EQ(check.status, 0);
+    EXPECT_EQ(check.output, std::string("yes\n") + kChanged + "\n");
+    ASSERT_TRUE(watcher().waitForNotification(kChanged, 2, 30s));
+    expectInstalled("2");
+    EXPECT_TRUE(waitForLogLine("Behavior ID acme.default is already sent, redoing bundle match"));
+    EXPECT_EQ(countLogLines("Carrier Bundle Match Result: kBundleChangeTypeUpdate"), 2);
+    EXPECT_TRUE(waitForLogLine("Best candidate asset has been purged"));
+    EXPECT_EQ(cachedAssets(), std::vector<std::string>{});
+    EXPECT_TRUE(waitForNextUpdateIn(kFifteenDays));
+
+    check =
+        runCommand({TAVRIX_CTL_PATH, "--address", busAddress(), "check-update", "--wait", "30"});
+    EXPECT_EQ(check.status, 0);
+    EXPECT_EQ(check.output, "no\n") << "nothing started, nothing to wait for";
+    EXPECT_TRUE(waitForLogLine("Current version: 2"));
+    EXPECT_TRUE(waitForLogLine("No higher update available"));
+    EXPECT_FALSE(watcher().waitForNotification(kChanged, 3, 500ms));
+}
+
+// Each way an update can go wrong leaves the linked bundle and its files as they were, posts
+// nothing and leaves no download behind; a download that started and failed re-arms the check a
+// day ahead, a refused catalog starts nothing. A good update afterwards still installs.
+TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheDaemonKeepsServing) {
+    setIDWithBundle("1");
+    ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
+    const auto installedFiles = userBundleFiles();
+    const std::string carrierFile = linkTarget(kPreferencesLink);
+
+    struct Case {
+        const char* name;
+        std::function<void()> arrange;
+        // True when the download starts (and fails); false when no candidate is found.
+        bool started;
+        const char* logged;
+    };
+    const std::vector<Case> cases{
+        {"archive changed on the server",
+         [&] {
+             fs::path archive = published(publish("2"));
+             std::string bytes = readFile(archive);
+             bytes[bytes.size() / 2] = static_cast<char>(bytes[bytes.size() / 2] ^ 0x55);
+             writeFile(archive, bytes);
+         },
+         true, "the archive's SHA-256 is"},
+        {"wrong digest in a validly signed catalog",
+         [&] {
+             publish("2");
+             auto catalog = plist::readFile((site() / "catalog.plist").string());
+             ASSERT_TRUE(catalog);
+             plist::Value& entry = catalog->asDictionary()->at("Assets").asArray()->at(0);
+             entry.asDictionary()->insert_or_assign("ArchiveSHA256", std::string(64, 'a'));
+             ASSERT_TRUE(plist::writeFile((site() / "catalog.plist").string(), *catalog));
+             // Signed again with the publisher's key, so only the digest is wrong.
+             const std::string bytes = readFile(site() / "catalog.plist");
+             const std::string secret = readFile(secretKey());
+             ASSERT_EQ(secret.size(), crypto_sign_SECRETKEYBYTES);
+             std::string signature(crypto_sign_BYTES, '\0');
+             ASSERT_GE(sodium_init(), 0);
+             crypto_sign_detached(reinterpret_cast<unsigned char*>(signature.data()), nullptr,
+                                  reinterpret_cast<const unsigned char*>(bytes.data()),
+                                  bytes.size(),
+                                  reinterpret_cast<const unsigned char*>(secret.data()));
+             writeFile(site() / "catalog.plist.sig", signature);
+         },
+         true, "the archive's SHA-256 is"},
+        {"catalog signature that does not verify",
+         [&] {
+             publish("2");
+             std::string signature = readFile(site() / "catalog.plist.sig");
+             signature[0] = static_cast<char>(signature[0] ^ 1);
+             writeFile(site() / "catalog.plist.sig", signature);
+         },
+         false, "its signature does not verify with the configured key"},
+        {"connection cut in the middle of the archive",
+         [&] {
+             std::string path = publish("2");
+             test::LocalHttpServer::Response cut;
+             cut.body = readFile(published(path));
+             cut.cutAfterBodyBytes = cut.body.size() / 2;
+             server.serve(path, cut);
+         },
+         true, "cannot download"},
+    };
+
+    int failedDownloads = 0;
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
+        // Whole seconds: that is what a stored date keeps.
+        const double armed = std::floor(now() + 3 * kOneDay);
+        setNextUpdate(armed);
+        c.arrange();
+        const int refusals = countLogLinesContaining(c.logged);
+        EXPECT_EQ(client().checkForTavrixBundleUpdate(), c.started);
+        if (c.started) {
+            ++failedDownloads;
+            EXPECT_TRUE(waitForLogLine("Current operation: Failed", 30s, failedDownloads));
+            EXPECT_TRUE(waitForNextUpdateIn(kOneDay));
+        } else {
+            EXPECT_EQ(nextUpdate(), std::optional<double>(armed));
+        }
+        EXPECT_GT(countLogLinesContaining(c.logged), refusals);
+        EXPECT_EQ(userBundleFiles(), installedFiles);
+        EXPECT_EQ(linkTarget(kBundleLink), at(kUserBundle).string());
+        EXPECT_EQ(linkTarget(kPreferencesLink), carrierFile);
+        EXPECT_EQ(cachedAssets(), std::vector<std::string>{});
+        EXPECT_FALSE(watcher().waitForNotification(kChanged, 2, 200ms));
+        EXPECT_TRUE(client().isTavrixBundleSupported());
+    }
+
+    publish("3");
+    EXPECT_TRUE(client().checkForTavrixBundleUpdate());
+    ASSERT_TRUE(watcher().waitForNotification(kChanged, 2, 30s));
+    expectInstalled("3");
+}
+
+class OverTheAirKeepAliveTest : public OverTheAirUpdateTest {
+  protected:
+    OverTheAirKeepAliveTest() { busOptions.idleExitSeconds = 1; }
+};
+
+// The scheduled check of a daemon that was started for it: its keep-alive transaction ends with
+// the download's first report, but the daemon stays while the download runs, however long the
+// server takes, installs the bundle, and leaves when idle afterwards.
+TEST_F(OverTheAirKeepAliveTest, ScheduledCheckKeepsTheDaemonUntilTheDownloadIsInstalled) {
+    setIDWithBundle("1");
+    ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
+    auto first = daemonPid();
+    ASSERT_TRUE(first);
+    ASSERT_EQ(::kill(*first, SIGTERM), 0);
+    ASSERT_EQ(waitForDaemonExit(*first), std::optional<int>(0));
+
+    const std::string archive = publish("2");
+    test::LocalHttpServer::Response held;
+    held.body = readFile(published(archive));
+    held.holdAfterBodyBytes = held.body.size() / 3;
+    server.serve(archive, held);
+
+    // The job's window came while the daemon was away: it fires when the daemon starts.
+    const double due = now() - 60.0;
+    setNextUpdate(due);
+    const std::string jobsFile = platform::BackgroundJobScheduler::jobsFilePathUnder(
+        device().root().string(), kUpdateCheckClientName);
+    fs::create_directories(fs::path(jobsFile).parent_path());
+    plist::Dictionary job{
+        {std::string(platform::kJobWindowStartDate), due},
+        {std::string(platform::kJobWindowEndDate), due + kUpdateCheckWindowSeconds},
+        {std::string(platform::kJobPowerOptimizationLevel), plist::Integer(1)},
+        {std::string(platform::kJobAllowedDuringVoiceCall), true}};
+    ASSERT_TRUE(
+        plist::writeFile(jobsFile, plist::Value(plist::Dictionary{{kUpdateCheckJobName, job}})));
+
+    const std::string launchEnded =
+        "*********** Ended Corvex transaction : TXMinimumLaunchTransaction ***********";
+    const int launchesEnded = countLogLines(launchEnded);
+    EXPECT_TRUE(client().isTavrixBundleSupported());
+    auto second = daemonPid();
+    ASSERT_TRUE(second);
+    EXPECT_TRUE(
+        waitForLogLine("*********** Beginning Corvex transaction : Update Check ***********"));
+    ASSERT_TRUE(server.waitForHeldResponse(30s));
+    EXPECT_TRUE(
+        waitForLogLine("*********** Ended Corvex transaction : Update Check ***********", 10s));
+    // Past the launch transaction and well past the idle grace, the download still holds it.
+    EXPECT_TRUE(waitForLogLine(launchEnded, 20s, launchesEnded + 1));
+    EXPECT_FALSE(waitForNoNameOwner(3s)) << "the daemon left in the middle of the download";
+
+    server.releaseHeldResponses();
+    EXPECT_TRUE(watcher().waitForNotification(kChanged, 2, 30s));
+    expectInstalled("2");
+    EXPECT_TRUE(waitForNextUpdateIn(kFifteenDays));
+    EXPECT_TRUE(waitForNoNameOwner(30s));
+    EXPECT_EQ(waitForDaemonExit(*second), std::optional<int>(0));
+    EXPECT_EQ(device().keepAliveFlag(), std::optional<std::string>("0"));
+}
+
+}  // namespace
+}  // namespace tavrix::integration
