@@ -89,6 +89,7 @@ void makeDeviceRoot(const fs::path& root) {
     writeBytes(root / "etc/passwd", "mobile:x:" + std::to_string(::getuid()) + ":" +
                                         std::to_string(::getgid()) +
                                         ":Mobile:/var/mobile:/usr/sbin/nologin\n");
+    fs::create_directories(root / "etc/tavrix");
     plist::writeFile(
         (root / "etc/tavrix/DeviceInfo.plist").string(),
         plist::Value(plist::Dictionary{
