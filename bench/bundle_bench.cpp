@@ -14,12 +14,15 @@
 #include <vector>
 
 #include "BenchSupport.h"
-#include "DbusDaemonProcess.h"
+#include "DaemonBench.h"
 #include "bundle/OverlayConfiguration.h"
 #include "client/TavrixClient.h"
 #include "plist/PropertyListFormat.h"
 
 using namespace tavrix;
+using bench::readBytes;
+using bench::runProgram;
+using bench::writeBytes;
 
 namespace {
 
@@ -29,32 +32,6 @@ constexpr int kPayloadRuns = 15;
 constexpr int kNoChangeRuns = 300;
 constexpr int kMergeRuns = 30;
 constexpr std::size_t kMergeKeys = 10000;
-
-void writeBytes(const fs::path& path, const std::string& bytes) {
-    fs::create_directories(path.parent_path());
-    std::ofstream(path, std::fstream::binary | std::fstream::trunc) << bytes;
-}
-
-std::string readBytes(const fs::path& path) {
-    std::ifstream in(path, std::fstream::binary);
-    return {std::istreambuf_iterator<char>(in), {}};
-}
-
-int runProgram(const std::vector<std::string>& argv) {
-    pid_t pid = ::fork();
-    if (pid == 0) {
-        std::vector<char*> args;
-        for (const auto& arg : argv) {
-            args.push_back(const_cast<char*>(arg.c_str()));
-        }
-        args.push_back(nullptr);
-        ::execv(args[0], args.data());
-        ::_exit(127);
-    }
-    int status = 0;
-    ::waitpid(pid, &status, 0);
-    return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-}
 
 // A bundle of about 1 MB packed: its carrier file with an overlay section for the ID used, and
 // incompressible resources, as bundles carry images and certificates.
@@ -80,7 +57,7 @@ fs::path makePayload(const fs::path& work) {
         writeBytes(bundle / "Resources" / ("blob" + std::to_string(i) + ".bin"), blob);
     }
     const fs::path payload = work / "payload.tgz";
-    runProgram({"/usr/bin/bsdtar", "-czf", payload.string(), "-C", bundle.string(), "."});
+    runProgram({"bsdtar", "-czf", payload.string(), "-C", bundle.string(), "."});
     return payload;
 }
 
@@ -142,20 +119,8 @@ void benchPayloads(const fs::path& work) {
     const std::string payloadText = readBytes(payloadFile);
     const std::vector<std::uint8_t> payload(payloadText.begin(), payloadText.end());
 
-    fs::create_directories(work / "services");
-    writeBytes(work / "services/com.zandor.tavrixservicesd.service",
-               "[D-BUS Service]\nName=com.zandor.tavrixservicesd\nExec=/usr/bin/env TAVRIX_ROOT=" +
-                   root.string() +
-                   " TAVRIX_LOG_STDERR=1 TAVRIX_IDLE_EXIT_SEC=300 RUNTIME_DIRECTORY=" +
-                   (work / "run").string() + " " + TAVRIX_DAEMON_PATH + "\n");
-    writeBytes(work / "bus.conf",
-               "<busconfig><type>session</type><listen>unix:path=" + (work / "socket").string() +
-                   "</listen><servicedir>" + (work / "services").string() +
-                   "</servicedir><auth>EXTERNAL</auth><policy context=\"default\">"
-                   "<allow send_destination=\"*\" eavesdrop=\"true\"/><allow eavesdrop=\"true\"/>"
-                   "<allow own=\"*\"/></policy></busconfig>\n");
-    test::DbusDaemonProcess bus(work / "bus.conf", work / "bus.log");
-    auto client = client::TavrixClient::connectToAddress(bus.address());
+    auto bus = bench::startDaemonBus(work, root);
+    auto client = client::TavrixClient::connectToAddress(bus->address());
 
     const fs::path extracted = work / "bsdtar-out";
     double ours =
@@ -163,7 +128,7 @@ void benchPayloads(const fs::path& work) {
     double peer = bench::medianMicros(kPayloadRuns, [&] {
         fs::remove_all(extracted);
         fs::create_directories(extracted);
-        runProgram({"/usr/bin/bsdtar", "-xzf", payloadFile.string(), "-C", extracted.string()});
+        runProgram({"bsdtar", "-xzf", payloadFile.string(), "-C", extracted.string()});
     });
     bench::printHeader("Bundle payload: SetTavrixID end to end vs bsdtar -xzf (tmpfs)");
     char what[96];
@@ -171,7 +136,7 @@ void benchPayloads(const fs::path& work) {
                   static_cast<double>(payload.size()) / 1e6);
     bench::printRow(what, ours / 1000, peer / 1000, "ms", "<=1.5x");
 
-    const pid_t pid = daemonPid(bus.address());
+    const pid_t pid = daemonPid(bus->address());
     client.setTavrixID("bench-id", std::nullopt);
     double cpuBefore = cpuMicros(pid);
     double roundTrip =

@@ -79,7 +79,8 @@ int main() {
             asm volatile("" : : "r"(&domain) : "memory");
         }
     });
-    bench::printHeader("Behavior preferences: 100,000 reads of an unchanged domain (peer: parse every read)");
+    bench::printHeader(
+        "Behavior preferences: 100,000 reads of an unchanged domain (peer: parse every read)");
     bench::printRow("100,000 copyBehaviorPreference reads", ours / 1000, peer / 1000, "ms", "<1x");
     bench::printRow("one read", ours / kReads, peer / kReads, "us", "");
     return 0;

@@ -24,13 +24,17 @@
 #include <vector>
 
 #include "BenchSupport.h"
-#include "DbusDaemonProcess.h"
+#include "DaemonBench.h"
 #include "client/TavrixClient.h"
 #include "payload/Archive.h"
 #include "plist/PropertyListFormat.h"
 #include "util/UniqueFd.h"
 
 using namespace tavrix;
+using bench::readBytes;
+using bench::runProgram;
+using bench::startProgram;
+using bench::writeBytes;
 
 namespace {
 
@@ -43,16 +47,6 @@ constexpr std::size_t kAssetBytes = 5'000'000;
 constexpr std::size_t kPackFiles = 40;
 constexpr std::size_t kPackFileBytes = 256 * 1024;  // 40 of them: 10 MiB
 
-void writeBytes(const fs::path& path, const std::string& bytes) {
-    fs::create_directories(path.parent_path());
-    std::ofstream(path, std::fstream::binary | std::fstream::trunc) << bytes;
-}
-
-std::string readBytes(const fs::path& path) {
-    std::ifstream in(path, std::fstream::binary);
-    return {std::istreambuf_iterator<char>(in), {}};
-}
-
 std::string randomBytes(std::size_t count, unsigned seed) {
     std::mt19937 random(seed);
     std::string bytes(count, '\0');
@@ -60,31 +54,6 @@ std::string randomBytes(std::size_t count, unsigned seed) {
         byte = static_cast<char>(random());
     }
     return bytes;
-}
-
-// Starts argv (looked up in PATH) with stdout and stderr on /dev/null.
-pid_t startProgram(const std::vector<std::string>& argv) {
-    pid_t pid = ::fork();
-    if (pid == 0) {
-        int null = ::open("/dev/null", O_WRONLY);
-        ::dup2(null, 1);
-        ::dup2(null, 2);
-        std::vector<char*> args;
-        for (const auto& arg : argv) {
-            args.push_back(const_cast<char*>(arg.c_str()));
-        }
-        args.push_back(nullptr);
-        ::execvp(args[0], args.data());
-        ::_exit(127);
-    }
-    return pid;
-}
-
-int runProgram(const std::vector<std::string>& argv) {
-    pid_t pid = startProgram(argv);
-    int status = 0;
-    ::waitpid(pid, &status, 0);
-    return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
 void mustRun(const std::vector<std::string>& argv) {
@@ -231,25 +200,13 @@ void benchUpdate(const fs::path& work) {
     StaticHttpServer server(site);
     const fs::path root = work / "root";
     makeDeviceRoot(root, server.url("/catalog.plist"), publicKey);
-    fs::create_directories(work / "services");
-    writeBytes(work / "services/com.zandor.tavrixservicesd.service",
-               "[D-BUS Service]\nName=com.zandor.tavrixservicesd\nExec=/usr/bin/env TAVRIX_ROOT=" +
-                   root.string() +
-                   " TAVRIX_LOG_STDERR=1 TAVRIX_IDLE_EXIT_SEC=300 RUNTIME_DIRECTORY=" +
-                   (work / "run").string() + " " + TAVRIX_DAEMON_PATH + "\n");
-    writeBytes(work / "bus.conf",
-               "<busconfig><type>session</type><listen>unix:path=" + (work / "socket").string() +
-                   "</listen><servicedir>" + (work / "services").string() +
-                   "</servicedir><auth>EXTERNAL</auth><policy context=\"default\">"
-                   "<allow send_destination=\"*\" eavesdrop=\"true\"/><allow eavesdrop=\"true\"/>"
-                   "<allow own=\"*\"/></policy></busconfig>\n");
-    test::DbusDaemonProcess bus(work / "bus.conf", work / "bus.log");
+    auto bus = bench::startDaemonBus(work, root);
     // Goes before the bus, also when the benchmark fails.
     struct DaemonStopper {
         const std::string& address;
         ~DaemonStopper() { stopDaemon(address); }
-    } stopper{bus.address()};
-    auto client = client::TavrixClient::connectToAddress(bus.address());
+    } stopper{bus->address()};
+    auto client = client::TavrixClient::connectToAddress(bus->address());
     int announced = 0;
     auto subscription = client.subscribe([&](const std::string& name) {
         announced += name == "kTVXBehaviorBundleChangedNotification" ? 1 : 0;

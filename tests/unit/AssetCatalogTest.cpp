@@ -198,7 +198,7 @@ TEST_F(AssetCatalogTest, QueryAnswersPublishedAssetsInOrderAndKeepsThemForLocalQ
     test::makeBundle(work / "one/Default.bundle", "1.0", {{"a.plist", "<plist/>"}});
     test::makeBundle(work / "two/Default.bundle", "2.0", {{"a.plist", "two"}});
     tool({"publish", work / "out", "--key", work / "secret.key", work / "one/Default.bundle",
-          "--product-type", "iPhone9,1", "--product-type", "iPad7,1", "--min-os", "7.0", "--max-os",
+          "--product-type", "Handset9,1", "--product-type", "Tablet7,1", "--min-os", "7.0", "--max-os",
           "9.3", work / "two/Default.bundle"});
     writeSettings(publicKey);
 
@@ -212,7 +212,7 @@ TEST_F(AssetCatalogTest, QueryAnswersPublishedAssetsInOrderAndKeepsThemForLocalQ
     plist::Dictionary first{
         {"Version", plist::Value("1.0")},
         {"SupportedProductTypes",
-         plist::Value(plist::Array{plist::Value("iPhone9,1"), plist::Value("iPad7,1")})},
+         plist::Value(plist::Array{plist::Value("Handset9,1"), plist::Value("Tablet7,1")})},
         {"MinimumOSVersion", plist::Value("7.0")},
         {"MaximumOSVersion", plist::Value("9.3")}};
     EXPECT_EQ(assets->at(0)->attributes(), first);

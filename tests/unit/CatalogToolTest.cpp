@@ -69,13 +69,13 @@ TEST_F(CatalogToolTest, PublishingAddsReplacesAndStartsFreshWithAValidSignatureE
 
     // The same archive name replaces its entry in place.
     ASSERT_EQ(publish({"--key", work / "secret.key", work / "b/Default.bundle", "--product-type",
-                       "iPhone9,1"}),
+                       "Handset9,1"}),
               0);
     std::optional<plist::Value> catalog = plist::readFile(work / "out/catalog.plist");
     ASSERT_TRUE(catalog);
     const plist::Value& replaced = catalog->find("Assets")->asArray()->at(1);
     EXPECT_EQ(*replaced.find("Attributes")->find("SupportedProductTypes"),
-              plist::Value(plist::Array{plist::Value("iPhone9,1")}));
+              plist::Value(plist::Array{plist::Value("Handset9,1")}));
     EXPECT_EQ(listedVersions().size(), 2u);
     EXPECT_TRUE(signatureVerifies());
 

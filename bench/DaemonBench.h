@@ -1,0 +1,73 @@
+// What the benchmarks that run the real daemon share: small file and process helpers, and a
+// private dbus-daemon that starts the daemon on demand under a device root.
+#pragma once
+
+#include <fcntl.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "DbusDaemonProcess.h"
+
+namespace tavrix::bench {
+
+inline void writeBytes(const std::filesystem::path& path, const std::string& bytes) {
+    std::filesystem::create_directories(path.parent_path());
+    std::ofstream(path, std::fstream::binary | std::fstream::trunc) << bytes;
+}
+
+inline std::string readBytes(const std::filesystem::path& path) {
+    std::ifstream in(path, std::fstream::binary);
+    return {std::istreambuf_iterator<char>(in), {}};
+}
+
+// Starts argv (looked up in PATH) with stdout and stderr on /dev/null.
+inline pid_t startProgram(const std::vector<std::string>& argv) {
+    pid_t pid = ::fork();
+    if (pid == 0) {
+        int null = ::open("/dev/null", O_WRONLY);
+        ::dup2(null, 1);
+        ::dup2(null, 2);
+        std::vector<char*> args;
+        for (const auto& arg : argv) {
+            args.push_back(const_cast<char*>(arg.c_str()));
+        }
+        args.push_back(nullptr);
+        ::execvp(args[0], args.data());
+        ::_exit(127);
+    }
+    return pid;
+}
+
+// Runs argv to its end: its exit status, or -1 when it did not exit normally.
+inline int runProgram(const std::vector<std::string>& argv) {
+    pid_t pid = startProgram(argv);
+    int status = 0;
+    ::waitpid(pid, &status, 0);
+    return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
+// A private bus in work/ whose service directory starts the daemon under root, logging to
+// work/bus.log; the daemon stays up for the whole benchmark.
+inline std::unique_ptr<test::DbusDaemonProcess> startDaemonBus(const std::filesystem::path& work,
+                                                               const std::filesystem::path& root) {
+    writeBytes(work / "services/com.zandor.tavrixservicesd.service",
+               "[D-BUS Service]\nName=com.zandor.tavrixservicesd\nExec=/usr/bin/env TAVRIX_ROOT=" +
+                   root.string() +
+                   " TAVRIX_LOG_STDERR=1 TAVRIX_IDLE_EXIT_SEC=300 RUNTIME_DIRECTORY=" +
+                   (work / "run").string() + " " + TAVRIX_DAEMON_PATH + "\n");
+    writeBytes(work / "bus.conf",
+               "<busconfig><type>session</type><listen>unix:path=" + (work / "socket").string() +
+                   "</listen><servicedir>" + (work / "services").string() +
+                   "</servicedir><auth>EXTERNAL</auth><policy context=\"default\">"
+                   "<allow send_destination=\"*\" eavesdrop=\"true\"/><allow eavesdrop=\"true\"/>"
+                   "<allow own=\"*\"/></policy></busconfig>\n");
+    return std::make_unique<test::DbusDaemonProcess>(work / "bus.conf", work / "bus.log");
+}
+
+}  // namespace tavrix::bench
