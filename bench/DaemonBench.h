@@ -6,8 +6,11 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstdio>
+#include <exception>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <memory>
 #include <string>
 #include <vector>
@@ -68,6 +71,27 @@ inline std::unique_ptr<test::DbusDaemonProcess> startDaemonBus(const std::filesy
                    "<allow send_destination=\"*\" eavesdrop=\"true\"/><allow eavesdrop=\"true\"/>"
                    "<allow own=\"*\"/></policy></busconfig>\n");
     return std::make_unique<test::DbusDaemonProcess>(work / "bus.conf", work / "bus.log");
+}
+
+// Runs the benchmark in a fresh directory under /dev/shm, removed afterwards unless it failed
+// (then kept for a look). The process's exit status.
+inline int runInScratchDirectory(const char* name,
+                                 const std::function<void(const std::filesystem::path&)>& run) {
+    std::string pattern = std::string("/dev/shm/tavrix-") + name + "-XXXXXX";
+    if (::mkdtemp(pattern.data()) == nullptr) {
+        std::perror("mkdtemp");
+        return 1;
+    }
+    const std::filesystem::path work = pattern;
+    try {
+        run(work);
+    } catch (const std::exception& error) {
+        std::fprintf(stderr, "%s: %s (files left in %s)\n", name, error.what(), work.c_str());
+        return 1;
+    }
+    std::error_code ignored;
+    std::filesystem::remove_all(work, ignored);
+    return 0;
 }
 
 }  // namespace tavrix::bench

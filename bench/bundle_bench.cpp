@@ -176,21 +176,8 @@ void benchMerge() {
 }  // namespace
 
 int main() {
-    char pattern[] = "/dev/shm/tavrix-bundle-bench-XXXXXX";
-    if (::mkdtemp(pattern) == nullptr) {
-        std::perror("mkdtemp");
-        return 1;
-    }
-    const fs::path work = pattern;
-    int status = 0;
-    try {
+    return bench::runInScratchDirectory("bundle_bench", [](const fs::path& work) {
         benchPayloads(work);
         benchMerge();
-    } catch (const std::exception& error) {
-        std::fprintf(stderr, "bundle_bench: %s\n", error.what());
-        status = 1;
-    }
-    std::error_code ignored;
-    fs::remove_all(work, ignored);
-    return status;
+    });
 }

@@ -317,25 +317,8 @@ void benchPack(const fs::path& work) {
 }  // namespace
 
 int main() {
-    char pattern[] = "/dev/shm/tavrix-update-bench-XXXXXX";
-    if (::mkdtemp(pattern) == nullptr) {
-        std::perror("mkdtemp");
-        return 1;
-    }
-    const fs::path work = pattern;
-    int status = 0;
-    try {
+    return bench::runInScratchDirectory("update_bench", [](const fs::path& work) {
         benchUpdate(work);
         benchPack(work);
-    } catch (const std::exception& error) {
-        std::fprintf(stderr, "update_bench: %s\n", error.what());
-        status = 1;
-    }
-    if (status == 0) {
-        std::error_code ignored;
-        fs::remove_all(work, ignored);
-    } else {
-        std::fprintf(stderr, "update_bench: files left in %s\n", work.c_str());
-    }
-    return status;
+    });
 }
