@@ -23,10 +23,7 @@ constexpr std::size_t kMaxBodyBytes = kMaxInflatedBytes;
 // A redirect loop ends the transfer as failed.
 constexpr long kMaxRedirects = 20;
 
-struct SlistFree {
-    void operator()(curl_slist* list) const { curl_slist_free_all(list); }
-};
-using HeaderList = std::unique_ptr<curl_slist, SlistFree>;
+using HeaderList = platform::CurlHeaderList;
 
 bool equalsIgnoringCase(std::string_view a, std::string_view b) {
     if (a.size() != b.size()) {
