@@ -4,6 +4,7 @@
 #include <utility>
 
 #include "util/Log.h"
+#include "util/TextCase.h"
 
 namespace tavrix {
 namespace {
@@ -12,23 +13,13 @@ namespace {
 // values built in memory) takes the overlay's value whole instead of recursing further.
 constexpr std::size_t kMaxMergeDepth = 512;
 
-// Only ASCII letters change, as with the C locale's classification.
-std::string asciiLowercase(std::string text) {
-    for (char& c : text) {
-        if (c >= 'A' && c <= 'Z') {
-            c = static_cast<char>(c - 'A' + 'a');
-        }
-    }
-    return text;
-}
-
 // Carrier files list IDs as strings; any other value is rendered as text.
 std::string behaviorIDText(const plist::Value& id) {
     const std::string* text = id.asString();
     return text != nullptr ? *text : id.description();
 }
 
-void addGroup(plist::Dictionary& map, const plist::Value& group) {
+void addGroup(BehaviorOverrideMap& map, const plist::Value& group) {
     if (!group.isDictionary()) {
         logCFormat("Failed to get the config dictionary in Allowed Multimode SIMs section\n");
         return;
@@ -43,8 +34,13 @@ void addGroup(plist::Dictionary& map, const plist::Value& group) {
         logCFormat("No Override Configuration found in the config dictionary\n");
         return;
     }
+    if (ids->asArray()->empty()) {
+        return;
+    }
+    auto shared = std::make_shared<const plist::Dictionary>(*configuration->asDictionary());
     for (const plist::Value& id : *ids->asArray()) {
-        map.insert_or_assign(asciiLowercase(behaviorIDText(id)), *configuration);
+        // Lower-cased the way the stored behavior ID is, so that IDs outside ASCII match too.
+        map.insert_or_assign(lowercaseText(behaviorIDText(id)), shared);
     }
 }
 
@@ -87,13 +83,13 @@ plist::Dictionary mergeAtDepth(const plist::Dictionary& base, const plist::Dicti
 
 }  // namespace
 
-std::optional<plist::Dictionary> copyBehaviorOverrides(const plist::Value& base) {
+std::optional<BehaviorOverrideMap> copyBehaviorOverrides(const plist::Value& base) {
     const plist::Value* overrides = base.find(kBehaviorOverridesKey);
     if (overrides == nullptr || !overrides->isDictionary()) {
         logCFormat("There are no behavior overrides in the base bundle\n");
         return std::nullopt;
     }
-    plist::Dictionary map;
+    BehaviorOverrideMap map;
     for (const auto& [groupName, group] : *overrides->asDictionary()) {
         addGroup(map, group);
     }
@@ -103,15 +99,15 @@ std::optional<plist::Dictionary> copyBehaviorOverrides(const plist::Value& base)
 BehaviorOverlayConfiguration::BehaviorOverlayConfiguration(std::string_view behaviorID,
                                                            plist::Value baseDictionary)
     : baseDictionary_(std::move(baseDictionary)) {
-    std::optional<plist::Dictionary> map = copyBehaviorOverrides(baseDictionary_);
+    std::optional<BehaviorOverrideMap> map = copyBehaviorOverrides(baseDictionary_);
     if (!map) {
         logCFormat("There is no merged allowed Behavior overlay configuration\n");
         return;
     }
     overlayKey_ = std::string(behaviorID);
     auto match = map->find(behaviorID);
-    if (match != map->end() && match->second.isDictionary()) {
-        overrideConfiguration_ = std::move(*match->second.asDictionary());
+    if (match != map->end()) {
+        overrideConfiguration_ = match->second;
     }
 }
 

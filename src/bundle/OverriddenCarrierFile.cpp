@@ -1,16 +1,18 @@
 #include "bundle/OverriddenCarrierFile.h"
 
+#include <limits.h>
+
 #include <algorithm>
 #include <iterator>
 #include <vector>
 
 #include "bundle/BundleLinks.h"
 #include "bundle/BundleLocations.h"
-#include "util/FileURL.h"
 #include "payload/FileSystemHelper.h"
 #include "payload/MobileUser.h"
 #include "platform/AtomicFile.h"
 #include "plist/PropertyListFormat.h"
+#include "util/FileURL.h"
 #include "util/Log.h"
 
 namespace tavrix {
@@ -40,6 +42,27 @@ std::string fileNameFor(const std::string& prefix, const std::string& bundleVers
     return prefix + kFieldSeparator + bundleVersion + kPropertyListExtension;
 }
 
+// The overlay key is a behavior ID or a hardware model, texts that other parties choose. Bytes that
+// would split the name into other fields ('+'), leave the directory ('/'), or garble a listing
+// (control characters) are written as %XX, and '%' itself too, so that two keys never share one
+// file name and every file stays inside the overlay directory.
+std::string fileNameField(std::string_view key) {
+    static constexpr char kHex[] = "0123456789abcdef";
+    std::string field;
+    field.reserve(key.size());
+    for (char c : key) {
+        auto byte = static_cast<unsigned char>(c);
+        if (byte < 0x20 || byte == 0x7F || c == '/' || c == kFieldSeparator || c == '%') {
+            field += '%';
+            field += kHex[byte >> 4];
+            field += kHex[byte & 0xF];
+        } else {
+            field += c;
+        }
+    }
+    return field;
+}
+
 std::string overlayDirectory() {
     const char* home = payload::MobileUser::homeDirectory();
     return std::string(home != nullptr ? home : "") + kUserBundlesDirectory + kOverlayDirectoryName;
@@ -55,7 +78,7 @@ std::optional<std::string> overriddenFilePath(OverlayContext& context) {
         return std::nullopt;
     }
     std::string prefix = std::string(overlayTypeWord(context.overlayType)) + kFieldSeparator +
-                         bundleName + kFieldSeparator + context.overlayKey;
+                         bundleName + kFieldSeparator + fileNameField(context.overlayKey);
     logCFormat("Overridden filename prefix: %s\n", prefix.c_str());
     const std::string& currentPath = context.bundle.carrierFilePath;
     logCFormat("Current carrier file path name: %s\n", currentPath.c_str());
@@ -77,7 +100,8 @@ std::optional<std::string> overriddenFilePath(OverlayContext& context) {
     context.overriddenFilePrefix = prefix;
 
     std::string fileName = fileNameFor(prefix, version);
-    if (payload::MobileUser::homeDirectory() == nullptr ||
+    // A name the file system cannot hold is no path at all; nothing is written then.
+    if (payload::MobileUser::homeDirectory() == nullptr || fileName.size() > NAME_MAX ||
         fileName.find_first_of(std::string_view("/\0", 2)) != std::string::npos) {
         return std::nullopt;
     }

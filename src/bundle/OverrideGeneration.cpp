@@ -60,10 +60,10 @@ class BehaviorOverlaySource : public OverlaySource {
     }
 
     std::optional<plist::Dictionary> overlayDictionary(const OverlayContext&) override {
-        if (!configuration_) {
+        if (!configuration_ || configuration_->overrideConfiguration() == nullptr) {
             return std::nullopt;
         }
-        return configuration_->overrideConfiguration();
+        return *configuration_->overrideConfiguration();
     }
 
     // The generated carrier file no longer needs the section it was made from.

@@ -1,7 +1,5 @@
 #include "daemon/TXManager.h"
 
-#include <algorithm>
-#include <cctype>
 #include <mutex>
 
 #include "bundle/BundleManager.h"
@@ -12,17 +10,12 @@
 #include "update/UpdateCheckScheduler.h"
 #include "util/Log.h"
 #include "util/TXUtility.h"
+#include "util/TextCase.h"
 
 namespace tavrix {
 namespace {
 
 constexpr const char* kBehaviorSettingsDomain = "com.zandor.tavrix";
-
-std::string lowerCased(std::string text) {
-    std::transform(text.begin(), text.end(), text.begin(),
-                   [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
-    return text;
-}
 
 }  // namespace
 
@@ -48,7 +41,7 @@ bool TXManager::setTavrixID(const std::string& tavrixID, const std::optional<pli
         logObjectFormat("Device has cellular radio, not accepting tavrix ID");
         return false;
     }
-    std::string lowered = lowerCased(tavrixID);
+    std::string lowered = lowercaseText(tavrixID);
     setBehaviorPreference(kTavrixIDKey, plist::Value(lowered));
     BundleManager& bundles = BundleManager::sharedInstance();
     {

@@ -15,6 +15,40 @@ namespace {
 
 constexpr int kPriority = LOG_NOTICE;
 
+// Values (a "%s" text or a "%@" description) come from clients, carrier files and the network: a
+// longer one is cut to this many bytes and marked, so one call cannot write megabytes of log.
+constexpr std::size_t kMaxValueBytes = 2048;
+constexpr std::string_view kCutMark = "...";
+
+// Control characters in a value are written as escapes, so that a value can neither end its
+// message early (a new line starts a new journal entry with a priority of its own) nor hide text.
+void appendValue(std::string& out, std::string_view value) {
+    bool cut = value.size() > kMaxValueBytes;
+    if (cut) {
+        value = value.substr(0, kMaxValueBytes);
+    }
+    for (char c : value) {
+        auto byte = static_cast<unsigned char>(c);
+        if (byte >= 0x20 && byte != 0x7F) {
+            out += c;
+        } else if (c == '\n') {
+            out += "\\n";
+        } else if (c == '\t') {
+            out += "\\t";
+        } else if (c == '\r') {
+            out += "\\r";
+        } else {
+            static constexpr char kHex[] = "0123456789abcdef";
+            out += "\\x";
+            out += kHex[byte >> 4];
+            out += kHex[byte & 0xF];
+        }
+    }
+    if (cut) {
+        out += kCutMark;
+    }
+}
+
 enum class Length { None, Char, Short, Long, LongLong, IntMax, Size, PtrDiff, LongDouble };
 
 // Formats one printf conversion (already stripped of '*') with one argument.
@@ -164,7 +198,7 @@ std::string formatObjectMessage(const char* format, va_list arguments) {
                 break;
             case '@': {
                 const auto* value = va_arg(cursor, const plist::Value*);
-                out += plist::describe(value);
+                appendValue(out, plist::describe(value));
                 break;
             }
             case 'd':
@@ -206,8 +240,13 @@ std::string formatObjectMessage(const char* format, va_list arguments) {
                     appendFormatted(out, spec + conversion, text == nullptr ? L"(null)" : text);
                 } else {
                     const char* text = va_arg(cursor, const char*);
-                    appendFormatted(out, spec.substr(0, lengthStart) + conversion,
-                                    text == nullptr ? "(null)" : text);
+                    // Only what can be shown is read, and the rest is never copied.
+                    std::string shown(text == nullptr ? "(null)" : text,
+                                      text == nullptr ? 6 : ::strnlen(text, kMaxValueBytes + 1));
+                    std::string formatted;
+                    appendFormatted(formatted, spec.substr(0, lengthStart) + conversion,
+                                    shown.c_str());
+                    appendValue(out, formatted);
                 }
                 break;
             }
@@ -241,28 +280,11 @@ void logObjectFormat(const char* format, ...) {
 }
 
 void logCFormat(const char* format, ...) {
+    // The same formatter as the object formats, so values are escaped and cut alike.
     va_list arguments;
     va_start(arguments, format);
-    va_list copy;
-    va_copy(copy, arguments);
-    char small[512];
-    int needed = std::vsnprintf(small, sizeof small, format, arguments);
+    logObjectFormatV(format, arguments);
     va_end(arguments);
-    if (needed < 0) {
-        va_end(copy);
-        return;
-    }
-    if (static_cast<std::size_t>(needed) < sizeof small) {
-        va_end(copy);
-        platform::writeSystemLog(kPriority,
-                                 std::string_view(small, static_cast<std::size_t>(needed)));
-        return;
-    }
-    std::string large(static_cast<std::size_t>(needed) + 1, '\0');
-    std::vsnprintf(large.data(), large.size(), format, copy);
-    va_end(copy);
-    large.resize(static_cast<std::size_t>(needed));
-    platform::writeSystemLog(kPriority, large);
 }
 
 }  // namespace tavrix

@@ -1,5 +1,7 @@
-// The daemon's three log wrappers. Each writes its message unchanged (no prefix, level or time
-// stamp) to the system log.
+// The daemon's three log wrappers. Each writes its message (no prefix, level or time stamp) to
+// the system log as one entry. The values a message shows ("%s" texts, "%@" descriptions) may come
+// from clients: control characters in them are escaped ("\n", "\t", "\r", "\xNN") and a value
+// longer than 2048 bytes is cut and ends with "...". The format's own text is kept unchanged.
 //
 // Object formats are printf formats plus "%@", whose argument is a `const tavrix::plist::Value*`
 // rendered by its description, or "(null)" for a null pointer.

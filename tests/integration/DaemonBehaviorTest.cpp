@@ -48,8 +48,15 @@ TEST_F(DaemonBehaviorTest, IdIsStoredLowerCasedWhetherOrNotSupportIsEnabled) {
     EXPECT_FALSE(caller.isTavrixBundleSupported());
     EXPECT_TRUE(waitForLogLine("Behavior bundle support is not present"));
 
-    EXPECT_TRUE(caller.setTavrixID("XY-Z", std::vector<std::uint8_t>{}));
-    EXPECT_EQ(storedTavrixID(device()), std::optional<plist::Value>("xy-z"));
+    // Every letter with a lower-case form changes, not only ASCII ones.
+    EXPECT_TRUE(
+        caller.setTavrixID("\xC3\x89"
+                           "COLE-\xC3\x84"
+                           "BC",
+                           std::vector<std::uint8_t>{}));
+    EXPECT_EQ(storedTavrixID(device()), std::optional<plist::Value>("\xC3\xA9"
+                                                                    "cole-\xC3\xA4"
+                                                                    "bc"));
     EXPECT_EQ(countLogLines("No bundle data given"), 1);
 }
 

@@ -29,7 +29,8 @@ TEST_F(LogTest, ObjectConversionUsesTheDescriptionAndNullForNil) {
     EXPECT_EQ(only(), "Removed client: (null), count: 0");
     sink.clear();
     logObjectFormat("transactions: %@", &set);
-    EXPECT_EQ(only(), "transactions: (\n    TXMinimumLaunchTransaction\n)");
+    // One message stays one line, so one journal entry.
+    EXPECT_EQ(only(), "transactions: (\\n    TXMinimumLaunchTransaction\\n)");
 }
 
 TEST_F(LogTest, ObjectFormatMixesPrintfConversionsInOrder) {
@@ -49,11 +50,24 @@ TEST_F(LogTest, MessagesAreKeptExactlyIncludingTrailingNewlines) {
                                         "no newline 1", "50% done", "trailing %"}));
 }
 
-TEST_F(LogTest, LongMessagesAreNotCut) {
-    std::string longText(5000, 'x');
-    logCFormat("%s!", longText.c_str());
-    logObjectFormat("%s?", longText.c_str());
-    EXPECT_EQ(sink.messages(), (std::vector<std::string>{longText + "!", longText + "?"}));
+// A client's text can neither forge a journal entry (a new line with a priority prefix) nor
+// flood the log: values are escaped and cut, whichever wrapper shows them.
+TEST_F(LogTest, ClientValuesAreEscapedAndCut) {
+    std::string forged = "abc\n<0>forged\ttab\x1b[31m\x7f";
+    plist::Value key(forged);
+    logCFormat("Copying %s\n", forged.c_str());
+    logObjectFormat("key: %@", &key);
+    const std::string escaped = "abc\\n<0>forged\\ttab\\x1b[31m\\x7f";
+    EXPECT_EQ(sink.messages(),
+              (std::vector<std::string>{"Copying " + escaped + "\n", "key: " + escaped}));
+
+    sink.clear();
+    std::string huge(30 << 20, 'x');
+    plist::Value hugeValue(huge);
+    logCFormat("%s!", huge.c_str());
+    logObjectFormat("%@?", &hugeValue);
+    const std::string cut = std::string(2048, 'x') + "...";
+    EXPECT_EQ(sink.messages(), (std::vector<std::string>{cut + "!", cut + "?"}));
 }
 
 }  // namespace

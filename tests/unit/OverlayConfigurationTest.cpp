@@ -19,6 +19,19 @@ Value group(Array ids, Dictionary configuration) {
                       {"OverrideConfiguration", std::move(configuration)}};
 }
 
+// The map with each shared configuration resolved, for comparison.
+std::optional<Dictionary> resolvedOverrides(const Value& base) {
+    std::optional<BehaviorOverrideMap> map = copyBehaviorOverrides(base);
+    if (!map) {
+        return std::nullopt;
+    }
+    Dictionary resolved;
+    for (const auto& [id, configuration] : *map) {
+        resolved.emplace(id, *configuration);
+    }
+    return resolved;
+}
+
 Value baseWith(Dictionary overrides) {
     return Dictionary{{"CarrierName", "Base"}, {"BehaviorOverrides", std::move(overrides)}};
 }
@@ -40,15 +53,18 @@ TEST_F(OverlayConfigurationTest, MapsEveryListedIDLowercasedToItsGroupsConfigura
         {"b-group", group({"shared", 42, true}, second)},
         {"c-empty", group({}, second)},
     });
-    std::optional<Dictionary> map = copyBehaviorOverrides(base);
+    std::optional<Dictionary> map = resolvedOverrides(base);
     ASSERT_TRUE(map);
-    // Only ASCII letters are lowered; non-string IDs are rendered as text.
+    // Letters outside ASCII are lowered like the stored ID; non-string IDs are rendered as text.
     EXPECT_EQ(*map, (Dictionary{{"abc", first},
-                                {"mixed-\xC3\x89t\xC3\xA9", first},
+                                {"mixed-\xC3\xA9t\xC3\xA9", first},
                                 {"shared", second},
                                 {"42", second},
                                 {"true", second}}));
     EXPECT_TRUE(sink.messages().empty());
+    // The IDs of one group share its configuration rather than each holding a copy.
+    std::optional<BehaviorOverrideMap> shared = copyBehaviorOverrides(base);
+    EXPECT_EQ(shared->at("abc").get(), shared->at("mixed-\xC3\xA9t\xC3\xA9").get());
 }
 
 TEST_F(OverlayConfigurationTest, MalformedGroupsAreLoggedAndSkipped) {
@@ -61,7 +77,7 @@ TEST_F(OverlayConfigurationTest, MalformedGroupsAreLoggedAndSkipped) {
         {"5", Dictionary{{"SupportedBehaviorIDs", Array{"abc"}}, {"OverrideConfiguration", 1}}},
         {"6", group({"ok"}, good)},
     });
-    std::optional<Dictionary> map = copyBehaviorOverrides(base);
+    std::optional<Dictionary> map = resolvedOverrides(base);
     ASSERT_TRUE(map);
     EXPECT_EQ(*map, (Dictionary{{"ok", good}}));
     EXPECT_EQ(sink.messages(),
@@ -98,7 +114,8 @@ TEST_F(OverlayConfigurationTest, TheBehaviorIDIsLookedUpAsGiven) {
     Value base = baseWith({{"g", group({"ABC"}, configuration)}});
     BehaviorOverlayConfiguration listed("abc", base);
     EXPECT_EQ(listed.overlayKey(), "abc");
-    EXPECT_EQ(listed.overrideConfiguration(), configuration);
+    ASSERT_TRUE(listed.overrideConfiguration());
+    EXPECT_EQ(*listed.overrideConfiguration(), configuration);
     // IDs reach this point lowercased already; an upper-case ID is a different one.
     BehaviorOverlayConfiguration upper("ABC", base);
     EXPECT_EQ(upper.overlayKey(), "ABC");

@@ -5,11 +5,13 @@
 #include <cstdlib>
 #include <filesystem>
 #include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
+#include "bundle/BundleLinks.h"
 #include "bundle/OverrideGeneration.h"
 #include "platform/PlatformRoot.h"
 #include "platform/SystemLog.h"
@@ -243,26 +245,40 @@ TEST_F(OverrideGenerationTest, AnUnreadableBaseMeansNoCarrierInfo) {
     EXPECT_EQ(record.carrierFilePath, baseFile());
 }
 
-TEST_F(OverrideGenerationTest, AFileThatCannotBeWrittenLeavesTheRecordAlone) {
+// Behavior IDs are chosen by others: whatever they hold, each gets a file of its own inside the
+// overlay directory, and one that no file name can hold leaves the record alone.
+TEST_F(OverrideGenerationTest, EveryBehaviorIDGetsItsOwnFileInsideTheOverlayDirectory) {
     writeDevice("T12AP");
+    const std::string escaping = "x/../../../escape";
+    const std::string lookalike = "x%2f..%2f..%2f..%2fescape";
+    const std::string withFields = "a+b\n<0>";
+    const std::string tooLong(300, 'l');
     Dictionary carrier = baseCarrier();
-    // Only listed IDs are ever written, but a listed one must still stay a plain file name.
     carrier.insert_or_assign(
         "BehaviorOverrides",
-        Dictionary{{"g", Dictionary{{"SupportedBehaviorIDs", Array{"abc", "x/../../../escape"}},
+        Dictionary{{"g", Dictionary{{"SupportedBehaviorIDs",
+                                     Array{"abc", escaping, lookalike, withFields, tooLong}},
                                     {"OverrideConfiguration", Dictionary{{"Name", "X"}}}}}});
     writeBundle(Value(carrier));
-    CarrierBundle record = baseBundle();
 
-    EXPECT_EQ(applyMultimodeOverlay(record, std::string("x/../../../escape")),
-              kOverrideBundleFailure);
-    EXPECT_THAT(sink.messages(),
-                IsSupersetOf({std::string("Failed to create the file URL\n"),
-                              std::string("Failed to generate overridden carrier plist\n")}));
-    EXPECT_EQ(record.carrierFilePath, baseFile());
+    std::set<std::string> files;
+    for (const std::string& id : {escaping, lookalike, withFields}) {
+        CarrierBundle record = baseBundle();
+        ASSERT_EQ(applyMultimodeOverlay(record, id), kOverrideBundleSuccess) << id;
+        EXPECT_EQ(dirNameOfPath(record.carrierFilePath), home() + "/Library/TavrixBundles/Overlay");
+        files.insert(record.carrierFilePath);
+    }
+    EXPECT_EQ(files.size(), 3u);
     EXPECT_FALSE(fs::exists(home() + "/Library/escape+1.0.plist"));
 
+    CarrierBundle record = baseBundle();
+    sink.clear();
+    EXPECT_EQ(applyMultimodeOverlay(record, tooLong), kOverrideBundleFailure);
+    EXPECT_TRUE(sink.contains("Failed to create the file URL\n"));
+    EXPECT_EQ(record.carrierFilePath, baseFile());
+
     // A file where the Overlay directory belongs.
+    fs::remove_all(home() + "/Library/TavrixBundles/Overlay");
     test::writeText(home() + "/Library/TavrixBundles/Overlay", "in the way");
     sink.clear();
     EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kOverrideBundleFailure);
