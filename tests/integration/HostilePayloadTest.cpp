@@ -1,0 +1,276 @@
+// Payloads chosen to hurt, sent to the real daemon. Whatever a payload holds, the call is
+// answered, the daemon stays small, every later call is answered, and so is every call to the
+// next launch (which redoes the bundle match from the stored ID, so a payload that stopped one
+// process would stop every one after it).
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/types.h>
+#include <unistd.h>
+
+#include <fstream>
+#include <functional>
+#include <set>
+
+#include "BusFixture.h"
+#include "CommandRunner.h"
+#include "plist/PropertyListFormat.h"
+
+namespace tavrix::integration {
+namespace {
+
+namespace fs = std::filesystem;
+
+constexpr const char* kSystemBundle = "/System/Library/TavrixBundles/Tablet/Default.bundle";
+constexpr const char* kBundleLink = "/var/mobile/Library/Tavrix.bundle";
+constexpr const char* kPreferencesLink = "/var/mobile/Library/Preferences/com.zandor.tavrix.plist";
+// An idle daemon holds about 12 MB; a payload may cost working memory, never its expansion.
+constexpr long kMaxResidentKiB = 160 * 1024;
+
+// A binary property list of string and array objects, laid out by hand because no writer
+// produces the shapes below: each array lists the indexes of the objects it holds.
+std::string binaryPropertyList(const std::vector<std::vector<std::uint32_t>>& arrays,
+                               const std::string& leaf) {
+    const std::size_t count = arrays.size() + 1;
+    const int refSize = count > 0xFF ? 2 : 1;
+    std::string bytes = "bplist00";
+    std::vector<std::uint64_t> offsets;
+    auto putBigEndian = [&bytes](std::uint64_t value, int size) {
+        for (int shift = (size - 1) * 8; shift >= 0; shift -= 8) {
+            bytes += static_cast<char>((value >> shift) & 0xFF);
+        }
+    };
+    for (const auto& members : arrays) {
+        offsets.push_back(bytes.size());
+        bytes += static_cast<char>(0xA0 | members.size());  // fewer than 15 members
+        for (std::uint32_t member : members) {
+            putBigEndian(member, refSize);
+        }
+    }
+    offsets.push_back(bytes.size());
+    bytes += static_cast<char>(0x50 | leaf.size());  // a short ASCII string
+    bytes += leaf;
+    const std::uint64_t tableOffset = bytes.size();
+    for (std::uint64_t offset : offsets) {
+        putBigEndian(offset, 4);
+    }
+    bytes += std::string(6, '\0');
+    bytes += static_cast<char>(4);
+    bytes += static_cast<char>(refSize);
+    putBigEndian(count, 8);
+    putBigEndian(0, 8);
+    putBigEndian(tableOffset, 8);
+    return bytes;
+}
+
+// Each array holds the next one: nesting as deep as there are arrays.
+std::string deepBinaryList(std::uint32_t depth) {
+    std::vector<std::vector<std::uint32_t>> arrays;
+    for (std::uint32_t i = 0; i < depth; ++i) {
+        arrays.push_back({i + 1});
+    }
+    return binaryPropertyList(arrays, "x");
+}
+
+// Each array holds the next one twice: 364 bytes that expand to 2^40 nodes.
+std::string selfSharingBinaryList() {
+    std::vector<std::vector<std::uint32_t>> arrays;
+    for (std::uint32_t i = 0; i < 40; ++i) {
+        arrays.push_back({i + 1, i + 1});
+    }
+    return binaryPropertyList(arrays, "x");
+}
+
+std::string deepXmlList(std::size_t depth) {
+    std::string xml = "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\">";
+    for (std::size_t i = 0; i < depth; ++i) {
+        xml += "<array>";
+    }
+    for (std::size_t i = 0; i < depth; ++i) {
+        xml += "</array>";
+    }
+    return xml + "</plist>\n";
+}
+
+// A carrier file listing many IDs for one large configuration.
+plist::Dictionary manyIDsCarrierFile() {
+    plist::Array ids;
+    for (int i = 0; i < 20000; ++i) {
+        ids.push_back(plist::Value("id-" + std::to_string(i)));
+    }
+    plist::Dictionary configuration;
+    for (int i = 0; i < 2000; ++i) {
+        configuration.emplace("Key" + std::to_string(i), std::string(40, 'v'));
+    }
+    plist::Dictionary group = {{"SupportedBehaviorIDs", std::move(ids)},
+                               {"OverrideConfiguration", std::move(configuration)}};
+    return {{"CarrierName", "Many"},
+            {"BehaviorOverrides", plist::Dictionary{{"Group", std::move(group)}}}};
+}
+
+void writeBytes(const fs::path& path, const std::string& bytes) {
+    std::ofstream(path, std::fstream::binary).write(bytes.data(), std::streamsize(bytes.size()));
+}
+
+struct HostileCase {
+    const char* name;
+    // Turns a good bundle directory (Info.plist and behavior.plist) into the hostile one.
+    std::function<void(const fs::path& bundle)> spoil;
+    // A bundle compressed from many zeros: packed by streaming zeros into gzip.
+    std::uint64_t zeroFileBytes = 0;
+};
+
+void PrintTo(const HostileCase& hostile, std::ostream* out) { *out << hostile.name; }
+
+void replaceWithFifo(const fs::path& file) {
+    fs::remove(file);
+    ASSERT_EQ(::mkfifo(file.c_str(), 0644), 0);
+}
+
+const HostileCase kCases[] = {
+    {"FifoAsCarrierFile", [](const fs::path& b) { replaceWithFifo(b / "behavior.plist"); }},
+    {"FifoAsInfo", [](const fs::path& b) { replaceWithFifo(b / "Info.plist"); }},
+    {"DeepXmlCarrierFile",
+     [](const fs::path& b) { writeBytes(b / "behavior.plist", deepXmlList(200000)); }},
+    {"DeepBinaryCarrierFile",
+     [](const fs::path& b) { writeBytes(b / "behavior.plist", deepBinaryList(30000)); }},
+    {"DeepBinaryInfo",
+     [](const fs::path& b) { writeBytes(b / "Info.plist", deepBinaryList(30000)); }},
+    {"SelfSharingBinaryCarrierFile",
+     [](const fs::path& b) { writeBytes(b / "behavior.plist", selfSharingBinaryList()); }},
+    {"SparseHugeCarrierFile",
+     [](const fs::path& b) { fs::resize_file(b / "behavior.plist", std::uintmax_t{100} << 30); }},
+    {"ManyIDsForOneConfiguration",
+     [](const fs::path& b) {
+         ASSERT_TRUE(
+             plist::writeFile((b / "behavior.plist").string(), plist::Value(manyIDsCarrierFile())));
+     }},
+    {"GzipBomb", [](const fs::path&) {}, std::uint64_t{4} << 30},
+};
+
+class HostilePayloadTest : public BusFixture, public testing::WithParamInterface<HostileCase> {
+  protected:
+    HostilePayloadTest() { busOptions.idleExitSeconds = 30; }
+
+    fs::path at(const char* absolutePath) { return device().path(absolutePath); }
+
+    void writeBundle(const fs::path& directory, const std::string& version) {
+        fs::create_directories(directory);
+        plist::Dictionary info = {{"QZBundleIdentifier", "com.zandor.tavrix.bundle.test"},
+                                  {"QZBundleVersion", version}};
+        ASSERT_TRUE(plist::writeFile((directory / "Info.plist").string(), plist::Value(info)));
+        ASSERT_TRUE(plist::writeFile((directory / "behavior.plist").string(),
+                                     plist::Value(plist::Dictionary{{"CarrierName", version}})));
+    }
+
+    std::vector<std::uint8_t> hostilePayload(const HostileCase& hostile) {
+        fs::path source = device().base() / "hostile";
+        writeBundle(source, "10");
+        hostile.spoil(source);
+        fs::path archive = device().base() / "hostile.tgz";
+        CommandResult packed;
+        if (hostile.zeroFileBytes != 0) {
+            // One entry of zeros as repeated gzip members: a few MB that expand to gigabytes.
+            packed = runCommand({"/usr/bin/python3", "-c", R"(
+import gzip, sys, tarfile
+archive, info, size = sys.argv[1], sys.argv[2], int(sys.argv[3])
+chunk = 64 << 20
+def entry(name, length):
+    header = tarfile.TarInfo(name)
+    header.size = length
+    return header.tobuf(format=tarfile.USTAR_FORMAT)
+data = open(info, "rb").read()
+with open(archive, "wb") as out:
+    out.write(gzip.compress(entry("Info.plist", len(data)) + data + bytes(-len(data) % 512)))
+    out.write(gzip.compress(entry("zeros", size)))
+    zeros = gzip.compress(bytes(chunk), 1)
+    for _ in range(size // chunk):
+        out.write(zeros)
+    out.write(gzip.compress(bytes(1024)))
+)",
+                                 archive.string(), (source / "Info.plist").string(),
+                                 std::to_string(hostile.zeroFileBytes)});
+        } else {
+            packed = runCommand({"/usr/bin/bsdtar", "-c", "-z", "-f", archive.string(), "-C",
+                                 source.string(), "."});
+        }
+        EXPECT_EQ(packed.status, 0) << packed.output;
+        std::ifstream in(archive, std::fstream::binary);
+        return {std::istreambuf_iterator<char>(in), {}};
+    }
+
+    long peakResidentKiB(pid_t pid) {
+        std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+        std::string line;
+        while (std::getline(status, line)) {
+            if (line.starts_with("VmHWM:")) {
+                return std::stol(line.substr(6));
+            }
+        }
+        return -1;
+    }
+
+    // Every call a client can make is answered.
+    void expectEveryCallAnswered(const char* when) {
+        auto caller = client();
+        EXPECT_TRUE(caller.isTavrixBundleSupported()) << when;
+        // Either bundle's settings, or none when no carrier file could be read: answered.
+        (void)caller.copyTavrixValue("CarrierName");
+        EXPECT_TRUE(waitForNameOwner()) << when;
+    }
+
+    // Both links lead to files that exist, or are not there at all.
+    void expectLinksResolveOrAreAbsent() {
+        for (const char* link : {kBundleLink, kPreferencesLink}) {
+            std::error_code error;
+            if (fs::is_symlink(at(link), error)) {
+                EXPECT_TRUE(fs::exists(at(link), error)) << link << " dangles";
+            }
+        }
+    }
+
+    // Nothing appeared in the test's base directory outside the device root and the payload
+    // sources the test made itself.
+    void expectNothingOutsideTheRoot(const std::set<std::string>& before) {
+        for (const auto& entry : fs::directory_iterator(device().base())) {
+            std::string name = entry.path().filename().string();
+            EXPECT_TRUE(before.contains(name) || name.starts_with("hostile")) << name;
+        }
+    }
+};
+
+TEST_P(HostilePayloadTest, DaemonKeepsServingAndSoDoesItsNextLaunch) {
+    const HostileCase& hostile = GetParam();
+    device().writeDaemonPreferences({{"EnableSupport", true}});
+    writeBundle(at(kSystemBundle), "1");
+    std::set<std::string> before;
+    for (const auto& entry : fs::directory_iterator(device().base())) {
+        before.insert(entry.path().filename().string());
+    }
+    auto payload = hostilePayload(hostile);
+
+    auto caller = client();
+    ASSERT_TRUE(caller.setTavrixID("id-7", payload)) << hostile.name;
+    std::optional<pid_t> pid = daemonPid();
+    ASSERT_TRUE(pid);
+    EXPECT_LT(peakResidentKiB(*pid), kMaxResidentKiB);
+    expectEveryCallAnswered("after the payload");
+    expectLinksResolveOrAreAbsent();
+
+    ASSERT_EQ(::kill(*pid, SIGTERM), 0);
+    EXPECT_EQ(waitForDaemonExit(*pid), std::optional<int>(0));
+    expectEveryCallAnswered("at the next launch");
+    std::optional<pid_t> next = daemonPid();
+    ASSERT_TRUE(next);
+    EXPECT_NE(*next, *pid);
+    EXPECT_LT(peakResidentKiB(*next), kMaxResidentKiB);
+    expectLinksResolveOrAreAbsent();
+    expectNothingOutsideTheRoot(before);
+}
+
+INSTANTIATE_TEST_SUITE_P(Payloads, HostilePayloadTest, testing::ValuesIn(kCases),
+                         [](const testing::TestParamInfo<HostileCase>& info) {
+                             return std::string(info.param.name);
+                         });
+
+}  // namespace
+}  // namespace tavrix::integration
