@@ -57,7 +57,8 @@ constexpr const char* kOverallHelp =
     "\n"
     "Options:\n"
     "  --address ADDRESS  use the message bus at this D-Bus address instead\n"
-    "  --help             show this help; 'tavrixctl COMMAND --help' shows a command's\n"
+    "  --version          show the version\n"
+    "  -h, --help         show this help; 'tavrixctl COMMAND --help' shows a command's\n"
     "\n"
     "Exit status: 0 on success (whatever the answer), 1 on failure, 2 on a usage mistake.\n";
 
@@ -489,10 +490,14 @@ int run(int argc, char** argv) {
     std::optional<std::string> address;
     std::size_t next = 0;
     // Global options come before the command.
-    for (; next < words.size() && words[next].rfind("--", 0) == 0; ++next) {
+    for (; next < words.size() && words[next].rfind("-", 0) == 0; ++next) {
         const std::string& word = words[next];
-        if (word == "--help") {
+        if (word == "--help" || word == "-h") {
             std::fputs(kOverallHelp, stdout);
+            return 0;
+        }
+        if (word == "--version") {
+            std::printf("tavrixctl %s\n", TAVRIX_VERSION);
             return 0;
         }
         if (word == "--address") {
