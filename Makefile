@@ -5,7 +5,7 @@ FUZZ_BUILD ?= build-fuzz
 JOBS       ?= 2
 FUZZ_SECONDS ?= 60
 
-.PHONY: all deps build test test-asan fuzz bench demo format clean
+.PHONY: all deps build test test-asan fuzz bench demo deb format clean
 
 all: build
 
@@ -42,8 +42,15 @@ bench: build
 demo: build
 	scripts/demo.sh $(BUILD)
 
+# The Debian package, built from debian/ and checked by lintian; the .deb files land in dist/.
+deb:
+	@scripts/install-deps.sh --deb
+	DEB_BUILD_OPTIONS="parallel=$(JOBS) nocheck" dpkg-buildpackage -us -uc -b
+	mkdir -p dist && mv ../tavrixservicesd*_$$(dpkg-parsechangelog -S Version)_*.* dist/
+	lintian --fail-on error,warning dist/tavrixservicesd_*.deb
+
 format:
 	git ls-files '*.cpp' '*.h' | xargs clang-format -i
 
 clean:
-	rm -rf $(BUILD) $(ASAN_BUILD) $(FUZZ_BUILD)
+	rm -rf $(BUILD) $(ASAN_BUILD) $(FUZZ_BUILD) dist obj-*

@@ -10,6 +10,11 @@ packages=(
     dbus libarchive-tools curl python3 tzdata
 )
 
+# `--deb`: also what building and checking the Debian package needs.
+if [ "${1:-}" = "--deb" ]; then
+    packages+=(debhelper dpkg-dev fakeroot lintian systemd)
+fi
+
 missing=()
 for package in "${packages[@]}"; do
     if ! dpkg-query -W -f='${Status}' "$package" 2>/dev/null | grep -q "install ok installed"; then
