@@ -1,18 +1,23 @@
 #include "daemon/TXManagerServer.h"
 
 #include <signal.h>
+#include <sys/epoll.h>
 #include <time.h>
 
 #include <algorithm>
 #include <cstdlib>
+#include <cstring>
 #include <thread>
 
 #include "daemon/TXManager.h"
 #include "daemon/TXTransactionManager.h"
+#include "platform/AssetCatalogService.h"
 #include "platform/NotificationCenter.h"
 #include "platform/ServiceManager.h"
 #include "update/UpdateCheckScheduler.h"
+#include "util/ContainExceptions.h"
 #include "util/Log.h"
+#include "util/TXUtility.h"
 
 namespace tavrix {
 namespace {
@@ -69,7 +74,7 @@ TXManager& TXManagerServer::manager() {
     return *_manager;
 }
 
-void TXManagerServer::runUntilIdleExit() {
+int TXManagerServer::runUntilIdleExit() {
     mainThreadId = std::this_thread::get_id();
     auto& transactions = TXTransactionManager::sharedInstance();
     auto& serviceManager = platform::ServiceManager::shared();
@@ -82,43 +87,13 @@ void TXManagerServer::runUntilIdleExit() {
         logObjectFormat("Starting the server.");
     }
 
-    sd_event* event = nullptr;
-    if (sd_event_default(&event) < 0) {
-        logCFormat("Cannot create the main event loop\n");
-        return;
+    // A daemon that cannot serve leaves with a failure, so that the service manager's restart
+    // policy and the caller see it.
+    if (!_startServing()) {
+        _stopWorkers();
+        return 1;
     }
-    _event.reset(event);
-
-    // SIGTERM and SIGINT finish the run loop like an idle exit; main() blocked them.
-    auto onSignal = [](sd_event_source*, const signalfd_siginfo*, void* userdata) -> int {
-        static_cast<TXManagerServer*>(userdata)->_finish();
-        return 0;
-    };
-    sd_event_source* source = nullptr;
-    if (sd_event_add_signal(event, &source, SIGTERM, onSignal, this) >= 0) {
-        _terminateSource.reset(source);
-    }
-    source = nullptr;
-    if (sd_event_add_signal(event, &source, SIGINT, onSignal, this) >= 0) {
-        _interruptSource.reset(source);
-    }
-
-    _listener.resume(event, kTXServiceObjectPath,
-                     {{kTXServiceInterface, managerServerVTable()},
-                      {platform::kNotificationInterface, notificationCenterVTable()}},
-                     this);
     platform::setNotificationBus(_listener.bus());
-
-    transactions.beginTransaction(kMinimumLaunchTransaction);
-    auto endLaunchTransaction = [](sd_event_source*, uint64_t, void*) -> int {
-        TXTransactionManager::sharedInstance().endTransaction(kMinimumLaunchTransaction);
-        return 0;
-    };
-    source = nullptr;
-    if (sd_event_add_time_relative(event, &source, CLOCK_MONOTONIC, kMinimumLaunchSeconds * 1000000,
-                                   0, endLaunchTransaction, nullptr) >= 0) {
-        _launchTimer.reset(source);
-    }
 
     logObjectFormat("Notifying observers of start");
     _notifyServerStart();
@@ -130,9 +105,74 @@ void TXManagerServer::runUntilIdleExit() {
 
     serviceManager.notifyReady(transactionStatus(transactions.openTransactions()));
     _run();
+    _stopWorkers();
 
     transactions.clearKeepAliveIfNecessary(true);
     platform::setNotificationBus(nullptr);
+    return 0;
+}
+
+bool TXManagerServer::_startServing() {
+    sd_event* event = nullptr;
+    if (sd_event_default(&event) < 0) {
+        logCFormat("Cannot create the main event loop\n");
+        return false;
+    }
+    _event.reset(event);
+
+    // SIGTERM and SIGINT finish the run loop like an idle exit; main() blocked them.
+    auto onSignal = [](sd_event_source*, const signalfd_siginfo*, void* userdata) -> int {
+        containExceptions("Leaving on a signal",
+                          [userdata] { static_cast<TXManagerServer*>(userdata)->_finish(); });
+        return 0;
+    };
+    // Transactions closed on other threads wake the loop, so that it looks at idleness again.
+    auto onWake = [](sd_event_source*, int, uint32_t, void*) -> int {
+        platform::ServiceManager::shared().consumeWake();
+        return 0;
+    };
+    sd_event_source* terminate = nullptr;
+    sd_event_source* interrupt = nullptr;
+    int r = sd_event_add_signal(event, &terminate, SIGTERM, onSignal, this);
+    _terminateSource.reset(terminate);
+    if (r >= 0) {
+        r = sd_event_add_signal(event, &interrupt, SIGINT, onSignal, this);
+        _interruptSource.reset(interrupt);
+    }
+    const int wakeFd = platform::ServiceManager::shared().wakeFd();
+    if (r >= 0 && wakeFd >= 0) {
+        sd_event_source* wake = nullptr;
+        r = sd_event_add_io(event, &wake, wakeFd, EPOLLIN, onWake, nullptr);
+        _wakeSource.reset(wake);
+    }
+    if (r < 0) {
+        logCFormat("Cannot set up the main event loop: %s\n", std::strerror(-r));
+        return false;
+    }
+
+    if (!_listener.resume(event, kTXServiceObjectPath,
+                          {{kTXServiceInterface, managerServerVTable()},
+                           {platform::kNotificationInterface, notificationCenterVTable()}},
+                          this)) {
+        return false;
+    }
+
+    TXTransactionManager::sharedInstance().beginTransaction(kMinimumLaunchTransaction);
+    auto endLaunchTransaction = [](sd_event_source*, uint64_t, void*) -> int {
+        containExceptions("Ending the launch transaction", [] {
+            TXTransactionManager::sharedInstance().endTransaction(kMinimumLaunchTransaction);
+        });
+        return 0;
+    };
+    sd_event_source* launch = nullptr;
+    r = sd_event_add_time_relative(event, &launch, CLOCK_MONOTONIC, kMinimumLaunchSeconds * 1000000,
+                                   0, endLaunchTransaction, nullptr);
+    _launchTimer.reset(launch);
+    if (r < 0) {
+        logCFormat("Cannot set up the launch timer: %s\n", std::strerror(-r));
+        return false;
+    }
+    return true;
 }
 
 void TXManagerServer::_run() {
@@ -142,21 +182,34 @@ void TXManagerServer::_run() {
     const auto slice = duration_cast<microseconds>(duration<double>(kRunLoopSliceSeconds));
     std::string lastStatus;
     for (;;) {
-        // One "is idle" predicate decides the exit: nothing open, keep-alive clear, and no
-        // activity for the grace period.
         microseconds timeout = slice;
-        if (!_finishing && serviceManager.isIdle()) {
-            auto deadline = serviceManager.lastActivity() + serviceManager.idleGrace();
-            auto now = steady_clock::now();
+        const auto now = steady_clock::now();
+        if (_finishing) {
+            // Work started by an answered call (a download, an install) ends before the process.
+            const int open = serviceManager.openTransactionCount();
+            if (open == 0) {
+                break;
+            }
+            if (now >= _drainDeadline) {
+                logCFormat("Leaving with %d transactions still open after waiting %lld s\n", open,
+                           static_cast<long long>(kDrainLimit.count()));
+                break;
+            }
+            timeout = std::min(
+                slice, duration_cast<microseconds>(_drainDeadline - now) + microseconds(1000));
+        } else if (serviceManager.isIdle()) {
+            // Nothing open, keep-alive clear, and no activity (a call included) for the grace.
+            const auto deadline = serviceManager.lastActivity() + serviceManager.idleGrace();
             if (now >= deadline) {
                 _finish();
-            } else {
-                timeout = std::min(
-                    slice, duration_cast<microseconds>(deadline - now) + microseconds(1000));
+                continue;  // look again: the calls answered while leaving may have started work
             }
+            timeout =
+                std::min(slice, duration_cast<microseconds>(deadline - now) + microseconds(1000));
         }
         int r = sd_event_run(_event.get(), static_cast<uint64_t>(timeout.count()));
-        if (r < 0 || sd_event_get_state(_event.get()) == SD_EVENT_FINISHED) {
+        if (r < 0) {
+            logCFormat("The main event loop failed: %s\n", std::strerror(-r));
             break;
         }
         std::set<std::string> open = transactions.openTransactions();
@@ -178,35 +231,51 @@ void TXManagerServer::_finish() {
         return;
     }
     _finishing = true;
+    _drainDeadline = std::chrono::steady_clock::now() + kDrainLimit;
     platform::ServiceManager::shared().notifyStopping();
+    // The launch transaction only guards a fresh daemon against idleness; leaving on a signal
+    // does not wait for it.
+    _launchTimer.reset();
+    TXTransactionManager::sharedInstance().endTransaction(kMinimumLaunchTransaction);
     _listener.releaseNameAndDrain();
-    sd_event_exit(_event.get(), 0);
+}
+
+void TXManagerServer::_stopWorkers() {
+    // Producers before consumers: the job timer and its queue start downloads, downloads queue
+    // progress reports, reports install bundles.
+    const bool scheduler = UpdateCheckScheduler::shutdownIfStarted(kWorkerStopPatience);
+    const bool catalog = platform::AssetCatalogService::shutdownIfStarted(kWorkerStopPatience);
+    const bool tasks = TXUtility::shutdownTaskQueue(kWorkerStopPatience);
+    _workersStopped = scheduler && catalog && tasks;
 }
 
 void TXManagerServer::_notifyServerStart() {
     platform::postNotification(kDaemonStartedNotification);
 }
 
-bool TXManagerServer::shouldAcceptNewConnection(platform::ServiceListener&,
+bool TXManagerServer::shouldAcceptNewConnection(platform::ServiceListener& listener,
                                                 const platform::PeerConnection& connection) {
     auto& transactions = TXTransactionManager::sharedInstance();
     transactions.beginTransaction(kAddClientTransaction);
-    addClient(std::make_unique<TXManagerServerClient>(connection.uniqueName, connection.pid,
-                                                      connection.commandName));
+    addClient(std::make_shared<TXManagerServerClient>(
+        connection.uniqueName, connection.pid, connection.commandName,
+        listener.watchConnection(connection.uniqueName)));
     transactions.endTransaction(kAddClientTransaction);
     return true;
 }
 
+bool TXManagerServer::isAcceptedConnection(const std::string& uniqueName) const {
+    return _clientForConnection(uniqueName) != nullptr;
+}
+
 void TXManagerServer::connectionInvalidated(const std::string& uniqueName) {
     assertMainThread("shouldAcceptNewConnection");
-    auto it = std::find_if(_clients.begin(), _clients.end(),
-                           [&](const auto& client) { return client->connection() == uniqueName; });
-    if (it != _clients.end()) {
-        removeClient(it->get());
+    if (auto client = _clientForConnection(uniqueName)) {
+        removeClient(client);
     }
 }
 
-void TXManagerServer::addClient(std::unique_ptr<TXManagerServerClient> client) {
+void TXManagerServer::addClient(std::shared_ptr<TXManagerServerClient> client) {
     std::optional<plist::Value> identifier;
     if (client->identifier()) {
         identifier.emplace(*client->identifier());
@@ -216,9 +285,8 @@ void TXManagerServer::addClient(std::unique_ptr<TXManagerServerClient> client) {
                     static_cast<unsigned>(_clients.size()));
 }
 
-void TXManagerServer::removeClient(TXManagerServerClient* client) {
-    auto it = std::find_if(_clients.begin(), _clients.end(),
-                           [&](const auto& owned) { return owned.get() == client; });
+void TXManagerServer::removeClient(const std::shared_ptr<TXManagerServerClient>& client) {
+    auto it = std::find(_clients.begin(), _clients.end(), client);
     if (it == _clients.end()) {
         return;
     }
@@ -232,25 +300,25 @@ void TXManagerServer::removeClient(TXManagerServerClient* client) {
                     static_cast<unsigned>(_clients.size()));
 }
 
-std::vector<const TXManagerServerClient*> TXManagerServer::clients() const {
-    std::vector<const TXManagerServerClient*> copy;
-    for (const auto& client : _clients) {
-        copy.push_back(client.get());
-    }
-    return copy;
+std::vector<std::shared_ptr<const TXManagerServerClient>> TXManagerServer::clients() const {
+    return {_clients.begin(), _clients.end()};
 }
 
-TXManagerServerClient* TXManagerServer::_clientForCurrentConnection() {
-    const std::string& current = _listener.currentConnection();
-    if (current.empty()) {
+std::shared_ptr<TXManagerServerClient> TXManagerServer::_clientForConnection(
+    const std::string& uniqueName) const {
+    if (uniqueName.empty()) {
         return nullptr;
     }
     for (const auto& client : _clients) {
-        if (client->connection() == current) {
-            return client.get();
+        if (client->connection() == uniqueName) {
+            return client;
         }
     }
     return nullptr;
+}
+
+std::shared_ptr<TXManagerServerClient> TXManagerServer::_clientForCurrentConnection() const {
+    return _clientForConnection(_listener.currentConnection());
 }
 
 void TXManagerServer::setTavrixID(const std::string& tavrixID,

@@ -1,10 +1,16 @@
 // The daemon's server: its life from start to idle exit, the clients it accepted, and the five
 // operations of the service interface, each answered through a reply handler. Everything here runs
 // on the main thread.
+//
+// Leaving (idle or SIGTERM) loses nothing: the name is released, the calls already queued are
+// answered, then the loop keeps running until the work those calls started (every open
+// transaction) has ended, within kDrainLimit; only then are the worker threads stopped and
+// joined, before anything they use goes away.
 #pragma once
 
 #include <sys/types.h>
 
+#include <chrono>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -31,14 +37,23 @@ class TXManagerServer : private platform::ServiceListener::Delegate {
     static constexpr std::uint64_t kMinimumLaunchSeconds = 10;
     // The length of one run-loop pass.
     static constexpr double kRunLoopSliceSeconds = 15.0;
+    // How long a leaving daemon waits for open transactions; below systemd's stop timeout, so
+    // that it leaves on its own terms.
+    static constexpr std::chrono::seconds kDrainLimit{60};
+    // How long each worker thread may take to finish its queue once the daemon is leaving.
+    static constexpr std::chrono::seconds kWorkerStopPatience{10};
 
     // The process's server, created on first use and never destroyed.
     static TXManagerServer& sharedInstance();
 
     TXManager& manager();
 
-    // The whole life of the daemon; returns when the run loop has finished.
-    void runUntilIdleExit();
+    // The whole life of the daemon; returns the process's exit status when the run loop has
+    // finished: 0, or 1 when the daemon could not start serving (logged).
+    int runUntilIdleExit();
+    // False when a worker thread was still busy when the daemon left (logged): the process must
+    // then end without running static destructors under it.
+    bool workersStopped() const { return _workersStopped; }
 
     // The service interface. A reply handler is called exactly once before the call returns;
     // the first four accept an empty handler.
@@ -51,9 +66,10 @@ class TXManagerServer : private platform::ServiceListener::Delegate {
     // Answers whether the calling connection is an accepted client; the type is not kept.
     void setClientType(std::int32_t type, const std::function<void(bool)>& result);
 
-    void addClient(std::unique_ptr<TXManagerServerClient> client);
-    void removeClient(TXManagerServerClient* client);
-    std::vector<const TXManagerServerClient*> clients() const;
+    void addClient(std::shared_ptr<TXManagerServerClient> client);
+    void removeClient(const std::shared_ptr<TXManagerServerClient>& client);
+    // A copy of the client list; the copy keeps its clients alive.
+    std::vector<std::shared_ptr<const TXManagerServerClient>> clients() const;
 
     platform::ServiceListener& listener() { return _listener; }
 
@@ -63,22 +79,32 @@ class TXManagerServer : private platform::ServiceListener::Delegate {
     // Listener delegate.
     bool shouldAcceptNewConnection(platform::ServiceListener& listener,
                                    const platform::PeerConnection& connection) override;
+    bool isAcceptedConnection(const std::string& uniqueName) const override;
     void connectionInvalidated(const std::string& uniqueName) override;
 
-    TXManagerServerClient* _clientForCurrentConnection();
+    std::shared_ptr<TXManagerServerClient> _clientForConnection(
+        const std::string& uniqueName) const;
+    std::shared_ptr<TXManagerServerClient> _clientForCurrentConnection() const;
+    // Event loop, signal sources, listener and launch timer; false (logged) when any fails.
+    bool _startServing();
     void _run();
     void _notifyServerStart();
-    // Releases the name, answers what is queued and finishes the run loop.
+    // Releases the name and answers what is queued; _run then waits for open transactions.
     void _finish();
+    // Stops and joins every worker thread, in the order they feed each other.
+    void _stopWorkers();
 
     TXManager* _manager = nullptr;
-    std::vector<std::unique_ptr<TXManagerServerClient>> _clients;
+    std::vector<std::shared_ptr<TXManagerServerClient>> _clients;
     platform::ServiceListener _listener;
     platform::EventPtr _event;
     platform::EventSourcePtr _launchTimer;
     platform::EventSourcePtr _terminateSource;
     platform::EventSourcePtr _interruptSource;
+    platform::EventSourcePtr _wakeSource;
     bool _finishing = false;
+    std::chrono::steady_clock::time_point _drainDeadline;
+    bool _workersStopped = true;
 };
 
 // The exported interface's method table (TXManagerServer_Daemon.cpp).

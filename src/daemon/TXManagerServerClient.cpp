@@ -7,14 +7,19 @@
 namespace tavrix {
 
 TXManagerServerClient::TXManagerServerClient(std::string connection, pid_t pid,
-                                             std::optional<std::string> identifier)
-    : _connection(std::move(connection)), _identifier(std::move(identifier)), _pid(pid) {}
+                                             std::optional<std::string> identifier,
+                                             platform::BusSlotPtr invalidationWatch)
+    : _connection(std::move(connection)),
+      _identifier(std::move(identifier)),
+      _pid(pid),
+      _invalidationWatch(std::move(invalidationWatch)) {}
 
 TXManagerServerClient::~TXManagerServerClient() {
     invalidate();
 }
 
 void TXManagerServerClient::invalidate() {
+    _invalidationWatch.reset();
     _connection.clear();
 }
 

@@ -7,13 +7,17 @@
 #include <optional>
 #include <string>
 
+#include "platform/BusHandles.h"
+
 namespace tavrix {
 
 class TXManagerServerClient {
   public:
     // connection: the peer's unique bus name; pid and identifier (its command name) come from the
-    // peer's credentials and may be unknown.
-    TXManagerServerClient(std::string connection, pid_t pid, std::optional<std::string> identifier);
+    // peer's credentials and may be unknown. invalidationWatch is what reports the peer leaving
+    // the bus; it is dropped with the connection.
+    TXManagerServerClient(std::string connection, pid_t pid, std::optional<std::string> identifier,
+                          platform::BusSlotPtr invalidationWatch = nullptr);
     ~TXManagerServerClient();
     TXManagerServerClient(const TXManagerServerClient&) = delete;
     TXManagerServerClient& operator=(const TXManagerServerClient&) = delete;
@@ -23,7 +27,7 @@ class TXManagerServerClient {
     const std::optional<std::string>& identifier() const { return _identifier; }
     pid_t pid() const { return _pid; }
 
-    // Forgets the connection. Safe to call twice.
+    // Forgets the connection and stops watching it. Safe to call twice.
     void invalidate();
 
     std::string description() const;
@@ -32,6 +36,7 @@ class TXManagerServerClient {
     std::string _connection;
     std::optional<std::string> _identifier;
     pid_t _pid;
+    platform::BusSlotPtr _invalidationWatch;
 };
 
 }  // namespace tavrix

@@ -1,23 +1,37 @@
 // The service interface on the bus: each handler reads its arguments, makes the sender the current
 // connection (accepting it on its first call), calls the server's operation and replies. Calls
-// with a wrong signature never get here: sd-bus answers them with InvalidArgs.
+// with a wrong signature never get here: sd-bus answers them with InvalidArgs. Nothing thrown
+// below a handler goes further: it is logged and the call gets the normal "no" answer (NO or no
+// value), and the daemon goes on serving.
 #include <systemd/sd-bus.h>
 
 #include "daemon/TXManagerServer.h"
 #include "platform/BusValueCodec.h"
 #include "platform/NotificationCenter.h"
+#include "platform/ServiceManager.h"
+#include "util/ContainExceptions.h"
 #include "util/Log.h"
 
 namespace tavrix {
 namespace {
 
-// The sender is the current connection for as long as its message is handled.
+// The sender is the current connection for as long as its message is handled. A call is activity:
+// the idle grace counts from the end of the last one.
 class MessageScope {
   public:
     MessageScope(TXManagerServer& server, sd_bus_message* message) : listener_(server.listener()) {
-        listener_.beginMessage(message);
+        platform::ServiceManager::shared().noteActivity();
+        try {
+            listener_.beginMessage(message);
+        } catch (...) {
+            listener_.endMessage();
+            throw;
+        }
     }
-    ~MessageScope() { listener_.endMessage(); }
+    ~MessageScope() {
+        listener_.endMessage();
+        platform::ServiceManager::shared().noteActivity();
+    }
     MessageScope(const MessageScope&) = delete;
     MessageScope& operator=(const MessageScope&) = delete;
 
@@ -33,6 +47,17 @@ int replyBoolean(sd_bus_message* message, bool answer) {
     return sd_bus_reply_method_return(message, "b", answer ? 1 : 0);
 }
 
+// Runs one operation for the call; whatever it throws leaves the answer at its "no" value.
+template <typename Answer, typename Operation>
+Answer answerOf(const char* request, TXManagerServer& server, sd_bus_message* message,
+                Answer answer, Operation&& operation) {
+    containExceptions(request, [&] {
+        MessageScope scope(server, message);
+        operation(answer);
+    });
+    return answer;
+}
+
 int handleSetTavrixID(sd_bus_message* message, void* userdata, sd_bus_error* error) {
     auto& server = *static_cast<TXManagerServer*>(userdata);
     const char* tavrixID = nullptr;
@@ -45,17 +70,17 @@ int handleSetTavrixID(sd_bus_message* message, void* userdata, sd_bus_error* err
         return sd_bus_error_set(error, SD_BUS_ERROR_INVALID_ARGS,
                                 "The bundle must be an array of at most one byte array");
     }
-    MessageScope scope(server, message);
-    bool answer = false;
-    server.setTavrixID(tavrixID, bundle, [&](bool accepted) { answer = accepted; });
+    bool answer = answerOf("Set Tavrix ID", server, message, false, [&](bool& answer) {
+        server.setTavrixID(tavrixID, bundle, [&](bool accepted) { answer = accepted; });
+    });
     return replyBoolean(message, answer);
 }
 
 int handleIsTavrixBundleSupported(sd_bus_message* message, void* userdata, sd_bus_error*) {
     auto& server = *static_cast<TXManagerServer*>(userdata);
-    MessageScope scope(server, message);
-    bool answer = false;
-    server.isTavrixBundleSupported([&](bool supported) { answer = supported; });
+    bool answer = answerOf("Is Tavrix Bundle Supported", server, message, false, [&](bool& answer) {
+        server.isTavrixBundleSupported([&](bool supported) { answer = supported; });
+    });
     return replyBoolean(message, answer);
 }
 
@@ -75,15 +100,23 @@ int handleCopyTavrixValue(sd_bus_message* message, void* userdata, sd_bus_error*
     if (r < 0) {
         return invalidArguments(error, r);
     }
-    MessageScope scope(server, message);
-    std::optional<plist::Value> answer;
-    server.copyTavrixValue(key,
-                           [&](std::optional<plist::Value> value) { answer = std::move(value); });
-    platform::BusMessagePtr replyMessage = valueReply(message, answer);
-    if (!replyMessage && answer) {
-        // A setting the bus cannot carry (too deep, or text that is not UTF-8) is answered as no
-        // value: every well-formed call gets a normal reply.
-        logCFormat("The value for key %s cannot be sent over the bus; answering no value\n", key);
+    platform::BusMessagePtr replyMessage;
+    containExceptions("Copy Tavrix Value", [&] {
+        auto answer = answerOf(
+            "Copy Tavrix Value", server, message, std::optional<plist::Value>(),
+            [&](std::optional<plist::Value>& answer) {
+                server.copyTavrixValue(
+                    key, [&](std::optional<plist::Value> value) { answer = std::move(value); });
+            });
+        replyMessage = valueReply(message, answer);
+        if (!replyMessage && answer) {
+            // A setting the bus cannot carry (too deep, or text that is not UTF-8) is answered as
+            // no value: every well-formed call gets a normal reply.
+            logCFormat("The value for key %s cannot be sent over the bus; answering no value\n",
+                       key);
+        }
+    });
+    if (!replyMessage) {
         replyMessage = valueReply(message, std::nullopt);
     }
     if (!replyMessage) {
@@ -94,9 +127,10 @@ int handleCopyTavrixValue(sd_bus_message* message, void* userdata, sd_bus_error*
 
 int handleCheckForTavrixBundleUpdate(sd_bus_message* message, void* userdata, sd_bus_error*) {
     auto& server = *static_cast<TXManagerServer*>(userdata);
-    MessageScope scope(server, message);
-    bool answer = false;
-    server.checkForTavrixBundleUpdate([&](bool started) { answer = started; });
+    bool answer =
+        answerOf("Check For Tavrix Bundle Update", server, message, false, [&](bool& answer) {
+            server.checkForTavrixBundleUpdate([&](bool started) { answer = started; });
+        });
     return replyBoolean(message, answer);
 }
 
@@ -107,25 +141,35 @@ int handleSetClientType(sd_bus_message* message, void* userdata, sd_bus_error* e
     if (r < 0) {
         return invalidArguments(error, r);
     }
-    MessageScope scope(server, message);
-    bool answer = false;
-    server.setClientType(type, [&](bool known) { answer = known; });
+    bool answer = answerOf("Set Client Type", server, message, false, [&](bool& answer) {
+        server.setClientType(type, [&](bool known) { answer = known; });
+    });
     return replyBoolean(message, answer);
+}
+
+// The last resort around a handler, for what happens outside its operation (reading the arguments,
+// building the reply): an exception must not unwind through sd-bus, so it becomes an error reply.
+template <int (*Handler)(sd_bus_message*, void*, sd_bus_error*)>
+int contained(sd_bus_message* message, void* userdata, sd_bus_error* error) noexcept {
+    int result = -ENOMEM;
+    containExceptions("A call", [&] { result = Handler(message, userdata, error); });
+    return result;
 }
 
 const sd_bus_vtable kManagerServerVTable[] = {
     SD_BUS_VTABLE_START(0),
     SD_BUS_METHOD_WITH_NAMES("SetTavrixID", "saay", SD_BUS_PARAM(tavrixID) SD_BUS_PARAM(bundle),
-                             "b", SD_BUS_PARAM(accepted), handleSetTavrixID,
+                             "b", SD_BUS_PARAM(accepted), contained<handleSetTavrixID>,
                              SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_METHOD_WITH_NAMES("IsTavrixBundleSupported", "", , "b", SD_BUS_PARAM(supported),
-                             handleIsTavrixBundleSupported, SD_BUS_VTABLE_UNPRIVILEGED),
+                             contained<handleIsTavrixBundleSupported>, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_METHOD_WITH_NAMES("CopyTavrixValue", "s", SD_BUS_PARAM(key), "av", SD_BUS_PARAM(value),
-                             handleCopyTavrixValue, SD_BUS_VTABLE_UNPRIVILEGED),
+                             contained<handleCopyTavrixValue>, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_METHOD_WITH_NAMES("CheckForTavrixBundleUpdate", "", , "b", SD_BUS_PARAM(started),
-                             handleCheckForTavrixBundleUpdate, SD_BUS_VTABLE_UNPRIVILEGED),
+                             contained<handleCheckForTavrixBundleUpdate>,
+                             SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_METHOD_WITH_NAMES("SetClientType", "i", SD_BUS_PARAM(type), "b", SD_BUS_PARAM(known),
-                             handleSetClientType, SD_BUS_VTABLE_UNPRIVILEGED),
+                             contained<handleSetClientType>, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_VTABLE_END,
 };
 

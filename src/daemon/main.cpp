@@ -1,8 +1,13 @@
 // tavrixservicesd: started on demand by the bus or systemd; reads no arguments and no
-// configuration file, serves until its run loop finishes, and exits with 0.
+// configuration file, serves until its run loop finishes, and exits with 0, or with 1 when it
+// could not start serving.
 #include <signal.h>
 
+#include <cstdio>
+#include <cstdlib>
+
 #include "daemon/TXManagerServer.h"
+#include "util/ContainExceptions.h"
 #include "util/TXUtility.h"
 
 int main() {
@@ -16,6 +21,14 @@ int main() {
     signal(SIGPIPE, SIG_IGN);
 
     tavrix::TXUtility::setIsDaemon(true);
-    tavrix::TXManagerServer::sharedInstance().runUntilIdleExit();
-    return 0;
+    auto& server = tavrix::TXManagerServer::sharedInstance();
+    int status = 1;
+    const bool ran =
+        tavrix::containExceptions("The daemon", [&] { status = server.runUntilIdleExit(); });
+    if (!ran || !server.workersStopped()) {
+        // A worker thread may still be running: static destructors must not run under it.
+        std::fflush(nullptr);
+        std::_Exit(ran ? status : 1);
+    }
+    return status;
 }

@@ -1,13 +1,36 @@
 #include "platform/AssetCatalogService.h"
 
+#include <atomic>
+
 #include "platform/PlatformRoot.h"
 #include "util/Log.h"
 
 namespace tavrix::platform {
 
+namespace {
+
+// Set once the service exists, so that shutting down never creates it.
+std::atomic<AssetCatalogService*> created{nullptr};
+
+}  // namespace
+
 AssetCatalogService& AssetCatalogService::shared() {
-    static AssetCatalogService* service = new AssetCatalogService();
+    static AssetCatalogService* service = [] {
+        auto* made = new AssetCatalogService();
+        created.store(made);
+        return made;
+    }();
     return *service;
+}
+
+bool AssetCatalogService::shutdownIfStarted(std::chrono::milliseconds patience) {
+    AssetCatalogService* service = created.load();
+    if (service == nullptr) {
+        return true;
+    }
+    // Downloads first: they queue the reports that the delivery thread hands out.
+    bool stopped = service->worker_.shutdown(patience);
+    return service->delivery_.shutdown(patience) && stopped;
 }
 
 AssetCatalogService::AssetCatalogService()

@@ -2,6 +2,7 @@
 // file, the worker that downloads, and the thread that delivers progress reports.
 #pragma once
 
+#include <chrono>
 #include <map>
 #include <mutex>
 #include <optional>
@@ -18,6 +19,10 @@ class AssetCatalogService {
   public:
     // Created on first use and never destroyed.
     static AssetCatalogService& shared();
+
+    // Stops the download and delivery threads, if the service was ever created, letting what is
+    // queued run. False when either was still busy after patience.
+    static bool shutdownIfStarted(std::chrono::milliseconds patience);
 
     // Downloads and purges, one at a time.
     SerialQueue& workerQueue() { return worker_; }

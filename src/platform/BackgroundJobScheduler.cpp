@@ -15,6 +15,7 @@
 #include "platform/AtomicFile.h"
 #include "platform/PlatformRoot.h"
 #include "plist/PropertyListFormat.h"
+#include "util/ContainExceptions.h"
 #include "util/Log.h"
 
 namespace tavrix::platform {
@@ -105,12 +106,18 @@ BackgroundJobScheduler::BackgroundJobScheduler(std::string clientName, SerialQue
 }
 
 BackgroundJobScheduler::~BackgroundJobScheduler() {
+    stopTimer();
+}
+
+void BackgroundJobScheduler::stopTimer() {
     {
         std::lock_guard lock(mutex_);
         stopping_ = true;
     }
     changed_.notify_all();
-    timer_.join();
+    if (timer_.joinable()) {
+        timer_.join();
+    }
 }
 
 bool BackgroundJobScheduler::addJob(const std::string& name, const plist::Dictionary& criteria) {
@@ -249,21 +256,36 @@ void BackgroundJobScheduler::runTimer() {
     ::pthread_setname_np(::pthread_self(), "tavrix-jobs");
     std::unique_lock lock(mutex_);
     while (!stopping_) {
-        const double now = Clock::absoluteTimeNow();
-        processDueJobsLocked(now);
-        if (jobs_.empty()) {
+        std::optional<double> wait;
+        bool processed = containExceptions("The background job timer", [&] {
+            const double now = Clock::absoluteTimeNow();
+            processDueJobsLocked(now);
+            if (jobs_.empty()) {
+                return;
+            }
+            double nextStart = jobs_.begin()->second.windowStart;
+            for (const auto& entry : jobs_) {
+                nextStart = std::min(nextStart, entry.second.windowStart);
+            }
+            wait = std::min(nextStart - now, kLongestWaitSeconds);
+        });
+        if (stopping_) {
+            break;
+        }
+        if (!processed) {
+            // Whatever failed would fail again at once: look again after the longest wait.
+            wait = kLongestWaitSeconds;
+        }
+        if (!wait) {
             changed_.wait(lock);
             continue;
         }
-        double nextStart = jobs_.begin()->second.windowStart;
-        for (const auto& entry : jobs_) {
-            nextStart = std::min(nextStart, entry.second.windowStart);
-        }
         // Waits on the system clock, so that a change of the wall clock or a suspended machine
         // ends the wait at the right moment; the test offset wakes it through the subscription.
-        const std::chrono::duration<double> wait(std::min(nextStart - now, kLongestWaitSeconds));
-        changed_.wait_until(lock, std::chrono::system_clock::now() +
-                                      std::chrono::duration_cast<std::chrono::nanoseconds>(wait));
+        const std::chrono::duration<double> seconds(*wait);
+        changed_.wait_until(lock,
+                            std::chrono::system_clock::now() +
+                                std::chrono::duration_cast<std::chrono::nanoseconds>(seconds));
     }
 }
 

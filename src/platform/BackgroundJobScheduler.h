@@ -45,6 +45,9 @@ class BackgroundJobScheduler {
     BackgroundJobScheduler(std::string clientName, SerialQueue& queue, Handler handler);
     // Stops the timer; jobs not yet fired stay in the file for the next binding.
     ~BackgroundJobScheduler();
+    // Stops and joins the timer thread ahead of destruction; jobs can still be added and removed
+    // (and are saved), but none fires any more. Safe to call twice.
+    void stopTimer();
     BackgroundJobScheduler(const BackgroundJobScheduler&) = delete;
     BackgroundJobScheduler& operator=(const BackgroundJobScheduler&) = delete;
 

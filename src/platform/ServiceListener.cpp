@@ -1,8 +1,10 @@
 #include "platform/ServiceListener.h"
 
+#include <cerrno>
 #include <cstring>
 
 #include "platform/BusConnection.h"
+#include "util/ContainExceptions.h"
 #include "util/Log.h"
 
 namespace tavrix::platform {
@@ -29,16 +31,22 @@ bool ServiceListener::resume(sd_event* event, const char* path,
         objectSlots_.emplace_back(slot);
     }
     if (r >= 0) {
-        slot = nullptr;
-        r = sd_bus_match_signal(bus_.get(), &slot, "org.freedesktop.DBus", "/org/freedesktop/DBus",
-                                "org.freedesktop.DBus", "NameOwnerChanged", onNameOwnerChanged,
-                                this);
-        ownerChangedSlot_.reset(slot);
+        sd_event_source* source = nullptr;
+        r = sd_event_add_defer(event, &source, onDepartures, this);
+        departuresSource_.reset(source);
+        if (r >= 0) {
+            r = sd_event_source_set_enabled(source, SD_EVENT_OFF);
+        }
     }
     // The object is in place before the name is owned, so calls queued for the name find it.
     if (r >= 0) {
         r = sd_bus_request_name(bus_.get(), serviceName_.c_str(), 0);
         nameOwned_ = r >= 0;
+        if (r == -EEXIST) {
+            logCFormat("The name %s is owned by another process on the bus\n",
+                       serviceName_.c_str());
+            return false;
+        }
     }
     if (r < 0) {
         logCFormat("Cannot serve %s on the bus: %s\n", serviceName_.c_str(), std::strerror(-r));
@@ -70,12 +78,49 @@ PeerConnection ServiceListener::peerOf(sd_bus_message* message) const {
 void ServiceListener::beginMessage(sd_bus_message* message) {
     const char* sender = sd_bus_message_get_sender(message);
     current_ = sender == nullptr ? "" : sender;
-    if (current_.empty() || accepted_.count(current_) != 0) {
-        return;
+    if (!current_.empty() && !delegate_.isAcceptedConnection(current_)) {
+        delegate_.shouldAcceptNewConnection(*this, peerOf(message));
     }
-    if (delegate_.shouldAcceptNewConnection(*this, peerOf(message))) {
-        accepted_.insert(current_);
+}
+
+BusSlotPtr ServiceListener::watchConnection(const std::string& uniqueName) {
+    // Only this peer's departure: a match on the whole of NameOwnerChanged would wake the daemon
+    // for every connection on the bus.
+    const std::string match =
+        "type='signal',sender='org.freedesktop.DBus',path='/org/freedesktop/DBus',"
+        "interface='org.freedesktop.DBus',member='NameOwnerChanged',arg0='" +
+        uniqueName + "'";
+    sd_bus_slot* raw = nullptr;
+    int r = sd_bus_add_match(bus_.get(), &raw, match.c_str(), onNameOwnerChanged, this);
+    BusSlotPtr slot(raw);
+    if (r < 0) {
+        logCFormat("Cannot watch the client %s on the bus: %s\n", uniqueName.c_str(),
+                   std::strerror(-r));
     }
+    // A peer that left before the match was in place sends no signal any more.
+    if (r < 0 || !hasOwner(uniqueName)) {
+        queueDeparture(uniqueName);
+    }
+    return slot;
+}
+
+bool ServiceListener::hasOwner(const std::string& uniqueName) {
+    BusError error;
+    sd_bus_message* raw = nullptr;
+    int r = sd_bus_call_method(bus_.get(), "org.freedesktop.DBus", "/org/freedesktop/DBus",
+                               "org.freedesktop.DBus", "NameHasOwner", error.get(), &raw, "s",
+                               uniqueName.c_str());
+    BusMessagePtr reply(raw);
+    int owned = 0;
+    if (r < 0 || sd_bus_message_read(reply.get(), "b", &owned) < 0) {
+        return true;  // unknown: the match will still report its departure
+    }
+    return owned != 0;
+}
+
+void ServiceListener::queueDeparture(const std::string& uniqueName) {
+    departures_.push_back(uniqueName);
+    sd_event_source_set_enabled(departuresSource_.get(), SD_EVENT_ONESHOT);
 }
 
 int ServiceListener::onNameOwnerChanged(sd_bus_message* message, void* userdata, sd_bus_error*) {
@@ -87,13 +132,18 @@ int ServiceListener::onNameOwnerChanged(sd_bus_message* message, void* userdata,
         newOwner == nullptr || *newOwner != '\0') {
         return 0;
     }
-    auto it = listener->accepted_.find(name);
-    if (it == listener->accepted_.end()) {
-        return 0;
+    containExceptions("Noting a client's departure", [&] { listener->queueDeparture(name); });
+    return 0;
+}
+
+int ServiceListener::onDepartures(sd_event_source*, void* userdata) {
+    auto* listener = static_cast<ServiceListener*>(userdata);
+    std::vector<std::string> departed;
+    departed.swap(listener->departures_);
+    for (const std::string& uniqueName : departed) {
+        containExceptions("Removing a client",
+                          [&] { listener->delegate_.connectionInvalidated(uniqueName); });
     }
-    std::string uniqueName = *it;
-    listener->accepted_.erase(it);
-    listener->delegate_.connectionInvalidated(uniqueName);
     return 0;
 }
 

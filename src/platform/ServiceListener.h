@@ -1,7 +1,9 @@
 // The listener for the daemon's named service on D-Bus. It owns the bus connection (attached to
 // the main event loop), exports one object, owns the well-known name, and turns bus peers into
 // connections: a peer's first call accepts it (with its pid and command name from its
-// credentials), and its leaving the bus invalidates it.
+// credentials), and its leaving the bus invalidates it. Which peers are accepted is the
+// delegate's to know; the listener only watches the names it is asked to, so that the bus's other
+// comings and goings never wake the daemon.
 #pragma once
 
 #include <sys/types.h>
@@ -10,7 +12,6 @@
 
 #include <initializer_list>
 #include <optional>
-#include <set>
 #include <string>
 #include <vector>
 
@@ -37,7 +38,9 @@ class ServiceListener {
         // A peer's first call; a peer not accepted is asked about again on its next call.
         virtual bool shouldAcceptNewConnection(ServiceListener& listener,
                                                const PeerConnection& connection) = 0;
-        // The peer left the bus.
+        // Whether the peer was accepted and has not been invalidated since.
+        virtual bool isAcceptedConnection(const std::string& uniqueName) const = 0;
+        // A watched peer left the bus (delivered from the loop, never inside a method handler).
         virtual void connectionInvalidated(const std::string& uniqueName) = 0;
     };
 
@@ -46,9 +49,15 @@ class ServiceListener {
     ServiceListener& operator=(const ServiceListener&) = delete;
 
     // Connects, attaches to the event loop, exports the interfaces at path and owns the name.
-    // False (with a log line) when any of it fails.
+    // False (with one log line saying which) when any of it fails: no bus, the name owned by
+    // another process, or the connection refusing the set-up.
     bool resume(sd_event* event, const char* path,
                 std::initializer_list<ExportedInterface> interfaces, void* userdata);
+
+    // Watches a peer until the returned slot is dropped: once it leaves the bus (or if it already
+    // has), the delegate hears connectionInvalidated. Null when the bus refused the watch; the
+    // peer is then treated as gone.
+    BusSlotPtr watchConnection(const std::string& uniqueName);
 
     // Called by every method handler first: accepts the sender on its first call and makes it
     // the current connection.
@@ -65,14 +74,19 @@ class ServiceListener {
 
   private:
     static int onNameOwnerChanged(sd_bus_message* message, void* userdata, sd_bus_error* error);
+    static int onDepartures(sd_event_source* source, void* userdata);
     PeerConnection peerOf(sd_bus_message* message) const;
+    bool hasOwner(const std::string& uniqueName);
+    void queueDeparture(const std::string& uniqueName);
 
     std::string serviceName_;
     Delegate& delegate_;
     BusPtr bus_;
     std::vector<BusSlotPtr> objectSlots_;
-    BusSlotPtr ownerChangedSlot_;
-    std::set<std::string> accepted_;
+    // Departures reach the delegate from this one-shot source, outside any bus callback, so that
+    // the delegate may drop the watch that reported them.
+    EventSourcePtr departuresSource_;
+    std::vector<std::string> departures_;
     std::string current_;
     bool nameOwned_ = false;
 };

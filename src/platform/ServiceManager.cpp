@@ -1,6 +1,7 @@
 #include "platform/ServiceManager.h"
 
 #include <fcntl.h>
+#include <sys/eventfd.h>
 #include <sys/stat.h>
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
@@ -56,7 +57,8 @@ ServiceManager::ServiceManager()
     : runtimeDirectory_(runtimeDirectoryFromEnvironment()),
       keepAlivePath_(runtimeDirectory_ + "/keep-alive"),
       idleGrace_(idleGraceFromEnvironment()),
-      lastActivityTicks_(ticksNow()) {}
+      lastActivityTicks_(ticksNow()),
+      wakeFd_(::eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC)) {}
 
 void ServiceManager::openTransaction() {
     openTransactions_.fetch_add(1);
@@ -68,6 +70,7 @@ void ServiceManager::closeTransaction() {
         openTransactions_.fetch_add(1);  // never below zero, whatever the callers do
     }
     noteActivity();
+    wake();
 }
 
 bool ServiceManager::readKeepAlive(std::int64_t& value) const {
@@ -118,6 +121,7 @@ bool ServiceManager::writeKeepAlive(std::int64_t value) {
         return false;
     }
     noteActivity();
+    wake();
     return true;
 }
 
@@ -137,6 +141,21 @@ void ServiceManager::noteActivity() {
 std::chrono::steady_clock::time_point ServiceManager::lastActivity() const {
     return std::chrono::steady_clock::time_point(
         std::chrono::steady_clock::duration(lastActivityTicks_.load()));
+}
+
+void ServiceManager::wake() {
+    if (wakeFd_) {
+        // A full counter already wakes the reader, so a failed write loses nothing.
+        std::uint64_t one = 1;
+        [[maybe_unused]] ssize_t written = ::write(wakeFd_.get(), &one, sizeof one);
+    }
+}
+
+void ServiceManager::consumeWake() {
+    if (wakeFd_) {
+        std::uint64_t count = 0;
+        [[maybe_unused]] ssize_t got = ::read(wakeFd_.get(), &count, sizeof count);
+    }
 }
 
 void ServiceManager::notifyReady(const std::string& status) {

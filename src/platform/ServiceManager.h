@@ -12,6 +12,8 @@
 #include <mutex>
 #include <string>
 
+#include "util/UniqueFd.h"
+
 namespace tavrix::platform {
 
 class ServiceManager {
@@ -31,10 +33,17 @@ class ServiceManager {
     // True when nothing keeps the daemon running: no open transaction and keep-alive clear.
     bool isIdle() const;
 
-    // Marks activity (a transaction begun or ended, the keep-alive flag written); idle time
-    // counts from the last one.
+    // Marks activity (a call, a transaction begun or ended, the keep-alive flag written); idle
+    // time counts from the last one.
     void noteActivity();
     std::chrono::steady_clock::time_point lastActivity() const;
+
+    // Readable (an eventfd) whenever a transaction closed or the keep-alive flag was written since
+    // the last wake was consumed, from whatever thread: the run loop watches it so that it
+    // re-checks for idleness at once instead of at the end of its pass. -1 when it could not be
+    // made (the loop then notices at the end of its pass).
+    int wakeFd() const { return wakeFd_.get(); }
+    void consumeWake();
 
     // How long the daemon stays after becoming idle: $TAVRIX_IDLE_EXIT_SEC or 30 s.
     std::chrono::milliseconds idleGrace() const { return idleGrace_; }
@@ -48,6 +57,7 @@ class ServiceManager {
 
   private:
     ServiceManager();
+    void wake();
 
     std::string runtimeDirectory_;
     std::string keepAlivePath_;
@@ -55,6 +65,7 @@ class ServiceManager {
     std::atomic<int> openTransactions_{0};
     std::atomic<std::int64_t> lastActivityTicks_;
     mutable std::mutex keepAliveMutex_;
+    UniqueFd wakeFd_;
 };
 
 // One service-manager transaction, open while the object lives: work the process must finish

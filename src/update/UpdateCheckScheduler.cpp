@@ -1,5 +1,7 @@
 #include "update/UpdateCheckScheduler.h"
 
+#include <atomic>
+
 #include "daemon/BehaviorPreferences.h"
 #include "daemon/TXManager.h"
 #include "daemon/TXTransactionManager.h"
@@ -8,10 +10,31 @@
 
 namespace tavrix {
 
+namespace {
+
+// Set once the scheduler exists, so that shutting down never creates it.
+std::atomic<UpdateCheckScheduler*> created{nullptr};
+
+}  // namespace
+
 UpdateCheckScheduler& UpdateCheckScheduler::sharedInstance() {
-    // Never destroyed: the download path may call in while the process exits.
-    static UpdateCheckScheduler* scheduler = new UpdateCheckScheduler();
+    // Never destroyed: the download path may call in until its thread has been joined.
+    static UpdateCheckScheduler* scheduler = [] {
+        auto* made = new UpdateCheckScheduler();
+        created.store(made);
+        return made;
+    }();
     return *scheduler;
+}
+
+bool UpdateCheckScheduler::shutdownIfStarted(std::chrono::milliseconds patience) {
+    UpdateCheckScheduler* scheduler = created.load();
+    if (scheduler == nullptr) {
+        return true;
+    }
+    // The timer first: it is what queues jobs on the scheduler queue.
+    scheduler->_jobScheduler->stopTimer();
+    return scheduler->_schedulerQueue.shutdown(patience);
 }
 
 UpdateCheckScheduler::UpdateCheckScheduler() : _schedulerQueue(kUpdateCheckQueueLabel) {

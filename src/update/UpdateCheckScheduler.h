@@ -3,6 +3,7 @@
 // its handler runs the check under a keep-alive transaction.
 #pragma once
 
+#include <chrono>
 #include <mutex>
 #include <optional>
 #include <string>
@@ -28,6 +29,11 @@ class UpdateCheckScheduler {
   public:
     // The process's scheduler, created once from any thread; creating it arms its timer.
     static UpdateCheckScheduler& sharedInstance();
+
+    // Stops the job timer and the scheduler queue (letting a check already queued run), if the
+    // scheduler was ever created. False when the queue was still busy after patience. The
+    // scheduler stays usable for re-arming (a download finishing later), but no job fires.
+    static bool shutdownIfStarted(std::chrono::milliseconds patience);
 
     // Arms the timer from the stored "NextUpdate" (pushed 15 days ahead when missing or past).
     void startTimer();

@@ -4,9 +4,9 @@
 
 #include <condition_variable>
 #include <deque>
-#include <exception>
 #include <mutex>
 
+#include "util/ContainExceptions.h"
 #include "util/Log.h"
 
 namespace tavrix {
@@ -14,13 +14,19 @@ namespace tavrix {
 // Shared with the worker, so that a worker detached by its own queue's destructor keeps what
 // it still needs.
 struct SerialQueue::State {
-    explicit State(std::string queueLabel) : label(std::move(queueLabel)) {}
+    explicit State(std::string queueLabel)
+        : label(std::move(queueLabel)), taskDescription("Task on queue " + label) {}
 
     const std::string label;
+    // Made up front, so that reporting a failed task never needs memory.
+    const std::string taskDescription;
     std::mutex mutex;
     std::condition_variable wake;
     std::deque<std::function<void()>> tasks;
     bool stopping = false;
+    // Set by the worker as it returns, so that a shutdown can wait for it with patience.
+    bool finished = false;
+    std::condition_variable finishedChanged;
     std::thread::id workerId;
 };
 
@@ -30,14 +36,8 @@ namespace {
 constexpr std::size_t kMaxThreadNameLength = 15;
 
 // A throwing task is reported and dropped; the queue goes on with the next one.
-void runGuarded(const std::string& label, const std::function<void()>& task) {
-    try {
-        task();
-    } catch (const std::exception& error) {
-        logCFormat("Task on queue %s failed with an exception: %s", label.c_str(), error.what());
-    } catch (...) {
-        logCFormat("Task on queue %s failed with an unknown exception", label.c_str());
-    }
+void runGuarded(const std::string& taskDescription, const std::function<void()>& task) {
+    containExceptions(taskDescription.c_str(), task);
 }
 
 }  // namespace
@@ -51,12 +51,15 @@ void SerialQueue::runWorker(const std::shared_ptr<State>& state) {
             std::unique_lock lock(state->mutex);
             state->wake.wait(lock, [&] { return state->stopping || !state->tasks.empty(); });
             if (state->tasks.empty()) {
-                return;  // stopping, and everything queued has run
+                // Stopping, and everything queued has run.
+                state->finished = true;
+                state->finishedChanged.notify_all();
+                return;
             }
             task = std::move(state->tasks.front());
             state->tasks.pop_front();
         }
-        runGuarded(state->label, task);
+        runGuarded(state->taskDescription, task);
     }
 }
 
@@ -69,19 +72,29 @@ SerialQueue::SerialQueue(std::string label) : state_(std::make_shared<State>(std
 }
 
 SerialQueue::~SerialQueue() {
-    {
-        std::lock_guard lock(state_->mutex);
-        state_->stopping = true;
-    }
+    shutdown(std::nullopt);
+}
+
+bool SerialQueue::shutdown(std::optional<std::chrono::milliseconds> patience) {
+    std::unique_lock lock(state_->mutex);
+    state_->stopping = true;
     state_->wake.notify_all();
     if (!worker_.joinable()) {
-        return;
+        return true;
     }
-    if (isCurrent()) {
+    if (state_->workerId == std::this_thread::get_id()) {
         worker_.detach();
-    } else {
-        worker_.join();
+        return true;
     }
+    if (patience &&
+        !state_->finishedChanged.wait_for(lock, *patience, [&] { return state_->finished; })) {
+        logCFormat("Queue %s is still busy after %lld ms; not waiting for it",
+                   state_->label.c_str(), static_cast<long long>(patience->count()));
+        return false;
+    }
+    lock.unlock();
+    worker_.join();
+    return true;
 }
 
 const std::string& SerialQueue::label() const {
@@ -108,7 +121,7 @@ bool SerialQueue::dispatchAsync(std::function<void()> task) {
 
 bool SerialQueue::dispatchSync(std::function<void()> task) {
     if (isCurrent()) {
-        runGuarded(state_->label, task);
+        runGuarded(state_->taskDescription, task);
         return true;
     }
     // Shared with the queued task, so that neither side outlives what it touches.

@@ -5,6 +5,7 @@
 #include <sys/statfs.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cerrno>
 #include <cmath>
 #include <cstdlib>
@@ -43,11 +44,26 @@ std::optional<std::string> homeDirectory() {
 
 }  // namespace
 
+namespace {
+
+// Set once the task queue exists, so that shutting down never creates it.
+std::atomic<SerialQueue*> createdTaskQueue{nullptr};
+
+}  // namespace
+
 SerialQueue& TXUtility::taskQueue() {
-    // Never destroyed: operations may still be queued when the process exits, and exit must not
-    // wait for them.
-    static SerialQueue* queue = new SerialQueue("com.zandor.tavrixservices.operationTaskQueue");
+    // Never destroyed: the daemon stops its worker (shutdownTaskQueue) before leaving instead.
+    static SerialQueue* queue = [] {
+        auto* made = new SerialQueue("com.zandor.tavrixservices.operationTaskQueue");
+        createdTaskQueue.store(made);
+        return made;
+    }();
     return *queue;
+}
+
+bool TXUtility::shutdownTaskQueue(std::chrono::milliseconds patience) {
+    SerialQueue* queue = createdTaskQueue.load();
+    return queue == nullptr || queue->shutdown(patience);
 }
 
 void TXUtility::setIsDaemon(bool isDaemon) {

@@ -2,6 +2,7 @@
 // Facts that cannot change while the process runs are asked once and kept for its life.
 #pragma once
 
+#include <chrono>
 #include <cstdint>
 #include <optional>
 #include <string>
@@ -18,6 +19,9 @@ class TXUtility {
 
     // The serial queue for the daemon's operations, created on first use.
     static SerialQueue& taskQueue();
+    // Lets the task queue finish what is queued and joins its worker, if it was ever created.
+    // False when it was still busy after patience.
+    static bool shutdownTaskQueue(std::chrono::milliseconds patience);
 
     // Whether this process is the daemon; false until set. Set once at start-up, before any
     // other thread asks.

@@ -1,10 +1,13 @@
-// The daemon's life on the bus: started by the first call, held by its launch transaction, gone
-// when idle, started again by the next call; SIGTERM ends it cleanly.
+// The daemon's life on the bus: started by the first call, held by its launch transaction and by
+// calls, gone when idle, started again by the next call; SIGTERM ends it cleanly; a daemon that
+// cannot serve says why and fails.
 #include <signal.h>
 
 #include <algorithm>
+#include <thread>
 
 #include "BusFixture.h"
+#include "CommandRunner.h"
 
 namespace tavrix::integration {
 namespace {
@@ -80,6 +83,58 @@ TEST_F(DaemonLifecycleTest, KeepAliveLeftByEarlierRunIsClearedAndSigtermExitsCle
     EXPECT_TRUE(waitForNoNameOwner());
     EXPECT_EQ(waitForDaemonExit(*pid), std::optional<int>(0));
     EXPECT_EQ(device().keepAliveFlag(), std::optional<std::string>("0"));
+}
+
+class DaemonActivityTest : public DaemonLifecycleTest {
+  protected:
+    DaemonActivityTest() { busOptions.idleExitSeconds = 2; }
+};
+
+// A client calling once a second, from before the launch transaction ends until well past it,
+// keeps the one daemon: the grace runs from the last call. Once the calls stop, it leaves.
+TEST_F(DaemonActivityTest, CallsOnceASecondKeepOneDaemonAlivePastTheGrace) {
+    auto caller = client();
+    EXPECT_FALSE(caller.isTavrixBundleSupported());
+    const auto pid = daemonPid();
+    ASSERT_TRUE(pid);
+    for (int second = 0; second < 15; ++second) {
+        std::this_thread::sleep_for(1s);
+        EXPECT_TRUE(caller.setClientType(second));
+    }
+    EXPECT_EQ(countLogLines(kLaunchEnded), 1);
+    EXPECT_EQ(daemonPid(), pid);
+    EXPECT_EQ(daemonLaunches().size(), 1u);
+
+    EXPECT_TRUE(waitForNoNameOwner(10s));
+    EXPECT_EQ(waitForDaemonExit(*pid), std::optional<int>(0));
+}
+
+// A daemon that cannot serve (no bus to reach, or its name already owned on the bus) logs why and
+// exits with a failure, so that the service manager's restart policy acts.
+TEST_F(DaemonLifecycleTest, DaemonThatCannotServeExitsWithAFailure) {
+    auto runDaemon = [&](const std::string& busAddress) {
+        return runCommand({"/usr/bin/env", "-i", "TAVRIX_ROOT=" + device().root().string(),
+                           "RUNTIME_DIRECTORY=" + device().runtimeDirectory().string(),
+                           "TAVRIX_LOG_STDERR=1", "TAVRIX_IDLE_EXIT_SEC=1",
+                           "DBUS_SYSTEM_BUS_ADDRESS=" + busAddress, TAVRIX_DAEMON_PATH});
+    };
+
+    const std::string nowhere = "unix:path=" + (device().base() / "no-bus-here").string();
+    CommandResult unreachable = runDaemon(nowhere);
+    EXPECT_EQ(unreachable.status, 1);
+    EXPECT_NE(unreachable.output.find("Cannot connect to the bus for com.zandor.tavrixservicesd"),
+              std::string::npos)
+        << unreachable.output;
+
+    auto squatter = rawConnection();
+    ASSERT_GE(sd_bus_request_name(squatter.get(), kDaemonBusName, 0), 0);
+    CommandResult taken = runDaemon(busAddress());
+    EXPECT_EQ(taken.status, 1);
+    EXPECT_NE(taken.output.find(
+                  "The name com.zandor.tavrixservicesd is owned by another process on the bus"),
+              std::string::npos)
+        << taken.output;
+    EXPECT_EQ(daemonLaunches().size(), 0u);
 }
 
 }  // namespace

@@ -126,6 +126,29 @@ TEST(SerialQueue, DestructionRunsQueuedWorkAndRefusesNewWork) {
               std::vector<std::string>{"Queue test.drain is shutting down; dropping a task"});
 }
 
+// The daemon's bounded stop: a worker still busy when patience runs out is left running (and
+// said so), new work is refused meanwhile, and a later stop joins it once it is done.
+TEST(SerialQueue, ShutdownWithPatienceGivesUpOnABusyWorkerThenJoinsItLater) {
+    platform::CapturingLogSink sink;
+    platform::ScopedLogSink guard(sink);
+    SerialQueue queue("test.patience");
+    std::promise<void> release;
+    std::atomic<bool> finished{false};
+    queue.dispatchAsync([released = release.get_future().share(), &finished] {
+        released.wait();
+        finished = true;
+    });
+    EXPECT_FALSE(queue.shutdown(20ms));
+    EXPECT_FALSE(queue.dispatchAsync([] {}));
+    release.set_value();
+    EXPECT_TRUE(queue.shutdown(5s));
+    EXPECT_TRUE(finished);
+    EXPECT_EQ(sink.messages(),
+              (std::vector<std::string>{"Queue test.patience is still busy after 20 ms; not "
+                                        "waiting for it",
+                                        "Queue test.patience is shutting down; dropping a task"}));
+}
+
 TEST(SerialQueue, DestructionFromItsOwnTaskDoesNotDeadlock) {
     auto queue = std::make_unique<SerialQueue>("test.self");
     std::promise<void> gate;
