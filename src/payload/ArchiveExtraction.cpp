@@ -181,7 +181,9 @@ bool extractArchive(const std::string& archivePath, const std::string& destinati
                 return false;
             }
         }
-        if (std::optional<std::string> exceeded = budget.admitEntry(declaredSize(entry))) {
+        if (std::optional<std::string> exceeded = budget.admitEntry(
+                archive_entry_pathname(entry) ? archive_entry_pathname(entry) : "",
+                declaredSize(entry))) {
             return stop(*exceeded);
         }
         if (!placeEntry(entry, destination)) {

@@ -19,11 +19,27 @@ std::uint64_t saturatingAdd(std::uint64_t a, std::uint64_t b) {
 ExtractionBudget::ExtractionBudget(const ExtractionLimits& limits, std::string destination)
     : limits_(limits), destination_(std::move(destination)) {}
 
-std::optional<std::string> ExtractionBudget::admitEntry(std::uint64_t declaredSize) {
+std::optional<std::string> ExtractionBudget::admitEntry(std::string_view path,
+                                                        std::uint64_t declaredSize) {
     finishedBytes_ = saturatingAdd(finishedBytes_, entryExtent_);
     entryExtent_ = 0;
-    if (++entries_ > limits_.maxEntries) {
-        return "it holds more than " + std::to_string(limits_.maxEntries) + " entries";
+    // The disk writer creates missing parents on its own: one entry with a deep path would
+    // otherwise make thousands of directories for the price of one.
+    std::uint64_t created = 1;
+    for (std::size_t slash = path.find('/', 1); slash != std::string_view::npos;
+         slash = path.find('/', slash + 1)) {
+        if (entries_ + created > limits_.maxEntries) {
+            break;
+        }
+        created +=
+            impliedDirectories_.insert(std::hash<std::string_view>()(path.substr(0, slash))).second
+                ? 1
+                : 0;
+    }
+    entries_ += created;
+    if (entries_ > limits_.maxEntries) {
+        return "it holds more than " + std::to_string(limits_.maxEntries) +
+               " entries (with the directories their paths imply)";
     }
     if (saturatingAdd(finishedBytes_, declaredSize) > limits_.maxExpandedBytes) {
         return "it expands to more than " + std::to_string(limits_.maxExpandedBytes) + " bytes";

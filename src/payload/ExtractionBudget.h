@@ -5,6 +5,8 @@
 #include <cstdint>
 #include <optional>
 #include <string>
+#include <string_view>
+#include <unordered_set>
 
 #include "payload/PayloadUnpack.h"
 
@@ -14,9 +16,10 @@ class ExtractionBudget {
   public:
     ExtractionBudget(const ExtractionLimits& limits, std::string destination);
 
-    // Before an entry is written: counts it and makes room for the size it declares. Each answer
-    // is nothing when it fits, else why the extraction must stop.
-    std::optional<std::string> admitEntry(std::uint64_t declaredSize);
+    // Before an entry is written: counts it, with the parent directories its path implies that no
+    // entry before it implied, and makes room for the size it declares. Each answer is nothing
+    // when it fits, else why the extraction must stop.
+    std::optional<std::string> admitEntry(std::string_view path, std::uint64_t declaredSize);
     // After a block: the current entry now reaches extent bytes (its end, holes included).
     std::optional<std::string> noteExtent(std::uint64_t extent);
     // When the extraction is over: the room for its copy, when asked for, is still there.
@@ -28,6 +31,8 @@ class ExtractionBudget {
     const ExtractionLimits limits_;
     const std::string destination_;
     std::uint64_t entries_ = 0;
+    // Hashes of the parent directories implied so far; a collision only undercounts by one.
+    std::unordered_set<std::size_t> impliedDirectories_;
     // Bytes of the entries before the current one, and the current one's extent.
     std::uint64_t finishedBytes_ = 0;
     std::uint64_t entryExtent_ = 0;
