@@ -1,6 +1,7 @@
 // extractArchive: libarchive's reader feeding its disk writer. Entry paths are prefixed with the
 // destination instead of changing the process-wide working directory, which other threads share.
 #include <cerrno>
+#include <cstdint>
 #include <cstdlib>
 #include <cstring>
 #include <memory>
@@ -8,7 +9,9 @@
 #include <string>
 #include <string_view>
 
+#include "payload/ArchiveEntryPolicy.h"
 #include "payload/ArchiveHandles.h"
+#include "payload/ExtractionBudget.h"
 #include "payload/FileSystemHelper.h"
 #include "payload/PayloadUnpack.h"
 #include "util/Log.h"
@@ -25,7 +28,8 @@ constexpr int kRestoredAttributes =
     ARCHIVE_EXTRACT_PERM | ARCHIVE_EXTRACT_TIME | ARCHIVE_EXTRACT_ACL | ARCHIVE_EXTRACT_FFLAGS;
 static_assert(kRestoredAttributes == 0x66);
 // Never write through a symbolic link or to a path with "..". Absolute paths are refused before
-// the destination is prefixed (after which every path is absolute).
+// the destination is prefixed (after which every path is absolute), with every other entry that
+// could lead outside (ArchiveEntryPolicy).
 constexpr int kPathSafetyFlags = ARCHIVE_EXTRACT_SECURE_SYMLINKS | ARCHIVE_EXTRACT_SECURE_NODOTDOT;
 // Archives from the network get no file flags either: an immutable or append-only file would
 // stop the next install from removing the bundle it replaces.
@@ -49,40 +53,15 @@ const char* errorText(archive* handle) {
     return text != nullptr ? text : "unknown error";
 }
 
-bool hasParentComponent(std::string_view path) {
-    while (!path.empty()) {
-        auto slash = path.find('/');
-        if (path.substr(0, slash) == "..") {
-            return true;
-        }
-        if (slash == std::string_view::npos) {
-            break;
-        }
-        path.remove_prefix(slash + 1);
-    }
-    return false;
-}
-
-bool leavesDestination(std::string_view path) {
-    return path.front() == '/' || hasParentComponent(path);
-}
-
 // Points the entry's path and its hard-link target (when relative) below destination, as if the
-// archive were extracted inside it. False, logged, when the entry must be skipped.
-bool placeEntry(archive_entry* entry, const std::string& destination, ExtractionSafety safety) {
+// archive were extracted inside it. False, logged, when the entry must not be written.
+bool placeEntry(archive_entry* entry, const std::string& destination) {
     const char* name = archive_entry_pathname(entry);
     if (name == nullptr || name[0] == '\0') {
         logCFormat("Skipping an archive entry without a usable name\n");
         return false;
     }
     const char* linkTarget = archive_entry_hardlink(entry);
-    if (safety == ExtractionSafety::PathSafe &&
-        (leavesDestination(name) ||
-         (linkTarget != nullptr && linkTarget[0] != '\0' && leavesDestination(linkTarget)))) {
-        logCFormat("Refusing the archive entry %s: it leads outside %s\n", name,
-                   destination.c_str());
-        return false;
-    }
     if (name[0] != '/') {
         archive_entry_copy_pathname(entry, (destination + "/" + name).c_str());
     }
@@ -92,18 +71,35 @@ bool placeEntry(archive_entry* entry, const std::string& destination, Extraction
     return true;
 }
 
+std::uint64_t declaredSize(archive_entry* entry) {
+    if (!archive_entry_size_is_set(entry) || archive_entry_size(entry) < 0) {
+        return 0;
+    }
+    return static_cast<std::uint64_t>(archive_entry_size(entry));
+}
+
 // Copies the current entry's data block by block (sparse entries keep their holes); stops at the
-// entry's end or at the first failure on either side.
-void copyEntryData(archive* reader, archive* writer) {
+// entry's end, at the first failure on either side, or when the budget runs out (the answer).
+std::optional<std::string> copyEntryData(archive* reader, archive* writer,
+                                         ExtractionBudget& budget) {
     for (;;) {
         const void* block = nullptr;
         size_t size = 0;
         la_int64_t offset = 0;
         if (archive_read_data_block(reader, &block, &size, &offset) != ARCHIVE_OK) {
-            return;
+            return std::nullopt;
+        }
+        std::uint64_t start = offset > 0 ? static_cast<std::uint64_t>(offset) : 0;
+        std::uint64_t extent = 0;
+        if (__builtin_add_overflow(start, size, &extent)) {
+            extent = UINT64_MAX;
+        }
+        // Counted before the write, so that a block past the cap never reaches the disk.
+        if (std::optional<std::string> exceeded = budget.noteExtent(extent)) {
+            return exceeded;
         }
         if (archive_write_data_block(writer, block, size, offset) != ARCHIVE_OK) {
-            return;
+            return std::nullopt;
         }
     }
 }
@@ -111,7 +107,7 @@ void copyEntryData(archive* reader, archive* writer) {
 }  // namespace
 
 bool extractArchive(const std::string& archivePath, const std::string& destinationDirectory,
-                    ExtractionSafety safety) {
+                    ExtractionSafety safety, const ExtractionLimits& limits) {
     // Empty names would mean standard input and the file-system root to libarchive.
     if (archivePath.empty() || destinationDirectory.empty()) {
         logCFormat("Cannot extract the archive '%s' into '%s'\n", archivePath.c_str(),
@@ -156,11 +152,20 @@ bool extractArchive(const std::string& archivePath, const std::string& destinati
                    errorText(reader.get()));
         return false;
     }
+    ExtractionBudget budget(limits, destination);
+    auto stop = [&](const std::string& why) {
+        logCFormat("Extraction of %s into %s stopped: %s\n", archivePath.c_str(),
+                   destination.c_str(), why.c_str());
+        return false;
+    };
     for (;;) {
         archive_entry* entry = nullptr;
         int status = archive_read_next_header(reader.get(), &entry);
         if (status == ARCHIVE_EOF) {
             archive_read_close(reader.get());
+            if (std::optional<std::string> exceeded = budget.checkFinalRoom()) {
+                return stop(*exceeded);
+            }
             return true;
         }
         if (status != ARCHIVE_OK) {
@@ -168,15 +173,31 @@ bool extractArchive(const std::string& archivePath, const std::string& destinati
                        errorText(reader.get()));
             return false;
         }
-        if (!placeEntry(entry, destination, safety)) {
+        if (safety == ExtractionSafety::PathSafe) {
+            if (std::optional<std::string> unsafe = whyEntryIsUnsafe(entry)) {
+                logCFormat("Refusing the archive entry %s of %s: %s\n",
+                           archive_entry_pathname(entry) ? archive_entry_pathname(entry) : "",
+                           archivePath.c_str(), unsafe->c_str());
+                return false;
+            }
+        }
+        if (std::optional<std::string> exceeded = budget.admitEntry(
+                archive_entry_pathname(entry) ? archive_entry_pathname(entry) : "",
+                declaredSize(entry))) {
+            return stop(*exceeded);
+        }
+        if (!placeEntry(entry, destination)) {
             continue;
         }
         if (archive_write_header(writer.get(), entry) < ARCHIVE_WARN) {
             logCFormat("%s", "");
             continue;
         }
-        copyEntryData(reader.get(), writer.get());
+        std::optional<std::string> exceeded = copyEntryData(reader.get(), writer.get(), budget);
         archive_write_finish_entry(writer.get());
+        if (exceeded) {
+            return stop(*exceeded);
+        }
     }
 }
 

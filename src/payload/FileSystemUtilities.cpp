@@ -3,6 +3,7 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
+#include <sys/statvfs.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -313,6 +314,20 @@ int removeItemTree(const std::string& path) {
     std::error_code error;
     std::filesystem::remove_all(path, error);
     return error.value();
+}
+
+std::optional<std::uint64_t> availableBytesAt(const std::string& path) {
+    struct statvfs info {};
+    if (::statvfs(path.c_str(), &info) != 0) {
+        return std::nullopt;
+    }
+    // Block counts are in fragment-size units; older kernels leave that zero.
+    auto unit = static_cast<std::uint64_t>(info.f_frsize > 0 ? info.f_frsize : info.f_bsize);
+    std::uint64_t bytes = 0;
+    if (__builtin_mul_overflow(unit, static_cast<std::uint64_t>(info.f_bavail), &bytes)) {
+        return UINT64_MAX;
+    }
+    return bytes;
 }
 
 int copyItemTree(const std::string& source, const std::string& destination) {

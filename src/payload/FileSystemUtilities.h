@@ -7,6 +7,7 @@
 #include <sys/types.h>
 
 #include <cstddef>
+#include <cstdint>
 #include <cstdlib>
 #include <optional>
 #include <string>
@@ -49,6 +50,10 @@ int copyItemTree(const std::string& source, const std::string& destination);
 // Moves source to destination, which must not exist (EEXIST otherwise): a rename that never
 // replaces, or across file systems a copy followed by removing the source. 0 or errno.
 int moveItemTree(const std::string& source, const std::string& destination);
+
+// The bytes an unprivileged writer may still use on the file system holding path, or nothing
+// when it cannot be examined.
+std::optional<std::uint64_t> availableBytesAt(const std::string& path);
 
 // ---- Merging and attributes ----
 

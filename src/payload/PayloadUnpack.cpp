@@ -50,7 +50,10 @@ void BundleManager::installBehaviorBundleData(const plist::Data& data) {
     // The old bundle goes even when the new one fails to extract: the bundle manager then finds
     // whatever was extracted, never a mix of two payloads.
     helper.removeItem(bundleDirectory);
-    payload::extractArchive(stagedPath, bundleDirectory);
+    // Bounded, so that a payload that unpacks to far more than it weighs stops before the disk
+    // fills; what was extracted until then stays, like any other incomplete payload.
+    payload::extractArchive(stagedPath, bundleDirectory, payload::ExtractionSafety::AsArchived,
+                            payload::kClientPayloadLimits);
     helper.removeItem(stagedPath);
 }
 

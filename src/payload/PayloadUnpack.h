@@ -2,6 +2,7 @@
 // BundleManager::installBehaviorBundleData (in PayloadUnpack.cpp) drives them.
 #pragma once
 
+#include <cstdint>
 #include <string>
 
 #include "plist/Value.h"
@@ -15,18 +16,40 @@ inline constexpr const char* kBundleArchiveTempPath = "/tmp/behaviorbundle_zippe
 bool writeDataToFile(const plist::Data& data, const std::string& path);
 
 // How entry paths are trusted. A client's own bundle payload is written where its entries point;
-// archives from the network are refused entries that would leave the destination.
+// archives from the network hold only what stays inside the destination.
 enum class ExtractionSafety { AsArchived, PathSafe };
+
+// What one extraction may cost. Bytes count what the entries expand to (a sparse entry counts to
+// its end), not what the archive weighs, so a small compressed bomb is stopped as it unpacks.
+struct ExtractionLimits {
+    std::uint64_t maxExpandedBytes = 0;
+    std::uint64_t maxEntries = 0;
+    // Free space the destination's file system keeps after every write.
+    std::uint64_t freeSpaceReserve = 0;
+    // The extracted tree is copied elsewhere afterwards: keep room for that copy as well.
+    bool keepRoomForCopy = false;
+};
+
+// A real bundle is a few hundred files and a few megabytes; these leave ample headroom while a
+// payload can no longer fill the disk the daemon shares with the rest of the system.
+inline constexpr std::uint64_t kPayloadMaxExpandedBytes = 256ull << 20;
+inline constexpr std::uint64_t kPayloadMaxEntries = 20000;
+inline constexpr std::uint64_t kPayloadFreeSpaceReserve = 64ull << 20;
+inline constexpr ExtractionLimits kClientPayloadLimits{kPayloadMaxExpandedBytes, kPayloadMaxEntries,
+                                                       kPayloadFreeSpaceReserve, false};
 
 // Extracts a gzip- or compress-compressed tar or cpio archive file into destinationDirectory
 // (created when missing), restoring permissions, times, ACLs and file flags but not owners.
-// Relative entry paths land below destinationDirectory. AsArchived writes absolute and ".." paths
-// where they point; PathSafe refuses those entries (and hard links to such targets), and anything
-// that would be written through a symbolic link, and extracts the rest.
-// True when the archive was read to its end; false when it could not be opened or a header could
-// not be read (entries before the damage stay extracted). archivePath names a file; standard input
-// is never read. Never changes the process's working directory.
+// Relative entry paths land below destinationDirectory.
+// AsArchived writes absolute and ".." paths where they point. PathSafe takes only regular files,
+// directories and symbolic links whose target stays inside the destination, all below it, never
+// written through a link; any other entry (hard link, device, FIFO, socket, escaping path or link)
+// stops the extraction, logged. File flags are not restored in PathSafe.
+// Either way, going past a limit stops the extraction with one log line; what was written stays.
+// True when the archive was read to its end with nothing refused or cut short; false otherwise.
+// archivePath names a file; standard input is never read. Never changes the working directory.
 bool extractArchive(const std::string& archivePath, const std::string& destinationDirectory,
-                    ExtractionSafety safety = ExtractionSafety::AsArchived);
+                    ExtractionSafety safety = ExtractionSafety::AsArchived,
+                    const ExtractionLimits& limits = kClientPayloadLimits);
 
 }  // namespace tavrix::payload

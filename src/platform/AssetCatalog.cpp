@@ -25,10 +25,10 @@ bool isFinalReport(const plist::Dictionary& progress) {
 
 }  // namespace
 
-Asset::Asset(CatalogEntry entry, std::string typeCacheDirectory)
+Asset::Asset(CatalogEntry entry, std::string typeCacheDirectory, AssetLimits limits)
     : entry_(std::move(entry)),
-      directory_(AssetCacheLocation::forEntry(typeCacheDirectory, entry_).directory),
-      typeCacheDirectory_(std::move(typeCacheDirectory)) {}
+      typeCacheDirectory_(std::move(typeCacheDirectory)),
+      limits_(limits) {}
 
 void Asset::beginDownload(const plist::Dictionary& /*options*/) {
     {
@@ -55,9 +55,10 @@ void Asset::beginDownload(const plist::Dictionary& /*options*/) {
 
 void Asset::runDownload() {
     logCFormat("Asset catalog: downloading %s", entry_.archiveURL.c_str());
-    AssetCacheLocation location = AssetCacheLocation::forEntry(typeCacheDirectory_, entry_);
+    AssetCacheLocation location = AssetCacheLocation::forDownload(typeCacheDirectory_, entry_);
     std::optional<std::string> failure = downloadAndInstallAsset(
-        entry_, location, [this](plist::Dictionary progress) { report(std::move(progress)); });
+        entry_, location, limits_,
+        [this](plist::Dictionary progress) { report(std::move(progress)); });
     plist::Dictionary last;
     if (failure) {
         logCFormat("Asset catalog: download of %s failed: %s", entry_.archiveURL.c_str(),
@@ -66,12 +67,15 @@ void Asset::runDownload() {
                 {kAssetProgressErrorKey, plist::Value(*failure)}};
     } else {
         logCFormat("Asset catalog: installed %s in %s", entry_.archiveURL.c_str(),
-                   directory_.c_str());
+                   location.directory.c_str());
         last = {{kAssetProgressOperationKey, plist::Value(kAssetOperationCompleted)}};
     }
     {
         std::lock_guard lock(mutex_);
         downloading_ = false;
+        if (!failure) {
+            downloaded_.push_back(location.directory);
+        }
     }
     report(std::move(last));
 }
@@ -126,11 +130,19 @@ void Asset::deliverReports() {
 }
 
 std::optional<std::string> Asset::localURL() const {
+    std::string directory;
+    {
+        std::lock_guard lock(mutex_);
+        if (downloaded_.empty()) {
+            return std::nullopt;
+        }
+        directory = downloaded_.back();
+    }
     struct stat info {};
-    if (::stat(directory_.c_str(), &info) != 0 || !S_ISDIR(info.st_mode)) {
+    if (::stat(directory.c_str(), &info) != 0 || !S_ISDIR(info.st_mode)) {
         return std::nullopt;
     }
-    return directory_;
+    return directory;
 }
 
 void Asset::purge(PurgeCompletion completion) {
@@ -138,11 +150,19 @@ void Asset::purge(PurgeCompletion completion) {
     auto unfinished = std::make_shared<ScopedServiceTransaction>();
     AssetCatalogService::shared().workerQueue().dispatchAsync(
         [self, unfinished, completion = std::move(completion)] {
-            int error = payload::removeItemTree(self->directory_);
-            bool purged = error == 0 || error == ENOENT;
-            if (!purged) {
-                logCFormat("Asset catalog: cannot purge %s: %s", self->directory_.c_str(),
-                           std::strerror(error));
+            std::vector<std::string> directories;
+            {
+                std::lock_guard lock(self->mutex_);
+                directories.swap(self->downloaded_);
+            }
+            bool purged = true;
+            for (const std::string& directory : directories) {
+                int error = payload::removeItemTree(directory);
+                if (error != 0 && error != ENOENT) {
+                    purged = false;
+                    logCFormat("Asset catalog: cannot purge %s: %s", directory.c_str(),
+                               std::strerror(error));
+                }
             }
             if (completion) {
                 completion(purged);
@@ -168,7 +188,8 @@ std::optional<std::vector<std::shared_ptr<Asset>>> AssetQuery::runQuery() const 
         return std::nullopt;
     }
     for (CatalogEntry& entry : *entries) {
-        assets.push_back(std::make_shared<Asset>(std::move(entry), settings->cacheDirectory));
+        assets.push_back(
+            std::make_shared<Asset>(std::move(entry), settings->cacheDirectory, settings->limits));
     }
     return assets;
 }

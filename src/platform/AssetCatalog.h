@@ -22,6 +22,7 @@
 #include <vector>
 
 #include "platform/AssetCatalogFormat.h"
+#include "platform/AssetCatalogSettings.h"
 #include "platform/ServiceManager.h"
 #include "plist/Value.h"
 
@@ -49,7 +50,7 @@ class Asset : public std::enable_shared_from_this<Asset> {
     using PurgeCompletion = std::function<void(bool purged)>;
 
     // Assets come from AssetQuery; typeCacheDirectory is the asset type's directory in the cache.
-    Asset(CatalogEntry entry, std::string typeCacheDirectory);
+    Asset(CatalogEntry entry, std::string typeCacheDirectory, AssetLimits limits);
     Asset(const Asset&) = delete;
     Asset& operator=(const Asset&) = delete;
 
@@ -63,11 +64,13 @@ class Asset : public std::enable_shared_from_this<Asset> {
     // Sets the handler for this download's reports, including those already made.
     void setProgressHandler(ProgressHandler handler);
 
-    // The directory holding the extracted asset, or nothing while it has not been downloaded.
+    // The directory holding this asset's latest completed download, or nothing while there is
+    // none. Each download has a directory of its own.
     std::optional<std::string> localURL() const;
 
-    // Removes the downloaded asset (after a download still queued or running), then calls
-    // completion, when given, on the worker thread: true when nothing of it is left.
+    // Removes the directories of this asset's downloads (after a download still queued or
+    // running), never another asset's, then calls completion, when given, on the worker thread:
+    // true when nothing of them is left.
     void purge(PurgeCompletion completion);
 
   private:
@@ -76,10 +79,12 @@ class Asset : public std::enable_shared_from_this<Asset> {
     void runDownload();
 
     const CatalogEntry entry_;
-    const std::string directory_;
     const std::string typeCacheDirectory_;
+    const AssetLimits limits_;
 
-    std::mutex mutex_;
+    mutable std::mutex mutex_;
+    // The directories of completed downloads, the latest last.
+    std::vector<std::string> downloaded_;
     bool downloading_ = false;
     ProgressHandler handler_;
     std::deque<plist::Dictionary> undelivered_;

@@ -1,5 +1,6 @@
 #include "platform/AssetCatalogSettings.h"
 
+#include <algorithm>
 #include <cstring>
 
 #include "platform/PlatformRoot.h"
@@ -28,7 +29,59 @@ std::optional<CatalogPublicKey> decodePublicKey(const plist::Value& value) {
     return key;
 }
 
+// Sets target from the integer under key, when present. False, with whyNot, when it is no integer
+// between minimum and maximum.
+template <typename Number>
+bool readLimit(const plist::Value& settings, const char* key, std::uint64_t minimum,
+               std::uint64_t maximum, Number& target, std::string& whyNot) {
+    const plist::Value* value = settings.find(key);
+    if (value == nullptr) {
+        return true;
+    }
+    const plist::Integer* number = value->asInteger();
+    if (number == nullptr || (!number->isLargeUnsigned() && number->signedValue() < 0) ||
+        number->unsignedValue() < minimum || number->unsignedValue() > maximum) {
+        whyNot = std::string(key) + " is not an integer from " + std::to_string(minimum) + " to " +
+                 std::to_string(maximum);
+        return false;
+    }
+    target = static_cast<Number>(number->unsignedValue());
+    return true;
+}
+
+// A day: no transfer of a catalog or bundle has a reason to take longer.
+constexpr std::uint64_t kMaxSeconds = 86400;
+
+bool readLimits(const plist::Value& settings, AssetLimits& limits, std::string& whyNot) {
+    return readLimit(settings, kSettingsMaxExpandedBytesKey, 1, UINT64_MAX, limits.maxExpandedBytes,
+                     whyNot) &&
+           readLimit(settings, kSettingsMaxArchiveEntriesKey, 1, UINT64_MAX,
+                     limits.maxArchiveEntries, whyNot) &&
+           readLimit(settings, kSettingsFreeSpaceReserveKey, 0, UINT64_MAX,
+                     limits.freeSpaceReserveBytes, whyNot) &&
+           readLimit(settings, kSettingsConnectTimeoutKey, 1, kMaxSeconds,
+                     limits.connectTimeoutSeconds, whyNot) &&
+           readLimit(settings, kSettingsLowSpeedBytesKey, 1, UINT32_MAX,
+                     limits.lowSpeedBytesPerSecond, whyNot) &&
+           readLimit(settings, kSettingsLowSpeedSecondsKey, 1, kMaxSeconds, limits.lowSpeedSeconds,
+                     whyNot) &&
+           readLimit(settings, kSettingsCatalogTimeoutKey, 1, kMaxSeconds,
+                     limits.catalogTimeoutSeconds, whyNot) &&
+           readLimit(settings, kSettingsArchiveTimeoutKey, 1, kMaxSeconds,
+                     limits.archiveTimeoutSeconds, whyNot);
+}
+
 }  // namespace
+
+HttpTransferLimits AssetLimits::archiveTransfer() const {
+    return {connectTimeoutSeconds, lowSpeedBytesPerSecond, lowSpeedSeconds,
+            archiveTimeoutSeconds * 1000};
+}
+
+HttpTransferLimits AssetLimits::catalogTransfer(long remainingMilliseconds) const {
+    return {connectTimeoutSeconds, lowSpeedBytesPerSecond, lowSpeedSeconds,
+            std::max(remainingMilliseconds, 1L)};
+}
 
 std::optional<AssetTypeSettings> parseAssetTypeSettings(const plist::Value& settings,
                                                         std::string_view assetType,
@@ -62,6 +115,9 @@ std::optional<AssetTypeSettings> parseAssetTypeSettings(const plist::Value& sett
         return std::nullopt;
     }
     AssetTypeSettings result;
+    if (!readLimits(settings, result.limits, whyNot)) {
+        return std::nullopt;
+    }
     result.assetType = std::string(assetType);
     result.catalogURL = *url->asString();
     if (const plist::Value* key = type->find(kSettingsPublicKeyKey)) {

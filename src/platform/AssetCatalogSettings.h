@@ -6,13 +6,16 @@
 //   AssetTypes       dictionary: asset type -> dictionary of
 //       CatalogURL   string, http or https URL of the catalog property list
 //       PublicKey    optional Ed25519 public key: data of 32 bytes, or a string of their base64
+//   and optional integers bounding what catalogs and archives may cost (AssetLimits below).
 #pragma once
 
+#include <cstdint>
 #include <optional>
 #include <string>
 #include <string_view>
 
 #include "platform/CatalogCrypto.h"
+#include "platform/HttpTransfer.h"
 #include "plist/Value.h"
 
 namespace tavrix::platform {
@@ -25,6 +28,35 @@ inline constexpr const char* kSettingsAssetTypesKey = "AssetTypes";
 inline constexpr const char* kSettingsCatalogURLKey = "CatalogURL";
 inline constexpr const char* kSettingsPublicKeyKey = "PublicKey";
 
+inline constexpr const char* kSettingsMaxExpandedBytesKey = "MaxExpandedBytes";
+inline constexpr const char* kSettingsMaxArchiveEntriesKey = "MaxArchiveEntries";
+inline constexpr const char* kSettingsFreeSpaceReserveKey = "FreeSpaceReserveBytes";
+inline constexpr const char* kSettingsConnectTimeoutKey = "ConnectTimeoutSeconds";
+inline constexpr const char* kSettingsLowSpeedBytesKey = "LowSpeedBytesPerSecond";
+inline constexpr const char* kSettingsLowSpeedSecondsKey = "LowSpeedSeconds";
+inline constexpr const char* kSettingsCatalogTimeoutKey = "CatalogTimeoutSeconds";
+inline constexpr const char* kSettingsArchiveTimeoutKey = "ArchiveTimeoutSeconds";
+
+// What one catalog fetch and one archive may cost. The defaults fit real bundles (a few
+// megabytes, a few hundred files) with wide margins. The catalog's time covers its signature too
+// and is short because a client's update check waits for it on the daemon's main thread.
+struct AssetLimits {
+    std::uint64_t maxExpandedBytes = 256ull << 20;
+    std::uint64_t maxArchiveEntries = 20000;
+    // Kept free on the cache's file system, beyond the room for the installer's copy.
+    std::uint64_t freeSpaceReserveBytes = 64ull << 20;
+    long connectTimeoutSeconds = 10;
+    long lowSpeedBytesPerSecond = 1024;
+    long lowSpeedSeconds = 30;
+    long catalogTimeoutSeconds = 5;
+    long archiveTimeoutSeconds = 1800;
+
+    HttpTransferLimits archiveTransfer() const;
+    // For what is left of the catalog's time; never below one millisecond, which curl would
+    // take as no limit.
+    HttpTransferLimits catalogTransfer(long remainingMilliseconds) const;
+};
+
 struct AssetTypeSettings {
     std::string assetType;
     std::string catalogURL;
@@ -32,10 +64,12 @@ struct AssetTypeSettings {
     std::optional<CatalogPublicKey> publicKey;
     // This type's own directory in the cache, resolved under the platform root.
     std::string cacheDirectory;
+    AssetLimits limits;
 };
 
 // The settings for assetType from the settings file's value, or nothing with whyNot saying what
-// is missing or malformed. A malformed key refuses the type rather than dropping verification.
+// is missing or malformed. A malformed key refuses the type rather than dropping verification, and
+// a malformed limit rather than dropping the limit.
 std::optional<AssetTypeSettings> parseAssetTypeSettings(const plist::Value& settings,
                                                         std::string_view assetType,
                                                         std::string& whyNot);

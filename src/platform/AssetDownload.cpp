@@ -1,11 +1,15 @@
 #include "platform/AssetDownload.h"
 
 #include <fcntl.h>
+#include <sys/random.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
+#include <cstdio>
 #include <cstring>
+#include <ctime>
 
 #include "payload/FileSystemUtilities.h"
 #include "payload/PayloadUnpack.h"
@@ -67,6 +71,7 @@ plist::Dictionary byteProgress(const char* operation, std::uint64_t written, std
 
 // Streams the archive into fd, hashing it on the way. Nothing on success, else why not.
 std::optional<std::string> downloadArchive(const CatalogEntry& entry, int fd,
+                                           const AssetLimits& limits,
                                            const AssetProgressReporter& report) {
     Sha256Digest digest;
     std::uint64_t received = 0;
@@ -91,7 +96,7 @@ std::optional<std::string> downloadArchive(const CatalogEntry& entry, int fd,
         return true;
     };
     std::string error;
-    if (!transferHttpBody(entry.archiveURL, receiver, {}, error)) {
+    if (!transferHttpBody(entry.archiveURL, receiver, limits.archiveTransfer(), error)) {
         return "cannot download " + entry.archiveURL + ": " + error;
     }
     if (received != entry.archiveSize) {
@@ -105,17 +110,36 @@ std::optional<std::string> downloadArchive(const CatalogEntry& entry, int fd,
     return std::nullopt;
 }
 
+// 64 random bits as hex; should the kernel give none, the process and a count still keep this
+// process's downloads apart from each other and from those of an earlier run.
+std::string uniqueSuffix() {
+    std::uint64_t bits = 0;
+    if (::getrandom(&bits, sizeof bits, 0) != static_cast<ssize_t>(sizeof bits)) {
+        static std::atomic<std::uint64_t> counter{0};
+        bits = (static_cast<std::uint64_t>(::getpid()) << 32) ^ ++counter ^
+               static_cast<std::uint64_t>(::time(nullptr));
+    }
+    char text[17];
+    std::snprintf(text, sizeof text, "%016llx", static_cast<unsigned long long>(bits));
+    return text;
+}
+
+payload::ExtractionLimits extractionLimits(const AssetLimits& limits) {
+    return {limits.maxExpandedBytes, limits.maxArchiveEntries, limits.freeSpaceReserveBytes, true};
+}
+
 }  // namespace
 
-AssetCacheLocation AssetCacheLocation::forEntry(const std::string& typeCacheDirectory,
-                                                const CatalogEntry& entry) {
+AssetCacheLocation AssetCacheLocation::forDownload(const std::string& typeCacheDirectory,
+                                                   const CatalogEntry& entry) {
+    std::string name = entry.archiveSHA256 + "-" + uniqueSuffix();
     std::string base = typeCacheDirectory + "/";
-    return {base + entry.archiveSHA256, base + "." + entry.archiveSHA256 + ".download",
-            base + "." + entry.archiveSHA256 + ".extracting"};
+    return {base + name, base + "." + name + ".download", base + "." + name + ".extracting"};
 }
 
 std::optional<std::string> downloadAndInstallAsset(const CatalogEntry& entry,
                                                    const AssetCacheLocation& location,
+                                                   const AssetLimits& limits,
                                                    const AssetProgressReporter& report) {
     report(byteProgress(kAssetOperationStarted, 0, entry.archiveSize));
     std::string cacheDirectory = location.directory.substr(0, location.directory.rfind('/'));
@@ -129,19 +153,16 @@ std::optional<std::string> downloadAndInstallAsset(const CatalogEntry& entry,
         if (!fd) {
             return errnoText("create", archive.path(), errno);
         }
-        if (std::optional<std::string> failure = downloadArchive(entry, fd.get(), report)) {
+        if (std::optional<std::string> failure = downloadArchive(entry, fd.get(), limits, report)) {
             return failure;
         }
     }
     report(progress(kAssetOperationInstalling));
     StagedPath extraction(location.extractionDirectory);
+    // The installer copies the extracted tree next: the extraction keeps room for that copy.
     if (!payload::extractArchive(archive.path(), extraction.path(),
-                                 payload::ExtractionSafety::PathSafe)) {
-        return "the archive could not be extracted";
-    }
-    int error = payload::removeItemTree(location.directory);
-    if (error != 0 && error != ENOENT) {
-        return errnoText("replace", location.directory, error);
+                                 payload::ExtractionSafety::PathSafe, extractionLimits(limits))) {
+        return "the archive could not be extracted whole";
     }
     if (::rename(extraction.path().c_str(), location.directory.c_str()) != 0) {
         return errnoText("install into", location.directory, errno);

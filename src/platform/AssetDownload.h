@@ -7,29 +7,33 @@
 #include <string>
 
 #include "platform/AssetCatalogFormat.h"
+#include "platform/AssetCatalogSettings.h"
 #include "plist/Value.h"
 
 namespace tavrix::platform {
 
-// Where an asset lives in its type's cache directory. Staging names start with "." so that they
-// never collide with an installed asset (named by its archive's digest).
+// Where one download of an asset lives in its type's cache directory. Every download gets names
+// of its own (the archive's digest and a random suffix), so two downloads of the same asset that
+// overlap never remove or replace each other's files. Staging names start with "." so that they
+// never collide with an installed asset.
 struct AssetCacheLocation {
     std::string directory;
     std::string archiveFile;
     std::string extractionDirectory;
 
-    static AssetCacheLocation forEntry(const std::string& typeCacheDirectory,
-                                       const CatalogEntry& entry);
+    static AssetCacheLocation forDownload(const std::string& typeCacheDirectory,
+                                          const CatalogEntry& entry);
 };
 
 using AssetProgressReporter = std::function<void(plist::Dictionary progress)>;
 
-// Downloads, verifies and extracts the entry's archive into location.directory, replacing what
-// was there, and reports the intermediate steps. Nothing on success, else why it failed. Either
-// way the staged archive and any partial extraction are gone afterwards; a download, check or
-// extraction that fails leaves an earlier installed copy as it was.
+// Downloads, verifies and extracts the entry's archive within limits, renames the extraction to
+// location.directory when it is whole, and reports the intermediate steps. Nothing on success,
+// else why it failed. Either way the staged archive and any partial extraction are gone
+// afterwards.
 std::optional<std::string> downloadAndInstallAsset(const CatalogEntry& entry,
                                                    const AssetCacheLocation& location,
+                                                   const AssetLimits& limits,
                                                    const AssetProgressReporter& report);
 
 }  // namespace tavrix::platform

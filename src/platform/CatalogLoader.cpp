@@ -1,6 +1,7 @@
 #include "platform/CatalogLoader.h"
 
 #include <cerrno>
+#include <chrono>
 #include <cstring>
 
 #include "payload/FileSystemUtilities.h"
@@ -12,7 +13,6 @@
 namespace tavrix::platform {
 namespace {
 
-constexpr long kCatalogTimeoutSeconds = 120;
 constexpr const char* kLocalCopyName = "/catalog.plist";
 
 struct SignedCatalog {
@@ -32,12 +32,31 @@ bool verify(const AssetTypeSettings& settings, const SignedCatalog& catalog, std
     return true;
 }
 
+// The catalog and its signature share one time budget: the whole fetch is what a waiting update
+// check feels.
+class FetchDeadline {
+  public:
+    explicit FetchDeadline(long seconds)
+        : end_(std::chrono::steady_clock::now() + std::chrono::seconds(seconds)) {}
+    long remainingMilliseconds() const {
+        auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+            end_ - std::chrono::steady_clock::now());
+        return static_cast<long>(left.count());
+    }
+
+  private:
+    std::chrono::steady_clock::time_point end_;
+};
+
 std::optional<SignedCatalog> fetchFromServer(const AssetTypeSettings& settings,
                                              std::string& whyNot) {
     std::string error;
     SignedCatalog catalog;
+    const AssetLimits& limits = settings.limits;
+    FetchDeadline deadline(limits.catalogTimeoutSeconds);
     std::optional<std::string> bytes =
-        fetchHttpBody(settings.catalogURL, kMaxCatalogBytes, kCatalogTimeoutSeconds, error);
+        fetchHttpBody(settings.catalogURL, kMaxCatalogBytes,
+                      limits.catalogTransfer(deadline.remainingMilliseconds()), error);
     if (!bytes) {
         whyNot = "cannot fetch it: " + error;
         return std::nullopt;
@@ -46,7 +65,8 @@ std::optional<SignedCatalog> fetchFromServer(const AssetTypeSettings& settings,
     if (settings.publicKey) {
         std::string signatureURL = settings.catalogURL + kCatalogSignatureSuffix;
         std::optional<std::string> signature =
-            fetchHttpBody(signatureURL, kCatalogSignatureBytes, kCatalogTimeoutSeconds, error);
+            fetchHttpBody(signatureURL, kCatalogSignatureBytes,
+                          limits.catalogTransfer(deadline.remainingMilliseconds()), error);
         if (!signature) {
             whyNot = "cannot fetch its signature " + signatureURL + ": " + error;
             return std::nullopt;

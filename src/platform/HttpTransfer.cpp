@@ -7,9 +7,6 @@
 namespace tavrix::platform {
 namespace {
 
-constexpr long kConnectTimeoutSeconds = 30;
-// A transfer slower than one byte a second for this long has stalled.
-constexpr long kStallSeconds = 60;
 constexpr long kMaxRedirects = 5;
 constexpr const char* kAllowedProtocols = "http,https";
 
@@ -64,10 +61,11 @@ bool transferHttpBody(const std::string& url, const HttpBodyReceiver& receiver,
         curl_easy_setopt(curl, CURLOPT_MAXREDIRS, kMaxRedirects) == CURLE_OK &&
         curl_easy_setopt(curl, CURLOPT_FAILONERROR, 1L) == CURLE_OK &&
         curl_easy_setopt(curl, CURLOPT_NOSIGNAL, 1L) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_CONNECTTIMEOUT, kConnectTimeoutSeconds) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_LOW_SPEED_LIMIT, 1L) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_LOW_SPEED_TIME, kStallSeconds) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_TIMEOUT, limits.totalTimeoutSeconds) == CURLE_OK &&
+        curl_easy_setopt(curl, CURLOPT_CONNECTTIMEOUT, limits.connectTimeoutSeconds) == CURLE_OK &&
+        curl_easy_setopt(curl, CURLOPT_LOW_SPEED_LIMIT, limits.lowSpeedBytesPerSecond) ==
+            CURLE_OK &&
+        curl_easy_setopt(curl, CURLOPT_LOW_SPEED_TIME, limits.lowSpeedSeconds) == CURLE_OK &&
+        curl_easy_setopt(curl, CURLOPT_TIMEOUT_MS, limits.totalTimeoutMilliseconds) == CURLE_OK &&
         curl_easy_setopt(curl, CURLOPT_ERRORBUFFER, errorText) == CURLE_OK &&
         curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, receiveBody) == CURLE_OK &&
         curl_easy_setopt(curl, CURLOPT_WRITEDATA, &state) == CURLE_OK;
@@ -92,7 +90,7 @@ bool transferHttpBody(const std::string& url, const HttpBodyReceiver& receiver,
 }
 
 std::optional<std::string> fetchHttpBody(const std::string& url, std::size_t maxBytes,
-                                         long totalTimeoutSeconds, std::string& error) {
+                                         const HttpTransferLimits& limits, std::string& error) {
     std::string body;
     HttpBodyReceiver collect = [&](std::string_view bytes, std::string& refusal) {
         if (bytes.size() > maxBytes - body.size()) {
@@ -102,7 +100,7 @@ std::optional<std::string> fetchHttpBody(const std::string& url, std::size_t max
         body.append(bytes);
         return true;
     };
-    if (!transferHttpBody(url, collect, {totalTimeoutSeconds}, error)) {
+    if (!transferHttpBody(url, collect, limits, error)) {
         return std::nullopt;
     }
     return body;

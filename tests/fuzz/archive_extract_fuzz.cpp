@@ -1,12 +1,14 @@
 // Feeds arbitrary bytes to the payload extractor as an archive file, in the mode used for
-// archives from the network, into a fresh directory that is removed afterwards. Whatever the
-// bytes, nothing may be written outside that directory.
+// archives from the network and with small limits, into a fresh directory that is removed
+// afterwards. Whatever the bytes, nothing may be written outside that directory, no symbolic link
+// left in it may lead outside, and what it holds stays within the limits.
 #include <fcntl.h>
 #include <linux/fs.h>
 #include <sys/ioctl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstddef>
 #include <cstdint>
 #include <cstdlib>
@@ -75,6 +77,43 @@ class DiscardingLogSink : public tavrix::platform::LogSink {
     void write(int, std::string_view) override {}
 };
 
+// Small enough that bombs are cut quickly, large enough for every seed to extract.
+constexpr tavrix::payload::ExtractionLimits kLimits{4u << 20, 200, 0, true};
+
+struct Contents {
+    std::uintmax_t bytes = 0;
+    std::uintmax_t objects = 0;
+};
+
+// Counts what lies below destination and aborts on a symbolic link that resolves outside it.
+Contents inspect(const fs::path& destination) {
+    Contents contents;
+    const fs::path inside = fs::canonical(destination);
+    std::error_code error;
+    for (fs::recursive_directory_iterator it(destination, error), end; !error && it != end;
+         it.increment(error)) {
+        ++contents.objects;
+        struct stat info {};
+        if (::lstat(it->path().c_str(), &info) != 0) {
+            continue;
+        }
+        if (S_ISREG(info.st_mode)) {
+            contents.bytes += static_cast<std::uintmax_t>(info.st_size);
+        } else if (S_ISLNK(info.st_mode)) {
+            std::error_code unresolved;
+            fs::path target = fs::canonical(it->path(), unresolved);
+            if (!unresolved) {
+                auto [end, at] =
+                    std::mismatch(inside.begin(), inside.end(), target.begin(), target.end());
+                if (end != inside.end()) {
+                    std::abort();
+                }
+            }
+        }
+    }
+    return contents;
+}
+
 }  // namespace
 
 // libarchive 3.6's cpio reader reserves a buffer as large as a header's declared name length (up
@@ -105,18 +144,26 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     // Two levels down, so that entries climbing out with ".." are seen in the levels above.
     const fs::path levels = work / "level";
     const fs::path destination = levels / "destination";
+    // Something outside for links to find: one that resolves to it is caught below.
+    const fs::path bait = work / "bait";
+    static const bool baited = std::ofstream(bait).good();
+    (void)baited;
     {
         std::ofstream out(archivePath, std::ofstream::binary | std::ofstream::trunc);
         out.write(reinterpret_cast<const char*>(data), static_cast<std::streamsize>(size));
     }
     tavrix::payload::extractArchive(archivePath, destination,
-                                    tavrix::payload::ExtractionSafety::PathSafe);
+                                    tavrix::payload::ExtractionSafety::PathSafe, kLimits);
     makeRemovable(destination);
+    Contents contents = inspect(destination);
+    if (contents.bytes > kLimits.maxExpandedBytes || contents.objects > kLimits.maxEntries) {
+        std::abort();
+    }
     std::error_code error;
     fs::remove_all(destination, error);
     // Anything left besides the payload and the emptied level means an entry escaped.
     for (const auto& entry : fs::recursive_directory_iterator(work)) {
-        if (entry.path() != archivePath && entry.path() != levels) {
+        if (entry.path() != archivePath && entry.path() != levels && entry.path() != bait) {
             std::abort();
         }
     }

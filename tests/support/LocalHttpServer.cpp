@@ -8,6 +8,7 @@
 #include <sys/time.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cctype>
 #include <cerrno>
 #include <fstream>
@@ -251,7 +252,10 @@ void LocalHttpServer::handleConnection(int rawFd) {
         held = body.substr(*response.holdAfterBodyBytes);
         body = body.substr(0, *response.holdAfterBodyBytes);
     }
-    if (sendAll(fd.get(), responseHead(response)) && sendAll(fd.get(), body) && !held.empty()) {
+    if (response.trickleBytesPerSecond) {
+        sendTrickling(fd.get(), responseHead(response), body, *response.trickleBytesPerSecond);
+    } else if (sendAll(fd.get(), responseHead(response)) && sendAll(fd.get(), body) &&
+               !held.empty()) {
         std::unique_lock lock(mutex_);
         ++heldResponses_;
         holdChanged_.notify_all();
@@ -261,6 +265,25 @@ void LocalHttpServer::handleConnection(int rawFd) {
         sendAll(fd.get(), held);
     }
     ::shutdown(fd.get(), SHUT_WR);
+}
+
+void LocalHttpServer::sendTrickling(int fd, const std::string& head, std::string_view body,
+                                    std::size_t bytesPerSecond) {
+    if (!sendAll(fd, head)) {
+        return;
+    }
+    while (!body.empty()) {
+        std::size_t count = std::min(std::max<std::size_t>(bytesPerSecond, 1), body.size());
+        if (!sendAll(fd, body.substr(0, count))) {
+            return;
+        }
+        body.remove_prefix(count);
+        // The server's end (which releases held responses) ends the trickle too.
+        std::unique_lock lock(mutex_);
+        if (holdChanged_.wait_for(lock, std::chrono::seconds(1), [&] { return released_; })) {
+            return;
+        }
+    }
 }
 
 LocalHttpServer::Response LocalHttpServer::responseFor(const Request& request) const {

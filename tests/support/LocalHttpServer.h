@@ -36,6 +36,9 @@ class LocalHttpServer {
         // When set, only this many body bytes are sent until releaseHeldResponses() (or the
         // server's end); then the rest follows. For work that must stay pending a while.
         std::optional<std::size_t> holdAfterBodyBytes;
+        // When set, the body goes out this many bytes a second, until it is sent or the server
+        // ends: a peer that is alive but too slow to wait for.
+        std::optional<std::size_t> trickleBytesPerSecond;
     };
 
     struct Request {
@@ -75,6 +78,8 @@ class LocalHttpServer {
     void acceptLoop();
     void handleConnection(int fd);
     Response responseFor(const Request& request) const;
+    void sendTrickling(int fd, const std::string& head, std::string_view body,
+                       std::size_t bytesPerSecond);
 
     UniqueFd listenFd_;
     // Written to on destruction, to wake the accept loop.

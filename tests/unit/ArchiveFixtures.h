@@ -21,7 +21,7 @@ enum class Container { Tar, Cpio };
 enum class Compression { Gzip, Compress, Bzip2 };
 
 struct ArchiveItem {
-    enum class Kind { File, Directory, Symlink, Hardlink };
+    enum class Kind { File, Directory, Symlink, Hardlink, Fifo };
     Kind kind = Kind::File;
     std::string path;
     std::string content;
@@ -44,6 +44,9 @@ inline ArchiveItem symlinkItem(std::string path, std::string target) {
 }
 inline ArchiveItem hardlinkItem(std::string path, std::string target) {
     return {ArchiveItem::Kind::Hardlink, std::move(path), {}, 0644, 1500000000, std::move(target)};
+}
+inline ArchiveItem fifoItem(std::string path) {
+    return {ArchiveItem::Kind::Fifo, std::move(path), {}, 0644, 1500000000, {}};
 }
 
 // Bytes that do not compress.
@@ -109,6 +112,9 @@ inline std::string buildArchive(Container container, Compression compression,
             case ArchiveItem::Kind::Hardlink:
                 archive_entry_set_filetype(entry.get(), AE_IFREG);
                 archive_entry_copy_hardlink(entry.get(), item.linkTarget.c_str());
+                break;
+            case ArchiveItem::Kind::Fifo:
+                archive_entry_set_filetype(entry.get(), AE_IFIFO);
                 break;
         }
         if (archive_write_header(handle, entry.get()) != ARCHIVE_OK) {

@@ -11,11 +11,11 @@
 #include <random>
 #include <thread>
 
+#include "ArchiveFixtures.h"
 #include "CatalogToolRunner.h"
 #include "LocalHttpServer.h"
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
-#include "payload/Archive.h"
 #include "platform/AssetCatalog.h"
 #include "platform/AssetCatalogSettings.h"
 #include "platform/CatalogCrypto.h"
@@ -121,13 +121,31 @@ class AssetCatalogTest : public testing::Test {
         return run.status;
     }
 
-    void writeSettings(const std::optional<std::string>& key) {
+    // extra: top-level settings such as limits.
+    void writeSettings(const std::optional<std::string>& key, plist::Dictionary extra = {}) {
         plist::Dictionary type{{kSettingsCatalogURLKey, plist::Value(catalogURL())}};
         if (key) {
             type.emplace(kSettingsPublicKeyKey, plist::Value(*key));
         }
-        writeSettingsValue(plist::Value(plist::Dictionary{
-            {kSettingsAssetTypesKey, plist::Value(plist::Dictionary{{kAssetType, type}})}}));
+        extra.insert_or_assign(kSettingsAssetTypesKey,
+                               plist::Value(plist::Dictionary{{kAssetType, type}}));
+        writeSettingsValue(plist::Value(std::move(extra)));
+    }
+
+    // Serves bytes as the catalog's only archive, listed unsigned with their size and digest.
+    void publishArchive(const std::string& bytes) {
+        Sha256Digest digest;
+        digest.update(bytes);
+        plist::Dictionary entry{
+            {"ArchiveURL", plist::Value("archive.tgz")},
+            {"ArchiveSize", plist::Value(static_cast<long long>(bytes.size()))},
+            {"ArchiveSHA256", plist::Value(digest.finishHex())},
+            {"Attributes", plist::Value(plist::Dictionary{{"Version", plist::Value("1.0")}})}};
+        server.serve("/catalog/archive.tgz", bodyResponse(bytes));
+        server.serve("/catalog/catalog.plist",
+                     bodyResponse(plist::serialize(plist::Value(plist::Dictionary{
+                         {"AssetType", plist::Value(kAssetType)},
+                         {"Assets", plist::Value(plist::Array{plist::Value(entry)})}}))));
     }
 
     void writeSettingsValue(const plist::Value& settings) {
@@ -198,8 +216,8 @@ TEST_F(AssetCatalogTest, QueryAnswersPublishedAssetsInOrderAndKeepsThemForLocalQ
     test::makeBundle(work / "one/Default.bundle", "1.0", {{"a.plist", "<plist/>"}});
     test::makeBundle(work / "two/Default.bundle", "2.0", {{"a.plist", "two"}});
     tool({"publish", work / "out", "--key", work / "secret.key", work / "one/Default.bundle",
-          "--product-type", "Handset9,1", "--product-type", "Tablet7,1", "--min-os", "7.0", "--max-os",
-          "9.3", work / "two/Default.bundle"});
+          "--product-type", "Handset9,1", "--product-type", "Tablet7,1", "--min-os", "7.0",
+          "--max-os", "9.3", work / "two/Default.bundle"});
     writeSettings(publicKey);
 
     std::optional<Assets> local = query(true);
@@ -258,6 +276,11 @@ TEST_F(AssetCatalogTest, WithoutUsableSettingsQueriesAnswerNoAssetsAndSayWhyOnce
                                        {kSettingsCatalogURLKey, plist::Value(3)}})}})}}));
          },
          "no CatalogURL"},
+        {"negative limit",
+         [this] {
+             writeSettings(std::nullopt, {{kSettingsMaxArchiveEntriesKey, plist::Value(-1)}});
+         },
+         "MaxArchiveEntries is not an integer"},
         // A key that cannot be read must not quietly turn verification off.
         {"short key",
          [this] { writeSettings(base64Encode(reinterpret_cast<const std::uint8_t*>("short"), 5)); },
@@ -463,46 +486,119 @@ TEST_F(AssetCatalogTest, FailedDownloadsReportFailureAndLeaveNothingBehind) {
     }
 }
 
-TEST_F(AssetCatalogTest, ArchiveEntriesCannotLeaveTheCache) {
-    writeText(work / "file.txt", "x");
-    fs::create_directories(out(""));
-    auto archive = payload::Archive::initWithArchiveType(payload::kArchiveTypeGzip, "hostile");
-    ASSERT_TRUE(archive);
-    // The absolute entry points into the test's own directory, so a fault cannot litter "/".
-    for (const std::string& name :
-         {std::string("../../../escape.txt"), std::string("../up.txt"),
-          std::string("a/../../up.txt"), work / "absolute.txt", std::string("kept.txt")}) {
-        ASSERT_TRUE(archive->addFile(work / "file.txt", name));
+// Archives from the network that could reach outside the cache, or that unpack to far more than
+// they weigh, are refused whole by the real binding: the download fails with one line saying why,
+// nothing is written outside, and no local URL is ever offered.
+TEST_F(AssetCatalogTest, HostileArchivesAreRefusedWholeAndNeverComplete) {
+    const std::string outside = work / "outside";
+    writeText(outside + "/secret", "secret");
+    std::vector<test::ArchiveItem> manyEntries;
+    for (int index = 0; index < 30; ++index) {
+        manyEntries.push_back(test::fileItem("f" + std::to_string(index), "x"));
     }
-    ASSERT_TRUE(archive->close());
-    ASSERT_TRUE(archive->writeToFile(out("hostile.tgz")));
-    std::string bytes = readText(out("hostile.tgz"));
-    Sha256Digest digest;
-    digest.update(bytes);
-    plist::Dictionary entry{{"ArchiveURL", plist::Value("hostile.tgz")},
-                            {"ArchiveSize", plist::Value(static_cast<long long>(bytes.size()))},
-                            {"ArchiveSHA256", plist::Value(digest.finishHex())}};
-    ASSERT_TRUE(plist::writeFile(
-        out("catalog.plist"), plist::Value(plist::Dictionary{
-                                  {"AssetType", plist::Value(kAssetType)},
-                                  {"Assets", plist::Value(plist::Array{plist::Value(entry)})}})));
-    writeSettings(std::nullopt);
-    std::shared_ptr<Asset> asset = onlyAsset();
-    ASSERT_TRUE(asset);
+    struct Case {
+        const char* name;
+        std::vector<test::ArchiveItem> items;
+        const char* reason;
+        plist::Dictionary settings;
+    };
+    const plist::Dictionary small{{kSettingsMaxExpandedBytesKey, plist::Value(1 << 20)},
+                                  {kSettingsMaxArchiveEntriesKey, plist::Value(20)}};
+    const std::vector<Case> cases{
+        {"absolute symlink",
+         {test::symlinkItem("escape", outside), test::fileItem("escape/planted", "p")},
+         "leads outside",
+         small},
+        {"climbing symlink",
+         {test::directoryItem("a/b"), test::symlinkItem("a/b/up", "../../../../outside")},
+         "leads outside",
+         small},
+        {"chain of symlinks",
+         {test::symlinkItem("self", "."), test::symlinkItem("up", "self/.."),
+          test::fileItem("up/planted", "p")},
+         "leads outside",
+         small},
+        {"hard link",
+         {test::fileItem("a", "a"), test::hardlinkItem("b", "a")},
+         "hard links",
+         small},
+        {"fifo", {test::fifoItem("pipe")}, "only regular files", small},
+        {"gzip bomb",
+         {test::fileItem("bomb", std::string(4u << 20, '\0'))},
+         "more than 1048576 bytes",
+         small},
+        {"too many entries", manyEntries, "more than 20 entries", small},
+        {"no room for the installer's copy",
+         {test::fileItem("a", "a")},
+         "bytes free",
+         {{kSettingsFreeSpaceReserveKey,
+           plist::Value(plist::Integer::fromUnsigned(UINT64_MAX / 2))}}},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
+        sink.clear();
+        writeSettings(std::nullopt, c.settings);
+        std::vector<test::ArchiveItem> items{test::fileItem("Info.plist", "<plist/>")};
+        items.insert(items.end(), c.items.begin(), c.items.end());
+        publishArchive(test::buildArchive(test::Container::Tar, test::Compression::Gzip, items));
+        std::shared_ptr<Asset> asset = onlyAsset();
+        ASSERT_TRUE(asset);
 
-    download(asset);
-
-    std::vector<std::string> escaped;
-    for (const fs::path& top : {test::unitTestRoot(), work.path()}) {
+        EXPECT_EQ(download(asset).back(), kAssetOperationFailed);
+        EXPECT_EQ(logLinesContaining(c.reason), 1u);
+        EXPECT_FALSE(asset->localURL().has_value());
+        EXPECT_TRUE(cachedAssetEntries().empty());
+        EXPECT_EQ(test::snapshotTree(outside), (test::Tree{{"secret", "secret"}}));
         std::error_code ignored;
-        for (const auto& found : fs::recursive_directory_iterator(top, ignored)) {
-            std::string name = found.path().filename().string();
-            if (name == "escape.txt" || name == "up.txt" || name == "absolute.txt") {
-                escaped.push_back(found.path().string());
-            }
+        for (const auto& found : fs::recursive_directory_iterator(work.path(), ignored)) {
+            EXPECT_NE(found.path().filename(), "planted") << found.path();
         }
     }
-    EXPECT_TRUE(escaped.empty()) << escaped.front();
+}
+
+// A server that answers but trickles cannot hold a download or a catalog fetch: both end within
+// the configured limits and are reported as failures.
+TEST_F(AssetCatalogTest, TricklingServersAreCutOff) {
+    const std::string archive =
+        test::buildArchive(test::Container::Tar, test::Compression::Gzip,
+                           {test::fileItem("a", incompressibleBytes(8192))});
+    writeSettings(std::nullopt, {{kSettingsLowSpeedSecondsKey, plist::Value(1)},
+                                 {kSettingsCatalogTimeoutKey, plist::Value(1)}});
+    publishArchive(archive);
+    LocalHttpServer::Response trickle = bodyResponse(archive);
+    trickle.trickleBytesPerSecond = 2;
+    server.serve("/catalog/archive.tgz", trickle);
+    std::shared_ptr<Asset> asset = onlyAsset();
+    ASSERT_TRUE(asset);
+    EXPECT_EQ(download(asset).back(), kAssetOperationFailed);
+    EXPECT_FALSE(asset->localURL().has_value());
+
+    LocalHttpServer::Response slowCatalog = bodyResponse(std::string(4096, ' '));
+    slowCatalog.trickleBytesPerSecond = 2000;
+    server.serve("/catalog/catalog.plist", slowCatalog);
+    EXPECT_FALSE(query().has_value());
+    EXPECT_EQ(logLinesContaining("cannot fetch it"), 1u);
+}
+
+// Two downloads of one asset never share files: purging one leaves the other's in place.
+TEST_F(AssetCatalogTest, OverlappingDownloadsOfOneAssetKeepTheirOwnDirectories) {
+    test::makeBundle(work / "b/Default.bundle", "1.0", {{"a.plist", "one"}});
+    tool({"publish", work / "out", "--key", work / "secret.key", work / "b/Default.bundle"});
+    writeSettings(publicKey);
+    std::shared_ptr<Asset> first = onlyAsset();
+    std::shared_ptr<Asset> second = onlyAsset();
+    ASSERT_TRUE(first && second);
+    ASSERT_EQ(download(first).back(), kAssetOperationCompleted);
+    ASSERT_EQ(download(second).back(), kAssetOperationCompleted);
+    ASSERT_TRUE(first->localURL() && second->localURL());
+    EXPECT_NE(*first->localURL(), *second->localURL());
+
+    std::promise<bool> purged;
+    first->purge([&](bool done) { purged.set_value(done); });
+    ASSERT_EQ(purged.get_future().wait_for(kPatience), std::future_status::ready);
+    EXPECT_FALSE(first->localURL().has_value());
+    ASSERT_TRUE(second->localURL().has_value());
+    EXPECT_EQ(readText(*second->localURL() + "/a.plist"), "one");
 }
 
 }  // namespace

@@ -164,33 +164,108 @@ TEST_F(PayloadExtraction, AsArchivedWritesEscapingEntriesWhereTheyPoint) {
     EXPECT_EQ(statOf(dir / "dest/linked.txt").st_ino, statOf(dir / "dest/inside.txt").st_ino);
 }
 
-// Network archives never reach outside their destination: not by "..", an absolute path, a
-// hard link to such a path, or a symbolic link the archive itself brings. The rest extracts.
-TEST_F(PayloadExtraction, PathSafeRefusesEntriesLeavingTheDestination) {
+// Network archives hold only files, directories and links that stay inside. The first entry that
+// could reach outside (or is no such thing) stops the extraction with one line: nothing after it
+// is written, and nothing outside changes.
+TEST_F(PayloadExtraction, PathSafeStopsAtTheFirstEntryThatCouldLeave) {
     const std::string outside = dir / "outside";
-    fs::create_directories(outside);
     writeText(outside + "/secret", "secret");
+    struct Case {
+        const char* name;
+        std::vector<ArchiveItem> hostile;
+    };
+    const std::vector<Case> cases{
+        {"dot-dot path", {test::fileItem("sub/../../up.txt", "up")}},
+        {"absolute path", {test::fileItem(outside + "/absolute.txt", "absolute")}},
+        {"hard link inside", {test::hardlinkItem("hard", "first.txt")}},
+        {"hard link outside", {test::hardlinkItem("hard", "../outside/secret")}},
+        {"absolute symlink",
+         {test::symlinkItem("escape", outside), test::fileItem("escape/x.txt", "x")}},
+        {"climbing symlink",
+         {test::directoryItem("a"), test::symlinkItem("a/escape", "../../outside")}},
+        {"chain of symlinks",
+         {test::symlinkItem("self", "."), test::symlinkItem("escape", "self/../outside")}},
+        {"fifo", {test::fifoItem("pipe")}},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
+        fs::remove_all(destination);
+        log.clear();
+        std::vector<ArchiveItem> items{test::fileItem("first.txt", "first")};
+        items.insert(items.end(), c.hostile.begin(), c.hostile.end());
+        items.push_back(test::fileItem("last.txt", "last"));
 
-    EXPECT_TRUE(extract(buildArchive(Container::Tar, Compression::Gzip,
-                                     {
-                                         test::fileItem("../beside.txt", "beside"),
-                                         test::fileItem("sub/../../up.txt", "up"),
-                                         test::fileItem(outside + "/absolute.txt", "absolute"),
-                                         test::hardlinkItem("hard", "../outside/secret"),
-                                         test::hardlinkItem("hard2", outside + "/secret"),
-                                         test::symlinkItem("escape", outside),
-                                         test::fileItem("escape/through.txt", "through"),
-                                         test::fileItem("inside.txt", "inside"),
-                                     }),
-                        ExtractionSafety::PathSafe));
+        EXPECT_FALSE(extract(buildArchive(Container::Tar, Compression::Gzip, items),
+                             ExtractionSafety::PathSafe));
+        EXPECT_EQ(snapshotTree(outside), (Tree{{"secret", "secret"}}));
+        EXPECT_EQ(snapshotTree(dir.path()).count("up.txt"), 0u);
+        EXPECT_EQ(readText(dir / "dest/first.txt"), "first");
+        EXPECT_FALSE(fs::exists(fs::symlink_status(dir / "dest/last.txt")));
+        EXPECT_EQ(log.messages().size(), 1u);
+        EXPECT_TRUE(log.messages().front().starts_with("Refusing the archive entry"));
+    }
+    // Links that stay inside, however they are spelled, are taken as they are.
+    fs::remove_all(destination);
+    EXPECT_TRUE(extract(
+        buildArchive(Container::Cpio, Compression::Gzip,
+                     {test::fileItem("data.txt", "data"), test::directoryItem("a/b"),
+                      test::symlinkItem("a/b/up", "../../data.txt"),
+                      test::symlinkItem("a/here", "./b/."), test::symlinkItem("top", "a/here/up")}),
+        ExtractionSafety::PathSafe));
+    EXPECT_EQ(readText(dir / "dest/top"), "data");
+}
 
-    EXPECT_EQ(snapshotTree(outside), (Tree{{"secret", "secret"}}));
-    EXPECT_FALSE(fs::exists(dir / "beside.txt"));
-    EXPECT_FALSE(fs::exists(dir / "up.txt"));
-    EXPECT_EQ(snapshotTree(destination),
-              (Tree{{"escape", "-> " + outside}, {"inside.txt", "inside"}}));
-    EXPECT_TRUE(log.contains("Refusing the archive entry ../beside.txt: it leads outside " +
-                             fs::canonical(destination).string() + "\n"));
+// Every limit stops a payload where it is reached, whichever way its entries are trusted: what
+// is written stays within the cap, the rest is never written, and one line says why.
+TEST_F(PayloadExtraction, LimitsCutBombsShortWithOneLine) {
+    const std::string zeros(3u << 20, '\0');  // compresses to a few kilobytes
+    std::vector<ArchiveItem> manyFiles;
+    for (int index = 0; index < 40; ++index) {
+        manyFiles.push_back(test::fileItem("f" + std::to_string(index), std::string(100, 'x')));
+    }
+    struct Case {
+        const char* name;
+        std::vector<ArchiveItem> items;
+        ExtractionLimits limits;
+        const char* reason;
+    };
+    const std::vector<Case> cases{
+        {"one large entry",
+         {test::fileItem("small", "s"), test::fileItem("bomb", zeros)},
+         {1u << 20, 100, 0, false},
+         "expands to more than 1048576 bytes"},
+        {"many entries", manyFiles, {1u << 20, 10, 0, false}, "holds more than 10 entries"},
+        {"many small files adding up", manyFiles, {2000, 100, 0, false}, "more than 2000 bytes"},
+        {"directories a deep path implies",
+         {test::fileItem("a/b/c/d/e/f/g/h/i/j", "x")},
+         {1u << 20, 5, 0, false},
+         "more than 5 entries"},
+        {"no free space left",
+         {test::fileItem("small", "s")},
+         {1u << 20, 100, UINT64_MAX / 2, false},
+         "bytes free"},
+    };
+    for (ExtractionSafety safety : {ExtractionSafety::AsArchived, ExtractionSafety::PathSafe}) {
+        for (const Case& c : cases) {
+            SCOPED_TRACE(c.name);
+            fs::remove_all(destination);
+            log.clear();
+            writeText(dir / "payload", buildArchive(Container::Tar, Compression::Gzip, c.items));
+            EXPECT_FALSE(extractArchive(dir / "payload", destination, safety, c.limits));
+            std::uintmax_t written = 0;
+            std::size_t entries = 0;
+            for (const auto& entry : fs::recursive_directory_iterator(destination)) {
+                written += entry.is_regular_file() ? entry.file_size() : 0;
+                ++entries;
+            }
+            EXPECT_LE(written, c.limits.maxExpandedBytes);
+            EXPECT_LE(entries, c.limits.maxEntries);
+            ASSERT_EQ(log.messages().size(), 1u);
+            EXPECT_NE(log.messages().front().find("stopped: "), std::string::npos);
+            EXPECT_NE(log.messages().front().find(c.reason), std::string::npos)
+                << log.messages().front();
+        }
+    }
 }
 
 // A destination reached through a symbolic link of the caller's is fine in PathSafe mode.

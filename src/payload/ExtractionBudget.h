@@ -1,0 +1,42 @@
+// Keeps one extraction within its ExtractionLimits: counts entries and the bytes they expand to,
+// and watches the destination's free space as they are written.
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <string_view>
+#include <unordered_set>
+
+#include "payload/PayloadUnpack.h"
+
+namespace tavrix::payload {
+
+class ExtractionBudget {
+  public:
+    ExtractionBudget(const ExtractionLimits& limits, std::string destination);
+
+    // Before an entry is written: counts it, with the parent directories its path implies that no
+    // entry before it implied, and makes room for the size it declares. Each answer is nothing
+    // when it fits, else why the extraction must stop.
+    std::optional<std::string> admitEntry(std::string_view path, std::uint64_t declaredSize);
+    // After a block: the current entry now reaches extent bytes (its end, holes included).
+    std::optional<std::string> noteExtent(std::uint64_t extent);
+    // When the extraction is over: the room for its copy, when asked for, is still there.
+    std::optional<std::string> checkFinalRoom();
+
+  private:
+    std::optional<std::string> checkFreeSpace(std::uint64_t stillToWrite);
+
+    const ExtractionLimits limits_;
+    const std::string destination_;
+    std::uint64_t entries_ = 0;
+    // Hashes of the parent directories implied so far; a collision only undercounts by one.
+    std::unordered_set<std::size_t> impliedDirectories_;
+    // Bytes of the entries before the current one, and the current one's extent.
+    std::uint64_t finishedBytes_ = 0;
+    std::uint64_t entryExtent_ = 0;
+    std::uint64_t uncheckedBytes_ = 0;
+};
+
+}  // namespace tavrix::payload
