@@ -6,11 +6,11 @@
 
 #include "bundle/BundleLinks.h"
 #include "bundle/BundleLocations.h"
-#include "util/FileURL.h"
 #include "payload/FileSystemHelper.h"
 #include "payload/MobileUser.h"
 #include "platform/AtomicFile.h"
 #include "plist/PropertyListFormat.h"
+#include "util/FileURL.h"
 #include "util/Log.h"
 
 namespace tavrix {
@@ -46,6 +46,10 @@ std::string overlayDirectory() {
 }
 
 }  // namespace
+
+std::string overriddenFilesDirectory() {
+    return payload::MobileUser::homeDirectory() != nullptr ? overlayDirectory() : std::string();
+}
 
 std::optional<std::string> overriddenFilePath(OverlayContext& context) {
     context.overriddenFilePrefix.clear();
