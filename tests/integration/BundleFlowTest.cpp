@@ -1,7 +1,6 @@
 // The daemon's main job as clients see it: a behavior ID set with a packed bundle ends with the
 // right carrier file linked into the mobile home and one notification, and nothing changes when
 // nothing changed.
-#include <signal.h>
 #include <sys/stat.h>
 
 #include <cstdlib>
@@ -287,31 +286,6 @@ TEST_F(BundleFlowTest, DirectoryInPlaceOfTheBundleLinkIsReportedAndLeftAlone) {
     ASSERT_TRUE(caller.setTavrixID("abc", std::nullopt));
     EXPECT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
     EXPECT_EQ(linkTarget(kBundleLink), at(kUserBundle).string());
-}
-
-// Every launch re-applies the stored ID: links lost while the daemon was away come back, and a
-// launch with the links in place changes nothing.
-TEST_F(BundleFlowTest, RestartRedoesTheBundleMatchFromTheStoredID) {
-    auto caller = client();
-    ASSERT_TRUE(caller.setTavrixID("abc", packBundle("10", "tgz")));
-    const std::string carrierFile = linkTarget(kPreferencesLink);
-    ASSERT_FALSE(carrierFile.empty());
-
-    for (bool removeLinks : {true, false}) {
-        auto pid = daemonPid();
-        ASSERT_TRUE(pid);
-        ASSERT_EQ(::kill(*pid, SIGTERM), 0);
-        ASSERT_EQ(waitForDaemonExit(*pid), std::optional<int>(0));
-        if (removeLinks) {
-            fs::remove(at(kBundleLink));
-            fs::remove(at(kPreferencesLink));
-        }
-        EXPECT_FALSE(caller.isTavrixBundleSupported());
-        EXPECT_EQ(linkTarget(kPreferencesLink), carrierFile);
-    }
-    EXPECT_EQ(countLogLines("Behavior ID abc is already sent, redoing bundle match"), 2);
-    EXPECT_EQ(countLogLines(matchResult("kBundleChangeTypeUpdate")), 2);
-    EXPECT_EQ(countLogLines(matchResult("kBundleChangeTypeNoChange")), 1);
 }
 
 // Iterations of the crash loops: TAVRIX_CRASH_LOOP_ITERATIONS when set (scripts/crash-loop.sh),

@@ -422,20 +422,5 @@ TEST_F(BundleReset, LinksOnceAndTellsEveryoneOnce) {
     EXPECT_THAT(posted, ElementsAre("kTVXBehaviorBundleChangedNotification", "marker"));
 }
 
-TEST_F(BundleReset, AFailedLinkAnswersNoChangeAndStopsThere) {
-    writeDeviceTable();
-    writeBundle(userBundle(), Value("10"));
-    test::writeText(bundleLink() + "/keep.txt", "kept");
-
-    BundleManager& manager = BundleManager::sharedInstance();
-    sink_.clear();
-    EXPECT_EQ(manager.resetBehaviorBundle("ab12"), kBundleChangeTypeNoChange);
-    EXPECT_THAT(lines(), ::testing::Contains("Bundle Compare decision kBundleChangeTypeUpdate\n"));
-    EXPECT_EQ(lines().back(), "Could not link bundle file!\n");
-    // The matched record is kept even so, and the next attempt compares against it.
-    EXPECT_EQ(manager.currentBundle().bundlePath, userBundle());
-    EXPECT_EQ(test::readText(bundleLink() + "/keep.txt"), "kept");
-}
-
 }  // namespace
 }  // namespace tavrix
