@@ -1,6 +1,8 @@
 #include "bundle/BundleLinks.h"
 
+#include <fcntl.h>
 #include <libgen.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -11,6 +13,7 @@
 
 #include "bundle/BundleInfo.h"
 #include "util/Log.h"
+#include "util/UniqueFd.h"
 
 namespace tavrix {
 namespace {
@@ -29,13 +32,38 @@ void copyCut(const std::string& path, char (&buffer)[kPathBufferSize]) {
     buffer[length] = '\0';
 }
 
+// Flushes the directory entry of a new link, so that after a power cut the links come back in the
+// order they were written.
+void flushDirectoryOf(const std::string& path) {
+    UniqueFd directory(::open(dirNameOfPath(path).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (directory) {
+        ::fsync(directory.get());
+    }
+}
+
+// The new link is made under a temporary name beside linkPath and renamed over whatever is there,
+// so that a reader (or a crash) finds the old link or the new one, never none. An empty directory
+// in the way goes, as a plain remove would take it; one that holds something stays and fails.
 bool linkPathTo(const std::string& linkPath, const std::string& target) {
-    // Whatever is there goes first; a non-empty directory stays and makes symlink fail.
-    std::remove(linkPath.c_str());
-    if (::symlink(target.c_str(), linkPath.c_str()) == -1) {
+    bool linked = false;
+    if (!linkPath.empty()) {
+        const std::string temporary =
+            dirNameOfPath(linkPath) + "/" + kLinkTemporaryPrefix + baseNameOfPath(linkPath);
+        ::unlink(temporary.c_str());
+        if (::symlink(target.c_str(), temporary.c_str()) == 0) {
+            linked = ::rename(temporary.c_str(), linkPath.c_str()) == 0 ||
+                     (::rmdir(linkPath.c_str()) == 0 &&
+                      ::rename(temporary.c_str(), linkPath.c_str()) == 0);
+            if (!linked) {
+                ::unlink(temporary.c_str());
+            }
+        }
+    }
+    if (!linked) {
         logCFormat("Failed to establish link from %s to %s\n", linkPath.c_str(), target.c_str());
         return false;
     }
+    flushDirectoryOf(linkPath);
     return true;
 }
 
@@ -74,6 +102,22 @@ bool establishBundleLinks(CarrierBundle& bundle, const std::string& bundleLink,
     bool linked = linkBundle(bundle);
     logCFormat("Dump state of the bundle being linked\n");
     return linked;
+}
+
+bool linksAgree(const CarrierBundle& linked, const std::string& overlayDirectory) {
+    struct stat info {};
+    const std::string bundle = realPathOf(linked.bundleLinkPath);
+    if (bundle.empty() || ::stat(bundle.c_str(), &info) != 0 || !S_ISDIR(info.st_mode)) {
+        return false;
+    }
+    const std::string carrierFile = realPathOf(linked.preferencesLinkPath);
+    if (carrierFile.empty() || ::stat(carrierFile.c_str(), &info) != 0 || !S_ISREG(info.st_mode)) {
+        return false;
+    }
+    auto inside = [&carrierFile](const std::string& directory) {
+        return !directory.empty() && carrierFile.starts_with(directory + "/");
+    };
+    return inside(bundle) || (!overlayDirectory.empty() && inside(realPathOf(overlayDirectory)));
 }
 
 std::string baseNameOfPath(const std::string& path) {

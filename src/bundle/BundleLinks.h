@@ -14,6 +14,15 @@ namespace tavrix {
 bool establishBundleLinks(CarrierBundle& bundle, const std::string& bundleLink,
                           const std::string& preferencesLink);
 
+// Whether the two links read at start-up describe one linked state: both resolve, and the
+// carrier file lies inside the linked bundle or inside overlayDirectory (the generated files). A
+// crash between the two link changes leaves a pair that does not.
+bool linksAgree(const CarrierBundle& linked, const std::string& overlayDirectory);
+
+// What the temporary name of a link being replaced starts with, so that start-up can find one
+// left by an interrupted change.
+inline constexpr const char* kLinkTemporaryPrefix = ".tavrix-link-";
+
 // POSIX basename / dirname of the path (cut at 1023 bytes); "." for an empty path.
 std::string baseNameOfPath(const std::string& path);
 std::string dirNameOfPath(const std::string& path);

@@ -8,7 +8,9 @@
 #include "bundle/BundleInfo.h"
 #include "bundle/BundleLinks.h"
 #include "bundle/BundleLocations.h"
+#include "bundle/InterruptedChanges.h"
 #include "bundle/OverlayContext.h"
+#include "bundle/OverriddenCarrierFile.h"
 #include "bundle/OverrideGeneration.h"
 #include "bundle/VersionCompare.h"
 #include "payload/MobileUser.h"
@@ -36,6 +38,12 @@ std::string homeLinkPath(const char* home, const char* format) {
     return buffer;
 }
 
+bool hasBaseCarrierFile(const std::string& bundle) {
+    struct stat info {};
+    return ::stat((bundle + "/" + kBaseCarrierFileName).c_str(), &info) == 0 &&
+           S_ISREG(info.st_mode);
+}
+
 // The path a chosen bundle location converts to; nothing when it does not fit a path buffer.
 std::optional<std::string> fileSystemPathOf(const std::string& location) {
     if (location.size() >= kPathBufferSize) {
@@ -51,6 +59,8 @@ BundleManager::BundleManager() {
     bundleLinkPath_ = homeLinkPath(home, kBundleLinkFormat);
     preferencesLinkPath_ = homeLinkPath(home, kPreferencesLinkFormat);
 
+    removeLeftoversOfInterruptedChanges(bundleLinkPath_, preferencesLinkPath_);
+
     // The link itself, not its target: a dangling link still describes the last linked state.
     struct stat linkInfo {};
     if (bundleLinkPath_.empty() || ::lstat(bundleLinkPath_.c_str(), &linkInfo) != 0) {
@@ -63,6 +73,15 @@ BundleManager::BundleManager() {
     logCFormat("Is carrier bundle's plist file overridden: %s\n",
                overlayTypeName(currentBundle_.overlayType));
     logCFormat("Carrier bundle state on BundleManager initialization\n");
+    if (!linksAgree(currentBundle_, overriddenFilesDirectory())) {
+        // A crash between the two link changes (or a link lost since) leaves a pair that the
+        // comparison, which looks at file names only, could take for the intended one.
+        logCFormat(
+            "The bundle link (%s) and the carrier file link (%s) disagree, linking again "
+            "at the next reset\n",
+            currentBundle_.bundlePath.c_str(), currentBundle_.carrierFilePath.c_str());
+        linksDisagree_ = true;
+    }
 }
 
 BundleManager& BundleManager::sharedInstance() {
@@ -91,7 +110,14 @@ bool BundleManager::findBundle(CarrierBundle& out) const {
         }
     } else {
         std::optional<plist::Value> userVersion = copyBundleVersionAtURL(userLocation);
-        if (systemVersion && userVersion) {
+        const bool systemHasBase = systemVersion && hasBaseCarrierFile(systemLocation);
+        const bool userHasBase = userVersion && hasBaseCarrierFile(userLocation);
+        if (systemVersion && userVersion && systemHasBase != userHasBase) {
+            // A bundle without its base carrier file could only be linked to a missing file.
+            chosen = systemHasBase ? &systemLocation : &userLocation;
+            logCFormat("Bundle %s has no base carrier file, not choosing it\n",
+                       (systemHasBase ? userLocation : systemLocation).c_str());
+        } else if (systemVersion && userVersion) {
             // The user bundle wins unless the system one is strictly newer.
             bool systemNewer = compareVersionStrings(bundleInfoValueText(systemVersion),
                                                      bundleInfoValueText(userVersion)) == 1;
@@ -116,7 +142,14 @@ bool BundleManager::findBundle(CarrierBundle& out) const {
     return true;
 }
 
+CarrierBundle BundleManager::currentBundle() const {
+    std::lock_guard lock(operationLock_);
+    return currentBundle_;
+}
+
 std::optional<std::string> BundleManager::copyBundleVersion() const {
+    // The update check asks from its own thread while a reset may be replacing the record.
+    std::lock_guard lock(operationLock_);
     if (currentBundle_.bundleVersion.empty()) {
         return std::nullopt;
     }
@@ -124,11 +157,13 @@ std::optional<std::string> BundleManager::copyBundleVersion() const {
 }
 
 BundleChangeType BundleManager::resetBehaviorBundle(const std::optional<std::string>& behaviorID) {
+    std::lock_guard lock(operationLock_);
     behaviorID_ = behaviorID;
     return runBundleReset();
 }
 
 BundleChangeType BundleManager::runBundleReset() {
+    std::lock_guard lock(operationLock_);
     BundleChangeType result = kBundleChangeTypeNoChange;
     if (!behaviorID_) {
         logCFormat("There is no tavrix ID provided\n");
@@ -151,17 +186,26 @@ BundleChangeType BundleManager::runBundleReset() {
     logCFormat("Device overlay decision: %s\n", overrideResultName(behaviorResult));
     logCFormat("Dump state for the bundle after multimode overlay\n");
 
-    result = compareBundles(currentBundle_, matched);
+    if (linksDisagree_) {
+        logCFormat("Original Bundle Links Do Not Exist. Treat as Carrier Change\n");
+        result = kBundleChangeTypeUpdate;
+    } else {
+        result = compareBundles(currentBundle_, matched);
+    }
     if (result != kBundleChangeTypeNoChange) {
         logCFormat("Bundle Compare decision %s\n", changeTypeName(result));
         currentBundle_ = matched;
+        linksDisagree_ = false;
         if (!establishBundleLinks(currentBundle_, bundleLinkPath_, preferencesLinkPath_)) {
+            // The links on disk may now be half replaced: whatever the record says, link again.
+            linksDisagree_ = true;
             logCFormat("Could not link bundle file!\n");
             return kBundleChangeTypeNoChange;
         }
         platform::PreferencesStore::shared().synchronize(kBehaviorPreferencesDomain,
                                                          payload::MobileUser::name());
         platform::postNotification(kBundleChangedNotification);
+        pruneOverriddenFilesOfRemovedBundles(currentBundle_.carrierFilePath);
     }
     logCFormat("Carrier Bundle Match Result: %s\n", changeTypeName(result));
     return result;

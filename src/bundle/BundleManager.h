@@ -35,7 +35,7 @@ class BundleManager {
     // Resets out to the newer of the system and the user bundle (the user one on equal versions).
     // False when neither has a version.
     bool findBundle(CarrierBundle& out) const;
-    // The linked bundle's version, or nothing when unknown.
+    // The linked bundle's version, or nothing when unknown. Safe from any thread.
     std::optional<std::string> copyBundleVersion() const;
     // What going from current to matched changes.
     BundleChangeType compareBundles(const CarrierBundle& current,
@@ -44,10 +44,10 @@ class BundleManager {
     // Held by each caller across a change of the bundles (a client's payload and bundle match, an
     // over-the-air install and its match), which may come from the main thread and the update
     // download's thread at once.
-    std::recursive_mutex& operationLock() { return operationLock_; }
+    std::recursive_mutex& operationLock() const { return operationLock_; }
 
-    // The bundle and carrier file linked now.
-    const CarrierBundle& currentBundle() const { return currentBundle_; }
+    // The bundle and carrier file linked now: a copy taken under operationLock().
+    CarrierBundle currentBundle() const;
     const std::string& bundleLinkPath() const { return bundleLinkPath_; }
     const std::string& preferencesLinkPath() const { return preferencesLinkPath_; }
 
@@ -58,7 +58,11 @@ class BundleManager {
     std::string bundleLinkPath_;
     std::string preferencesLinkPath_;
     CarrierBundle currentBundle_;
-    std::recursive_mutex operationLock_;
+    // The links found at start-up do not describe one state: the next reset links again whatever
+    // the comparison says.
+    bool linksDisagree_ = false;
+    // Also guards currentBundle_, which other threads read.
+    mutable std::recursive_mutex operationLock_;
 };
 
 }  // namespace tavrix

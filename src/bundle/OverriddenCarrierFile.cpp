@@ -70,6 +70,10 @@ std::string overlayDirectory() {
 
 }  // namespace
 
+std::string overriddenFilesDirectory() {
+    return payload::MobileUser::homeDirectory() != nullptr ? overlayDirectory() : std::string();
+}
+
 std::optional<std::string> overriddenFilePath(OverlayContext& context) {
     context.overriddenFilePrefix.clear();
     std::string bundleName = context.bundle.bundleName();

@@ -14,6 +14,9 @@ namespace tavrix {
 
 inline constexpr const char* kOverlayDirectoryName = "Overlay/";
 
+// The directory the overridden carrier files are written to, ending in '/'; empty without a home.
+std::string overriddenFilesDirectory();
+
 // Computes the file-name prefix (logged, kept in context.overriddenFilePrefix) and answers the
 // overridden file's path. Nothing when no file can be named: no bundle name, no home directory,
 // or fields that would make the name leave the Overlay directory (a '/' in the key or version).

@@ -22,6 +22,9 @@ constexpr const char* kBehaviorSettingsDomain = "com.zandor.tavrix";
 TXManager& TXManager::sharedInstance() {
     static TXManager* manager = [] {
         auto* created = new TXManager();
+        // An install cut short by a crash first, so that the match below sees the bundle it was
+        // installing.
+        AssetHandler::resumeInterruptedInstall();
         // Re-applies a behavior set before this launch of the daemon.
         auto stored = copyBehaviorPreference(kTavrixIDKey);
         if (stored && stored->isString()) {

@@ -6,6 +6,7 @@
 #include <sys/statvfs.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cmath>
 #include <cstdio>
@@ -14,6 +15,7 @@
 #include <memory>
 #include <system_error>
 
+#include "platform/AtomicFile.h"
 #include "plist/PropertyListFormat.h"
 #include "util/UniqueFd.h"
 
@@ -45,45 +47,40 @@ std::string parentOf(std::string_view path) {
     return std::string(parent.empty() ? "/" : parent);
 }
 
+// The copy appears under its final name complete, with the source's mode, or not at all: a full
+// disk or a crash part way must never leave a truncated file that looks installed.
 int copyFileContents(const std::string& source, const std::string& destination, mode_t mode) {
     UniqueFd in(::open(source.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW));
     if (!in) {
         return lastError();
     }
-    UniqueFd out(::open(destination.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
-    if (!out) {
-        return lastError();
-    }
-    std::unique_ptr<char[]> buffer(new char[1 << 16]);
-    for (;;) {
-        ssize_t got = ::read(in.get(), buffer.get(), 1 << 16);
-        if (got < 0 && errno == EINTR) {
-            continue;
-        }
-        if (got < 0) {
-            return lastError();
-        }
-        if (got == 0) {
-            break;
-        }
-        for (ssize_t written = 0; written < got;) {
-            errno = 0;
-            ssize_t put =
-                ::write(out.get(), buffer.get() + written, static_cast<std::size_t>(got - written));
-            if (put < 0 && errno == EINTR) {
+    return platform::createFileAtomicallyWith(destination, mode & 07777, [&in](int out) {
+        std::unique_ptr<char[]> buffer(new char[1 << 16]);
+        for (;;) {
+            ssize_t got = ::read(in.get(), buffer.get(), 1 << 16);
+            if (got < 0 && errno == EINTR) {
                 continue;
             }
-            if (put <= 0) {
+            if (got < 0) {
                 return lastError();
             }
-            written += put;
+            if (got == 0) {
+                return 0;
+            }
+            for (ssize_t written = 0; written < got;) {
+                errno = 0;
+                ssize_t put =
+                    ::write(out, buffer.get() + written, static_cast<std::size_t>(got - written));
+                if (put < 0 && errno == EINTR) {
+                    continue;
+                }
+                if (put <= 0) {
+                    return lastError();
+                }
+                written += put;
+            }
         }
-    }
-    if (::fchmod(out.get(), mode & 07777) != 0) {
-        return lastError();
-    }
-    // A delayed write error shows only when the file is closed.
-    return ::close(out.release()) == 0 ? 0 : lastError();
+    });
 }
 
 int copySymbolicLink(const std::string& source, const std::string& destination, off_t size) {
@@ -313,6 +310,13 @@ int removeItemTree(const std::string& path) {
     }
     std::error_code error;
     std::filesystem::remove_all(path, error);
+    if (error == std::errc::permission_denied || error == std::errc::operation_not_permitted) {
+        // A directory extracted without write permission must not keep its entries (and leave
+        // the next tree mixed into them): open every directory up, then try again.
+        makeDirectoriesWritable(path);
+        error.clear();
+        std::filesystem::remove_all(path, error);
+    }
     return error.value();
 }
 
@@ -326,6 +330,45 @@ std::optional<std::uint64_t> availableBytesAt(const std::string& path) {
     std::uint64_t bytes = 0;
     if (__builtin_mul_overflow(unit, static_cast<std::uint64_t>(info.f_bavail), &bytes)) {
         return UINT64_MAX;
+    }
+    return bytes;
+}
+
+void makeDirectoriesWritable(const std::string& path) {
+    struct stat info {};
+    if (::lstat(path.c_str(), &info) != 0 || !S_ISDIR(info.st_mode)) {
+        return;
+    }
+    // Before listing: a directory without read or search permission cannot be listed.
+    if ((info.st_mode & S_IRWXU) != S_IRWXU) {
+        ::chmod(path.c_str(), (info.st_mode & 07777) | S_IRWXU);
+    }
+    std::vector<std::string> names;
+    if (readDirectoryNames(path, names) != 0) {
+        return;
+    }
+    for (const std::string& name : names) {
+        makeDirectoriesWritable(joinPath(path, name));
+    }
+}
+
+std::uint64_t diskBytesOfTree(const std::string& path) {
+    constexpr std::uint64_t kBlock = 4096;
+    struct stat info {};
+    if (::lstat(path.c_str(), &info) != 0) {
+        return 0;
+    }
+    // Whole blocks, as a file system allocates them; a directory or link takes at least one.
+    std::uint64_t bytes = std::max<std::uint64_t>(
+                              (static_cast<std::uint64_t>(info.st_size) + kBlock - 1) / kBlock, 1) *
+                          kBlock;
+    if (S_ISDIR(info.st_mode)) {
+        std::vector<std::string> names;
+        if (readDirectoryNames(path, names) == 0) {
+            for (const std::string& name : names) {
+                bytes += diskBytesOfTree(joinPath(path, name));
+            }
+        }
     }
     return bytes;
 }

@@ -38,9 +38,16 @@ int readDirectoryNames(const std::string& path, std::vector<std::string>& names)
 // parents (always with the umask default) and accepts an existing directory. 0 or errno.
 int createDirectoryAt(const std::string& path, std::optional<mode_t> mode, bool withIntermediates);
 
-// Removes a file, a symbolic link (not its target) or a whole tree. 0 or errno (ENOENT when
-// nothing is there).
+// Removes a file, a symbolic link (not its target) or a whole tree, opening up directories that
+// lack write permission when that is what stops it. 0 or errno (ENOENT when nothing is there).
 int removeItemTree(const std::string& path);
+
+// Gives every directory in the tree at path (links not followed) read, write and search
+// permission for its owner. Best effort.
+void makeDirectoriesWritable(const std::string& path);
+
+// What copying the tree at path takes on disk, rounded up to whole 4 KiB blocks per entry.
+std::uint64_t diskBytesOfTree(const std::string& path);
 
 // Copies source to destination, which must not exist (EEXIST otherwise): regular files with their
 // content and mode, directories with everything in them, symbolic links as links. A failure part

@@ -1,5 +1,7 @@
 #include "payload/PayloadUnpack.h"
 
+#include <cerrno>
+#include <cstdio>
 #include <cstring>
 
 #include "bundle/BundleLocations.h"
@@ -16,6 +18,12 @@ namespace payload {
 constexpr mode_t kStagedFileMode = 0600;
 // A device root made for tests or the demo may lack /tmp; it gets the usual one.
 constexpr mode_t kTemporaryDirectoryMode = 01777;
+
+std::string extractionStagingPathFor(const std::string& bundleDirectory) {
+    std::size_t slash = bundleDirectory.rfind('/');
+    return bundleDirectory.substr(0, slash + 1) + "." + bundleDirectory.substr(slash + 1) +
+           ".incoming";
+}
 
 bool writeDataToFile(const plist::Data& data, const std::string& path) {
     if (platform::replaceFileAtomically(path, data, kStagedFileMode) == 0) {
@@ -48,12 +56,28 @@ void BundleManager::installBehaviorBundleData(const plist::Data& data) {
     }
     payload::writeDataToFile(data, stagedPath);
     // The old bundle goes even when the new one fails to extract: the bundle manager then finds
-    // whatever was extracted, never a mix of two payloads.
-    helper.removeItem(bundleDirectory);
+    // whatever was extracted, never a mix of two payloads. A bundle that cannot be removed whole
+    // (and would mix with the new one) stays as it is.
+    int removed = helper.removeItem(bundleDirectory);
+    if (removed != 0 && removed != ENOENT) {
+        logCFormat("Could not remove the bundle %s (error %d), keeping it\n",
+                   bundleDirectory.c_str(), removed);
+        helper.removeItem(stagedPath);
+        return;
+    }
+    // Extracted beside the bundle directory and renamed into place: a crash part way leaves no
+    // bundle directory with some of its files (start-up removes the staging directory).
+    const std::string staging = payload::extractionStagingPathFor(bundleDirectory);
+    helper.removeItem(staging);
     // Bounded, so that a payload that unpacks to far more than it weighs stops before the disk
     // fills; what was extracted until then stays, like any other incomplete payload.
-    payload::extractArchive(stagedPath, bundleDirectory, payload::ExtractionSafety::AsArchived,
+    payload::extractArchive(stagedPath, staging, payload::ExtractionSafety::AsArchived,
                             payload::kClientPayloadLimits);
+    if (::rename(staging.c_str(), bundleDirectory.c_str()) != 0) {
+        logCFormat("Could not move the extracted bundle into %s (error %d)\n",
+                   bundleDirectory.c_str(), errno);
+        helper.removeItem(staging);
+    }
     helper.removeItem(stagedPath);
 }
 

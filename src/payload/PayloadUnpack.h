@@ -12,6 +12,10 @@ namespace tavrix::payload {
 // Where a payload is staged before extraction (under the platform root); one payload at a time.
 inline constexpr const char* kBundleArchiveTempPath = "/tmp/behaviorbundle_zipped.tgz";
 
+// Where a new bundle (an extracted payload, a copied download) is assembled before it takes the
+// bundle directory's place: beside it, so that the final rename stays on one file system.
+std::string extractionStagingPathFor(const std::string& bundleDirectory);
+
 // Writes the bytes to path atomically and logs the outcome. Always true: callers do not look.
 bool writeDataToFile(const plist::Data& data, const std::string& path);
 

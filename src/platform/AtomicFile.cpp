@@ -69,19 +69,20 @@ int renameWithoutReplacing(const std::string& from, const std::string& to) {
     return ::rename(from.c_str(), to.c_str()) == 0 ? 0 : errno;
 }
 
-int writeAtomically(const std::string& path, std::string_view bytes, mode_t mode, bool replace) {
+int writeAtomically(const std::string& path, mode_t mode, bool replace,
+                    const std::function<int(int fd)>& fill) {
     if (path.empty() || path.back() == '/') {
         return EISDIR;
     }
     const std::string directory = directoryOf(path);
     // A fixed short name, so that a file name near the length limit still gets a temporary.
-    std::string pattern = directory + "/.tavrix-write-XXXXXX";
+    std::string pattern = directory + "/" + kAtomicWritePrefix + "XXXXXX";
     UniqueFd fd(::mkostemp(pattern.data(), O_CLOEXEC));
     if (!fd) {
         return errno;
     }
     TemporaryPath temporary(pattern);
-    if (int error = writeAll(fd.get(), bytes); error != 0) {
+    if (int error = fill(fd.get()); error != 0) {
         return error;
     }
     if (::fchmod(fd.get(), mode) != 0 || ::fsync(fd.get()) != 0) {
@@ -111,11 +112,18 @@ int writeAtomically(const std::string& path, std::string_view bytes, mode_t mode
 }  // namespace
 
 int replaceFileAtomically(const std::string& path, std::string_view bytes, mode_t mode) {
-    return writeAtomically(path, bytes, mode, /*replace=*/true);
+    return writeAtomically(path, mode, /*replace=*/true,
+                           [bytes](int fd) { return writeAll(fd, bytes); });
 }
 
 int createFileAtomically(const std::string& path, std::string_view bytes, mode_t mode) {
-    return writeAtomically(path, bytes, mode, /*replace=*/false);
+    return writeAtomically(path, mode, /*replace=*/false,
+                           [bytes](int fd) { return writeAll(fd, bytes); });
+}
+
+int createFileAtomicallyWith(const std::string& path, mode_t mode,
+                             const std::function<int(int fd)>& fill) {
+    return writeAtomically(path, mode, /*replace=*/false, fill);
 }
 
 }  // namespace tavrix::platform

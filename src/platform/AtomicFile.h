@@ -5,6 +5,7 @@
 #include <sys/types.h>
 
 #include <cstdint>
+#include <functional>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -16,6 +17,13 @@ namespace tavrix::platform {
 int replaceFileAtomically(const std::string& path, std::string_view bytes, mode_t mode);
 // The same, except that an existing file at path is never replaced (EEXIST).
 int createFileAtomically(const std::string& path, std::string_view bytes, mode_t mode);
+// The same again, with the content written by fill into the open temporary file (answering 0 or
+// an errno); for content too large to hold in memory. Temporary names start with
+// kAtomicWritePrefix.
+int createFileAtomicallyWith(const std::string& path, mode_t mode,
+                             const std::function<int(int fd)>& fill);
+// What the temporary names of an interrupted write start with, so that start-up can find them.
+inline constexpr const char* kAtomicWritePrefix = ".tavrix-write-";
 // replaceFileAtomically for binary data.
 inline int replaceFileAtomically(const std::string& path, const std::vector<std::uint8_t>& bytes,
                                  mode_t mode) {

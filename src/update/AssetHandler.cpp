@@ -1,6 +1,10 @@
 #include "update/AssetHandler.h"
 
 #include <algorithm>
+#include <atomic>
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
 #include <mutex>
 #include <string>
 
@@ -9,6 +13,10 @@
 #include "bundle/VersionCompare.h"
 #include "daemon/BehaviorPreferences.h"
 #include "payload/FileSystemHelper.h"
+#include "payload/FileSystemUtilities.h"
+#include "payload/MobileUser.h"
+#include "payload/PayloadUnpack.h"
+#include "update/PendingInstall.h"
 #include "update/UpdateCheckScheduler.h"
 #include "util/Log.h"
 #include "util/TXUtility.h"
@@ -126,6 +134,16 @@ AssetHandler::AssetPtr AssetHandler::findTheBestAsset() {
 }
 
 bool AssetHandler::downloadUpdateIfAvailable() {
+    // Two checks would download into and purge the same cache directory, and install over each
+    // other. Held until the check's download has been installed and purged.
+    static std::atomic<bool> checkRunning{false};
+    bool idle = false;
+    if (!checkRunning.compare_exchange_strong(idle, true)) {
+        logCFormat("An update check is already running, not starting another\n");
+        return false;
+    }
+    auto running = std::make_shared<RunningCheck>(checkRunning);
+
     AssetPtr asset = findTheBestAsset();
     if (!asset) {
         logObjectFormat("Best candidate passed in is nil");
@@ -137,13 +155,14 @@ bool AssetHandler::downloadUpdateIfAvailable() {
     }
     asset->beginDownload();
     // The handler keeps the asset alive until the catalog drops it after the last report.
-    asset->setProgressHandler(
-        [asset](const plist::Dictionary& progress) { handleDownloadProgress(asset, progress); });
+    asset->setProgressHandler([asset, running](const plist::Dictionary& progress) {
+        handleDownloadProgress(asset, progress, running);
+    });
     return true;
 }
 
-void AssetHandler::handleDownloadProgress(const AssetPtr& asset,
-                                          const plist::Dictionary& progress) {
+void AssetHandler::handleDownloadProgress(const AssetPtr& asset, const plist::Dictionary& progress,
+                                          const std::shared_ptr<RunningCheck>& running) {
     auto& scheduler = UpdateCheckScheduler::sharedInstance();
     auto operation = progress.find(platform::kAssetProgressOperationKey);
     if (operation == progress.end()) {
@@ -157,54 +176,115 @@ void AssetHandler::handleDownloadProgress(const AssetPtr& asset,
         // Every report but the last ends the check and re-arms it a day ahead; the last one
         // re-arms it again.
         scheduler.rescheduleAndEndCheck(kInstallRetryDelaySeconds);
+        if (name != nullptr && *name == platform::kAssetOperationFailed) {
+            running->finish();
+        }
         return;
     }
     std::optional<std::string> url = asset->localURL();
     if (!url) {
         logObjectFormat("Local URL is not available?");
         scheduler.rescheduleAndEndCheck(kInstallRetryDelaySeconds);
+        running->finish();
         return;
     }
     const plist::Value urlPath(*url);
     logObjectFormat("URL string: %@", &urlPath);
-    installDownloadedBundle(*url);
-    asset->purge([](bool) { logObjectFormat("Best candidate asset has been purged"); });
-    scheduler.rescheduleAndEndCheck(kInstallDoneDelaySeconds);
+    const bool installed = installDownloadedBundle(*url);
+    // The check ends only once the download is gone, so that no other check downloads into the
+    // directory being purged; the install is complete once its download is.
+    asset->purge([running](bool) {
+        removePendingInstall();
+        logObjectFormat("Best candidate asset has been purged");
+        running->finish();
+    });
+    scheduler.rescheduleAndEndCheck(installed ? kInstallDoneDelaySeconds
+                                              : kInstallRetryDelaySeconds);
 }
 
-void AssetHandler::installDownloadedBundle(const std::string& source) {
+bool AssetHandler::installDownloadedBundle(const std::string& source) {
     const std::string& destination = userBundleLocation();
     if (destination.empty()) {
         logCFormat("The mobile user's home directory is unknown, not installing the bundle\n");
-        return;
+        return false;
     }
     BundleManager& bundles = BundleManager::sharedInstance();
     std::lock_guard lock(bundles.operationLock());
-    {
-        payload::FileSystemHelper files;
-        logCFormat("Removing the directory %s\n", destination.c_str());
-        files.removeItem(destination);
-        logCFormat("Copying the directory %s to %s\n", source.c_str(), destination.c_str());
-        files.createDirectory(destination, 0755, true);
-        std::vector<std::string> names;
-        if (files.listDirectory(source, names, false) == 0) {
-            logCFormat("There are %ld files in directory %s\n", static_cast<long>(names.size()),
-                       source.c_str());
-            for (const std::string& name : names) {
-                const std::string entry = source + "/" + name;
-                logCFormat("Copying %s\n", entry.c_str());
-                files.copyItem(entry, destination);
-            }
-        }
+    // The new bundle is copied while the old one still stands, so both must fit.
+    const std::uint64_t needed = payload::diskBytesOfTree(source);
+    const char* home = payload::MobileUser::homeDirectory();
+    if (home == nullptr || !TXUtility::hasEnoughDiskSpaceAt(home, needed)) {
+        logCFormat("Not enough free space to install %s (%llu bytes), keeping the bundle\n",
+                   source.c_str(), static_cast<unsigned long long>(needed));
+        return false;
+    }
+    if (!writePendingInstall(source) || !copyDownloadedBundle(source, destination)) {
+        return false;
     }
     auto behaviorID = copyBehaviorPreference(kTavrixIDKey);
     if (!behaviorID || !behaviorID->isString()) {
         logObjectFormat("Behavior ID is not set yet in the preferences, no action is being taken");
-        return;
+        return true;
     }
     logCFormat("Behavior ID %s is already sent, redoing bundle match\n",
                behaviorID->asString()->c_str());
     bundles.resetBehaviorBundle(*behaviorID->asString());
+    return true;
+}
+
+bool AssetHandler::copyDownloadedBundle(const std::string& source, const std::string& destination) {
+    payload::FileSystemHelper files;
+    // Copied beside the user bundle and put in its place only when whole: a copy that fails (a
+    // disk that fills) leaves the old bundle as it was, and every file in the copy appears whole
+    // or not at all.
+    const std::string staging = payload::extractionStagingPathFor(destination);
+    files.removeItem(staging);
+    logCFormat("Copying the directory %s to %s\n", source.c_str(), destination.c_str());
+    files.createDirectory(staging, 0755, true);
+    std::vector<std::string> names;
+    int error = files.listDirectory(source, names, false);
+    if (error == 0) {
+        logCFormat("There are %ld files in directory %s\n", static_cast<long>(names.size()),
+                   source.c_str());
+    }
+    for (std::size_t index = 0; error == 0 && index < names.size(); ++index) {
+        const std::string entry = source + "/" + names[index];
+        logCFormat("Copying %s\n", entry.c_str());
+        error = payload::copyItemTree(entry, staging + "/" + names[index]);
+    }
+    if (error == 0) {
+        logCFormat("Removing the directory %s\n", destination.c_str());
+        error = files.removeItem(destination);
+        error = error == ENOENT ? 0 : error;
+    }
+    if (error == 0 && ::rename(staging.c_str(), destination.c_str()) != 0) {
+        error = errno;
+    }
+    if (error != 0) {
+        logCFormat("Failed to install %s into %s: %s\n", source.c_str(), destination.c_str(),
+                   std::strerror(error));
+        files.removeItem(staging);
+        return false;
+    }
+    return true;
+}
+
+void AssetHandler::resumeInterruptedInstall() {
+    std::optional<std::string> asset = readPendingInstall();
+    if (!asset) {
+        return;
+    }
+    if (payload::itemKind(*asset) != payload::ItemKind::Directory) {
+        logCFormat("The interrupted install of %s cannot be completed: the download is gone\n",
+                   asset->c_str());
+        removePendingInstall();
+        return;
+    }
+    logCFormat("Completing the interrupted install of %s\n", asset->c_str());
+    installDownloadedBundle(*asset);
+    payload::removeItemTree(*asset);
+    removePendingInstall();
+    logCFormat("Purged the download %s of the interrupted install\n", asset->c_str());
 }
 
 }  // namespace tavrix

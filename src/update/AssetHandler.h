@@ -2,6 +2,7 @@
 // only; a download's state lives in its progress handler.
 #pragma once
 
+#include <atomic>
 #include <memory>
 #include <optional>
 #include <vector>
@@ -36,15 +37,43 @@ class AssetHandler {
     static AssetPtr findTheBestAsset();
 
     // Starts downloading the best asset; its completion installs it as the user bundle and redoes
-    // the bundle match. True when a download was started.
+    // the bundle match. True when a download was started. One check at a time: while one runs
+    // (until its download is installed and purged) another answers false and starts nothing.
     static bool downloadUpdateIfAvailable();
 
-    // What a download's progress handler does with one report (on the catalog's thread).
-    static void handleDownloadProgress(const AssetPtr& asset, const plist::Dictionary& progress);
+    // Completes an install that a crash cut short, from the download still in the cache, redoes
+    // the match and purges the download. For the launch, before anything else changes the bundles.
+    static void resumeInterruptedInstall();
 
   private:
+    // Marks an update check as running until finish() or its last owner goes.
+    class RunningCheck {
+      public:
+        explicit RunningCheck(std::atomic<bool>& flag) : flag_(flag) {}
+        ~RunningCheck() { finish(); }
+        RunningCheck(const RunningCheck&) = delete;
+        RunningCheck& operator=(const RunningCheck&) = delete;
+        // Once only: a later check may have set the flag again by the time the last owner goes.
+        void finish() {
+            if (!finished_.exchange(true)) {
+                flag_ = false;
+            }
+        }
+
+      private:
+        std::atomic<bool>& flag_;
+        std::atomic<bool> finished_{false};
+    };
+
+    // What a download's progress handler does with one report (on the catalog's thread); running
+    // marks the check as running for as long as it is held.
+    static void handleDownloadProgress(const AssetPtr& asset, const plist::Dictionary& progress,
+                                       const std::shared_ptr<RunningCheck>& running);
     // Copies the downloaded bundle over the user bundle directory and redoes the bundle match.
-    static void installDownloadedBundle(const std::string& source);
+    // False when the install was refused before the old bundle was touched, or failed.
+    static bool installDownloadedBundle(const std::string& source);
+    // The copy itself; false when an entry could not be copied whole.
+    static bool copyDownloadedBundle(const std::string& source, const std::string& destination);
 };
 
 }  // namespace tavrix

@@ -129,8 +129,12 @@ bool TXUtility::freeSpaceExceeds(std::uint64_t blockSize, std::uint64_t freeBloc
 
 bool TXUtility::hasEnoughDiskSpace(std::uint64_t bytes) {
     auto home = homeDirectory();
+    return home && hasEnoughDiskSpaceAt(*home, bytes);
+}
+
+bool TXUtility::hasEnoughDiskSpaceAt(const std::string& path, std::uint64_t bytes) {
     struct statfs info {};
-    if (!home || ::statfs(home->c_str(), &info) != 0) {
+    if (::statfs(path.c_str(), &info) != 0) {
         return false;
     }
     // The block counts are in units of the fragment size, which is the block size on nearly every

@@ -45,6 +45,8 @@ class TXUtility {
     // True when the file system holding the home directory has more than bytes free (counting
     // the blocks reserved for privileged users); false when it cannot be asked.
     static bool hasEnoughDiskSpace(std::uint64_t bytes);
+    // The same for the file system holding path.
+    static bool hasEnoughDiskSpaceAt(const std::string& path, std::uint64_t bytes);
     // The rule behind hasEnoughDiskSpace: blockSize x freeBlocks strictly above bytes. A product
     // beyond 64 bits is more than any request.
     static bool freeSpaceExceeds(std::uint64_t blockSize, std::uint64_t freeBlocks,

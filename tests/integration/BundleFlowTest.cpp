@@ -1,10 +1,14 @@
 // The daemon's main job as clients see it: a behavior ID set with a packed bundle ends with the
 // right carrier file linked into the mobile home and one notification, and nothing changes when
 // nothing changed.
-#include <signal.h>
 #include <sys/stat.h>
 
+#include <cstdlib>
 #include <fstream>
+#include <iostream>
+#include <map>
+#include <random>
+#include <thread>
 
 #include "BusFixture.h"
 #include "CommandRunner.h"
@@ -284,29 +288,118 @@ TEST_F(BundleFlowTest, DirectoryInPlaceOfTheBundleLinkIsReportedAndLeftAlone) {
     EXPECT_EQ(linkTarget(kBundleLink), at(kUserBundle).string());
 }
 
-// Every launch re-applies the stored ID: links lost while the daemon was away come back, and a
-// launch with the links in place changes nothing.
-TEST_F(BundleFlowTest, RestartRedoesTheBundleMatchFromTheStoredID) {
-    auto caller = client();
-    ASSERT_TRUE(caller.setTavrixID("abc", packBundle("10", "tgz")));
-    const std::string carrierFile = linkTarget(kPreferencesLink);
-    ASSERT_FALSE(carrierFile.empty());
+// Iterations of the crash loops: TAVRIX_CRASH_LOOP_ITERATIONS when set (scripts/crash-loop.sh),
+// else enough for the test to run well under a minute.
+int crashLoopIterations() {
+    const char* text = std::getenv("TAVRIX_CRASH_LOOP_ITERATIONS");
+    return text != nullptr && std::atoi(text) > 0 ? std::atoi(text) : 30;
+}
 
-    for (bool removeLinks : {true, false}) {
+// A client's SetTavrixID with a multi-megabyte payload, the daemon killed at a random instant of
+// it: every next launch finds (or makes) one whole state: both links resolve, the carrier file is
+// in the linked bundle or the generated files and parses, the daemon preferences parse. The call
+// made again ends with the payload's bundle linked. Nothing of the interrupted calls stays.
+TEST_F(BundleFlowTest, KilledAnywhereInSetTavrixIDTheNextLaunchFindsOneWholeState) {
+    writeBundle(at(kSystemBundle), "9");
+    // Two versions, each with a large file that does not compress and many small ones.
+    auto packLarge = [&](const std::string& version) {
+        const fs::path source = device().base() / ("large-" + version);
+        writeBundle(source, version);
+        std::mt19937 bytes(static_cast<unsigned>(std::stoi(version)));
+        std::string bulk(3 << 20, '\0');
+        for (char& byte : bulk) {
+            byte = static_cast<char>(bytes());
+        }
+        fs::create_directories(source / "Resources/small");
+        std::ofstream(source / "Resources/bulk.bin", std::fstream::binary) << bulk;
+        for (int i = 0; i < 100; ++i) {
+            std::ofstream(source / ("Resources/small/" + std::to_string(i) + ".txt")) << version;
+        }
+        const fs::path archive = device().base() / ("large-" + version + ".tgz");
+        EXPECT_EQ(
+            runCommand({"/usr/bin/bsdtar", "-czf", archive.string(), "-C", source.string(), "."})
+                .status,
+            0);
+        return readBytes(archive);
+    };
+    const std::vector<std::pair<std::string, std::vector<std::uint8_t>>> payloads = {
+        {"10", packLarge("10")}, {"11", packLarge("11")}};
+
+    // Whether both links resolve and the carrier file lies in the linked bundle or among the
+    // generated files.
+    auto linkState = [&]() -> std::string {
+        std::error_code error;
+        const fs::path bundle = fs::canonical(at(kBundleLink), error);
+        const std::string carrierFile =
+            error ? std::string() : fs::canonical(at(kPreferencesLink), error).string();
+        if (error || !fs::is_directory(bundle) || !fs::is_regular_file(carrierFile)) {
+            return "links dangle";
+        }
+        return carrierFile.starts_with(bundle.string() + "/") ||
+                       carrierFile.starts_with(at(kOverlayDirectory).string() + "/")
+                   ? "links agree"
+                   : "links disagree";
+    };
+    auto linkedVersion = [&]() -> std::string {
+        auto info = plist::readFile((at(kBundleLink) / "Info.plist").string());
+        const plist::Value* version = info ? info->find("QZBundleVersion") : nullptr;
+        return version != nullptr && version->asString() != nullptr ? *version->asString() : "";
+    };
+    const auto started = std::chrono::steady_clock::now();
+    ASSERT_TRUE(client().setTavrixID("abc", payloads[0].second));
+    const auto callTime = std::chrono::steady_clock::now() - started;
+
+    const unsigned seed = static_cast<unsigned>(std::random_device{}());
+    SCOPED_TRACE("seed " + std::to_string(seed));
+    std::mt19937 random(seed);
+    std::map<std::string, int> statesFound;
+    for (int iteration = 0; iteration < crashLoopIterations(); ++iteration) {
+        SCOPED_TRACE("iteration " + std::to_string(iteration));
+        const auto& [version, payload] = payloads[static_cast<std::size_t>(iteration) % 2];
         auto pid = daemonPid();
         ASSERT_TRUE(pid);
-        ASSERT_EQ(::kill(*pid, SIGTERM), 0);
-        ASSERT_EQ(waitForDaemonExit(*pid), std::optional<int>(0));
-        if (removeLinks) {
-            fs::remove(at(kBundleLink));
-            fs::remove(at(kPreferencesLink));
-        }
-        EXPECT_FALSE(caller.isTavrixBundleSupported());
-        EXPECT_EQ(linkTarget(kPreferencesLink), carrierFile);
+        std::thread victim([&, &payload = payload] {
+            try {
+                client().setTavrixID("abc", payload);
+            } catch (const std::exception&) {
+                // The daemon died under the call: that is the point.
+            }
+        });
+        std::this_thread::sleep_for(
+            std::uniform_int_distribution<std::int64_t>(
+                0, std::chrono::duration_cast<std::chrono::microseconds>(callTime).count() * 5 /
+                       4)(random) *
+            1us);
+        ASSERT_TRUE(killDaemon(*pid));
+        victim.join();
+        ++statesFound[linkState()];
+
+        client().isTavrixBundleSupported();  // a fresh launch
+        ASSERT_EQ(linkState(), "links agree");
+        EXPECT_TRUE(fs::exists(at(kBundleLink) / "Info.plist"));
+        EXPECT_TRUE(linkedCarrierFile().has_value());
+        EXPECT_TRUE(device().readDaemonPreferences().has_value());
+
+        ASSERT_TRUE(client().setTavrixID("abc", payload));
+        EXPECT_EQ(linkedVersion(), version);
+        EXPECT_EQ(linkTarget(kBundleLink), at(kUserBundle).string());
+        EXPECT_TRUE(fs::exists(at(kUserBundle) / "Resources/small/99.txt"));
+        EXPECT_EQ(fs::file_size(at(kUserBundle) / "Resources/bulk.bin"), 3u << 20);
     }
-    EXPECT_EQ(countLogLines("Behavior ID abc is already sent, redoing bundle match"), 2);
-    EXPECT_EQ(countLogLines(matchResult("kBundleChangeTypeUpdate")), 2);
-    EXPECT_EQ(countLogLines(matchResult("kBundleChangeTypeNoChange")), 1);
+    for (const char* leftover : {"/tmp/behaviorbundle_zipped.tgz",
+                                 "/var/mobile/Library/TavrixBundles/.Default.bundle.incoming"}) {
+        EXPECT_FALSE(fs::exists(at(leftover))) << leftover;
+    }
+    std::cout << "[ crash loop ] SetTavrixID: " << crashLoopIterations() << " iterations;";
+    for (const auto& [state, count] : statesFound) {
+        std::cout << " " << state << ": " << count << ";";
+    }
+    int repairs = 0;
+    for (const std::string& line : daemonLogLines()) {
+        repairs += line.find("disagree, linking again") != std::string::npos ||
+                   line.find("left by an interrupted change") != std::string::npos;
+    }
+    std::cout << " repairs: " << repairs << "\n";
 }
 
 }  // namespace

@@ -52,9 +52,17 @@ void BusFixture::stopDaemons() {
         }
     }
     for (const DaemonLaunch& launch : bus_->launches()) {
+        if (killed_.contains(launch.pid)) {
+            continue;
+        }
         EXPECT_EQ(launch.exitStatus, std::optional<int>(0))
             << "daemon " << launch.pid << " exited with an unexpected status";
     }
+}
+
+bool BusFixture::killDaemon(pid_t pid) {
+    killed_.insert(pid);
+    return ::kill(pid, SIGKILL) == 0 && waitForDaemonExit(pid).has_value();
 }
 
 std::vector<std::string> BusFixture::daemonLogLines() const {

@@ -10,6 +10,7 @@
 #include <chrono>
 #include <memory>
 #include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -62,6 +63,9 @@ class BusFixture : public ::testing::Test {
     // The exit status of the daemon process pid once it has ended, or nothing at the timeout.
     std::optional<int> waitForDaemonExit(pid_t pid, std::chrono::milliseconds timeout = 10s) const;
     std::vector<DaemonLaunch> daemonLaunches() const { return bus_->launches(); }
+    // Kills the daemon process pid with SIGKILL, as a power cut would end it, and waits for it to
+    // end; that daemon is then not expected to exit with 0. False when it did not end.
+    bool killDaemon(pid_t pid);
 
     // Set by a derived fixture's constructor; read by SetUp.
     BusOptions busOptions;
@@ -71,6 +75,7 @@ class BusFixture : public ::testing::Test {
     void stopDaemons();
 
     DeviceRoot device_;
+    std::set<pid_t> killed_;
     std::unique_ptr<PrivateBus> bus_;
     std::unique_ptr<BusWatcher> watcher_;
 };

@@ -3,12 +3,17 @@
 // and downloads that go wrong leaving the linked bundle as it was.
 #include <signal.h>
 #include <sodium.h>
+#include <sys/mount.h>
+#include <unistd.h>
 
 #include <cmath>
+#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <future>
+#include <iostream>
 #include <map>
+#include <random>
 #include <thread>
 
 #include "BusFixture.h"
@@ -30,6 +35,7 @@ constexpr const char* kBundleLink = "/var/mobile/Library/Tavrix.bundle";
 constexpr const char* kPreferencesLink = "/var/mobile/Library/Preferences/com.zandor.tavrix.plist";
 constexpr const char* kAssetCache = "/var/cache/tavrixservicesd/com.zandor.Grellas.TavrixBundles";
 constexpr const char* kBehaviorID = "acme.default";
+constexpr const char* kPendingInstall = "/var/lib/tavrixservicesd/pending-install.plist";
 
 constexpr double kOneDay = 86400.0;
 constexpr double kFifteenDays = 1296000.0;
@@ -78,8 +84,9 @@ class OverTheAirUpdateTest : public BusFixture {
     fs::path site() { return device().base() / "site"; }
     fs::path secretKey() { return keys_ / "secret"; }
 
-    // A bundle: its Info.plist, the base carrier file naming the version, and one file of its own.
-    fs::path writeBundle(const std::string& version) {
+    // A bundle: its Info.plist, the base carrier file naming the version, one file of its own and,
+    // when asked, a large file of bulkBytes that does not compress.
+    fs::path writeBundle(const std::string& version, std::size_t bulkBytes = 0) {
         const fs::path directory = device().base() / ("bundles/" + version + "/Default.bundle");
         fs::create_directories(directory);
         EXPECT_TRUE(plist::writeFile(
@@ -90,6 +97,11 @@ class OverTheAirUpdateTest : public BusFixture {
             (directory / "behavior.plist").string(),
             plist::Value(plist::Dictionary{{"CarrierName", "Bundle " + version}})));
         writeFile(directory / ("Resources/only-in-" + version + ".txt"), version);
+        if (bulkBytes > 0) {
+            std::string bulk(bulkBytes, '\0');
+            randombytes_buf(bulk.data(), bulk.size());
+            writeFile(directory / "Resources/bulk.bin", bulk);
+        }
         return directory;
     }
 
@@ -106,10 +118,10 @@ class OverTheAirUpdateTest : public BusFixture {
 
     // Publishes the bundle of this version, signed, as the only asset of the catalog; answers
     // the archive's URL path.
-    std::string publish(const std::string& version) {
+    std::string publish(const std::string& version, std::size_t bulkBytes = 0) {
         CommandResult run =
             runCommand({TAVRIX_CATALOG_TOOL, "publish", site().string(), "--key",
-                        secretKey().string(), "--fresh", writeBundle(version).string()});
+                        secretKey().string(), "--fresh", writeBundle(version, bulkBytes).string()});
         EXPECT_EQ(run.status, 0) << run.output;
         return "/updates/archives/Default-" + version + ".tgz";
     }
@@ -200,15 +212,23 @@ class OverTheAirUpdateTest : public BusFixture {
         return true;
     }
 
+    // The version of the bundle the bundle link points at, or empty.
+    std::string linkedVersion() {
+        auto info = plist::readFile((at(kBundleLink) / "Info.plist").string());
+        const plist::Value* version = info ? info->find("QZBundleVersion") : nullptr;
+        return version != nullptr && version->asString() != nullptr ? *version->asString() : "";
+    }
+
     // The installed bundle of this version is linked and read as the behavior settings.
-    void expectInstalled(const std::string& version) {
-        auto files = userBundleFiles();
-        EXPECT_EQ(files.count("Resources/only-in-" + version + ".txt"), 1u) << version;
-        EXPECT_EQ(files.size(), 3u) << "entries of the previous bundle are gone";
+    void expectInstalled(const std::string& version, std::size_t files = 3) {
+        auto installed = userBundleFiles();
+        EXPECT_EQ(installed.count("Resources/only-in-" + version + ".txt"), 1u) << version;
+        EXPECT_EQ(installed.size(), files) << "entries of the previous bundle are gone";
         EXPECT_EQ(linkTarget(kBundleLink), at(kUserBundle).string());
         EXPECT_EQ(linkTarget(kPreferencesLink), (at(kUserBundle) / "behavior.plist").string());
         EXPECT_EQ(client().copyTavrixValue("CarrierName"),
                   std::optional<plist::Value>("Bundle " + version));
+        EXPECT_FALSE(fs::exists(device().path(kPendingInstall)));
     }
 
     test::LocalHttpServer server;
@@ -225,10 +245,23 @@ TEST_F(OverTheAirUpdateTest, NewerPublishedBundleIsInstalledLinkedAndAnnounced) 
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
     expectInstalled("1");
 
-    publish("2");
-    // As an operator asks for it: tavrixctl waits for the installed bundle's announcement.
-    CommandResult check =
-        runCommand({TAVRIX_CTL_PATH, "--address", busAddress(), "check-update", "--wait", "30"});
+    const std::string archive = publish("2");
+    test::LocalHttpServer::Response held;
+    held.body = readFile(published(archive));
+    held.holdAfterBodyBytes = held.body.size() / 2;
+    server.serve(archive, held);
+    // As an operator asks for it: tavrixctl waits for the installed bundle's announcement. A
+    // second check while that one downloads starts nothing and answers at once.
+    CommandResult check;
+    std::thread operatorCheck([&] {
+        check = runCommand(
+            {TAVRIX_CTL_PATH, "--address", busAddress(), "check-update", "--wait", "30"});
+    });
+    ASSERT_TRUE(server.waitForHeldResponse(30s));
+    EXPECT_FALSE(client().checkForTavrixBundleUpdate());
+    EXPECT_EQ(countLogLines("An update check is already running, not starting another"), 1);
+    server.releaseHeldResponses();
+    operatorCheck.join();
     EXPECT_EQ(check.status, 0);
     EXPECT_EQ(check.output, std::string("yes\n") + kChanged + "\n");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 2, 30s));
@@ -372,6 +405,107 @@ TEST_F(OverTheAirUpdateTest, CheckAnsweredWhileTheDaemonLeavesIsInstalledBeforeI
     EXPECT_EQ(linkTarget(kPreferencesLink), (at(kUserBundle) / "behavior.plist").string());
     EXPECT_TRUE(watcher().waitForNotification(kChanged, 2, 5s));
     EXPECT_TRUE(waitForNextUpdateIn(kFifteenDays));
+}
+
+// A bundle larger than the free space of the mobile home is refused before the old bundle is
+// touched: the old one stays linked and whole, the download is purged and the check re-armed a
+// day ahead.
+TEST_F(OverTheAirUpdateTest, AnUpdateThatDoesNotFitLeavesTheOldBundleLinked) {
+    const fs::path home = at("/var/mobile");
+    if (::geteuid() != 0 || ::mount("tmpfs", home.c_str(), "tmpfs", 0, "size=2m") != 0) {
+        GTEST_SKIP() << "cannot mount a small tmpfs as the mobile home (needs root)";
+    }
+    struct Unmount {
+        fs::path path;
+        ~Unmount() { ::umount2(path.c_str(), MNT_DETACH); }
+    } unmount{home};
+    device().writeDaemonPreferences(
+        {{"EnableSupport", true}, {"NextUpdate", plist::Date{now() + 3 * kOneDay}}});
+    setIDWithBundle("1");
+    ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
+    const auto installedFiles = userBundleFiles();
+
+    publish("2", 3 << 20);
+    EXPECT_TRUE(client().checkForTavrixBundleUpdate());
+    EXPECT_TRUE(waitForLogLine("Best candidate asset has been purged", 30s));
+    EXPECT_EQ(countLogLinesContaining("Not enough free space to install"), 1);
+    EXPECT_EQ(countLogLines("Removing the directory " + at(kUserBundle).string()), 0);
+    EXPECT_TRUE(waitForNextUpdateIn(kOneDay));
+    EXPECT_EQ(userBundleFiles(), installedFiles);
+    EXPECT_EQ(linkTarget(kBundleLink), at(kUserBundle).string());
+    EXPECT_EQ(client().copyTavrixValue("CarrierName"), std::optional<plist::Value>("Bundle 1"));
+    EXPECT_EQ(cachedAssets(), std::vector<std::string>{});
+    EXPECT_FALSE(watcher().waitForNotification(kChanged, 2, 200ms));
+}
+
+// The daemon killed at a random instant of an over-the-air update (download, copy, match, purge):
+// every next launch finds both links resolving to a whole bundle and a carrier file that parses,
+// and either completes the interrupted install from the cached download or, when the download had
+// not completed, the next check installs it. Nothing is left in the cache.
+TEST_F(OverTheAirUpdateTest, KilledAnywhereInAnUpdateTheNextLaunchCompletesOrRedoesIt) {
+    constexpr std::size_t kBulk = 2 << 20;
+    constexpr const char* kPurged = "Best candidate asset has been purged";
+    setIDWithBundle("1");
+    ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
+    publish("2", kBulk);
+    const auto started = std::chrono::steady_clock::now();
+    ASSERT_TRUE(client().checkForTavrixBundleUpdate());
+    ASSERT_TRUE(waitForLogLine(kPurged, 30s));
+    const auto updateTime = std::chrono::steady_clock::now() - started;
+
+    const char* iterationsText = std::getenv("TAVRIX_CRASH_LOOP_ITERATIONS");
+    const int iterations =
+        iterationsText != nullptr && std::atoi(iterationsText) > 0 ? std::atoi(iterationsText) : 30;
+    const unsigned seed = static_cast<unsigned>(std::random_device{}());
+    SCOPED_TRACE("seed " + std::to_string(seed));
+    std::mt19937 random(seed);
+    std::map<std::string, int> statesFound;
+    for (int iteration = 0; iteration < iterations; ++iteration) {
+        const std::string version = std::to_string(iteration + 3);
+        SCOPED_TRACE("version " + version);
+        publish(version, kBulk);
+        auto pid = daemonPid();
+        ASSERT_TRUE(pid);
+        EXPECT_TRUE(client().checkForTavrixBundleUpdate());
+        std::this_thread::sleep_for(
+            std::uniform_int_distribution<std::int64_t>(
+                0, std::chrono::duration_cast<std::chrono::microseconds>(updateTime).count() * 5 /
+                       4)(random) *
+            1us);
+        ASSERT_TRUE(killDaemon(*pid));
+        const bool marked = fs::exists(device().path(kPendingInstall));
+        ++statesFound[linkedVersion() == version ? "installed"
+                      : marked                   ? "install interrupted"
+                                                 : "not installed"];
+
+        client().isTavrixBundleSupported();  // a fresh launch
+        std::error_code error;
+        const fs::path bundle = fs::canonical(at(kBundleLink), error);
+        ASSERT_FALSE(error) << "the bundle link does not resolve";
+        const std::string carrierFile = fs::canonical(at(kPreferencesLink), error).string();
+        ASSERT_FALSE(error) << "the carrier file link does not resolve";
+        EXPECT_TRUE(carrierFile.starts_with(bundle.string() + "/")) << carrierFile;
+        EXPECT_TRUE(plist::readFile(carrierFile).has_value());
+        EXPECT_TRUE(device().readDaemonPreferences().has_value());
+        EXPECT_FALSE(fs::exists(device().path(kPendingInstall)));
+        if (linkedVersion() != version) {
+            const int purged = countLogLines(kPurged);
+            EXPECT_TRUE(client().checkForTavrixBundleUpdate());
+            // The check has ended once its download is purged.
+            EXPECT_TRUE(waitForLogLine(kPurged, 30s, purged + 1));
+        }
+        expectInstalled(version, 4);
+        EXPECT_EQ(cachedAssets(), std::vector<std::string>{});
+    }
+    EXPECT_EQ(cachedAssets(), std::vector<std::string>{});
+    std::cout << "[ crash loop ] update: " << iterations << " iterations;";
+    for (const auto& [state, count] : statesFound) {
+        std::cout << " " << state << ": " << count << ";";
+    }
+    std::cout << " repairs: "
+              << countLogLinesContaining("Completing the interrupted install") +
+                     countLogLinesContaining("disagree, linking again")
+              << "\n";
 }
 
 class OverTheAirKeepAliveTest : public OverTheAirUpdateTest {

@@ -1,5 +1,7 @@
 #include <gtest/gtest.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -197,6 +199,56 @@ TEST(FileSystemHelper, RemoveItemRemovesTreesAndLinksButNotLinkTargets) {
     EXPECT_FALSE(helper.fileExists(dir / "tree"));
     EXPECT_EQ(readText(dir / "kept/z"), "z");
     EXPECT_EQ(helper.removeItem(dir / "tree"), ENOENT);
+}
+
+// A tree that an unprivileged daemon extracted with a directory it may not write: removing the
+// tree must still take everything, or the next bundle would be mixed into what is left.
+TEST(FileSystemHelper, RemoveItemOpensUpDirectoriesWithoutWritePermission) {
+    if (::geteuid() != 0) {
+        GTEST_SKIP() << "needs root to act as an unprivileged owner";
+    }
+    TempDir dir;
+    constexpr uid_t kNobody = 65534;
+    ASSERT_EQ(::chown(dir.path().c_str(), kNobody, kNobody), 0);
+    const std::string tree = dir / "bundle";
+    pid_t child = ::fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+        bool ok = ::setgid(kNobody) == 0 && ::setuid(kNobody) == 0;
+        writeText(tree + "/Resources/locked/file", "x");
+        ok = ok && ::chmod((tree + "/Resources/locked").c_str(), 0555) == 0 &&
+             ::chmod((tree + "/Resources").c_str(), 0500) == 0;
+        ok = ok && removeItemTree(tree) == 0 && !fs::exists(fs::symlink_status(tree));
+        ::_exit(ok ? 0 : 1);
+    }
+    int status = 0;
+    ASSERT_EQ(::waitpid(child, &status, 0), child);
+    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+}
+
+// A full disk part way through a copy leaves nothing under the final name and no temporary
+// file; a copy that fits keeps the source's mode.
+TEST(FileSystemPrimitives, ACopyThatRunsOutOfSpaceLeavesNoFileBehind) {
+    TempDir dir;
+    const std::string small = dir / "small";
+    fs::create_directory(small);
+    if (::geteuid() != 0 || ::mount("tmpfs", small.c_str(), "tmpfs", 0, "size=1m") != 0) {
+        GTEST_SKIP() << "cannot mount a small tmpfs (needs root)";
+    }
+    struct Unmount {
+        std::string path;
+        ~Unmount() { ::umount2(path.c_str(), MNT_DETACH); }
+    } unmount{small};
+    writeText(dir / "big", std::string(3 << 20, 'b'));
+    writeText(dir / "fits", "fits");
+    ASSERT_EQ(::chmod((dir / "fits").c_str(), 0604), 0);
+
+    EXPECT_EQ(copyItemTree(dir / "big", small + "/big"), ENOSPC);
+    EXPECT_TRUE(fs::is_empty(small));
+    EXPECT_EQ(copyItemTree(dir / "fits", small + "/fits"), 0);
+    EXPECT_EQ(readText(small + "/fits"), "fits");
+    EXPECT_EQ(modeOf(small + "/fits"), 0604u);
+    EXPECT_EQ(snapshotTree(small).size(), 1u);
 }
 
 TEST(FileSystemAttributes, PermissionsApplyToTheWholeTreeButNotThroughLinks) {

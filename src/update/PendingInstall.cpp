@@ -1,0 +1,61 @@
+#include "update/PendingInstall.h"
+
+#include <cerrno>
+#include <cstring>
+
+#include "payload/FileSystemUtilities.h"
+#include "platform/AtomicFile.h"
+#include "platform/PlatformRoot.h"
+#include "plist/PropertyListFormat.h"
+#include "util/Log.h"
+
+namespace tavrix {
+namespace {
+
+constexpr const char* kStateDirectory = "/var/lib/tavrixservicesd";
+constexpr const char* kMarkerFileName = "pending-install.plist";
+constexpr const char* kAssetDirectoryKey = "AssetDirectory";
+constexpr mode_t kStateDirectoryMode = 0755;
+constexpr mode_t kMarkerMode = 0600;
+
+}  // namespace
+
+std::string pendingInstallMarkerPath() {
+    return platform::resolvePath(kStateDirectory) + "/" + kMarkerFileName;
+}
+
+bool writePendingInstall(const std::string& assetDirectory) {
+    const std::string directory = platform::resolvePath(kStateDirectory);
+    int error = payload::createDirectoryAt(directory, kStateDirectoryMode, true);
+    if (error == 0) {
+        const std::string xml = plist::serialize(
+            plist::Value(plist::Dictionary{{kAssetDirectoryKey, plist::Value(assetDirectory)}}),
+            plist::Format::Xml);
+        error = platform::replaceFileAtomically(pendingInstallMarkerPath(), xml, kMarkerMode);
+    }
+    if (error != 0) {
+        logCFormat("Could not record the install of %s: %s\n", assetDirectory.c_str(),
+                   std::strerror(error));
+        return false;
+    }
+    return true;
+}
+
+std::optional<std::string> readPendingInstall() {
+    std::optional<plist::Value> marker = plist::readFile(pendingInstallMarkerPath());
+    const plist::Dictionary* values = marker ? marker->asDictionary() : nullptr;
+    if (values == nullptr) {
+        return std::nullopt;
+    }
+    auto directory = values->find(kAssetDirectoryKey);
+    if (directory == values->end() || directory->second.asString() == nullptr) {
+        return std::nullopt;
+    }
+    return *directory->second.asString();
+}
+
+void removePendingInstall() {
+    payload::removeItemTree(pendingInstallMarkerPath());
+}
+
+}  // namespace tavrix
