@@ -107,12 +107,19 @@ std::optional<std::string> copyEntryData(archive* reader, archive* writer,
 }  // namespace
 
 bool extractArchive(const std::string& archivePath, const std::string& destinationDirectory,
-                    ExtractionSafety safety, const ExtractionLimits& limits) {
+                    ExtractionSafety safety, const ExtractionLimits& limits, std::string* whyNot) {
+    auto fail = [&](const std::string& why) {
+        if (whyNot != nullptr) {
+            *whyNot = why;
+        } else {
+            logCFormat("%s\n", why.c_str());
+        }
+        return false;
+    };
     // Empty names would mean standard input and the file-system root to libarchive.
     if (archivePath.empty() || destinationDirectory.empty()) {
-        logCFormat("Cannot extract the archive '%s' into '%s'\n", archivePath.c_str(),
-                   destinationDirectory.c_str());
-        return false;
+        return fail("Cannot extract the archive '" + archivePath + "' into '" +
+                    destinationDirectory + "'");
     }
     FileSystemHelper helper;
     if (!helper.fileExists(destinationDirectory)) {
@@ -124,9 +131,8 @@ bool extractArchive(const std::string& archivePath, const std::string& destinati
         // brings are refused.
         auto resolved = resolvedPath(destinationDirectory);
         if (!resolved) {
-            logCFormat("Cannot extract into %s: %s\n", destinationDirectory.c_str(),
-                       std::strerror(errno));
-            return false;
+            return fail("Cannot extract into " + destinationDirectory + ": " +
+                        std::strerror(errno));
         }
         destination = *resolved;
     }
@@ -134,8 +140,7 @@ bool extractArchive(const std::string& archivePath, const std::string& destinati
     ArchiveReader reader(archive_read_new());
     ArchiveWriter writer(archive_write_disk_new());
     if (!reader || !writer) {
-        logCFormat("Cannot extract %s: out of memory\n", archivePath.c_str());
-        return false;
+        return fail("Cannot extract " + archivePath + ": out of memory");
     }
     archive_write_disk_set_options(writer.get(), safety == ExtractionSafety::PathSafe
                                                      ? kNetworkArchiveOptions
@@ -148,15 +153,11 @@ bool extractArchive(const std::string& archivePath, const std::string& destinati
 
     if (archive_read_open_filename(reader.get(), archivePath.c_str(), kReadBlockSize) !=
         ARCHIVE_OK) {
-        logCFormat("Cannot open the archive %s: %s\n", archivePath.c_str(),
-                   errorText(reader.get()));
-        return false;
+        return fail("Cannot open the archive " + archivePath + ": " + errorText(reader.get()));
     }
     ExtractionBudget budget(limits, destination);
     auto stop = [&](const std::string& why) {
-        logCFormat("Extraction of %s into %s stopped: %s\n", archivePath.c_str(),
-                   destination.c_str(), why.c_str());
-        return false;
+        return fail("Extraction of " + archivePath + " into " + destination + " stopped: " + why);
     };
     for (;;) {
         archive_entry* entry = nullptr;
@@ -169,16 +170,13 @@ bool extractArchive(const std::string& archivePath, const std::string& destinati
             return true;
         }
         if (status != ARCHIVE_OK) {
-            logCFormat("Cannot read the archive %s: %s\n", archivePath.c_str(),
-                       errorText(reader.get()));
-            return false;
+            return fail("Cannot read the archive " + archivePath + ": " + errorText(reader.get()));
         }
         if (safety == ExtractionSafety::PathSafe) {
             if (std::optional<std::string> unsafe = whyEntryIsUnsafe(entry)) {
-                logCFormat("Refusing the archive entry %s of %s: %s\n",
-                           archive_entry_pathname(entry) ? archive_entry_pathname(entry) : "",
-                           archivePath.c_str(), unsafe->c_str());
-                return false;
+                const char* name = archive_entry_pathname(entry);
+                return fail(std::string("Refusing the archive entry ") + (name ? name : "") +
+                            " of " + archivePath + ": " + *unsafe);
             }
         }
         if (std::optional<std::string> exceeded = budget.admitEntry(

@@ -49,11 +49,14 @@ inline constexpr ExtractionLimits kClientPayloadLimits{kPayloadMaxExpandedBytes,
 // directories and symbolic links whose target stays inside the destination, all below it, never
 // written through a link; any other entry (hard link, device, FIFO, socket, escaping path or link)
 // stops the extraction, logged. File flags are not restored in PathSafe.
-// Either way, going past a limit stops the extraction with one log line; what was written stays.
-// True when the archive was read to its end with nothing refused or cut short; false otherwise.
-// archivePath names a file; standard input is never read. Never changes the working directory.
+// Either way, going past a limit stops the extraction; what was written stays.
+// True when the archive was read to its end with nothing refused or cut short; false otherwise,
+// with one line saying why: logged, or put in whyNot when given (for a caller that reports it as
+// part of its own failure). archivePath names a file; standard input is never read. Never
+// changes the working directory.
 bool extractArchive(const std::string& archivePath, const std::string& destinationDirectory,
                     ExtractionSafety safety = ExtractionSafety::AsArchived,
-                    const ExtractionLimits& limits = kClientPayloadLimits);
+                    const ExtractionLimits& limits = kClientPayloadLimits,
+                    std::string* whyNot = nullptr);
 
 }  // namespace tavrix::payload

@@ -10,6 +10,7 @@
 #include <cstdio>
 #include <cstring>
 #include <ctime>
+#include <vector>
 
 #include "payload/FileSystemUtilities.h"
 #include "payload/PayloadUnpack.h"
@@ -20,6 +21,9 @@
 
 namespace tavrix::platform {
 namespace {
+
+constexpr const char* kStagedArchiveSuffix = ".download";
+constexpr const char* kStagedExtractionSuffix = ".extracting";
 
 // Downloading reports come at each further quarter of the archive, not for every chunk.
 constexpr std::uint64_t kDownloadReportSteps = 4;
@@ -124,6 +128,21 @@ std::string uniqueSuffix() {
     return text;
 }
 
+// Staging left by a process that ended mid-download. Downloads run one at a time on the worker,
+// so no staging name present now belongs to a running one.
+void removeAbandonedStaging(const std::string& cacheDirectory) {
+    std::vector<std::string> names;
+    if (payload::readDirectoryNames(cacheDirectory, names) != 0) {
+        return;
+    }
+    for (const std::string& name : names) {
+        if (name.starts_with(".") &&
+            (name.ends_with(kStagedArchiveSuffix) || name.ends_with(kStagedExtractionSuffix))) {
+            payload::removeItemTree(cacheDirectory + "/" + name);
+        }
+    }
+}
+
 payload::ExtractionLimits extractionLimits(const AssetLimits& limits) {
     return {limits.maxExpandedBytes, limits.maxArchiveEntries, limits.freeSpaceReserveBytes, true};
 }
@@ -134,7 +153,8 @@ AssetCacheLocation AssetCacheLocation::forDownload(const std::string& typeCacheD
                                                    const CatalogEntry& entry) {
     std::string name = entry.archiveSHA256 + "-" + uniqueSuffix();
     std::string base = typeCacheDirectory + "/";
-    return {base + name, base + "." + name + ".download", base + "." + name + ".extracting"};
+    return {base + name, base + "." + name + kStagedArchiveSuffix,
+            base + "." + name + kStagedExtractionSuffix};
 }
 
 std::optional<std::string> downloadAndInstallAsset(const CatalogEntry& entry,
@@ -146,6 +166,7 @@ std::optional<std::string> downloadAndInstallAsset(const CatalogEntry& entry,
     if (int error = payload::createDirectoryAt(cacheDirectory, 0755, true)) {
         return errnoText("create", cacheDirectory, error);
     }
+    removeAbandonedStaging(cacheDirectory);
     StagedPath archive(location.archiveFile);
     {
         UniqueFd fd(::open(archive.path().c_str(),
@@ -160,9 +181,11 @@ std::optional<std::string> downloadAndInstallAsset(const CatalogEntry& entry,
     report(progress(kAssetOperationInstalling));
     StagedPath extraction(location.extractionDirectory);
     // The installer copies the extracted tree next: the extraction keeps room for that copy.
+    std::string whyNot;
     if (!payload::extractArchive(archive.path(), extraction.path(),
-                                 payload::ExtractionSafety::PathSafe, extractionLimits(limits))) {
-        return "the archive could not be extracted whole";
+                                 payload::ExtractionSafety::PathSafe, extractionLimits(limits),
+                                 &whyNot)) {
+        return whyNot;
     }
     if (::rename(extraction.path().c_str(), location.directory.c_str()) != 0) {
         return errnoText("install into", location.directory, errno);

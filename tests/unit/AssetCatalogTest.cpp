@@ -580,15 +580,19 @@ TEST_F(AssetCatalogTest, TricklingServersAreCutOff) {
     EXPECT_EQ(logLinesContaining("cannot fetch it"), 1u);
 }
 
-// Two downloads of one asset never share files: purging one leaves the other's in place.
-TEST_F(AssetCatalogTest, OverlappingDownloadsOfOneAssetKeepTheirOwnDirectories) {
+// Two downloads of one asset never share files: purging one leaves the other's in place. Staging
+// that an ended process left behind is cleared by the next download.
+TEST_F(AssetCatalogTest, DownloadsOfOneAssetKeepTheirOwnDirectories) {
     test::makeBundle(work / "b/Default.bundle", "1.0", {{"a.plist", "one"}});
     tool({"publish", work / "out", "--key", work / "secret.key", work / "b/Default.bundle"});
     writeSettings(publicKey);
     std::shared_ptr<Asset> first = onlyAsset();
     std::shared_ptr<Asset> second = onlyAsset();
     ASSERT_TRUE(first && second);
+    writeText(typeCache() + "/.abandoned.extracting/a.plist", "old");
+    writeText(typeCache() + "/.abandoned.download", "old");
     ASSERT_EQ(download(first).back(), kAssetOperationCompleted);
+    EXPECT_EQ(cachedAssetEntries().size(), 1u);
     ASSERT_EQ(download(second).back(), kAssetOperationCompleted);
     ASSERT_TRUE(first->localURL() && second->localURL());
     EXPECT_NE(*first->localURL(), *second->localURL());
