@@ -47,15 +47,16 @@ int replyBoolean(sd_bus_message* message, bool answer) {
     return sd_bus_reply_method_return(message, "b", answer ? 1 : 0);
 }
 
-// Runs one operation for the call; whatever it throws leaves the answer at its "no" value.
+// Runs one operation for the call; if it throws, the answer is the fallback, its "no" value.
 template <typename Answer, typename Operation>
 Answer answerOf(const char* request, TXManagerServer& server, sd_bus_message* message,
-                Answer answer, Operation&& operation) {
-    containExceptions(request, [&] {
+                const Answer& fallback, Operation&& operation) {
+    Answer answer = fallback;
+    const bool completed = containExceptions(request, [&] {
         MessageScope scope(server, message);
         operation(answer);
     });
-    return answer;
+    return completed ? answer : fallback;
 }
 
 int handleSetTavrixID(sd_bus_message* message, void* userdata, sd_bus_error* error) {
@@ -70,16 +71,16 @@ int handleSetTavrixID(sd_bus_message* message, void* userdata, sd_bus_error* err
         return sd_bus_error_set(error, SD_BUS_ERROR_INVALID_ARGS,
                                 "The bundle must be an array of at most one byte array");
     }
-    bool answer = answerOf("Set Tavrix ID", server, message, false, [&](bool& answer) {
-        server.setTavrixID(tavrixID, bundle, [&](bool accepted) { answer = accepted; });
+    bool answer = answerOf("Set Tavrix ID", server, message, false, [&](bool& result) {
+        server.setTavrixID(tavrixID, bundle, [&](bool accepted) { result = accepted; });
     });
     return replyBoolean(message, answer);
 }
 
 int handleIsTavrixBundleSupported(sd_bus_message* message, void* userdata, sd_bus_error*) {
     auto& server = *static_cast<TXManagerServer*>(userdata);
-    bool answer = answerOf("Is Tavrix Bundle Supported", server, message, false, [&](bool& answer) {
-        server.isTavrixBundleSupported([&](bool supported) { answer = supported; });
+    bool answer = answerOf("Is Tavrix Bundle Supported", server, message, false, [&](bool& result) {
+        server.isTavrixBundleSupported([&](bool supported) { result = supported; });
     });
     return replyBoolean(message, answer);
 }
@@ -104,9 +105,9 @@ int handleCopyTavrixValue(sd_bus_message* message, void* userdata, sd_bus_error*
     containExceptions("Copy Tavrix Value", [&] {
         auto answer = answerOf(
             "Copy Tavrix Value", server, message, std::optional<plist::Value>(),
-            [&](std::optional<plist::Value>& answer) {
+            [&](std::optional<plist::Value>& result) {
                 server.copyTavrixValue(
-                    key, [&](std::optional<plist::Value> value) { answer = std::move(value); });
+                    key, [&](std::optional<plist::Value> value) { result = std::move(value); });
             });
         replyMessage = valueReply(message, answer);
         if (!replyMessage && answer) {
@@ -128,8 +129,8 @@ int handleCopyTavrixValue(sd_bus_message* message, void* userdata, sd_bus_error*
 int handleCheckForTavrixBundleUpdate(sd_bus_message* message, void* userdata, sd_bus_error*) {
     auto& server = *static_cast<TXManagerServer*>(userdata);
     bool answer =
-        answerOf("Check For Tavrix Bundle Update", server, message, false, [&](bool& answer) {
-            server.checkForTavrixBundleUpdate([&](bool started) { answer = started; });
+        answerOf("Check For Tavrix Bundle Update", server, message, false, [&](bool& result) {
+            server.checkForTavrixBundleUpdate([&](bool started) { result = started; });
         });
     return replyBoolean(message, answer);
 }
@@ -141,8 +142,8 @@ int handleSetClientType(sd_bus_message* message, void* userdata, sd_bus_error* e
     if (r < 0) {
         return invalidArguments(error, r);
     }
-    bool answer = answerOf("Set Client Type", server, message, false, [&](bool& answer) {
-        server.setClientType(type, [&](bool known) { answer = known; });
+    bool answer = answerOf("Set Client Type", server, message, false, [&](bool& result) {
+        server.setClientType(type, [&](bool known) { result = known; });
     });
     return replyBoolean(message, answer);
 }
