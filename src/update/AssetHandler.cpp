@@ -218,18 +218,24 @@ bool AssetHandler::installDownloadedBundle(const std::string& source) {
                    source.c_str(), static_cast<unsigned long long>(needed));
         return false;
     }
-    if (!writePendingInstall(source) || !copyDownloadedBundle(source, destination)) {
+    if (!writePendingInstall({source, false})) {
         return false;
     }
+    const bool copied = copyDownloadedBundle(source, destination);
     auto behaviorID = copyBehaviorPreference(kTavrixIDKey);
-    if (!behaviorID || !behaviorID->isString()) {
+    if (!copied) {
+        // The old bundle stands as it was.
+    } else if (!behaviorID || !behaviorID->isString()) {
         logObjectFormat("Behavior ID is not set yet in the preferences, no action is being taken");
-        return true;
+    } else {
+        logCFormat("Behavior ID %s is already sent, redoing bundle match\n",
+                   behaviorID->asString()->c_str());
+        bundles.resetBehaviorBundle(*behaviorID->asString());
     }
-    logCFormat("Behavior ID %s is already sent, redoing bundle match\n",
-               behaviorID->asString()->c_str());
-    bundles.resetBehaviorBundle(*behaviorID->asString());
-    return true;
+    // From here on a crash leaves only the purge to do: a purge cut short leaves part of the
+    // download, which must never be installed.
+    writePendingInstall({source, true});
+    return copied;
 }
 
 bool AssetHandler::copyDownloadedBundle(const std::string& source, const std::string& destination) {
@@ -270,21 +276,21 @@ bool AssetHandler::copyDownloadedBundle(const std::string& source, const std::st
 }
 
 void AssetHandler::resumeInterruptedInstall() {
-    std::optional<std::string> asset = readPendingInstall();
-    if (!asset) {
+    std::optional<PendingInstall> pending = readPendingInstall();
+    if (!pending) {
         return;
     }
-    if (payload::itemKind(*asset) != payload::ItemKind::Directory) {
+    const std::string& asset = pending->assetDirectory;
+    if (!pending->installed && payload::itemKind(asset) == payload::ItemKind::Directory) {
+        logCFormat("Completing the interrupted install of %s\n", asset.c_str());
+        installDownloadedBundle(asset);
+    } else if (!pending->installed) {
         logCFormat("The interrupted install of %s cannot be completed: the download is gone\n",
-                   asset->c_str());
-        removePendingInstall();
-        return;
+                   asset.c_str());
     }
-    logCFormat("Completing the interrupted install of %s\n", asset->c_str());
-    installDownloadedBundle(*asset);
-    payload::removeItemTree(*asset);
+    payload::removeItemTree(asset);
     removePendingInstall();
-    logCFormat("Purged the download %s of the interrupted install\n", asset->c_str());
+    logCFormat("Purged the download %s of the interrupted install\n", asset.c_str());
 }
 
 }  // namespace tavrix

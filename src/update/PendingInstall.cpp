@@ -15,6 +15,7 @@ namespace {
 constexpr const char* kStateDirectory = "/var/lib/tavrixservicesd";
 constexpr const char* kMarkerFileName = "pending-install.plist";
 constexpr const char* kAssetDirectoryKey = "AssetDirectory";
+constexpr const char* kInstalledKey = "Installed";
 constexpr mode_t kStateDirectoryMode = 0755;
 constexpr mode_t kMarkerMode = 0600;
 
@@ -24,12 +25,14 @@ std::string pendingInstallMarkerPath() {
     return platform::resolvePath(kStateDirectory) + "/" + kMarkerFileName;
 }
 
-bool writePendingInstall(const std::string& assetDirectory) {
+bool writePendingInstall(const PendingInstall& install) {
+    const std::string& assetDirectory = install.assetDirectory;
     const std::string directory = platform::resolvePath(kStateDirectory);
     int error = payload::createDirectoryAt(directory, kStateDirectoryMode, true);
     if (error == 0) {
         const std::string xml = plist::serialize(
-            plist::Value(plist::Dictionary{{kAssetDirectoryKey, plist::Value(assetDirectory)}}),
+            plist::Value(plist::Dictionary{{kAssetDirectoryKey, plist::Value(assetDirectory)},
+                                           {kInstalledKey, plist::Value(install.installed)}}),
             plist::Format::Xml);
         error = platform::replaceFileAtomically(pendingInstallMarkerPath(), xml, kMarkerMode);
     }
@@ -41,7 +44,7 @@ bool writePendingInstall(const std::string& assetDirectory) {
     return true;
 }
 
-std::optional<std::string> readPendingInstall() {
+std::optional<PendingInstall> readPendingInstall() {
     std::optional<plist::Value> marker = plist::readFile(pendingInstallMarkerPath());
     const plist::Dictionary* values = marker ? marker->asDictionary() : nullptr;
     if (values == nullptr) {
@@ -51,7 +54,9 @@ std::optional<std::string> readPendingInstall() {
     if (directory == values->end() || directory->second.asString() == nullptr) {
         return std::nullopt;
     }
-    return *directory->second.asString();
+    auto installed = values->find(kInstalledKey);
+    const bool* flag = installed != values->end() ? installed->second.asBoolean() : nullptr;
+    return PendingInstall{*directory->second.asString(), flag != nullptr && *flag};
 }
 
 void removePendingInstall() {

@@ -1,6 +1,8 @@
 // The durable note of an over-the-air install under way: written before the old user bundle is
-// removed and removed once the new one is matched and its download purged, so that an install cut
-// short by a crash or power loss is completed at the next launch from the download still cached.
+// removed, marked installed once the install has run (the new one in place and matched, or its
+// copy failed), and removed once the download is purged. At the next launch after a crash or power
+// loss, an install not yet marked is completed from the download still cached, and a marked one
+// has its download purged (a purge cut short leaves part of it, which must never be installed).
 #pragma once
 
 #include <optional>
@@ -8,14 +10,19 @@
 
 namespace tavrix {
 
+struct PendingInstall {
+    std::string assetDirectory;
+    bool installed = false;
+};
+
 // "<root>/var/lib/tavrixservicesd/pending-install.plist".
 std::string pendingInstallMarkerPath();
 
-// Records that the asset in assetDirectory is being installed (flushed to disk before it
-// answers). False, logged, when it cannot be written.
-bool writePendingInstall(const std::string& assetDirectory);
-// The asset directory of an install that did not finish, or nothing.
-std::optional<std::string> readPendingInstall();
+// Records the install's state (flushed to disk before it answers). False, logged, when it cannot
+// be written.
+bool writePendingInstall(const PendingInstall& install);
+// The install that did not finish, or nothing.
+std::optional<PendingInstall> readPendingInstall();
 void removePendingInstall();
 
 }  // namespace tavrix
