@@ -3,12 +3,12 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include "plist/PropertyListFormat.h"
+#include "util/PropertyListFile.h"
 
 namespace tavrix {
 
 std::optional<plist::Value> BundleDirectory::copyInfoValue(std::string_view key) const {
-    std::optional<plist::Value> info = plist::readFile(path_ + "/" + kBundleInfoFileName);
+    std::optional<plist::Value> info = readPropertyListFile(path_ + "/" + kBundleInfoFileName);
     if (!info) {
         return std::nullopt;
     }

@@ -14,6 +14,7 @@
 #include <system_error>
 
 #include "plist/PropertyListFormat.h"
+#include "util/PropertyListFile.h"
 #include "util/UniqueFd.h"
 
 namespace tavrix::payload {
@@ -493,7 +494,7 @@ char* copyCStringFromString(const CStringAllocator& allocator, std::string_view 
 }
 
 std::optional<plist::Value> loadDictionaryAtPath(const std::string& path) {
-    auto value = plist::readFile(path);
+    auto value = readPropertyListFile(path);
     if (!value || !value->isDictionary()) {
         return std::nullopt;
     }
