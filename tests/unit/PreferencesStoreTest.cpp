@@ -341,7 +341,7 @@ TEST_F(BehaviorPreferencesTest, SetValueIsOnDiskForAFreshProcess) {
 }
 
 TEST_F(BehaviorPreferencesTest, KeysKeepTheirTypesAndNothingRemoves) {
-    Value next(plist::Date::fromUnixTime(1700000000.5));
+    Value next(plist::Date::fromUnixTime(1700000000));
     ASSERT_TRUE(setBehaviorPreference(kNextUpdateKey, next));
     ASSERT_TRUE(setBehaviorPreference(kEnableSupportKey, Value(false)));
     EXPECT_EQ(copyBehaviorPreference(kNextUpdateKey), next);
