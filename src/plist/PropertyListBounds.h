@@ -18,7 +18,7 @@ inline constexpr std::size_t kMaxPropertyListBytes = 16 * 1024 * 1024;
 inline constexpr std::size_t kMaxPropertyListDepth = 512;
 // Most nodes (dictionary keys included) one document may become, every shared binary object
 // counted each time it is referenced.
-inline constexpr std::size_t kMaxPropertyListNodes = 1024 * 1024;
+inline constexpr std::size_t kMaxPropertyListNodes = 256 * 1024;
 // Most string and data bytes one binary document may become, shared objects counted the same way.
 inline constexpr std::size_t kMaxPropertyListPayloadBytes = 64 * 1024 * 1024;
 
