@@ -22,18 +22,21 @@ int usage() {
 int main(int argc, char** argv) {
     using namespace tavrix::plist;
     if (argc == 2 && std::strcmp(argv[1], "--help") != 0) {
-        auto value = readFile(argv[1]);
+        Refusal refusal;
+        auto value = readFile(argv[1], &refusal);
         if (!value) {
-            std::fprintf(stderr, "tavrix-plist: %s is missing or not a property list\n", argv[1]);
+            std::fprintf(stderr, "tavrix-plist: %s: %s\n", argv[1], refusal.reason.c_str());
             return 1;
         }
         std::printf("%s\n", value->description().c_str());
         return 0;
     }
-    if (argc == 4 && (std::strcmp(argv[1], "--xml") == 0 || std::strcmp(argv[1], "--binary") == 0)) {
-        auto value = readFile(argv[2]);
+    if (argc == 4 &&
+        (std::strcmp(argv[1], "--xml") == 0 || std::strcmp(argv[1], "--binary") == 0)) {
+        Refusal refusal;
+        auto value = readFile(argv[2], &refusal);
         if (!value) {
-            std::fprintf(stderr, "tavrix-plist: %s is missing or not a property list\n", argv[2]);
+            std::fprintf(stderr, "tavrix-plist: %s: %s\n", argv[2], refusal.reason.c_str());
             return 1;
         }
         Format format = argv[1][2] == 'x' ? Format::Xml : Format::Binary;

@@ -3,12 +3,19 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include "plist/PropertyListFormat.h"
+#include <cerrno>
+
+#include "util/PropertyListFile.h"
 
 namespace tavrix {
 
-std::optional<plist::Value> BundleDirectory::copyInfoValue(std::string_view key) const {
-    std::optional<plist::Value> info = plist::readFile(path_ + "/" + kBundleInfoFileName);
+std::string BundleDirectory::infoPath() const {
+    return path_ + "/" + kBundleInfoFileName;
+}
+
+std::optional<plist::Value> BundleDirectory::copyInfoValue(std::string_view key,
+                                                           plist::Refusal* refusal) const {
+    std::optional<plist::Value> info = plist::readFile(infoPath(), refusal);
     if (!info) {
         return std::nullopt;
     }
@@ -24,6 +31,18 @@ std::optional<BundleDirectory> createBundleAtPath(const std::string& path) {
     return BundleDirectory(path);
 }
 
+namespace {
+
+// A refused Info dictionary is logged once per request, after the last attempt; a missing one is
+// not (a bundle being installed has none yet).
+void logInfoRefusal(const BundleDirectory& bundle, const plist::Refusal& refusal) {
+    if (!refusal.reason.empty() && refusal.error != ENOENT) {
+        logPropertyListRefusal(bundle.infoPath(), refusal, "ignoring it");
+    }
+}
+
+}  // namespace
+
 std::optional<plist::Value> copyBundleInfoValue(const std::string& path, std::string_view key) {
     for (int attempt = 0; attempt < kBundleInfoRetryCount; ++attempt) {
         // Created afresh each time: the bundle may appear or change between attempts.
@@ -31,8 +50,12 @@ std::optional<plist::Value> copyBundleInfoValue(const std::string& path, std::st
         if (!bundle) {
             return std::nullopt;
         }
-        if (auto value = bundle->copyInfoValue(key)) {
+        plist::Refusal refusal;
+        if (auto value = bundle->copyInfoValue(key, &refusal)) {
             return value;
+        }
+        if (attempt + 1 == kBundleInfoRetryCount) {
+            logInfoRefusal(*bundle, refusal);
         }
         ::usleep(kBundleInfoRetryDelayMicroseconds);
     }
@@ -52,7 +75,9 @@ std::optional<std::string> copyBundleIdentifierAtPath(const std::string& path) {
     if (!bundle) {
         return std::nullopt;
     }
-    std::optional<plist::Value> value = bundle->copyInfoValue(kBundleIdentifierKey);
+    plist::Refusal refusal;
+    std::optional<plist::Value> value = bundle->copyInfoValue(kBundleIdentifierKey, &refusal);
+    logInfoRefusal(*bundle, refusal);
     if (!value || !value->isString()) {
         return std::nullopt;
     }

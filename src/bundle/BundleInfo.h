@@ -7,6 +7,7 @@
 #include <string_view>
 #include <utility>
 
+#include "plist/PropertyListFormat.h"
 #include "plist/Value.h"
 
 namespace tavrix {
@@ -26,8 +27,11 @@ class BundleDirectory {
     explicit BundleDirectory(std::string path) : path_(std::move(path)) {}
 
     const std::string& path() const { return path_; }
-    // The Info dictionary's value for key; nothing when the dictionary or the key is missing.
-    std::optional<plist::Value> copyInfoValue(std::string_view key) const;
+    std::string infoPath() const;
+    // The Info dictionary's value for key; nothing when the dictionary or the key is missing
+    // (refusal then says why the dictionary was not read, if it was not).
+    std::optional<plist::Value> copyInfoValue(std::string_view key,
+                                              plist::Refusal* refusal = nullptr) const;
 
   private:
     std::string path_;

@@ -17,6 +17,7 @@
 
 #include "platform/AtomicFile.h"
 #include "plist/PropertyListFormat.h"
+#include "util/PropertyListFile.h"
 #include "util/UniqueFd.h"
 
 namespace tavrix::payload {
@@ -551,7 +552,7 @@ char* copyCStringFromString(const CStringAllocator& allocator, std::string_view 
 }
 
 std::optional<plist::Value> loadDictionaryAtPath(const std::string& path) {
-    auto value = plist::readFile(path);
+    auto value = readPropertyListFile(path);
     if (!value || !value->isDictionary()) {
         return std::nullopt;
     }

@@ -63,8 +63,13 @@ std::optional<std::vector<CatalogEntry>> readCatalogEntries(std::string_view byt
                                                             const std::string& catalogURL,
                                                             std::string_view assetType,
                                                             std::string& whyNot) {
-    std::optional<plist::Value> catalog = plist::parse(bytes);
-    if (!catalog || !catalog->isDictionary()) {
+    plist::Refusal refusal;
+    std::optional<plist::Value> catalog = plist::parse(bytes, &refusal);
+    if (!catalog) {
+        whyNot = "it is not a property list: " + refusal.reason;
+        return std::nullopt;
+    }
+    if (!catalog->isDictionary()) {
         whyNot = "it is not a property-list dictionary";
         return std::nullopt;
     }

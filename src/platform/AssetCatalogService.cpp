@@ -45,7 +45,7 @@ std::optional<AssetTypeSettings> AssetCatalogService::settingsFor(std::string_vi
     if (snapshot.state == plist::CachedPropertyListFile::State::Missing) {
         reason = "there is no settings file";
     } else if (snapshot.state == plist::CachedPropertyListFile::State::Damaged) {
-        reason = "the settings file is not a property list";
+        reason = "the settings file is not a property list: " + snapshot.refusal.reason;
     } else {
         settings = parseAssetTypeSettings(*snapshot.value, assetType, reason);
     }

@@ -17,6 +17,7 @@
 #include "plist/PropertyListFormat.h"
 #include "util/ContainExceptions.h"
 #include "util/Log.h"
+#include "util/PropertyListFile.h"
 
 namespace tavrix::platform {
 namespace {
@@ -170,9 +171,13 @@ void BackgroundJobScheduler::load() {
         }
         return;
     }
-    auto bytes = plist::readFileBytes(filePath_);
-    auto contents = bytes ? plist::parse(*bytes) : std::nullopt;
-    if (!contents || !contents->isDictionary()) {
+    plist::Refusal refusal;
+    auto contents = plist::readFile(filePath_, &refusal);
+    if (!contents) {
+        logPropertyListRefusal(filePath_, refusal, "starting with no jobs");
+        return;
+    }
+    if (!contents->isDictionary()) {
         logCFormat("Background jobs: %s is damaged or not a list of jobs; starting with no jobs",
                    filePath_.c_str());
         return;

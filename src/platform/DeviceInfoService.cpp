@@ -6,6 +6,7 @@
 #include "platform/RunningSystemFacts.h"
 #include "plist/CachedPropertyListFile.h"
 #include "util/Log.h"
+#include "util/PropertyListFile.h"
 
 namespace tavrix::platform {
 namespace {
@@ -21,8 +22,7 @@ std::shared_ptr<const plist::Value> currentTable() {
     auto snapshot = tableFile().read();
     if (snapshot.state == plist::CachedPropertyListFile::State::Damaged) {
         if (snapshot.freshlyRead) {
-            logCFormat("Device information table %s is damaged; ignoring it",
-                       tableFile().path().c_str());
+            logPropertyListRefusal(tableFile().path(), snapshot.refusal, "ignoring it");
         }
         return nullptr;
     }

@@ -15,10 +15,13 @@
 #include "plist/CachedPropertyListFile.h"
 #include "plist/PropertyListFormat.h"
 #include "util/Log.h"
+#include "util/PropertyListFile.h"
 #include "util/UniqueFd.h"
 
 namespace tavrix::platform {
 namespace {
+
+const plist::Refusal kNotADictionary{0, "it is not a dictionary"};
 
 constexpr std::string_view kPreferencesDirectory = "/Library/Preferences";
 constexpr std::string_view kExtension = ".plist";
@@ -279,7 +282,7 @@ std::optional<plist::Value> PreferencesStore::copyValue(std::string_view key,
     }
     if (snapshot.value == nullptr || !snapshot.value->isDictionary()) {
         if (snapshot.freshlyRead) {
-            logDamage(*state);
+            logDamage(*state, snapshot.value == nullptr ? snapshot.refusal : kNotADictionary);
         }
         return std::nullopt;
     }
@@ -368,16 +371,16 @@ bool PreferencesStore::writePending(Domain& domain) {
             logCFormat("Preferences: %s is not a regular file", target->c_str());
             return false;
         }
-        auto bytes = plist::readFileBytes(*target);
-        if (!bytes) {
-            logFailure("read", *target, errno);
+        plist::Refusal refusal;
+        auto current = plist::readFile(*target, &refusal);
+        if (!current && refusal.error != 0) {
+            logFailure("read", *target, refusal.error);
             return false;
         }
-        auto current = plist::parse(*bytes);
         if (current && current->isDictionary()) {
             contents = std::move(*current->asDictionary());
         } else {
-            logDamage(domain);
+            logDamage(domain, current ? kNotADictionary : refusal);
         }
     } else if (errno != ENOENT) {
         logFailure("examine", *target, errno);
@@ -399,13 +402,13 @@ bool PreferencesStore::writePending(Domain& domain) {
     return replaceFile(*target, bytes);
 }
 
-void PreferencesStore::logDamage(Domain& domain) {
+void PreferencesStore::logDamage(Domain& domain, const plist::Refusal& refusal) {
     auto version = versionOf(domain.path);
     if (version && domain.loggedDamage == version) {
         return;
     }
     domain.loggedDamage = version;
-    logCFormat("Preferences file %s is damaged; reading it as empty", domain.path.c_str());
+    logPropertyListRefusal(domain.path, refusal, "reading it as empty");
 }
 
 }  // namespace tavrix::platform

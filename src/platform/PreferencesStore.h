@@ -16,6 +16,7 @@
 #include <string>
 #include <string_view>
 
+#include "plist/PropertyListFormat.h"
 #include "plist/Value.h"
 
 namespace tavrix::platform {
@@ -52,7 +53,7 @@ class PreferencesStore {
     Domain* domainFor(std::string_view domain, std::string_view user);
     bool writePending(Domain& domain);
     // Logs that the domain's file is damaged, once per version of the file.
-    void logDamage(Domain& domain);
+    void logDamage(Domain& domain, const plist::Refusal& refusal);
 
     std::mutex mutex_;
     std::map<std::string, UserDomains, std::less<>> users_;

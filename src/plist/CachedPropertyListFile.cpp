@@ -21,21 +21,22 @@ CachedPropertyListFile::Snapshot CachedPropertyListFile::read() {
     }
     std::lock_guard lock(mutex_);
     if (cached_ && current == identity_) {
-        return {state_, value_, false};
+        return {state_, value_, false, refusal_};
     }
     cached_ = true;
     identity_ = current;
     value_.reset();
+    refusal_ = {};
     if (current.size < 0) {
         state_ = State::Missing;
-        return {state_, nullptr, true};
+        return {state_, nullptr, true, refusal_};
     }
-    auto parsed = readFile(path_);
+    auto parsed = readFile(path_, &refusal_);
     state_ = parsed ? State::Valid : State::Damaged;
     if (parsed) {
         value_ = std::make_shared<const Value>(std::move(*parsed));
     }
-    return {state_, value_, true};
+    return {state_, value_, true, refusal_};
 }
 
 void CachedPropertyListFile::invalidate() {

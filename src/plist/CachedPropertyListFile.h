@@ -10,7 +10,7 @@
 #include <mutex>
 #include <string>
 
-#include "plist/Value.h"
+#include "plist/PropertyListFormat.h"
 
 namespace tavrix::plist {
 
@@ -24,6 +24,8 @@ class CachedPropertyListFile {
         std::shared_ptr<const Value> value;
         // True when this read parsed the file (the first read of a new version of it).
         bool freshlyRead = false;
+        // Why the file is Damaged.
+        plist::Refusal refusal;
     };
 
     explicit CachedPropertyListFile(std::string path);
@@ -51,6 +53,7 @@ class CachedPropertyListFile {
     Identity identity_;
     State state_ = State::Missing;
     std::shared_ptr<const Value> value_;
+    Refusal refusal_;
 };
 
 }  // namespace tavrix::plist

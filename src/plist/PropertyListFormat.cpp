@@ -5,6 +5,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cctype>
 #include <cerrno>
 #include <cmath>
@@ -35,10 +36,10 @@ struct MallocDeleter {
     void operator()(char* buffer) const { std::free(buffer); }
 };
 
-// Deeper documents are refused rather than risking the stack on hostile input.
-constexpr int kMaxDepth = 512;
-// libplist takes 32-bit lengths.
-constexpr std::size_t kMaxInputBytes = std::numeric_limits<std::uint32_t>::max();
+// The tree walks below stop here too, whatever the bounds check let through.
+constexpr int kMaxDepth = static_cast<int>(kMaxPropertyListDepth);
+static_assert(kMaxPropertyListBytes <= std::numeric_limits<std::uint32_t>::max(),
+              "libplist takes 32-bit lengths");
 constexpr std::int64_t kMicrosPerSecond = 1000000;
 
 // libplist 2.2 keeps whole seconds of XML dates only; the fractions are taken from the date texts,
@@ -283,17 +284,15 @@ class NodeReader {
     std::size_t nextDate_ = 0;
 };
 
-// Builds libplist's tree; records the microsecond fraction of every date in document order so the
-// XML writer can put them back.
+// Builds libplist's tree.
 class NodeWriter {
   public:
-    // With wholeSecondDates, dates go to libplist without their fractions (its XML writer mangles
-    // fractions of dates before the reference date); the fractions are patched in afterwards.
+    // With wholeSecondDates, dates go to libplist without their fractions: XML readers elsewhere
+    // refuse fractional seconds, and libplist's XML writer mangles fractions of dates before the
+    // reference date.
     explicit NodeWriter(bool wholeSecondDates) : wholeSecondDates_(wholeSecondDates) {}
 
     Node write(const Value& value) { return Node(build(value)); }
-    const std::vector<std::int64_t>& dateFractions() const { return dateFractions_; }
-    bool hasFractionalDate() const { return hasFractionalDate_; }
 
   private:
     plist_t build(const Value& value) {
@@ -363,15 +362,11 @@ class NodeWriter {
             fraction += kMicrosPerSecond;
             seconds -= 1;
         }
-        dateFractions_.push_back(fraction);
-        hasFractionalDate_ = hasFractionalDate_ || fraction != 0;
         return plist_new_date(static_cast<int32_t>(seconds),
                               wholeSecondDates_ ? 0 : static_cast<int32_t>(fraction));
     }
 
     bool wholeSecondDates_;
-    std::vector<std::int64_t> dateFractions_;
-    bool hasFractionalDate_ = false;
 };
 
 // libplist's XML carries a DOCTYPE naming an outside document; a property list needs none.
@@ -391,47 +386,8 @@ void removeDoctype(std::string& xml) {
     xml.erase(start, end - start);
 }
 
-// Puts the fractions back into the date texts, which libplist writes as whole seconds.
-std::string insertDateFractions(std::string_view xml, const std::vector<std::int64_t>& fractions) {
-    static constexpr std::string_view kOpen = "<date>";
-    std::string out;
-    out.reserve(xml.size() + fractions.size() * 7);
-    std::size_t copied = 0;
-    std::size_t index = 0;
-    for (std::size_t at = xml.find(kOpen); at != std::string_view::npos && index < fractions.size();
-         at = xml.find(kOpen, at)) {
-        std::size_t zone = xml.find("Z</date>", at);
-        if (zone == std::string_view::npos) {
-            break;
-        }
-        std::int64_t fraction = fractions[index++];
-        at = zone;
-        if (fraction == 0) {
-            continue;
-        }
-        out.append(xml.substr(copied, zone - copied));
-        char digits[16];
-        std::snprintf(digits, sizeof digits, ".%06lld", static_cast<long long>(fraction));
-        std::string_view text(digits);
-        while (text.back() == '0') {
-            text.remove_suffix(1);
-        }
-        out.append(text);
-        copied = zone;
-    }
-    out.append(xml.substr(copied));
-    return out;
-}
-
-// A binary file can hold a key or string with a NUL inside. libplist reads such a key only by
-// failing an assertion, which would end the process; its XML writer does copy the whole key, so a
-// NUL in that text gives the damage away before any key is read.
-bool hasEmbeddedNul(plist_t root) {
-    char* xml = nullptr;
-    uint32_t length = 0;
-    plist_to_xml(root, &xml, &length);
-    std::unique_ptr<char, XmlBufferDeleter> owned(xml);
-    return xml == nullptr || std::memchr(xml, '\0', length) != nullptr;
+std::string tooLarge() {
+    return "it is larger than " + std::to_string(kMaxPropertyListBytes) + " bytes";
 }
 
 bool endsWithClosingTag(std::string_view xml) {
@@ -444,23 +400,32 @@ bool endsWithClosingTag(std::string_view xml) {
 
 }  // namespace
 
-std::optional<Value> parse(std::string_view bytes) {
-    if (bytes.empty() || bytes.size() > kMaxInputBytes) {
+std::optional<Value> parse(std::string_view bytes, Refusal* refusal) {
+    auto refuse = [refusal](std::string reason) -> std::optional<Value> {
+        if (refusal != nullptr) {
+            *refusal = Refusal{0, std::move(reason)};
+        }
         return std::nullopt;
+    };
+    if (bytes.empty()) {
+        return refuse("it is empty");
     }
-    plist_t raw = nullptr;
+    if (bytes.size() > kMaxPropertyListBytes) {
+        return refuse(tooLarge());
+    }
     bool binary = plist_is_binary(bytes.data(), static_cast<uint32_t>(bytes.size())) != 0;
     // libplist accepts a document cut off before its closing tag; a truncated file is no value.
     if (!binary && !endsWithClosingTag(bytes)) {
-        return std::nullopt;
+        return refuse("it is not a complete XML property list");
     }
+    if (auto why = binary ? checkBinaryBounds(bytes) : checkXmlBounds(bytes)) {
+        return refuse(std::move(*why));
+    }
+    plist_t raw = nullptr;
     plist_from_memory(bytes.data(), static_cast<uint32_t>(bytes.size()), &raw);
     Node root(raw);
     if (!root) {
-        return std::nullopt;
-    }
-    if (binary && hasEmbeddedNul(root.get())) {
-        return std::nullopt;
+        return refuse("it is not a property list");
     }
     std::vector<std::string_view> dateTexts;
     if (!binary) {
@@ -469,48 +434,74 @@ std::optional<Value> parse(std::string_view bytes) {
             dateTexts.clear();
         }
     }
-    return NodeReader(std::move(dateTexts)).read(root.get(), 0);
+    auto value = NodeReader(std::move(dateTexts)).read(root.get(), 0);
+    if (!value) {
+        return refuse("it holds text that is not UTF-8 or a damaged dictionary");
+    }
+    return value;
 }
 
-std::optional<std::string> readFileBytes(const std::string& path) {
-    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-    if (!fd) {
+std::optional<std::string> readFileBytes(const std::string& path, Refusal* refusal) {
+    auto refuse = [refusal](int error, std::string reason) -> std::optional<std::string> {
+        if (refusal != nullptr) {
+            *refusal = Refusal{error, std::move(reason)};
+        }
         return std::nullopt;
+    };
+    // Without O_NONBLOCK, opening a FIFO would wait for a writer for ever.
+    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
+    if (!fd) {
+        int error = errno;
+        return refuse(error, std::strerror(error));
     }
     struct stat info {};
-    if (::fstat(fd.get(), &info) != 0 || !S_ISREG(info.st_mode)) {
-        return std::nullopt;
+    if (::fstat(fd.get(), &info) != 0) {
+        int error = errno;
+        return refuse(error, std::strerror(error));
     }
-    std::string bytes;
-    bytes.resize(static_cast<std::size_t>(info.st_size));
+    if (!S_ISREG(info.st_mode)) {
+        return refuse(0, "it is not a regular file");
+    }
+    if (info.st_size < 0 || static_cast<std::uint64_t>(info.st_size) > kMaxPropertyListBytes) {
+        return refuse(0, tooLarge());
+    }
+    // One byte beyond the size tells a file that grew since fstat; growth is read in chunks up to
+    // one byte beyond the cap.
+    std::string bytes(static_cast<std::size_t>(info.st_size) + 1, '\0');
     std::size_t filled = 0;
     for (;;) {
         if (filled == bytes.size()) {
-            // The file may have grown since fstat.
-            bytes.resize(bytes.size() + 4096);
+            if (filled > kMaxPropertyListBytes) {
+                return refuse(0, tooLarge());
+            }
+            bytes.resize(std::min(filled + 65536, kMaxPropertyListBytes + 1));
         }
         ssize_t got = ::read(fd.get(), bytes.data() + filled, bytes.size() - filled);
         if (got < 0 && errno == EINTR) {
             continue;
         }
         if (got < 0) {
-            return std::nullopt;
+            int error = errno;
+            return refuse(error, std::strerror(error));
         }
         if (got == 0) {
             break;
         }
         filled += static_cast<std::size_t>(got);
     }
+    if (filled > kMaxPropertyListBytes) {
+        return refuse(0, tooLarge());
+    }
     bytes.resize(filled);
     return bytes;
 }
 
-std::optional<Value> readFile(const std::string& path) {
-    auto bytes = readFileBytes(path);
+std::optional<Value> readFile(const std::string& path, Refusal* refusal) {
+    auto bytes = readFileBytes(path, refusal);
     if (!bytes) {
         return std::nullopt;
     }
-    return parse(*bytes);
+    return parse(*bytes, refusal);
 }
 
 std::string serialize(const Value& value, Format format) {
@@ -531,9 +522,6 @@ std::string serialize(const Value& value, Format format) {
     }
     std::string text(xml, length);
     removeDoctype(text);
-    if (writer.hasFractionalDate()) {
-        return insertDateFractions(text, writer.dateFractions());
-    }
     return text;
 }
 

@@ -1,33 +1,46 @@
 // Reading and writing property lists in their XML and binary file formats.
-// All parsing and serialization is done by libplist; damaged input is "no value", never a crash.
+// All parsing and serialization is done by libplist; damaged or hostile input is "no value", never
+// a crash: files must be regular and at most kMaxPropertyListBytes long, and documents stay within
+// the limits of PropertyListBounds.h before libplist sees them.
 #pragma once
 
 #include <optional>
 #include <string>
 #include <string_view>
 
+#include "plist/PropertyListBounds.h"
 #include "plist/Value.h"
 
 namespace tavrix::plist {
 
 enum class Format { Xml, Binary };
 
+// Why a read answered no value.
+struct Refusal {
+    // The errno of a file that could not be opened or read (ENOENT: there is none), else 0.
+    int error = 0;
+    // For a log line: "it is not a regular file", "it nests deeper than 512 levels", ...
+    std::string reason;
+};
+
 // The value encoded in bytes (XML or binary, detected from the content), or nothing when the
-// bytes are not a complete property list.
-std::optional<Value> parse(std::string_view bytes);
+// bytes are not a complete property list or exceed the limits.
+std::optional<Value> parse(std::string_view bytes, Refusal* refusal = nullptr);
 
 // The value stored in the file at path (symbolic links followed), or nothing when the file is
-// missing, unreadable or not a property list.
-std::optional<Value> readFile(const std::string& path);
+// missing, not a regular file, too large, unreadable or not a property list.
+std::optional<Value> readFile(const std::string& path, Refusal* refusal = nullptr);
 
-// The value encoded in the given format. Dates keep microsecond fractions in both formats.
+// The value encoded in the given format. XML dates are whole seconds, as every reader of the
+// format expects; binary dates keep their fractions.
 std::string serialize(const Value& value, Format format = Format::Xml);
 
 // Writes the serialized value over the file at path (not atomically). False when the file
 // cannot be written.
 bool writeFile(const std::string& path, const Value& value, Format format = Format::Xml);
 
-// Reads the whole file into memory, or nothing when it cannot be read.
-std::optional<std::string> readFileBytes(const std::string& path);
+// Reads the whole of a regular file of at most kMaxPropertyListBytes into memory, or nothing.
+// Opening never blocks (a FIFO or device is refused, not waited on).
+std::optional<std::string> readFileBytes(const std::string& path, Refusal* refusal = nullptr);
 
 }  // namespace tavrix::plist

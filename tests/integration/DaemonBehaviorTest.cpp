@@ -103,7 +103,7 @@ TEST_F(DaemonBehaviorTest, BehaviorSettingsAreReadOnlyWhileSupported) {
         {"MaxRate", 42},
         {"Ratio", 0.25},
         {"Roaming", false},
-        {"Since", plist::Date{123456.5}},
+        {"Since", plist::Date{123456}},
         {"Token", plist::Data{0, 1, 2, 255}},
         {"Bands", plist::Array{"b1", 3}},
         {"Limits", plist::Dictionary{{"daily", 10}, {"note", ""}}},

@@ -165,7 +165,10 @@ TEST_F(BundleLocationsTest, FindBundleTakesTheNewerAndTheUserOneOnATie) {
     fs::remove_all(systemBundle());
     sink_.clear();
     EXPECT_FALSE(manager.findBundle(found));
-    EXPECT_THAT(lines(), ElementsAre("Could not find either of the bundle locations\n"));
+    EXPECT_THAT(lines(), ElementsAre("Property list " + userBundle() +
+                                         "/Info.plist refused: it is not a complete XML property "
+                                         "list; ignoring it",
+                                     "Could not find either of the bundle locations\n"));
 }
 
 TEST_F(BundleLocationsTest, WithoutAHomeNothingIsLinkedOrInstalledAnywhere) {

@@ -69,7 +69,8 @@ TEST_F(DeviceInfoTable, UnusableTableIsLoggedOncePerVersionAndAnswersNothing) {
     writeTableBytes("<?xml version=\"1.0\"?><plist><dict><key>DeviceClass</key>");
     EXPECT_EQ(copyDeviceStringAnswer("DeviceClass"), std::nullopt);
     EXPECT_EQ(copyDeviceAnswers({"DeviceClass", "ReleaseType"}), plist::Dictionary{});
-    std::string damaged = "Device information table " + tablePath() + " is damaged; ignoring it";
+    std::string damaged = "Property list " + tablePath() +
+                          " refused: it is not a complete XML property list; ignoring it";
     EXPECT_EQ(sink.messages(), std::vector<std::string>{damaged});
 
     sink.clear();

@@ -99,8 +99,9 @@ TEST_F(PreferencesStoreTest, EveryValueTypeSurvivesTheFileWhichIsXmlAndReadable)
                              {"large unsigned", Value(plist::Integer::fromUnsigned(UINT64_MAX))},
                              {"real", Value(2.5)},
                              {"false", Value(false)},
-                             {"date", Value(plist::Date{700000000.25})},
-                             {"early date", Value(plist::Date{-1000.5})},
+                             // Whole seconds: XML files hold no fractions.
+                             {"date", Value(plist::Date{700000000})},
+                             {"early date", Value(plist::Date{-1000})},
                              {"data", Value(plist::Data{0, 1, 0x7f, 0xff})},
                              {"nested", Value(nested)}};
     for (const auto& [key, value] : values) {
@@ -143,15 +144,19 @@ TEST_F(PreferencesStoreTest, ReadsAreCachedUntilSynchronize) {
 TEST_F(PreferencesStoreTest, DamagedFileReadsEmptyIsLoggedOncePerVersionAndIsRepaired) {
     const std::string domain = "test.damaged";
     const std::string path = domainPath(domain);
-    const std::string logLine = "Preferences file " + path + " is damaged; reading it as empty";
     std::string good = plist::serialize(Value(plist::Dictionary{{"old", Value(1)}}));
-    const std::vector<std::string> damaged = {
-        "not a property list at all", good.substr(0, good.size() / 2), std::string(),
-        plist::serialize(Value(plist::Array{Value("not"), Value("a dictionary")})),
-        std::string("\0\1\2", 3)};
+    const std::vector<std::pair<std::string, std::string>> damaged = {
+        {"not a property list at all", "it is not a complete XML property list"},
+        {good.substr(0, good.size() / 2), "it is not a complete XML property list"},
+        {std::string(), "it is empty"},
+        {plist::serialize(Value(plist::Array{Value("not"), Value("a dictionary")})),
+         "it is not a dictionary"},
+        {"bplist00" + std::string(40, '\0'), "its trailer is damaged"}};
 
-    for (const auto& bytes : damaged) {
+    for (const auto& [bytes, reason] : damaged) {
         SCOPED_TRACE(testing::PrintToString(bytes));
+        const std::string logLine =
+            "Property list " + path + " refused: " + reason + "; reading it as empty";
         test::writeText(path, bytes);
         ASSERT_TRUE(store.synchronize(domain, kUser));
         sink.clear();
@@ -336,7 +341,7 @@ TEST_F(BehaviorPreferencesTest, SetValueIsOnDiskForAFreshProcess) {
 }
 
 TEST_F(BehaviorPreferencesTest, KeysKeepTheirTypesAndNothingRemoves) {
-    Value next(plist::Date::fromUnixTime(1700000000.5));
+    Value next(plist::Date::fromUnixTime(1700000000));
     ASSERT_TRUE(setBehaviorPreference(kNextUpdateKey, next));
     ASSERT_TRUE(setBehaviorPreference(kEnableSupportKey, Value(false)));
     EXPECT_EQ(copyBehaviorPreference(kNextUpdateKey), next);

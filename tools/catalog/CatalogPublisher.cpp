@@ -62,8 +62,13 @@ std::optional<std::string> bundleVersion(const BundleToPublish& bundle, std::str
         return bundle.version;
     }
     std::string infoPath = (fs::path(bundle.directory) / kInfoFileName).string();
-    std::optional<plist::Value> info = plist::readFile(infoPath);
-    const plist::Value* version = info ? info->find(kBundleVersionKey) : nullptr;
+    plist::Refusal refusal;
+    std::optional<plist::Value> info = plist::readFile(infoPath, &refusal);
+    if (!info) {
+        error = infoPath + ": " + refusal.reason + "; give --version";
+        return std::nullopt;
+    }
+    const plist::Value* version = info->find(kBundleVersionKey);
     if (version == nullptr || version->asString() == nullptr || version->asString()->empty()) {
         error = infoPath + " has no " + kBundleVersionKey + " string; give --version";
         return std::nullopt;
@@ -184,7 +189,12 @@ std::optional<plist::Array> existingEntries(const PublishRequest& request, std::
     if (request.fresh || !fs::exists(path, code)) {
         return plist::Array();
     }
-    std::optional<plist::Value> catalog = plist::readFile(path);
+    plist::Refusal refusal;
+    std::optional<plist::Value> catalog = plist::readFile(path, &refusal);
+    if (!catalog) {
+        error = path + ": " + refusal.reason + "; use --fresh to replace it";
+        return std::nullopt;
+    }
     const plist::Value* type = catalog ? catalog->find(platform::kCatalogAssetTypeKey) : nullptr;
     const plist::Value* assets = catalog ? catalog->find(platform::kCatalogAssetsKey) : nullptr;
     if (assets == nullptr || assets->asArray() == nullptr) {
