@@ -194,4 +194,12 @@ std::optional<std::vector<std::shared_ptr<Asset>>> AssetQuery::runQuery() const 
     return assets;
 }
 
+void AssetQuery::removeAbandonedDownloads() const {
+    std::optional<AssetTypeSettings> settings =
+        AssetCatalogService::shared().settingsFor(assetType_);
+    if (settings) {
+        platform::removeAbandonedDownloads(settings->cacheDirectory, /*completedToo=*/true);
+    }
+}
+
 }  // namespace tavrix::platform

@@ -105,6 +105,10 @@ class AssetQuery {
     // the catalog's order, or nothing when the catalog cannot be fetched or is refused (logged).
     std::optional<std::vector<std::shared_ptr<Asset>>> runQuery() const;
 
+    // Removes the downloads a process that ended left in this type's cache (see
+    // removeAbandonedDownloads); for the launch, before any download can start.
+    void removeAbandonedDownloads() const;
+
   private:
     std::string assetType_;
     bool localOnly_ = false;

@@ -17,6 +17,7 @@
 #include "platform/AssetCatalog.h"
 #include "platform/CatalogCrypto.h"
 #include "platform/HttpTransfer.h"
+#include "util/Log.h"
 #include "util/UniqueFd.h"
 
 namespace tavrix::platform {
@@ -128,26 +129,41 @@ std::string uniqueSuffix() {
     return text;
 }
 
-// Staging left by a process that ended mid-download. Downloads run one at a time on the worker,
-// so no staging name present now belongs to a running one.
-void removeAbandonedStaging(const std::string& cacheDirectory) {
-    std::vector<std::string> names;
-    if (payload::readDirectoryNames(cacheDirectory, names) != 0) {
-        return;
-    }
-    for (const std::string& name : names) {
-        if (name.starts_with(".") &&
-            (name.ends_with(kStagedArchiveSuffix) || name.ends_with(kStagedExtractionSuffix))) {
-            payload::removeItemTree(cacheDirectory + "/" + name);
-        }
-    }
-}
-
 payload::ExtractionLimits extractionLimits(const AssetLimits& limits) {
     return {limits.maxExpandedBytes, limits.maxArchiveEntries, limits.freeSpaceReserveBytes, true};
 }
 
 }  // namespace
+
+namespace {
+
+bool isHexText(std::string_view text, std::size_t length) {
+    return text.size() == length &&
+           text.find_first_not_of("0123456789abcdef") == std::string_view::npos;
+}
+
+// "<archive SHA-256>-<random suffix>", the name every download's directory gets.
+bool isDownloadName(std::string_view name) {
+    return name.size() == 64 + 1 + 16 && name[64] == '-' && isHexText(name.substr(0, 64), 64) &&
+           isHexText(name.substr(65), 16);
+}
+
+}  // namespace
+
+void removeAbandonedDownloads(const std::string& typeCacheDirectory, bool completedToo) {
+    std::vector<std::string> names;
+    if (payload::readDirectoryNames(typeCacheDirectory, names) != 0) {
+        return;
+    }
+    for (const std::string& name : names) {
+        bool staging = name.starts_with(".") && (name.ends_with(kStagedArchiveSuffix) ||
+                                                 name.ends_with(kStagedExtractionSuffix));
+        if (staging || (completedToo && isDownloadName(name))) {
+            logCFormat("Asset catalog: removing the abandoned download %s\n", name.c_str());
+            payload::removeItemTree(typeCacheDirectory + "/" + name);
+        }
+    }
+}
 
 AssetCacheLocation AssetCacheLocation::forDownload(const std::string& typeCacheDirectory,
                                                    const CatalogEntry& entry) {
@@ -166,7 +182,7 @@ std::optional<std::string> downloadAndInstallAsset(const CatalogEntry& entry,
     if (int error = payload::createDirectoryAt(cacheDirectory, 0755, true)) {
         return errnoText("create", cacheDirectory, error);
     }
-    removeAbandonedStaging(cacheDirectory);
+    removeAbandonedDownloads(cacheDirectory, /*completedToo=*/false);
     StagedPath archive(location.archiveFile);
     {
         UniqueFd fd(::open(archive.path().c_str(),

@@ -25,6 +25,11 @@ struct AssetCacheLocation {
                                           const CatalogEntry& entry);
 };
 
+// Removes the downloads a process that ended left in a type's cache directory: staged ones (before
+// a download starts: downloads run one at a time) and, with completedToo, complete ones as well
+// (at launch, once an interrupted install has been resumed, when none can be in use).
+void removeAbandonedDownloads(const std::string& typeCacheDirectory, bool completedToo);
+
 using AssetProgressReporter = std::function<void(plist::Dictionary progress)>;
 
 // Downloads, verifies and extracts the entry's archive within limits, renames the extraction to

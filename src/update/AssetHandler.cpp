@@ -277,9 +277,15 @@ bool AssetHandler::copyDownloadedBundle(const std::string& source, const std::st
 
 void AssetHandler::resumeInterruptedInstall() {
     std::optional<PendingInstall> pending = readPendingInstall();
-    if (!pending) {
-        return;
+    if (pending) {
+        resumePendingInstall(*pending);
     }
+    // Whatever else a killed process left in the cache is never installed now.
+    platform::AssetQuery(kAssetTypeTavrixBundles).removeAbandonedDownloads();
+}
+
+void AssetHandler::resumePendingInstall(const PendingInstall& pendingInstall) {
+    const PendingInstall* pending = &pendingInstall;
     const std::string& asset = pending->assetDirectory;
     if (!pending->installed && payload::itemKind(asset) == payload::ItemKind::Directory) {
         logCFormat("Completing the interrupted install of %s\n", asset.c_str());

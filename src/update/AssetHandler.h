@@ -12,6 +12,8 @@
 
 namespace tavrix {
 
+struct PendingInstall;
+
 inline constexpr const char* kAssetTypeTavrixBundles = "com.zandor.Grellas.TavrixBundles";
 inline constexpr const char* kAssetAttributeVersion = "Version";
 inline constexpr const char* kAssetAttributeSupportedProductTypes = "SupportedProductTypes";
@@ -46,6 +48,9 @@ class AssetHandler {
     static void resumeInterruptedInstall();
 
   private:
+    // Completes (or gives up) one recorded install, then purges its download and the record.
+    static void resumePendingInstall(const PendingInstall& pending);
+
     // Marks an update check as running until finish() or its last owner goes.
     class RunningCheck {
       public:

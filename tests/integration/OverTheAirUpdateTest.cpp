@@ -3,7 +3,9 @@
 // and downloads that go wrong leaving the linked bundle as it was.
 #include <signal.h>
 #include <sodium.h>
+#include <fcntl.h>
 #include <sys/mount.h>
+#include <sys/statvfs.h>
 #include <unistd.h>
 
 #include <cmath>
@@ -17,6 +19,7 @@
 #include <thread>
 
 #include "BusFixture.h"
+#include "util/UniqueFd.h"
 #include "CommandRunner.h"
 #include "LocalHttpServer.h"
 #include "platform/BackgroundJobScheduler.h"
@@ -228,6 +231,12 @@ class OverTheAirUpdateTest : public BusFixture {
         EXPECT_EQ(linkTarget(kPreferencesLink), (at(kUserBundle) / "behavior.plist").string());
         EXPECT_EQ(client().copyTavrixValue("CarrierName"),
                   std::optional<plist::Value>("Bundle " + version));
+        // The record goes with the purge, which follows the announcement.
+        const auto deadline = std::chrono::steady_clock::now() + 10s;
+        while (fs::exists(device().path(kPendingInstall)) &&
+               std::chrono::steady_clock::now() < deadline) {
+            std::this_thread::sleep_for(20ms);
+        }
         EXPECT_FALSE(fs::exists(device().path(kPendingInstall)));
     }
 
@@ -412,7 +421,7 @@ TEST_F(OverTheAirUpdateTest, CheckAnsweredWhileTheDaemonLeavesIsInstalledBeforeI
 // day ahead.
 TEST_F(OverTheAirUpdateTest, AnUpdateThatDoesNotFitLeavesTheOldBundleLinked) {
     const fs::path home = at("/var/mobile");
-    if (::geteuid() != 0 || ::mount("tmpfs", home.c_str(), "tmpfs", 0, "size=2m") != 0) {
+    if (::geteuid() != 0 || ::mount("tmpfs", home.c_str(), "tmpfs", 0, "size=72m") != 0) {
         GTEST_SKIP() << "cannot mount a small tmpfs as the mobile home (needs root)";
     }
     struct Unmount {
@@ -424,6 +433,15 @@ TEST_F(OverTheAirUpdateTest, AnUpdateThatDoesNotFitLeavesTheOldBundleLinked) {
     setIDWithBundle("1");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
     const auto installedFiles = userBundleFiles();
+    // Room for the payload's extraction reserve was needed above; now leave 2 MB free.
+    {
+        struct statvfs space {};
+        ASSERT_EQ(::statvfs(home.c_str(), &space), 0);
+        const off_t filler = static_cast<off_t>(space.f_bavail * space.f_frsize) - (2 << 20);
+        UniqueFd fd(::open((home / "filler").c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600));
+        ASSERT_TRUE(fd);
+        ASSERT_EQ(::posix_fallocate(fd.get(), 0, filler), 0);
+    }
 
     publish("2", 3 << 20);
     EXPECT_TRUE(client().checkForTavrixBundleUpdate());
