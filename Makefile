@@ -34,14 +34,14 @@ test: build
 test-asan: deps $(ASAN_BUILD)/build.ninja
 	cmake --build $(ASAN_BUILD) -j $(JOBS)
 	ASAN_OPTIONS=detect_leaks=1:abort_on_error=1 UBSAN_OPTIONS=print_stacktrace=1:halt_on_error=1 \
-	    ctest --test-dir $(ASAN_BUILD) -j $(JOBS) --output-on-failure
+	    TAVRIX_CRASH_LOOP_ITERATIONS=8 ctest --test-dir $(ASAN_BUILD) -j $(JOBS) --output-on-failure
 
 # Every test under the thread sanitizer: the daemon's worker threads, the queues and the
 # integration tests' real daemons (each daemon's report lands in its log and fails the test).
 test-tsan: deps $(TSAN_BUILD)/build.ninja
 	cmake --build $(TSAN_BUILD) -j $(JOBS)
 	TSAN_OPTIONS="halt_on_error=1 second_deadlock_stack=1 suppressions=$(CURDIR)/tests/tsan.supp" \
-	    ctest --test-dir $(TSAN_BUILD) -j $(JOBS) --output-on-failure
+	    TAVRIX_CRASH_LOOP_ITERATIONS=8 ctest --test-dir $(TSAN_BUILD) -j $(JOBS) --output-on-failure
 
 fuzz: deps $(FUZZ_BUILD)/build.ninja
 	cmake --build $(FUZZ_BUILD) -j $(JOBS) --target fuzz_targets
