@@ -146,8 +146,8 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
             if (++merges > 4) {
                 break;
             }
-            mergeAndCheck(base, *configuration.asDictionary());
-            mergeAndCheck(*configuration.asDictionary(), base);
+            mergeAndCheck(base, *configuration);
+            mergeAndCheck(*configuration, base);
         }
     }
     return 0;
