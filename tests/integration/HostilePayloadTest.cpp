@@ -24,9 +24,9 @@ constexpr const char* kSystemBundle = "/System/Library/TavrixBundles/Tablet/Defa
 constexpr const char* kBundleLink = "/var/mobile/Library/Tavrix.bundle";
 constexpr const char* kPreferencesLink = "/var/mobile/Library/Preferences/com.zandor.tavrix.plist";
 // An idle daemon holds about 12 MB; a payload may cost working memory, never its expansion. Under
-// the address sanitizer freed memory is held back in quarantine (256 MB) and shadowed, so the
-// bound there only catches an expansion.
-#if defined(__SANITIZE_ADDRESS__)
+// a sanitizer memory is shadowed (and freed memory held back in quarantine), so the bound there
+// only catches an expansion.
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
 constexpr long kMaxResidentKiB = 640 * 1024;
 #else
 constexpr long kMaxResidentKiB = 160 * 1024;
