@@ -22,7 +22,6 @@
 namespace tavrix::platform {
 namespace {
 
-constexpr std::string_view kJobsDirectory = "/var/lib/tavrixservicesd";
 constexpr std::string_view kJobsFileSuffix = ".jobs.plist";
 constexpr mode_t kJobsFileMode = 0600;
 // The timer looks again at least this often, so that a far deadline never overflows a wait and
@@ -77,7 +76,7 @@ std::string BackgroundJobScheduler::jobsFilePath(std::string_view clientName) {
 
 std::string BackgroundJobScheduler::jobsFilePathUnder(std::string_view root,
                                                       std::string_view clientName) {
-    return resolvePathUnder(root, kJobsDirectory) + "/" + std::string(clientName) +
+    return resolvePathUnder(root, kDaemonStateDirectory) + "/" + std::string(clientName) +
            std::string(kJobsFileSuffix);
 }
 

@@ -8,6 +8,9 @@
 
 namespace tavrix::platform {
 
+// The daemon's own durable state (scheduled jobs, the record of an install under way).
+inline constexpr std::string_view kDaemonStateDirectory = "/var/lib/tavrixservicesd";
+
 // The root directory without a trailing slash ("" for "/"), read from the environment once.
 const std::string& platformRoot();
 

@@ -12,7 +12,6 @@
 namespace tavrix {
 namespace {
 
-constexpr const char* kStateDirectory = "/var/lib/tavrixservicesd";
 constexpr const char* kMarkerFileName = "pending-install.plist";
 constexpr const char* kAssetDirectoryKey = "AssetDirectory";
 constexpr const char* kInstalledKey = "Installed";
@@ -22,12 +21,12 @@ constexpr mode_t kMarkerMode = 0600;
 }  // namespace
 
 std::string pendingInstallMarkerPath() {
-    return platform::resolvePath(kStateDirectory) + "/" + kMarkerFileName;
+    return platform::resolvePath(platform::kDaemonStateDirectory) + "/" + kMarkerFileName;
 }
 
 bool writePendingInstall(const PendingInstall& install) {
     const std::string& assetDirectory = install.assetDirectory;
-    const std::string directory = platform::resolvePath(kStateDirectory);
+    const std::string directory = platform::resolvePath(platform::kDaemonStateDirectory);
     int error = payload::createDirectoryAt(directory, kStateDirectoryMode, true);
     if (error == 0) {
         const std::string xml = plist::serialize(
