@@ -3,6 +3,7 @@
 #include <sys/stat.h>
 
 #include <cstdio>
+#include <optional>
 
 #include "bundle/BundleComparison.h"
 #include "bundle/BundleInfo.h"
@@ -16,6 +17,7 @@
 #include "payload/MobileUser.h"
 #include "platform/NotificationCenter.h"
 #include "platform/PreferencesStore.h"
+#include "platform/SystemLog.h"
 #include "util/Log.h"
 
 namespace tavrix {
@@ -170,6 +172,7 @@ BundleChangeType BundleManager::runBundleReset() {
         logCFormat("Carrier Bundle Match Result: %s\n", changeTypeName(result));
         return result;
     }
+    const platform::ScopedLogField idField("TAVRIX_BEHAVIOR_ID", *behaviorID_);
     logCFormat("\n");
     logCFormat(
         "=========================== Potentially Resetting Behavior Bundle "
@@ -185,6 +188,10 @@ BundleChangeType BundleManager::runBundleReset() {
     OverrideResult behaviorResult = applyMultimodeOverlay(matched, behaviorID_);
     logCFormat("Device overlay decision: %s\n", overrideResultName(behaviorResult));
     logCFormat("Dump state for the bundle after multimode overlay\n");
+    std::optional<platform::ScopedLogField> versionField;
+    if (!matched.bundleVersion.empty()) {
+        versionField.emplace("TAVRIX_BUNDLE_VERSION", matched.bundleVersion);
+    }
 
     if (linksDisagree_) {
         logCFormat("Original Bundle Links Do Not Exist. Treat as Carrier Change\n");

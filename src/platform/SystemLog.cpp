@@ -1,6 +1,8 @@
 #include "platform/SystemLog.h"
 
 #include <sys/stat.h>
+#include <sys/uio.h>
+#include <systemd/sd-journal.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -13,6 +15,9 @@ namespace tavrix::platform {
 namespace {
 
 constexpr const char* kIdent = "tavrixservicesd";
+
+// The fields of the ScopedLogFields alive on this thread, innermost last.
+thread_local std::vector<std::pair<std::string, std::string>> scopedFields;
 
 // JOURNAL_STREAM is "device:inode" of the stream the journal handed us; it only counts while
 // stderr is still that stream.
@@ -61,6 +66,25 @@ class StderrSink : public LogSink {
     bool withPriorityPrefix_;
 };
 
+// One entry per message, whatever it contains: a line break inside a message cannot split it.
+class JournalSink : public LogSink {
+  public:
+    void write(int priority, std::string_view message) override {
+        std::vector<std::string> fields = journalFields(priority, message);
+        std::vector<iovec> vectors;
+        vectors.reserve(fields.size());
+        for (std::string& field : fields) {
+            vectors.push_back({field.data(), field.size()});
+        }
+        if (sd_journal_sendv(vectors.data(), static_cast<int>(vectors.size())) < 0) {
+            fallback_.write(priority, message);  // the journal's socket is gone: keep the line
+        }
+    }
+
+  private:
+    StderrSink fallback_{true};
+};
+
 class SyslogSink : public LogSink {
   public:
     SyslogSink() { ::openlog(kIdent, LOG_PID, LOG_DAEMON); }
@@ -73,7 +97,7 @@ class SyslogSink : public LogSink {
 LogSink& defaultSink() {
     static LogSink* sink = []() -> LogSink* {
         if (stderrIsJournal()) {
-            return new StderrSink(true);
+            return new JournalSink();
         }
         const char* forced = std::getenv("TAVRIX_LOG_STDERR");
         if ((forced != nullptr && std::strcmp(forced, "1") == 0) || ::isatty(STDERR_FILENO)) {
@@ -88,6 +112,34 @@ std::atomic<LogSink*> overridingSink{nullptr};
 
 }  // namespace
 
+ScopedLogField::ScopedLogField(std::string name, std::string value) {
+    scopedFields.emplace_back(std::move(name), std::move(value));
+}
+
+ScopedLogField::~ScopedLogField() {
+    scopedFields.pop_back();
+}
+
+std::vector<std::string> journalFields(int priority, std::string_view message) {
+    if (!message.empty() && message.back() == '\n') {
+        message.remove_suffix(1);  // the journal ends every entry itself
+    }
+    std::vector<std::string> fields;
+    fields.push_back("MESSAGE=" + std::string(message));
+    fields.push_back("PRIORITY=" + std::to_string(LOG_PRI(priority)));
+    fields.push_back(std::string("SYSLOG_IDENTIFIER=") + kIdent);
+    for (auto field = scopedFields.rbegin(); field != scopedFields.rend(); ++field) {
+        const std::string prefix = field->first + "=";
+        bool shadowed = std::any_of(fields.begin() + 3, fields.end(), [&](const std::string& f) {
+            return f.compare(0, prefix.size(), prefix) == 0;
+        });
+        if (!shadowed) {
+            fields.push_back(prefix + field->second);
+        }
+    }
+    return fields;
+}
+
 void writeSystemLog(int priority, std::string_view message) {
     LogSink* sink = overridingSink.load(std::memory_order_acquire);
     (sink != nullptr ? *sink : defaultSink()).write(priority, message);
@@ -100,9 +152,15 @@ ScopedLogSink::~ScopedLogSink() {
     overridingSink.store(previous_, std::memory_order_release);
 }
 
-void CapturingLogSink::write(int, std::string_view message) {
+void CapturingLogSink::write(int priority, std::string_view message) {
     std::lock_guard lock(mutex_);
     messages_.emplace_back(message);
+    priorities_.push_back(priority);
+}
+
+std::vector<int> CapturingLogSink::priorities() const {
+    std::lock_guard lock(mutex_);
+    return priorities_;
 }
 
 std::vector<std::string> CapturingLogSink::messages() const {
@@ -118,6 +176,7 @@ bool CapturingLogSink::contains(std::string_view message) const {
 void CapturingLogSink::clear() {
     std::lock_guard lock(mutex_);
     messages_.clear();
+    priorities_.clear();
 }
 
 }  // namespace tavrix::platform

@@ -1,6 +1,9 @@
 // The system log: where every log line of the daemon goes.
-// A line goes to stderr when stderr is the journal, a terminal, or TAVRIX_LOG_STDERR=1 is set;
-// otherwise to syslog(3) with the ident "tavrixservicesd". Messages are written unchanged.
+// When stderr is the journal, each message is one journal entry sent with sd_journal_sendv: its
+// priority, SYSLOG_IDENTIFIER "tavrixservicesd" and the fields of the ScopedLogFields alive on the
+// logging thread, so an operator can filter (journalctl -p warning, TAVRIX_BEHAVIOR_ID=...). On a
+// terminal, or with TAVRIX_LOG_STDERR=1, lines go to stderr; otherwise to syslog(3). Messages are
+// written unchanged.
 #pragma once
 
 #include <syslog.h>
@@ -8,6 +11,7 @@
 #include <mutex>
 #include <string>
 #include <string_view>
+#include <utility>
 #include <vector>
 
 namespace tavrix::platform {
@@ -21,6 +25,19 @@ class LogSink {
 
 // Writes one message to the current sink.
 void writeSystemLog(int priority, std::string_view message);
+
+// Adds a journal field (an upper-case name such as "TAVRIX_BEHAVIOR_ID") to every message this
+// thread logs while the guard lives. Guards nest; an inner field of the same name wins.
+class ScopedLogField {
+  public:
+    ScopedLogField(std::string name, std::string value);
+    ~ScopedLogField();
+    ScopedLogField(const ScopedLogField&) = delete;
+    ScopedLogField& operator=(const ScopedLogField&) = delete;
+};
+
+// The "NAME=value" fields of one journal entry for a message logged on this thread.
+std::vector<std::string> journalFields(int priority, std::string_view message);
 
 // Sends every message to the given sink while the guard lives (tests). Guards nest.
 class ScopedLogSink {
@@ -39,12 +56,15 @@ class CapturingLogSink : public LogSink {
   public:
     void write(int priority, std::string_view message) override;
     std::vector<std::string> messages() const;
+    // The priority of each message, in the same order.
+    std::vector<int> priorities() const;
     bool contains(std::string_view message) const;
     void clear();
 
   private:
     mutable std::mutex mutex_;
     std::vector<std::string> messages_;
+    std::vector<int> priorities_;
 };
 
 }  // namespace tavrix::platform

@@ -6,6 +6,7 @@
 #include <cstdio>
 #include <cstring>
 #include <mutex>
+#include <optional>
 #include <string>
 
 #include "bundle/BundleLocations.h"
@@ -16,6 +17,7 @@
 #include "payload/FileSystemUtilities.h"
 #include "payload/MobileUser.h"
 #include "payload/PayloadUnpack.h"
+#include "platform/SystemLog.h"
 #include "update/PendingInstall.h"
 #include "update/UpdateCheckScheduler.h"
 #include "util/Log.h"
@@ -187,6 +189,11 @@ void AssetHandler::handleDownloadProgress(const AssetPtr& asset, const plist::Di
         scheduler.rescheduleAndEndCheck(kInstallRetryDelaySeconds);
         running->finish();
         return;
+    }
+    std::optional<platform::ScopedLogField> versionField;
+    auto version = asset->attributes().find(kAssetAttributeVersion);
+    if (version != asset->attributes().end()) {
+        versionField.emplace("TAVRIX_BUNDLE_VERSION", versionText(version->second));
     }
     const plist::Value urlPath(*url);
     logObjectFormat("URL string: %@", &urlPath);

@@ -13,7 +13,25 @@
 namespace tavrix {
 namespace {
 
-constexpr int kPriority = LOG_NOTICE;
+// A message whose format reports a failure is a warning, the rest a notice. Only the format's own
+// text counts, so no client value can change a message's priority.
+int priorityOf(const char* format) {
+    static constexpr std::string_view kFailureWords[] = {
+        "fail",    "cannot",  "could not",  "refus",   "error", "exception",
+        "invalid", "damaged", "not enough", "problem", "unable"};
+    std::string lowered(format);
+    for (char& c : lowered) {
+        if (c >= 'A' && c <= 'Z') {
+            c = static_cast<char>(c - 'A' + 'a');
+        }
+    }
+    for (std::string_view word : kFailureWords) {
+        if (lowered.find(word) != std::string::npos) {
+            return LOG_WARNING;
+        }
+    }
+    return LOG_NOTICE;
+}
 
 // Values (a "%s" text or a "%@" description) come from clients, carrier files and the network: a
 // longer one is cut to this many bytes and marked, so one call cannot write megabytes of log.
@@ -269,7 +287,7 @@ std::string formatObjectMessage(const char* format, va_list arguments) {
 }
 
 void logObjectFormatV(const char* format, va_list arguments) {
-    platform::writeSystemLog(kPriority, formatObjectMessage(format, arguments));
+    platform::writeSystemLog(priorityOf(format), formatObjectMessage(format, arguments));
 }
 
 void logObjectFormat(const char* format, ...) {

@@ -70,5 +70,25 @@ TEST_F(LogTest, ClientValuesAreEscapedAndCut) {
     EXPECT_EQ(sink.messages(), (std::vector<std::string>{cut + "!", cut + "?"}));
 }
 
+// An operator filters by priority and by the fields of the flow a message belongs to; a client's
+// value can raise neither.
+TEST_F(LogTest, JournalEntriesCarryPriorityAndScopedFields) {
+    logCFormat("Failed to establish link from %s to %s\n", "a", "b");
+    logCFormat("Copying %s\n", "refused error failed");
+    EXPECT_EQ(sink.priorities(), (std::vector<int>{LOG_WARNING, LOG_NOTICE}));
+
+    platform::ScopedLogField outer("TAVRIX_BEHAVIOR_ID", "outer");
+    {
+        platform::ScopedLogField id("TAVRIX_BEHAVIOR_ID", "abc\ndef");
+        platform::ScopedLogField version("TAVRIX_BUNDLE_VERSION", "2.0");
+        EXPECT_EQ(
+            platform::journalFields(LOG_WARNING, "line one\nline two\n"),
+            (std::vector<std::string>{"MESSAGE=line one\nline two", "PRIORITY=4",
+                                      "SYSLOG_IDENTIFIER=tavrixservicesd",
+                                      "TAVRIX_BUNDLE_VERSION=2.0", "TAVRIX_BEHAVIOR_ID=abc\ndef"}));
+    }
+    EXPECT_EQ(platform::journalFields(LOG_NOTICE, "x").back(), "TAVRIX_BEHAVIOR_ID=outer");
+}
+
 }  // namespace
 }  // namespace tavrix
