@@ -100,11 +100,6 @@ std::size_t receiveHeader(char* bytes, std::size_t size, std::size_t count, void
     return size * count;
 }
 
-bool curlIsReady() {
-    static const bool ready = curl_global_init(CURL_GLOBAL_DEFAULT) == CURLE_OK;
-    return ready;
-}
-
 // Hands the body to out as the response's encoding asks: as it is without an encoding,
 // inflated for gzip, and not at all for any other encoding (although "compress" is offered).
 void takeBody(Transfer& transfer, std::optional<plist::Data>& out) {
@@ -138,11 +133,12 @@ bool copyDataFromHTTP(const std::string& url, std::optional<plist::Data>* out) {
         return false;
     }
     out->reset();
-    if (!curlIsReady()) {
+    const platform::CurlLibrary* libcurl = platform::loadCurl();
+    if (libcurl == nullptr) {
         return false;
     }
-    platform::CurlEasy handle(curl_easy_init());
-    HeaderList headers(curl_slist_append(nullptr, "Accept-Encoding: compress, gzip"));
+    platform::CurlEasy handle(libcurl->easy_init());
+    HeaderList headers(libcurl->slist_append(nullptr, "Accept-Encoding: compress, gzip"));
     if (!handle || !headers) {
         return false;
     }
@@ -152,19 +148,19 @@ bool copyDataFromHTTP(const std::string& url, std::optional<plist::Data>* out) {
     // and the Content-Encoding field decides. There is no equivalent of an opportunistic
     // connection here, and no time limit of the loader's own.
     bool configured =
-        curl_easy_setopt(curl, CURLOPT_URL, url.c_str()) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_HTTP_VERSION, long{CURL_HTTP_VERSION_1_0}) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_HTTPHEADER, headers.get()) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_FOLLOWLOCATION, 1L) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_MAXREDIRS, kMaxRedirects) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_PROTOCOLS_STR, "http,https") == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_REDIR_PROTOCOLS_STR, "http,https") == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_NOSIGNAL, 1L) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, &receiveBody) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_WRITEDATA, &transfer) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_HEADERFUNCTION, &receiveHeader) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_HEADERDATA, &transfer) == CURLE_OK;
-    if (!configured || curl_easy_perform(curl) != CURLE_OK) {
+        libcurl->easy_setopt(curl, CURLOPT_URL, url.c_str()) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_HTTP_VERSION, long{CURL_HTTP_VERSION_1_0}) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_HTTPHEADER, headers.get()) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_FOLLOWLOCATION, 1L) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_MAXREDIRS, kMaxRedirects) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_PROTOCOLS_STR, "http,https") == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_REDIR_PROTOCOLS_STR, "http,https") == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_NOSIGNAL, 1L) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_WRITEFUNCTION, &receiveBody) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_WRITEDATA, &transfer) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_HEADERFUNCTION, &receiveHeader) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_HEADERDATA, &transfer) == CURLE_OK;
+    if (!configured || libcurl->easy_perform(curl) != CURLE_OK) {
         return false;
     }
     takeBody(transfer, *out);

@@ -26,7 +26,8 @@ constexpr mode_t kArchiveFileMode = 0644;
 
 int openCallback(archive* handle, void* clientData) {
     if (clientData == nullptr) {
-        archive_set_error(handle, kUnderlyingDataMissingError, "Underlying KWData was nil");
+        libarchive().archive_set_error(handle, kUnderlyingDataMissingError,
+                                       "Underlying KWData was nil");
         return ARCHIVE_FATAL;
     }
     return ARCHIVE_OK;
@@ -39,7 +40,7 @@ la_ssize_t writeCallback(archive* handle, void* clientData, const void* buffer, 
         data->insert(data->end(), bytes, bytes + length);
     } catch (const std::bad_alloc&) {
         // No exception may cross libarchive's C frames.
-        archive_set_error(handle, ENOMEM, "Out of memory for the archive data");
+        libarchive().archive_set_error(handle, ENOMEM, "Out of memory for the archive data");
         return -1;
     }
     return static_cast<la_ssize_t>(length);
@@ -104,7 +105,7 @@ std::optional<std::string> pathOfFileURL(const std::string& url) {
 Archive::Archive(std::uint32_t maxUncompressedSize, int archiveType, std::string identifier)
     : maxUncompressedSize_(maxUncompressedSize),
       archiveType_(archiveType),
-      archive_(archive_write_new()),
+      archive_(loadArchive() != nullptr ? libarchive().archive_write_new() : nullptr),
       identifier_(std::move(identifier)) {}
 
 std::unique_ptr<Archive> Archive::initWithMaxUncompressedSize(std::uint32_t size, int archiveType,
@@ -116,16 +117,17 @@ std::unique_ptr<Archive> Archive::initWithMaxUncompressedSize(std::uint32_t size
     }
     int filterStatus = ARCHIVE_FATAL;
     if (archiveType == kArchiveTypeBzip2) {
-        filterStatus = archive_write_add_filter_bzip2(writer);
+        filterStatus = libarchive().archive_write_add_filter_bzip2(writer);
     } else if (archiveType == kArchiveTypeGzip) {
-        filterStatus = archive_write_add_filter_gzip(writer);
+        filterStatus = libarchive().archive_write_add_filter_gzip(writer);
     }
     if (filterStatus != ARCHIVE_OK ||
-        archive_write_set_format_pax_restricted(writer) != ARCHIVE_OK ||
-        archive_write_set_bytes_per_block(writer, kBytesPerBlock) != ARCHIVE_OK ||
-        archive_write_set_bytes_in_last_block(writer, kBytesInLastBlock) != ARCHIVE_OK ||
-        archive_write_open(writer, &created->archiveData_, openCallback, writeCallback,
-                           closeCallback) != ARCHIVE_OK) {
+        libarchive().archive_write_set_format_pax_restricted(writer) != ARCHIVE_OK ||
+        libarchive().archive_write_set_bytes_per_block(writer, kBytesPerBlock) != ARCHIVE_OK ||
+        libarchive().archive_write_set_bytes_in_last_block(writer, kBytesInLastBlock) !=
+            ARCHIVE_OK ||
+        libarchive().archive_write_open(writer, &created->archiveData_, openCallback, writeCallback,
+                                        closeCallback) != ARCHIVE_OK) {
         return nullptr;
     }
     return created;
@@ -155,21 +157,21 @@ bool Archive::addFile(const std::string& path, const std::string& asFile) {
         return false;
     }
 
-    ArchiveEntry entry(archive_entry_new());
+    ArchiveEntry entry(libarchive().archive_entry_new());
     if (!entry) {
         return false;
     }
-    archive_entry_copy_pathname(entry.get(), asFile.c_str());
-    archive_entry_set_size(entry.get(), static_cast<la_int64_t>(length));
-    archive_entry_set_filetype(entry.get(), AE_IFREG);
-    archive_entry_set_perm(entry.get(), kEntryMode);
-    archive_entry_set_mtime(entry.get(), contents->info.st_mtim.tv_sec,
-                            contents->info.st_mtim.tv_nsec);
-    if (archive_write_header(archive_.get(), entry.get()) != ARCHIVE_OK) {
+    libarchive().archive_entry_copy_pathname(entry.get(), asFile.c_str());
+    libarchive().archive_entry_set_size(entry.get(), static_cast<la_int64_t>(length));
+    libarchive().archive_entry_set_filetype(entry.get(), AE_IFREG);
+    libarchive().archive_entry_set_perm(entry.get(), kEntryMode);
+    libarchive().archive_entry_set_mtime(entry.get(), contents->info.st_mtim.tv_sec,
+                                         contents->info.st_mtim.tv_nsec);
+    if (libarchive().archive_write_header(archive_.get(), entry.get()) != ARCHIVE_OK) {
         return false;
     }
-    la_ssize_t written =
-        archive_write_data(archive_.get(), contents->bytes.data(), contents->bytes.size());
+    la_ssize_t written = libarchive().archive_write_data(archive_.get(), contents->bytes.data(),
+                                                         contents->bytes.size());
     if (written < 0 || static_cast<std::uint64_t>(written) != length) {
         return false;
     }
@@ -188,7 +190,7 @@ bool Archive::addFileURL(const std::string& url) {
 }
 
 bool Archive::close() {
-    return archive_write_close(archive_.get()) == ARCHIVE_OK;
+    return libarchive().archive_write_close(archive_.get()) == ARCHIVE_OK;
 }
 
 bool Archive::writeToFile(const std::string& path) const {

@@ -2,6 +2,8 @@
 
 #include <cstdint>
 
+#include "payload/ArchiveLibrary.h"
+
 namespace tavrix::payload {
 namespace {
 
@@ -54,19 +56,19 @@ bool linkTargetStaysInside(std::string_view linkPath, std::string_view target) {
 }
 
 std::optional<std::string> whyEntryIsUnsafe(archive_entry* entry) {
-    const char* name = archive_entry_pathname(entry);
+    const char* name = libarchive().archive_entry_pathname(entry);
     if (name == nullptr || name[0] == '\0') {
         return "it has no usable name";
     }
     if (leavesDestination(name)) {
         return "its path leads outside the destination";
     }
-    if (archive_entry_hardlink(entry) != nullptr) {
+    if (libarchive().archive_entry_hardlink(entry) != nullptr) {
         return "hard links are not accepted";
     }
     // The disk writer makes a symbolic link whenever a target is set, whatever the entry's type.
-    const char* linkTarget = archive_entry_symlink(entry);
-    switch (archive_entry_filetype(entry)) {
+    const char* linkTarget = libarchive().archive_entry_symlink(entry);
+    switch (libarchive().archive_entry_filetype(entry)) {
         case AE_IFREG:
         case AE_IFDIR:
             if (linkTarget != nullptr) {

@@ -49,33 +49,34 @@ std::optional<std::string> resolvedPath(const std::string& path) {
 }
 
 const char* errorText(archive* handle) {
-    const char* text = archive_error_string(handle);
+    const char* text = libarchive().archive_error_string(handle);
     return text != nullptr ? text : "unknown error";
 }
 
 // Points the entry's path and its hard-link target (when relative) below destination, as if the
 // archive were extracted inside it. False, logged, when the entry must not be written.
 bool placeEntry(archive_entry* entry, const std::string& destination) {
-    const char* name = archive_entry_pathname(entry);
+    const char* name = libarchive().archive_entry_pathname(entry);
     if (name == nullptr || name[0] == '\0') {
         logCFormat("Skipping an archive entry without a usable name\n");
         return false;
     }
-    const char* linkTarget = archive_entry_hardlink(entry);
+    const char* linkTarget = libarchive().archive_entry_hardlink(entry);
     if (name[0] != '/') {
-        archive_entry_copy_pathname(entry, (destination + "/" + name).c_str());
+        libarchive().archive_entry_copy_pathname(entry, (destination + "/" + name).c_str());
     }
     if (linkTarget != nullptr && linkTarget[0] != '\0' && linkTarget[0] != '/') {
-        archive_entry_copy_hardlink(entry, (destination + "/" + linkTarget).c_str());
+        libarchive().archive_entry_copy_hardlink(entry, (destination + "/" + linkTarget).c_str());
     }
     return true;
 }
 
 std::uint64_t declaredSize(archive_entry* entry) {
-    if (!archive_entry_size_is_set(entry) || archive_entry_size(entry) < 0) {
+    if (!libarchive().archive_entry_size_is_set(entry) ||
+        libarchive().archive_entry_size(entry) < 0) {
         return 0;
     }
-    return static_cast<std::uint64_t>(archive_entry_size(entry));
+    return static_cast<std::uint64_t>(libarchive().archive_entry_size(entry));
 }
 
 // Copies the current entry's data block by block (sparse entries keep their holes); stops at the
@@ -86,7 +87,7 @@ std::optional<std::string> copyEntryData(archive* reader, archive* writer,
         const void* block = nullptr;
         size_t size = 0;
         la_int64_t offset = 0;
-        if (archive_read_data_block(reader, &block, &size, &offset) != ARCHIVE_OK) {
+        if (libarchive().archive_read_data_block(reader, &block, &size, &offset) != ARCHIVE_OK) {
             return std::nullopt;
         }
         std::uint64_t start = offset > 0 ? static_cast<std::uint64_t>(offset) : 0;
@@ -98,7 +99,7 @@ std::optional<std::string> copyEntryData(archive* reader, archive* writer,
         if (std::optional<std::string> exceeded = budget.noteExtent(extent)) {
             return exceeded;
         }
-        if (archive_write_data_block(writer, block, size, offset) != ARCHIVE_OK) {
+        if (libarchive().archive_write_data_block(writer, block, size, offset) != ARCHIVE_OK) {
             return std::nullopt;
         }
     }
@@ -137,22 +138,25 @@ bool extractArchive(const std::string& archivePath, const std::string& destinati
         destination = *resolved;
     }
 
-    ArchiveReader reader(archive_read_new());
-    ArchiveWriter writer(archive_write_disk_new());
+    if (loadArchive() == nullptr) {
+        return fail("Cannot extract " + archivePath + ": libarchive is unavailable");
+    }
+    ArchiveReader reader(libarchive().archive_read_new());
+    ArchiveWriter writer(libarchive().archive_write_disk_new());
     if (!reader || !writer) {
         return fail("Cannot extract " + archivePath + ": out of memory");
     }
-    archive_write_disk_set_options(writer.get(), safety == ExtractionSafety::PathSafe
-                                                     ? kNetworkArchiveOptions
-                                                     : kRestoredAttributes);
-    archive_read_support_filter_gzip(reader.get());
-    archive_read_support_filter_compress(reader.get());
-    archive_read_support_format_tar(reader.get());
-    archive_read_support_format_cpio(reader.get());
-    archive_write_disk_set_standard_lookup(writer.get());
+    libarchive().archive_write_disk_set_options(writer.get(), safety == ExtractionSafety::PathSafe
+                                                                  ? kNetworkArchiveOptions
+                                                                  : kRestoredAttributes);
+    libarchive().archive_read_support_filter_gzip(reader.get());
+    libarchive().archive_read_support_filter_compress(reader.get());
+    libarchive().archive_read_support_format_tar(reader.get());
+    libarchive().archive_read_support_format_cpio(reader.get());
+    libarchive().archive_write_disk_set_standard_lookup(writer.get());
 
-    if (archive_read_open_filename(reader.get(), archivePath.c_str(), kReadBlockSize) !=
-        ARCHIVE_OK) {
+    if (libarchive().archive_read_open_filename(reader.get(), archivePath.c_str(),
+                                                kReadBlockSize) != ARCHIVE_OK) {
         return fail("Cannot open the archive " + archivePath + ": " + errorText(reader.get()));
     }
     ExtractionBudget budget(limits, destination);
@@ -161,9 +165,9 @@ bool extractArchive(const std::string& archivePath, const std::string& destinati
     };
     for (;;) {
         archive_entry* entry = nullptr;
-        int status = archive_read_next_header(reader.get(), &entry);
+        int status = libarchive().archive_read_next_header(reader.get(), &entry);
         if (status == ARCHIVE_EOF) {
-            archive_read_close(reader.get());
+            libarchive().archive_read_close(reader.get());
             if (std::optional<std::string> exceeded = budget.checkFinalRoom()) {
                 return stop(*exceeded);
             }
@@ -174,25 +178,27 @@ bool extractArchive(const std::string& archivePath, const std::string& destinati
         }
         if (safety == ExtractionSafety::PathSafe) {
             if (std::optional<std::string> unsafe = whyEntryIsUnsafe(entry)) {
-                const char* name = archive_entry_pathname(entry);
+                const char* name = libarchive().archive_entry_pathname(entry);
                 return fail(std::string("Refusing the archive entry ") + (name ? name : "") +
                             " of " + archivePath + ": " + *unsafe);
             }
         }
-        if (std::optional<std::string> exceeded = budget.admitEntry(
-                archive_entry_pathname(entry) ? archive_entry_pathname(entry) : "",
-                declaredSize(entry))) {
+        if (std::optional<std::string> exceeded =
+                budget.admitEntry(libarchive().archive_entry_pathname(entry)
+                                      ? libarchive().archive_entry_pathname(entry)
+                                      : "",
+                                  declaredSize(entry))) {
             return stop(*exceeded);
         }
         if (!placeEntry(entry, destination)) {
             continue;
         }
-        if (archive_write_header(writer.get(), entry) < ARCHIVE_WARN) {
+        if (libarchive().archive_write_header(writer.get(), entry) < ARCHIVE_WARN) {
             logCFormat("%s", "");
             continue;
         }
         std::optional<std::string> exceeded = copyEntryData(reader.get(), writer.get(), budget);
-        archive_write_finish_entry(writer.get());
+        libarchive().archive_write_finish_entry(writer.get());
         if (exceeded) {
             return stop(*exceeded);
         }

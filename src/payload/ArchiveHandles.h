@@ -2,21 +2,20 @@
 // also closes it) on every path.
 #pragma once
 
-#include <archive.h>
-#include <archive_entry.h>
-
 #include <memory>
+
+#include "payload/ArchiveLibrary.h"
 
 namespace tavrix::payload {
 
 struct ArchiveReadFree {
-    void operator()(archive* handle) const { archive_read_free(handle); }
+    void operator()(archive* handle) const { libarchive().archive_read_free(handle); }
 };
 struct ArchiveWriteFree {
-    void operator()(archive* handle) const { archive_write_free(handle); }
+    void operator()(archive* handle) const { libarchive().archive_write_free(handle); }
 };
 struct ArchiveEntryFree {
-    void operator()(archive_entry* entry) const { archive_entry_free(entry); }
+    void operator()(archive_entry* entry) const { libarchive().archive_entry_free(entry); }
 };
 
 // A reader from archive_read_new.

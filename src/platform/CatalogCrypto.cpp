@@ -1,58 +1,10 @@
 #include "platform/CatalogCrypto.h"
 
-#include <fcntl.h>
-#include <unistd.h>
-
-#include <cerrno>
-#include <vector>
-
-#include "util/UniqueFd.h"
-
 namespace tavrix::platform {
 
 bool sodiumReady() {
     static const bool ready = sodium_init() >= 0;
     return ready;
-}
-
-Sha256Digest::Sha256Digest() {
-    sodiumReady();
-    crypto_hash_sha256_init(&state_);
-}
-
-void Sha256Digest::update(std::string_view bytes) {
-    crypto_hash_sha256_update(&state_, reinterpret_cast<const unsigned char*>(bytes.data()),
-                              bytes.size());
-}
-
-std::string Sha256Digest::finishHex() {
-    unsigned char digest[crypto_hash_sha256_BYTES];
-    crypto_hash_sha256_final(&state_, digest);
-    char hex[kSha256HexLength + 1];
-    sodium_bin2hex(hex, sizeof hex, digest, sizeof digest);
-    return std::string(hex, kSha256HexLength);
-}
-
-std::optional<std::string> sha256HexOfFile(const std::string& path) {
-    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-    if (!fd) {
-        return std::nullopt;
-    }
-    Sha256Digest digest;
-    std::vector<char> buffer(1 << 16);
-    for (;;) {
-        ssize_t count = ::read(fd.get(), buffer.data(), buffer.size());
-        if (count < 0 && errno == EINTR) {
-            continue;
-        }
-        if (count < 0) {
-            return std::nullopt;
-        }
-        if (count == 0) {
-            return digest.finishHex();
-        }
-        digest.update(std::string_view(buffer.data(), static_cast<std::size_t>(count)));
-    }
 }
 
 bool isSha256Hex(std::string_view text) {

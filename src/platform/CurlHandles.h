@@ -1,24 +1,24 @@
 // Owners of libcurl handles: each handle is wrapped the moment it is created and released on
-// every path.
+// every path. A handle exists only once libcurl is loaded, so the deleters find it loaded.
 #pragma once
 
-#include <curl/curl.h>
-
 #include <memory>
+
+#include "platform/CurlLibrary.h"
 
 namespace tavrix::platform {
 
 struct CurlEasyCleanup {
-    void operator()(CURL* handle) const { curl_easy_cleanup(handle); }
+    void operator()(CURL* handle) const { loadCurl()->easy_cleanup(handle); }
 };
 struct CurlUrlCleanup {
-    void operator()(CURLU* handle) const { curl_url_cleanup(handle); }
+    void operator()(CURLU* handle) const { loadCurl()->url_cleanup(handle); }
 };
 struct CurlSlistFree {
-    void operator()(curl_slist* list) const { curl_slist_free_all(list); }
+    void operator()(curl_slist* list) const { loadCurl()->slist_free_all(list); }
 };
 struct CurlFree {
-    void operator()(char* text) const { curl_free(text); }
+    void operator()(char* text) const { loadCurl()->free(text); }
 };
 
 using CurlEasy = std::unique_ptr<CURL, CurlEasyCleanup>;

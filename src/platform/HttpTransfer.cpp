@@ -10,12 +10,6 @@ namespace {
 constexpr long kMaxRedirects = 5;
 constexpr const char* kAllowedProtocols = "http,https";
 
-bool curlReady() {
-    // Reference-counted and thread-safe in the libcurl this builds against; done once anyway.
-    static const bool ready = curl_global_init(CURL_GLOBAL_DEFAULT) == CURLE_OK;
-    return ready;
-}
-
 struct TransferState {
     const HttpBodyReceiver* receiver = nullptr;
     std::string refusal;
@@ -41,11 +35,11 @@ bool isHttpScheme(const char* scheme) {
 
 bool transferHttpBody(const std::string& url, const HttpBodyReceiver& receiver,
                       const HttpTransferLimits& limits, std::string& error) {
-    if (!curlReady()) {
-        error = "libcurl could not be initialised";
+    const CurlLibrary* libcurl = loadCurl(&error);
+    if (libcurl == nullptr) {
         return false;
     }
-    CurlEasy handle(curl_easy_init());
+    CurlEasy handle(libcurl->easy_init());
     if (!handle) {
         error = "libcurl could not create a transfer";
         return false;
@@ -54,26 +48,28 @@ bool transferHttpBody(const std::string& url, const HttpBodyReceiver& receiver,
     TransferState state{&receiver, {}, false};
     char errorText[CURL_ERROR_SIZE] = {};
     bool configured =
-        curl_easy_setopt(curl, CURLOPT_URL, url.c_str()) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_PROTOCOLS_STR, kAllowedProtocols) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_REDIR_PROTOCOLS_STR, kAllowedProtocols) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_FOLLOWLOCATION, 1L) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_MAXREDIRS, kMaxRedirects) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_FAILONERROR, 1L) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_NOSIGNAL, 1L) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_CONNECTTIMEOUT, limits.connectTimeoutSeconds) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_LOW_SPEED_LIMIT, limits.lowSpeedBytesPerSecond) ==
+        libcurl->easy_setopt(curl, CURLOPT_URL, url.c_str()) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_PROTOCOLS_STR, kAllowedProtocols) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_REDIR_PROTOCOLS_STR, kAllowedProtocols) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_FOLLOWLOCATION, 1L) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_MAXREDIRS, kMaxRedirects) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_FAILONERROR, 1L) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_NOSIGNAL, 1L) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_CONNECTTIMEOUT, limits.connectTimeoutSeconds) ==
             CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_LOW_SPEED_TIME, limits.lowSpeedSeconds) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_TIMEOUT_MS, limits.totalTimeoutMilliseconds) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_ERRORBUFFER, errorText) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_WRITEFUNCTION, receiveBody) == CURLE_OK &&
-        curl_easy_setopt(curl, CURLOPT_WRITEDATA, &state) == CURLE_OK;
+        libcurl->easy_setopt(curl, CURLOPT_LOW_SPEED_LIMIT, limits.lowSpeedBytesPerSecond) ==
+            CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_LOW_SPEED_TIME, limits.lowSpeedSeconds) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_TIMEOUT_MS, limits.totalTimeoutMilliseconds) ==
+            CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_ERRORBUFFER, errorText) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_WRITEFUNCTION, receiveBody) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_WRITEDATA, &state) == CURLE_OK;
     if (!configured) {
         error = "libcurl refused the transfer options";
         return false;
     }
-    CURLcode result = curl_easy_perform(curl);
+    CURLcode result = libcurl->easy_perform(curl);
     if (result == CURLE_OK) {
         return true;
     }
@@ -81,10 +77,10 @@ bool transferHttpBody(const std::string& url, const HttpBodyReceiver& receiver,
         error = state.refusal;
     } else if (result == CURLE_HTTP_RETURNED_ERROR) {
         long status = 0;
-        curl_easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &status);
+        libcurl->easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &status);
         error = "the server answered HTTP status " + std::to_string(status);
     } else {
-        error = errorText[0] != '\0' ? errorText : curl_easy_strerror(result);
+        error = errorText[0] != '\0' ? errorText : libcurl->easy_strerror(result);
     }
     return false;
 }
@@ -107,13 +103,17 @@ std::optional<std::string> fetchHttpBody(const std::string& url, std::size_t max
 }
 
 std::optional<std::string> resolveHttpURL(const std::string& base, const std::string& reference) {
-    CurlUrl handle(curl_url());
-    if (!handle || curl_url_set(handle.get(), CURLUPART_URL, base.c_str(), 0) != CURLUE_OK ||
-        curl_url_set(handle.get(), CURLUPART_URL, reference.c_str(), 0) != CURLUE_OK) {
+    const CurlLibrary* libcurl = loadCurl();
+    if (libcurl == nullptr) {
+        return std::nullopt;
+    }
+    CurlUrl handle(libcurl->url());
+    if (!handle || libcurl->url_set(handle.get(), CURLUPART_URL, base.c_str(), 0) != CURLUE_OK ||
+        libcurl->url_set(handle.get(), CURLUPART_URL, reference.c_str(), 0) != CURLUE_OK) {
         return std::nullopt;
     }
     char* rawScheme = nullptr;
-    if (curl_url_get(handle.get(), CURLUPART_SCHEME, &rawScheme, 0) != CURLUE_OK) {
+    if (libcurl->url_get(handle.get(), CURLUPART_SCHEME, &rawScheme, 0) != CURLUE_OK) {
         return std::nullopt;
     }
     CurlString scheme(rawScheme);
@@ -121,7 +121,7 @@ std::optional<std::string> resolveHttpURL(const std::string& base, const std::st
         return std::nullopt;
     }
     char* rawURL = nullptr;
-    if (curl_url_get(handle.get(), CURLUPART_URL, &rawURL, 0) != CURLUE_OK) {
+    if (libcurl->url_get(handle.get(), CURLUPART_URL, &rawURL, 0) != CURLUE_OK) {
         return std::nullopt;
     }
     CurlString resolved(rawURL);

@@ -1,7 +1,7 @@
 #include "plist/PropertyListBounds.h"
 
 #include <cstdint>
-#include <unordered_map>
+#include <vector>
 
 namespace tavrix::plist {
 namespace {
@@ -54,15 +54,21 @@ class XmlScan {
   private:
     static constexpr std::size_t npos = std::string_view::npos;
 
-    // The first terminator at or after from, skipping double-quoted text when quoted.
+    // The first terminator at or after from, skipping double-quoted text when quoted. This scan
+    // runs over every byte of every document read: the whole terminator is compared only where
+    // its first character is.
     std::size_t find(std::size_t from, std::string_view terminator, bool quoted) const {
+        const char first = terminator[0];
+        const char* data = xml_.data();
         for (std::size_t at = from; at < xml_.size(); ++at) {
-            if (quoted && xml_[at] == '"') {
+            if (quoted && data[at] == '"') {
                 at = xml_.find('"', at + 1);
                 if (at == npos) {
                     return npos;
                 }
-            } else if (xml_.compare(at, terminator.size(), terminator) == 0) {
+            } else if (data[at] == first &&
+                       (terminator.size() == 1 ||
+                        xml_.compare(at, terminator.size(), terminator) == 0)) {
                 return at;
             }
         }
@@ -96,7 +102,8 @@ class XmlScan {
         return skip(start, start + 2, ">", true);
     }
 
-    // An element start tag: open unless it ends in "/>" however its quotes are read.
+    // An element start tag: open unless it ends in "/>" however its quotes are read. The same
+    // as skip(start, start + 1, ">", true), with both ends found once.
     std::size_t tag(std::size_t start) {
         std::size_t honoured = find(start + 1, ">", true);
         std::size_t plain = find(start + 1, ">", false);
@@ -106,7 +113,12 @@ class XmlScan {
         if (!selfClosing) {
             ++depth_;
         }
-        return skip(start, start + 1, ">", true);
+        if (honoured == npos) {
+            uncertain(start + 1, xml_.size());
+            return xml_.size();
+        }
+        uncertain(plain, honoured);
+        return honoured + 1;
     }
 
     // Text that libplist may or may not read as markup: every '<' that could start an element
@@ -126,10 +138,14 @@ class XmlScan {
 };
 
 // What one binary object becomes once libplist has copied every shared reference.
+// Kept small: one is held for every object of the document. The limits keep each count far
+// below 2^32.
 struct Expansion {
-    std::uint64_t nodes = 0;
-    std::uint64_t payloadBytes = 0;
-    std::size_t height = 0;
+    enum State : std::uint8_t { kUnseen, kWalking, kDone };
+    std::uint32_t nodes = 0;
+    std::uint32_t payloadBytes = 0;
+    std::uint16_t height = 0;
+    State state = kUnseen;
 };
 
 // Walks the objects of a binary property list from the top object along their references,
@@ -156,8 +172,14 @@ class BinaryWalk {
             top >= objectCount) {
             return std::string("its trailer is damaged");
         }
+        // Every object of a well-formed list is reached at least once, so more objects than
+        // nodes would exceed the limit anyway; this also bounds the table of expansions below.
+        if (objectCount > kMaxPropertyListNodes) {
+            return tooManyNodes();
+        }
         table_ = table;
         objectCount_ = objectCount;
+        expansions_.assign(objectCount, Expansion{});
         Expansion root;
         if (auto failure = walk(top, 1, root)) {
             return failure;
@@ -204,20 +226,21 @@ class BinaryWalk {
         if (depth > kMaxPropertyListDepth) {
             return tooDeep();
         }
-        auto known = visited_.find(index);
-        if (known != visited_.end()) {
-            if (known->second.nodes == 0) {
-                return std::string("an object contains itself");
-            }
-            out = known->second;
+        Expansion& known = expansions_[index];
+        if (known.state == Expansion::kWalking) {
+            return std::string("an object contains itself");
+        }
+        if (known.state == Expansion::kDone) {
+            out = known;
             return std::nullopt;
         }
-        visited_.emplace(index, Expansion{});  // nodes 0 marks an object being walked
+        known.state = Expansion::kWalking;
         Expansion expansion;
         if (auto failure = expand(index, depth, expansion)) {
             return failure;
         }
-        visited_[index] = expansion;
+        expansion.state = Expansion::kDone;
+        expansions_[index] = expansion;
         out = expansion;
         return std::nullopt;
     }
@@ -229,7 +252,7 @@ class BinaryWalk {
         }
         auto marker = static_cast<std::size_t>(offset);
         auto kind = static_cast<unsigned char>(bytes_[marker]) >> 4;
-        out = Expansion{1, 0, 1};
+        out = Expansion{1, 0, 1, Expansion::kUnseen};
         std::uint64_t count = 0;
         std::size_t contents = 0;
         switch (kind) {
@@ -264,7 +287,7 @@ class BinaryWalk {
                     return std::string("a string holds a NUL character");
                 }
                 // UTF-16 becomes up to three UTF-8 bytes per unit.
-                out.payloadBytes = kind == 0x6 ? count * 3 : count;
+                out.payloadBytes = static_cast<std::uint32_t>(kind == 0x6 ? count * 3 : count);
                 return std::nullopt;
             }
             case 0xA:  // array
@@ -292,7 +315,7 @@ class BinaryWalk {
                     }
                     out.nodes += part.nodes;
                     out.payloadBytes += part.payloadBytes;
-                    out.height = std::max(out.height, part.height + 1);
+                    out.height = std::max<std::uint16_t>(out.height, part.height + 1);
                     if (out.nodes > kMaxPropertyListNodes) {
                         return tooManyNodes();
                     }
@@ -338,7 +361,8 @@ class BinaryWalk {
     std::size_t table_ = 0;
     std::size_t objectsEnd_ = 0;
     std::uint64_t objectCount_ = 0;
-    std::unordered_map<std::uint64_t, Expansion> visited_;
+    // Indexed by object; the trailer check bounds the object count.
+    std::vector<Expansion> expansions_;
 };
 
 }  // namespace

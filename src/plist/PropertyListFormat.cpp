@@ -16,6 +16,7 @@
 #include <memory>
 #include <vector>
 
+#include "plist/PropertyListWriter.h"
 #include "util/UniqueFd.h"
 
 namespace tavrix::plist {
@@ -26,12 +27,6 @@ struct NodeDeleter {
 };
 using Node = std::unique_ptr<void, NodeDeleter>;
 
-struct XmlBufferDeleter {
-    void operator()(char* buffer) const { plist_to_xml_free(buffer); }
-};
-struct BinaryBufferDeleter {
-    void operator()(char* buffer) const { plist_to_bin_free(buffer); }
-};
 struct MallocDeleter {
     void operator()(char* buffer) const { std::free(buffer); }
 };
@@ -79,6 +74,15 @@ std::int64_t fractionMicros(std::string_view text) {
 // the document damaged.
 bool isValidUtf8(std::string_view text) {
     std::size_t i = 0;
+    // Most text is ASCII: eight bytes at a time until the first byte that is not.
+    while (text.size() - i >= 8) {
+        std::uint64_t word;
+        std::memcpy(&word, text.data() + i, 8);
+        if ((word & 0x8080808080808080ULL) != 0) {
+            break;
+        }
+        i += 8;
+    }
     while (i < text.size()) {
         auto byte = static_cast<unsigned char>(text[i]);
         std::size_t extra = 0;
@@ -284,108 +288,6 @@ class NodeReader {
     std::size_t nextDate_ = 0;
 };
 
-// Builds libplist's tree.
-class NodeWriter {
-  public:
-    // With wholeSecondDates, dates go to libplist without their fractions: XML readers elsewhere
-    // refuse fractional seconds, and libplist's XML writer mangles fractions of dates before the
-    // reference date.
-    explicit NodeWriter(bool wholeSecondDates) : wholeSecondDates_(wholeSecondDates) {}
-
-    Node write(const Value& value) { return Node(build(value)); }
-
-  private:
-    plist_t build(const Value& value) {
-        switch (value.type()) {
-            case Type::Dictionary: {
-                plist_t dictionary = plist_new_dict();
-                for (const auto& [key, child] : *value.asDictionary()) {
-                    plist_dict_set_item(dictionary, key.c_str(), build(child));
-                }
-                return dictionary;
-            }
-            case Type::Array: {
-                plist_t array = plist_new_array();
-                for (const auto& child : *value.asArray()) {
-                    plist_array_append_item(array, build(child));
-                }
-                return array;
-            }
-            case Type::String:
-                return plist_new_string(value.asString()->c_str());
-            case Type::Integer:
-                return buildInteger(*value.asInteger());
-            case Type::Real:
-                return plist_new_real(*value.asReal());
-            case Type::Boolean:
-                return plist_new_bool(*value.asBoolean() ? 1 : 0);
-            case Type::Date:
-                return buildDate(*value.asDate());
-            case Type::Data: {
-                const Data& data = *value.asData();
-                return plist_new_data(reinterpret_cast<const char*>(data.data()), data.size());
-            }
-        }
-        return plist_new_bool(0);
-    }
-
-    // plist_new_uint marks every value as signed; an unsigned value above INT64_MAX gets its
-    // unsigned marking only from libplist's own XML reader.
-    static plist_t buildInteger(const Integer& integer) {
-        if (integer.isLargeUnsigned()) {
-            std::string xml =
-                "<plist><integer>" + std::to_string(integer.unsignedValue()) + "</integer></plist>";
-            plist_t node = nullptr;
-            plist_from_xml(xml.data(), static_cast<uint32_t>(xml.size()), &node);
-            if (node != nullptr) {
-                return node;
-            }
-        }
-        return plist_new_uint(integer.unsignedValue());
-    }
-
-    plist_t buildDate(const Date& date) {
-        double totalMicros = std::round(date.secondsSinceReferenceDate * kMicrosPerSecond);
-        // libplist holds dates as 32-bit seconds; later or earlier dates are clamped to its range.
-        constexpr double kMinMicros = static_cast<double>(INT32_MIN) * kMicrosPerSecond;
-        constexpr double kMaxMicros = static_cast<double>(INT32_MAX) * kMicrosPerSecond;
-        if (!(totalMicros >= kMinMicros)) {
-            totalMicros = kMinMicros;
-        }
-        if (totalMicros > kMaxMicros) {
-            totalMicros = kMaxMicros;
-        }
-        auto micros = static_cast<std::int64_t>(totalMicros);
-        std::int64_t seconds = micros / kMicrosPerSecond;
-        std::int64_t fraction = micros % kMicrosPerSecond;
-        if (fraction < 0) {
-            fraction += kMicrosPerSecond;
-            seconds -= 1;
-        }
-        return plist_new_date(static_cast<int32_t>(seconds),
-                              wholeSecondDates_ ? 0 : static_cast<int32_t>(fraction));
-    }
-
-    bool wholeSecondDates_;
-};
-
-// libplist's XML carries a DOCTYPE naming an outside document; a property list needs none.
-void removeDoctype(std::string& xml) {
-    std::size_t start = xml.find("<!DOCTYPE");
-    if (start == std::string::npos || start > 256) {
-        return;
-    }
-    std::size_t end = xml.find('>', start);
-    if (end == std::string::npos) {
-        return;
-    }
-    end += 1;
-    if (end < xml.size() && xml[end] == '\n') {
-        end += 1;
-    }
-    xml.erase(start, end - start);
-}
-
 std::string tooLarge() {
     return "it is larger than " + std::to_string(kMaxPropertyListBytes) + " bytes";
 }
@@ -505,24 +407,7 @@ std::optional<Value> readFile(const std::string& path, Refusal* refusal) {
 }
 
 std::string serialize(const Value& value, Format format) {
-    NodeWriter writer(format == Format::Xml);
-    Node root = writer.write(value);
-    uint32_t length = 0;
-    if (format == Format::Binary) {
-        char* bytes = nullptr;
-        plist_to_bin(root.get(), &bytes, &length);
-        std::unique_ptr<char, BinaryBufferDeleter> owned(bytes);
-        return bytes == nullptr ? std::string() : std::string(bytes, length);
-    }
-    char* xml = nullptr;
-    plist_to_xml(root.get(), &xml, &length);
-    std::unique_ptr<char, XmlBufferDeleter> owned(xml);
-    if (xml == nullptr) {
-        return {};
-    }
-    std::string text(xml, length);
-    removeDoctype(text);
-    return text;
+    return format == Format::Binary ? writeBinary(value) : writeXml(value);
 }
 
 bool writeFile(const std::string& path, const Value& value, Format format) {

@@ -1,7 +1,7 @@
 // Reading and writing property lists in their XML and binary file formats.
-// All parsing and serialization is done by libplist; damaged or hostile input is "no value", never
-// a crash: files must be regular and at most kMaxPropertyListBytes long, and documents stay within
-// the limits of PropertyListBounds.h before libplist sees them.
+// All parsing is done by libplist (writing is PropertyListWriter's); damaged or hostile input is
+// "no value", never a crash: files must be regular and at most kMaxPropertyListBytes long, and
+// documents stay within the limits of PropertyListBounds.h before libplist sees them.
 #pragma once
 
 #include <optional>
