@@ -31,6 +31,8 @@ unit=$(find_one systemd/system/tavrixservicesd.service)
 find_one systemd/system/tavrixservicesd-update.timer >/dev/null
 activation=$(find_one dbus-1/system-services/com.zandor.tavrixservicesd.service)
 find_one dbus-1/system.d/com.zandor.tavrixservicesd.conf >/dev/null
+completion=$(find_one bash-completion/completions/tavrixctl)
+bash -n "$completion" || fail "the bash completion does not parse"
 sysusers=$(find_one sysusers.d/tavrixservicesd.conf)
 tmpfiles=$(find_one tmpfiles.d/tavrixservicesd.conf)
 
