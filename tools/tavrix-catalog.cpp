@@ -29,7 +29,9 @@ constexpr const char* kHelp =
     "publish  packs each bundle directory into OUTDIR/archives/NAME-VERSION.tgz and lists it\n"
     "         in OUTDIR/catalog.plist, signed into OUTDIR/catalog.plist.sig. Bundles are\n"
     "         added to the catalog already in OUTDIR; one with the same archive name\n"
-    "         replaces its entry. Serve OUTDIR with any static HTTP server.\n"
+    "         replaces its entry. Serve OUTDIR with any static HTTP server. A bundle\n"
+    "         directory needs an Info.plist with QZBundleIdentifier and QZBundleVersion\n"
+    "         strings and a behavior.plist; one without them is refused.\n"
     "\n"
     "publish options:\n"
     "  --key FILE         sign with this secret key\n"
@@ -38,10 +40,14 @@ constexpr const char* kHelp =
     "  --fresh            start a new catalog instead of adding to the existing one\n"
     "\n"
     "BUNDLE_OPTIONS apply to the bundle directory before them:\n"
-    "  --version V        the asset's Version (default: the bundle's Info.plist QZBundleVersion)\n"
+    "  --version V        must equal the bundle's Info.plist QZBundleVersion, which is the\n"
+    "                     asset's Version\n"
     "  --product-type T   a supported product type (repeatable; none: every product type)\n"
     "  --min-os V         MinimumOSVersion\n"
-    "  --max-os V         MaximumOSVersion\n";
+    "  --max-os V         MaximumOSVersion\n"
+    "\n"
+    "  -h, --help         show this help\n"
+    "  --version          show the tool's version (before a command)\n";
 
 int usageError(const std::string& message) {
     std::fprintf(stderr, "tavrix-catalog: %s\nTry 'tavrix-catalog --help'.\n", message.c_str());
@@ -141,6 +147,11 @@ int main(int argc, char** argv) {
             std::fputs(kHelp, stdout);
             return 0;
         }
+    }
+    // Only before a command: after a bundle directory, --version is that bundle's.
+    if (!arguments.empty() && arguments.front() == "--version") {
+        std::printf("tavrix-catalog %s\n", TAVRIX_VERSION);
+        return 0;
     }
     if (arguments.empty()) {
         return usageError("a command is needed");

@@ -10,10 +10,21 @@
 
 namespace {
 
+constexpr const char* kUsage =
+    "usage: tavrix-plist FILE\n"
+    "       tavrix-plist --xml|--binary FILE OUT\n";
+
+constexpr const char* kHelp =
+    "\n"
+    "Prints a property-list file (XML or binary) readably, or converts it.\n"
+    "\n"
+    "  --xml FILE OUT     write FILE as an XML property list to OUT\n"
+    "  --binary FILE OUT  write FILE as a binary property list to OUT\n"
+    "  --version          show the version\n"
+    "  -h, --help         show this help\n";
+
 int usage() {
-    std::fprintf(stderr,
-                 "usage: tavrix-plist FILE\n"
-                 "       tavrix-plist --xml|--binary FILE OUT\n");
+    std::fputs(kUsage, stderr);
     return 2;
 }
 
@@ -21,7 +32,15 @@ int usage() {
 
 int main(int argc, char** argv) {
     using namespace tavrix::plist;
-    if (argc == 2 && std::strcmp(argv[1], "--help") != 0) {
+    if (argc == 2 && (std::strcmp(argv[1], "--help") == 0 || std::strcmp(argv[1], "-h") == 0)) {
+        std::printf("%s%s", kUsage, kHelp);
+        return 0;
+    }
+    if (argc == 2 && std::strcmp(argv[1], "--version") == 0) {
+        std::printf("tavrix-plist %s\n", TAVRIX_VERSION);
+        return 0;
+    }
+    if (argc == 2) {
         Refusal refusal;
         auto value = readFile(argv[1], &refusal);
         if (!value) {

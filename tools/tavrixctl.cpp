@@ -21,8 +21,11 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <thread>
 #include <vector>
 
+#include "TavrixctlOutput.h"
+#include "catalog/BundleCheck.h"
 #include "client/TavrixClient.h"
 #include "payload/Archive.h"
 #include "util/UniqueFd.h"
@@ -31,36 +34,44 @@ namespace {
 
 using tavrix::client::ClientError;
 using tavrix::client::TavrixClient;
+namespace plist = tavrix::plist;
 
 constexpr int kFailure = 1;
 constexpr int kUsage = 2;
 
-// Posted by the daemon after it linked a changed bundle.
-constexpr const char* kBundleChangedNotification = "kTVXBehaviorBundleChangedNotification";
+// How often check-update --wait asks how the check is going.
+constexpr std::chrono::milliseconds kStatusPollInterval{100};
 
 constexpr const char* kOverallHelp =
-    "usage: tavrixctl [--address ADDRESS] COMMAND [ARGUMENTS]\n"
+    "usage: tavrixctl [--address ADDRESS] [--json] COMMAND [ARGUMENTS]\n"
     "\n"
     "Calls tavrixservicesd on the system bus.\n"
     "\n"
     "Commands:\n"
+    "  status                     show the daemon's state: behavior ID, linked bundle,\n"
+    "                             update checks and the last payload\n"
     "  set-id ID [--bundle FILE]  set the behavior ID, optionally with a packed bundle\n"
     "  supported                  tell whether behavior bundles are supported\n"
     "  value KEY                  print the behavior setting for KEY\n"
     "  check-update [--wait SECONDS]\n"
-    "                             look for a newer behavior bundle and install it\n"
+    "                             look for a newer behavior bundle and install it; print\n"
+    "                             how the check went\n"
     "  client-type N              announce this client's type N\n"
     "  watch [--count N] [--timeout SECONDS]\n"
     "                             print the names of posted notifications\n"
     "  pack DIR -o FILE           pack the files below DIR into a bundle payload FILE\n"
     "                             (works offline: the daemon is not called)\n"
     "\n"
-    "Options:\n"
+    "Options (anywhere on the line):\n"
     "  --address ADDRESS  use the message bus at this D-Bus address instead\n"
+    "  --json             print the answer as one line of JSON (status, supported, value,\n"
+    "                     check-update, set-id, client-type)\n"
     "  --version          show the version\n"
     "  -h, --help         show this help; 'tavrixctl COMMAND --help' shows a command's\n"
     "\n"
-    "Exit status: 0 on success (whatever the answer), 1 on failure, 2 on a usage mistake.\n";
+    "Exit status: 0 on success (whatever the answer), 1 on failure (check-update: also when\n"
+    "the check failed), 2 on a usage mistake. Setting the behavior ID and starting a check\n"
+    "are for root and members of the \"tavrix\" group; anyone may ask the rest.\n";
 
 struct Command {
     const char* name;
@@ -88,10 +99,20 @@ constexpr Command kCommands[] = {
      "usage: tavrixctl check-update [--wait SECONDS]\n"
      "\n"
      "Asks the daemon to look for a newer behavior bundle and install it. Prints \"yes\" when\n"
-     "an update was found and its download started, else \"no\". The download and the\n"
-     "installation go on in the daemon after the answer. With --wait, after a \"yes\" it waits\n"
-     "up to SECONDS for the daemon to announce the installed bundle and prints the\n"
-     "notification's name; exits 1 when none came in time.\n"},
+     "an update was found and its download started, else \"no\", then how the check went\n"
+     "(the status view's last check): \"up to date ...\", \"installed version V\",\n"
+     "\"no catalog configured\", \"catalog refused: ...\", \"catalog fetch failed: ...\",\n"
+     "\"download failed: ...\" or, while it goes on, \"downloading version V\". The download\n"
+     "and the installation go on in the daemon after the answer; with --wait, after a \"yes\"\n"
+     "it waits up to SECONDS for them to end. Exits 0 when the bundle is up to date, installed\n"
+     "or (without --wait) downloading, 1 when the check failed or did not end in time.\n"},
+    {"status",
+     "usage: tavrixctl status\n"
+     "\n"
+     "Prints the daemon's state: its version, the behavior ID, whether bundles are supported\n"
+     "and why not, the linked bundle, the system and user bundle versions, the next update\n"
+     "check, and the last check and payload with their outcome. Anyone may ask; nothing is\n"
+     "started by asking. With --json, the view as one JSON object (see docs/dbus-api.md).\n"},
     {"client-type",
      "usage: tavrixctl client-type N\n"
      "\n"
@@ -111,7 +132,9 @@ constexpr Command kCommands[] = {
      "gzip-compressed tar archive for 'set-id --bundle'. Together the files may hold at most\n"
      "10000000 bytes. Each file that cannot be packed (unreadable, or over that limit) is\n"
      "named on stderr and nothing is written; otherwise FILE is replaced whole. Other kinds\n"
-     "of entries (symbolic links, devices) are named and left out. The daemon is not called.\n"},
+     "of entries (symbolic links, devices) are named and left out. DIR must be a bundle: an\n"
+     "Info.plist with QZBundleIdentifier and QZBundleVersion strings and a behavior.plist,\n"
+     "else nothing is packed. The daemon is not called.\n"},
 };
 
 // A usage mistake: the reason, reported with exit status 2.
@@ -285,9 +308,9 @@ int pack(Arguments& arguments) {
     if (!output || output->empty()) {
         throw UsageError{"pack: -o FILE is required"};
     }
-    std::error_code error;
-    if (!fs::is_directory(directory, error)) {
-        throw Failure{"pack: " + directory + " is not a directory"};
+    std::string notABundle;
+    if (!tavrix::tools::checkBundleDirectory(directory, notABundle)) {
+        throw Failure{"pack: refused " + notABundle};
     }
 
     std::vector<FileToPack> files;
@@ -335,8 +358,24 @@ int pack(Arguments& arguments) {
     return 0;
 }
 
-void printBoolean(bool answer) {
-    std::printf("%s\n", answer ? "yes" : "no");
+// Set from --json: answers go out as one line of JSON.
+bool jsonOutput = false;
+
+// A yes/no answer: "yes" or "no", or {"<name>":true} in JSON.
+void printBoolean(bool answer, const char* name) {
+    if (jsonOutput) {
+        std::printf("{\"%s\":%s}\n", name, answer ? "true" : "false");
+    } else {
+        std::printf("%s\n", answer ? "yes" : "no");
+    }
+}
+
+constexpr const char* kAccessDenied = "org.freedesktop.DBus.Error.AccessDenied";
+
+// The outcomes of a check that count as success.
+bool checkSucceeded(const std::string& outcome, bool waited) {
+    return outcome == "up-to-date" || outcome == "installed" ||
+           (!waited && outcome == "downloading");
 }
 
 // What a command does once connected; answers the exit status.
@@ -382,30 +421,55 @@ int watch(TavrixClient& client, std::optional<long long> count,
     return 0;
 }
 
-// The update is installed after the answer, on the daemon's own time; waiting shows its end.
+// The update is installed after the answer, on the daemon's own time; the status view's last
+// check says how it went, and waiting watches it until it is no longer downloading.
 int checkUpdate(TavrixClient& client, std::optional<std::chrono::milliseconds> wait) {
-    bool announced = false;
-    tavrix::client::NotificationSubscription subscription;
-    if (wait) {
-        // Subscribed before asking, so that a quick installation is not missed.
-        subscription = client.subscribe([&](const std::string& name) {
-            announced = announced || name == kBundleChangedNotification;
-        });
-    }
     const bool started = client.checkForTavrixBundleUpdate();
-    printBoolean(started);
-    if (!wait || !started) {
-        return 0;
+    auto lastCheck = [&client] {
+        plist::Dictionary status = client.status();
+        auto check = status.find("LastCheck");
+        return check != status.end() && check->second.asDictionary() != nullptr
+                   ? *check->second.asDictionary()
+                   : plist::Dictionary();
+    };
+    auto textOf = [](const plist::Dictionary& check, const char* key) {
+        auto found = check.find(key);
+        return found != check.end() && found->second.asString() != nullptr
+                   ? *found->second.asString()
+                   : std::string();
+    };
+    plist::Dictionary check = lastCheck();
+    if (started && wait) {
+        if (!jsonOutput) {
+            printBoolean(started, "started");
+            std::fflush(stdout);
+        }
+        const auto deadline = std::chrono::steady_clock::now() + *wait;
+        while (textOf(check, "Outcome") == "downloading") {
+            if (std::chrono::steady_clock::now() >= deadline) {
+                char seconds[32];
+                std::snprintf(seconds, sizeof seconds, "%g",
+                              static_cast<double>(wait->count()) / 1000);
+                throw Failure{std::string("check-update: still downloading after ") + seconds +
+                              " seconds"};
+            }
+            std::this_thread::sleep_for(kStatusPollInterval);
+            check = lastCheck();
+        }
+    } else if (!jsonOutput) {
+        printBoolean(started, "started");
     }
-    std::fflush(stdout);
-    if (!client.runUntil([&] { return announced; }, *wait)) {
-        char seconds[32];
-        std::snprintf(seconds, sizeof seconds, "%g", static_cast<double>(wait->count()) / 1000);
-        throw Failure{std::string("check-update: no new bundle was announced within ") + seconds +
-                      " seconds"};
+    const std::string outcome = textOf(check, "Outcome");
+    const std::string reason = outcome.empty() ? "no check recorded" : textOf(check, "Reason");
+    if (jsonOutput) {
+        plist::Dictionary answer{{"started", plist::Value(started)},
+                                 {"outcome", plist::Value(outcome)},
+                                 {"reason", plist::Value(reason)}};
+        std::printf("%s\n", tavrix::tools::toJson(plist::Value(std::move(answer))).c_str());
+    } else {
+        std::printf("%s\n", reason.c_str());
     }
-    std::printf("%s\n", kBundleChangedNotification);
-    return 0;
+    return checkSucceeded(outcome, started && wait.has_value()) ? 0 : kFailure;
 }
 
 Action parseWatch(Arguments& arguments) {
@@ -439,14 +503,26 @@ Action parseCommand(const Command& command, Arguments& arguments) {
             bundle = readWholeFile(*file);
         }
         return [id, bundle = std::move(bundle)](TavrixClient& client) {
-            printBoolean(client.setTavrixID(id, bundle));
+            printBoolean(client.setTavrixID(id, bundle), "accepted");
             return 0;
         };
     }
     if (name == "supported") {
         arguments.operands({});
         return [](TavrixClient& client) {
-            printBoolean(client.isTavrixBundleSupported());
+            printBoolean(client.isTavrixBundleSupported(), "supported");
+            return 0;
+        };
+    }
+    if (name == "status") {
+        arguments.operands({});
+        return [](TavrixClient& client) {
+            const plist::Dictionary status = client.status();
+            if (jsonOutput) {
+                std::printf("%s\n", tavrix::tools::toJson(plist::Value(status)).c_str());
+            } else {
+                std::fputs(tavrix::tools::readableStatus(status).c_str(), stdout);
+            }
             return 0;
         };
     }
@@ -454,7 +530,13 @@ Action parseCommand(const Command& command, Arguments& arguments) {
         auto key = arguments.operands({"KEY"})[0];
         return [key](TavrixClient& client) {
             auto value = client.copyTavrixValue(key);
-            std::printf("%s\n", value ? value->description().c_str() : "(no value)");
+            if (jsonOutput) {
+                std::printf("{\"key\":%s,\"value\":%s}\n",
+                            tavrix::tools::toJson(plist::Value(key)).c_str(),
+                            value ? tavrix::tools::toJson(*value).c_str() : "null");
+            } else {
+                std::printf("%s\n", value ? value->description().c_str() : "(no value)");
+            }
             return 0;
         };
     }
@@ -478,18 +560,44 @@ Action parseCommand(const Command& command, Arguments& arguments) {
             throw UsageError{"client-type: N must be a signed 32-bit number, not '" + text + "'"};
         }
         return [type = static_cast<std::int32_t>(*type)](TavrixClient& client) {
-            printBoolean(client.setClientType(type));
+            printBoolean(client.setClientType(type), "known");
             return 0;
         };
     }
     return parseWatch(arguments);
 }
 
+// Takes the global options out of words, wherever they are.
+std::optional<std::string> takeGlobalOptions(std::vector<std::string>& words) {
+    std::optional<std::string> address;
+    for (std::size_t i = 0; i < words.size();) {
+        if (words[i] == "--json") {
+            jsonOutput = true;
+            words.erase(words.begin() + static_cast<std::ptrdiff_t>(i));
+        } else if (words[i] == "--address") {
+            if (i + 1 == words.size()) {
+                throw UsageError{"--address needs a value"};
+            }
+            address = words[i + 1];
+            words.erase(words.begin() + static_cast<std::ptrdiff_t>(i),
+                        words.begin() + static_cast<std::ptrdiff_t>(i) + 2);
+        } else if (words[i].rfind("--address=", 0) == 0) {
+            address = words[i].substr(std::strlen("--address="));
+            words.erase(words.begin() + static_cast<std::ptrdiff_t>(i));
+        } else {
+            ++i;
+        }
+    }
+    if (address && address->empty()) {
+        throw UsageError{"--address needs a value"};
+    }
+    return address;
+}
+
 int run(int argc, char** argv) {
     std::vector<std::string> words(argv + 1, argv + argc);
-    std::optional<std::string> address;
+    std::optional<std::string> address = takeGlobalOptions(words);
     std::size_t next = 0;
-    // Global options come before the command.
     for (; next < words.size() && words[next].rfind("-", 0) == 0; ++next) {
         const std::string& word = words[next];
         if (word == "--help" || word == "-h") {
@@ -500,16 +608,7 @@ int run(int argc, char** argv) {
             std::printf("tavrixctl %s\n", TAVRIX_VERSION);
             return 0;
         }
-        if (word == "--address") {
-            if (next + 1 == words.size()) {
-                throw UsageError{"--address needs a value"};
-            }
-            address = words[++next];
-        } else if (word.rfind("--address=", 0) == 0) {
-            address = word.substr(std::strlen("--address="));
-        } else {
-            throw UsageError{"unknown option " + word};
-        }
+        throw UsageError{"unknown option " + word};
     }
     if (next == words.size()) {
         throw UsageError{"no command given"};
@@ -521,17 +620,18 @@ int run(int argc, char** argv) {
     std::vector<std::string> rest(words.begin() + static_cast<std::ptrdiff_t>(next) + 1,
                                   words.end());
     for (const std::string& word : rest) {
-        if (word == "--help") {
+        if (word == "--help" || word == "-h") {
             std::fputs(command->help, stdout);
             return 0;
         }
     }
-    if (address && address->empty()) {
-        throw UsageError{"--address needs a value"};
+    const std::string_view name = command->name;
+    if (jsonOutput && (name == "pack" || name == "watch")) {
+        throw UsageError{std::string(name) + " has no --json output"};
     }
     Arguments arguments(*command, std::move(rest));
     // Packing works on local files only; it needs no bus.
-    if (std::string_view(command->name) == "pack") {
+    if (name == "pack") {
         return pack(arguments);
     }
     Action action = parseCommand(*command, arguments);
@@ -552,7 +652,14 @@ int main(int argc, char** argv) {
         std::fprintf(stderr, "tavrixctl: %s\n", error.reason.c_str());
         return kFailure;
     } catch (const ClientError& error) {
-        std::fprintf(stderr, "tavrixctl: %s\n", error.what());
+        if (std::strstr(error.what(), kAccessDenied) != nullptr) {
+            std::fprintf(stderr,
+                         "tavrixctl: refused by the bus policy (AccessDenied): only root and "
+                         "members of the \"tavrix\" group may set the behavior ID or start an "
+                         "update check\n");
+        } else {
+            std::fprintf(stderr, "tavrixctl: %s\n", error.what());
+        }
         return kFailure;
     } catch (const std::exception& error) {
         std::fprintf(stderr, "tavrixctl: %s\n", error.what());

@@ -23,8 +23,9 @@ class BundleManager {
     BundleManager& operator=(const BundleManager&) = delete;
 
     // Replaces the user bundle with the one packed in data (a gzip- or compress-compressed tar or
-    // cpio archive). Failures are logged only; the old user bundle is gone even then.
-    void installBehaviorBundleData(const plist::Data& data);
+    // cpio archive). Failures are logged; the old user bundle is gone even then. True when the
+    // archive was extracted whole and put in place; otherwise whyNot, when given, says why.
+    bool installBehaviorBundleData(const plist::Data& data, std::string* whyNot = nullptr);
 
     // Keeps behaviorID and runs the reset flow for it.
     BundleChangeType resetBehaviorBundle(const std::optional<std::string>& behaviorID);

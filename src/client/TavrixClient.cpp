@@ -163,10 +163,11 @@ namespace {
 // One method call of the server interface: builds the call, sends it and checks the reply.
 class Call {
   public:
-    Call(sd_bus* bus, const char* member) : member_(member) {
+    Call(sd_bus* bus, const char* member, const char* interface = kServerInterface)
+        : member_(member) {
         sd_bus_message* raw = nullptr;
-        int r = sd_bus_message_new_method_call(bus, &raw, kServiceName, kObjectPath,
-                                               kServerInterface, member);
+        int r =
+            sd_bus_message_new_method_call(bus, &raw, kServiceName, kObjectPath, interface, member);
         message_.reset(raw);
         check(r, "cannot create the call");
     }
@@ -335,6 +336,17 @@ std::string TavrixClient::uniqueName() const {
         throw ClientError("cannot read the unique bus name: " + errnoText(r));
     }
     return name;
+}
+
+plist::Dictionary TavrixClient::status() {
+    Call call(state_->bus.get(), "GetStatus", kStatusInterface);
+    BusMessagePtr reply = call.send(state_->bus.get(), "a{sv}");
+    plist::Dictionary status;
+    int r = platform::readDictionary(reply.get(), status);
+    if (r < 0) {
+        call.fail("malformed reply: " + errnoText(r));
+    }
+    return status;
 }
 
 }  // namespace tavrix::client

@@ -24,6 +24,7 @@ namespace tavrix::client {
 inline constexpr const char* kServiceName = "com.zandor.tavrixservicesd";
 inline constexpr const char* kObjectPath = "/com/zandor/tavrixservicesd";
 inline constexpr const char* kServerInterface = "com.zandor.TXManagerServerInterface";
+inline constexpr const char* kStatusInterface = "com.zandor.TXManagerStatusInterface";
 inline constexpr const char* kNotificationInterface = "com.zandor.NotificationCenter";
 inline constexpr const char* kNotificationMember = "Posted";
 
@@ -108,6 +109,10 @@ class TavrixClient {
     bool processOnce(std::chrono::steady_clock::duration timeout);
 
     std::unique_ptr<State> state_;
+
+  public:
+    // The daemon's status view (see docs/dbus-api.md for its keys).
+    plist::Dictionary status();
 };
 
 }  // namespace tavrix::client

@@ -6,6 +6,7 @@
 #include "daemon/BehaviorPreferences.h"
 #include "payload/MobileUser.h"
 #include "platform/PreferencesStore.h"
+#include "update/ActivityRecord.h"
 #include "update/AssetHandler.h"
 #include "update/UpdateCheckScheduler.h"
 #include "util/Log.h"
@@ -50,7 +51,11 @@ bool TXManager::setTavrixID(const std::string& tavrixID, const std::optional<pli
     {
         std::lock_guard lock(bundles.operationLock());
         if (bundle) {
-            bundles.installBehaviorBundleData(*bundle);
+            std::string whyNot;
+            const bool extracted = bundles.installBehaviorBundleData(*bundle, &whyNot);
+            recordPayload(extracted, extracted ? "extracted " + std::to_string(bundle->size()) +
+                                                     " bytes into the user bundle"
+                                               : whyNot);
         } else {
             logObjectFormat("No bundle data given");
         }
@@ -60,23 +65,57 @@ bool TXManager::setTavrixID(const std::string& tavrixID, const std::optional<pli
     return true;
 }
 
-bool TXManager::isTavrixBundleSupported() {
+const char* bundleSupportReason(BundleSupport support) {
+    switch (support) {
+        case BundleSupport::Supported:
+            return "";
+        case BundleSupport::CellularRadio:
+            return "the device has a cellular radio";
+        case BundleSupport::NotEnabled:
+            return "bundle support is not enabled (no EnableSupport preference)";
+        case BundleSupport::Disabled:
+            return "bundle support is set to false (EnableSupport)";
+        case BundleSupport::NoBehaviorID:
+            return "no behavior ID has been set";
+    }
+    return "";
+}
+
+BundleSupport TXManager::bundleSupport() const {
     if (TXUtility::hasCellularRadio()) {
-        logObjectFormat(
-            "Is behavior bundle supported: Device has cellular radio, no tavrix bundle");
-        return false;
+        return BundleSupport::CellularRadio;
     }
     auto enableSupport = copyBehaviorPreference(kEnableSupportKey);
     if (!enableSupport) {
-        logObjectFormat("Behavior bundle support is not present");
-        return false;
+        return BundleSupport::NotEnabled;
     }
+    // Only the false boolean disables; any other value counts as enabled.
     const bool* flag = enableSupport->asBoolean();
     if (flag != nullptr && !*flag) {
-        logObjectFormat("Behavior bundle support has been set to false");
-        return false;
+        return BundleSupport::Disabled;
     }
-    return copyBehaviorPreference(kTavrixIDKey).has_value();
+    return copyBehaviorPreference(kTavrixIDKey).has_value() ? BundleSupport::Supported
+                                                            : BundleSupport::NoBehaviorID;
+}
+
+bool TXManager::isTavrixBundleSupported() {
+    switch (bundleSupport()) {
+        case BundleSupport::CellularRadio:
+            logObjectFormat(
+                "Is behavior bundle supported: Device has cellular radio, no tavrix bundle");
+            return false;
+        case BundleSupport::NotEnabled:
+            logObjectFormat("Behavior bundle support is not present");
+            return false;
+        case BundleSupport::Disabled:
+            logObjectFormat("Behavior bundle support has been set to false");
+            return false;
+        case BundleSupport::NoBehaviorID:
+            return false;
+        case BundleSupport::Supported:
+            break;
+    }
+    return true;
 }
 
 std::optional<plist::Value> TXManager::copyTavrixValue(const std::string& key) {
@@ -91,6 +130,8 @@ std::optional<plist::Value> TXManager::copyTavrixValue(const std::string& key) {
 bool TXManager::checkForTavrixBundleUpdate() {
     if (!isTavrixBundleSupported()) {
         logObjectFormat("No behavior ID, not checking for OTA update");
+        recordUpdateCheck(kCheckNotSupported,
+                          std::string("not checked: ") + bundleSupportReason(bundleSupport()));
         return false;
     }
     return AssetHandler::downloadUpdateIfAvailable();

@@ -10,6 +10,12 @@
 
 namespace tavrix {
 
+// Why a device does or does not take bundles, in the order isTavrixBundleSupported asks.
+enum class BundleSupport { Supported, CellularRadio, NotEnabled, Disabled, NoBehaviorID };
+
+// One line for an operator: why bundles are not supported ("" when they are).
+const char* bundleSupportReason(BundleSupport support);
+
 class TXManager {
   public:
     // The process's façade; its first creation redoes the bundle match for a stored behavior ID.
@@ -19,6 +25,8 @@ class TXManager {
     // False only on a device with a cellular radio.
     bool setTavrixID(const std::string& tavrixID, const std::optional<plist::Data>& bundle);
     bool isTavrixBundleSupported();
+    // What isTavrixBundleSupported answers from, without logging.
+    BundleSupport bundleSupport() const;
     // The behavior setting for key from "com.zandor.tavrix", or nothing.
     std::optional<plist::Value> copyTavrixValue(const std::string& key);
     bool checkForTavrixBundleUpdate();

@@ -10,6 +10,7 @@
 #include <thread>
 
 #include "daemon/TXManager.h"
+#include "daemon/TXManagerStatus.h"
 #include "daemon/TXTransactionManager.h"
 #include "platform/AssetCatalogService.h"
 #include "platform/NotificationCenter.h"
@@ -152,6 +153,7 @@ bool TXManagerServer::_startServing() {
 
     if (!_listener.resume(event, kTXServiceObjectPath,
                           {{kTXServiceInterface, managerServerVTable()},
+                           {kTXStatusInterface, statusVTable()},
                            {platform::kNotificationInterface, notificationCenterVTable()}},
                           this)) {
         return false;
@@ -347,6 +349,10 @@ void TXManagerServer::checkForTavrixBundleUpdate(const std::function<void(bool)>
 void TXManagerServer::setClientType(std::int32_t /*type: deliberately not kept*/,
                                     const std::function<void(bool)>& result) {
     result(_clientForCurrentConnection() != nullptr);
+}
+
+void TXManagerServer::getStatus(const std::function<void(plist::Dictionary)>& replyHandler) {
+    reply(replyHandler, copyDaemonStatus());
 }
 
 }  // namespace tavrix

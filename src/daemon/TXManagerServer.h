@@ -30,6 +30,8 @@ class TXManager;
 inline constexpr const char* kTXServiceName = "com.zandor.tavrixservicesd";
 inline constexpr const char* kTXServiceObjectPath = "/com/zandor/tavrixservicesd";
 inline constexpr const char* kTXServiceInterface = "com.zandor.TXManagerServerInterface";
+// Read-only, beside the service interface: the status view for operators.
+inline constexpr const char* kTXStatusInterface = "com.zandor.TXManagerStatusInterface";
 
 class TXManagerServer : private platform::ServiceListener::Delegate {
   public:
@@ -65,6 +67,8 @@ class TXManagerServer : private platform::ServiceListener::Delegate {
     void checkForTavrixBundleUpdate(const std::function<void(bool)>& replyHandler);
     // Answers whether the calling connection is an accepted client; the type is not kept.
     void setClientType(std::int32_t type, const std::function<void(bool)>& result);
+    // The status view (TXManagerStatus.h), answered at once.
+    void getStatus(const std::function<void(plist::Dictionary)>& replyHandler);
 
     void addClient(std::shared_ptr<TXManagerServerClient> client);
     void removeClient(const std::shared_ptr<TXManagerServerClient>& client);
@@ -111,5 +115,7 @@ class TXManagerServer : private platform::ServiceListener::Delegate {
 const sd_bus_vtable* managerServerVTable();
 // The notification interface's table: its one signal, so that introspection shows it.
 const sd_bus_vtable* notificationCenterVTable();
+// The status interface's table.
+const sd_bus_vtable* statusVTable();
 
 }  // namespace tavrix

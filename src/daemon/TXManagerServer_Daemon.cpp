@@ -5,6 +5,8 @@
 // value), and the daemon goes on serving.
 #include <systemd/sd-bus.h>
 
+#include <cstring>
+
 #include "daemon/TXManagerServer.h"
 #include "platform/BusValueCodec.h"
 #include "platform/NotificationCenter.h"
@@ -148,6 +150,34 @@ int handleSetClientType(sd_bus_message* message, void* userdata, sd_bus_error* e
     return replyBoolean(message, answer);
 }
 
+int handleGetStatus(sd_bus_message* message, void* userdata, sd_bus_error*) {
+    auto& server = *static_cast<TXManagerServer*>(userdata);
+    plist::Dictionary status = answerOf(
+        "Get Status", server, message, plist::Dictionary(), [&](plist::Dictionary& result) {
+            server.getStatus([&](plist::Dictionary answer) { result = std::move(answer); });
+        });
+    sd_bus_message* raw = nullptr;
+    int r = sd_bus_message_new_method_return(message, &raw);
+    platform::BusMessagePtr replyMessage(raw);
+    if (r >= 0) {
+        r = platform::appendDictionary(replyMessage.get(), status);
+    }
+    if (r < 0) {
+        // A value the bus cannot carry (text that is not UTF-8 in a path): the empty view rather
+        // than no answer.
+        logCFormat("The status cannot be sent over the bus: %s\n", std::strerror(-r));
+        r = sd_bus_message_new_method_return(message, &raw);
+        replyMessage.reset(raw);
+        if (r >= 0) {
+            r = platform::appendDictionary(replyMessage.get(), {});
+        }
+        if (r < 0) {
+            return r;
+        }
+    }
+    return sd_bus_send(nullptr, replyMessage.get(), nullptr);
+}
+
 // The last resort around a handler, for what happens outside its operation (reading the arguments,
 // building the reply): an exception must not unwind through sd-bus, so it becomes an error reply.
 template <int (*Handler)(sd_bus_message*, void*, sd_bus_error*)>
@@ -174,6 +204,14 @@ const sd_bus_vtable kManagerServerVTable[] = {
     SD_BUS_VTABLE_END,
 };
 
+// Anyone may read the status (the bus policy says so); it changes nothing.
+const sd_bus_vtable kStatusVTable[] = {
+    SD_BUS_VTABLE_START(0),
+    SD_BUS_METHOD_WITH_NAMES("GetStatus", "", , "a{sv}", SD_BUS_PARAM(status),
+                             contained<handleGetStatus>, SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_VTABLE_END,
+};
+
 const sd_bus_vtable kNotificationCenterVTable[] = {
     SD_BUS_VTABLE_START(0),
     SD_BUS_SIGNAL_WITH_NAMES("Posted", "s", SD_BUS_PARAM(name), 0),
@@ -187,6 +225,9 @@ const sd_bus_vtable* managerServerVTable() {
 }
 const sd_bus_vtable* notificationCenterVTable() {
     return kNotificationCenterVTable;
+}
+const sd_bus_vtable* statusVTable() {
+    return kStatusVTable;
 }
 
 }  // namespace tavrix

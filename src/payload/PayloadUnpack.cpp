@@ -36,7 +36,13 @@ bool writeDataToFile(const plist::Data& data, const std::string& path) {
 
 }  // namespace payload
 
-void BundleManager::installBehaviorBundleData(const plist::Data& data) {
+bool BundleManager::installBehaviorBundleData(const plist::Data& data, std::string* whyNot) {
+    auto refuse = [whyNot](std::string reason) {
+        if (whyNot != nullptr) {
+            *whyNot = std::move(reason);
+        }
+        return false;
+    };
     logCFormat("Behavior bundle data is received %ld\n", static_cast<long>(data.size()));
     const std::string& bundleDirectory = userBundleLocation();
     if (bundleDirectory.empty()) {
@@ -44,7 +50,7 @@ void BundleManager::installBehaviorBundleData(const plist::Data& data) {
         logCFormat(
             "Not installing the behavior bundle: the home directory of the mobile user is "
             "unknown\n");
-        return;
+        return refuse("the mobile user's home directory is unknown");
     }
     logCFormat("Writing the zipped file into: %s\n", payload::kBundleArchiveTempPath);
     const std::string stagedPath = platform::resolvePath(payload::kBundleArchiveTempPath);
@@ -63,7 +69,8 @@ void BundleManager::installBehaviorBundleData(const plist::Data& data) {
         logCFormat("Could not remove the bundle %s (error %d), keeping it\n",
                    bundleDirectory.c_str(), removed);
         helper.removeItem(stagedPath);
-        return;
+        return refuse("the old bundle could not be removed: " +
+                      std::string(std::strerror(removed)));
     }
     // Extracted beside the bundle directory and renamed into place: a crash part way leaves no
     // bundle directory with some of its files (start-up removes the staging directory).
@@ -71,14 +78,31 @@ void BundleManager::installBehaviorBundleData(const plist::Data& data) {
     helper.removeItem(staging);
     // Bounded, so that a payload that unpacks to far more than it weighs stops before the disk
     // fills; what was extracted until then stays, like any other incomplete payload.
-    payload::extractArchive(stagedPath, staging, payload::ExtractionSafety::AsArchived,
-                            payload::kClientPayloadLimits);
+    std::string extractionFailure;
+    const bool extracted =
+        payload::extractArchive(stagedPath, staging, payload::ExtractionSafety::AsArchived,
+                                payload::kClientPayloadLimits, &extractionFailure);
+    if (!extracted) {
+        if (extractionFailure.empty()) {
+            extractionFailure = "the archive could not be extracted";
+        }
+        logCFormat("%s\n", extractionFailure.c_str());
+    }
+    bool placed = true;
     if (::rename(staging.c_str(), bundleDirectory.c_str()) != 0) {
+        const int error = errno;
         logCFormat("Could not move the extracted bundle into %s (error %d)\n",
-                   bundleDirectory.c_str(), errno);
+                   bundleDirectory.c_str(), error);
         helper.removeItem(staging);
+        placed = false;
+        extractionFailure = "the extracted bundle could not be moved into place: " +
+                            std::string(std::strerror(error));
     }
     helper.removeItem(stagedPath);
+    if (!extracted || !placed) {
+        return refuse(extractionFailure);
+    }
+    return true;
 }
 
 }  // namespace tavrix

@@ -177,6 +177,7 @@ std::optional<std::vector<std::shared_ptr<Asset>>> AssetQuery::runQuery() const 
     std::optional<AssetTypeSettings> settings =
         AssetCatalogService::shared().settingsFor(assetType_);
     if (!settings) {
+        lastResult_ = {QueryOutcome::NoCatalogConfigured, "no catalog configured"};
         return assets;
     }
     std::string whyNot;
@@ -185,8 +186,14 @@ std::optional<std::vector<std::shared_ptr<Asset>>> AssetQuery::runQuery() const 
     if (!entries) {
         logCFormat("Asset catalog: refusing the catalog %s: %s", settings->catalogURL.c_str(),
                    whyNot.c_str());
+        // The loader says why in one line; only a failed transfer begins "cannot fetch", every
+        // other reason is the catalog's own fault.
+        lastResult_ = {
+            whyNot.starts_with("cannot fetch") ? QueryOutcome::FetchFailed : QueryOutcome::Refused,
+            whyNot};
         return std::nullopt;
     }
+    lastResult_ = {QueryOutcome::Answered, {}};
     for (CatalogEntry& entry : *entries) {
         assets.push_back(
             std::make_shared<Asset>(std::move(entry), settings->cacheDirectory, settings->limits));

@@ -92,6 +92,15 @@ class Asset : public std::enable_shared_from_this<Asset> {
     std::optional<ScopedServiceTransaction> unfinished_;
 };
 
+// How the last runQuery() went, for a caller that tells "nothing newer" from "could not ask".
+enum class QueryOutcome { NotRun, Answered, NoCatalogConfigured, FetchFailed, Refused };
+
+struct QueryResult {
+    QueryOutcome outcome = QueryOutcome::NotRun;
+    // One line: why the catalog gave no assets (empty when it answered).
+    std::string reason;
+};
+
 // A query for the assets of one type. Without settings for the type it answers no assets and logs
 // why once.
 class AssetQuery {
@@ -104,6 +113,8 @@ class AssetQuery {
     // Runs the query on the calling thread (it blocks while the catalog is fetched). The assets in
     // the catalog's order, or nothing when the catalog cannot be fetched or is refused (logged).
     std::optional<std::vector<std::shared_ptr<Asset>>> runQuery() const;
+    // The outcome of the last runQuery().
+    const QueryResult& lastResult() const { return lastResult_; }
 
     // Removes the downloads a process that ended left in this type's cache (see
     // removeAbandonedDownloads); for the launch, before any download can start.
@@ -112,6 +123,7 @@ class AssetQuery {
   private:
     std::string assetType_;
     bool localOnly_ = false;
+    mutable QueryResult lastResult_;
 };
 
 }  // namespace tavrix::platform

@@ -387,6 +387,21 @@ int readOptionalValue(sd_bus_message* message, std::optional<Value>& out) {
     return 1;
 }
 
+int appendDictionary(sd_bus_message* message, const plist::Dictionary& dictionary) {
+    // The dictionary counts as the first level, as it would inside a variant.
+    return appendVariantContent(message, Value(dictionary), 1);
+}
+
+int readDictionary(sd_bus_message* message, plist::Dictionary& out) {
+    std::optional<Value> value;
+    int r = readDictionary(message, value, 1);
+    if (r < 0) {
+        return r;
+    }
+    out = std::move(*value->asDictionary());
+    return 1;
+}
+
 int appendOptionalBytes(sd_bus_message* message,
                         const std::optional<std::vector<std::uint8_t>>& bytes) {
     int r = sd_bus_message_open_container(message, 'a', "ay");

@@ -41,6 +41,11 @@ int appendOptionalValue(sd_bus_message* message, const std::optional<plist::Valu
 // Reads "av"; more than one element is -EINVAL.
 int readOptionalValue(sd_bus_message* message, std::optional<plist::Value>& out);
 
+// A dictionary as a bare "a{sv}" (not inside a variant), as a method's whole answer.
+int appendDictionary(sd_bus_message* message, const plist::Dictionary& dictionary);
+// Reads a bare "a{sv}"; out is set only on success.
+int readDictionary(sd_bus_message* message, plist::Dictionary& out);
+
 // "aay" with no element for absent bytes, one element otherwise.
 int appendOptionalBytes(sd_bus_message* message,
                         const std::optional<std::vector<std::uint8_t>>& bytes);

@@ -18,6 +18,7 @@
 #include "payload/MobileUser.h"
 #include "payload/PayloadUnpack.h"
 #include "platform/SystemLog.h"
+#include "update/ActivityRecord.h"
 #include "update/PendingInstall.h"
 #include "update/UpdateCheckScheduler.h"
 #include "util/Log.h"
@@ -78,19 +79,50 @@ bool fitsThisDevice(const plist::Dictionary& attributes, const plist::Value& pro
     return true;
 }
 
+std::string assetVersionText(const platform::Asset& asset) {
+    auto version = asset.attributes().find(kAssetAttributeVersion);
+    return version != asset.attributes().end() ? versionText(version->second) : "(unknown)";
+}
+
+// Why a check found nothing to download, in the words the status view shows.
+void recordQueryWithoutCandidate(const platform::QueryResult& query) {
+    switch (query.outcome) {
+        case platform::QueryOutcome::NoCatalogConfigured:
+            recordUpdateCheck(kCheckNoCatalog, "no catalog configured");
+            return;
+        case platform::QueryOutcome::FetchFailed:
+            recordUpdateCheck(kCheckFetchFailed, "catalog fetch failed: " + query.reason);
+            return;
+        case platform::QueryOutcome::Refused:
+            recordUpdateCheck(kCheckCatalogRefused, "catalog refused: " + query.reason);
+            return;
+        case platform::QueryOutcome::Answered:
+        case platform::QueryOutcome::NotRun:
+            break;
+    }
+    std::optional<std::string> installed = BundleManager::sharedInstance().copyBundleVersion();
+    recordUpdateCheck(kCheckUpToDate, installed
+                                          ? "up to date (version " + *installed + " installed)"
+                                          : "up to date (no newer bundle for this device)");
+}
+
 }  // namespace
 
-std::optional<std::vector<AssetHandler::AssetPtr>> AssetHandler::downloadAvailableAssets() {
+std::optional<std::vector<AssetHandler::AssetPtr>> AssetHandler::downloadAvailableAssets(
+    platform::QueryResult* result) {
     platform::AssetQuery query(kAssetTypeTavrixBundles);
     query.setQueriesLocalInformationOnly(false);
     logCFormat("Issuing query\n");
     auto results = query.runQuery();
     logCFormat("Query returned back with %d items\n",
                results ? static_cast<int>(results->size()) : 0);
+    if (result != nullptr) {
+        *result = query.lastResult();
+    }
     return results;
 }
 
-AssetHandler::AssetPtr AssetHandler::findTheBestAsset() {
+AssetHandler::AssetPtr AssetHandler::findTheBestAsset(platform::QueryResult* result) {
     std::optional<std::string> installed = BundleManager::sharedInstance().copyBundleVersion();
     if (!installed) {
         logObjectFormat("No bundle version available, initializing with 0.0");
@@ -104,7 +136,7 @@ AssetHandler::AssetPtr AssetHandler::findTheBestAsset() {
     logObjectFormat("Product Type: %@\n", productType ? &*productType : nullptr);
 
     AssetPtr best;
-    auto assets = downloadAvailableAssets();
+    auto assets = downloadAvailableAssets(result);
     if (!assets) {
         return best;
     }
@@ -146,15 +178,18 @@ bool AssetHandler::downloadUpdateIfAvailable() {
     }
     auto running = std::make_shared<RunningCheck>(checkRunning);
 
-    AssetPtr asset = findTheBestAsset();
+    platform::QueryResult query;
+    AssetPtr asset = findTheBestAsset(&query);
     if (!asset) {
         logObjectFormat("Best candidate passed in is nil");
+        recordQueryWithoutCandidate(query);
         return false;
     }
     for (const auto& [key, value] : asset->attributes()) {
         const plist::Value keyValue(key);
         logObjectFormat("Best Candidate: key: %@, value: %@", &keyValue, &value);
     }
+    recordUpdateCheck(kCheckDownloading, "downloading version " + assetVersionText(*asset));
     asset->beginDownload();
     // The handler keeps the asset alive until the catalog drops it after the last report.
     asset->setProgressHandler([asset, running](const plist::Dictionary& progress) {
@@ -177,6 +212,12 @@ void AssetHandler::handleDownloadProgress(const AssetPtr& asset, const plist::Di
     if (name == nullptr || *name != platform::kAssetOperationCompleted) {
         // Every report but the last ends the check and re-arms it a day ahead; the last one
         // re-arms it again.
+        if (name != nullptr && *name == platform::kAssetOperationFailed) {
+            auto error = progress.find(platform::kAssetProgressErrorKey);
+            const std::string* why = error != progress.end() ? error->second.asString() : nullptr;
+            recordUpdateCheck(kCheckDownloadFailed,
+                              "download failed: " + (why != nullptr ? *why : "no reason given"));
+        }
         scheduler.rescheduleAndEndCheck(kInstallRetryDelaySeconds);
         if (name != nullptr && *name == platform::kAssetOperationFailed) {
             running->finish();
@@ -186,6 +227,7 @@ void AssetHandler::handleDownloadProgress(const AssetPtr& asset, const plist::Di
     std::optional<std::string> url = asset->localURL();
     if (!url) {
         logObjectFormat("Local URL is not available?");
+        recordUpdateCheck(kCheckDownloadFailed, "download failed: the downloaded bundle is gone");
         scheduler.rescheduleAndEndCheck(kInstallRetryDelaySeconds);
         running->finish();
         return;
@@ -198,6 +240,12 @@ void AssetHandler::handleDownloadProgress(const AssetPtr& asset, const plist::Di
     const plist::Value urlPath(*url);
     logObjectFormat("URL string: %@", &urlPath);
     const bool installed = installDownloadedBundle(*url);
+    if (installed) {
+        recordUpdateCheck(kCheckInstalled, "installed version " + assetVersionText(*asset));
+    } else {
+        recordUpdateCheck(kCheckInstallFailed,
+                          "install failed: the bundle could not be copied into place (logged)");
+    }
     // The check ends only once the download is gone, so that no other check downloads into the
     // directory being purged; the install is complete once its download is.
     asset->purge([running](bool) {

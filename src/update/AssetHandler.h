@@ -31,12 +31,13 @@ class AssetHandler {
     using AssetPtr = std::shared_ptr<platform::Asset>;
 
     // Every asset of the bundle type the catalog lists (asking its server), or nothing when the
-    // query failed.
-    static std::optional<std::vector<AssetPtr>> downloadAvailableAssets();
+    // query failed; result, when given, says how the query went.
+    static std::optional<std::vector<AssetPtr>> downloadAvailableAssets(
+        platform::QueryResult* result = nullptr);
 
     // The asset with the highest version strictly above the installed bundle's that fits this
     // device's OS version and product type; the first of equal versions wins. Null when none.
-    static AssetPtr findTheBestAsset();
+    static AssetPtr findTheBestAsset(platform::QueryResult* result = nullptr);
 
     // Starts downloading the best asset; its completion installs it as the user bundle and redoes
     // the bundle match. True when a download was started. One check at a time: while one runs

@@ -46,6 +46,9 @@ class UpdateCheckScheduler {
     // Re-arms seconds ahead and ends the check; called when a started download has finished,
     // from any thread.
     void rescheduleAndEndCheck(double seconds);
+    // When the registered job's window starts (seconds since the reference date), or nothing
+    // when no check is registered.
+    std::optional<double> nextCheckTime() const;
 
   private:
     UpdateCheckScheduler();

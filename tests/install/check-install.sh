@@ -18,8 +18,10 @@ daemon="$prefix/libexec/tavrixservicesd"
 for tool in tavrixctl tavrix-catalog tavrix-plist; do
     [ -x "$image$prefix/bin/$tool" ] || fail "no $tool in $prefix/bin"
 done
-"$image$prefix/bin/tavrixctl" --version | grep -q '^tavrixctl [0-9]' || fail "tavrixctl --version"
-"$image$prefix/bin/tavrixctl" -h | grep -q '^usage: tavrixctl' || fail "tavrixctl -h"
+for tool in tavrixctl tavrix-catalog tavrix-plist; do
+    "$image$prefix/bin/$tool" --version | grep -q "^$tool [0-9]" || fail "$tool --version"
+    "$image$prefix/bin/$tool" -h | grep -q "^usage: $tool" || fail "$tool -h"
+done
 
 find_one() {
     local found
@@ -31,6 +33,8 @@ unit=$(find_one systemd/system/tavrixservicesd.service)
 find_one systemd/system/tavrixservicesd-update.timer >/dev/null
 activation=$(find_one dbus-1/system-services/com.zandor.tavrixservicesd.service)
 find_one dbus-1/system.d/com.zandor.tavrixservicesd.conf >/dev/null
+completion=$(find_one bash-completion/completions/tavrixctl)
+bash -n "$completion" || fail "the bash completion does not parse"
 sysusers=$(find_one sysusers.d/tavrixservicesd.conf)
 tmpfiles=$(find_one tmpfiles.d/tavrixservicesd.conf)
 

@@ -6,6 +6,7 @@
 #include <pwd.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <fstream>
 
 #include "BusFixture.h"
@@ -83,10 +84,15 @@ TEST_F(DaemonPolicyTest, AnyoneMayAskButOnlyPrivilegedCallersMayChange) {
     EXPECT_THAT(setID.output, HasSubstr("AccessDenied"));
     auto update = tavrixctlAs(nogroup, {"check-update"});
     EXPECT_NE(update.status, 0) << update.output;
+    // One line that says who may.
     EXPECT_THAT(update.output, HasSubstr("AccessDenied"));
+    EXPECT_THAT(update.output, HasSubstr("root and members of the \"tavrix\" group"));
+    EXPECT_EQ(std::count(update.output.begin(), update.output.end(), '\n'), 1) << update.output;
 
-    for (const std::vector<std::string>& question :
-         {std::vector<std::string>{"supported"}, {"value", "CarrierName"}, {"client-type", "1"}}) {
+    for (const std::vector<std::string>& question : {std::vector<std::string>{"supported"},
+                                                     {"value", "CarrierName"},
+                                                     {"client-type", "1"},
+                                                     {"status"}}) {
         auto answer = tavrixctlAs(nogroup, question);
         EXPECT_EQ(answer.status, 0) << question.front() << ": " << answer.output;
         EXPECT_THAT(answer.output, Not(HasSubstr("AccessDenied"))) << question.front();

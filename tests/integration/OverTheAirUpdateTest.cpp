@@ -1,15 +1,17 @@
 // Over-the-air bundle updates as a device sees them: a catalog made and signed by the publishing
 // tool, served over HTTP on 127.0.0.1, a newer bundle installed over the user bundle and linked,
 // and downloads that go wrong leaving the linked bundle as it was.
+#include <fcntl.h>
 #include <signal.h>
 #include <sodium.h>
-#include <fcntl.h>
 #include <sys/mount.h>
 #include <sys/statvfs.h>
 #include <unistd.h>
 
+#include <cctype>
 #include <cmath>
 #include <cstdlib>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <future>
@@ -19,13 +21,13 @@
 #include <thread>
 
 #include "BusFixture.h"
-#include "util/UniqueFd.h"
 #include "CommandRunner.h"
 #include "LocalHttpServer.h"
 #include "platform/BackgroundJobScheduler.h"
 #include "platform/Clock.h"
 #include "plist/PropertyListFormat.h"
 #include "update/UpdateCheckScheduler.h"
+#include "util/UniqueFd.h"
 
 namespace tavrix::integration {
 namespace {
@@ -52,6 +54,91 @@ void writeFile(const fs::path& path, const std::string& bytes) {
     fs::create_directories(path.parent_path());
     std::ofstream(path, std::fstream::binary | std::fstream::trunc) << bytes;
 }
+
+// Just enough JSON to read tavrixctl's answers back: objects, arrays, strings (with escapes),
+// booleans and integers. Nothing for anything else or trailing text, so malformed output fails.
+class JsonReader {
+  public:
+    explicit JsonReader(std::string text) : text_(std::move(text)) {}
+
+    std::optional<plist::Value> read() {
+        auto value = readValue();
+        skipSpace();
+        return at_ == text_.size() ? value : std::nullopt;
+    }
+
+  private:
+    void skipSpace() {
+        while (at_ < text_.size() && std::isspace(static_cast<unsigned char>(text_[at_]))) {
+            ++at_;
+        }
+    }
+    bool take(char c) {
+        skipSpace();
+        if (at_ < text_.size() && text_[at_] == c) {
+            ++at_;
+            return true;
+        }
+        return false;
+    }
+    std::optional<std::string> readString() {
+        if (!take('"')) {
+            return std::nullopt;
+        }
+        std::string out;
+        while (at_ < text_.size() && text_[at_] != '"') {
+            char c = text_[at_++];
+            if (static_cast<unsigned char>(c) < 0x20) {
+                return std::nullopt;
+            }
+            if (c == '\\' && at_ < text_.size()) {
+                const char escaped = text_[at_++];
+                c = escaped == 'n' ? '\n' : escaped == 't' ? '\t' : escaped;
+            }
+            out += c;
+        }
+        return take('"') ? std::optional(out) : std::nullopt;
+    }
+    std::optional<plist::Value> readValue() {
+        skipSpace();
+        if (at_ < text_.size() && text_[at_] == '"') {
+            auto text = readString();
+            return text ? std::optional<plist::Value>(*text) : std::nullopt;
+        }
+        if (take('{')) {
+            plist::Dictionary object;
+            while (!take('}')) {
+                if (!object.empty() && !take(',')) {
+                    return std::nullopt;
+                }
+                auto key = readString();
+                auto value = key && take(':') ? readValue() : std::nullopt;
+                if (!value) {
+                    return std::nullopt;
+                }
+                object.emplace(*key, std::move(*value));
+            }
+            return plist::Value(std::move(object));
+        }
+        for (const auto& [word, flag] : {std::pair{"true", true}, std::pair{"false", false}}) {
+            if (text_.compare(at_, std::strlen(word), word) == 0) {
+                at_ += std::strlen(word);
+                return plist::Value(flag);
+            }
+        }
+        std::size_t used = 0;
+        try {
+            long long number = std::stoll(text_.substr(at_), &used);
+            at_ += used;
+            return plist::Value(plist::Integer(static_cast<std::int64_t>(number)));
+        } catch (const std::exception&) {
+            return std::nullopt;
+        }
+    }
+
+    std::string text_;
+    std::size_t at_ = 0;
+};
 
 class OverTheAirUpdateTest : public BusFixture {
   protected:
@@ -240,6 +327,37 @@ class OverTheAirUpdateTest : public BusFixture {
         EXPECT_FALSE(fs::exists(device().path(kPendingInstall)));
     }
 
+    // tavrixctl with --json at the end of the line, where global options may also go; its
+    // answer read back.
+    plist::Dictionary tavrixctlJson(std::vector<std::string> arguments, int expectedStatus = 0) {
+        arguments.insert(arguments.begin(), {TAVRIX_CTL_PATH, "--address", busAddress()});
+        arguments.push_back("--json");
+        CommandResult run = runCommand(arguments);
+        EXPECT_EQ(run.status, expectedStatus) << run.output;
+        std::optional<plist::Value> answer = JsonReader(run.output).read();
+        EXPECT_TRUE(answer && answer->asDictionary() != nullptr) << run.output;
+        return answer && answer->asDictionary() ? *answer->asDictionary() : plist::Dictionary();
+    }
+
+    // The text at a path of keys in a JSON answer, or "(absent)".
+    static std::string textAt(const plist::Dictionary& answer,
+                              std::initializer_list<const char*> keys) {
+        const plist::Value* value = nullptr;
+        const plist::Dictionary* in = &answer;
+        for (const char* key : keys) {
+            auto found = in != nullptr ? in->find(key) : plist::Dictionary::const_iterator();
+            if (in == nullptr || found == in->end()) {
+                return "(absent)";
+            }
+            value = &found->second;
+            in = value->asDictionary();
+        }
+        if (const bool* flag = value->asBoolean()) {
+            return *flag ? "true" : "false";
+        }
+        return value->asString() != nullptr ? *value->asString() : value->description();
+    }
+
     test::LocalHttpServer server;
 
   private:
@@ -272,7 +390,7 @@ TEST_F(OverTheAirUpdateTest, NewerPublishedBundleIsInstalledLinkedAndAnnounced) 
     server.releaseHeldResponses();
     operatorCheck.join();
     EXPECT_EQ(check.status, 0);
-    EXPECT_EQ(check.output, std::string("yes\n") + kChanged + "\n");
+    EXPECT_EQ(check.output, "yes\ninstalled version 2\n");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 2, 30s));
     expectInstalled("2");
     EXPECT_TRUE(waitForLogLine("Behavior ID acme.default is already sent, redoing bundle match"));
@@ -285,10 +403,66 @@ TEST_F(OverTheAirUpdateTest, NewerPublishedBundleIsInstalledLinkedAndAnnounced) 
     check =
         runCommand({TAVRIX_CTL_PATH, "--address", busAddress(), "check-update", "--wait", "30"});
     EXPECT_EQ(check.status, 0);
-    EXPECT_EQ(check.output, "no\n") << "nothing started, nothing to wait for";
+    EXPECT_EQ(check.output, "no\nup to date (version 2 installed)\n")
+        << "nothing started, nothing to wait for";
     EXPECT_TRUE(waitForLogLine("Current version: 2"));
     EXPECT_TRUE(waitForLogLine("No higher update available"));
     EXPECT_FALSE(watcher().waitForNotification(kChanged, 3, 500ms));
+}
+
+// The status view after each step an operator takes, as scripts read it: a payload, an installed
+// update, a refused catalog (kept across the daemon's exit), no catalog at all, a broken payload.
+TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
+    setIDWithBundle("1");
+    plist::Dictionary status = tavrixctlJson({"status"});
+    EXPECT_EQ(textAt(status, {"BehaviorID"}), kBehaviorID);
+    EXPECT_EQ(textAt(status, {"Supported"}), "true");
+    EXPECT_EQ(textAt(status, {"WhyNotSupported"}), "(absent)");
+    EXPECT_EQ(textAt(status, {"LinkedBundle", "Identifier"}), "com.zandor.tavrix.bundle.ota");
+    EXPECT_EQ(textAt(status, {"LinkedBundle", "Version"}), "1");
+    EXPECT_EQ(textAt(status, {"LinkedBundle", "OverlayType"}), "kNoOverlay");
+    EXPECT_EQ(textAt(status, {"UserBundleVersion"}), "1");
+    EXPECT_EQ(textAt(status, {"LastPayload", "Extracted"}), "true");
+    EXPECT_EQ(textAt(status, {"LastCheck"}), "(absent)");
+    EXPECT_NE(textAt(status, {"NextUpdateCheck"}), "(absent)");
+    EXPECT_NE(textAt(status, {"DaemonVersion"}), "(absent)");
+
+    publish("2");
+    plist::Dictionary check = tavrixctlJson({"check-update", "--wait", "30"});
+    EXPECT_EQ(textAt(check, {"started"}), "true");
+    EXPECT_EQ(textAt(check, {"outcome"}), "installed");
+    EXPECT_EQ(textAt(check, {"reason"}), "installed version 2");
+    status = tavrixctlJson({"status"});
+    EXPECT_EQ(textAt(status, {"LinkedBundle", "Version"}), "2");
+    EXPECT_EQ(textAt(status, {"LastCheck", "Outcome"}), "installed");
+
+    publish("3");
+    std::string signature = readFile(site() / "catalog.plist.sig");
+    signature[0] = static_cast<char>(signature[0] ^ 1);
+    writeFile(site() / "catalog.plist.sig", signature);
+    check = tavrixctlJson({"check-update"}, 1);
+    EXPECT_EQ(textAt(check, {"outcome"}), "catalog-refused");
+    EXPECT_EQ(textAt(check, {"reason"}),
+              "catalog refused: its signature does not verify with the configured key");
+    // What the daemon recorded is still there after it left and was started again.
+    const auto pid = daemonPid();
+    ASSERT_TRUE(pid);
+    ::kill(*pid, SIGTERM);
+    EXPECT_EQ(waitForDaemonExit(*pid, 90s), std::optional<int>(0));
+    status = tavrixctlJson({"status"});
+    EXPECT_EQ(textAt(status, {"LastCheck", "Outcome"}), "catalog-refused");
+    EXPECT_EQ(textAt(status, {"LinkedBundle", "Version"}), "2");
+
+    fs::remove(at("/etc/tavrix/AssetCatalog.plist"));
+    check = tavrixctlJson({"check-update"}, 1);
+    EXPECT_EQ(textAt(check, {"started"}), "false");
+    EXPECT_EQ(textAt(check, {"reason"}), "no catalog configured");
+
+    ASSERT_TRUE(client().setTavrixID(kBehaviorID, std::vector<std::uint8_t>{'n', 'o', 't'}));
+    status = tavrixctlJson({"status"});
+    EXPECT_EQ(textAt(status, {"LastPayload", "Extracted"}), "false");
+    EXPECT_NE(textAt(status, {"LastPayload", "Reason"}), "");
+    EXPECT_EQ(textAt(status, {"LastCheck", "Outcome"}), "no-catalog");
 }
 
 // Each way an update can go wrong leaves the linked bundle and its files as they were, posts

@@ -72,7 +72,7 @@ class AssetSelectionTest : public testing::Test {
         std::vector<std::string> arguments{"publish", work / "out", "--unsigned", "--fresh"};
         for (std::size_t i = 0; i < c.assets.size(); ++i) {
             const std::string bundle = work / ("bundles/Asset" + std::to_string(i) + ".bundle");
-            test::makeBundle(bundle, c.assets[i].version, {{"behavior.plist", "<plist/>"}});
+            test::makeBundle(bundle, c.assets[i].version, {});
             arguments.push_back(bundle);
             arguments.insert(arguments.end(), c.assets[i].options.begin(),
                              c.assets[i].options.end());

@@ -19,7 +19,7 @@ struct ToolRun {
     std::string errors;
 };
 
-inline ToolRun runCatalogTool(const std::vector<std::string>& arguments) {
+inline ToolRun runTool(const char* tool, const std::vector<std::string>& arguments) {
     TempDir outputs;
     std::string errorsPath = outputs / "stderr";
     posix_spawn_file_actions_t actions;
@@ -27,7 +27,7 @@ inline ToolRun runCatalogTool(const std::vector<std::string>& arguments) {
     posix_spawn_file_actions_addopen(&actions, STDOUT_FILENO, "/dev/null", O_WRONLY, 0);
     posix_spawn_file_actions_addopen(&actions, STDERR_FILENO, errorsPath.c_str(),
                                      O_WRONLY | O_CREAT | O_TRUNC, 0600);
-    std::vector<std::string> command{TAVRIX_CATALOG_TOOL};
+    std::vector<std::string> command{tool};
     command.insert(command.end(), arguments.begin(), arguments.end());
     std::vector<char*> argv;
     for (std::string& argument : command) {
@@ -35,7 +35,7 @@ inline ToolRun runCatalogTool(const std::vector<std::string>& arguments) {
     }
     argv.push_back(nullptr);
     pid_t pid = -1;
-    int spawned = posix_spawn(&pid, TAVRIX_CATALOG_TOOL, &actions, nullptr, argv.data(), environ);
+    int spawned = posix_spawn(&pid, tool, &actions, nullptr, argv.data(), environ);
     posix_spawn_file_actions_destroy(&actions);
     ToolRun run;
     int wait = 0;
@@ -46,17 +46,23 @@ inline ToolRun runCatalogTool(const std::vector<std::string>& arguments) {
     return run;
 }
 
-// A bundle directory with an Info.plist giving version (none when empty) and the given files
-// (relative path -> content).
+inline ToolRun runCatalogTool(const std::vector<std::string>& arguments) {
+    return runTool(TAVRIX_CATALOG_TOOL, arguments);
+}
+
+// A bundle directory with an Info.plist giving an identifier and version (no Info.plist when the
+// version is empty), a base carrier file and the given files (relative path -> content).
 inline void makeBundle(const std::string& directory, const std::string& version,
                        const std::vector<std::pair<std::string, std::string>>& files) {
     std::filesystem::create_directories(directory);
     if (!version.empty()) {
         writeText(directory + "/Info.plist",
                   "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict>"
+                  "<key>QZBundleIdentifier</key><string>com.zandor.tavrix.test</string>"
                   "<key>QZBundleVersion</key><string>" +
                       version + "</string></dict></plist>\n");
     }
+    writeText(directory + "/behavior.plist", "<plist version=\"1.0\"><dict/></plist>\n");
     for (const auto& [path, content] : files) {
         writeText(directory + "/" + path, content);
     }

@@ -2,7 +2,9 @@
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <filesystem>
+#include <functional>
 
 #include "CatalogToolRunner.h"
 #include "TestSupport.h"
@@ -79,8 +81,8 @@ TEST_F(CatalogToolTest, PublishingAddsReplacesAndStartsFreshWithAValidSignatureE
     EXPECT_EQ(listedVersions().size(), 2u);
     EXPECT_TRUE(signatureVerifies());
 
-    ASSERT_EQ(publish({"--unsigned", "--fresh", work / "a/Default.bundle", "--version", "1.1"}), 0);
-    EXPECT_EQ(listedVersions(), (std::vector<std::string>{"1.1"}));
+    ASSERT_EQ(publish({"--unsigned", "--fresh", work / "a/Default.bundle", "--version", "1.0"}), 0);
+    EXPECT_EQ(listedVersions(), (std::vector<std::string>{"1.0"}));
     EXPECT_FALSE(fs::exists(work / "out/catalog.plist.sig")) << "a stale signature is removed";
 }
 
@@ -98,6 +100,9 @@ TEST_F(CatalogToolTest, MistakesFailClearlyAndChangeNothing) {
     std::vector<Case> cases{
         {"keygen over a secret key", {"keygen", work / "secret.key", work / "other.pub"}, 1},
         {"no version", {"publish", work / "out", "--unsigned", work / "unversioned"}, 1},
+        {"version other than the bundle's",
+         {"publish", work / "out", "--unsigned", work / "a/Default.bundle", "--version", "1.1"},
+         1},
         {"public key given as secret",
          {"publish", work / "out", "--key", work / "public.key", work / "a/Default.bundle"},
          1},
@@ -121,6 +126,55 @@ TEST_F(CatalogToolTest, MistakesFailClearlyAndChangeNothing) {
     EXPECT_EQ(readText(work / "out/catalog.plist"), catalog);
     EXPECT_EQ(readText(work / "secret.key"), secret);
     EXPECT_TRUE(signatureVerifies());
+}
+
+// A directory that is no complete bundle is refused alike by the packer and the publisher, with
+// one line naming the file, and nothing is written.
+TEST_F(CatalogToolTest, PackAndPublishRefuseADirectoryThatIsNoBundle) {
+    const std::string info = "/Info.plist";
+    const std::string carrier = "/behavior.plist";
+    auto infoWith = [](const std::string& entries) {
+        return "<plist version=\"1.0\"><dict>" + entries + "</dict></plist>";
+    };
+    struct Case {
+        const char* name;
+        std::function<void(const std::string& bundle)> spoil;
+        std::string named;
+    };
+    const std::vector<Case> cases{
+        {"no Info.plist", [&](const std::string& b) { fs::remove(b + info); }, info},
+        {"Info.plist damaged", [&](const std::string& b) { writeText(b + info, "<plist"); }, info},
+        {"no identifier",
+         [&](const std::string& b) {
+             writeText(b + info, infoWith("<key>QZBundleVersion</key><string>1</string>"));
+         },
+         "QZBundleIdentifier"},
+        {"version not a string",
+         [&](const std::string& b) {
+             writeText(b + info, infoWith("<key>QZBundleIdentifier</key><string>x</string>"
+                                          "<key>QZBundleVersion</key><integer>1</integer>"));
+         },
+         "QZBundleVersion"},
+        {"no behavior.plist", [&](const std::string& b) { fs::remove(b + carrier); }, carrier},
+        {"behavior.plist damaged",
+         [&](const std::string& b) { writeText(b + carrier, "not a plist"); }, carrier},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
+        const std::string bundle = work / ("spoiled/" + std::string(c.name));
+        makeBundle(bundle, "3.0", {{"a.plist", "a"}});
+        c.spoil(bundle);
+        const std::string payload = work / "payload.tgz";
+        ToolRun pack = runTool(TAVRIX_CTL_TOOL, {"pack", bundle, "-o", payload});
+        EXPECT_EQ(pack.status, 1);
+        EXPECT_NE(pack.errors.find(c.named), std::string::npos) << pack.errors;
+        EXPECT_EQ(std::count(pack.errors.begin(), pack.errors.end(), '\n'), 1) << pack.errors;
+        EXPECT_FALSE(fs::exists(payload));
+        ToolRun published = runCatalogTool({"publish", work / "out", "--unsigned", bundle});
+        EXPECT_EQ(published.status, 1);
+        EXPECT_NE(published.errors.find(c.named), std::string::npos) << published.errors;
+        EXPECT_FALSE(fs::exists(work / "out/catalog.plist"));
+    }
 }
 
 }  // namespace

@@ -10,6 +10,7 @@
 #include <filesystem>
 #include <system_error>
 
+#include "catalog/BundleCheck.h"
 #include "payload/Archive.h"
 #include "platform/AssetCatalogFormat.h"
 #include "platform/AtomicFile.h"
@@ -57,23 +58,19 @@ std::string archiveNameFor(const std::string& directory, const std::string& vers
     return name + ".tgz";
 }
 
+// The version is always the bundle's own: a catalog that names another one makes every device
+// download the bundle again at each check.
 std::optional<std::string> bundleVersion(const BundleToPublish& bundle, std::string& error) {
-    if (!bundle.version.empty()) {
-        return bundle.version;
-    }
-    std::string infoPath = (fs::path(bundle.directory) / kInfoFileName).string();
-    plist::Refusal refusal;
-    std::optional<plist::Value> info = plist::readFile(infoPath, &refusal);
-    if (!info) {
-        error = infoPath + ": " + refusal.reason + "; give --version";
+    std::optional<BundleIdentity> identity = checkBundleDirectory(bundle.directory, error);
+    if (!identity) {
         return std::nullopt;
     }
-    const plist::Value* version = info->find(kBundleVersionKey);
-    if (version == nullptr || version->asString() == nullptr || version->asString()->empty()) {
-        error = infoPath + " has no " + kBundleVersionKey + " string; give --version";
+    if (!bundle.version.empty() && bundle.version != identity->version) {
+        error = bundle.directory + ": --version " + bundle.version + " differs from " +
+                kInfoFileName + " " + kBundleVersionKey + " " + identity->version;
         return std::nullopt;
     }
-    return *version->asString();
+    return identity->version;
 }
 
 // The regular files below directory as paths relative to it, sorted so archives are

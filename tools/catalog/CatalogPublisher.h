@@ -15,7 +15,7 @@ inline constexpr const char* kArchivesDirectoryName = "archives";
 
 struct BundleToPublish {
     std::string directory;
-    // Empty: the bundle's Info.plist "QZBundleVersion".
+    // Empty or equal to the bundle's Info.plist "QZBundleVersion", which is always the one used.
     std::string version;
     std::vector<std::string> productTypes;
     std::string minimumOSVersion;

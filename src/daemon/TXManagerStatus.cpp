@@ -1,0 +1,59 @@
+#include "daemon/TXManagerStatus.h"
+
+#include "bundle/BundleInfo.h"
+#include "bundle/BundleLocations.h"
+#include "bundle/BundleManager.h"
+#include "daemon/BehaviorPreferences.h"
+#include "daemon/TXManager.h"
+#include "update/ActivityRecord.h"
+#include "update/UpdateCheckScheduler.h"
+
+namespace tavrix {
+namespace {
+
+void setText(plist::Dictionary& status, const char* key, const std::string& text) {
+    if (!text.empty()) {
+        status.insert_or_assign(key, plist::Value(text));
+    }
+}
+
+plist::Dictionary describeLinkedBundle(const CarrierBundle& bundle) {
+    plist::Dictionary linked;
+    setText(linked, "Path", bundle.bundlePath);
+    setText(linked, "Identifier", bundle.copyBundleIdentifier());
+    setText(linked, "Version", bundle.bundleVersion);
+    setText(linked, "OverlayType", overlayTypeName(bundle.overlayType));
+    setText(linked, "CarrierFile", bundle.carrierFilePath);
+    return linked;
+}
+
+}  // namespace
+
+plist::Dictionary copyDaemonStatus() {
+    plist::Dictionary status = copyActivityRecord();
+    status.insert_or_assign(kStatusDaemonVersionKey, plist::Value(TAVRIX_VERSION));
+
+    auto behaviorID = copyBehaviorPreference(kTavrixIDKey);
+    if (behaviorID && behaviorID->isString()) {
+        status.insert_or_assign(kStatusBehaviorIDKey, *behaviorID);
+    }
+    const BundleSupport support = TXManager::sharedInstance().bundleSupport();
+    status.insert_or_assign(kStatusSupportedKey, plist::Value(support == BundleSupport::Supported));
+    setText(status, kStatusWhyNotSupportedKey, bundleSupportReason(support));
+
+    const CarrierBundle linked = BundleManager::sharedInstance().currentBundle();
+    if (!linked.bundlePath.empty()) {
+        status.insert_or_assign(kStatusLinkedBundleKey, plist::Value(describeLinkedBundle(linked)));
+    }
+    setText(status, kStatusSystemBundleVersionKey,
+            bundleInfoValueText(copyBundleVersionAtPath(systemBundleLocation())));
+    setText(status, kStatusUserBundleVersionKey,
+            bundleInfoValueText(copyBundleVersionAtPath(userBundleLocation())));
+
+    if (auto next = UpdateCheckScheduler::sharedInstance().nextCheckTime()) {
+        status.insert_or_assign(kStatusNextUpdateCheckKey, plist::Value(plist::Date{*next}));
+    }
+    return status;
+}
+
+}  // namespace tavrix

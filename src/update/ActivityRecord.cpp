@@ -1,0 +1,75 @@
+#include "update/ActivityRecord.h"
+
+#include <cstring>
+#include <mutex>
+
+#include "payload/FileSystemUtilities.h"
+#include "platform/AtomicFile.h"
+#include "platform/Clock.h"
+#include "platform/PlatformRoot.h"
+#include "plist/PropertyListFormat.h"
+#include "util/Log.h"
+
+namespace tavrix {
+namespace {
+
+constexpr const char* kRecordFileName = "activity.plist";
+constexpr mode_t kStateDirectoryMode = 0755;
+constexpr mode_t kRecordMode = 0644;
+
+// The main thread (payloads, checks a client asks for) and the download thread both write.
+std::mutex& recordLock() {
+    static std::mutex lock;
+    return lock;
+}
+
+plist::Dictionary readRecordLocked() {
+    std::optional<plist::Value> record = plist::readFile(activityRecordPath());
+    if (record && record->asDictionary() != nullptr) {
+        return *record->asDictionary();
+    }
+    return {};
+}
+
+void replaceEntry(const char* key, plist::Dictionary entry) {
+    entry.insert_or_assign(kActivityTimeKey,
+                           plist::Value(plist::Date{platform::Clock::absoluteTimeNow()}));
+    std::lock_guard lock(recordLock());
+    plist::Dictionary record = readRecordLocked();
+    record.insert_or_assign(key, plist::Value(std::move(entry)));
+    const std::string directory = platform::resolvePath(platform::kDaemonStateDirectory);
+    int error = payload::createDirectoryAt(directory, kStateDirectoryMode, true);
+    if (error == 0) {
+        // Binary keeps the fraction of a second, so two checks within a second stay apart.
+        error = platform::replaceFileAtomically(
+            activityRecordPath(), plist::serialize(plist::Value(record), plist::Format::Binary),
+            kRecordMode);
+    }
+    if (error != 0) {
+        logCFormat("Could not record the %s in %s: %s\n", key, activityRecordPath().c_str(),
+                   std::strerror(error));
+    }
+}
+
+}  // namespace
+
+std::string activityRecordPath() {
+    return platform::resolvePath(platform::kDaemonStateDirectory) + "/" + kRecordFileName;
+}
+
+void recordUpdateCheck(const std::string& outcome, const std::string& reason) {
+    replaceEntry(kLastCheckKey, {{kActivityOutcomeKey, plist::Value(outcome)},
+                                 {kActivityReasonKey, plist::Value(reason)}});
+}
+
+void recordPayload(bool extracted, const std::string& reason) {
+    replaceEntry(kLastPayloadKey, {{kActivityExtractedKey, plist::Value(extracted)},
+                                   {kActivityReasonKey, plist::Value(reason)}});
+}
+
+plist::Dictionary copyActivityRecord() {
+    std::lock_guard lock(recordLock());
+    return readRecordLocked();
+}
+
+}  // namespace tavrix
