@@ -53,12 +53,14 @@ bench: build
 demo: build
 	scripts/demo.sh $(BUILD)
 
-# The Debian package, built from debian/ and checked by lintian; the .deb files land in dist/.
+# The Debian packages (the daemon, the client library and its -dev), built from debian/ and
+# checked by lintian; the .deb files land in dist/.
 deb:
 	@scripts/install-deps.sh --deb
 	DEB_BUILD_OPTIONS="parallel=$(JOBS) nocheck" dpkg-buildpackage -us -uc -b
-	mkdir -p dist && mv ../tavrixservicesd*_$$(dpkg-parsechangelog -S Version)_*.* dist/
-	lintian --fail-on error,warning dist/tavrixservicesd_*.deb
+	mkdir -p dist && version=$$(dpkg-parsechangelog -S Version) && \
+	    mv ../tavrixservicesd*_$${version}_*.* ../libtavrixclient*_$${version}_*.* dist/
+	lintian --fail-on error,warning dist/*.deb
 
 format:
 	git ls-files '*.cpp' '*.h' | xargs clang-format -i

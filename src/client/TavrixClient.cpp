@@ -6,6 +6,7 @@
 #include <exception>
 #include <utility>
 
+#include "platform/BusHandles.h"
 #include "platform/BusValueCodec.h"
 
 namespace tavrix::client {
@@ -52,6 +53,8 @@ struct Deliveries {
 struct NotificationSubscription::Target {
     NotificationHandler handler;
     std::shared_ptr<Deliveries> deliveries;
+    // Last, so that it is released before what it points to.
+    platform::BusSlotPtr slot;
 };
 
 NotificationSubscription::NotificationSubscription() = default;
@@ -61,7 +64,6 @@ NotificationSubscription& NotificationSubscription::operator=(
     if (this != &other) {
         reset();
         target_ = std::move(other.target_);
-        slot_ = std::move(other.slot_);
     }
     return *this;
 }
@@ -70,7 +72,6 @@ NotificationSubscription::~NotificationSubscription() {
 }
 
 void NotificationSubscription::reset() noexcept {
-    slot_.reset();
     target_.reset();
 }
 
@@ -264,20 +265,24 @@ bool TavrixClient::setClientType(std::int32_t type) {
 }
 
 NotificationSubscription TavrixClient::subscribe(NotificationHandler handler) {
-    NotificationSubscription subscription;
-    subscription.target_.reset(
-        new NotificationSubscription::Target{std::move(handler), state_->deliveries});
-    // Any sender: every daemon instance posts, and a restarted one has a new unique name.
-    const std::string rule = std::string("type='signal',interface='") + kNotificationInterface +
-                             "',member='" + kNotificationMember + "'";
+    auto target = std::make_unique<NotificationSubscription::Target>();
+    target->handler = std::move(handler);
+    target->deliveries = state_->deliveries;
+    // The well-known name as sender: the bus matches it against whoever owns the name when the
+    // signal is sent, so every daemon instance is heard and a look-alike from any other peer is
+    // not.
+    const std::string rule = std::string("type='signal',sender='") + kServiceName +
+                             "',interface='" + kNotificationInterface + "',member='" +
+                             kNotificationMember + "'";
     sd_bus_slot* raw = nullptr;
     // Synchronous, so that no notification posted after this returns can be missed.
-    int r = sd_bus_add_match(state_->bus.get(), &raw, rule.c_str(), onPosted,
-                             subscription.target_.get());
-    subscription.slot_.reset(raw);
+    int r = sd_bus_add_match(state_->bus.get(), &raw, rule.c_str(), onPosted, target.get());
+    target->slot.reset(raw);
     if (r < 0) {
         throw ClientError("cannot subscribe to notifications: " + errnoText(r));
     }
+    NotificationSubscription subscription;
+    subscription.target_ = std::move(target);
     return subscription;
 }
 

@@ -16,7 +16,6 @@
 #include <string>
 #include <vector>
 
-#include "platform/BusHandles.h"
 #include "plist/Value.h"
 
 namespace tavrix::client {
@@ -41,7 +40,7 @@ using NotificationHandler = std::function<void(const std::string& name)>;
 // Keeps a notification handler registered; destroying (or resetting) it unsubscribes.
 class NotificationSubscription {
   public:
-    // What the bus slot points to: the handler and where deliveries are counted.
+    // The handler, where deliveries are counted, and the bus registration that points to them.
     struct Target;
 
     NotificationSubscription();
@@ -51,15 +50,13 @@ class NotificationSubscription {
     NotificationSubscription& operator=(const NotificationSubscription&) = delete;
     ~NotificationSubscription();
 
-    bool active() const { return slot_ != nullptr; }
+    bool active() const { return target_ != nullptr; }
     void reset() noexcept;
 
   private:
     friend class TavrixClient;
 
-    // Declared before the slot, so that the slot is released before the target it points to.
     std::unique_ptr<Target> target_;
-    platform::BusSlotPtr slot_;
 };
 
 class TavrixClient {
@@ -86,9 +83,10 @@ class TavrixClient {
     // True when the daemon knows this connection as a client.
     bool setClientType(std::int32_t type);
 
-    // Calls handler with the name of every notification posted from now on, by any daemon
-    // instance, while the subscription lives. Handlers run inside processFor and runUntil; an
-    // exception a handler throws comes out of those.
+    // Calls handler with the name of every notification that the daemon (any instance of it, and
+    // nobody else: the bus checks the sender) posts from now on, while the subscription lives.
+    // Handlers run inside processFor and runUntil; an exception a handler throws comes out of
+    // those.
     NotificationSubscription subscribe(NotificationHandler handler);
 
     // Handles incoming messages for the given time; true when a notification was delivered.

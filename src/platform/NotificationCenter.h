@@ -13,12 +13,14 @@ inline constexpr const char* kNotificationInterface = "com.zandor.NotificationCe
 inline constexpr const char* kNotificationMember = "Posted";
 inline constexpr const char* kNotificationPath = "/com/zandor/tavrixservicesd";
 
-// Posts on the daemon's own connection when called on the main thread; from other threads, over a
-// connection of its own (a bus connection must not be shared between threads). False when the
-// signal could not be sent.
+// Posts on the connection that owns the daemon's name, so that subscribers matching on that name
+// as sender hear it: at once on the main thread, from other threads through the main loop.
+// Without such a connection (tools), over a connection of the calling thread's own. False when
+// the signal could not be sent or queued.
 bool postNotification(const std::string& name);
 
-// The connection that main-thread posts use (null to stop using it) and the thread that owns it.
+// The connection that posts use (null to stop using it, after sending what is queued): the
+// calling thread owns it, and it must be attached to that thread's event loop.
 void setNotificationBus(sd_bus* bus);
 
 }  // namespace tavrix::platform

@@ -1,7 +1,9 @@
 #!/usr/bin/env bash
 # Installs the build into a scratch directory and checks what an integrator gets: every file in
-# its place under the configured prefix, the service files naming the installed daemon, and the
-# user and directory snippets accepted by systemd's own tools.
+# its place under the configured prefix, the service files naming the installed daemon and its
+# user, the user and directory snippets accepted by systemd's own tools; and what an application
+# developer gets: the example client built with pkg-config against the installed files only, run
+# against the installed daemon on a private bus.
 # usage: tests/install/check-install.sh BUILD_DIR
 set -euo pipefail
 build=${1:?build directory}
@@ -13,6 +15,9 @@ DESTDIR="$stage/image" cmake --install "$build" >/dev/null
 prefix=$(sed -n 's/^CMAKE_INSTALL_PREFIX:PATH=//p' "$build/CMakeCache.txt")
 image="$stage/image"
 daemon="$prefix/libexec/tavrixservicesd"
+libdir=$(sed -n 's/^CMAKE_INSTALL_LIBDIR:PATH=//p' "$build/CMakeCache.txt")
+case $libdir in /*) ;; *) libdir="$prefix/$libdir" ;; esac
+export LD_LIBRARY_PATH="$image$libdir"
 
 [ -x "$image$daemon" ] || fail "no daemon at $daemon"
 for tool in tavrixctl tavrix-catalog tavrix-plist; do
@@ -40,21 +45,60 @@ tmpfiles=$(find_one tmpfiles.d/tavrixservicesd.conf)
 
 grep -qx "ExecStart=$daemon" "$unit" || fail "the unit does not start $daemon"
 grep -qx "Exec=$daemon" "$activation" || fail "the activation file does not name $daemon"
+grep -qx "User=tavrixservicesd" "$unit" || fail "the unit does not run as tavrixservicesd"
+grep -qx "User=tavrixservicesd" "$activation" || fail "the bus does not start tavrixservicesd's user"
 ! grep -rq '@[A-Z_]*@' "$unit" "$activation" || fail "a placeholder was left unreplaced"
 
-# The snippets make the mobile user, the tavrix group and every directory the unit writes.
+# The snippets make the daemon's and the mobile user, the tavrix group and every directory the
+# unit writes, the mobile ones reachable through the daemon's group.
 if command -v systemd-sysusers >/dev/null && command -v systemd-tmpfiles >/dev/null; then
     root="$stage/root"
     mkdir -p "$root/etc"
     systemd-sysusers --root="$root" "$sysusers" 2>/dev/null
     grep -q '^mobile:x:[0-9]*:[0-9]*:[^:]*:/var/mobile:' "$root/etc/passwd" || fail "no mobile user"
+    grep -q '^tavrixservicesd:x:' "$root/etc/passwd" || fail "no tavrixservicesd user"
     grep -q '^tavrix:' "$root/etc/group" || fail "no tavrix group"
     systemd-tmpfiles --root="$root" --create "$tmpfiles" 2>/dev/null
     for directory in var/mobile/Library/Preferences var/mobile/Library/TavrixBundles \
         var/lib/tavrixservicesd var/cache/tavrixservicesd; do
         [ -d "$root/$directory" ] || fail "tmpfiles.d does not make /$directory"
     done
+    daemon_gid=$(sed -n 's/^tavrixservicesd:x:[0-9]*:\([0-9]*\):.*/\1/p' "$root/etc/passwd")
+    for directory in var/mobile/Library var/mobile/Library/Preferences; do
+        [ "$(stat -c %a:%g "$root/$directory")" = "2775:$daemon_gid" ] ||
+            fail "/$directory is not group-writable and setgid for the daemon's group"
+    done
 else
     echo "systemd-sysusers or systemd-tmpfiles missing: snippets not checked"
 fi
-echo "installed under $prefix: all files in place"
+# The client library as an application sees it.
+pc="$image$libdir/pkgconfig/tavrixclient.pc"
+[ -f "$pc" ] || fail "no tavrixclient.pc"
+flags=$(PKG_CONFIG_PATH="$image$libdir/pkgconfig" PKG_CONFIG_SYSROOT_DIR="$image" \
+    pkg-config --cflags --libs tavrixclient) || fail "pkg-config does not know tavrixclient"
+source_dir=$(sed -n 's/^CMAKE_HOME_DIRECTORY:INTERNAL=//p' "$build/CMakeCache.txt")
+# shellcheck disable=SC2086 # the flags are words
+c++ -std=c++20 -Wall -Wextra -Werror -o "$stage/client-example" \
+    "$source_dir/examples/client/client-example.cpp" $flags || fail "the example does not build"
+ldd "$stage/client-example" | grep -q "libtavrixclient.so.1 => $image" ||
+    fail "the example does not use the installed library"
+if grep -rqE '#include "(platform|util|payload|daemon|bundle|update)/' "$image$prefix/include/tavrix"; then
+    fail "an installed header includes an internal one"
+fi
+
+# ... and run against the installed daemon, activated by a private bus on the demo device.
+if command -v dbus-daemon >/dev/null; then
+    # shellcheck source=scripts/private-bus.sh
+    . "$source_dir/scripts/private-bus.sh"
+    cp -r "$source_dir/examples/demo-root" "$stage/device"
+    trap 'stop_private_bus; rm -rf "$stage"' EXIT
+    start_private_bus "$stage/bus" "$image$daemon" "$stage/device" 5 || fail "no private bus"
+    output=$("$stage/client-example" --address "$DBUS_SYSTEM_BUS_ADDRESS" 2>&1) ||
+        fail "the example failed: $output"
+    grep -qE "^supported: (yes|no)$" <<<"$output" || fail "the example was not answered: $output"
+    grep -qx "notification: TXDaemonStartedNotification" <<<"$output" ||
+        fail "the example heard no notification: $output"
+else
+    "$stage/client-example" --help | grep -q '^usage: client-example' || fail "client-example --help"
+fi
+echo "installed under $prefix: all files in place; the example client builds and runs"

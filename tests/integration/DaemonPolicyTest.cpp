@@ -51,8 +51,8 @@ class DaemonPolicyTest : public BusFixture {
         std::ifstream in(TAVRIX_POLICY_PATH, std::fstream::binary);
         std::string policy(std::istreambuf_iterator<char>(in), {});
         const passwd* self = ::getpwuid(::geteuid());
-        policy =
-            replaceOnce(policy, "user=\"mobile\"", std::string("user=\"") + self->pw_name + "\"");
+        policy = replaceOnce(policy, "user=\"tavrixservicesd\"",
+                             std::string("user=\"") + self->pw_name + "\"");
         policy =
             replaceOnce(policy, "group=\"tavrix\"", std::string("group=\"") + kStandInGroup + "\"");
         std::filesystem::path path = device().base() / "policy.conf";
@@ -107,7 +107,7 @@ TEST_F(DaemonPolicyTest, AnyoneMayAskButOnlyPrivilegedCallersMayChange) {
     EXPECT_TRUE(client().setTavrixID("z", std::nullopt));
 }
 
-TEST_F(DaemonPolicyTest, OnlyTheDaemonsUserMayOwnTheName) {
+TEST_F(DaemonPolicyTest, OnlyTheDaemonsUserMayOwnTheNameOrPost) {
     const std::vector<std::string> requestName = {"call",
                                                   "org.freedesktop.DBus",
                                                   "/org/freedesktop/DBus",
@@ -127,6 +127,23 @@ TEST_F(DaemonPolicyTest, OnlyTheDaemonsUserMayOwnTheName) {
     auto owned = runCommand(busctl);
     EXPECT_EQ(owned.status, 0) << owned.output;
     EXPECT_EQ(owned.output, "u 1\n");
+
+    // A look-alike notification from anyone else never reaches a listener, even one that does
+    // not check the sender; the daemon's user, posting after it, gets through.
+    auto post = [&](const std::string& name) {
+        return std::vector<std::string>{"/usr/bin/busctl",
+                                        "--address=" + busAddress(),
+                                        "emit",
+                                        "/com/zandor/tavrixservicesd",
+                                        "com.zandor.NotificationCenter",
+                                        "Posted",
+                                        "s",
+                                        name};
+    };
+    asNobody(kNobody, post("kTVXBehaviorBundleChangedNotification"));
+    EXPECT_EQ(runCommand(post("PolicyTestMarker")).status, 0);
+    EXPECT_TRUE(watcher().waitForNotification("PolicyTestMarker", 1, std::chrono::seconds(10)));
+    EXPECT_EQ(watcher().notificationCount("kTVXBehaviorBundleChangedNotification"), 0);
 }
 
 }  // namespace

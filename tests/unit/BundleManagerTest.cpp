@@ -373,8 +373,14 @@ TEST_F(BundleReset, LinksOnceAndTellsEveryoneOnce) {
     writeBundle(systemBundle(), Value("9"));
     writeBundle(userBundle(), Value("10"));
 
+    // Posts leave on the connection that owns the daemon's name, as in the daemon.
     test::PrivateBusDaemon bus;
-    ::setenv("DBUS_STARTER_ADDRESS", bus.address().c_str(), 1);
+    platform::BusPtr daemonSide = bus.connect();
+    ASSERT_GE(sd_bus_request_name(daemonSide.get(), client::kServiceName, 0), 0);
+    platform::setNotificationBus(daemonSide.get());
+    struct Unset {
+        ~Unset() { platform::setNotificationBus(nullptr); }
+    } unset;
     TavrixClient listener = TavrixClient::connectToAddress(bus.address());
     std::vector<std::string> posted;
     auto subscription =

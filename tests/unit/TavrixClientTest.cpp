@@ -188,10 +188,16 @@ TEST(TavrixClient, DeliversNotificationsWhileSubscribed) {
     std::vector<std::string> names;
     auto subscription = client.subscribe([&](const std::string& name) { names.push_back(name); });
 
+    // The same signal from a peer that does not own the daemon's name is nobody's notification.
+    BusPtr lookAlike = bus.connect();
+    sd_bus_emit_signal(lookAlike.get(), kObjectPath, kNotificationInterface, kNotificationMember,
+                       "s", "LookAlike");
+    sd_bus_flush(lookAlike.get());
     stub.post("s", "TXDaemonStartedNotification");
     stub.post("i", 42);  // a matching signal without a name is skipped
     stub.post("s", "kTVXBehaviorBundleChangedNotification");
     EXPECT_TRUE(client.runUntil([&] { return names.size() >= 2; }, 10s));
+    client.processFor(200ms);  // time for a straggler
     EXPECT_EQ(names, (std::vector<std::string>{"TXDaemonStartedNotification",
                                                "kTVXBehaviorBundleChangedNotification"}));
 
