@@ -119,6 +119,10 @@ std::unique_ptr<Archive> Archive::initWithMaxUncompressedSize(std::uint32_t size
         filterStatus = archive_write_add_filter_bzip2(writer);
     } else if (archiveType == kArchiveTypeGzip) {
         filterStatus = archive_write_add_filter_gzip(writer);
+        // The time of writing in the gzip header would make equal archives differ.
+        if (filterStatus == ARCHIVE_OK) {
+            filterStatus = archive_write_set_filter_option(writer, "gzip", "timestamp", nullptr);
+        }
     }
     if (filterStatus != ARCHIVE_OK ||
         archive_write_set_format_pax_restricted(writer) != ARCHIVE_OK ||
@@ -163,8 +167,12 @@ bool Archive::addFile(const std::string& path, const std::string& asFile) {
     archive_entry_set_size(entry.get(), static_cast<la_int64_t>(length));
     archive_entry_set_filetype(entry.get(), AE_IFREG);
     archive_entry_set_perm(entry.get(), kEntryMode);
-    archive_entry_set_mtime(entry.get(), contents->info.st_mtim.tv_sec,
-                            contents->info.st_mtim.tv_nsec);
+    if (entryModificationTime_) {
+        archive_entry_set_mtime(entry.get(), *entryModificationTime_, 0);
+    } else {
+        archive_entry_set_mtime(entry.get(), contents->info.st_mtim.tv_sec,
+                                contents->info.st_mtim.tv_nsec);
+    }
     if (archive_write_header(archive_.get(), entry.get()) != ARCHIVE_OK) {
         return false;
     }

@@ -1,9 +1,9 @@
 // Over-the-air bundle updates as a device sees them: a catalog made and signed by the publishing
 // tool, served over HTTP on 127.0.0.1, a newer bundle installed over the user bundle and linked,
 // and downloads that go wrong leaving the linked bundle as it was.
+#include <fcntl.h>
 #include <signal.h>
 #include <sodium.h>
-#include <fcntl.h>
 #include <sys/mount.h>
 #include <sys/statvfs.h>
 #include <unistd.h>
@@ -12,6 +12,7 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <future>
 #include <iostream>
 #include <map>
@@ -19,13 +20,13 @@
 #include <thread>
 
 #include "BusFixture.h"
-#include "util/UniqueFd.h"
 #include "CommandRunner.h"
 #include "LocalHttpServer.h"
 #include "platform/BackgroundJobScheduler.h"
 #include "platform/Clock.h"
 #include "plist/PropertyListFormat.h"
 #include "update/UpdateCheckScheduler.h"
+#include "util/UniqueFd.h"
 
 namespace tavrix::integration {
 namespace {
@@ -63,23 +64,44 @@ class OverTheAirUpdateTest : public BusFixture {
         CommandResult keys = runCommand(
             {TAVRIX_CATALOG_TOOL, "keygen", secretKey().string(), (keys_ / "public").string()});
         ASSERT_EQ(keys.status, 0) << keys.output;
-        std::string publicKey = readFile(keys_ / "public");
-        while (!publicKey.empty() && publicKey.back() == '\n') {
-            publicKey.pop_back();
-        }
         server.serveDirectory("/updates/", site());
+        writeCatalogSettings(true);
+        // A check already armed a few days ahead, so that every re-arm shows.
+        device().writeDaemonPreferences(
+            {{"EnableSupport", true}, {"NextUpdate", plist::Date{now() + 3 * kOneDay}}});
+    }
+
+    // The device trusts the publisher's key (in the single-key form), or no key at all.
+    void writeCatalogSettings(bool trusted) {
+        plist::Dictionary type{{"CatalogURL", server.url("/updates/catalog.plist")}};
+        if (trusted) {
+            std::string publicKey = readFile(keys_ / "public");
+            publicKey.pop_back();  // the line break
+            type.emplace("PublicKey", publicKey);
+        }
         ASSERT_TRUE(plist::writeFile(
             at("/etc/tavrix/AssetCatalog.plist").string(),
             plist::Value(plist::Dictionary{
                 {"AssetTypes",
-                 plist::Dictionary{{"com.zandor.Grellas.TavrixBundles",
-                                    plist::Dictionary{
-                                        {"CatalogURL", server.url("/updates/catalog.plist")},
-                                        {"PublicKey", publicKey},
-                                    }}}}})));
-        // A check already armed a few days ahead, so that every re-arm shows.
-        device().writeDaemonPreferences(
-            {{"EnableSupport", true}, {"NextUpdate", plist::Date{now() + 3 * kOneDay}}});
+                 plist::Dictionary{{"com.zandor.Grellas.TavrixBundles", std::move(type)}}}})));
+    }
+
+    // Edits the published catalog and signs it again with the publisher's key, as a publisher
+    // with the key could.
+    void editAndResign(const std::function<void(plist::Dictionary&)>& edit) {
+        auto catalog = plist::readFile((site() / "catalog.plist").string());
+        ASSERT_TRUE(catalog && catalog->isDictionary());
+        edit(*catalog->asDictionary());
+        ASSERT_TRUE(plist::writeFile((site() / "catalog.plist").string(), *catalog));
+        const std::string bytes = readFile(site() / "catalog.plist");
+        const std::string secret = readFile(secretKey());
+        ASSERT_EQ(secret.size(), crypto_sign_SECRETKEYBYTES);
+        std::string signature(crypto_sign_BYTES, '\0');
+        ASSERT_GE(sodium_init(), 0);
+        crypto_sign_detached(reinterpret_cast<unsigned char*>(signature.data()), nullptr,
+                             reinterpret_cast<const unsigned char*>(bytes.data()), bytes.size(),
+                             reinterpret_cast<const unsigned char*>(secret.data()));
+        writeFile(site() / "catalog.plist.sig", signature);
     }
 
     static double now() { return platform::Clock::absoluteTimeNow(); }
@@ -121,10 +143,17 @@ class OverTheAirUpdateTest : public BusFixture {
 
     // Publishes the bundle of this version, signed, as the only asset of the catalog; answers
     // the archive's URL path.
-    std::string publish(const std::string& version, std::size_t bulkBytes = 0) {
-        CommandResult run =
-            runCommand({TAVRIX_CATALOG_TOOL, "publish", site().string(), "--key",
-                        secretKey().string(), "--fresh", writeBundle(version, bulkBytes).string()});
+    std::string publish(const std::string& version, std::size_t bulkBytes = 0,
+                        const std::vector<std::string>& options = {}) {
+        std::vector<std::string> command{TAVRIX_CATALOG_TOOL,
+                                         "publish",
+                                         site().string(),
+                                         "--key",
+                                         secretKey().string(),
+                                         "--fresh",
+                                         writeBundle(version, bulkBytes).string()};
+        command.insert(command.end(), options.begin(), options.end());
+        CommandResult run = runCommand(command);
         EXPECT_EQ(run.status, 0) << run.output;
         return "/updates/archives/Default-" + version + ".tgz";
     }
@@ -293,7 +322,8 @@ TEST_F(OverTheAirUpdateTest, NewerPublishedBundleIsInstalledLinkedAndAnnounced) 
 
 // Each way an update can go wrong leaves the linked bundle and its files as they were, posts
 // nothing and leaves no download behind; a download that started and failed re-arms the check a
-// day ahead, a refused catalog starts nothing. A good update afterwards still installs.
+// day ahead, a refused catalog (expired, replayed, unsigned) or an asset held back by its rollout
+// starts nothing. A good update afterwards still installs.
 TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheDaemonKeepsServing) {
     setIDWithBundle("1");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
@@ -319,32 +349,42 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheDaemonKeepsServing)
         {"wrong digest in a validly signed catalog",
          [&] {
              publish("2");
-             auto catalog = plist::readFile((site() / "catalog.plist").string());
-             ASSERT_TRUE(catalog);
-             plist::Value& entry = catalog->asDictionary()->at("Assets").asArray()->at(0);
-             entry.asDictionary()->insert_or_assign("ArchiveSHA256", std::string(64, 'a'));
-             ASSERT_TRUE(plist::writeFile((site() / "catalog.plist").string(), *catalog));
-             // Signed again with the publisher's key, so only the digest is wrong.
-             const std::string bytes = readFile(site() / "catalog.plist");
-             const std::string secret = readFile(secretKey());
-             ASSERT_EQ(secret.size(), crypto_sign_SECRETKEYBYTES);
-             std::string signature(crypto_sign_BYTES, '\0');
-             ASSERT_GE(sodium_init(), 0);
-             crypto_sign_detached(reinterpret_cast<unsigned char*>(signature.data()), nullptr,
-                                  reinterpret_cast<const unsigned char*>(bytes.data()),
-                                  bytes.size(),
-                                  reinterpret_cast<const unsigned char*>(secret.data()));
-             writeFile(site() / "catalog.plist.sig", signature);
+             editAndResign([](plist::Dictionary& catalog) {
+                 catalog.at("Assets").asArray()->at(0).asDictionary()->insert_or_assign(
+                     "ArchiveSHA256", std::string(64, 'a'));
+             });
          },
          true, "the archive's SHA-256 is"},
-        {"catalog signature that does not verify",
+        {"expired catalog",
          [&] {
              publish("2");
-             std::string signature = readFile(site() / "catalog.plist.sig");
-             signature[0] = static_cast<char>(signature[0] ^ 1);
-             writeFile(site() / "catalog.plist.sig", signature);
+             editAndResign([](plist::Dictionary& catalog) {
+                 catalog.insert_or_assign("Expires", plist::Date{now() - 60});
+             });
          },
-         false, "its signature does not verify with the configured key"},
+         false, ": expired: "},
+        {"older catalog replayed",
+         [&] {
+             publish("2");
+             const std::string older = readFile(site() / "catalog.plist");
+             const std::string olderSignature = readFile(site() / "catalog.plist.sig");
+             publish("1");
+             EXPECT_FALSE(client().checkForTavrixBundleUpdate()) << "a newer catalog, seen";
+             writeFile(site() / "catalog.plist", older);
+             writeFile(site() / "catalog.plist.sig", olderSignature);
+         },
+         false, ": rollback: "},
+        {"no trusted key",
+         [&] {
+             publish("2");
+             writeCatalogSettings(false);
+         },
+         false, ": unsigned not allowed: "},
+        {"outside a rollout at 0%",
+         [&] {
+             publish("2", 0, {"--rollout", "0"});
+         },
+         false, "outside the rollout of 2 (0%)"},
         {"connection cut in the middle of the archive",
          [&] {
              std::string path = publish("2");
@@ -362,6 +402,7 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheDaemonKeepsServing)
         // Whole seconds: that is what a stored date keeps.
         const double armed = std::floor(now() + 3 * kOneDay);
         setNextUpdate(armed);
+        writeCatalogSettings(true);
         c.arrange();
         const int refusals = countLogLinesContaining(c.logged);
         EXPECT_EQ(client().checkForTavrixBundleUpdate(), c.started);
@@ -381,7 +422,8 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheDaemonKeepsServing)
         EXPECT_TRUE(client().isTavrixBundleSupported());
     }
 
-    publish("3");
+    writeCatalogSettings(true);
+    publish("3", 0, {"--rollout", "100"});
     EXPECT_TRUE(client().checkForTavrixBundleUpdate());
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 2, 30s));
     expectInstalled("3");
