@@ -26,15 +26,15 @@ constexpr const char* kDefaultAssetType = "com.zandor.Grellas.TavrixBundles";
 constexpr const char* kHelp =
     "usage: tavrix-catalog keygen SECRET_KEY_FILE PUBLIC_KEY_FILE\n"
     "       tavrix-catalog publish OUTDIR (--key SECRET_KEY_FILE [--key-id ID] | --unsigned)\n"
-    "                      [--asset-type TYPE] [--expires-in DAYS] [--fresh]\n"
+    "                      [--asset-type TYPE] [--expires-in DAYS] [--serial N] [--fresh]\n"
     "                      BUNDLE_DIR [BUNDLE_OPTIONS]...\n"
     "       tavrix-catalog verify (URL | OUTDIR) (--key [ID=]PUBLIC_KEY_FILE... | "
     "--allow-unsigned)\n"
     "                      [--asset-type TYPE] [--min-serial N]\n"
     "\n"
     "keygen   makes an Ed25519 key pair. The secret key file (mode 0600) signs catalogs;\n"
-    "         the public key is printed and written as base64, the form the PublicKey\n"
-    "         setting of AssetCatalog.plist takes.\n"
+    "         the public key is printed and written as base64, the form the TrustedKeys\n"
+    "         entries of AssetCatalog.plist take.\n"
     "publish  packs each bundle directory into OUTDIR/archives/NAME-VERSION.tgz and lists it\n"
     "         in OUTDIR/catalog.plist, signed into OUTDIR/catalog.plist.sig. Bundles are\n"
     "         added to the catalog already in OUTDIR; one with the same archive name\n"
@@ -51,6 +51,8 @@ constexpr const char* kHelp =
     "  --asset-type TYPE  the catalog's asset type (default com.zandor.Grellas.TavrixBundles)\n"
     "  --expires-in DAYS  devices refuse the catalog after this many days (default 30):\n"
     "                     publish again before then\n"
+    "  --serial N         publish under this serial instead of the next one; for a site\n"
+    "                     rebuilt from scratch, give one above what devices hold\n"
     "  --fresh            start a new catalog instead of adding to the existing one\n"
     "\n"
     "verify options:\n"
@@ -136,6 +138,12 @@ int runPublish(const std::vector<std::string_view>& arguments) {
                 return usageError("--expires-in takes a number of days from 1 to 3650");
             }
             request.expiresInDays = static_cast<int>(*days);
+        } else if (argument == "--serial") {
+            std::optional<long long> serial = parseNumber(value, 1, INT64_MAX);
+            if (!serial) {
+                return usageError("--serial takes a whole number from 1");
+            }
+            request.serial = *serial;
         } else if (argument == "--rollout") {
             std::optional<long long> percent = parseNumber(value, 0, 100);
             if (!percent) {

@@ -2,8 +2,7 @@
 
 #include <sys/stat.h>
 
-#include <cinttypes>
-#include <cstdio>
+#include <ctime>
 
 #include "payload/FileSystemUtilities.h"
 #include "platform/AtomicFile.h"
@@ -23,14 +22,17 @@ std::string serialFilePath(std::string_view assetType) {
            ".plist";
 }
 
-std::string dateText(plist::Date date) {
-    auto seconds = static_cast<long long>(date.unixTime());
-    char text[32];
-    std::snprintf(text, sizeof text, "unix time %lld", seconds);
+}  // namespace
+
+std::string catalogDateText(plist::Date date) {
+    auto seconds = static_cast<std::time_t>(date.unixTime());
+    std::tm parts{};
+    char text[32] = "?";
+    if (::gmtime_r(&seconds, &parts) != nullptr) {
+        std::strftime(text, sizeof text, "%Y-%m-%d %H:%M:%S UTC", &parts);
+    }
     return text;
 }
-
-}  // namespace
 
 std::string defaultKeyIdentifier(const CatalogPublicKey& publicKey) {
     Sha256Digest digest;
@@ -95,8 +97,9 @@ bool verifyWithTrustedKey(std::string_view bytes, std::string_view signature,
 bool checkFreshness(const CatalogMetadata& metadata, plist::Date now,
                     std::optional<std::int64_t> highestAccepted, CatalogRefusal& refusal) {
     if (metadata.expires <= now) {
-        refusal = {CatalogRefusalKind::Expired,
-                   "it expired at " + dateText(metadata.expires) + ", it is now " + dateText(now)};
+        refusal = {CatalogRefusalKind::Expired, "it expired at " +
+                                                    catalogDateText(metadata.expires) +
+                                                    ", it is now " + catalogDateText(now)};
         return false;
     }
     if (highestAccepted && metadata.serial < *highestAccepted) {

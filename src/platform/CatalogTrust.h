@@ -25,6 +25,9 @@ struct TrustedCatalogKey {
 // key configured alone and the catalogs it signs agree on a name without anyone choosing one.
 std::string defaultKeyIdentifier(const CatalogPublicKey& publicKey);
 
+// date as "2026-11-23 14:00:00 UTC", for log lines and the tool's output.
+std::string catalogDateText(plist::Date date);
+
 // What a catalog says about itself, under its signature.
 struct CatalogMetadata {
     std::int64_t serial = 0;

@@ -298,7 +298,7 @@ std::optional<std::string> publishCatalog(const PublishRequest& request) {
         return systemError("cannot create", archives, code.value());
     }
     std::string error;
-    std::int64_t serial = previousSerial(request) + 1;
+    std::int64_t serial = request.serial.value_or(previousSerial(request) + 1);
     std::optional<plist::Array> entries = existingEntries(request, error);
     if (!entries) {
         return error;

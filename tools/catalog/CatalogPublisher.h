@@ -2,6 +2,7 @@
 // property list and signing it, so that any static HTTP server can serve the output directory.
 #pragma once
 
+#include <cstdint>
 #include <optional>
 #include <string>
 #include <vector>
@@ -31,6 +32,8 @@ struct PublishRequest {
     std::optional<platform::CatalogSecretKey> secretKey;
     // The identifier devices know the key by; empty: its default identifier.
     std::string keyIdentifier;
+    // Nothing: one more than the catalog it replaces.
+    std::optional<std::int64_t> serial;
     // Devices refuse the catalog this many days after publication.
     int expiresInDays = 30;
     // Start a new catalog instead of adding to the one in the output directory.

@@ -25,16 +25,6 @@ bool isURL(const std::string& source) {
     return source.starts_with("http://") || source.starts_with("https://");
 }
 
-std::string utcText(plist::Date date) {
-    std::time_t seconds = static_cast<std::time_t>(date.unixTime());
-    std::tm parts{};
-    char text[64] = "?";
-    if (::gmtime_r(&seconds, &parts) != nullptr) {
-        std::strftime(text, sizeof text, "%Y-%m-%d %H:%M:%S UTC", &parts);
-    }
-    return text;
-}
-
 std::optional<std::string> readSource(const std::string& location, std::size_t maxBytes,
                                       std::string& error) {
     if (isURL(location)) {
@@ -126,7 +116,7 @@ bool verifyPublishedCatalog(const VerifyRequest& request) {
         std::printf("signature: not checked (--allow-unsigned)\n");
     }
     std::printf("serial: %lld\nexpires: %s\n", static_cast<long long>(metadata->serial),
-                utcText(metadata->expires).c_str());
+                platform::catalogDateText(metadata->expires).c_str());
     plist::Date now = plist::Date::fromUnixTime(static_cast<double>(std::time(nullptr)));
     if (!platform::checkFreshness(*metadata, now, request.minimumSerial, refusal)) {
         good = problem(refusal.what());
