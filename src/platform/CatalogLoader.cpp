@@ -143,12 +143,8 @@ std::optional<std::vector<CatalogEntry>> loadCatalogEntries(const AssetTypeSetti
         refusal = {CatalogRefusalKind::Malformed, whyNot};
         return std::nullopt;
     }
-    std::optional<CatalogMetadata> metadata = readCatalogMetadata(*parsed, refusal);
-    if (!metadata) {
-        return std::nullopt;
-    }
     if (isSigned(settings)) {
-        if (!verifyWithTrustedKey(catalog->bytes, catalog->signature, metadata->keyID,
+        if (!verifyWithTrustedKey(catalog->bytes, catalog->signature, catalogKeyID(*parsed),
                                   settings.trustedKeys, refusal)) {
             return std::nullopt;
         }
@@ -157,6 +153,10 @@ std::optional<std::vector<CatalogEntry>> loadCatalogEntries(const AssetTypeSetti
             "Asset catalog: taking the catalog %s unverified: AllowUnsigned is set, which "
             "is for development only",
             settings.catalogURL.c_str());
+    }
+    std::optional<CatalogMetadata> metadata = readCatalogMetadata(*parsed, refusal);
+    if (!metadata) {
+        return std::nullopt;
     }
     std::optional<std::int64_t> highestAccepted = readAcceptedSerial(settings.assetType);
     if (!checkFreshness(*metadata, plist::Date{Clock::absoluteTimeNow()}, highestAccepted,

@@ -57,14 +57,15 @@ std::optional<CatalogMetadata> readCatalogMetadata(const plist::Value& catalog,
         return std::nullopt;
     }
     metadata.expires = *expires->asDate();
-    if (const plist::Value* keyID = catalog.find(kCatalogKeyIDKey)) {
-        if (keyID->asString() == nullptr) {
-            refusal = {CatalogRefusalKind::Malformed, "its KeyID is not a string"};
-            return std::nullopt;
-        }
-        metadata.keyID = *keyID->asString();
-    }
     return metadata;
+}
+
+std::optional<std::string> catalogKeyID(const plist::Value& catalog) {
+    const plist::Value* keyID = catalog.find(kCatalogKeyIDKey);
+    if (keyID == nullptr || keyID->asString() == nullptr) {
+        return std::nullopt;
+    }
+    return *keyID->asString();
 }
 
 bool verifyWithTrustedKey(std::string_view bytes, std::string_view signature,

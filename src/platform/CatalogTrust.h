@@ -28,18 +28,20 @@ std::string defaultKeyIdentifier(const CatalogPublicKey& publicKey);
 // date as "2026-11-23 14:00:00 UTC", for log lines and the tool's output.
 std::string catalogDateText(plist::Date date);
 
-// What a catalog says about itself, under its signature.
+// What a catalog says about its freshness, under its signature.
 struct CatalogMetadata {
     std::int64_t serial = 0;
     plist::Date expires;
-    // Nothing for a catalog that names no key (unsigned ones).
-    std::optional<std::string> keyID;
 };
 
 // The metadata of a parsed catalog; nothing, with a Malformed refusal, when Serial or Expires is
 // missing or of the wrong type.
 std::optional<CatalogMetadata> readCatalogMetadata(const plist::Value& catalog,
                                                    CatalogRefusal& refusal);
+
+// The key a parsed catalog names as its signer, when it names one as a string. Read before the
+// signature is checked, and used only to pick the key to check it with.
+std::optional<std::string> catalogKeyID(const plist::Value& catalog);
 
 // True when signature is the signature of bytes by the trusted key that keyID names.
 bool verifyWithTrustedKey(std::string_view bytes, std::string_view signature,

@@ -346,15 +346,6 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheDaemonKeepsServing)
              writeFile(archive, bytes);
          },
          true, "the archive's SHA-256 is"},
-        {"wrong digest in a validly signed catalog",
-         [&] {
-             publish("2");
-             editAndResign([](plist::Dictionary& catalog) {
-                 catalog.at("Assets").asArray()->at(0).asDictionary()->insert_or_assign(
-                     "ArchiveSHA256", std::string(64, 'a'));
-             });
-         },
-         true, "the archive's SHA-256 is"},
         {"expired catalog",
          [&] {
              publish("2");

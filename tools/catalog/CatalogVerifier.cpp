@@ -96,24 +96,24 @@ bool verifyPublishedCatalog(const VerifyRequest& request) {
         return problem("malformed: " + error);
     }
     platform::CatalogRefusal refusal;
-    std::optional<platform::CatalogMetadata> metadata =
-        platform::readCatalogMetadata(*catalog, refusal);
-    if (!metadata) {
-        return problem(refusal.what());
-    }
     bool good = true;
     if (!request.keys.empty()) {
         std::string signature = readSource(catalogLocation + platform::kCatalogSignatureSuffix,
                                            kMaxSignatureBytes, error)
                                     .value_or(std::string());
-        if (platform::verifyWithTrustedKey(*bytes, signature, metadata->keyID, request.keys,
-                                           refusal)) {
-            std::printf("signature: verified with the key %s\n", metadata->keyID->c_str());
+        std::optional<std::string> keyID = platform::catalogKeyID(*catalog);
+        if (platform::verifyWithTrustedKey(*bytes, signature, keyID, request.keys, refusal)) {
+            std::printf("signature: verified with the key %s\n", keyID->c_str());
         } else {
             good = problem(refusal.what());
         }
     } else {
         std::printf("signature: not checked (--allow-unsigned)\n");
+    }
+    std::optional<platform::CatalogMetadata> metadata =
+        platform::readCatalogMetadata(*catalog, refusal);
+    if (!metadata) {
+        return problem(refusal.what());
     }
     std::printf("serial: %lld\nexpires: %s\n", static_cast<long long>(metadata->serial),
                 platform::catalogDateText(metadata->expires).c_str());
