@@ -262,6 +262,14 @@ TEST_F(AssetCatalogTest, WithoutUsableSettingsQueriesAnswerNoAssetsAndSayWhyOnce
         {"short key",
          [this] { writeSettings(base64Encode(reinterpret_cast<const std::uint8_t*>("short"), 5)); },
          "PublicKey is not 32 bytes"},
+        {"short key among trusted keys",
+         [this] {
+             writeTypeSettings(
+                 {{kSettingsTrustedKeysKey,
+                   plist::Value(plist::Dictionary{{"good", plist::Value(publicKey)},
+                                                  {"bad", plist::Value("c2hvcnQ=")}})}});
+         },
+         "TrustedKeys entry \"bad\""},
     };
     for (const Case& c : cases) {
         SCOPED_TRACE(c.name);
