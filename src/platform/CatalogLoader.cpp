@@ -108,11 +108,8 @@ void recordSerial(const AssetTypeSettings& settings, std::int64_t serial,
     }
 }
 
-}  // namespace
-
-std::optional<std::vector<CatalogEntry>> loadCatalogEntries(const AssetTypeSettings& settings,
-                                                            bool localOnly,
-                                                            CatalogRefusal& refusal) {
+std::optional<std::vector<CatalogEntry>> loadOnce(const AssetTypeSettings& settings, bool localOnly,
+                                                  CatalogRefusal& refusal) {
     if (!isSigned(settings) && !settings.allowUnsigned) {
         refusal = {CatalogRefusalKind::UnsignedNotAllowed, "no trusted key is configured for " +
                                                                settings.assetType +
@@ -172,6 +169,20 @@ std::optional<std::vector<CatalogEntry>> loadCatalogEntries(const AssetTypeSetti
     if (!localOnly) {
         recordSerial(settings, metadata->serial, highestAccepted);
         keepLocalCopy(settings, *catalog);
+    }
+    return entries;
+}
+
+}  // namespace
+
+std::optional<std::vector<CatalogEntry>> loadCatalogEntries(const AssetTypeSettings& settings,
+                                                            bool localOnly,
+                                                            CatalogRefusal& refusal) {
+    std::optional<std::vector<CatalogEntry>> entries = loadOnce(settings, localOnly, refusal);
+    // A publisher replaces the signature just before the catalog, so a fetch that falls between
+    // the two sees a pair that does not match; fetching again settles it.
+    if (!entries && !localOnly && refusal.kind() == CatalogRefusalKind::BadSignature) {
+        entries = loadOnce(settings, localOnly, refusal);
     }
     return entries;
 }

@@ -373,6 +373,28 @@ TEST_F(AssetCatalogTest, UntrustworthyCatalogsAreRefusedWithTheirReasonAndKeysRo
     EXPECT_EQ(logLinesContaining(": expired: "), 1u);
 }
 
+// A device that fetches the catalog just before a publication and its signature just after takes
+// the new pair, not a refusal that would keep it waiting for its next check.
+TEST_F(AssetCatalogTest, FetchCaughtBetweenSignatureAndCatalogReplacementTriesAgain) {
+    test::makeBundle(work / "b/Default.bundle", "1.0", {{"a.plist", "one"}});
+    tool({"publish", work / "out", "--key", work / "secret.key", work / "b/Default.bundle"});
+    writeSettings(publicKey);
+    LocalHttpServer::Response held = bodyResponse(readText(out("catalog.plist")));
+    held.holdAfterBodyBytes = held.body.size() - 1;
+    server.serve("/catalog/catalog.plist", held);
+    auto assets = std::async(std::launch::async, [this] { return query(); });
+    ASSERT_TRUE(server.waitForHeldResponse(kPatience));
+    tool({"publish", work / "out", "--key", work / "secret.key", work / "b/Default.bundle",
+          "--version", "2.0"});
+    server.serve("/catalog/catalog.plist", bodyResponse(readText(out("catalog.plist"))));
+    server.releaseHeldResponses();
+    std::optional<Assets> answered = assets.get();
+    ASSERT_TRUE(answered.has_value());
+    ASSERT_EQ(answered->size(), 2u);
+    EXPECT_EQ(answered->back()->attributes(),
+              (plist::Dictionary{{"Version", plist::Value("2.0")}}));
+}
+
 // Development setups may take unsigned catalogs, but only when told so, and say so every time.
 // A staged rollout shows an asset to the devices under its percentage, the same ones each time,
 // and a higher percentage keeps every device a lower one had.

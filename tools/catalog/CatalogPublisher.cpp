@@ -248,7 +248,7 @@ bool writeFile(const std::string& path, const std::string& bytes, mode_t mode) {
 
 // Writes the catalog and, with a key, its detached signature of exactly those bytes. The
 // signature goes first, each file replaced whole: a device that fetches between the two sees a
-// pair that does not verify and tries again at its next check, never an old catalog taken as new.
+// pair that does not verify and fetches again, never an old catalog taken as new.
 Failure writeCatalog(const PublishRequest& request, std::int64_t serial, plist::Array entries) {
     std::string path = (fs::path(request.outputDirectory) / kCatalogFileName).string();
     std::string signaturePath = path + platform::kCatalogSignatureSuffix;
