@@ -127,6 +127,12 @@ bool verifyPublishedCatalog(const VerifyRequest& request) {
     if (!entries) {
         return problem("malformed: " + error);
     }
+    // Devices skip malformed entries; a publisher wants to hear of them.
+    std::size_t listed = catalog->find(platform::kCatalogAssetsKey)->asArray()->size();
+    if (entries->size() != listed) {
+        good = problem(std::to_string(listed - entries->size()) + " of " + std::to_string(listed) +
+                       " entries are malformed and skipped by devices");
+    }
     for (const platform::CatalogEntry& entry : *entries) {
         std::string name = entry.archiveURL.starts_with(kDirectoryBase)
                                ? entry.archiveURL.substr(kDirectoryBase.size())
