@@ -3,7 +3,7 @@
 # activates the freshly built daemon on demand, and walks through the daemon's main job with
 # tavrixctl: a behavior ID set with a packed bundle, the bundle match, the links, the generated
 # overlay file, the notification, a repeated call that changes nothing, and an over-the-air
-# update from a signed catalog served on 127.0.0.1.
+# update from a signed, expiring catalog served on 127.0.0.1.
 # usage: scripts/demo.sh BUILD_DIR
 set -euo pipefail
 build=$(cd "${1:-build}" && pwd)
@@ -97,8 +97,8 @@ mkdir -p "$work/v11"
 cp -a "$top/examples/bundles/Default.bundle" "$work/v11/"
 sed -i 's|<string>10</string>|<string>11</string>|' "$work/v11/Default.bundle/Info.plist"
 run "$catalog_tool" keygen "$work/signing.key" "$work/signing.pub"
-run "$catalog_tool" publish "$work/site" --key "$work/signing.key" "$work/v11/Default.bundle" \
-    --version 11
+run "$catalog_tool" publish "$work/site" --key "$work/signing.key" --key-id demo \
+    --expires-in 30 "$work/v11/Default.bundle" --version 11
 port=$(python3 -c 'import socket; s = socket.socket(); s.bind(("127.0.0.1", 0)); print(s.getsockname()[1])')
 python3 -m http.server --bind 127.0.0.1 --directory "$work/site" "$port" > "$work/http.log" 2>&1 &
 http_server=$!
@@ -107,6 +107,8 @@ for _ in $(seq 100); do
     sleep 0.05
 done
 printf 'serving %s at http://127.0.0.1:%s/\n' "$work/site" "$port"
+# Checked the way the device will check it: signature, expiry, serial, archive digests.
+run "$catalog_tool" verify "http://127.0.0.1:$port/catalog.plist" --key "demo=$work/signing.pub"
 cat > "$root/etc/tavrix/AssetCatalog.plist" <<SETTINGS
 <?xml version="1.0" encoding="UTF-8"?>
 <plist version="1.0">
@@ -117,8 +119,11 @@ cat > "$root/etc/tavrix/AssetCatalog.plist" <<SETTINGS
 		<dict>
 			<key>CatalogURL</key>
 			<string>http://127.0.0.1:$port/catalog.plist</string>
-			<key>PublicKey</key>
-			<string>$(cat "$work/signing.pub")</string>
+			<key>TrustedKeys</key>
+			<dict>
+				<key>demo</key>
+				<string>$(cat "$work/signing.pub")</string>
+			</dict>
 		</dict>
 	</dict>
 </dict>

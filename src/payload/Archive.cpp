@@ -120,6 +120,10 @@ std::unique_ptr<Archive> Archive::initWithMaxUncompressedSize(std::uint32_t size
         filterStatus = libarchive().archive_write_add_filter_bzip2(writer);
     } else if (archiveType == kArchiveTypeGzip) {
         filterStatus = libarchive().archive_write_add_filter_gzip(writer);
+        // The time of writing in the gzip header would make equal archives differ.
+        if (filterStatus == ARCHIVE_OK) {
+            filterStatus = libarchive().archive_write_set_filter_option(writer, "gzip", "timestamp", nullptr);
+        }
     }
     if (filterStatus != ARCHIVE_OK ||
         libarchive().archive_write_set_format_pax_restricted(writer) != ARCHIVE_OK ||
@@ -165,8 +169,12 @@ bool Archive::addFile(const std::string& path, const std::string& asFile) {
     libarchive().archive_entry_set_size(entry.get(), static_cast<la_int64_t>(length));
     libarchive().archive_entry_set_filetype(entry.get(), AE_IFREG);
     libarchive().archive_entry_set_perm(entry.get(), kEntryMode);
-    libarchive().archive_entry_set_mtime(entry.get(), contents->info.st_mtim.tv_sec,
-                                         contents->info.st_mtim.tv_nsec);
+    if (entryModificationTime_) {
+        libarchive().archive_entry_set_mtime(entry.get(), *entryModificationTime_, 0);
+    } else {
+        libarchive().archive_entry_set_mtime(entry.get(), contents->info.st_mtim.tv_sec,
+                                contents->info.st_mtim.tv_nsec);
+    }
     if (libarchive().archive_write_header(archive_.get(), entry.get()) != ARCHIVE_OK) {
         return false;
     }

@@ -46,6 +46,10 @@ class Archive {
     // names. False for any other URL.
     bool addFileURL(const std::string& url);
 
+    // Files added from now on get this modification time instead of their own, so that the same
+    // files always make the same archive.
+    void setEntryModificationTime(std::int64_t seconds) { entryModificationTime_ = seconds; }
+
     // Finishes the archive: archiveData is complete only after this. Files cannot be added after.
     bool close();
     // Replaces the file at path with archiveData atomically.
@@ -78,6 +82,7 @@ class Archive {
     ArchiveWriter archive_;
     std::vector<std::string> files_;
     std::string identifier_;
+    std::optional<std::int64_t> entryModificationTime_;
 };
 
 // Packs every entry of directory (one level, by name) into a gzip'd archive written to

@@ -25,6 +25,7 @@
     X(archive_write_close)                     \
     X(archive_write_add_filter_bzip2)          \
     X(archive_write_add_filter_gzip)           \
+    X(archive_write_set_filter_option)         \
     X(archive_write_set_format_pax_restricted) \
     X(archive_write_set_bytes_per_block)       \
     X(archive_write_set_bytes_in_last_block)   \

@@ -9,10 +9,15 @@
 #include "platform/AssetCatalogService.h"
 #include "platform/AssetDownload.h"
 #include "platform/CatalogLoader.h"
+#include "platform/CatalogRollout.h"
+#include "platform/DeviceInfoService.h"
 #include "util/Log.h"
 
 namespace tavrix::platform {
 namespace {
+
+constexpr const char* kSerialNumberKey = "SerialNumber";
+constexpr const char* kVersionAttribute = "Version";
 
 bool isFinalReport(const plist::Dictionary& progress) {
     auto operation = progress.find(kAssetProgressOperationKey);
@@ -180,23 +185,43 @@ std::optional<std::vector<std::shared_ptr<Asset>>> AssetQuery::runQuery() const 
         lastResult_ = {QueryOutcome::NoCatalogConfigured, "no catalog configured"};
         return assets;
     }
-    std::string whyNot;
+    CatalogRefusal refusal;
     std::optional<std::vector<CatalogEntry>> entries =
-        loadCatalogEntries(*settings, localOnly_, whyNot);
+        loadCatalogEntries(*settings, localOnly_, refusal);
     if (!entries) {
         logCFormat("Asset catalog: refusing the catalog %s: %s", settings->catalogURL.c_str(),
-                   whyNot.c_str());
-        // The loader says why in one line; only a failed transfer begins "cannot fetch", every
-        // other reason is the catalog's own fault.
-        lastResult_ = {
-            whyNot.starts_with("cannot fetch") ? QueryOutcome::FetchFailed : QueryOutcome::Refused,
-            whyNot};
+                   refusal.what().c_str());
+        const bool fetchFailed = refusal.kind() == CatalogRefusalKind::FetchFailed;
+        lastResult_ = {fetchFailed ? QueryOutcome::FetchFailed : QueryOutcome::Refused,
+                       refusal.what()};
         return std::nullopt;
     }
     lastResult_ = {QueryOutcome::Answered, {}};
+    std::string heldBack;
+    std::string serialNumber;
+    bool serialNumberRead = false;
     for (CatalogEntry& entry : *entries) {
+        if (entry.rolloutPercent < 100) {
+            if (!serialNumberRead) {
+                serialNumber = copyDeviceStringAnswer(kSerialNumberKey).value_or(std::string());
+                serialNumberRead = true;
+            }
+            auto version = entry.attributes.find(kVersionAttribute);
+            std::string versionText =
+                version != entry.attributes.end() && version->second.asString() != nullptr
+                    ? *version->second.asString()
+                    : std::string();
+            if (!takesPartInRollout(serialNumber, versionText, entry.rolloutPercent)) {
+                heldBack += (heldBack.empty() ? "" : ", ") + versionText + " (" +
+                            std::to_string(entry.rolloutPercent) + "%)";
+                continue;
+            }
+        }
         assets.push_back(
             std::make_shared<Asset>(std::move(entry), settings->cacheDirectory, settings->limits));
+    }
+    if (!heldBack.empty()) {
+        logCFormat("Asset catalog: this device is outside the rollout of %s", heldBack.c_str());
     }
     return assets;
 }

@@ -111,7 +111,9 @@ class AssetQuery {
     void setQueriesLocalInformationOnly(bool localOnly) { localOnly_ = localOnly; }
 
     // Runs the query on the calling thread (it blocks while the catalog is fetched). The assets in
-    // the catalog's order, or nothing when the catalog cannot be fetched or is refused (logged).
+    // the catalog's order, less those whose staged rollout leaves this device out (one log line
+    // for them all), or nothing when the catalog cannot be fetched or is refused (one log line
+    // with the refusal's reason).
     std::optional<std::vector<std::shared_ptr<Asset>>> runQuery() const;
     // The outcome of the last runQuery().
     const QueryResult& lastResult() const { return lastResult_; }

@@ -51,6 +51,15 @@ std::optional<CatalogEntry> readEntry(const plist::Value& value, const std::stri
         return std::nullopt;
     }
     entry.archiveSHA256 = *digest->asString();
+    if (const plist::Value* rollout = value.find(kCatalogRolloutPercentKey)) {
+        const plist::Integer* percent = rollout->asInteger();
+        if (percent == nullptr || percent->isLargeUnsigned() || percent->signedValue() < 0 ||
+            percent->signedValue() > 100) {
+            whyNot = "RolloutPercent is not an integer from 0 to 100";
+            return std::nullopt;
+        }
+        entry.rolloutPercent = static_cast<int>(percent->signedValue());
+    }
     std::transform(entry.archiveSHA256.begin(), entry.archiveSHA256.end(),
                    entry.archiveSHA256.begin(),
                    [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
@@ -59,10 +68,7 @@ std::optional<CatalogEntry> readEntry(const plist::Value& value, const std::stri
 
 }  // namespace
 
-std::optional<std::vector<CatalogEntry>> readCatalogEntries(std::string_view bytes,
-                                                            const std::string& catalogURL,
-                                                            std::string_view assetType,
-                                                            std::string& whyNot) {
+std::optional<plist::Value> parseCatalog(std::string_view bytes, std::string& whyNot) {
     plist::Refusal refusal;
     std::optional<plist::Value> catalog = plist::parse(bytes, &refusal);
     if (!catalog) {
@@ -73,13 +79,20 @@ std::optional<std::vector<CatalogEntry>> readCatalogEntries(std::string_view byt
         whyNot = "it is not a property-list dictionary";
         return std::nullopt;
     }
-    const plist::Value* listedType = catalog->find(kCatalogAssetTypeKey);
+    return catalog;
+}
+
+std::optional<std::vector<CatalogEntry>> readCatalogEntries(const plist::Value& catalog,
+                                                            const std::string& catalogURL,
+                                                            std::string_view assetType,
+                                                            std::string& whyNot) {
+    const plist::Value* listedType = catalog.find(kCatalogAssetTypeKey);
     if (listedType == nullptr || listedType->asString() == nullptr ||
         *listedType->asString() != assetType) {
         whyNot = "its AssetType is not " + std::string(assetType);
         return std::nullopt;
     }
-    const plist::Value* assets = catalog->find(kCatalogAssetsKey);
+    const plist::Value* assets = catalog.find(kCatalogAssetsKey);
     if (assets == nullptr || assets->asArray() == nullptr) {
         whyNot = "it has no Assets array";
         return std::nullopt;

@@ -2,12 +2,16 @@
 // publishing tool. A catalog is a property list:
 //
 //   AssetType          string, the asset type it lists (a catalog of another type is refused)
+//   Serial             integer from 1, higher with every publication: devices refuse to go back
+//   Expires            date after which devices refuse the catalog, so a frozen view shows
+//   KeyID              string, the identifier of the key that signed it
 //   Assets             array of dictionaries:
 //       Attributes     dictionary, handed to callers as it is
 //       ArchiveURL     string, the gzip-compressed tar of the asset, relative to the catalog's URL
 //                      or absolute (http or https)
 //       ArchiveSize    integer, the archive's length in bytes
 //       ArchiveSHA256  string, the archive's SHA-256 in hex
+//       RolloutPercent optional integer 0-100: the share of devices that see the asset (all)
 //
 // Its detached Ed25519 signature (64 raw bytes) is served at the catalog's URL + ".sig".
 #pragma once
@@ -29,6 +33,10 @@ inline constexpr const char* kCatalogAttributesKey = "Attributes";
 inline constexpr const char* kCatalogArchiveURLKey = "ArchiveURL";
 inline constexpr const char* kCatalogArchiveSizeKey = "ArchiveSize";
 inline constexpr const char* kCatalogArchiveSHA256Key = "ArchiveSHA256";
+inline constexpr const char* kCatalogSerialKey = "Serial";
+inline constexpr const char* kCatalogExpiresKey = "Expires";
+inline constexpr const char* kCatalogKeyIDKey = "KeyID";
+inline constexpr const char* kCatalogRolloutPercentKey = "RolloutPercent";
 inline constexpr const char* kCatalogSignatureSuffix = ".sig";
 
 // Bounds on what a server may make the daemon hold or store.
@@ -41,12 +49,15 @@ struct CatalogEntry {
     std::string archiveURL;
     std::uint64_t archiveSize = 0;
     std::string archiveSHA256;
+    int rolloutPercent = 100;
 };
 
-// The entries of a catalog's bytes. A catalog that is not a property list, lists another asset
-// type or has no Assets array is refused: nothing, with whyNot saying why. Malformed entries are
-// skipped, each with a log line.
-std::optional<std::vector<CatalogEntry>> readCatalogEntries(std::string_view bytes,
+// The catalog's bytes as a property-list dictionary, or nothing with whyNot saying why.
+std::optional<plist::Value> parseCatalog(std::string_view bytes, std::string& whyNot);
+
+// The entries of a parsed catalog. A catalog that lists another asset type or has no Assets array
+// is refused: nothing, with whyNot saying why. Malformed entries are skipped, each with a log line.
+std::optional<std::vector<CatalogEntry>> readCatalogEntries(const plist::Value& catalog,
                                                             const std::string& catalogURL,
                                                             std::string_view assetType,
                                                             std::string& whyNot);

@@ -29,6 +29,37 @@ std::optional<CatalogPublicKey> decodePublicKey(const plist::Value& value) {
     return key;
 }
 
+// A key that cannot be read refuses the whole type rather than quietly trusting fewer keys.
+bool readTrustedKeys(const plist::Value& type, std::vector<TrustedCatalogKey>& keys,
+                     std::string& whyNot) {
+    if (const plist::Value* single = type.find(kSettingsPublicKeyKey)) {
+        std::optional<CatalogPublicKey> key = decodePublicKey(*single);
+        if (!key) {
+            whyNot = "PublicKey is not 32 bytes of data or their base64";
+            return false;
+        }
+        keys.push_back({defaultKeyIdentifier(*key), *key});
+    }
+    const plist::Value* listed = type.find(kSettingsTrustedKeysKey);
+    if (listed == nullptr) {
+        return true;
+    }
+    if (!listed->isDictionary()) {
+        whyNot = "TrustedKeys is not a dictionary";
+        return false;
+    }
+    for (const auto& [identifier, value] : *listed->asDictionary()) {
+        std::optional<CatalogPublicKey> key = decodePublicKey(value);
+        if (identifier.empty() || !key) {
+            whyNot =
+                "TrustedKeys entry \"" + identifier + "\" is not 32 bytes of data or their base64";
+            return false;
+        }
+        keys.push_back({identifier, *key});
+    }
+    return true;
+}
+
 // Sets target from the integer under key, when present. False, with whyNot, when it is no integer
 // between minimum and maximum.
 template <typename Number>
@@ -120,12 +151,15 @@ std::optional<AssetTypeSettings> parseAssetTypeSettings(const plist::Value& sett
     }
     result.assetType = std::string(assetType);
     result.catalogURL = *url->asString();
-    if (const plist::Value* key = type->find(kSettingsPublicKeyKey)) {
-        result.publicKey = decodePublicKey(*key);
-        if (!result.publicKey) {
-            whyNot = "PublicKey is not 32 bytes of data or their base64";
+    if (!readTrustedKeys(*type, result.trustedKeys, whyNot)) {
+        return std::nullopt;
+    }
+    if (const plist::Value* allow = type->find(kSettingsAllowUnsignedKey)) {
+        if (allow->asBoolean() == nullptr) {
+            whyNot = "AllowUnsigned is not a boolean";
             return std::nullopt;
         }
+        result.allowUnsigned = *allow->asBoolean();
     }
     result.cacheDirectory = resolvePath(cacheDirectory) + "/" + result.assetType;
     return result;

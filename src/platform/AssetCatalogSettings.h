@@ -1,11 +1,16 @@
-// The asset catalog's settings: which catalog serves each asset type, the key its catalogs are
+// The asset catalog's settings: which catalog serves each asset type, the keys its catalogs may be
 // signed with, and where downloaded assets are kept. Read from
 // <root>/etc/tavrix/AssetCatalog.plist:
 //
 //   CacheDirectory   string, absolute path under the root (default /var/cache/tavrixservicesd)
 //   AssetTypes       dictionary: asset type -> dictionary of
-//       CatalogURL   string, http or https URL of the catalog property list
-//       PublicKey    optional Ed25519 public key: data of 32 bytes, or a string of their base64
+//       CatalogURL     string, http or https URL of the catalog property list
+//       TrustedKeys    dictionary: key identifier -> Ed25519 public key (data of 32 bytes, or a
+//                      string of their base64). Several keys let a publisher rotate: sign with
+//                      the new one once devices trust it, then remove the old one here.
+//       PublicKey      the older form of a single trusted key, named by defaultKeyIdentifier
+//       AllowUnsigned  boolean, for development only: without any trusted key, take catalogs
+//                      unsigned instead of refusing them
 //   and optional integers bounding what catalogs and archives may cost (AssetLimits below).
 #pragma once
 
@@ -13,8 +18,9 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
-#include "platform/CatalogCrypto.h"
+#include "platform/CatalogTrust.h"
 #include "platform/HttpTransfer.h"
 #include "plist/Value.h"
 
@@ -27,6 +33,8 @@ inline constexpr const char* kSettingsCacheDirectoryKey = "CacheDirectory";
 inline constexpr const char* kSettingsAssetTypesKey = "AssetTypes";
 inline constexpr const char* kSettingsCatalogURLKey = "CatalogURL";
 inline constexpr const char* kSettingsPublicKeyKey = "PublicKey";
+inline constexpr const char* kSettingsTrustedKeysKey = "TrustedKeys";
+inline constexpr const char* kSettingsAllowUnsignedKey = "AllowUnsigned";
 
 inline constexpr const char* kSettingsMaxExpandedBytesKey = "MaxExpandedBytes";
 inline constexpr const char* kSettingsMaxArchiveEntriesKey = "MaxArchiveEntries";
@@ -60,8 +68,10 @@ struct AssetLimits {
 struct AssetTypeSettings {
     std::string assetType;
     std::string catalogURL;
-    // Without a key, catalogs are taken unsigned (archives are still checked against them).
-    std::optional<CatalogPublicKey> publicKey;
+    // A catalog must verify with one of these; with none, every catalog is refused unless
+    // allowUnsigned (archives are still checked against an unsigned catalog).
+    std::vector<TrustedCatalogKey> trustedKeys;
+    bool allowUnsigned = false;
     // This type's own directory in the cache, resolved under the platform root.
     std::string cacheDirectory;
     AssetLimits limits;

@@ -6,6 +6,8 @@
 
 #include "payload/FileSystemUtilities.h"
 #include "platform/AtomicFile.h"
+#include "platform/CatalogTrust.h"
+#include "platform/Clock.h"
 #include "platform/HttpTransfer.h"
 #include "plist/PropertyListFormat.h"
 #include "util/Log.h"
@@ -14,6 +16,8 @@ namespace tavrix::platform {
 namespace {
 
 constexpr const char* kLocalCopyName = "/catalog.plist";
+// Generous: a wrong length is then refused as a bad signature, not as a failed fetch.
+constexpr std::size_t kMaxSignatureBytes = 4096;
 
 struct SignedCatalog {
     std::string bytes;
@@ -21,15 +25,8 @@ struct SignedCatalog {
     std::string signature;
 };
 
-bool verify(const AssetTypeSettings& settings, const SignedCatalog& catalog, std::string& whyNot) {
-    if (!settings.publicKey) {
-        return true;
-    }
-    if (!verifyCatalogSignature(catalog.bytes, catalog.signature, *settings.publicKey)) {
-        whyNot = "its signature does not verify with the configured key";
-        return false;
-    }
-    return true;
+bool isSigned(const AssetTypeSettings& settings) {
+    return !settings.trustedKeys.empty();
 }
 
 // The catalog and its signature share one time budget: the whole fetch is what a waiting update
@@ -49,7 +46,7 @@ class FetchDeadline {
 };
 
 std::optional<SignedCatalog> fetchFromServer(const AssetTypeSettings& settings,
-                                             std::string& whyNot) {
+                                             CatalogRefusal& refusal) {
     std::string error;
     SignedCatalog catalog;
     const AssetLimits& limits = settings.limits;
@@ -58,17 +55,18 @@ std::optional<SignedCatalog> fetchFromServer(const AssetTypeSettings& settings,
         fetchHttpBody(settings.catalogURL, kMaxCatalogBytes,
                       limits.catalogTransfer(deadline.remainingMilliseconds()), error);
     if (!bytes) {
-        whyNot = "cannot fetch it: " + error;
+        refusal = {CatalogRefusalKind::FetchFailed, "cannot fetch it: " + error};
         return std::nullopt;
     }
     catalog.bytes = std::move(*bytes);
-    if (settings.publicKey) {
+    if (isSigned(settings)) {
         std::string signatureURL = settings.catalogURL + kCatalogSignatureSuffix;
         std::optional<std::string> signature =
-            fetchHttpBody(signatureURL, kCatalogSignatureBytes,
+            fetchHttpBody(signatureURL, kMaxSignatureBytes,
                           limits.catalogTransfer(deadline.remainingMilliseconds()), error);
         if (!signature) {
-            whyNot = "cannot fetch its signature " + signatureURL + ": " + error;
+            refusal = {CatalogRefusalKind::MissingSignature,
+                       "cannot fetch its signature " + signatureURL + ": " + error};
             return std::nullopt;
         }
         catalog.signature = std::move(*signature);
@@ -81,13 +79,13 @@ void keepLocalCopy(const AssetTypeSettings& settings, const SignedCatalog& catal
     std::string path = settings.cacheDirectory + kLocalCopyName;
     std::string signaturePath = path + kCatalogSignatureSuffix;
     int error = payload::createDirectoryAt(settings.cacheDirectory, 0755, true);
+    if (error == 0 && isSigned(settings)) {
+        error = replaceFileAtomically(signaturePath, catalog.signature, 0644);
+    }
     if (error == 0) {
         error = replaceFileAtomically(path, catalog.bytes, 0644);
     }
-    if (error == 0 && settings.publicKey) {
-        error = replaceFileAtomically(signaturePath, catalog.signature, 0644);
-    }
-    if (error == 0 && !settings.publicKey) {
+    if (error == 0 && !isSigned(settings)) {
         payload::removeItemTree(signaturePath);  // a stale signature would only mislead
     }
     if (error != 0) {
@@ -96,10 +94,28 @@ void keepLocalCopy(const AssetTypeSettings& settings, const SignedCatalog& catal
     }
 }
 
-}  // namespace
+// Records the serial of a catalog taken from the server. Failing to costs only the rollback
+// protection of that one step, so the catalog is still used.
+void recordSerial(const AssetTypeSettings& settings, std::int64_t serial,
+                  std::optional<std::int64_t> highestAccepted) {
+    if (highestAccepted && serial <= *highestAccepted) {
+        return;
+    }
+    if (int error = recordAcceptedSerial(settings.assetType, serial); error != 0) {
+        logCFormat("Asset catalog: cannot record serial %lld of %s: %s",
+                   static_cast<long long>(serial), settings.assetType.c_str(),
+                   std::strerror(error));
+    }
+}
 
-std::optional<std::vector<CatalogEntry>> loadCatalogEntries(const AssetTypeSettings& settings,
-                                                            bool localOnly, std::string& whyNot) {
+std::optional<std::vector<CatalogEntry>> loadOnce(const AssetTypeSettings& settings, bool localOnly,
+                                                  CatalogRefusal& refusal) {
+    if (!isSigned(settings) && !settings.allowUnsigned) {
+        refusal = {CatalogRefusalKind::UnsignedNotAllowed, "no trusted key is configured for " +
+                                                               settings.assetType +
+                                                               " and AllowUnsigned is not set"};
+        return std::nullopt;
+    }
     std::optional<SignedCatalog> catalog;
     if (localOnly) {
         std::string path = settings.cacheDirectory + kLocalCopyName;
@@ -108,23 +124,65 @@ std::optional<std::vector<CatalogEntry>> loadCatalogEntries(const AssetTypeSetti
             return std::vector<CatalogEntry>();
         }
         catalog = SignedCatalog{std::move(*bytes), {}};
-        if (settings.publicKey) {
+        if (isSigned(settings)) {
             catalog->signature =
                 plist::readFileBytes(path + kCatalogSignatureSuffix).value_or(std::string());
         }
     } else {
-        catalog = fetchFromServer(settings, whyNot);
+        catalog = fetchFromServer(settings, refusal);
         if (!catalog) {
             return std::nullopt;
         }
     }
-    if (!verify(settings, *catalog, whyNot)) {
+    std::string whyNot;
+    std::optional<plist::Value> parsed = parseCatalog(catalog->bytes, whyNot);
+    if (!parsed) {
+        refusal = {CatalogRefusalKind::Malformed, whyNot};
+        return std::nullopt;
+    }
+    if (isSigned(settings)) {
+        if (!verifyWithTrustedKey(catalog->bytes, catalog->signature, catalogKeyID(*parsed),
+                                  settings.trustedKeys, refusal)) {
+            return std::nullopt;
+        }
+    } else {
+        logCFormat(
+            "Asset catalog: taking the catalog %s unverified: AllowUnsigned is set, which "
+            "is for development only",
+            settings.catalogURL.c_str());
+    }
+    std::optional<CatalogMetadata> metadata = readCatalogMetadata(*parsed, refusal);
+    if (!metadata) {
+        return std::nullopt;
+    }
+    std::optional<std::int64_t> highestAccepted = readAcceptedSerial(settings.assetType);
+    if (!checkFreshness(*metadata, plist::Date{Clock::absoluteTimeNow()}, highestAccepted,
+                        refusal)) {
         return std::nullopt;
     }
     std::optional<std::vector<CatalogEntry>> entries =
-        readCatalogEntries(catalog->bytes, settings.catalogURL, settings.assetType, whyNot);
-    if (entries && !localOnly) {
+        readCatalogEntries(*parsed, settings.catalogURL, settings.assetType, whyNot);
+    if (!entries) {
+        refusal = {CatalogRefusalKind::Malformed, whyNot};
+        return std::nullopt;
+    }
+    if (!localOnly) {
+        recordSerial(settings, metadata->serial, highestAccepted);
         keepLocalCopy(settings, *catalog);
+    }
+    return entries;
+}
+
+}  // namespace
+
+std::optional<std::vector<CatalogEntry>> loadCatalogEntries(const AssetTypeSettings& settings,
+                                                            bool localOnly,
+                                                            CatalogRefusal& refusal) {
+    std::optional<std::vector<CatalogEntry>> entries = loadOnce(settings, localOnly, refusal);
+    // A publisher replaces the signature just before the catalog, so a fetch that falls between
+    // the two sees a pair that does not match; fetching again settles it.
+    if (!entries && !localOnly && refusal.kind() == CatalogRefusalKind::BadSignature) {
+        entries = loadOnce(settings, localOnly, refusal);
     }
     return entries;
 }

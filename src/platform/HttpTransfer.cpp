@@ -8,7 +8,6 @@ namespace tavrix::platform {
 namespace {
 
 constexpr long kMaxRedirects = 5;
-constexpr const char* kAllowedProtocols = "http,https";
 
 struct TransferState {
     const HttpBodyReceiver* receiver = nullptr;
@@ -47,10 +46,13 @@ bool transferHttpBody(const std::string& url, const HttpBodyReceiver& receiver,
     CURL* curl = handle.get();
     TransferState state{&receiver, {}, false};
     char errorText[CURL_ERROR_SIZE] = {};
+    // A redirect keeps the URL's own scheme: never https to http, never anywhere else.
+    const char* scheme =
+        url.size() >= 6 && strncasecmp(url.c_str(), "https:", 6) == 0 ? "https" : "http";
     bool configured =
         libcurl->easy_setopt(curl, CURLOPT_URL, url.c_str()) == CURLE_OK &&
-        libcurl->easy_setopt(curl, CURLOPT_PROTOCOLS_STR, kAllowedProtocols) == CURLE_OK &&
-        libcurl->easy_setopt(curl, CURLOPT_REDIR_PROTOCOLS_STR, kAllowedProtocols) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_PROTOCOLS_STR, scheme) == CURLE_OK &&
+        libcurl->easy_setopt(curl, CURLOPT_REDIR_PROTOCOLS_STR, scheme) == CURLE_OK &&
         libcurl->easy_setopt(curl, CURLOPT_FOLLOWLOCATION, 1L) == CURLE_OK &&
         libcurl->easy_setopt(curl, CURLOPT_MAXREDIRS, kMaxRedirects) == CURLE_OK &&
         libcurl->easy_setopt(curl, CURLOPT_FAILONERROR, 1L) == CURLE_OK &&

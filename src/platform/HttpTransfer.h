@@ -1,6 +1,6 @@
 // Plain HTTP(S) GET transfers for the asset catalog: a whole body into memory, or a body streamed
-// to a receiver. Only http and https are followed, including on redirects; a server's error status
-// is a failure.
+// to a receiver. Only http and https are fetched, and a redirect keeps the scheme of the URL it
+// starts from; a server's error status is a failure.
 #pragma once
 
 #include <cstddef>

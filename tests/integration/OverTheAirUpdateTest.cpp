@@ -14,6 +14,7 @@
 #include <cstring>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <future>
 #include <iostream>
 #include <map>
@@ -150,23 +151,44 @@ class OverTheAirUpdateTest : public BusFixture {
         CommandResult keys = runCommand(
             {TAVRIX_CATALOG_TOOL, "keygen", secretKey().string(), (keys_ / "public").string()});
         ASSERT_EQ(keys.status, 0) << keys.output;
-        std::string publicKey = readFile(keys_ / "public");
-        while (!publicKey.empty() && publicKey.back() == '\n') {
-            publicKey.pop_back();
-        }
         server.serveDirectory("/updates/", site());
+        writeCatalogSettings(true);
+        // A check already armed a few days ahead, so that every re-arm shows.
+        device().writeDaemonPreferences(
+            {{"EnableSupport", true}, {"NextUpdate", plist::Date{now() + 3 * kOneDay}}});
+    }
+
+    // The device trusts the publisher's key (in the single-key form), or no key at all.
+    void writeCatalogSettings(bool trusted) {
+        plist::Dictionary type{{"CatalogURL", server.url("/updates/catalog.plist")}};
+        if (trusted) {
+            std::string publicKey = readFile(keys_ / "public");
+            publicKey.pop_back();  // the line break
+            type.emplace("PublicKey", publicKey);
+        }
         ASSERT_TRUE(plist::writeFile(
             at("/etc/tavrix/AssetCatalog.plist").string(),
             plist::Value(plist::Dictionary{
                 {"AssetTypes",
-                 plist::Dictionary{{"com.zandor.Grellas.TavrixBundles",
-                                    plist::Dictionary{
-                                        {"CatalogURL", server.url("/updates/catalog.plist")},
-                                        {"PublicKey", publicKey},
-                                    }}}}})));
-        // A check already armed a few days ahead, so that every re-arm shows.
-        device().writeDaemonPreferences(
-            {{"EnableSupport", true}, {"NextUpdate", plist::Date{now() + 3 * kOneDay}}});
+                 plist::Dictionary{{"com.zandor.Grellas.TavrixBundles", std::move(type)}}}})));
+    }
+
+    // Edits the published catalog and signs it again with the publisher's key, as a publisher
+    // with the key could.
+    void editAndResign(const std::function<void(plist::Dictionary&)>& edit) {
+        auto catalog = plist::readFile((site() / "catalog.plist").string());
+        ASSERT_TRUE(catalog && catalog->isDictionary());
+        edit(*catalog->asDictionary());
+        ASSERT_TRUE(plist::writeFile((site() / "catalog.plist").string(), *catalog));
+        const std::string bytes = readFile(site() / "catalog.plist");
+        const std::string secret = readFile(secretKey());
+        ASSERT_EQ(secret.size(), crypto_sign_SECRETKEYBYTES);
+        std::string signature(crypto_sign_BYTES, '\0');
+        ASSERT_GE(sodium_init(), 0);
+        crypto_sign_detached(reinterpret_cast<unsigned char*>(signature.data()), nullptr,
+                             reinterpret_cast<const unsigned char*>(bytes.data()), bytes.size(),
+                             reinterpret_cast<const unsigned char*>(secret.data()));
+        writeFile(site() / "catalog.plist.sig", signature);
     }
 
     static double now() { return platform::Clock::absoluteTimeNow(); }
@@ -208,10 +230,17 @@ class OverTheAirUpdateTest : public BusFixture {
 
     // Publishes the bundle of this version, signed, as the only asset of the catalog; answers
     // the archive's URL path.
-    std::string publish(const std::string& version, std::size_t bulkBytes = 0) {
-        CommandResult run =
-            runCommand({TAVRIX_CATALOG_TOOL, "publish", site().string(), "--key",
-                        secretKey().string(), "--fresh", writeBundle(version, bulkBytes).string()});
+    std::string publish(const std::string& version, std::size_t bulkBytes = 0,
+                        const std::vector<std::string>& options = {}) {
+        std::vector<std::string> command{TAVRIX_CATALOG_TOOL,
+                                         "publish",
+                                         site().string(),
+                                         "--key",
+                                         secretKey().string(),
+                                         "--fresh",
+                                         writeBundle(version, bulkBytes).string()};
+        command.insert(command.end(), options.begin(), options.end());
+        CommandResult run = runCommand(command);
         EXPECT_EQ(run.status, 0) << run.output;
         return "/updates/archives/Default-" + version + ".tgz";
     }
@@ -467,7 +496,8 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
 
 // Each way an update can go wrong leaves the linked bundle and its files as they were, posts
 // nothing and leaves no download behind; a download that started and failed re-arms the check a
-// day ahead, a refused catalog starts nothing. A good update afterwards still installs.
+// day ahead, a refused catalog (expired, replayed, unsigned) or an asset held back by its rollout
+// starts nothing. A good update afterwards still installs.
 TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheDaemonKeepsServing) {
     setIDWithBundle("1");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
@@ -490,35 +520,36 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheDaemonKeepsServing)
              writeFile(archive, bytes);
          },
          true, "the archive's SHA-256 is"},
-        {"wrong digest in a validly signed catalog",
+        {"expired catalog",
          [&] {
              publish("2");
-             auto catalog = plist::readFile((site() / "catalog.plist").string());
-             ASSERT_TRUE(catalog);
-             plist::Value& entry = catalog->asDictionary()->at("Assets").asArray()->at(0);
-             entry.asDictionary()->insert_or_assign("ArchiveSHA256", std::string(64, 'a'));
-             ASSERT_TRUE(plist::writeFile((site() / "catalog.plist").string(), *catalog));
-             // Signed again with the publisher's key, so only the digest is wrong.
-             const std::string bytes = readFile(site() / "catalog.plist");
-             const std::string secret = readFile(secretKey());
-             ASSERT_EQ(secret.size(), crypto_sign_SECRETKEYBYTES);
-             std::string signature(crypto_sign_BYTES, '\0');
-             ASSERT_GE(sodium_init(), 0);
-             crypto_sign_detached(reinterpret_cast<unsigned char*>(signature.data()), nullptr,
-                                  reinterpret_cast<const unsigned char*>(bytes.data()),
-                                  bytes.size(),
-                                  reinterpret_cast<const unsigned char*>(secret.data()));
-             writeFile(site() / "catalog.plist.sig", signature);
+             editAndResign([](plist::Dictionary& catalog) {
+                 catalog.insert_or_assign("Expires", plist::Date{now() - 60});
+             });
          },
-         true, "the archive's SHA-256 is"},
-        {"catalog signature that does not verify",
+         false, ": expired: "},
+        {"older catalog replayed",
          [&] {
              publish("2");
-             std::string signature = readFile(site() / "catalog.plist.sig");
-             signature[0] = static_cast<char>(signature[0] ^ 1);
-             writeFile(site() / "catalog.plist.sig", signature);
+             const std::string older = readFile(site() / "catalog.plist");
+             const std::string olderSignature = readFile(site() / "catalog.plist.sig");
+             publish("1");
+             EXPECT_FALSE(client().checkForTavrixBundleUpdate()) << "a newer catalog, seen";
+             writeFile(site() / "catalog.plist", older);
+             writeFile(site() / "catalog.plist.sig", olderSignature);
          },
-         false, "its signature does not verify with the configured key"},
+         false, ": rollback: "},
+        {"no trusted key",
+         [&] {
+             publish("2");
+             writeCatalogSettings(false);
+         },
+         false, ": unsigned not allowed: "},
+        {"outside a rollout at 0%",
+         [&] {
+             publish("2", 0, {"--rollout", "0"});
+         },
+         false, "outside the rollout of 2 (0%)"},
         {"connection cut in the middle of the archive",
          [&] {
              std::string path = publish("2");
@@ -536,6 +567,7 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheDaemonKeepsServing)
         // Whole seconds: that is what a stored date keeps.
         const double armed = std::floor(now() + 3 * kOneDay);
         setNextUpdate(armed);
+        writeCatalogSettings(true);
         c.arrange();
         const int refusals = countLogLinesContaining(c.logged);
         EXPECT_EQ(client().checkForTavrixBundleUpdate(), c.started);
@@ -555,7 +587,8 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheDaemonKeepsServing)
         EXPECT_TRUE(client().isTavrixBundleSupported());
     }
 
-    publish("3");
+    writeCatalogSettings(true);
+    publish("3", 0, {"--rollout", "100"});
     EXPECT_TRUE(client().checkForTavrixBundleUpdate());
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 2, 30s));
     expectInstalled("3");

@@ -2,11 +2,13 @@
 // tool produced.
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <chrono>
 #include <condition_variable>
 #include <filesystem>
 #include <functional>
 #include <future>
+#include <map>
 #include <mutex>
 #include <random>
 #include <thread>
@@ -19,6 +21,7 @@
 #include "platform/AssetCatalog.h"
 #include "platform/AssetCatalogSettings.h"
 #include "platform/CatalogCrypto.h"
+#include "platform/Clock.h"
 #include "platform/PlatformRoot.h"
 #include "platform/SystemLog.h"
 #include "plist/PropertyListFormat.h"
@@ -109,7 +112,9 @@ class AssetCatalogTest : public testing::Test {
         std::error_code ignored;
         fs::remove_all(resolvePath("/etc/tavrix"), ignored);
         fs::remove_all(resolvePath("/var/cache"), ignored);
+        fs::remove_all(resolvePath(std::string(kDaemonStateDirectory)), ignored);
         ASSERT_EQ(tool({"keygen", work / "secret.key", work / "public.key"}), 0);
+        ASSERT_EQ(tool({"keygen", work / "new.key", work / "new.pub"}), 0);
         publicKey = readText(work / "public.key");
         publicKey.pop_back();  // the line break
         server.serveDirectory("/catalog/", work.path() / "out");
@@ -121,12 +126,16 @@ class AssetCatalogTest : public testing::Test {
         return run.status;
     }
 
+    // The type trusts key in the single-key form, or without a key takes catalogs unsigned;
     // extra: top-level settings such as limits.
     void writeSettings(const std::optional<std::string>& key, plist::Dictionary extra = {}) {
-        plist::Dictionary type{{kSettingsCatalogURLKey, plist::Value(catalogURL())}};
-        if (key) {
-            type.emplace(kSettingsPublicKeyKey, plist::Value(*key));
-        }
+        writeTypeSettings(key ? plist::Dictionary{{kSettingsPublicKeyKey, plist::Value(*key)}}
+                              : plist::Dictionary{{kSettingsAllowUnsignedKey, plist::Value(true)}},
+                          std::move(extra));
+    }
+
+    void writeTypeSettings(plist::Dictionary type, plist::Dictionary extra = {}) {
+        type.emplace(kSettingsCatalogURLKey, plist::Value(catalogURL()));
         extra.insert_or_assign(kSettingsAssetTypesKey,
                                plist::Value(plist::Dictionary{{kAssetType, type}}));
         writeSettingsValue(plist::Value(std::move(extra)));
@@ -145,6 +154,8 @@ class AssetCatalogTest : public testing::Test {
         server.serve("/catalog/catalog.plist",
                      bodyResponse(plist::serialize(plist::Value(plist::Dictionary{
                          {"AssetType", plist::Value(kAssetType)},
+                         {"Serial", plist::Value(1)},
+                         {"Expires", plist::Value(plist::Date{Clock::absoluteTimeNow() + 3600})},
                          {"Assets", plist::Value(plist::Array{plist::Value(entry)})}}))));
     }
 
@@ -212,40 +223,6 @@ class AssetCatalogTest : public testing::Test {
     ScopedLogSink guard{sink};
 };
 
-TEST_F(AssetCatalogTest, QueryAnswersPublishedAssetsInOrderAndKeepsThemForLocalQueries) {
-    test::makeBundle(work / "one/Default.bundle", "1.0", {{"a.plist", "<plist/>"}});
-    test::makeBundle(work / "two/Default.bundle", "2.0", {{"a.plist", "two"}});
-    tool({"publish", work / "out", "--key", work / "secret.key", work / "one/Default.bundle",
-          "--product-type", "Handset9,1", "--product-type", "Tablet7,1", "--min-os", "7.0",
-          "--max-os", "9.3", work / "two/Default.bundle"});
-    writeSettings(publicKey);
-
-    std::optional<Assets> local = query(true);
-    ASSERT_TRUE(local.has_value());
-    EXPECT_TRUE(local->empty()) << "nothing is known locally before the first fetch";
-
-    std::optional<Assets> assets = query();
-    ASSERT_TRUE(assets.has_value());
-    ASSERT_EQ(assets->size(), 2u);
-    plist::Dictionary first{
-        {"Version", plist::Value("1.0")},
-        {"SupportedProductTypes",
-         plist::Value(plist::Array{plist::Value("Handset9,1"), plist::Value("Tablet7,1")})},
-        {"MinimumOSVersion", plist::Value("7.0")},
-        {"MaximumOSVersion", plist::Value("9.3")}};
-    EXPECT_EQ(assets->at(0)->attributes(), first);
-    EXPECT_EQ(assets->at(1)->attributes(), (plist::Dictionary{{"Version", plist::Value("2.0")}}));
-    EXPECT_FALSE(assets->at(0)->localURL().has_value());
-
-    // The local answer comes from the kept copy: the server is not asked again.
-    std::size_t requestsBefore = server.requests().size();
-    local = query(true);
-    ASSERT_TRUE(local.has_value());
-    ASSERT_EQ(local->size(), 2u);
-    EXPECT_EQ(local->at(0)->attributes(), first);
-    EXPECT_EQ(server.requests().size(), requestsBefore);
-}
-
 TEST_F(AssetCatalogTest, WithoutUsableSettingsQueriesAnswerNoAssetsAndSayWhyOnce) {
     struct Case {
         const char* name;
@@ -285,6 +262,14 @@ TEST_F(AssetCatalogTest, WithoutUsableSettingsQueriesAnswerNoAssetsAndSayWhyOnce
         {"short key",
          [this] { writeSettings(base64Encode(reinterpret_cast<const std::uint8_t*>("short"), 5)); },
          "PublicKey is not 32 bytes"},
+        {"short key among trusted keys",
+         [this] {
+             writeTypeSettings(
+                 {{kSettingsTrustedKeysKey,
+                   plist::Value(plist::Dictionary{{"good", plist::Value(publicKey)},
+                                                  {"bad", plist::Value("c2hvcnQ=")}})}});
+         },
+         "TrustedKeys entry \"bad\""},
     };
     for (const Case& c : cases) {
         SCOPED_TRACE(c.name);
@@ -300,44 +285,154 @@ TEST_F(AssetCatalogTest, WithoutUsableSettingsQueriesAnswerNoAssetsAndSayWhyOnce
     EXPECT_TRUE(server.requests().empty());
 }
 
-TEST_F(AssetCatalogTest, CatalogsThatFailVerificationAreRefusedAndTheKeptCopySurvives) {
-    test::makeBundle(work / "b/Default.bundle", "1.0", {{"a.plist", "one"}});
-    tool({"publish", work / "out", "--key", work / "secret.key", work / "b/Default.bundle"});
-    writeSettings(publicKey);
+// Every way a catalog can be untrustworthy is refused with its own reason in one line, and a
+// refused catalog never replaces the copy kept for local queries from the last good one. Keys
+// rotate: a catalog signed with a newly trusted key is taken, and once the old key is removed from
+// the settings its catalogs are refused.
+TEST_F(AssetCatalogTest, UntrustworthyCatalogsAreRefusedWithTheirReasonAndKeysRotate) {
+    std::string newKey = readText(work / "new.pub");
+    newKey.pop_back();
+    auto trusting = [](plist::Dictionary keys) {
+        return plist::Dictionary{{kSettingsTrustedKeysKey, plist::Value(std::move(keys))}};
+    };
+    auto publish = [&](const char* version, const char* key, const char* id) {
+        std::string bundle = work / (std::string(version) + "/Default.bundle");
+        test::makeBundle(bundle, version, {{"a.plist", version}});
+        tool({"publish", work / "out", "--key", work / key, "--key-id", id, "--fresh", bundle});
+    };
+    writeTypeSettings(trusting({{"old", plist::Value(publicKey)}, {"new", plist::Value(newKey)}}));
+    publish("1.0", "secret.key", "old");
+    EXPECT_TRUE(query(true).value_or(Assets{nullptr}).empty()) << "nothing is kept before a fetch";
+    ASSERT_EQ(query().value_or(Assets()).size(), 1u);
+    publish("2.0", "new.key", "new");
+    ASSERT_EQ(query().value_or(Assets()).size(), 1u) << "signed with the rotated-in key";
+    std::string oldCatalog = readText(out("catalog.plist"));
+    std::string oldSignature = readText(out("catalog.plist.sig"));
+    writeTypeSettings(trusting({{"new", plist::Value(newKey)}}));
+    publish("2.1", "new.key", "new");
     ASSERT_EQ(query().value_or(Assets()).size(), 1u);
     std::string catalog = readText(out("catalog.plist"));
     std::string signature = readText(out("catalog.plist.sig"));
 
     struct Case {
         const char* name;
-        std::string catalog;
-        std::optional<std::string> signature;
+        std::function<void()> arrange;
         const char* reason;
     };
+    auto serve = [&](const std::string& bytes, const std::optional<std::string>& sig) {
+        writeText(out("catalog.plist"), bytes);
+        fs::remove(out("catalog.plist.sig"));
+        if (sig) {
+            writeText(out("catalog.plist.sig"), *sig);
+        }
+    };
     std::string altered = catalog;
-    altered.replace(altered.find("<string>1.0</string>"), 20, "<string>9.0</string>");
+    altered.replace(altered.find("<string>2.1</string>"), 20, "<string>9.0</string>");
     std::vector<Case> cases{
-        {"altered catalog", altered, signature, "signature does not verify"},
-        {"zeroed signature", catalog, std::string(64, '\0'), "signature does not verify"},
-        {"long signature", catalog, signature + "x", "cannot fetch its signature"},
-        {"no signature", catalog, std::nullopt, "cannot fetch its signature"},
+        {"altered catalog", [&] { serve(altered, signature); }, "bad signature"},
+        {"no signature", [&] { serve(catalog, std::nullopt); }, "missing signature"},
+        {"replayed older serial", [&] { serve(oldCatalog, oldSignature); }, "rollback"},
+        {"signed with the removed key", [&] { publish("3.0", "secret.key", "old"); },
+         "unknown key"},
+        {"no key and no AllowUnsigned",
+         [&] {
+             serve(catalog, signature);
+             writeTypeSettings({});
+         },
+         "unsigned not allowed"},
+        // Only the URL's own scheme is followed.
+        {"redirect to another scheme",
+         [&] {
+             writeTypeSettings(trusting({{"new", plist::Value(newKey)}}));
+             LocalHttpServer::Response moved = statusResponse(302, "Found");
+             moved.headers = {{"Location", "https://127.0.0.1:" + std::to_string(server.port()) +
+                                               "/catalog/catalog.plist"}};
+             server.serve("/catalog/catalog.plist", moved);
+         },
+         "fetch failed"},
     };
     for (const Case& c : cases) {
         SCOPED_TRACE(c.name);
         sink.clear();
-        writeText(out("catalog.plist"), c.catalog);
-        fs::remove(out("catalog.plist.sig"));
-        if (c.signature) {
-            writeText(out("catalog.plist.sig"), *c.signature);
-        }
+        c.arrange();
         EXPECT_FALSE(query().has_value());
-        EXPECT_EQ(logLinesContaining(c.reason), 1u);
+        EXPECT_EQ(logLinesContaining(std::string(": ") + c.reason + ": "), 1u);
     }
-    // Refused catalogs never replace the copy kept from the last good one.
+    EXPECT_EQ(logLinesContaining("\"https\" not supported"), 1u) << "the redirect was not followed";
+    std::size_t requests = server.requests().size();
     std::optional<Assets> kept = query(true);
     ASSERT_TRUE(kept.has_value());
     ASSERT_EQ(kept->size(), 1u);
-    EXPECT_EQ(*kept->front()->attributes().find("Version")->second.asString(), "1.0");
+    EXPECT_EQ(kept->front()->attributes(), (plist::Dictionary{{"Version", plist::Value("2.1")}}));
+    EXPECT_EQ(server.requests().size(), requests) << "local queries do not ask the server";
+
+    // A device whose view is frozen notices once the catalog expires, even the kept copy.
+    ScopedClockOffset monthLater(std::chrono::hours(24 * 31));
+    sink.clear();
+    EXPECT_FALSE(query(true).has_value());
+    EXPECT_EQ(logLinesContaining(": expired: "), 1u);
+}
+
+// A device that fetches the catalog just before a publication and its signature just after takes
+// the new pair, not a refusal that would keep it waiting for its next check.
+TEST_F(AssetCatalogTest, FetchCaughtBetweenSignatureAndCatalogReplacementTriesAgain) {
+    test::makeBundle(work / "b/Default.bundle", "1.0", {{"a.plist", "one"}});
+    tool({"publish", work / "out", "--key", work / "secret.key", work / "b/Default.bundle"});
+    writeSettings(publicKey);
+    LocalHttpServer::Response held = bodyResponse(readText(out("catalog.plist")));
+    held.holdAfterBodyBytes = held.body.size() - 1;
+    server.serve("/catalog/catalog.plist", held);
+    auto assets = std::async(std::launch::async, [this] { return query(); });
+    ASSERT_TRUE(server.waitForHeldResponse(kPatience));
+    tool({"publish", work / "out", "--key", work / "secret.key", work / "b/Default.bundle",
+          "--version", "2.0"});
+    server.serve("/catalog/catalog.plist", bodyResponse(readText(out("catalog.plist"))));
+    server.releaseHeldResponses();
+    std::optional<Assets> answered = assets.get();
+    ASSERT_TRUE(answered.has_value());
+    ASSERT_EQ(answered->size(), 2u);
+    EXPECT_EQ(answered->back()->attributes(),
+              (plist::Dictionary{{"Version", plist::Value("2.0")}}));
+}
+
+// Development setups may take unsigned catalogs, but only when told so, and say so every time.
+// A staged rollout shows an asset to the devices under its percentage, the same ones each time,
+// and a higher percentage keeps every device a lower one had.
+TEST_F(AssetCatalogTest, UnsignedCatalogsAreAnnouncedAndRolloutsAreStablePerDevice) {
+    test::makeBundle(work / "b/Default.bundle", "1.0", {{"a.plist", "one"}});
+    auto publishAt = [&](const char* percent) {
+        tool({"publish", work / "out", "--unsigned", work / "b/Default.bundle", "--rollout",
+              percent});
+    };
+    writeSettings(std::nullopt);
+    publishAt("100");
+    for (int use = 1; use <= 2; ++use) {
+        EXPECT_EQ(query().value_or(Assets()).size(), 1u);
+        EXPECT_EQ(logLinesContaining("AllowUnsigned is set"), static_cast<std::size_t>(use));
+    }
+    publishAt("0");
+    EXPECT_TRUE(query().value_or(Assets{nullptr}).empty());
+    EXPECT_EQ(logLinesContaining("outside the rollout of 1.0 (0%)"), 1u);
+
+    // Each device decides the same way every time; raising the share keeps those it had.
+    std::map<std::string, bool> at40;
+    for (int percent : {40, 70}) {
+        publishAt(std::to_string(percent).c_str());
+        for (int device = 0; device < 12; ++device) {
+            std::string serialNumber = "SN" + std::to_string(device);
+            writeText(resolvePath("/etc/tavrix/DeviceInfo.plist"),
+                      plist::serialize(plist::Value(
+                          plist::Dictionary{{"SerialNumber", plist::Value(serialNumber)}})));
+            bool taking = query().value_or(Assets()).size() == 1;
+            EXPECT_EQ(query().value_or(Assets()).size() == 1, taking) << serialNumber;
+            EXPECT_TRUE(percent == 40 || taking || !at40[serialNumber]) << serialNumber;
+            at40.try_emplace(serialNumber, taking);
+        }
+    }
+    std::size_t taking = std::count_if(at40.begin(), at40.end(), [](auto& e) { return e.second; });
+    EXPECT_GT(taking, 0u);
+    EXPECT_LT(taking, at40.size());
+    fs::remove(resolvePath("/etc/tavrix/DeviceInfo.plist"));
 }
 
 TEST_F(AssetCatalogTest, DamagedCatalogsAreRefusedAndMalformedEntriesSkipped) {
@@ -361,10 +456,14 @@ TEST_F(AssetCatalogTest, DamagedCatalogsAreRefusedAndMalformedEntriesSkipped) {
         with("ArchiveURL", plist::Value("file:///etc/passwd")),
         with("ArchiveURL", plist::Value(plist::Data{1, 2})),
         with("Attributes", plist::Value(plist::Array{})),
+        with("RolloutPercent", plist::Value(101)),
     };
     auto catalogWith = [&](plist::Value type, plist::Value assets) {
-        return plist::serialize(plist::Value(
-            plist::Dictionary{{"AssetType", std::move(type)}, {"Assets", std::move(assets)}}));
+        return plist::serialize(plist::Value(plist::Dictionary{
+            {"AssetType", std::move(type)},
+            {"Serial", plist::Value(1)},
+            {"Expires", plist::Value(plist::Date{Clock::absoluteTimeNow() + 3600})},
+            {"Assets", std::move(assets)}}));
     };
     server.serve("/catalog/catalog.plist", bodyResponse(catalogWith(kAssetType, entries)));
     std::optional<Assets> assets = query();
@@ -378,6 +477,8 @@ TEST_F(AssetCatalogTest, DamagedCatalogsAreRefusedAndMalformedEntriesSkipped) {
         {"another type", catalogWith("other.type", entries)},
         {"assets of the wrong type", catalogWith(kAssetType, plist::Value("x"))},
         {"over the size cap", std::string(9u << 20, ' ')},
+        {"no serial", plist::serialize(plist::Value(plist::Dictionary{
+                          {"AssetType", plist::Value(kAssetType)}, {"Assets", entries}}))},
     };
     for (const auto& [name, body] : refused) {
         SCOPED_TRACE(name);

@@ -45,6 +45,7 @@ class AssetSelectionTest : public testing::Test {
     void SetUp() override {
         const fs::path& root = test::unitTestRoot();
         fs::create_directories(root / "etc/tavrix");
+        fs::remove_all(root / "var/lib/tavrixservicesd");  // serials other tests' catalogs left
         ASSERT_TRUE(plist::writeFile((root / "etc/tavrix/DeviceInfo.plist").string(),
                                      plist::Value(plist::Dictionary{
                                          {"contains-cellular-radio", false},
@@ -63,8 +64,9 @@ class AssetSelectionTest : public testing::Test {
                 {platform::kSettingsAssetTypesKey,
                  plist::Dictionary{
                      {kAssetTypeTavrixBundles,
-                      plist::Dictionary{{platform::kSettingsCatalogURLKey,
-                                         server.url("/catalog/catalog.plist")}}}}}})));
+                      plist::Dictionary{
+                          {platform::kSettingsCatalogURLKey, server.url("/catalog/catalog.plist")},
+                          {platform::kSettingsAllowUnsignedKey, true}}}}}})));
     }
 
     // Publishes the case's assets as a new catalog, each from a bundle directory of its own.

@@ -3,13 +3,12 @@
 #include <sys/stat.h>
 
 #include <algorithm>
+#include <chrono>
 #include <filesystem>
 #include <functional>
 
 #include "CatalogToolRunner.h"
 #include "TestSupport.h"
-#include "platform/AssetCatalogFormat.h"
-#include "platform/CatalogCrypto.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix::test {
@@ -43,17 +42,16 @@ class CatalogToolTest : public testing::Test {
         return versions;
     }
 
-    bool signatureVerifies() {
-        std::string key = readText(work / "public.key");
-        std::optional<std::string> keyBytes = platform::base64Decode(key);
-        platform::CatalogPublicKey publicKey{};
-        if (!keyBytes || keyBytes->size() != publicKey.size()) {
-            return false;
-        }
-        std::copy(keyBytes->begin(), keyBytes->end(), publicKey.begin());
-        return platform::verifyCatalogSignature(readText(work / "out/catalog.plist"),
-                                                readText(work / "out/catalog.plist.sig"),
-                                                publicKey);
+    // The tool's own check, as a device would make it.
+    ToolRun verify(std::vector<std::string> arguments = {}) {
+        arguments.insert(arguments.begin(), {"verify", work / "out", "--key", work / "public.key"});
+        return runCatalogTool(arguments);
+    }
+
+    std::int64_t serial() {
+        std::optional<plist::Value> catalog = plist::readFile(work / "out/catalog.plist");
+        const plist::Value* value = catalog ? catalog->find("Serial") : nullptr;
+        return value != nullptr ? value->asInteger()->signedValue() : -1;
     }
 
     TempDir work;
@@ -67,7 +65,8 @@ TEST_F(CatalogToolTest, PublishingAddsReplacesAndStartsFreshWithAValidSignatureE
     ASSERT_EQ(publish({"--key", work / "secret.key", work / "a/Default.bundle"}), 0);
     ASSERT_EQ(publish({"--key", work / "secret.key", work / "b/Default.bundle"}), 0);
     EXPECT_EQ(listedVersions(), (std::vector<std::string>{"1.0", "2.0"}));
-    EXPECT_TRUE(signatureVerifies());
+    EXPECT_EQ(verify().status, 0);
+    EXPECT_EQ(serial(), 2);
 
     // The same archive name replaces its entry in place.
     ASSERT_EQ(publish({"--key", work / "secret.key", work / "b/Default.bundle", "--product-type",
@@ -79,11 +78,39 @@ TEST_F(CatalogToolTest, PublishingAddsReplacesAndStartsFreshWithAValidSignatureE
     EXPECT_EQ(*replaced.find("Attributes")->find("SupportedProductTypes"),
               plist::Value(plist::Array{plist::Value("Handset9,1")}));
     EXPECT_EQ(listedVersions().size(), 2u);
-    EXPECT_TRUE(signatureVerifies());
+    EXPECT_EQ(verify({"--min-serial", "3"}).status, 0);
+    EXPECT_EQ(verify({"--min-serial", "4"}).status, 1) << "a device holding serial 4";
 
+    // A fresh catalog still continues the serial: devices would refuse a lower one.
     ASSERT_EQ(publish({"--unsigned", "--fresh", work / "a/Default.bundle", "--version", "1.0"}), 0);
     EXPECT_EQ(listedVersions(), (std::vector<std::string>{"1.0"}));
+    EXPECT_EQ(serial(), 4);
     EXPECT_FALSE(fs::exists(work / "out/catalog.plist.sig")) << "a stale signature is removed";
+    EXPECT_EQ(verify().status, 1) << "unsigned, with a key to check";
+}
+
+// The same files make the same archive whenever and wherever they are packed, and verify finds
+// an archive that no longer matches its listing.
+TEST_F(CatalogToolTest, ArchivesAreReproducibleAndVerifyFindsTamperedOnes) {
+    ASSERT_EQ(publish({"--key", work / "secret.key", work / "b/Default.bundle"}), 0);
+    std::string first = readText(work / "out/archives/Default-2.0.tgz");
+    fs::copy(work / "b", work / "copy", fs::copy_options::recursive);
+    fs::last_write_time(work / "copy/Default.bundle/sub/b.plist",
+                        fs::file_time_type::clock::now() - std::chrono::hours(100));
+    ASSERT_EQ(
+        runCatalogTool({"publish", work / "other", "--unsigned", work / "copy/Default.bundle"})
+            .status,
+        0);
+    EXPECT_EQ(readText(work / "other/archives/Default-2.0.tgz"), first);
+
+    ToolRun good = verify();
+    EXPECT_EQ(good.status, 0) << good.errors;
+    std::string tampered = first;
+    tampered[tampered.size() / 2] ^= 0x20;
+    writeText(work / "out/archives/Default-2.0.tgz", tampered);
+    EXPECT_EQ(verify().status, 1);
+    writeText(work / "out/archives/Default-2.0.tgz", first + "x");
+    EXPECT_EQ(verify().status, 1);
 }
 
 TEST_F(CatalogToolTest, MistakesFailClearlyAndChangeNothing) {
@@ -115,6 +142,10 @@ TEST_F(CatalogToolTest, MistakesFailClearlyAndChangeNothing) {
         {"option before its bundle",
          {"publish", work / "out", "--unsigned", "--version", "1", work / "a/Default.bundle"},
          2},
+        {"rollout over 100",
+         {"publish", work / "out", "--unsigned", work / "a/Default.bundle", "--rollout", "101"},
+         2},
+        {"verify without a key", {"verify", work / "out"}, 2},
         {"unknown command", {"sign"}, 2},
     };
     for (const Case& c : cases) {
@@ -125,7 +156,7 @@ TEST_F(CatalogToolTest, MistakesFailClearlyAndChangeNothing) {
     }
     EXPECT_EQ(readText(work / "out/catalog.plist"), catalog);
     EXPECT_EQ(readText(work / "secret.key"), secret);
-    EXPECT_TRUE(signatureVerifies());
+    EXPECT_EQ(verify().status, 0);
 }
 
 // A directory that is no complete bundle is refused alike by the packer and the publisher, with

@@ -7,6 +7,7 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
+#include <ctime>
 #include <filesystem>
 #include <system_error>
 
@@ -14,6 +15,7 @@
 #include "payload/Archive.h"
 #include "platform/AssetCatalogFormat.h"
 #include "platform/AtomicFile.h"
+#include "platform/CatalogTrust.h"
 #include "plist/PropertyListFormat.h"
 #include "util/UniqueFd.h"
 
@@ -27,6 +29,9 @@ constexpr const char* kBundleVersionKey = "QZBundleVersion";
 constexpr const char* kBundleExtension = ".bundle";
 // The whole bundle is packed in memory; this keeps that bounded.
 constexpr std::uint32_t kMaxBundleBytes = 1u << 30;
+// Every entry's modification time (2001-01-01), so that archives depend on file contents only.
+constexpr std::int64_t kEntryModificationTime = 978307200;
+constexpr double kSecondsPerDay = 86400.0;
 
 using Failure = std::optional<std::string>;
 
@@ -112,6 +117,7 @@ Failure packBundle(const std::string& directory, const std::vector<std::string>&
     if (!archive) {
         return "cannot set up an archive for " + directory;
     }
+    archive->setEntryModificationTime(kEntryModificationTime);
     for (const std::string& file : files) {
         std::string path = (fs::path(directory) / file).string();
         if (!archive->addFile(path, file)) {
@@ -171,12 +177,28 @@ std::optional<plist::Value> publishBundle(const PublishRequest& request,
     }
     std::printf("packed %s: %zu files, %ju bytes, Version %s\n", relativeURL.c_str(), files->size(),
                 size, version->c_str());
-    return plist::Value(plist::Dictionary{
+    plist::Dictionary entry{
         {platform::kCatalogAttributesKey, attributesFor(bundle, *version)},
         {platform::kCatalogArchiveURLKey, plist::Value(relativeURL)},
         {platform::kCatalogArchiveSizeKey, plist::Value(static_cast<long long>(size))},
         {platform::kCatalogArchiveSHA256Key, plist::Value(*digest)},
-    });
+    };
+    if (bundle.rolloutPercent) {
+        entry.emplace(platform::kCatalogRolloutPercentKey, plist::Value(*bundle.rolloutPercent));
+    }
+    return plist::Value(std::move(entry));
+}
+
+// The serial of the catalog already in the output directory, 0 when there is none: devices refuse
+// to go back, so even a fresh catalog continues from it.
+std::int64_t previousSerial(const PublishRequest& request) {
+    std::string path = (fs::path(request.outputDirectory) / kCatalogFileName).string();
+    std::optional<plist::Value> catalog = plist::readFile(path);
+    const plist::Value* serial = catalog ? catalog->find(platform::kCatalogSerialKey) : nullptr;
+    const plist::Integer* number = serial != nullptr ? serial->asInteger() : nullptr;
+    return number != nullptr && !number->isLargeUnsigned() && number->signedValue() > 0
+               ? number->signedValue()
+               : 0;
 }
 
 // The entries of the catalog already in the output directory (none when there is none yet).
@@ -221,28 +243,41 @@ bool writeFile(const std::string& path, const std::string& bytes, mode_t mode) {
     return platform::replaceFileAtomically(path, bytes, mode) == 0;
 }
 
-// Writes the catalog and, with a key, its detached signature of exactly those bytes.
-Failure writeCatalog(const PublishRequest& request, plist::Array entries) {
+// Writes the catalog and, with a key, its detached signature of exactly those bytes. The
+// signature goes first, each file replaced whole: a device that fetches between the two sees a
+// pair that does not verify and fetches again, never an old catalog taken as new.
+Failure writeCatalog(const PublishRequest& request, std::int64_t serial, plist::Array entries) {
     std::string path = (fs::path(request.outputDirectory) / kCatalogFileName).string();
     std::string signaturePath = path + platform::kCatalogSignatureSuffix;
-    std::string bytes = plist::serialize(plist::Value(plist::Dictionary{
+    double now = static_cast<double>(std::time(nullptr));
+    plist::Dictionary catalog{
         {platform::kCatalogAssetTypeKey, plist::Value(request.assetType)},
+        {platform::kCatalogSerialKey, plist::Value(static_cast<long long>(serial))},
+        {platform::kCatalogExpiresKey,
+         plist::Value(plist::Date::fromUnixTime(now + request.expiresInDays * kSecondsPerDay))},
         {platform::kCatalogAssetsKey, plist::Value(std::move(entries))},
-    }));
-    if (!writeFile(path, bytes, 0644)) {
-        return systemError("cannot write", path, errno);
+    };
+    if (request.secretKey) {
+        catalog.emplace(
+            platform::kCatalogKeyIDKey,
+            plist::Value(request.keyIdentifier.empty() ? keyIdentifierOf(*request.secretKey)
+                                                       : request.keyIdentifier));
     }
+    std::string bytes = plist::serialize(plist::Value(std::move(catalog)));
     if (!request.secretKey) {
         std::error_code ignored;
         fs::remove(signaturePath, ignored);  // a stale signature would make devices refuse it
-        return std::nullopt;
+    } else {
+        std::string signature(platform::kCatalogSignatureBytes, '\0');
+        crypto_sign_detached(reinterpret_cast<unsigned char*>(signature.data()), nullptr,
+                             reinterpret_cast<const unsigned char*>(bytes.data()), bytes.size(),
+                             request.secretKey->data());
+        if (!writeFile(signaturePath, signature, 0644)) {
+            return systemError("cannot write", signaturePath, errno);
+        }
     }
-    std::string signature(platform::kCatalogSignatureBytes, '\0');
-    crypto_sign_detached(reinterpret_cast<unsigned char*>(signature.data()), nullptr,
-                         reinterpret_cast<const unsigned char*>(bytes.data()), bytes.size(),
-                         request.secretKey->data());
-    if (!writeFile(signaturePath, signature, 0644)) {
-        return systemError("cannot write", signaturePath, errno);
+    if (!writeFile(path, bytes, 0644)) {
+        return systemError("cannot write", path, errno);
     }
     return std::nullopt;
 }
@@ -260,6 +295,7 @@ std::optional<std::string> publishCatalog(const PublishRequest& request) {
         return systemError("cannot create", archives, code.value());
     }
     std::string error;
+    std::int64_t serial = request.serial.value_or(previousSerial(request) + 1);
     std::optional<plist::Array> entries = existingEntries(request, error);
     if (!entries) {
         return error;
@@ -272,11 +308,13 @@ std::optional<std::string> publishCatalog(const PublishRequest& request) {
         addOrReplace(*entries, std::move(*entry));
     }
     std::size_t count = entries->size();
-    if (Failure failure = writeCatalog(request, std::move(*entries))) {
+    if (Failure failure = writeCatalog(request, serial, std::move(*entries))) {
         return failure;
     }
-    std::printf("wrote %s/%s: %zu asset(s), %s\n", request.outputDirectory.c_str(),
-                kCatalogFileName, count, request.secretKey ? "signed" : "unsigned");
+    std::printf("wrote %s/%s: %zu asset(s), serial %lld, expires in %d days, %s\n",
+                request.outputDirectory.c_str(), kCatalogFileName, count,
+                static_cast<long long>(serial), request.expiresInDays,
+                request.secretKey ? "signed" : "unsigned");
     return std::nullopt;
 }
 
@@ -307,6 +345,12 @@ std::optional<std::string> generateKeyPair(const std::string& secretKeyPath,
         return std::nullopt;
     }
     return publicText;
+}
+
+std::string keyIdentifierOf(const platform::CatalogSecretKey& secretKey) {
+    platform::CatalogPublicKey publicKey{};
+    crypto_sign_ed25519_sk_to_pk(publicKey.data(), secretKey.data());
+    return platform::defaultKeyIdentifier(publicKey);
 }
 
 std::optional<platform::CatalogSecretKey> readSecretKey(const std::string& path,
