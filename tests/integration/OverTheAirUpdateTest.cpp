@@ -471,8 +471,8 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
     writeFile(site() / "catalog.plist.sig", signature);
     check = tavrixctlJson({"check-update"}, 1);
     EXPECT_EQ(textAt(check, {"outcome"}), "catalog-refused");
-    EXPECT_EQ(textAt(check, {"reason"}),
-              "catalog refused: its signature does not verify with the configured key");
+    EXPECT_TRUE(textAt(check, {"reason"}).starts_with("catalog refused: bad signature: "))
+        << textAt(check, {"reason"});
     // What the daemon recorded is still there after it left and was started again.
     const auto pid = daemonPid();
     ASSERT_TRUE(pid);

@@ -384,8 +384,8 @@ TEST_F(AssetCatalogTest, FetchCaughtBetweenSignatureAndCatalogReplacementTriesAg
     server.serve("/catalog/catalog.plist", held);
     auto assets = std::async(std::launch::async, [this] { return query(); });
     ASSERT_TRUE(server.waitForHeldResponse(kPatience));
-    tool({"publish", work / "out", "--key", work / "secret.key", work / "b/Default.bundle",
-          "--version", "2.0"});
+    test::makeBundle(work / "c/Default.bundle", "2.0", {{"a.plist", "two"}});
+    tool({"publish", work / "out", "--key", work / "secret.key", work / "c/Default.bundle"});
     server.serve("/catalog/catalog.plist", bodyResponse(readText(out("catalog.plist"))));
     server.releaseHeldResponses();
     std::optional<Assets> answered = assets.get();
