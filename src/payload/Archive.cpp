@@ -122,7 +122,8 @@ std::unique_ptr<Archive> Archive::initWithMaxUncompressedSize(std::uint32_t size
         filterStatus = libarchive().archive_write_add_filter_gzip(writer);
         // The time of writing in the gzip header would make equal archives differ.
         if (filterStatus == ARCHIVE_OK) {
-            filterStatus = libarchive().archive_write_set_filter_option(writer, "gzip", "timestamp", nullptr);
+            filterStatus =
+                libarchive().archive_write_set_filter_option(writer, "gzip", "timestamp", nullptr);
         }
     }
     if (filterStatus != ARCHIVE_OK ||
@@ -173,7 +174,7 @@ bool Archive::addFile(const std::string& path, const std::string& asFile) {
         libarchive().archive_entry_set_mtime(entry.get(), *entryModificationTime_, 0);
     } else {
         libarchive().archive_entry_set_mtime(entry.get(), contents->info.st_mtim.tv_sec,
-                                contents->info.st_mtim.tv_nsec);
+                                             contents->info.st_mtim.tv_nsec);
     }
     if (libarchive().archive_write_header(archive_.get(), entry.get()) != ARCHIVE_OK) {
         return false;
