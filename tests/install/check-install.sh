@@ -79,7 +79,8 @@ flags=$(PKG_CONFIG_PATH="$image$libdir/pkgconfig" PKG_CONFIG_SYSROOT_DIR="$image
 source_dir=$(sed -n 's/^CMAKE_HOME_DIRECTORY:INTERNAL=//p' "$build/CMakeCache.txt")
 # shellcheck disable=SC2086 # the flags are words
 c++ -std=c++20 -Wall -Wextra -Werror -o "$stage/client-example" \
-    "$source_dir/examples/client/client-example.cpp" $flags || fail "the example does not build"
+    "$source_dir/examples/client/client-example.cpp" $flags ${TAVRIX_EXAMPLE_FLAGS:-} ||
+    fail "the example does not build"
 ldd "$stage/client-example" | grep -q "libtavrixclient.so.1 => $image" ||
     fail "the example does not use the installed library"
 if grep -rqE '#include "(platform|util|payload|daemon|bundle|update)/' "$image$prefix/include/tavrix"; then
