@@ -141,3 +141,6 @@ step "The links and the bundle version now linked"
 show_links
 printf '   linked bundle: %s\n' \
     "$("$plist" "$home/Library/Tavrix.bundle/Info.plist" | grep QZBundleVersion | sed 's/^ *//')"
+
+step "What the daemon reports about itself"
+run "$ctl" status
