@@ -114,6 +114,11 @@ read_as_mobile() {
 step "the mobile user reads the linked carrier file" read_as_mobile
 step "the installed bundle belongs to the daemon's user" \
     test "$(stat -c %U /var/mobile/Library/TavrixBundles/Default.bundle)" = tavrixservicesd
+status_as_nobody() {
+    as_nobody tavrixctl status --json >"$work/step.log" 2>&1 &&
+        grep -qE '"Extracted": *true' "$work/step.log"
+}
+step "nobody: tavrixctl status shows the payload extracted" status_as_nobody
 
 # 6. A look-alike notification from another user never reaches a listener, even one that does
 #    not match the sender; the daemon's user gets through.
