@@ -94,9 +94,17 @@ void UpdateCheckScheduler::scheduleJob() {
         {std::string(platform::kJobPowerOptimizationLevel), plist::Integer(1)},
         {std::string(platform::kJobAllowedDuringVoiceCall), true},
     };
-    // Removed first, so that at most one such job exists.
-    _jobScheduler->removeJob(kUpdateCheckJobName);
-    _jobScheduler->addJob(kUpdateCheckJobName, criteria);
+    // Every supported launch comes here: a registration that is already as asked is left alone,
+    // rather than written to the job store (with its fsync) again.
+    const plist::Dictionary jobs = _jobScheduler->copyJobs();
+    auto registered = jobs.find(kUpdateCheckJobName);
+    if (registered != jobs.end() && registered->second == plist::Value(criteria)) {
+        return;
+    }
+    // Adding replaces the job of that name; one that cannot be added must not stay either.
+    if (!_jobScheduler->addJob(kUpdateCheckJobName, criteria)) {
+        _jobScheduler->removeJob(kUpdateCheckJobName);
+    }
 }
 
 void UpdateCheckScheduler::onJobFired(const std::string& /*jobName*/,

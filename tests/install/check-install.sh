@@ -24,8 +24,9 @@ for tool in tavrixctl tavrix-catalog tavrix-plist; do
     [ -x "$image$prefix/bin/$tool" ] || fail "no $tool in $prefix/bin"
 done
 for tool in tavrixctl tavrix-catalog tavrix-plist; do
-    "$image$prefix/bin/$tool" --version | grep -q "^$tool [0-9]" || fail "$tool --version"
-    "$image$prefix/bin/$tool" -h | grep -q "^usage: $tool" || fail "$tool -h"
+    # Here-strings, not pipes: grep -q leaving early would fail the writer under pipefail.
+    grep -q "^$tool [0-9]" <<<"$("$image$prefix/bin/$tool" --version)" || fail "$tool --version"
+    grep -q "^usage: $tool" <<<"$("$image$prefix/bin/$tool" -h)" || fail "$tool -h"
 done
 
 find_one() {
@@ -81,7 +82,7 @@ source_dir=$(sed -n 's/^CMAKE_HOME_DIRECTORY:INTERNAL=//p' "$build/CMakeCache.tx
 c++ -std=c++20 -Wall -Wextra -Werror -o "$stage/client-example" \
     "$source_dir/examples/client/client-example.cpp" $flags ${TAVRIX_EXAMPLE_FLAGS:-} ||
     fail "the example does not build"
-ldd "$stage/client-example" | grep -q "libtavrixclient.so.1 => $image" ||
+grep -q "libtavrixclient.so.1 => $image" <<<"$(ldd "$stage/client-example")" ||
     fail "the example does not use the installed library"
 if grep -rqE '#include "(platform|util|payload|daemon|bundle|update)/' "$image$prefix/include/tavrix"; then
     fail "an installed header includes an internal one"
@@ -100,6 +101,7 @@ if command -v dbus-daemon >/dev/null; then
     grep -qx "notification: TXDaemonStartedNotification" <<<"$output" ||
         fail "the example heard no notification: $output"
 else
-    "$stage/client-example" --help | grep -q '^usage: client-example' || fail "client-example --help"
+    grep -q '^usage: client-example' <<<"$("$stage/client-example" --help)" ||
+        fail "client-example --help"
 fi
 echo "installed under $prefix: all files in place; the example client builds and runs"
