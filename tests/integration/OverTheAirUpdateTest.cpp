@@ -152,20 +152,18 @@ class OverTheAirUpdateTest : public BusFixture {
             {TAVRIX_CATALOG_TOOL, "keygen", secretKey().string(), (keys_ / "public").string()});
         ASSERT_EQ(keys.status, 0) << keys.output;
         server.serveDirectory("/updates/", site());
-        writeCatalogSettings(true);
+        writeCatalogSettings();
         // A check already armed a few days ahead, so that every re-arm shows.
         device().writeDaemonPreferences(
             {{"EnableSupport", true}, {"NextUpdate", plist::Date{now() + 3 * kOneDay}}});
     }
 
-    // The device trusts the publisher's key (in the single-key form), or no key at all.
-    void writeCatalogSettings(bool trusted) {
-        plist::Dictionary type{{"CatalogURL", server.url("/updates/catalog.plist")}};
-        if (trusted) {
-            std::string publicKey = readFile(keys_ / "public");
-            publicKey.pop_back();  // the line break
-            type.emplace("PublicKey", publicKey);
-        }
+    // The device trusts the publisher's key, in the single-key form.
+    void writeCatalogSettings() {
+        std::string publicKey = readFile(keys_ / "public");
+        publicKey.pop_back();  // the line break
+        plist::Dictionary type{{"CatalogURL", server.url("/updates/catalog.plist")},
+                               {"PublicKey", publicKey}};
         ASSERT_TRUE(plist::writeFile(
             at("/etc/tavrix/AssetCatalog.plist").string(),
             plist::Value(plist::Dictionary{
@@ -317,18 +315,6 @@ class OverTheAirUpdateTest : public BusFixture {
             count += line.find(text) != std::string::npos ? 1 : 0;
         }
         return count;
-    }
-
-    bool waitForLogLinesContaining(const std::string& text, int count,
-                                   std::chrono::milliseconds timeout = 30s) const {
-        const auto deadline = std::chrono::steady_clock::now() + timeout;
-        while (countLogLinesContaining(text) < count) {
-            if (std::chrono::steady_clock::now() > deadline) {
-                return false;
-            }
-            std::this_thread::sleep_for(20ms);
-        }
-        return true;
     }
 
     // The version of the bundle the bundle link points at, or empty.
@@ -496,8 +482,8 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
 
 // Each way an update can go wrong leaves the linked bundle and its files as they were, posts
 // nothing and leaves no download behind; a download that started and failed re-arms the check a
-// day ahead, a refused catalog (expired, replayed, unsigned) or an asset held back by its rollout
-// starts nothing. A good update afterwards still installs.
+// day ahead, a refused catalog or an asset held back by its rollout starts nothing. A good update
+// afterwards still installs.
 TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheDaemonKeepsServing) {
     setIDWithBundle("1");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
@@ -528,37 +514,11 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheDaemonKeepsServing)
              });
          },
          false, ": expired: "},
-        {"older catalog replayed",
-         [&] {
-             publish("2");
-             const std::string older = readFile(site() / "catalog.plist");
-             const std::string olderSignature = readFile(site() / "catalog.plist.sig");
-             publish("1");
-             EXPECT_FALSE(client().checkForTavrixBundleUpdate()) << "a newer catalog, seen";
-             writeFile(site() / "catalog.plist", older);
-             writeFile(site() / "catalog.plist.sig", olderSignature);
-         },
-         false, ": rollback: "},
-        {"no trusted key",
-         [&] {
-             publish("2");
-             writeCatalogSettings(false);
-         },
-         false, ": unsigned not allowed: "},
         {"outside a rollout at 0%",
          [&] {
              publish("2", 0, {"--rollout", "0"});
          },
          false, "outside the rollout of 2 (0%)"},
-        {"connection cut in the middle of the archive",
-         [&] {
-             std::string path = publish("2");
-             test::LocalHttpServer::Response cut;
-             cut.body = readFile(published(path));
-             cut.cutAfterBodyBytes = cut.body.size() / 2;
-             server.serve(path, cut);
-         },
-         true, "cannot download"},
     };
 
     int failedDownloads = 0;
@@ -567,7 +527,7 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheDaemonKeepsServing)
         // Whole seconds: that is what a stored date keeps.
         const double armed = std::floor(now() + 3 * kOneDay);
         setNextUpdate(armed);
-        writeCatalogSettings(true);
+        writeCatalogSettings();
         c.arrange();
         const int refusals = countLogLinesContaining(c.logged);
         EXPECT_EQ(client().checkForTavrixBundleUpdate(), c.started);
@@ -587,7 +547,7 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheDaemonKeepsServing)
         EXPECT_TRUE(client().isTavrixBundleSupported());
     }
 
-    writeCatalogSettings(true);
+    writeCatalogSettings();
     publish("3", 0, {"--rollout", "100"});
     EXPECT_TRUE(client().checkForTavrixBundleUpdate());
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 2, 30s));
@@ -792,6 +752,9 @@ TEST_F(OverTheAirKeepAliveTest, ScheduledCheckKeepsTheDaemonUntilTheDownloadIsIn
     EXPECT_TRUE(waitForNextUpdateIn(kFifteenDays));
     EXPECT_EQ(waitForDaemonExit(*second), std::optional<int>(0));
     EXPECT_EQ(device().keepAliveFlag(), std::optional<std::string>("0"));
+    // Start-up also found "NextUpdate" past and re-armed the job; the check still ran once.
+    EXPECT_EQ(countLogLines("*********** Beginning Corvex transaction : Update Check ***********"),
+              1);
 }
 
 }  // namespace
