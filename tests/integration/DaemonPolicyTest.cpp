@@ -7,10 +7,10 @@
 #include <unistd.h>
 
 #include <algorithm>
-#include <fstream>
 
 #include "BusFixture.h"
 #include "CommandRunner.h"
+#include "TestSupport.h"
 
 namespace tavrix::integration {
 namespace {
@@ -48,15 +48,14 @@ class DaemonPolicyTest : public BusFixture {
     // The packaged policy, with the daemon's user being whoever runs the tests (the bus starts
     // the daemon as that user) and the stand-in group for "tavrix".
     std::filesystem::path adaptedPolicy() {
-        std::ifstream in(TAVRIX_POLICY_PATH, std::fstream::binary);
-        std::string policy(std::istreambuf_iterator<char>(in), {});
+        std::string policy = test::readText(TAVRIX_POLICY_PATH);
         const passwd* self = ::getpwuid(::geteuid());
         policy = replaceOnce(policy, "user=\"tavrixservicesd\"",
                              std::string("user=\"") + self->pw_name + "\"");
         policy =
             replaceOnce(policy, "group=\"tavrix\"", std::string("group=\"") + kStandInGroup + "\"");
         std::filesystem::path path = device().base() / "policy.conf";
-        std::ofstream(path, std::fstream::binary) << policy;
+        test::writeText(path, policy);
         return path;
     }
 

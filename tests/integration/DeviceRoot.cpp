@@ -1,11 +1,11 @@
 #include "DeviceRoot.h"
 
-#include <stdlib.h>
 #include <unistd.h>
 
 #include <fstream>
 #include <stdexcept>
 
+#include "TestSupport.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix::integration {
@@ -18,15 +18,6 @@ constexpr std::string_view kDaemonPreferences =
     "/var/mobile/Library/Preferences/com.zandor.tavrixservices.plist";
 constexpr std::string_view kBehaviorSettings =
     "/var/mobile/Library/Preferences/com.zandor.tavrix.plist";
-
-void writeText(const fs::path& path, std::string_view text) {
-    fs::create_directories(path.parent_path());
-    std::ofstream out(path, std::fstream::binary | std::fstream::trunc);
-    out << text;
-    if (!out.flush()) {
-        throw std::runtime_error("cannot write " + path.string());
-    }
-}
 
 // Everything the device information service is asked for, so that no answer comes from the
 // machine running the tests.
@@ -47,26 +38,17 @@ plist::Dictionary deviceTable(bool cellularRadio) {
 }  // namespace
 
 DeviceRoot::DeviceRoot() {
-    std::string pattern = (fs::temp_directory_path() / "tavrix-integ-XXXXXX").string();
-    if (::mkdtemp(pattern.data()) == nullptr) {
-        throw std::runtime_error("mkdtemp failed");
-    }
-    base_ = pattern;
     // Other users reach the bus socket in here (the policy tests run clients as nobody).
-    fs::permissions(base_, fs::perms::owner_all | fs::perms::group_read | fs::perms::group_exec |
-                               fs::perms::others_read | fs::perms::others_exec);
+    fs::permissions(base(), fs::perms::owner_all | fs::perms::group_read | fs::perms::group_exec |
+                                fs::perms::others_read | fs::perms::others_exec);
 
-    writeText(path("/etc/passwd"),
-              "root:x:0:0:root:/root:/bin/sh\nmobile:x:" + std::to_string(::getuid()) + ":" +
-                  std::to_string(::getgid()) + ":Mobile User:/var/mobile:/usr/sbin/nologin\n");
+    test::writeText(path("/etc/passwd"),
+                    "root:x:0:0:root:/root:/bin/sh\nmobile:x:" + std::to_string(::getuid()) + ":" +
+                        std::to_string(::getgid()) +
+                        ":Mobile User:/var/mobile:/usr/sbin/nologin\n");
     fs::create_directories(path("/var/mobile/Library/Preferences"));
     fs::create_directories(runtimeDirectory());
     setCellularRadio(false);
-}
-
-DeviceRoot::~DeviceRoot() {
-    std::error_code ignored;
-    fs::remove_all(base_, ignored);
 }
 
 fs::path DeviceRoot::path(std::string_view absolutePath) const {
@@ -102,7 +84,7 @@ std::optional<std::string> DeviceRoot::keepAliveFlag() const {
 }
 
 void DeviceRoot::setKeepAliveFlag(std::string_view text) {
-    writeText(runtimeDirectory() / "keep-alive", text);
+    test::writeText(runtimeDirectory() / "keep-alive", std::string(text));
 }
 
 void DeviceRoot::writePropertyList(std::string_view absolutePath, const plist::Dictionary& values) {

@@ -7,6 +7,7 @@
 #include <string>
 #include <string_view>
 
+#include "TestSupport.h"
 #include "plist/Value.h"
 
 namespace tavrix::integration {
@@ -16,14 +17,13 @@ class DeviceRoot {
     // etc/passwd holds "mobile" with the test's own uid and gid (home /var/mobile); the device
     // table says there is no cellular radio.
     DeviceRoot();
-    ~DeviceRoot();
     DeviceRoot(const DeviceRoot&) = delete;
     DeviceRoot& operator=(const DeviceRoot&) = delete;
 
     // The temporary directory holding everything (the root, the run directory, the bus files).
-    const std::filesystem::path& base() const { return base_; }
-    std::filesystem::path root() const { return base_ / "root"; }
-    std::filesystem::path runtimeDirectory() const { return base_ / "run"; }
+    const std::filesystem::path& base() const { return base_.path(); }
+    std::filesystem::path root() const { return base() / "root"; }
+    std::filesystem::path runtimeDirectory() const { return base() / "run"; }
     // absolutePath of the device, under the root.
     std::filesystem::path path(std::string_view absolutePath) const;
 
@@ -44,7 +44,7 @@ class DeviceRoot {
     // sees a new file.
     void writePropertyList(std::string_view absolutePath, const plist::Dictionary& values);
 
-    std::filesystem::path base_;
+    test::TempDir base_;
 };
 
 }  // namespace tavrix::integration

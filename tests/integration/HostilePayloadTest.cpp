@@ -13,6 +13,7 @@
 
 #include "BusFixture.h"
 #include "CommandRunner.h"
+#include "TestSupport.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix::integration {
@@ -113,10 +114,6 @@ plist::Dictionary manyIDsCarrierFile() {
             {"BehaviorOverrides", plist::Dictionary{{"Group", std::move(group)}}}};
 }
 
-void writeBytes(const fs::path& path, const std::string& bytes) {
-    std::ofstream(path, std::fstream::binary).write(bytes.data(), std::streamsize(bytes.size()));
-}
-
 struct HostileCase {
     const char* name;
     // Turns a good bundle directory (Info.plist and behavior.plist) into the hostile one.
@@ -125,7 +122,9 @@ struct HostileCase {
     std::uint64_t zeroFileBytes = 0;
 };
 
-void PrintTo(const HostileCase& hostile, std::ostream* out) { *out << hostile.name; }
+void PrintTo(const HostileCase& hostile, std::ostream* out) {
+    *out << hostile.name;
+}
 
 void replaceWithFifo(const fs::path& file) {
     fs::remove(file);
@@ -136,13 +135,13 @@ const HostileCase kCases[] = {
     {"FifoAsCarrierFile", [](const fs::path& b) { replaceWithFifo(b / "behavior.plist"); }},
     {"FifoAsInfo", [](const fs::path& b) { replaceWithFifo(b / "Info.plist"); }},
     {"DeepXmlCarrierFile",
-     [](const fs::path& b) { writeBytes(b / "behavior.plist", deepXmlList(200000)); }},
+     [](const fs::path& b) { test::writeText(b / "behavior.plist", deepXmlList(200000)); }},
     {"DeepBinaryCarrierFile",
-     [](const fs::path& b) { writeBytes(b / "behavior.plist", deepBinaryList(30000)); }},
+     [](const fs::path& b) { test::writeText(b / "behavior.plist", deepBinaryList(30000)); }},
     {"DeepBinaryInfo",
-     [](const fs::path& b) { writeBytes(b / "Info.plist", deepBinaryList(30000)); }},
+     [](const fs::path& b) { test::writeText(b / "Info.plist", deepBinaryList(30000)); }},
     {"SelfSharingBinaryCarrierFile",
-     [](const fs::path& b) { writeBytes(b / "behavior.plist", selfSharingBinaryList()); }},
+     [](const fs::path& b) { test::writeText(b / "behavior.plist", selfSharingBinaryList()); }},
     {"SparseHugeCarrierFile",
      [](const fs::path& b) { fs::resize_file(b / "behavior.plist", std::uintmax_t{100} << 30); }},
     {"ManyIDsForOneConfiguration",

@@ -8,10 +8,8 @@
 #include <sys/statvfs.h>
 #include <unistd.h>
 
-#include <cctype>
 #include <cmath>
 #include <cstdlib>
-#include <cstring>
 #include <filesystem>
 #include <fstream>
 #include <functional>
@@ -24,6 +22,7 @@
 #include "BusFixture.h"
 #include "CommandRunner.h"
 #include "LocalHttpServer.h"
+#include "TestSupport.h"
 #include "platform/BackgroundJobScheduler.h"
 #include "platform/Clock.h"
 #include "plist/PropertyListFormat.h"
@@ -34,6 +33,8 @@ namespace tavrix::integration {
 namespace {
 
 namespace fs = std::filesystem;
+using test::readText;
+using test::writeText;
 
 constexpr const char* kChanged = "kTVXBehaviorBundleChangedNotification";
 constexpr const char* kUserBundle = "/var/mobile/Library/TavrixBundles/Default.bundle";
@@ -46,101 +47,6 @@ constexpr const char* kPendingInstall = "/var/lib/tavrixservicesd/pending-instal
 constexpr double kOneDay = 86400.0;
 constexpr double kFifteenDays = 1296000.0;
 
-std::string readFile(const fs::path& path) {
-    std::ifstream in(path, std::fstream::binary);
-    return {std::istreambuf_iterator<char>(in), {}};
-}
-
-void writeFile(const fs::path& path, const std::string& bytes) {
-    fs::create_directories(path.parent_path());
-    std::ofstream(path, std::fstream::binary | std::fstream::trunc) << bytes;
-}
-
-// Just enough JSON to read tavrixctl's answers back: objects, arrays, strings (with escapes),
-// booleans and integers. Nothing for anything else or trailing text, so malformed output fails.
-class JsonReader {
-  public:
-    explicit JsonReader(std::string text) : text_(std::move(text)) {}
-
-    std::optional<plist::Value> read() {
-        auto value = readValue();
-        skipSpace();
-        return at_ == text_.size() ? value : std::nullopt;
-    }
-
-  private:
-    void skipSpace() {
-        while (at_ < text_.size() && std::isspace(static_cast<unsigned char>(text_[at_]))) {
-            ++at_;
-        }
-    }
-    bool take(char c) {
-        skipSpace();
-        if (at_ < text_.size() && text_[at_] == c) {
-            ++at_;
-            return true;
-        }
-        return false;
-    }
-    std::optional<std::string> readString() {
-        if (!take('"')) {
-            return std::nullopt;
-        }
-        std::string out;
-        while (at_ < text_.size() && text_[at_] != '"') {
-            char c = text_[at_++];
-            if (static_cast<unsigned char>(c) < 0x20) {
-                return std::nullopt;
-            }
-            if (c == '\\' && at_ < text_.size()) {
-                const char escaped = text_[at_++];
-                c = escaped == 'n' ? '\n' : escaped == 't' ? '\t' : escaped;
-            }
-            out += c;
-        }
-        return take('"') ? std::optional(out) : std::nullopt;
-    }
-    std::optional<plist::Value> readValue() {
-        skipSpace();
-        if (at_ < text_.size() && text_[at_] == '"') {
-            auto text = readString();
-            return text ? std::optional<plist::Value>(*text) : std::nullopt;
-        }
-        if (take('{')) {
-            plist::Dictionary object;
-            while (!take('}')) {
-                if (!object.empty() && !take(',')) {
-                    return std::nullopt;
-                }
-                auto key = readString();
-                auto value = key && take(':') ? readValue() : std::nullopt;
-                if (!value) {
-                    return std::nullopt;
-                }
-                object.emplace(*key, std::move(*value));
-            }
-            return plist::Value(std::move(object));
-        }
-        for (const auto& [word, flag] : {std::pair{"true", true}, std::pair{"false", false}}) {
-            if (text_.compare(at_, std::strlen(word), word) == 0) {
-                at_ += std::strlen(word);
-                return plist::Value(flag);
-            }
-        }
-        std::size_t used = 0;
-        try {
-            long long number = std::stoll(text_.substr(at_), &used);
-            at_ += used;
-            return plist::Value(plist::Integer(static_cast<std::int64_t>(number)));
-        } catch (const std::exception&) {
-            return std::nullopt;
-        }
-    }
-
-    std::string text_;
-    std::size_t at_ = 0;
-};
-
 class OverTheAirUpdateTest : public BusFixture {
   protected:
     OverTheAirUpdateTest() { busOptions.idleExitSeconds = 30; }
@@ -152,20 +58,18 @@ class OverTheAirUpdateTest : public BusFixture {
             {TAVRIX_CATALOG_TOOL, "keygen", secretKey().string(), (keys_ / "public").string()});
         ASSERT_EQ(keys.status, 0) << keys.output;
         server.serveDirectory("/updates/", site());
-        writeCatalogSettings(true);
+        writeCatalogSettings();
         // A check already armed a few days ahead, so that every re-arm shows.
         device().writeDaemonPreferences(
             {{"EnableSupport", true}, {"NextUpdate", plist::Date{now() + 3 * kOneDay}}});
     }
 
-    // The device trusts the publisher's key (in the single-key form), or no key at all.
-    void writeCatalogSettings(bool trusted) {
-        plist::Dictionary type{{"CatalogURL", server.url("/updates/catalog.plist")}};
-        if (trusted) {
-            std::string publicKey = readFile(keys_ / "public");
-            publicKey.pop_back();  // the line break
-            type.emplace("PublicKey", publicKey);
-        }
+    // The device trusts the publisher's key, in the single-key form.
+    void writeCatalogSettings() {
+        std::string publicKey = readText(keys_ / "public");
+        publicKey.pop_back();  // the line break
+        plist::Dictionary type{{"CatalogURL", server.url("/updates/catalog.plist")},
+                               {"PublicKey", publicKey}};
         ASSERT_TRUE(plist::writeFile(
             at("/etc/tavrix/AssetCatalog.plist").string(),
             plist::Value(plist::Dictionary{
@@ -180,15 +84,15 @@ class OverTheAirUpdateTest : public BusFixture {
         ASSERT_TRUE(catalog && catalog->isDictionary());
         edit(*catalog->asDictionary());
         ASSERT_TRUE(plist::writeFile((site() / "catalog.plist").string(), *catalog));
-        const std::string bytes = readFile(site() / "catalog.plist");
-        const std::string secret = readFile(secretKey());
+        const std::string bytes = readText(site() / "catalog.plist");
+        const std::string secret = readText(secretKey());
         ASSERT_EQ(secret.size(), crypto_sign_SECRETKEYBYTES);
         std::string signature(crypto_sign_BYTES, '\0');
         ASSERT_GE(sodium_init(), 0);
         crypto_sign_detached(reinterpret_cast<unsigned char*>(signature.data()), nullptr,
                              reinterpret_cast<const unsigned char*>(bytes.data()), bytes.size(),
                              reinterpret_cast<const unsigned char*>(secret.data()));
-        writeFile(site() / "catalog.plist.sig", signature);
+        writeText(site() / "catalog.plist.sig", signature);
     }
 
     static double now() { return platform::Clock::absoluteTimeNow(); }
@@ -208,11 +112,11 @@ class OverTheAirUpdateTest : public BusFixture {
         EXPECT_TRUE(plist::writeFile(
             (directory / "behavior.plist").string(),
             plist::Value(plist::Dictionary{{"CarrierName", "Bundle " + version}})));
-        writeFile(directory / ("Resources/only-in-" + version + ".txt"), version);
+        writeText(directory / ("Resources/only-in-" + version + ".txt"), version);
         if (bulkBytes > 0) {
             std::string bulk(bulkBytes, '\0');
             randombytes_buf(bulk.data(), bulk.size());
-            writeFile(directory / "Resources/bulk.bin", bulk);
+            writeText(directory / "Resources/bulk.bin", bulk);
         }
         return directory;
     }
@@ -223,7 +127,7 @@ class OverTheAirUpdateTest : public BusFixture {
         CommandResult packed = runCommand({"/usr/bin/bsdtar", "-czf", archive.string(), "-C",
                                            writeBundle(version).string(), "."});
         ASSERT_EQ(packed.status, 0) << packed.output;
-        const std::string bytes = readFile(archive);
+        const std::string bytes = readText(archive);
         ASSERT_TRUE(client().setTavrixID(kBehaviorID,
                                          std::vector<std::uint8_t>(bytes.begin(), bytes.end())));
     }
@@ -256,7 +160,7 @@ class OverTheAirUpdateTest : public BusFixture {
         for (auto it = fs::recursive_directory_iterator(at(kUserBundle), error);
              !error && it != fs::recursive_directory_iterator(); it.increment(error)) {
             if (it->is_regular_file()) {
-                files[fs::relative(it->path(), at(kUserBundle)).string()] = readFile(it->path());
+                files[fs::relative(it->path(), at(kUserBundle)).string()] = readText(it->path());
             }
         }
         return files;
@@ -319,18 +223,6 @@ class OverTheAirUpdateTest : public BusFixture {
         return count;
     }
 
-    bool waitForLogLinesContaining(const std::string& text, int count,
-                                   std::chrono::milliseconds timeout = 30s) const {
-        const auto deadline = std::chrono::steady_clock::now() + timeout;
-        while (countLogLinesContaining(text) < count) {
-            if (std::chrono::steady_clock::now() > deadline) {
-                return false;
-            }
-            std::this_thread::sleep_for(20ms);
-        }
-        return true;
-    }
-
     // The version of the bundle the bundle link points at, or empty.
     std::string linkedVersion() {
         auto info = plist::readFile((at(kBundleLink) / "Info.plist").string());
@@ -363,7 +255,16 @@ class OverTheAirUpdateTest : public BusFixture {
         arguments.push_back("--json");
         CommandResult run = runCommand(arguments);
         EXPECT_EQ(run.status, expectedStatus) << run.output;
-        std::optional<plist::Value> answer = JsonReader(run.output).read();
+        // Python's strict parser: malformed output or trailing text fails.
+        const fs::path answerFile = device().base() / "answer.json";
+        writeText(answerFile, run.output);
+        CommandResult converted =
+            runCommand({"/usr/bin/python3", "-c",
+                        "import json,plistlib,sys; "
+                        "sys.stdout.write(plistlib.dumps(json.load(open(sys.argv[1]))).decode())",
+                        answerFile.string()});
+        std::optional<plist::Value> answer =
+            converted.status == 0 ? plist::parse(converted.output) : std::nullopt;
         EXPECT_TRUE(answer && answer->asDictionary() != nullptr) << run.output;
         return answer && answer->asDictionary() ? *answer->asDictionary() : plist::Dictionary();
     }
@@ -403,7 +304,7 @@ TEST_F(OverTheAirUpdateTest, NewerPublishedBundleIsInstalledLinkedAndAnnounced) 
 
     const std::string archive = publish("2");
     test::LocalHttpServer::Response held;
-    held.body = readFile(published(archive));
+    held.body = readText(published(archive));
     held.holdAfterBodyBytes = held.body.size() / 2;
     server.serve(archive, held);
     // As an operator asks for it: tavrixctl waits for the installed bundle's announcement. A
@@ -466,9 +367,9 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
     EXPECT_EQ(textAt(status, {"LastCheck", "Outcome"}), "installed");
 
     publish("3");
-    std::string signature = readFile(site() / "catalog.plist.sig");
+    std::string signature = readText(site() / "catalog.plist.sig");
     signature[0] = static_cast<char>(signature[0] ^ 1);
-    writeFile(site() / "catalog.plist.sig", signature);
+    writeText(site() / "catalog.plist.sig", signature);
     check = tavrixctlJson({"check-update"}, 1);
     EXPECT_EQ(textAt(check, {"outcome"}), "catalog-refused");
     EXPECT_TRUE(textAt(check, {"reason"}).starts_with("catalog refused: bad signature: "))
@@ -496,8 +397,8 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
 
 // Each way an update can go wrong leaves the linked bundle and its files as they were, posts
 // nothing and leaves no download behind; a download that started and failed re-arms the check a
-// day ahead, a refused catalog (expired, replayed, unsigned) or an asset held back by its rollout
-// starts nothing. A good update afterwards still installs.
+// day ahead, a refused catalog or an asset held back by its rollout starts nothing. A good update
+// afterwards still installs.
 TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheDaemonKeepsServing) {
     setIDWithBundle("1");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
@@ -515,9 +416,9 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheDaemonKeepsServing)
         {"archive changed on the server",
          [&] {
              fs::path archive = published(publish("2"));
-             std::string bytes = readFile(archive);
+             std::string bytes = readText(archive);
              bytes[bytes.size() / 2] = static_cast<char>(bytes[bytes.size() / 2] ^ 0x55);
-             writeFile(archive, bytes);
+             writeText(archive, bytes);
          },
          true, "the archive's SHA-256 is"},
         {"expired catalog",
@@ -528,37 +429,11 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheDaemonKeepsServing)
              });
          },
          false, ": expired: "},
-        {"older catalog replayed",
-         [&] {
-             publish("2");
-             const std::string older = readFile(site() / "catalog.plist");
-             const std::string olderSignature = readFile(site() / "catalog.plist.sig");
-             publish("1");
-             EXPECT_FALSE(client().checkForTavrixBundleUpdate()) << "a newer catalog, seen";
-             writeFile(site() / "catalog.plist", older);
-             writeFile(site() / "catalog.plist.sig", olderSignature);
-         },
-         false, ": rollback: "},
-        {"no trusted key",
-         [&] {
-             publish("2");
-             writeCatalogSettings(false);
-         },
-         false, ": unsigned not allowed: "},
         {"outside a rollout at 0%",
          [&] {
              publish("2", 0, {"--rollout", "0"});
          },
          false, "outside the rollout of 2 (0%)"},
-        {"connection cut in the middle of the archive",
-         [&] {
-             std::string path = publish("2");
-             test::LocalHttpServer::Response cut;
-             cut.body = readFile(published(path));
-             cut.cutAfterBodyBytes = cut.body.size() / 2;
-             server.serve(path, cut);
-         },
-         true, "cannot download"},
     };
 
     int failedDownloads = 0;
@@ -567,7 +442,7 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheDaemonKeepsServing)
         // Whole seconds: that is what a stored date keeps.
         const double armed = std::floor(now() + 3 * kOneDay);
         setNextUpdate(armed);
-        writeCatalogSettings(true);
+        writeCatalogSettings();
         c.arrange();
         const int refusals = countLogLinesContaining(c.logged);
         EXPECT_EQ(client().checkForTavrixBundleUpdate(), c.started);
@@ -587,7 +462,7 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheDaemonKeepsServing)
         EXPECT_TRUE(client().isTavrixBundleSupported());
     }
 
-    writeCatalogSettings(true);
+    writeCatalogSettings();
     publish("3", 0, {"--rollout", "100"});
     EXPECT_TRUE(client().checkForTavrixBundleUpdate());
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 2, 30s));
@@ -605,7 +480,7 @@ TEST_F(OverTheAirUpdateTest, CheckAnsweredWhileTheDaemonLeavesIsInstalledBeforeI
 
     publish("2");
     test::LocalHttpServer::Response held;
-    held.body = readFile(site() / "catalog.plist");
+    held.body = readText(site() / "catalog.plist");
     held.holdAfterBodyBytes = held.body.size() / 2;
     server.serve("/updates/catalog.plist", held);
     auto answer =
@@ -752,7 +627,7 @@ TEST_F(OverTheAirKeepAliveTest, ScheduledCheckKeepsTheDaemonUntilTheDownloadIsIn
 
     const std::string archive = publish("2");
     test::LocalHttpServer::Response held;
-    held.body = readFile(published(archive));
+    held.body = readText(published(archive));
     held.holdAfterBodyBytes = held.body.size() / 3;
     server.serve(archive, held);
 
@@ -792,6 +667,9 @@ TEST_F(OverTheAirKeepAliveTest, ScheduledCheckKeepsTheDaemonUntilTheDownloadIsIn
     EXPECT_TRUE(waitForNextUpdateIn(kFifteenDays));
     EXPECT_EQ(waitForDaemonExit(*second), std::optional<int>(0));
     EXPECT_EQ(device().keepAliveFlag(), std::optional<std::string>("0"));
+    // Start-up also found "NextUpdate" past and re-armed the job; the check still ran once.
+    EXPECT_EQ(countLogLines("*********** Beginning Corvex transaction : Update Check ***********"),
+              1);
 }
 
 }  // namespace

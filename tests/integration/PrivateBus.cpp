@@ -1,9 +1,9 @@
 #include "PrivateBus.h"
 
-#include <fstream>
 #include <map>
 #include <sstream>
-#include <stdexcept>
+
+#include "TestSupport.h"
 
 extern char** environ;
 
@@ -11,19 +11,6 @@ namespace tavrix::integration {
 namespace {
 
 namespace fs = std::filesystem;
-
-std::string readWholeFile(const fs::path& path) {
-    std::ifstream in(path, std::fstream::binary);
-    return std::string(std::istreambuf_iterator<char>(in), {});
-}
-
-void writeWholeFile(const fs::path& path, const std::string& text) {
-    std::ofstream out(path, std::fstream::binary | std::fstream::trunc);
-    out << text;
-    if (!out.flush()) {
-        throw std::runtime_error("cannot write " + path.string());
-    }
-}
 
 std::string quoted(const fs::path& path) {
     return "'" + path.string() + "'";
@@ -45,14 +32,6 @@ constexpr const char* kSystemDefaultPolicy = R"(  <policy context="default">
     <allow send_destination="org.freedesktop.DBus" send_interface="org.freedesktop.DBus"/>
     <allow send_destination="org.freedesktop.DBus"
            send_interface="org.freedesktop.DBus.Introspectable"/>
-  </policy>
-)";
-
-// The rules of a session bus: everything may be owned, sent and received.
-constexpr const char* kOpenPolicy = R"(  <policy context="default">
-    <allow send_destination="*" eavesdrop="true"/>
-    <allow eavesdrop="true"/>
-    <allow own="*"/>
   </policy>
 )";
 
@@ -89,42 +68,32 @@ void PrivateBus::writeConfiguration(const DeviceRoot& device, const BusOptions& 
     // The daemon runs as a child of this script rather than in its place, so that its exit
     // status is recorded: the bus only ever sees the script's.
     const fs::path launcher = directory_ / "launch-daemon";
-    writeWholeFile(launcher,
-                   "#!/bin/sh\n"
-                   "/usr/bin/env TAVRIX_ROOT=" +
-                       quoted(device.root()) + " TAVRIX_LOG_STDERR=1 TAVRIX_IDLE_EXIT_SEC=" +
-                       std::to_string(options.idleExitSeconds) +
-                       " RUNTIME_DIRECTORY=" + quoted(device.runtimeDirectory()) + " " +
-                       quoted(TAVRIX_DAEMON_PATH) + " >>" + quoted(logPath_) + " 2>&1 &\n" +
-                       "daemon=$!\n"
-                       "echo \"started $daemon\" >>" +
-                       quoted(launchesPath_) + "\n" +
-                       "wait \"$daemon\"\n"
-                       "echo \"exited $daemon $?\" >>" +
-                       quoted(launchesPath_) + "\n");
+    test::writeText(launcher,
+                    "#!/bin/sh\n"
+                    "/usr/bin/env TAVRIX_ROOT=" +
+                        quoted(device.root()) + " TAVRIX_LOG_STDERR=1 TAVRIX_IDLE_EXIT_SEC=" +
+                        std::to_string(options.idleExitSeconds) +
+                        " RUNTIME_DIRECTORY=" + quoted(device.runtimeDirectory()) + " " +
+                        quoted(TAVRIX_DAEMON_PATH) + " >>" + quoted(logPath_) + " 2>&1 &\n" +
+                        "daemon=$!\n"
+                        "echo \"started $daemon\" >>" +
+                        quoted(launchesPath_) + "\n" +
+                        "wait \"$daemon\"\n"
+                        "echo \"exited $daemon $?\" >>" +
+                        quoted(launchesPath_) + "\n");
 
-    writeWholeFile(directory_ / "services" / "com.zandor.tavrixservicesd.service",
-                   "[D-BUS Service]\n"
-                   "Name=com.zandor.tavrixservicesd\n"
-                   "Exec=/bin/sh " +
-                       launcher.string() + "\n");
+    test::writeText(directory_ / "services" / "com.zandor.tavrixservicesd.service",
+                    "[D-BUS Service]\n"
+                    "Name=com.zandor.tavrixservicesd\n"
+                    "Exec=/bin/sh " +
+                        launcher.string() + "\n");
 
-    std::string policy = kOpenPolicy;
-    if (options.policyFile) {
-        policy = std::string(kSystemDefaultPolicy) + "  <include>" + options.policyFile->string() +
-                 "</include>\n";
-    }
-    writeWholeFile(directory_ / "bus.conf",
-                   "<!DOCTYPE busconfig PUBLIC \"-//freedesktop//DTD D-Bus Bus Configuration "
-                   "1.0//EN\"\n \"http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd\">\n"
-                   "<busconfig>\n"
-                   "  <type>session</type>\n"
-                   "  <listen>unix:path=" +
-                       (directory_ / "socket").string() + "</listen>\n" +
-                       "  <auth>EXTERNAL</auth>\n"
-                       "  <servicedir>" +
-                       (directory_ / "services").string() + "</servicedir>\n" + policy +
-                       "</busconfig>\n");
+    const std::string policy = options.policyFile
+                                   ? std::string(kSystemDefaultPolicy) + "  <include>" +
+                                         options.policyFile->string() + "</include>\n"
+                                   : std::string(test::kOpenBusPolicy);
+    test::writeBusConfiguration(directory_, "  <servicedir>" + (directory_ / "services").string() +
+                                                "</servicedir>\n" + policy);
 }
 
 void PrivateBus::start() {
@@ -136,13 +105,13 @@ void PrivateBus::stop() {
 }
 
 std::string PrivateBus::log() const {
-    return readWholeFile(logPath_);
+    return test::readText(logPath_);
 }
 
 std::vector<DaemonLaunch> PrivateBus::launches() const {
     std::vector<DaemonLaunch> result;
     std::map<pid_t, std::size_t> indexOfPid;
-    std::istringstream lines(readWholeFile(launchesPath_));
+    std::istringstream lines(test::readText(launchesPath_));
     std::string what;
     pid_t pid = -1;
     while (lines >> what >> pid) {

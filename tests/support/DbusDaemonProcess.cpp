@@ -74,6 +74,20 @@ std::string readLog(const std::filesystem::path& path) {
 
 }  // namespace
 
+std::filesystem::path writeBusConfiguration(const std::filesystem::path& directory,
+                                            const std::string& extra) {
+    const std::filesystem::path path = directory / "bus.conf";
+    std::ofstream(path, std::ofstream::binary | std::ofstream::trunc)
+        << "<!DOCTYPE busconfig PUBLIC \"-//freedesktop//DTD D-Bus Bus Configuration 1.0//EN\"\n"
+           " \"http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd\">\n"
+           "<busconfig>\n"
+           "  <type>session</type>\n"
+           "  <listen>unix:path="
+        << (directory / "socket").string() << "</listen>\n  <auth>EXTERNAL</auth>\n"
+        << extra << "</busconfig>\n";
+    return path;
+}
+
 DbusDaemonProcess::DbusDaemonProcess(const std::filesystem::path& configFile,
                                      const std::filesystem::path& logFile,
                                      const std::optional<std::vector<std::string>>& environment) {

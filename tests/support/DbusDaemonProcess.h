@@ -13,6 +13,19 @@
 
 namespace tavrix::test {
 
+// Writes directory/bus.conf for a bus listening on directory/socket, with extra (policies,
+// service directories) inside; answers the file's path.
+std::filesystem::path writeBusConfiguration(const std::filesystem::path& directory,
+                                            const std::string& extra);
+
+// The rules of a session bus: everything may be owned, sent and received.
+inline constexpr const char* kOpenBusPolicy = R"(  <policy context="default">
+    <allow send_destination="*" eavesdrop="true"/>
+    <allow eavesdrop="true"/>
+    <allow own="*"/>
+  </policy>
+)";
+
 class DbusDaemonProcess {
   public:
     // environment: the bus's whole environment; without one it inherits the test's. Throws

@@ -589,7 +589,9 @@ TEST_F(AssetCatalogTest, FailedDownloadsReportFailureAndLeaveNothingBehind) {
 
 // Archives from the network that could reach outside the cache, or that unpack to far more than
 // they weigh, are refused whole by the real binding: the download fails with one line saying why,
-// nothing is written outside, and no local URL is ever offered.
+// nothing is written outside, and no local URL is ever offered. Each entry kind the extraction
+// refuses is covered where extraction is tested; here, that the binding asks for path-safe
+// extraction with its own settings' limits.
 TEST_F(AssetCatalogTest, HostileArchivesAreRefusedWholeAndNeverComplete) {
     const std::string outside = work / "outside";
     writeText(outside + "/secret", "secret");
@@ -610,20 +612,6 @@ TEST_F(AssetCatalogTest, HostileArchivesAreRefusedWholeAndNeverComplete) {
          {test::symlinkItem("escape", outside), test::fileItem("escape/planted", "p")},
          "leads outside",
          small},
-        {"climbing symlink",
-         {test::directoryItem("a/b"), test::symlinkItem("a/b/up", "../../../../outside")},
-         "leads outside",
-         small},
-        {"chain of symlinks",
-         {test::symlinkItem("self", "."), test::symlinkItem("up", "self/.."),
-          test::fileItem("up/planted", "p")},
-         "leads outside",
-         small},
-        {"hard link",
-         {test::fileItem("a", "a"), test::hardlinkItem("b", "a")},
-         "hard links",
-         small},
-        {"fifo", {test::fifoItem("pipe")}, "only regular files", small},
         {"gzip bomb",
          {test::fileItem("bomb", std::string(4u << 20, '\0'))},
          "more than 1048576 bytes",

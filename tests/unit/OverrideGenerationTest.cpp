@@ -1,4 +1,3 @@
-#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
@@ -24,8 +23,6 @@ namespace fs = std::filesystem;
 using plist::Array;
 using plist::Dictionary;
 using plist::Value;
-using ::testing::ElementsAre;
-using ::testing::IsSupersetOf;
 
 // A device in the test's own root with one system bundle (version 1.0) whose base carrier file
 // lists behavior overrides for "ABC".
@@ -109,14 +106,6 @@ TEST_F(OverrideGenerationTest, BehaviorOverlayIsWrittenOnceWithoutItsSection) {
 
     const std::string written = overlayFile("id+behavior+Default.bundle+abc+1.0.plist");
     EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kOverrideBundleSuccess);
-    EXPECT_THAT(
-        sink.messages(),
-        ElementsAre("Loading carrier file " + baseFile() + "\n", "Overlay key: 'abc'\n",
-                    "Overridden filename prefix: id+behavior+Default.bundle+abc\n",
-                    "Current carrier file path name: " + baseFile() + "\n",
-                    "Overridden file does not exist\n",
-                    "The overridden file was successfully written to " + written + "\n",
-                    "Resetting bundle object\n", "Successfully generated the carrier plist\n"));
     EXPECT_EQ(record.carrierFilePath, written);
     EXPECT_EQ(record.overlayType, kBehaviorOverlay);
     EXPECT_EQ(record.bundlePath, bundle());
@@ -130,11 +119,7 @@ TEST_F(OverrideGenerationTest, BehaviorOverlayIsWrittenOnceWithoutItsSection) {
     changed.insert_or_assign("Name", "Changed");
     writeBundle(Value(changed));
     CarrierBundle again = baseBundle();
-    sink.clear();
     EXPECT_EQ(applyMultimodeOverlay(again, std::string("abc")), kOverrideBundleSuccess);
-    EXPECT_TRUE(
-        sink.contains("Overridden file " + written + " already exists, not generating again\n"));
-    EXPECT_FALSE(sink.contains("Overridden file does not exist\n"));
     EXPECT_EQ(again.carrierFilePath, written);
     EXPECT_EQ(again.overlayType, kBehaviorOverlay);
     FileIdentity after = identityOf(written);
@@ -150,18 +135,11 @@ TEST_F(OverrideGenerationTest, WithoutAMatchTheRecordKeepsTheBaseFile) {
     CarrierBundle record = baseBundle();
 
     EXPECT_EQ(applyMultimodeOverlay(record, std::string("xyz")), kNoMatchForOverlay);
-    EXPECT_TRUE(sink.contains("No match for overlay\n"));
     EXPECT_EQ(applyMultimodeOverlay(record, std::string("")), kOverrideNotRequired);
     EXPECT_EQ(applyMultimodeOverlay(record, std::nullopt), kOverrideNotRequired);
 
     writeBundle(Value(Dictionary{{"Name", "Base"}}));
-    sink.clear();
     EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kOverrideNotRequired);
-    EXPECT_THAT(sink.messages(),
-                ElementsAre("Loading carrier file " + baseFile() + "\n",
-                            "There are no behavior overrides in the base bundle\n",
-                            "There is no merged allowed Behavior overlay configuration\n",
-                            "Failed to get overlay matching key, marking override not required\n"));
     EXPECT_EQ(record.carrierFilePath, baseFile());
     EXPECT_EQ(record.overlayType, kNoOverlay);
     EXPECT_FALSE(fs::exists(home() + "/Library/TavrixBundles/Overlay"));
@@ -179,12 +157,6 @@ TEST_F(OverrideGenerationTest, DeviceOverlayKeepsTheSectionAndTheBehaviorOverlay
     CarrierBundle record;
     EXPECT_EQ(makeDeviceOverlayDecision(record, std::string("ignored")), kOverrideBundleSuccess);
     const std::string deviceFile = overlayFile("device+behavior+Default.bundle+T12AP+1.0.plist");
-    EXPECT_THAT(sink.messages(),
-                IsSupersetOf({std::string("Overlay key: 'T12AP'\n"),
-                              std::string("Found a file with the prefix matching: "
-                                          "overrides_T12.plist\n"),
-                              std::string("Found match, file overrides_X1_T12AP.plist contains "
-                                          "this device's specific carrier plist\n")}));
     EXPECT_EQ(record.carrierFilePath, deviceFile);
     EXPECT_EQ(record.overlayType, kDeviceOverlay);
     Dictionary deviceCarrier = baseCarrier();
@@ -192,12 +164,9 @@ TEST_F(OverrideGenerationTest, DeviceOverlayKeepsTheSectionAndTheBehaviorOverlay
     EXPECT_EQ(plist::readFile(deviceFile), Value(deviceCarrier));
 
     // The behavior overlay reads the device file and keeps the model in its name.
-    sink.clear();
     EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kOverrideBundleSuccess);
     const std::string bothFile =
         overlayFile("device+id+behavior+Default.bundle+abc+T12AP+1.0.plist");
-    EXPECT_TRUE(sink.contains("Adding the extra identifier T12AP to the file name\n"));
-    EXPECT_TRUE(sink.contains("Overridden carrier file path name: " + bothFile + "\n"));
     EXPECT_EQ(record.carrierFilePath, bothFile);
     EXPECT_EQ(record.overlayType, kDeviceBehaviorOverlay);
     EXPECT_EQ(plist::readFile(bothFile), Value(Dictionary{{"Name", "Abc"}, {"Model", "T12AP"}}));
@@ -209,7 +178,6 @@ TEST_F(OverrideGenerationTest, WithoutADeviceFileTheBaseBundleIsLeftInTheRecord)
     CarrierBundle record;
     record.carrierFilePath = "/stale";
     EXPECT_EQ(makeDeviceOverlayDecision(record, std::nullopt), kNoMatchForOverlay);
-    EXPECT_TRUE(sink.contains("No device specific overlay file name found in the base bundle\n"));
     EXPECT_EQ(record.bundlePath, bundle());
     EXPECT_EQ(record.carrierFilePath, baseFile());
     EXPECT_EQ(record.overlayType, kNoOverlay);
@@ -220,28 +188,20 @@ TEST_F(OverrideGenerationTest, AnUnknownModelNeedsNoOverride) {
     writeBundle(Value(baseCarrier()));
     CarrierBundle record;
     EXPECT_EQ(makeDeviceOverlayDecision(record, std::nullopt), kOverrideNotRequired);
-    EXPECT_TRUE(sink.contains("Model name is empty\n"));
-    EXPECT_TRUE(
-        sink.contains("Failed to get overlay matching key, marking override not required\n"));
     EXPECT_EQ(record.carrierFilePath, baseFile());
 }
 
 TEST_F(OverrideGenerationTest, AnUnreadableBaseMeansNoCarrierInfo) {
     writeDevice("T12AP");
-    const std::string noInfo =
-        "Failed to load the base bundle carrier file itself, carrier info not present\n";
     // No bundle at all: the empty carrier path cannot be loaded.
     CarrierBundle record;
     EXPECT_EQ(makeDeviceOverlayDecision(record, std::nullopt), kCarrierInfoNotPresent);
-    EXPECT_TRUE(sink.contains("Failed to find a bundle\n"));
-    EXPECT_TRUE(sink.contains(noInfo));
     EXPECT_TRUE(record.bundlePath.empty());
 
     // A base carrier file that holds no dictionary.
     writeBundle(Value(Array{"ABC"}));
     record = baseBundle();
     EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kCarrierInfoNotPresent);
-    EXPECT_THAT(sink.messages(), ElementsAre("Loading carrier file " + baseFile() + "\n", noInfo));
     EXPECT_EQ(record.carrierFilePath, baseFile());
 }
 
@@ -272,18 +232,13 @@ TEST_F(OverrideGenerationTest, EveryBehaviorIDGetsItsOwnFileInsideTheOverlayDire
     EXPECT_FALSE(fs::exists(home() + "/Library/escape+1.0.plist"));
 
     CarrierBundle record = baseBundle();
-    sink.clear();
     EXPECT_EQ(applyMultimodeOverlay(record, tooLong), kOverrideBundleFailure);
-    EXPECT_TRUE(sink.contains("Failed to create the file URL\n"));
     EXPECT_EQ(record.carrierFilePath, baseFile());
 
     // A file where the Overlay directory belongs.
     fs::remove_all(home() + "/Library/TavrixBundles/Overlay");
     test::writeText(home() + "/Library/TavrixBundles/Overlay", "in the way");
-    sink.clear();
     EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kOverrideBundleFailure);
-    EXPECT_TRUE(
-        sink.contains("Failed to write the overridden carrier bundle with error code: 20\n"));
     EXPECT_EQ(record.carrierFilePath, baseFile());
     EXPECT_EQ(record.overlayType, kNoOverlay);
 }

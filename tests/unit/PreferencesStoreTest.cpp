@@ -326,20 +326,6 @@ class BehaviorPreferencesTest : public testing::Test {
     platform::ScopedLogSink guard{sink};
 };
 
-TEST_F(BehaviorPreferencesTest, SetValueIsOnDiskForAFreshProcess) {
-    ASSERT_TRUE(setBehaviorPreference(kTavrixIDKey, Value("abc")));
-    EXPECT_EQ(copyBehaviorPreference(kTavrixIDKey), Value("abc"));
-
-    pid_t reader = startChild(
-        [] { return readFresh("TavrixID", "com.zandor.tavrixservices") == Value("abc"); });
-    EXPECT_EQ(waitChild(reader), 0);
-    auto stored = plist::readFile(domainPath("com.zandor.tavrixservices"));
-    ASSERT_TRUE(stored);
-    ASSERT_NE(stored->find("TavrixID"), nullptr);
-    EXPECT_EQ(*stored->find("TavrixID"), Value("abc"));
-    EXPECT_TRUE(sink.messages().empty());
-}
-
 TEST_F(BehaviorPreferencesTest, KeysKeepTheirTypesAndNothingRemoves) {
     Value next(plist::Date::fromUnixTime(1700000000));
     ASSERT_TRUE(setBehaviorPreference(kNextUpdateKey, next));

@@ -15,24 +15,9 @@ namespace tavrix::test {
 class PrivateBusDaemon {
   public:
     PrivateBusDaemon() {
-        const std::string config = directory_ / "bus.conf";
-        writeText(config,
-                  "<!DOCTYPE busconfig PUBLIC \"-//freedesktop//DTD D-Bus Bus Configuration "
-                  "1.0//EN\" \"http://www.freedesktop.org/standards/dbus/1.0/busconfig.dtd\">\n"
-                  "<busconfig>\n"
-                  "  <type>session</type>\n"
-                  "  <listen>unix:path=" +
-                      (directory_ / "socket") +
-                      "</listen>\n"
-                      "  <auth>EXTERNAL</auth>\n"
-                      "  <policy context=\"default\">\n"
-                      "    <allow send_destination=\"*\" eavesdrop=\"true\"/>\n"
-                      "    <allow eavesdrop=\"true\"/>\n"
-                      "    <allow own=\"*\"/>\n"
-                      "  </policy>\n"
-                      "</busconfig>\n");
         // Its complaints (it cannot raise its descriptor limit unprivileged) go beside the socket.
-        process_.emplace(config, directory_ / "daemon.log");
+        process_.emplace(writeBusConfiguration(directory_.path(), kOpenBusPolicy),
+                         directory_ / "daemon.log");
     }
     PrivateBusDaemon(const PrivateBusDaemon&) = delete;
     PrivateBusDaemon& operator=(const PrivateBusDaemon&) = delete;

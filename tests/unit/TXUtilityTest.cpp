@@ -58,15 +58,6 @@ TEST(TXUtilityFacts, RadioCapabilitiesFollowTheTable) {
     EXPECT_FALSE(TXUtility::isWiFiCapable());
 }
 
-TEST(TXUtilityFacts, TaskQueueIsOneLabelledQueue) {
-    SerialQueue& queue = TXUtility::taskQueue();
-    EXPECT_EQ(&queue, &TXUtility::taskQueue());
-    EXPECT_EQ(queue.label(), "com.zandor.tavrixservices.operationTaskQueue");
-    bool ran = false;
-    EXPECT_TRUE(queue.dispatchSync([&] { ran = true; }));
-    EXPECT_TRUE(ran);
-}
-
 TEST(TXUtilityDiskSpace, NeedsStrictlyMoreFreeBytesThanAsked) {
     EXPECT_FALSE(TXUtility::freeSpaceExceeds(4096, 10, 40960));
     EXPECT_TRUE(TXUtility::freeSpaceExceeds(4096, 10, 40959));

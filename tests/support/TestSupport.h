@@ -1,9 +1,11 @@
-// Shared helpers for the unit tests: temporary directories and small file helpers.
+// Shared helpers for the tests: temporary directories and small file helpers.
 #pragma once
 
+#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <map>
+#include <stdexcept>
 #include <string>
 
 namespace tavrix::test {
