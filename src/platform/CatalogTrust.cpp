@@ -1,25 +1,19 @@
 #include "platform/CatalogTrust.h"
 
-#include <sys/stat.h>
-
 #include <ctime>
 
-#include "payload/FileSystemUtilities.h"
-#include "platform/AtomicFile.h"
-#include "platform/PlatformRoot.h"
+#include "platform/DaemonStateFile.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix::platform {
 namespace {
 
-constexpr const char* kSerialFilePrefix = "/catalog-serial-";
+constexpr const char* kSerialFilePrefix = "catalog-serial-";
 constexpr const char* kHighestSerialKey = "HighestSerial";
-constexpr mode_t kStateDirectoryMode = 0755;
 constexpr std::size_t kDefaultIdentifierLength = 16;
 
-std::string serialFilePath(std::string_view assetType) {
-    return resolvePath(kDaemonStateDirectory) + kSerialFilePrefix + std::string(assetType) +
-           ".plist";
+std::string serialFileName(std::string_view assetType) {
+    return kSerialFilePrefix + std::string(assetType) + ".plist";
 }
 
 }  // namespace
@@ -113,7 +107,8 @@ bool checkFreshness(const CatalogMetadata& metadata, plist::Date now,
 }
 
 std::optional<std::int64_t> readAcceptedSerial(std::string_view assetType) {
-    std::optional<plist::Value> stored = plist::readFile(serialFilePath(assetType));
+    std::optional<plist::Value> stored =
+        plist::readFile(daemonStateFilePath(serialFileName(assetType)));
     const plist::Value* serial = stored ? stored->find(kHighestSerialKey) : nullptr;
     const plist::Integer* number = serial != nullptr ? serial->asInteger() : nullptr;
     if (number == nullptr || number->isLargeUnsigned()) {
@@ -123,16 +118,9 @@ std::optional<std::int64_t> readAcceptedSerial(std::string_view assetType) {
 }
 
 int recordAcceptedSerial(std::string_view assetType, std::int64_t serial) {
-    int error =
-        payload::createDirectoryAt(resolvePath(kDaemonStateDirectory), kStateDirectoryMode, true);
-    if (error != 0) {
-        return error;
-    }
-    std::string bytes = plist::serialize(
-        plist::Value(
-            plist::Dictionary{{kHighestSerialKey, plist::Value(static_cast<long long>(serial))}}),
-        plist::Format::Xml);
-    return replaceFileAtomically(serialFilePath(assetType), bytes, 0644);
+    const plist::Value record(
+        plist::Dictionary{{kHighestSerialKey, plist::Value(static_cast<long long>(serial))}});
+    return writeDaemonStateFile(serialFileName(assetType), record, plist::Format::Xml, 0644);
 }
 
 }  // namespace tavrix::platform

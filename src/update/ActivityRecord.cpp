@@ -3,10 +3,8 @@
 #include <cstring>
 #include <mutex>
 
-#include "payload/FileSystemUtilities.h"
-#include "platform/AtomicFile.h"
 #include "platform/Clock.h"
-#include "platform/PlatformRoot.h"
+#include "platform/DaemonStateFile.h"
 #include "plist/PropertyListFormat.h"
 #include "util/Log.h"
 
@@ -14,7 +12,6 @@ namespace tavrix {
 namespace {
 
 constexpr const char* kRecordFileName = "activity.plist";
-constexpr mode_t kStateDirectoryMode = 0755;
 constexpr mode_t kRecordMode = 0644;
 
 // The main thread (payloads, checks a client asks for) and the download thread both write.
@@ -37,15 +34,10 @@ void replaceEntry(const char* key, plist::Dictionary entry) {
     std::lock_guard lock(recordLock());
     plist::Dictionary record = readRecordLocked();
     record.insert_or_assign(key, plist::Value(std::move(entry)));
-    const std::string directory = platform::resolvePath(platform::kDaemonStateDirectory);
-    int error = payload::createDirectoryAt(directory, kStateDirectoryMode, true);
-    if (error == 0) {
-        // Binary keeps the fraction of a second, so two checks within a second stay apart.
-        error = platform::replaceFileAtomically(
-            activityRecordPath(), plist::serialize(plist::Value(record), plist::Format::Binary),
-            kRecordMode);
-    }
-    if (error != 0) {
+    // Binary keeps the fraction of a second, so two checks within a second stay apart.
+    if (int error = platform::writeDaemonStateFile(kRecordFileName, plist::Value(std::move(record)),
+                                                   plist::Format::Binary, kRecordMode);
+        error != 0) {
         logCFormat("Could not record the %s in %s: %s\n", key, activityRecordPath().c_str(),
                    std::strerror(error));
     }
@@ -54,7 +46,7 @@ void replaceEntry(const char* key, plist::Dictionary entry) {
 }  // namespace
 
 std::string activityRecordPath() {
-    return platform::resolvePath(platform::kDaemonStateDirectory) + "/" + kRecordFileName;
+    return platform::daemonStateFilePath(kRecordFileName);
 }
 
 void recordUpdateCheck(const std::string& outcome, const std::string& reason) {

@@ -4,8 +4,7 @@
 #include <cstring>
 
 #include "payload/FileSystemUtilities.h"
-#include "platform/AtomicFile.h"
-#include "platform/PlatformRoot.h"
+#include "platform/DaemonStateFile.h"
 #include "plist/PropertyListFormat.h"
 #include "util/Log.h"
 
@@ -15,27 +14,21 @@ namespace {
 constexpr const char* kMarkerFileName = "pending-install.plist";
 constexpr const char* kAssetDirectoryKey = "AssetDirectory";
 constexpr const char* kInstalledKey = "Installed";
-constexpr mode_t kStateDirectoryMode = 0755;
 constexpr mode_t kMarkerMode = 0600;
 
 }  // namespace
 
 std::string pendingInstallMarkerPath() {
-    return platform::resolvePath(platform::kDaemonStateDirectory) + "/" + kMarkerFileName;
+    return platform::daemonStateFilePath(kMarkerFileName);
 }
 
 bool writePendingInstall(const PendingInstall& install) {
     const std::string& assetDirectory = install.assetDirectory;
-    const std::string directory = platform::resolvePath(platform::kDaemonStateDirectory);
-    int error = payload::createDirectoryAt(directory, kStateDirectoryMode, true);
-    if (error == 0) {
-        const std::string xml = plist::serialize(
-            plist::Value(plist::Dictionary{{kAssetDirectoryKey, plist::Value(assetDirectory)},
-                                           {kInstalledKey, plist::Value(install.installed)}}),
-            plist::Format::Xml);
-        error = platform::replaceFileAtomically(pendingInstallMarkerPath(), xml, kMarkerMode);
-    }
-    if (error != 0) {
+    const plist::Value record(plist::Dictionary{{kAssetDirectoryKey, plist::Value(assetDirectory)},
+                                                {kInstalledKey, plist::Value(install.installed)}});
+    if (int error = platform::writeDaemonStateFile(kMarkerFileName, record, plist::Format::Xml,
+                                                   kMarkerMode);
+        error != 0) {
         logCFormat("Could not record the install of %s: %s\n", assetDirectory.c_str(),
                    std::strerror(error));
         return false;

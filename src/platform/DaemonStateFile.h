@@ -1,0 +1,22 @@
+// Files of the daemon's own durable state (the install record, the activity record, accepted
+// catalog serials) under the state directory, each written complete or not at all.
+#pragma once
+
+#include <sys/types.h>
+
+#include <string>
+#include <string_view>
+
+#include "plist/PropertyListFormat.h"
+
+namespace tavrix::platform {
+
+// "<root>/var/lib/tavrixservicesd/<fileName>".
+std::string daemonStateFilePath(std::string_view fileName);
+
+// Writes value as fileName in the state directory, creating the directory when missing. 0, or
+// the errno that stopped it; the file is then as it was.
+int writeDaemonStateFile(std::string_view fileName, const plist::Value& value, plist::Format format,
+                         mode_t mode);
+
+}  // namespace tavrix::platform
