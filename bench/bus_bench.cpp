@@ -30,8 +30,8 @@
 #include <vector>
 
 #include "BenchSupport.h"
-#include "platform/BusHandles.h"
-#include "util/UniqueFd.h"
+#include "bus/BusHandles.h"
+#include "fs/UniqueFd.h"
 
 extern char** environ;
 

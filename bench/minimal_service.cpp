@@ -7,7 +7,7 @@
 #include <cstdlib>
 #include <cstring>
 
-#include "platform/BusHandles.h"
+#include "bus/BusHandles.h"
 
 using tavrix::platform::BusPtr;
 using tavrix::platform::BusSlotPtr;

@@ -10,7 +10,7 @@
 #include <string>
 
 #include "BenchSupport.h"
-#include "daemon/BehaviorPreferences.h"
+#include "device/BehaviorPreferences.h"
 #include "plist/PropertyListFormat.h"
 
 using namespace tavrix;

@@ -28,7 +28,7 @@
 #include "client/TavrixClient.h"
 #include "payload/Archive.h"
 #include "plist/PropertyListFormat.h"
-#include "util/UniqueFd.h"
+#include "fs/UniqueFd.h"
 
 using namespace tavrix;
 using bench::readBytes;

@@ -10,8 +10,8 @@
 #include <string_view>
 #include <vector>
 
-#include "catalog/CatalogPublisher.h"
-#include "catalog/CatalogVerifier.h"
+#include "publishing/CatalogPublisher.h"
+#include "publishing/CatalogVerifier.h"
 
 namespace {
 

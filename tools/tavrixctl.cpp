@@ -25,10 +25,10 @@
 #include <vector>
 
 #include "TavrixctlOutput.h"
-#include "catalog/BundleCheck.h"
+#include "publishing/BundleCheck.h"
 #include "client/TavrixClient.h"
 #include "payload/Archive.h"
-#include "util/UniqueFd.h"
+#include "fs/UniqueFd.h"
 
 namespace {
 

@@ -6,7 +6,7 @@
 #include "bundle/BundleLinks.h"
 #include "bundle/BundleManager.h"
 #include "bundle/VersionCompare.h"
-#include "payload/FileSystemHelper.h"
+#include "util/FileSystemHelper.h"
 #include "util/Log.h"
 
 namespace tavrix {

@@ -13,7 +13,7 @@
 
 #include "bundle/BundleInfo.h"
 #include "util/Log.h"
-#include "util/UniqueFd.h"
+#include "fs/UniqueFd.h"
 
 namespace tavrix {
 namespace {

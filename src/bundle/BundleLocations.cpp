@@ -1,9 +1,9 @@
 #include "bundle/BundleLocations.h"
 
-#include "payload/MobileUser.h"
-#include "platform/PlatformRoot.h"
+#include "device/MobileUser.h"
+#include "device/PlatformRoot.h"
 #include "util/Log.h"
-#include "util/TXUtility.h"
+#include "device/TXUtility.h"
 
 namespace tavrix {
 namespace {

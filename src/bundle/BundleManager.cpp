@@ -14,10 +14,10 @@
 #include "bundle/OverriddenCarrierFile.h"
 #include "bundle/OverrideGeneration.h"
 #include "bundle/VersionCompare.h"
-#include "payload/MobileUser.h"
-#include "platform/NotificationCenter.h"
-#include "platform/PreferencesStore.h"
-#include "platform/SystemLog.h"
+#include "device/MobileUser.h"
+#include "bus/NotificationCenter.h"
+#include "device/PreferencesStore.h"
+#include "util/SystemLog.h"
 #include "util/Log.h"
 
 namespace tavrix {

@@ -12,8 +12,8 @@
 
 #include "bundle/CarrierFileLoader.h"
 #include "bundle/GzipInflater.h"
-#include "platform/CurlHandles.h"
-#include "platform/SystemLog.h"
+#include "http/CurlHandles.h"
+#include "util/SystemLog.h"
 
 namespace tavrix {
 namespace {

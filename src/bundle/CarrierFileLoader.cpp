@@ -5,7 +5,7 @@
 #include <string_view>
 
 #include "util/FileURL.h"
-#include "platform/SystemLog.h"
+#include "util/SystemLog.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix {

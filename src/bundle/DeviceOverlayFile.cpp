@@ -4,7 +4,7 @@
 #include <string_view>
 #include <vector>
 
-#include "payload/FileSystemHelper.h"
+#include "util/FileSystemHelper.h"
 #include "util/Log.h"
 
 namespace tavrix {

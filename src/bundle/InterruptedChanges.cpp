@@ -8,10 +8,10 @@
 #include "bundle/BundleLocations.h"
 #include "bundle/BundleTypes.h"
 #include "bundle/OverriddenCarrierFile.h"
-#include "payload/FileSystemUtilities.h"
+#include "util/FileSystemUtilities.h"
 #include "payload/PayloadUnpack.h"
-#include "platform/AtomicFile.h"
-#include "platform/PlatformRoot.h"
+#include "fs/AtomicFile.h"
+#include "device/PlatformRoot.h"
 #include "util/Log.h"
 
 namespace tavrix {

@@ -8,9 +8,9 @@
 
 #include "bundle/BundleLinks.h"
 #include "bundle/BundleLocations.h"
-#include "payload/FileSystemHelper.h"
-#include "payload/MobileUser.h"
-#include "platform/AtomicFile.h"
+#include "util/FileSystemHelper.h"
+#include "device/MobileUser.h"
+#include "fs/AtomicFile.h"
 #include "plist/PropertyListFormat.h"
 #include "util/FileURL.h"
 #include "util/Log.h"

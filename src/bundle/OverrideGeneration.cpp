@@ -8,9 +8,9 @@
 #include "bundle/OverlayConfiguration.h"
 #include "bundle/OverlayContext.h"
 #include "bundle/OverriddenCarrierFile.h"
-#include "payload/FileSystemHelper.h"
+#include "util/FileSystemHelper.h"
 #include "util/Log.h"
-#include "util/TXUtility.h"
+#include "device/TXUtility.h"
 
 namespace tavrix {
 namespace {

@@ -6,8 +6,8 @@
 #include <exception>
 #include <utility>
 
-#include "platform/BusHandles.h"
-#include "platform/BusValueCodec.h"
+#include "bus/BusHandles.h"
+#include "bus/BusValueCodec.h"
 
 namespace tavrix::client {
 

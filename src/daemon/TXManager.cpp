@@ -3,14 +3,14 @@
 #include <mutex>
 
 #include "bundle/BundleManager.h"
-#include "daemon/BehaviorPreferences.h"
-#include "payload/MobileUser.h"
-#include "platform/PreferencesStore.h"
+#include "device/BehaviorPreferences.h"
+#include "device/MobileUser.h"
+#include "device/PreferencesStore.h"
 #include "update/ActivityRecord.h"
 #include "update/AssetHandler.h"
-#include "update/UpdateCheckScheduler.h"
+#include "daemon/UpdateCheckScheduler.h"
 #include "util/Log.h"
-#include "util/TXUtility.h"
+#include "device/TXUtility.h"
 #include "util/TextCase.h"
 
 namespace tavrix {
@@ -134,7 +134,9 @@ bool TXManager::checkForTavrixBundleUpdate() {
                           std::string("not checked: ") + bundleSupportReason(bundleSupport()));
         return false;
     }
-    return AssetHandler::downloadUpdateIfAvailable();
+    return AssetHandler::downloadUpdateIfAvailable([](double nextCheckSeconds) {
+        UpdateCheckScheduler::sharedInstance().rescheduleAndEndCheck(nextCheckSeconds);
+    });
 }
 
 }  // namespace tavrix

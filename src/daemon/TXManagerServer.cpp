@@ -11,14 +11,14 @@
 
 #include "daemon/TXManager.h"
 #include "daemon/TXManagerStatus.h"
-#include "daemon/TXTransactionManager.h"
-#include "platform/AssetCatalogService.h"
-#include "platform/NotificationCenter.h"
-#include "platform/ServiceManager.h"
-#include "update/UpdateCheckScheduler.h"
+#include "bus/TXTransactionManager.h"
+#include "catalog/AssetCatalogService.h"
+#include "bus/NotificationCenter.h"
+#include "bus/ServiceManager.h"
+#include "daemon/UpdateCheckScheduler.h"
 #include "util/ContainExceptions.h"
 #include "util/Log.h"
-#include "util/TXUtility.h"
+#include "device/TXUtility.h"
 
 namespace tavrix {
 namespace {

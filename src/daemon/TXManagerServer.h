@@ -19,8 +19,8 @@
 #include <vector>
 
 #include "daemon/TXManagerServerClient.h"
-#include "platform/BusHandles.h"
-#include "platform/ServiceListener.h"
+#include "bus/BusHandles.h"
+#include "bus/ServiceListener.h"
 #include "plist/Value.h"
 
 namespace tavrix {

@@ -7,7 +7,7 @@
 #include <optional>
 #include <string>
 
-#include "platform/BusHandles.h"
+#include "bus/BusHandles.h"
 
 namespace tavrix {
 

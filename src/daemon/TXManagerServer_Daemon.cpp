@@ -8,9 +8,9 @@
 #include <cstring>
 
 #include "daemon/TXManagerServer.h"
-#include "platform/BusValueCodec.h"
-#include "platform/NotificationCenter.h"
-#include "platform/ServiceManager.h"
+#include "bus/BusValueCodec.h"
+#include "bus/NotificationCenter.h"
+#include "bus/ServiceManager.h"
 #include "util/ContainExceptions.h"
 #include "util/Log.h"
 

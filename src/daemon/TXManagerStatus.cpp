@@ -3,10 +3,10 @@
 #include "bundle/BundleInfo.h"
 #include "bundle/BundleLocations.h"
 #include "bundle/BundleManager.h"
-#include "daemon/BehaviorPreferences.h"
+#include "device/BehaviorPreferences.h"
 #include "daemon/TXManager.h"
 #include "update/ActivityRecord.h"
-#include "update/UpdateCheckScheduler.h"
+#include "daemon/UpdateCheckScheduler.h"
 
 namespace tavrix {
 namespace {

@@ -8,7 +8,7 @@
 
 #include "daemon/TXManagerServer.h"
 #include "util/ContainExceptions.h"
-#include "util/TXUtility.h"
+#include "device/TXUtility.h"
 
 int main() {
     // The run loop takes these signals through its own sources; block them before any thread

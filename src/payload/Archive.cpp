@@ -9,11 +9,11 @@
 #include <limits>
 #include <new>
 
-#include "payload/FileSystemHelper.h"
-#include "platform/AtomicFile.h"
+#include "util/FileSystemHelper.h"
+#include "fs/AtomicFile.h"
 #include "util/FileURL.h"
 #include "util/Log.h"
-#include "util/UniqueFd.h"
+#include "fs/UniqueFd.h"
 
 namespace tavrix::payload {
 namespace {

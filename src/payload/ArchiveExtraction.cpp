@@ -12,7 +12,7 @@
 #include "payload/ArchiveEntryPolicy.h"
 #include "payload/ArchiveHandles.h"
 #include "payload/ExtractionBudget.h"
-#include "payload/FileSystemHelper.h"
+#include "util/FileSystemHelper.h"
 #include "payload/PayloadUnpack.h"
 #include "util/Log.h"
 

@@ -3,8 +3,8 @@
 #include <memory>
 #include <string>
 
-#include "platform/SharedLibrary.h"
-#include "platform/SystemLog.h"
+#include "util/SharedLibrary.h"
+#include "util/SystemLog.h"
 
 namespace tavrix::payload {
 namespace {

@@ -1,6 +1,6 @@
 #include "payload/ExtractionBudget.h"
 
-#include "payload/FileSystemUtilities.h"
+#include "util/FileSystemUtilities.h"
 
 namespace tavrix::payload {
 namespace {

@@ -1,5 +1,5 @@
 // Turning a received bundle payload into files: the staged archive file and its extraction.
-// BundleManager::installBehaviorBundleData (in PayloadUnpack.cpp) drives them.
+// BundleManager::installBehaviorBundleData (bundle/BundleInstall.cpp) drives them.
 #pragma once
 
 #include <cstdint>

@@ -17,7 +17,7 @@
 #include <vector>
 
 #include "plist/PropertyListWriter.h"
-#include "util/UniqueFd.h"
+#include "fs/UniqueFd.h"
 
 namespace tavrix::plist {
 namespace {

@@ -3,8 +3,8 @@
 #include <cstring>
 #include <mutex>
 
-#include "platform/Clock.h"
-#include "platform/DaemonStateFile.h"
+#include "util/Clock.h"
+#include "device/DaemonStateFile.h"
 #include "plist/PropertyListFormat.h"
 #include "util/Log.h"
 

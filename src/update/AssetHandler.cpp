@@ -12,17 +12,16 @@
 #include "bundle/BundleLocations.h"
 #include "bundle/BundleManager.h"
 #include "bundle/VersionCompare.h"
-#include "daemon/BehaviorPreferences.h"
-#include "payload/FileSystemHelper.h"
-#include "payload/FileSystemUtilities.h"
-#include "payload/MobileUser.h"
+#include "device/BehaviorPreferences.h"
+#include "util/FileSystemHelper.h"
+#include "util/FileSystemUtilities.h"
+#include "device/MobileUser.h"
 #include "payload/PayloadUnpack.h"
-#include "platform/SystemLog.h"
+#include "util/SystemLog.h"
 #include "update/ActivityRecord.h"
 #include "update/PendingInstall.h"
-#include "update/UpdateCheckScheduler.h"
 #include "util/Log.h"
-#include "util/TXUtility.h"
+#include "device/TXUtility.h"
 
 namespace tavrix {
 namespace {
@@ -167,7 +166,7 @@ AssetHandler::AssetPtr AssetHandler::findTheBestAsset(platform::QueryResult* res
     return best;
 }
 
-bool AssetHandler::downloadUpdateIfAvailable() {
+bool AssetHandler::downloadUpdateIfAvailable(EndCheck endCheck) {
     // Two checks would download into and purge the same cache directory, and install over each
     // other. Held until the check's download has been installed and purged.
     static std::atomic<bool> checkRunning{false};
@@ -192,19 +191,19 @@ bool AssetHandler::downloadUpdateIfAvailable() {
     recordUpdateCheck(kCheckDownloading, "downloading version " + assetVersionText(*asset));
     asset->beginDownload();
     // The handler keeps the asset alive until the catalog drops it after the last report.
-    asset->setProgressHandler([asset, running](const plist::Dictionary& progress) {
-        handleDownloadProgress(asset, progress, running);
+    asset->setProgressHandler([asset, running, endCheck](const plist::Dictionary& progress) {
+        handleDownloadProgress(asset, progress, running, endCheck);
     });
     return true;
 }
 
 void AssetHandler::handleDownloadProgress(const AssetPtr& asset, const plist::Dictionary& progress,
-                                          const std::shared_ptr<RunningCheck>& running) {
-    auto& scheduler = UpdateCheckScheduler::sharedInstance();
+                                          const std::shared_ptr<RunningCheck>& running,
+                                          const EndCheck& endCheck) {
     auto operation = progress.find(platform::kAssetProgressOperationKey);
     if (operation == progress.end()) {
         logObjectFormat("Operation is not available?");
-        scheduler.rescheduleAndEndCheck(kInstallRetryDelaySeconds);
+        endCheck(kInstallRetryDelaySeconds);
         return;
     }
     logObjectFormat("Current operation: %@", &operation->second);
@@ -218,7 +217,7 @@ void AssetHandler::handleDownloadProgress(const AssetPtr& asset, const plist::Di
             recordUpdateCheck(kCheckDownloadFailed,
                               "download failed: " + (why != nullptr ? *why : "no reason given"));
         }
-        scheduler.rescheduleAndEndCheck(kInstallRetryDelaySeconds);
+        endCheck(kInstallRetryDelaySeconds);
         if (name != nullptr && *name == platform::kAssetOperationFailed) {
             running->finish();
         }
@@ -228,7 +227,7 @@ void AssetHandler::handleDownloadProgress(const AssetPtr& asset, const plist::Di
     if (!url) {
         logObjectFormat("Local URL is not available?");
         recordUpdateCheck(kCheckDownloadFailed, "download failed: the downloaded bundle is gone");
-        scheduler.rescheduleAndEndCheck(kInstallRetryDelaySeconds);
+        endCheck(kInstallRetryDelaySeconds);
         running->finish();
         return;
     }
@@ -253,7 +252,7 @@ void AssetHandler::handleDownloadProgress(const AssetPtr& asset, const plist::Di
         logObjectFormat("Best candidate asset has been purged");
         running->finish();
     });
-    scheduler.rescheduleAndEndCheck(installed ? kInstallDoneDelaySeconds
+    endCheck(installed ? kInstallDoneDelaySeconds
                                               : kInstallRetryDelaySeconds);
 }
 

@@ -3,11 +3,12 @@
 #pragma once
 
 #include <atomic>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <vector>
 
-#include "platform/AssetCatalog.h"
+#include "catalog/AssetCatalog.h"
 #include "plist/Value.h"
 
 namespace tavrix {
@@ -42,7 +43,10 @@ class AssetHandler {
     // Starts downloading the best asset; its completion installs it as the user bundle and redoes
     // the bundle match. True when a download was started. One check at a time: while one runs
     // (until its download is installed and purged) another answers false and starts nothing.
-    static bool downloadUpdateIfAvailable();
+    // endCheck is called (on the catalog's thread) each time the download reports that the check
+    // is over for now, with the delay until the next check.
+    using EndCheck = std::function<void(double nextCheckSeconds)>;
+    static bool downloadUpdateIfAvailable(EndCheck endCheck);
 
     // Completes an install that a crash cut short, from the download still in the cache, redoes
     // the match and purges the download. For the launch, before anything else changes the bundles.
@@ -74,7 +78,8 @@ class AssetHandler {
     // What a download's progress handler does with one report (on the catalog's thread); running
     // marks the check as running for as long as it is held.
     static void handleDownloadProgress(const AssetPtr& asset, const plist::Dictionary& progress,
-                                       const std::shared_ptr<RunningCheck>& running);
+                                       const std::shared_ptr<RunningCheck>& running,
+                                       const EndCheck& endCheck);
     // Copies the downloaded bundle over the user bundle directory and redoes the bundle match.
     // False when the install was refused before the old bundle was touched, or failed.
     static bool installDownloadedBundle(const std::string& source);

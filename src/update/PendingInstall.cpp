@@ -3,8 +3,8 @@
 #include <cerrno>
 #include <cstring>
 
-#include "payload/FileSystemUtilities.h"
-#include "platform/DaemonStateFile.h"
+#include "util/FileSystemUtilities.h"
+#include "device/DaemonStateFile.h"
 #include "plist/PropertyListFormat.h"
 #include "util/Log.h"
 

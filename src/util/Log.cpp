@@ -7,7 +7,7 @@
 #include <cwchar>
 #include <string_view>
 
-#include "platform/SystemLog.h"
+#include "util/SystemLog.h"
 #include "plist/Value.h"
 
 namespace tavrix {

@@ -19,7 +19,7 @@
 #include <vector>
 
 #include "payload/PayloadUnpack.h"
-#include "platform/SystemLog.h"
+#include "util/SystemLog.h"
 
 namespace {
 

@@ -16,8 +16,8 @@
 #include <string_view>
 #include <vector>
 
-#include "platform/BusHandles.h"
-#include "platform/BusValueCodec.h"
+#include "bus/BusHandles.h"
+#include "bus/BusValueCodec.h"
 
 namespace {
 

@@ -9,7 +9,7 @@
 
 #include "bundle/BundleComparison.h"
 #include "bundle/VersionCompare.h"
-#include "platform/SystemLog.h"
+#include "util/SystemLog.h"
 
 namespace {
 

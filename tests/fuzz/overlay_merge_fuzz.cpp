@@ -9,7 +9,7 @@
 #include <vector>
 
 #include "bundle/OverlayConfiguration.h"
-#include "platform/SystemLog.h"
+#include "util/SystemLog.h"
 #include "plist/PropertyListFormat.h"
 
 namespace {

@@ -18,7 +18,7 @@
 #include "DeviceRoot.h"
 #include "PrivateBus.h"
 #include "client/TavrixClient.h"
-#include "platform/BusHandles.h"
+#include "bus/BusHandles.h"
 
 namespace tavrix::integration {
 

@@ -11,7 +11,7 @@
 #include <optional>
 #include <string>
 
-#include "platform/BusHandles.h"
+#include "bus/BusHandles.h"
 
 namespace tavrix::integration {
 

@@ -7,7 +7,7 @@
 
 #include <cerrno>
 
-#include "util/UniqueFd.h"
+#include "fs/UniqueFd.h"
 
 extern char** environ;
 

@@ -23,11 +23,11 @@
 #include "CommandRunner.h"
 #include "LocalHttpServer.h"
 #include "TestSupport.h"
-#include "platform/BackgroundJobScheduler.h"
-#include "platform/Clock.h"
+#include "bus/BackgroundJobScheduler.h"
+#include "util/Clock.h"
 #include "plist/PropertyListFormat.h"
-#include "update/UpdateCheckScheduler.h"
-#include "util/UniqueFd.h"
+#include "daemon/UpdateCheckScheduler.h"
+#include "fs/UniqueFd.h"
 
 namespace tavrix::integration {
 namespace {

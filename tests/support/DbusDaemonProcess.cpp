@@ -13,7 +13,7 @@
 #include <stdexcept>
 #include <thread>
 
-#include "util/UniqueFd.h"
+#include "fs/UniqueFd.h"
 
 extern char** environ;
 

@@ -18,7 +18,7 @@
 #include <utility>
 #include <vector>
 
-#include "util/UniqueFd.h"
+#include "fs/UniqueFd.h"
 
 namespace tavrix::test {
 

@@ -12,7 +12,7 @@
 #include "TestSupport.h"
 #include "payload/Archive.h"
 #include "payload/PayloadUnpack.h"
-#include "platform/SystemLog.h"
+#include "util/SystemLog.h"
 
 namespace tavrix::payload {
 namespace {

@@ -18,12 +18,12 @@
 #include "LocalHttpServer.h"
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
-#include "platform/AssetCatalog.h"
-#include "platform/AssetCatalogSettings.h"
-#include "platform/CatalogCrypto.h"
-#include "platform/Clock.h"
-#include "platform/PlatformRoot.h"
-#include "platform/SystemLog.h"
+#include "catalog/AssetCatalog.h"
+#include "catalog/AssetCatalogSettings.h"
+#include "catalog/CatalogCrypto.h"
+#include "util/Clock.h"
+#include "device/PlatformRoot.h"
+#include "util/SystemLog.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix::platform {

@@ -13,8 +13,8 @@
 #include "LocalHttpServer.h"
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
-#include "platform/AssetCatalogSettings.h"
-#include "platform/SystemLog.h"
+#include "catalog/AssetCatalogSettings.h"
+#include "util/SystemLog.h"
 #include "plist/PropertyListFormat.h"
 #include "update/AssetHandler.h"
 
@@ -176,7 +176,7 @@ TEST_F(AssetSelectionTest, FirstOfEqualVersionsWinsAndNoCandidateStartsNothing) 
     EXPECT_EQ(best->attributes().at("MaximumOSVersion"), plist::Value("9.9"));
 
     publish({"older only", {{"0.9", {}}}, ""});
-    EXPECT_FALSE(AssetHandler::downloadUpdateIfAvailable());
+    EXPECT_FALSE(AssetHandler::downloadUpdateIfAvailable([](double) {}));
     EXPECT_TRUE(logged("Best candidate passed in is nil"));
 }
 

@@ -12,8 +12,8 @@
 #include <vector>
 
 #include "TestSupport.h"
-#include "platform/BackgroundJobScheduler.h"
-#include "platform/SystemLog.h"
+#include "bus/BackgroundJobScheduler.h"
+#include "util/SystemLog.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix::platform {

@@ -10,7 +10,7 @@
 #include "bundle/BundleLinks.h"
 #include "bundle/BundleManager.h"
 #include "bundle/VersionCompare.h"
-#include "platform/SystemLog.h"
+#include "util/SystemLog.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix {

@@ -12,8 +12,8 @@
 #include "bundle/BundleLinks.h"
 #include "bundle/BundleLocations.h"
 #include "bundle/BundleManager.h"
-#include "platform/PlatformRoot.h"
-#include "platform/SystemLog.h"
+#include "device/PlatformRoot.h"
+#include "util/SystemLog.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix {

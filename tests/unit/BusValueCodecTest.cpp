@@ -7,8 +7,8 @@
 #include <functional>
 
 #include "PrivateBusDaemon.h"
-#include "platform/BusHandles.h"
-#include "platform/BusValueCodec.h"
+#include "bus/BusHandles.h"
+#include "bus/BusValueCodec.h"
 
 namespace tavrix::platform {
 namespace {

@@ -12,7 +12,7 @@
 #include "TestSupport.h"
 #include "bundle/CarrierFileLoader.h"
 #include "bundle/GzipInflater.h"
-#include "platform/SystemLog.h"
+#include "util/SystemLog.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix {

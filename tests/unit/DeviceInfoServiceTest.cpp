@@ -4,9 +4,9 @@
 
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
-#include "platform/DeviceInfoService.h"
-#include "platform/RunningSystemFacts.h"
-#include "platform/SystemLog.h"
+#include "device/DeviceInfoService.h"
+#include "device/RunningSystemFacts.h"
+#include "util/SystemLog.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix::platform {

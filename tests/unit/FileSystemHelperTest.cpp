@@ -11,8 +11,8 @@
 #include <map>
 
 #include "TestSupport.h"
-#include "payload/FileSystemHelper.h"
-#include "payload/FileSystemUtilities.h"
+#include "util/FileSystemHelper.h"
+#include "util/FileSystemUtilities.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix::payload {

@@ -1,6 +1,6 @@
 #include <gtest/gtest.h>
 
-#include "platform/SystemLog.h"
+#include "util/SystemLog.h"
 #include "plist/Value.h"
 #include "util/Log.h"
 

@@ -3,8 +3,8 @@
 
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
-#include "payload/BuildCapabilities.h"
-#include "payload/MobileUser.h"
+#include "device/BuildCapabilities.h"
+#include "device/MobileUser.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix::payload {

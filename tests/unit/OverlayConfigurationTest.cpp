@@ -4,7 +4,7 @@
 #include <vector>
 
 #include "bundle/OverlayConfiguration.h"
-#include "platform/SystemLog.h"
+#include "util/SystemLog.h"
 #include "plist/Value.h"
 
 namespace tavrix {

@@ -11,7 +11,7 @@
 #include "bundle/BundleLocations.h"
 #include "bundle/BundleManager.h"
 #include "payload/PayloadUnpack.h"
-#include "platform/SystemLog.h"
+#include "util/SystemLog.h"
 
 namespace tavrix::payload {
 namespace {

@@ -11,9 +11,9 @@
 
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
-#include "daemon/BehaviorPreferences.h"
-#include "platform/PreferencesStore.h"
-#include "platform/SystemLog.h"
+#include "device/BehaviorPreferences.h"
+#include "device/PreferencesStore.h"
+#include "util/SystemLog.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix {

@@ -8,7 +8,7 @@
 
 #include "DbusDaemonProcess.h"
 #include "TestSupport.h"
-#include "platform/BusHandles.h"
+#include "bus/BusHandles.h"
 
 namespace tavrix::test {
 

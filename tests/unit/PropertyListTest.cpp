@@ -9,7 +9,7 @@
 #include <functional>
 
 #include "TestSupport.h"
-#include "platform/SystemLog.h"
+#include "util/SystemLog.h"
 #include "plist/PropertyListFormat.h"
 #include "plist/Value.h"
 #include "util/PropertyListFile.h"

@@ -10,7 +10,7 @@
 #include <thread>
 #include <vector>
 
-#include "platform/SystemLog.h"
+#include "util/SystemLog.h"
 #include "util/SerialQueue.h"
 
 namespace tavrix {

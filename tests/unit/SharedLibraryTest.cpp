@@ -2,8 +2,8 @@
 
 #include <string>
 
-#include "platform/Sha256.h"
-#include "platform/SharedLibrary.h"
+#include "catalog/Sha256.h"
+#include "util/SharedLibrary.h"
 
 namespace tavrix::platform {
 namespace {

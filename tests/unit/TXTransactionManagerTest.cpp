@@ -5,9 +5,9 @@
 
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
-#include "daemon/TXTransactionManager.h"
-#include "platform/ServiceManager.h"
-#include "platform/SystemLog.h"
+#include "bus/TXTransactionManager.h"
+#include "bus/ServiceManager.h"
+#include "util/SystemLog.h"
 
 namespace tavrix {
 namespace {

@@ -10,9 +10,9 @@
 
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
-#include "platform/SystemLog.h"
+#include "util/SystemLog.h"
 #include "plist/PropertyListFormat.h"
-#include "util/TXUtility.h"
+#include "device/TXUtility.h"
 
 namespace tavrix {
 namespace {

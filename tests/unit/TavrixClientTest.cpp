@@ -11,7 +11,7 @@
 
 #include "PrivateBusDaemon.h"
 #include "client/TavrixClient.h"
-#include "platform/BusValueCodec.h"
+#include "bus/BusValueCodec.h"
 
 namespace tavrix::client {
 namespace {

@@ -13,12 +13,12 @@
 
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
-#include "daemon/BehaviorPreferences.h"
-#include "daemon/TXTransactionManager.h"
-#include "platform/Clock.h"
-#include "platform/SystemLog.h"
+#include "device/BehaviorPreferences.h"
+#include "bus/TXTransactionManager.h"
+#include "util/Clock.h"
+#include "util/SystemLog.h"
 #include "plist/PropertyListFormat.h"
-#include "update/UpdateCheckScheduler.h"
+#include "daemon/UpdateCheckScheduler.h"
 
 namespace tavrix {
 namespace {

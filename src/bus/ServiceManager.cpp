@@ -1,0 +1,173 @@
+#include "bus/ServiceManager.h"
+
+#include <fcntl.h>
+#include <sys/eventfd.h>
+#include <sys/stat.h>
+#include <systemd/sd-daemon.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdlib>
+#include <filesystem>
+#include <string_view>
+
+#include "device/PlatformRoot.h"
+#include "fs/UniqueFd.h"
+
+namespace tavrix::platform {
+namespace {
+
+constexpr std::chrono::seconds kDefaultIdleGrace{30};
+
+std::chrono::milliseconds idleGraceFromEnvironment() {
+    const char* configured = std::getenv("TAVRIX_IDLE_EXIT_SEC");
+    if (configured == nullptr || *configured == '\0') {
+        return kDefaultIdleGrace;
+    }
+    char* end = nullptr;
+    double seconds = std::strtod(configured, &end);
+    if (end == configured || *end != '\0' || !(seconds >= 0) || seconds > 86400) {
+        return kDefaultIdleGrace;
+    }
+    return std::chrono::milliseconds(static_cast<long long>(seconds * 1000));
+}
+
+std::string runtimeDirectoryFromEnvironment() {
+    // systemd may list several directories separated by ':'; the first is ours.
+    const char* configured = std::getenv("RUNTIME_DIRECTORY");
+    if (configured != nullptr && *configured != '\0') {
+        std::string_view value(configured);
+        return std::string(value.substr(0, value.find(':')));
+    }
+    return resolvePath("/run/tavrixservicesd");
+}
+
+std::int64_t ticksNow() {
+    return std::chrono::steady_clock::now().time_since_epoch().count();
+}
+
+}  // namespace
+
+ServiceManager& ServiceManager::shared() {
+    static ServiceManager* manager = new ServiceManager();  // lives as long as the process
+    return *manager;
+}
+
+ServiceManager::ServiceManager()
+    : runtimeDirectory_(runtimeDirectoryFromEnvironment()),
+      keepAlivePath_(runtimeDirectory_ + "/keep-alive"),
+      idleGrace_(idleGraceFromEnvironment()),
+      lastActivityTicks_(ticksNow()),
+      wakeFd_(::eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC)) {}
+
+void ServiceManager::openTransaction() {
+    openTransactions_.fetch_add(1);
+    noteActivity();
+}
+
+void ServiceManager::closeTransaction() {
+    if (openTransactions_.fetch_sub(1) <= 0) {
+        openTransactions_.fetch_add(1);  // never below zero, whatever the callers do
+    }
+    noteActivity();
+    wake();
+}
+
+bool ServiceManager::readKeepAlive(std::int64_t& value) const {
+    std::lock_guard lock(keepAliveMutex_);
+    UniqueFd fd(::open(keepAlivePath_.c_str(), O_RDONLY | O_CLOEXEC));
+    if (!fd) {
+        if (errno == ENOENT) {
+            value = 0;
+            return true;
+        }
+        return false;
+    }
+    char buffer[32] = {};
+    ssize_t got = ::read(fd.get(), buffer, sizeof buffer - 1);
+    if (got < 0) {
+        return false;
+    }
+    char* end = nullptr;
+    long long parsed = std::strtoll(buffer, &end, 10);
+    if (end == buffer) {
+        return false;
+    }
+    value = parsed;
+    return true;
+}
+
+bool ServiceManager::writeKeepAlive(std::int64_t value) {
+    std::lock_guard lock(keepAliveMutex_);
+    std::error_code error;
+    std::filesystem::create_directories(runtimeDirectory_, error);
+    if (error) {
+        return false;
+    }
+    std::string temporary = keepAlivePath_ + ".new";
+    UniqueFd fd(::open(temporary.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644));
+    if (!fd) {
+        return false;
+    }
+    std::string text = std::to_string(value) + "\n";
+    if (::write(fd.get(), text.data(), text.size()) != static_cast<ssize_t>(text.size()) ||
+        ::fsync(fd.get()) != 0) {
+        ::unlink(temporary.c_str());
+        return false;
+    }
+    fd.reset();
+    if (::rename(temporary.c_str(), keepAlivePath_.c_str()) != 0) {
+        ::unlink(temporary.c_str());
+        return false;
+    }
+    noteActivity();
+    wake();
+    return true;
+}
+
+bool ServiceManager::isIdle() const {
+    if (openTransactions_.load() > 0) {
+        return false;
+    }
+    std::int64_t keepAlive = 0;
+    // A flag that cannot be read counts as set: better to stay than to leave work behind.
+    return readKeepAlive(keepAlive) && keepAlive == 0;
+}
+
+void ServiceManager::noteActivity() {
+    lastActivityTicks_.store(ticksNow());
+}
+
+std::chrono::steady_clock::time_point ServiceManager::lastActivity() const {
+    return std::chrono::steady_clock::time_point(
+        std::chrono::steady_clock::duration(lastActivityTicks_.load()));
+}
+
+void ServiceManager::wake() {
+    if (wakeFd_) {
+        // A full counter already wakes the reader, so a failed write loses nothing.
+        std::uint64_t one = 1;
+        [[maybe_unused]] ssize_t written = ::write(wakeFd_.get(), &one, sizeof one);
+    }
+}
+
+void ServiceManager::consumeWake() {
+    if (wakeFd_) {
+        std::uint64_t count = 0;
+        [[maybe_unused]] ssize_t got = ::read(wakeFd_.get(), &count, sizeof count);
+    }
+}
+
+void ServiceManager::notifyReady(const std::string& status) {
+    sd_notifyf(0, "READY=1\nSTATUS=%s", status.c_str());
+}
+
+void ServiceManager::notifyStatus(const std::string& status) {
+    sd_notifyf(0, "STATUS=%s", status.c_str());
+}
+
+void ServiceManager::notifyStopping() {
+    sd_notify(0, "STOPPING=1\nSTATUS=Leaving");
+}
+
+}  // namespace tavrix::platform

@@ -1,0 +1,81 @@
+// The service manager's side of the daemon: the count of open transactions, the keep-alive flag,
+// the idle predicate, and status reports to systemd.
+//
+// The keep-alive flag is kept in "<runtime directory>/keep-alive" ("1" or "0"), the runtime
+// directory being $RUNTIME_DIRECTORY or /run/tavrixservicesd under the platform root, so that it
+// survives a restart of the daemon.
+#pragma once
+
+#include <atomic>
+#include <chrono>
+#include <cstdint>
+#include <mutex>
+#include <string>
+
+#include "fs/UniqueFd.h"
+
+namespace tavrix::platform {
+
+class ServiceManager {
+  public:
+    // The process's service manager binding.
+    static ServiceManager& shared();
+
+    void openTransaction();
+    void closeTransaction();
+    int openTransactionCount() const { return openTransactions_.load(); }
+
+    // Reads the keep-alive flag into value (0 when never written). False when it cannot be read.
+    bool readKeepAlive(std::int64_t& value) const;
+    // Writes the keep-alive flag atomically. False when it cannot be written.
+    bool writeKeepAlive(std::int64_t value);
+
+    // True when nothing keeps the daemon running: no open transaction and keep-alive clear.
+    bool isIdle() const;
+
+    // Marks activity (a call, a transaction begun or ended, the keep-alive flag written); idle
+    // time counts from the last one.
+    void noteActivity();
+    std::chrono::steady_clock::time_point lastActivity() const;
+
+    // Readable (an eventfd) whenever a transaction closed or the keep-alive flag was written since
+    // the last wake was consumed, from whatever thread: the run loop watches it so that it
+    // re-checks for idleness at once instead of at the end of its pass. -1 when it could not be
+    // made (the loop then notices at the end of its pass).
+    int wakeFd() const { return wakeFd_.get(); }
+    void consumeWake();
+
+    // How long the daemon stays after becoming idle: $TAVRIX_IDLE_EXIT_SEC or 30 s.
+    std::chrono::milliseconds idleGrace() const { return idleGrace_; }
+
+    // Reports to systemd (no-ops when not started by it).
+    void notifyReady(const std::string& status);
+    void notifyStatus(const std::string& status);
+    void notifyStopping();
+
+    const std::string& keepAlivePath() const { return keepAlivePath_; }
+
+  private:
+    ServiceManager();
+    void wake();
+
+    std::string runtimeDirectory_;
+    std::string keepAlivePath_;
+    std::chrono::milliseconds idleGrace_;
+    std::atomic<int> openTransactions_{0};
+    std::atomic<std::int64_t> lastActivityTicks_;
+    mutable std::mutex keepAliveMutex_;
+    UniqueFd wakeFd_;
+};
+
+// One service-manager transaction, open while the object lives: work the process must finish
+// before it may leave for idleness.
+class ScopedServiceTransaction {
+  public:
+    ScopedServiceTransaction() { ServiceManager::shared().openTransaction(); }
+    ~ScopedServiceTransaction() { ServiceManager::shared().closeTransaction(); }
+    ScopedServiceTransaction(const ScopedServiceTransaction&) = delete;
+    ScopedServiceTransaction& operator=(const ScopedServiceTransaction&) = delete;
+};
+
+}  // namespace tavrix::platform

@@ -1,0 +1,109 @@
+#include "bus/TXTransactionManager.h"
+
+#include "bus/ServiceManager.h"
+#include "plist/Value.h"
+#include "util/Log.h"
+
+namespace tavrix {
+
+TXTransactionManager& TXTransactionManager::sharedInstance() {
+    static TXTransactionManager* manager = new TXTransactionManager();
+    return *manager;
+}
+
+TXTransactionManager::TXTransactionManager() = default;
+
+TXTransactionManager::~TXTransactionManager() {
+    for (const std::string& name : openTransactions()) {
+        endTransaction(name);
+    }
+}
+
+void TXTransactionManager::beginTransaction(const std::string& name) {
+    beginTransaction(name, false);
+}
+
+void TXTransactionManager::beginTransaction(const std::string& name, bool keepAlive) {
+    std::lock_guard lock(_lock);
+    if (_openTransactions.count(name) != 0) {
+        return;
+    }
+    _openTransactions.insert(name);
+    if (keepAlive) {
+        _keepAliveTransactions.insert(name);
+        _toggleKeepAliveStatus();
+    }
+    plist::Value nameValue(name);
+    logObjectFormat("*********** Beginning Corvex transaction : %@ ***********", &nameValue);
+    platform::ServiceManager::shared().openTransaction();
+}
+
+void TXTransactionManager::endTransaction(const std::string& name) {
+    std::lock_guard lock(_lock);
+    if (_openTransactions.erase(name) == 0) {
+        return;
+    }
+    if (_keepAliveTransactions.erase(name) != 0) {
+        _toggleKeepAliveStatus();
+    }
+    plist::Value nameValue(name);
+    logObjectFormat("*********** Ended Corvex transaction : %@ ***********", &nameValue);
+    platform::ServiceManager::shared().closeTransaction();
+}
+
+bool TXTransactionManager::hasOpenTransactionForName(const std::string& name) const {
+    std::lock_guard lock(_lock);
+    return _openTransactions.count(name) != 0;
+}
+
+std::set<std::string> TXTransactionManager::openTransactions() const {
+    std::lock_guard lock(_lock);
+    return _openTransactions;
+}
+
+void TXTransactionManager::setKeepAliveClearable(bool clearable) {
+    std::lock_guard lock(_lock);
+    _keepAliveClearable = clearable;
+}
+
+bool TXTransactionManager::isKeepAliveEnabled() {
+    return _isKeepAliveEnabled(nullptr);
+}
+
+void TXTransactionManager::clearKeepAliveIfNecessary(bool force) {
+    std::lock_guard lock(_lock);
+    if (force || _keepAliveTransactions.empty()) {
+        _setKeepAlive(false);
+    }
+}
+
+void TXTransactionManager::_toggleKeepAliveStatus() {
+    _setKeepAlive(!_keepAliveTransactions.empty());
+}
+
+void TXTransactionManager::_setKeepAlive(bool enable) {
+    if (!enable && !_keepAliveClearable) {
+        return;
+    }
+    bool readError = false;
+    if (_isKeepAliveEnabled(&readError) == enable && !readError) {
+        return;
+    }
+    if (!platform::ServiceManager::shared().writeKeepAlive(enable ? 1 : 0)) {
+        logObjectFormat("pelgarind could not toggle keep alive status to stelmard.");
+        return;
+    }
+    plist::Value status(enable ? "Enabled" : "Disabled");
+    logObjectFormat("Keep alive status: %@", &status);
+}
+
+bool TXTransactionManager::_isKeepAliveEnabled(bool* /*error: accepted, never written*/) {
+    std::int64_t value = 1;
+    if (!platform::ServiceManager::shared().readKeepAlive(value)) {
+        logObjectFormat("pelgarind could not read keep alive status from stelmard.");
+        return true;
+    }
+    return value != 0;
+}
+
+}  // namespace tavrix

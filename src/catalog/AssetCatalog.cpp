@@ -1,0 +1,237 @@
+#include "catalog/AssetCatalog.h"
+
+#include <sys/stat.h>
+
+#include <cerrno>
+#include <cstring>
+
+#include "util/FileSystemUtilities.h"
+#include "catalog/AssetCatalogService.h"
+#include "catalog/AssetDownload.h"
+#include "catalog/CatalogLoader.h"
+#include "catalog/CatalogRollout.h"
+#include "device/DeviceInfoService.h"
+#include "util/Log.h"
+
+namespace tavrix::platform {
+namespace {
+
+constexpr const char* kSerialNumberKey = "SerialNumber";
+constexpr const char* kVersionAttribute = "Version";
+
+bool isFinalReport(const plist::Dictionary& progress) {
+    auto operation = progress.find(kAssetProgressOperationKey);
+    if (operation == progress.end() || operation->second.asString() == nullptr) {
+        return false;
+    }
+    const std::string& name = *operation->second.asString();
+    return name == kAssetOperationCompleted || name == kAssetOperationFailed;
+}
+
+}  // namespace
+
+Asset::Asset(CatalogEntry entry, std::string typeCacheDirectory, AssetLimits limits)
+    : entry_(std::move(entry)),
+      typeCacheDirectory_(std::move(typeCacheDirectory)),
+      limits_(limits) {}
+
+void Asset::beginDownload(const plist::Dictionary& /*options*/) {
+    {
+        std::lock_guard lock(mutex_);
+        if (downloading_) {
+            logCFormat("Asset catalog: the download of %s is already running",
+                       entry_.archiveURL.c_str());
+            return;
+        }
+        downloading_ = true;
+        if (!unfinished_) {
+            unfinished_.emplace();
+        }
+    }
+    // The task holds the asset until its download is over.
+    auto self = shared_from_this();
+    if (!AssetCatalogService::shared().workerQueue().dispatchAsync(
+            [self] { self->runDownload(); })) {
+        std::lock_guard lock(mutex_);
+        downloading_ = false;
+        unfinished_.reset();
+    }
+}
+
+void Asset::runDownload() {
+    logCFormat("Asset catalog: downloading %s", entry_.archiveURL.c_str());
+    AssetCacheLocation location = AssetCacheLocation::forDownload(typeCacheDirectory_, entry_);
+    std::optional<std::string> failure = downloadAndInstallAsset(
+        entry_, location, limits_,
+        [this](plist::Dictionary progress) { report(std::move(progress)); });
+    plist::Dictionary last;
+    if (failure) {
+        logCFormat("Asset catalog: download of %s failed: %s", entry_.archiveURL.c_str(),
+                   failure->c_str());
+        last = {{kAssetProgressOperationKey, plist::Value(kAssetOperationFailed)},
+                {kAssetProgressErrorKey, plist::Value(*failure)}};
+    } else {
+        logCFormat("Asset catalog: installed %s in %s", entry_.archiveURL.c_str(),
+                   location.directory.c_str());
+        last = {{kAssetProgressOperationKey, plist::Value(kAssetOperationCompleted)}};
+    }
+    {
+        std::lock_guard lock(mutex_);
+        downloading_ = false;
+        if (!failure) {
+            downloaded_.push_back(location.directory);
+        }
+    }
+    report(std::move(last));
+}
+
+void Asset::report(plist::Dictionary progress) {
+    {
+        std::lock_guard lock(mutex_);
+        undelivered_.push_back(std::move(progress));
+    }
+    auto self = shared_from_this();
+    AssetCatalogService::shared().deliveryQueue().dispatchAsync([self] { self->deliverReports(); });
+}
+
+void Asset::setProgressHandler(ProgressHandler handler) {
+    {
+        std::lock_guard lock(mutex_);
+        handler_ = std::move(handler);
+    }
+    auto self = shared_from_this();
+    AssetCatalogService::shared().deliveryQueue().dispatchAsync([self] { self->deliverReports(); });
+}
+
+// Runs only on the delivery queue, so reports reach the handler one at a time and in order.
+void Asset::deliverReports() {
+    for (;;) {
+        ProgressHandler handler;
+        plist::Dictionary progress;
+        bool last = false;
+        {
+            std::lock_guard lock(mutex_);
+            if (!handler_ || undelivered_.empty()) {
+                return;
+            }
+            handler = handler_;
+            progress = std::move(undelivered_.front());
+            undelivered_.pop_front();
+            last = isFinalReport(progress);
+            if (last) {
+                // The handler usually captures this asset; dropping it breaks that cycle.
+                handler_ = nullptr;
+            }
+        }
+        handler(progress);
+        if (last) {
+            // The handler has installed what was downloaded: the process may leave now.
+            std::lock_guard lock(mutex_);
+            if (!downloading_) {
+                unfinished_.reset();
+            }
+        }
+    }
+}
+
+std::optional<std::string> Asset::localURL() const {
+    std::string directory;
+    {
+        std::lock_guard lock(mutex_);
+        if (downloaded_.empty()) {
+            return std::nullopt;
+        }
+        directory = downloaded_.back();
+    }
+    struct stat info {};
+    if (::stat(directory.c_str(), &info) != 0 || !S_ISDIR(info.st_mode)) {
+        return std::nullopt;
+    }
+    return directory;
+}
+
+void Asset::purge(PurgeCompletion completion) {
+    auto self = shared_from_this();
+    auto unfinished = std::make_shared<ScopedServiceTransaction>();
+    AssetCatalogService::shared().workerQueue().dispatchAsync(
+        [self, unfinished, completion = std::move(completion)] {
+            std::vector<std::string> directories;
+            {
+                std::lock_guard lock(self->mutex_);
+                directories.swap(self->downloaded_);
+            }
+            bool purged = true;
+            for (const std::string& directory : directories) {
+                int error = payload::removeItemTree(directory);
+                if (error != 0 && error != ENOENT) {
+                    purged = false;
+                    logCFormat("Asset catalog: cannot purge %s: %s", directory.c_str(),
+                               std::strerror(error));
+                }
+            }
+            if (completion) {
+                completion(purged);
+            }
+        });
+}
+
+AssetQuery::AssetQuery(std::string assetType) : assetType_(std::move(assetType)) {}
+
+std::optional<std::vector<std::shared_ptr<Asset>>> AssetQuery::runQuery() const {
+    std::vector<std::shared_ptr<Asset>> assets;
+    std::optional<AssetTypeSettings> settings =
+        AssetCatalogService::shared().settingsFor(assetType_);
+    if (!settings) {
+        lastResult_ = {QueryOutcome::NoCatalogConfigured, "no catalog configured"};
+        return assets;
+    }
+    CatalogRefusal refusal;
+    std::optional<std::vector<CatalogEntry>> entries =
+        loadCatalogEntries(*settings, localOnly_, refusal);
+    if (!entries) {
+        logCFormat("Asset catalog: refusing the catalog %s: %s", settings->catalogURL.c_str(),
+                   refusal.what().c_str());
+        const bool fetchFailed = refusal.kind() == CatalogRefusalKind::FetchFailed;
+        lastResult_ = {fetchFailed ? QueryOutcome::FetchFailed : QueryOutcome::Refused,
+                       refusal.what()};
+        return std::nullopt;
+    }
+    lastResult_ = {QueryOutcome::Answered, {}};
+    std::string heldBack;
+    std::string serialNumber;
+    bool serialNumberRead = false;
+    for (CatalogEntry& entry : *entries) {
+        if (entry.rolloutPercent < 100) {
+            if (!serialNumberRead) {
+                serialNumber = copyDeviceStringAnswer(kSerialNumberKey).value_or(std::string());
+                serialNumberRead = true;
+            }
+            auto version = entry.attributes.find(kVersionAttribute);
+            std::string versionText =
+                version != entry.attributes.end() && version->second.asString() != nullptr
+                    ? *version->second.asString()
+                    : std::string();
+            if (!takesPartInRollout(serialNumber, versionText, entry.rolloutPercent)) {
+                heldBack += (heldBack.empty() ? "" : ", ") + versionText + " (" +
+                            std::to_string(entry.rolloutPercent) + "%)";
+                continue;
+            }
+        }
+        assets.push_back(
+            std::make_shared<Asset>(std::move(entry), settings->cacheDirectory, settings->limits));
+    }
+    if (!heldBack.empty()) {
+        logCFormat("Asset catalog: this device is outside the rollout of %s", heldBack.c_str());
+    }
+    return assets;
+}
+
+void AssetQuery::removeAbandonedDownloads() const {
+    std::optional<AssetTypeSettings> settings =
+        AssetCatalogService::shared().settingsFor(assetType_);
+    if (settings) {
+        platform::removeAbandonedDownloads(settings->cacheDirectory, /*completedToo=*/true);
+    }
+}
+
+}  // namespace tavrix::platform

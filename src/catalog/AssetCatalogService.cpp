@@ -1,0 +1,73 @@
+#include "catalog/AssetCatalogService.h"
+
+#include <atomic>
+
+#include "device/PlatformRoot.h"
+#include "util/Log.h"
+
+namespace tavrix::platform {
+
+namespace {
+
+// Set once the service exists, so that shutting down never creates it.
+std::atomic<AssetCatalogService*> created{nullptr};
+
+}  // namespace
+
+AssetCatalogService& AssetCatalogService::shared() {
+    static AssetCatalogService* service = [] {
+        auto* made = new AssetCatalogService();
+        created.store(made);
+        return made;
+    }();
+    return *service;
+}
+
+bool AssetCatalogService::shutdownIfStarted(std::chrono::milliseconds patience) {
+    AssetCatalogService* service = created.load();
+    if (service == nullptr) {
+        return true;
+    }
+    // Downloads first: they queue the reports that the delivery thread hands out.
+    bool stopped = service->worker_.shutdown(patience);
+    return service->delivery_.shutdown(patience) && stopped;
+}
+
+AssetCatalogService::AssetCatalogService()
+    : settingsFile_(resolvePath(kAssetCatalogSettingsPath)),
+      worker_("com.zandor.tavrixservicesd.AssetDownloads"),
+      delivery_("com.zandor.tavrixservicesd.AssetProgress") {}
+
+std::optional<AssetTypeSettings> AssetCatalogService::settingsFor(std::string_view assetType) {
+    plist::CachedPropertyListFile::Snapshot snapshot = settingsFile_.read();
+    std::string reason;
+    std::optional<AssetTypeSettings> settings;
+    if (snapshot.state == plist::CachedPropertyListFile::State::Missing) {
+        reason = "there is no settings file";
+    } else if (snapshot.state == plist::CachedPropertyListFile::State::Damaged) {
+        reason = "the settings file is not a property list: " + snapshot.refusal.reason;
+    } else {
+        settings = parseAssetTypeSettings(*snapshot.value, assetType, reason);
+    }
+    if (settings) {
+        reason.clear();
+    }
+    noteSettingsProblem(assetType, reason);
+    return settings;
+}
+
+void AssetCatalogService::noteSettingsProblem(std::string_view assetType,
+                                              const std::string& reason) {
+    std::lock_guard lock(mutex_);
+    auto known = loggedProblems_.find(assetType);
+    if (known != loggedProblems_.end() && known->second == reason) {
+        return;
+    }
+    loggedProblems_[std::string(assetType)] = reason;
+    if (!reason.empty()) {
+        logCFormat("Asset catalog: no assets of type %s: %s (%s)", std::string(assetType).c_str(),
+                   reason.c_str(), settingsFile_.path().c_str());
+    }
+}
+
+}  // namespace tavrix::platform

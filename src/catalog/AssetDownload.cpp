@@ -1,0 +1,212 @@
+#include "catalog/AssetDownload.h"
+
+#include <fcntl.h>
+#include <sys/random.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <atomic>
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <ctime>
+#include <vector>
+
+#include "util/FileSystemUtilities.h"
+#include "payload/PayloadUnpack.h"
+#include "catalog/AssetCatalog.h"
+#include "catalog/CatalogCrypto.h"
+#include "http/HttpTransfer.h"
+#include "util/Log.h"
+#include "fs/UniqueFd.h"
+
+namespace tavrix::platform {
+namespace {
+
+constexpr const char* kStagedArchiveSuffix = ".download";
+constexpr const char* kStagedExtractionSuffix = ".extracting";
+
+// Downloading reports come at each further quarter of the archive, not for every chunk.
+constexpr std::uint64_t kDownloadReportSteps = 4;
+
+// Removes a staging file or directory when the step that made it is over.
+class StagedPath {
+  public:
+    explicit StagedPath(std::string path) : path_(std::move(path)) {
+        payload::removeItemTree(path_);
+    }
+    ~StagedPath() { payload::removeItemTree(path_); }
+    StagedPath(const StagedPath&) = delete;
+    StagedPath& operator=(const StagedPath&) = delete;
+
+    const std::string& path() const { return path_; }
+
+  private:
+    std::string path_;
+};
+
+std::string errnoText(const char* action, const std::string& path, int error) {
+    return std::string("cannot ") + action + " " + path + ": " + std::strerror(error);
+}
+
+bool writeAll(int fd, std::string_view bytes) {
+    while (!bytes.empty()) {
+        ssize_t written = ::write(fd, bytes.data(), bytes.size());
+        if (written < 0 && errno == EINTR) {
+            continue;
+        }
+        if (written <= 0) {
+            return false;
+        }
+        bytes.remove_prefix(static_cast<std::size_t>(written));
+    }
+    return true;
+}
+
+plist::Dictionary progress(const char* operation) {
+    return plist::Dictionary{{kAssetProgressOperationKey, plist::Value(operation)}};
+}
+
+plist::Dictionary byteProgress(const char* operation, std::uint64_t written, std::uint64_t total) {
+    plist::Dictionary report = progress(operation);
+    report.emplace(kAssetProgressBytesWrittenKey, plist::Value(static_cast<long long>(written)));
+    report.emplace(kAssetProgressTotalBytesKey, plist::Value(static_cast<long long>(total)));
+    return report;
+}
+
+// Streams the archive into fd, hashing it on the way. Nothing on success, else why not.
+std::optional<std::string> downloadArchive(const CatalogEntry& entry, int fd,
+                                           const AssetLimits& limits,
+                                           const AssetProgressReporter& report) {
+    Sha256Digest digest;
+    std::uint64_t received = 0;
+    const std::uint64_t step = std::max<std::uint64_t>(entry.archiveSize / kDownloadReportSteps, 1);
+    std::uint64_t nextReport = step;
+    HttpBodyReceiver receiver = [&](std::string_view bytes, std::string& refusal) {
+        if (bytes.size() > entry.archiveSize - received) {
+            refusal = "the server sent more than the catalog's " +
+                      std::to_string(entry.archiveSize) + " bytes";
+            return false;
+        }
+        if (!writeAll(fd, bytes)) {
+            refusal = std::string("cannot write the archive: ") + std::strerror(errno);
+            return false;
+        }
+        digest.update(bytes);
+        received += bytes.size();
+        if (received >= nextReport) {
+            report(byteProgress(kAssetOperationDownloading, received, entry.archiveSize));
+            nextReport = (received / step + 1) * step;
+        }
+        return true;
+    };
+    std::string error;
+    if (!transferHttpBody(entry.archiveURL, receiver, limits.archiveTransfer(), error)) {
+        return "cannot download " + entry.archiveURL + ": " + error;
+    }
+    if (received != entry.archiveSize) {
+        return "the archive is " + std::to_string(received) + " bytes, the catalog says " +
+               std::to_string(entry.archiveSize);
+    }
+    std::string actual = digest.finishHex();
+    if (actual != entry.archiveSHA256) {
+        return "the archive's SHA-256 is " + actual + ", the catalog says " + entry.archiveSHA256;
+    }
+    return std::nullopt;
+}
+
+// 64 random bits as hex; should the kernel give none, the process and a count still keep this
+// process's downloads apart from each other and from those of an earlier run.
+std::string uniqueSuffix() {
+    std::uint64_t bits = 0;
+    if (::getrandom(&bits, sizeof bits, 0) != static_cast<ssize_t>(sizeof bits)) {
+        static std::atomic<std::uint64_t> counter{0};
+        bits = (static_cast<std::uint64_t>(::getpid()) << 32) ^ ++counter ^
+               static_cast<std::uint64_t>(::time(nullptr));
+    }
+    char text[17];
+    std::snprintf(text, sizeof text, "%016llx", static_cast<unsigned long long>(bits));
+    return text;
+}
+
+payload::ExtractionLimits extractionLimits(const AssetLimits& limits) {
+    return {limits.maxExpandedBytes, limits.maxArchiveEntries, limits.freeSpaceReserveBytes, true};
+}
+
+}  // namespace
+
+namespace {
+
+bool isHexText(std::string_view text, std::size_t length) {
+    return text.size() == length &&
+           text.find_first_not_of("0123456789abcdef") == std::string_view::npos;
+}
+
+// "<archive SHA-256>-<random suffix>", the name every download's directory gets.
+bool isDownloadName(std::string_view name) {
+    return name.size() == 64 + 1 + 16 && name[64] == '-' && isHexText(name.substr(0, 64), 64) &&
+           isHexText(name.substr(65), 16);
+}
+
+}  // namespace
+
+void removeAbandonedDownloads(const std::string& typeCacheDirectory, bool completedToo) {
+    std::vector<std::string> names;
+    if (payload::readDirectoryNames(typeCacheDirectory, names) != 0) {
+        return;
+    }
+    for (const std::string& name : names) {
+        bool staging = name.starts_with(".") && (name.ends_with(kStagedArchiveSuffix) ||
+                                                 name.ends_with(kStagedExtractionSuffix));
+        if (staging || (completedToo && isDownloadName(name))) {
+            logCFormat("Asset catalog: removing the abandoned download %s\n", name.c_str());
+            payload::removeItemTree(typeCacheDirectory + "/" + name);
+        }
+    }
+}
+
+AssetCacheLocation AssetCacheLocation::forDownload(const std::string& typeCacheDirectory,
+                                                   const CatalogEntry& entry) {
+    std::string name = entry.archiveSHA256 + "-" + uniqueSuffix();
+    std::string base = typeCacheDirectory + "/";
+    return {base + name, base + "." + name + kStagedArchiveSuffix,
+            base + "." + name + kStagedExtractionSuffix};
+}
+
+std::optional<std::string> downloadAndInstallAsset(const CatalogEntry& entry,
+                                                   const AssetCacheLocation& location,
+                                                   const AssetLimits& limits,
+                                                   const AssetProgressReporter& report) {
+    report(byteProgress(kAssetOperationStarted, 0, entry.archiveSize));
+    std::string cacheDirectory = location.directory.substr(0, location.directory.rfind('/'));
+    if (int error = payload::createDirectoryAt(cacheDirectory, 0755, true)) {
+        return errnoText("create", cacheDirectory, error);
+    }
+    removeAbandonedDownloads(cacheDirectory, /*completedToo=*/false);
+    StagedPath archive(location.archiveFile);
+    {
+        UniqueFd fd(::open(archive.path().c_str(),
+                           O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, 0600));
+        if (!fd) {
+            return errnoText("create", archive.path(), errno);
+        }
+        if (std::optional<std::string> failure = downloadArchive(entry, fd.get(), limits, report)) {
+            return failure;
+        }
+    }
+    report(progress(kAssetOperationInstalling));
+    StagedPath extraction(location.extractionDirectory);
+    // The installer copies the extracted tree next: the extraction keeps room for that copy.
+    std::string whyNot;
+    if (!payload::extractArchive(archive.path(), extraction.path(),
+                                 payload::ExtractionSafety::PathSafe, extractionLimits(limits),
+                                 &whyNot)) {
+        return whyNot;
+    }
+    if (::rename(extraction.path().c_str(), location.directory.c_str()) != 0) {
+        return errnoText("install into", location.directory, errno);
+    }
+    return std::nullopt;
+}
+
+}  // namespace tavrix::platform

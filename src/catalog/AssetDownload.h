@@ -1,0 +1,44 @@
+// One asset's download on the worker thread: stream the archive into the cache, check it against
+// the catalog, extract it, and only then put it where its local URL points.
+#pragma once
+
+#include <functional>
+#include <optional>
+#include <string>
+
+#include "catalog/AssetCatalogFormat.h"
+#include "catalog/AssetCatalogSettings.h"
+#include "plist/Value.h"
+
+namespace tavrix::platform {
+
+// Where one download of an asset lives in its type's cache directory. Every download gets names
+// of its own (the archive's digest and a random suffix), so two downloads of the same asset that
+// overlap never remove or replace each other's files. Staging names start with "." so that they
+// never collide with an installed asset.
+struct AssetCacheLocation {
+    std::string directory;
+    std::string archiveFile;
+    std::string extractionDirectory;
+
+    static AssetCacheLocation forDownload(const std::string& typeCacheDirectory,
+                                          const CatalogEntry& entry);
+};
+
+// Removes the downloads a process that ended left in a type's cache directory: staged ones (before
+// a download starts: downloads run one at a time) and, with completedToo, complete ones as well
+// (at launch, once an interrupted install has been resumed, when none can be in use).
+void removeAbandonedDownloads(const std::string& typeCacheDirectory, bool completedToo);
+
+using AssetProgressReporter = std::function<void(plist::Dictionary progress)>;
+
+// Downloads, verifies and extracts the entry's archive within limits, renames the extraction to
+// location.directory when it is whole, and reports the intermediate steps. Nothing on success,
+// else why it failed. Either way the staged archive and any partial extraction are gone
+// afterwards.
+std::optional<std::string> downloadAndInstallAsset(const CatalogEntry& entry,
+                                                   const AssetCacheLocation& location,
+                                                   const AssetLimits& limits,
+                                                   const AssetProgressReporter& report);
+
+}  // namespace tavrix::platform

@@ -1,0 +1,190 @@
+#include "catalog/CatalogLoader.h"
+
+#include <cerrno>
+#include <chrono>
+#include <cstring>
+
+#include "util/FileSystemUtilities.h"
+#include "fs/AtomicFile.h"
+#include "catalog/CatalogTrust.h"
+#include "util/Clock.h"
+#include "http/HttpTransfer.h"
+#include "plist/PropertyListFormat.h"
+#include "util/Log.h"
+
+namespace tavrix::platform {
+namespace {
+
+constexpr const char* kLocalCopyName = "/catalog.plist";
+// Generous: a wrong length is then refused as a bad signature, not as a failed fetch.
+constexpr std::size_t kMaxSignatureBytes = 4096;
+
+struct SignedCatalog {
+    std::string bytes;
+    // Empty when no key is configured.
+    std::string signature;
+};
+
+bool isSigned(const AssetTypeSettings& settings) {
+    return !settings.trustedKeys.empty();
+}
+
+// The catalog and its signature share one time budget: the whole fetch is what a waiting update
+// check feels.
+class FetchDeadline {
+  public:
+    explicit FetchDeadline(long seconds)
+        : end_(std::chrono::steady_clock::now() + std::chrono::seconds(seconds)) {}
+    long remainingMilliseconds() const {
+        auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+            end_ - std::chrono::steady_clock::now());
+        return static_cast<long>(left.count());
+    }
+
+  private:
+    std::chrono::steady_clock::time_point end_;
+};
+
+std::optional<SignedCatalog> fetchFromServer(const AssetTypeSettings& settings,
+                                             CatalogRefusal& refusal) {
+    std::string error;
+    SignedCatalog catalog;
+    const AssetLimits& limits = settings.limits;
+    FetchDeadline deadline(limits.catalogTimeoutSeconds);
+    std::optional<std::string> bytes =
+        fetchHttpBody(settings.catalogURL, kMaxCatalogBytes,
+                      limits.catalogTransfer(deadline.remainingMilliseconds()), error);
+    if (!bytes) {
+        refusal = {CatalogRefusalKind::FetchFailed, "cannot fetch it: " + error};
+        return std::nullopt;
+    }
+    catalog.bytes = std::move(*bytes);
+    if (isSigned(settings)) {
+        std::string signatureURL = settings.catalogURL + kCatalogSignatureSuffix;
+        std::optional<std::string> signature =
+            fetchHttpBody(signatureURL, kMaxSignatureBytes,
+                          limits.catalogTransfer(deadline.remainingMilliseconds()), error);
+        if (!signature) {
+            refusal = {CatalogRefusalKind::MissingSignature,
+                       "cannot fetch its signature " + signatureURL + ": " + error};
+            return std::nullopt;
+        }
+        catalog.signature = std::move(*signature);
+    }
+    return catalog;
+}
+
+// Keeps the verified pair for local queries. Failing to keep it costs only those queries.
+void keepLocalCopy(const AssetTypeSettings& settings, const SignedCatalog& catalog) {
+    std::string path = settings.cacheDirectory + kLocalCopyName;
+    std::string signaturePath = path + kCatalogSignatureSuffix;
+    int error = payload::createDirectoryAt(settings.cacheDirectory, 0755, true);
+    if (error == 0 && isSigned(settings)) {
+        error = replaceFileAtomically(signaturePath, catalog.signature, 0644);
+    }
+    if (error == 0) {
+        error = replaceFileAtomically(path, catalog.bytes, 0644);
+    }
+    if (error == 0 && !isSigned(settings)) {
+        payload::removeItemTree(signaturePath);  // a stale signature would only mislead
+    }
+    if (error != 0) {
+        logCFormat("Asset catalog: cannot keep a local copy of the catalog in %s: %s",
+                   settings.cacheDirectory.c_str(), std::strerror(error));
+    }
+}
+
+// Records the serial of a catalog taken from the server. Failing to costs only the rollback
+// protection of that one step, so the catalog is still used.
+void recordSerial(const AssetTypeSettings& settings, std::int64_t serial,
+                  std::optional<std::int64_t> highestAccepted) {
+    if (highestAccepted && serial <= *highestAccepted) {
+        return;
+    }
+    if (int error = recordAcceptedSerial(settings.assetType, serial); error != 0) {
+        logCFormat("Asset catalog: cannot record serial %lld of %s: %s",
+                   static_cast<long long>(serial), settings.assetType.c_str(),
+                   std::strerror(error));
+    }
+}
+
+std::optional<std::vector<CatalogEntry>> loadOnce(const AssetTypeSettings& settings, bool localOnly,
+                                                  CatalogRefusal& refusal) {
+    if (!isSigned(settings) && !settings.allowUnsigned) {
+        refusal = {CatalogRefusalKind::UnsignedNotAllowed, "no trusted key is configured for " +
+                                                               settings.assetType +
+                                                               " and AllowUnsigned is not set"};
+        return std::nullopt;
+    }
+    std::optional<SignedCatalog> catalog;
+    if (localOnly) {
+        std::string path = settings.cacheDirectory + kLocalCopyName;
+        std::optional<std::string> bytes = plist::readFileBytes(path);
+        if (!bytes) {
+            return std::vector<CatalogEntry>();
+        }
+        catalog = SignedCatalog{std::move(*bytes), {}};
+        if (isSigned(settings)) {
+            catalog->signature =
+                plist::readFileBytes(path + kCatalogSignatureSuffix).value_or(std::string());
+        }
+    } else {
+        catalog = fetchFromServer(settings, refusal);
+        if (!catalog) {
+            return std::nullopt;
+        }
+    }
+    std::string whyNot;
+    std::optional<plist::Value> parsed = parseCatalog(catalog->bytes, whyNot);
+    if (!parsed) {
+        refusal = {CatalogRefusalKind::Malformed, whyNot};
+        return std::nullopt;
+    }
+    if (isSigned(settings)) {
+        if (!verifyWithTrustedKey(catalog->bytes, catalog->signature, catalogKeyID(*parsed),
+                                  settings.trustedKeys, refusal)) {
+            return std::nullopt;
+        }
+    } else {
+        logCFormat(
+            "Asset catalog: taking the catalog %s unverified: AllowUnsigned is set, which "
+            "is for development only",
+            settings.catalogURL.c_str());
+    }
+    std::optional<CatalogMetadata> metadata = readCatalogMetadata(*parsed, refusal);
+    if (!metadata) {
+        return std::nullopt;
+    }
+    std::optional<std::int64_t> highestAccepted = readAcceptedSerial(settings.assetType);
+    if (!checkFreshness(*metadata, plist::Date{Clock::absoluteTimeNow()}, highestAccepted,
+                        refusal)) {
+        return std::nullopt;
+    }
+    std::optional<std::vector<CatalogEntry>> entries =
+        readCatalogEntries(*parsed, settings.catalogURL, settings.assetType, whyNot);
+    if (!entries) {
+        refusal = {CatalogRefusalKind::Malformed, whyNot};
+        return std::nullopt;
+    }
+    if (!localOnly) {
+        recordSerial(settings, metadata->serial, highestAccepted);
+        keepLocalCopy(settings, *catalog);
+    }
+    return entries;
+}
+
+}  // namespace
+
+std::optional<std::vector<CatalogEntry>> loadCatalogEntries(const AssetTypeSettings& settings,
+                                                            bool localOnly,
+                                                            CatalogRefusal& refusal) {
+    std::optional<std::vector<CatalogEntry>> entries = loadOnce(settings, localOnly, refusal);
+    // A publisher replaces the signature just before the catalog, so a fetch that falls between
+    // the two sees a pair that does not match; fetching again settles it.
+    if (!entries && !localOnly && refusal.kind() == CatalogRefusalKind::BadSignature) {
+        entries = loadOnce(settings, localOnly, refusal);
+    }
+    return entries;
+}
+
+}  // namespace tavrix::platform

@@ -1,0 +1,127 @@
+#include "catalog/Sha256.h"
+
+#include <fcntl.h>
+#include <openssl/evp.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <vector>
+
+#include "util/SharedLibrary.h"
+#include "util/SystemLog.h"
+#include "fs/UniqueFd.h"
+
+namespace tavrix::platform {
+namespace {
+
+constexpr const char* kLibraryName = "libcrypto.so.3";
+
+struct Crypto {
+    std::unique_ptr<SharedLibrary> library;
+    decltype(&::EVP_MD_CTX_new) contextNew = nullptr;
+    decltype(&::EVP_MD_CTX_free) contextFree = nullptr;
+    decltype(&::EVP_sha256) sha256 = nullptr;
+    decltype(&::EVP_DigestInit_ex) init = nullptr;
+    decltype(&::EVP_DigestUpdate) update = nullptr;
+    decltype(&::EVP_DigestFinal_ex) final = nullptr;
+};
+
+Crypto load() {
+    Crypto crypto;
+    std::string error;
+    auto library = SharedLibrary::open(kLibraryName, error);
+    bool bound = library && library->bind(crypto.contextNew, "EVP_MD_CTX_new", error) &&
+                 library->bind(crypto.contextFree, "EVP_MD_CTX_free", error) &&
+                 library->bind(crypto.sha256, "EVP_sha256", error) &&
+                 library->bind(crypto.init, "EVP_DigestInit_ex", error) &&
+                 library->bind(crypto.update, "EVP_DigestUpdate", error) &&
+                 library->bind(crypto.final, "EVP_DigestFinal_ex", error);
+    if (!bound) {
+        writeSystemLog(LOG_ERR, "SHA-256 digests are unavailable: " + error);
+        return Crypto{};
+    }
+    // Kept for the rest of the process: libcrypto cleans up at exit, not at dlclose.
+    crypto.library = std::move(library);
+    return crypto;
+}
+
+const Crypto* loadCrypto() {
+    static const Crypto crypto = load();
+    return crypto.library ? &crypto : nullptr;
+}
+
+}  // namespace
+
+struct Sha256Digest::Context {
+    const Crypto* crypto = nullptr;
+    EVP_MD_CTX* state = nullptr;
+    bool failed = false;
+};
+
+Sha256Digest::Sha256Digest() : context_(std::make_unique<Context>()) {
+    const Crypto* crypto = loadCrypto();
+    if (crypto == nullptr) {
+        context_->failed = true;
+        return;
+    }
+    context_->crypto = crypto;
+    context_->state = crypto->contextNew();
+    context_->failed =
+        context_->state == nullptr || crypto->init(context_->state, crypto->sha256(), nullptr) != 1;
+}
+
+Sha256Digest::~Sha256Digest() {
+    if (context_->state != nullptr) {
+        context_->crypto->contextFree(context_->state);
+    }
+}
+
+void Sha256Digest::update(std::string_view bytes) {
+    if (!context_->failed &&
+        context_->crypto->update(context_->state, bytes.data(), bytes.size()) != 1) {
+        context_->failed = true;
+    }
+}
+
+std::string Sha256Digest::finishHex() {
+    unsigned char digest[EVP_MAX_MD_SIZE];
+    unsigned int length = 0;
+    if (context_->failed || context_->crypto->final(context_->state, digest, &length) != 1 ||
+        length * 2 != kSha256HexLength) {
+        context_->failed = true;
+        return {};
+    }
+    context_->failed = true;  // spent
+    static constexpr char kHex[] = "0123456789abcdef";
+    std::string hex(kSha256HexLength, '\0');
+    for (unsigned int i = 0; i < length; ++i) {
+        hex[2 * i] = kHex[digest[i] >> 4];
+        hex[2 * i + 1] = kHex[digest[i] & 0x0F];
+    }
+    return hex;
+}
+
+std::optional<std::string> sha256HexOfFile(const std::string& path) {
+    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    if (!fd) {
+        return std::nullopt;
+    }
+    Sha256Digest digest;
+    std::vector<char> buffer(1 << 16);
+    for (;;) {
+        ssize_t count = ::read(fd.get(), buffer.data(), buffer.size());
+        if (count < 0 && errno == EINTR) {
+            continue;
+        }
+        if (count < 0) {
+            return std::nullopt;
+        }
+        if (count == 0) {
+            std::string hex = digest.finishHex();
+            return hex.empty() ? std::nullopt : std::optional<std::string>(std::move(hex));
+        }
+        digest.update(std::string_view(buffer.data(), static_cast<std::size_t>(count)));
+    }
+}
+
+}  // namespace tavrix::platform

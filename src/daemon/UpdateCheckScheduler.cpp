@@ -1,0 +1,156 @@
+#include "daemon/UpdateCheckScheduler.h"
+
+#include <atomic>
+
+#include "device/BehaviorPreferences.h"
+#include "daemon/TXManager.h"
+#include "bus/TXTransactionManager.h"
+#include "util/Clock.h"
+#include "util/Log.h"
+
+namespace tavrix {
+
+namespace {
+
+// Set once the scheduler exists, so that shutting down never creates it.
+std::atomic<UpdateCheckScheduler*> created{nullptr};
+
+}  // namespace
+
+UpdateCheckScheduler& UpdateCheckScheduler::sharedInstance() {
+    // Never destroyed: the download path may call in until its thread has been joined.
+    static UpdateCheckScheduler* scheduler = [] {
+        auto* made = new UpdateCheckScheduler();
+        created.store(made);
+        return made;
+    }();
+    return *scheduler;
+}
+
+bool UpdateCheckScheduler::shutdownIfStarted(std::chrono::milliseconds patience) {
+    UpdateCheckScheduler* scheduler = created.load();
+    if (scheduler == nullptr) {
+        return true;
+    }
+    // The timer first: it is what queues jobs on the scheduler queue.
+    scheduler->_jobScheduler->stopTimer();
+    return scheduler->_schedulerQueue.shutdown(patience);
+}
+
+UpdateCheckScheduler::UpdateCheckScheduler() : _schedulerQueue(kUpdateCheckQueueLabel) {
+    logObjectFormat("Initializing Timers Manager");
+    // Created on the queue: a job due at launch is queued by the binding's constructor, and so
+    // reaches onJobFired only once the binding is in place.
+    _schedulerQueue.dispatchSync([this] {
+        _jobScheduler.emplace(kUpdateCheckClientName, _schedulerQueue,
+                              [this](const std::string& jobName, const plist::Dictionary* job) {
+                                  onJobFired(jobName, job);
+                              });
+    });
+    startTimer();
+}
+
+void UpdateCheckScheduler::startTimer() {
+    if (!TXManager::sharedInstance().isTavrixBundleSupported()) {
+        // A job registered earlier stays: it finds the device unsupported when it fires.
+        logObjectFormat("Behavior bundle is not supported, not starting the update check timer");
+        return;
+    }
+    auto stored = copyBehaviorPreference(kNextUpdateKey);
+    const plist::Date* nextUpdate = stored ? stored->asDate() : nullptr;
+    if (nextUpdate == nullptr) {
+        logObjectFormat("No previous update time in the preferences list");
+        setUpNewTimer(kUpdateCheckIntervalSeconds);
+    } else if (nextUpdate->secondsSinceReferenceDate < platform::Clock::absoluteTimeNow()) {
+        // A missed check is not run now but pushed a whole interval ahead.
+        logObjectFormat("Previous update time present is past, resetting it");
+        setUpNewTimer(kUpdateCheckIntervalSeconds);
+    } else {
+        scheduleJob();
+    }
+}
+
+void UpdateCheckScheduler::setUpNewTimer(double seconds) {
+    std::lock_guard lock(_rearmLock);
+    logObjectFormat("Setting up a new update check timer");
+    plist::Date nextUpdate{platform::Clock::absoluteTimeNow() + seconds};
+    setBehaviorPreference(kNextUpdateKey, plist::Value(nextUpdate));
+    scheduleJob();
+}
+
+void UpdateCheckScheduler::scheduleJob() {
+    std::lock_guard lock(_rearmLock);
+    auto stored = copyBehaviorPreference(kNextUpdateKey);
+    const plist::Date* nextUpdate = stored ? stored->asDate() : nullptr;
+    if (nextUpdate == nullptr) {
+        logObjectFormat(
+            "No update time in the preferences list, the update check is not scheduled");
+        return;
+    }
+    const double start = nextUpdate->secondsSinceReferenceDate;
+    plist::Dictionary criteria{
+        {std::string(platform::kJobWindowStartDate), start},
+        {std::string(platform::kJobWindowEndDate), start + kUpdateCheckWindowSeconds},
+        {std::string(platform::kJobPowerOptimizationLevel), plist::Integer(1)},
+        {std::string(platform::kJobAllowedDuringVoiceCall), true},
+    };
+    // Every supported launch comes here: a registration that is already as asked is left alone,
+    // rather than written to the job store (with its fsync) again.
+    const plist::Dictionary jobs = _jobScheduler->copyJobs();
+    auto registered = jobs.find(kUpdateCheckJobName);
+    if (registered != jobs.end() && registered->second == plist::Value(criteria)) {
+        return;
+    }
+    // Adding replaces the job of that name; one that cannot be added must not stay either.
+    if (!_jobScheduler->addJob(kUpdateCheckJobName, criteria)) {
+        _jobScheduler->removeJob(kUpdateCheckJobName);
+    }
+}
+
+void UpdateCheckScheduler::onJobFired(const std::string& /*jobName*/,
+                                      const plist::Dictionary* job) {
+    auto& transactions = TXTransactionManager::sharedInstance();
+    // Keep-alive, so that the daemon stays for the download that may follow.
+    transactions.beginTransaction(TXUpdateCheckTransaction, true);
+    if (job == nullptr) {
+        logObjectFormat("Invalid Corvex job object received in the call back");
+    } else if (TXManager::sharedInstance().checkForTavrixBundleUpdate()) {
+        // The download path ends the transaction through rescheduleAndEndCheck.
+        return;
+    }
+    logObjectFormat("Update check has failed, rescheduling the next update");
+    setUpNewTimer(kUpdateCheckIntervalSeconds);
+    // Ended twice, as this path always has; the second end finds the name closed and does nothing.
+    transactions.endTransaction(TXUpdateCheckTransaction);
+    transactions.endTransaction(TXUpdateCheckTransaction);
+}
+
+void UpdateCheckScheduler::rescheduleAndEndCheck(double seconds) {
+    setUpNewTimer(seconds);
+    TXTransactionManager::sharedInstance().endTransaction(TXUpdateCheckTransaction);
+}
+
+std::optional<double> UpdateCheckScheduler::nextCheckTime() const {
+    if (!_jobScheduler) {
+        return std::nullopt;
+    }
+    plist::Dictionary jobs = _jobScheduler->copyJobs();
+    auto job = jobs.find(kUpdateCheckJobName);
+    const plist::Dictionary* criteria = job != jobs.end() ? job->second.asDictionary() : nullptr;
+    if (criteria == nullptr) {
+        return std::nullopt;
+    }
+    auto start = criteria->find(std::string(platform::kJobWindowStartDate));
+    if (start == criteria->end()) {
+        return std::nullopt;
+    }
+    if (const double* real = start->second.asReal()) {
+        return *real;
+    }
+    if (const plist::Integer* integer = start->second.asInteger()) {
+        return static_cast<double>(integer->signedValue());
+    }
+    return std::nullopt;
+}
+
+}  // namespace tavrix

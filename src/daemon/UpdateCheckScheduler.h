@@ -1,0 +1,63 @@
+// Schedules the periodic over-the-air update check. The time of the next check is the daemon
+// preference "NextUpdate"; one background job fires inside a one-hour window starting then, and
+// its handler runs the check under a keep-alive transaction.
+#pragma once
+
+#include <chrono>
+#include <mutex>
+#include <optional>
+#include <string>
+
+#include "bus/BackgroundJobScheduler.h"
+#include "plist/Value.h"
+#include "util/SerialQueue.h"
+
+namespace tavrix {
+
+// The interval the scheduler arms itself with: 15 days.
+inline constexpr double kUpdateCheckIntervalSeconds = 1296000.0;
+// How long the job's window stays open after "NextUpdate".
+inline constexpr double kUpdateCheckWindowSeconds = 3600.0;
+// Held open, with keep-alive, from the job firing until the check has come to an end.
+inline constexpr const char* TXUpdateCheckTransaction = "Update Check";
+
+inline constexpr const char* kUpdateCheckJobName = "Behavior Bundle Update Check";
+inline constexpr const char* kUpdateCheckClientName = "com.zandor.tavrixservicesd";
+inline constexpr const char* kUpdateCheckQueueLabel = "com.zandor.quorrd.TimerManagerSerialQueue";
+
+class UpdateCheckScheduler {
+  public:
+    // The process's scheduler, created once from any thread; creating it arms its timer.
+    static UpdateCheckScheduler& sharedInstance();
+
+    // Stops the job timer and the scheduler queue (letting a check already queued run), if the
+    // scheduler was ever created. False when the queue was still busy after patience. The
+    // scheduler stays usable for re-arming (a download finishing later), but no job fires.
+    static bool shutdownIfStarted(std::chrono::milliseconds patience);
+
+    // Arms the timer from the stored "NextUpdate" (pushed 15 days ahead when missing or past).
+    void startTimer();
+    // Stores now + seconds as "NextUpdate" and registers the job for it.
+    void setUpNewTimer(double seconds);
+    // (Re)registers the one job for the stored "NextUpdate".
+    void scheduleJob();
+    // The job's handler, on the scheduler queue: runs the check.
+    void onJobFired(const std::string& jobName, const plist::Dictionary* job);
+    // Re-arms seconds ahead and ends the check; called when a started download has finished,
+    // from any thread.
+    void rescheduleAndEndCheck(double seconds);
+    // When the registered job's window starts (seconds since the reference date), or nothing
+    // when no check is registered.
+    std::optional<double> nextCheckTime() const;
+
+  private:
+    UpdateCheckScheduler();
+
+    SerialQueue _schedulerQueue;
+    std::optional<platform::BackgroundJobScheduler> _jobScheduler;
+    // Re-arming runs on the main thread, the scheduler queue and the download thread; this keeps
+    // "NextUpdate" and the registered job in step.
+    std::recursive_mutex _rearmLock;
+};
+
+}  // namespace tavrix

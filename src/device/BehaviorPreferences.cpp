@@ -1,0 +1,20 @@
+#include "device/BehaviorPreferences.h"
+
+#include "device/MobileUser.h"
+#include "device/PreferencesStore.h"
+
+namespace tavrix {
+
+std::optional<plist::Value> copyBehaviorPreference(std::string_view key) {
+    return platform::PreferencesStore::shared().copyValue(key, kBehaviorPreferencesDomain,
+                                                          payload::MobileUser::name());
+}
+
+bool setBehaviorPreference(std::string_view key, const std::optional<plist::Value>& value) {
+    auto& store = platform::PreferencesStore::shared();
+    const std::string& user = payload::MobileUser::name();
+    store.setValue(key, value, kBehaviorPreferencesDomain, user);
+    return store.synchronize(kBehaviorPreferencesDomain, user);
+}
+
+}  // namespace tavrix

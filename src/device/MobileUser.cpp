@@ -1,0 +1,43 @@
+#include "device/MobileUser.h"
+
+#include "device/PlatformRoot.h"
+#include "device/UserDatabase.h"
+
+namespace tavrix::payload {
+
+MobileUser::Facts MobileUser::lookUpUnder(std::string_view root) {
+    Facts facts;
+    if (auto record = platform::lookupUserUnder(root, name())) {
+        facts.uid = record->uid;
+        facts.gid = record->gid;
+        if (!record->homeDirectory.empty()) {
+            facts.homeDirectory = record->homeDirectory;
+        }
+    }
+    return facts;
+}
+
+const std::string& MobileUser::name() {
+    static const std::string kName = "mobile";
+    return kName;
+}
+
+const MobileUser::Facts& MobileUser::facts() {
+    static const Facts kFacts = lookUpUnder(platform::platformRoot());
+    return kFacts;
+}
+
+const char* MobileUser::homeDirectory() {
+    const auto& home = facts().homeDirectory;
+    return home ? home->c_str() : nullptr;
+}
+
+uid_t MobileUser::uid() {
+    return facts().uid;
+}
+
+gid_t MobileUser::gid() {
+    return facts().gid;
+}
+
+}  // namespace tavrix::payload

@@ -1,0 +1,193 @@
+#include "device/TXUtility.h"
+
+#include <pwd.h>
+#include <sys/stat.h>
+#include <sys/statfs.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <cmath>
+#include <cstdlib>
+#include <ctime>
+#include <vector>
+
+#include "device/DeviceInfoService.h"
+#include "util/Log.h"
+
+namespace tavrix {
+namespace {
+
+bool gIsDaemon = false;
+
+std::optional<std::string> homeDirectory() {
+    const char* home = std::getenv("HOME");
+    if (home != nullptr && *home != '\0') {
+        return std::string(home);
+    }
+    long suggested = ::sysconf(_SC_GETPW_R_SIZE_MAX);
+    std::vector<char> buffer(suggested > 0 ? static_cast<std::size_t>(suggested) : 4096);
+    for (;;) {
+        passwd entry{};
+        passwd* found = nullptr;
+        int error = ::getpwuid_r(::geteuid(), &entry, buffer.data(), buffer.size(), &found);
+        if (error == ERANGE && buffer.size() < (1u << 20)) {
+            buffer.resize(buffer.size() * 2);
+            continue;
+        }
+        if (error != 0 || found == nullptr || entry.pw_dir == nullptr || *entry.pw_dir == '\0') {
+            return std::nullopt;
+        }
+        return std::string(entry.pw_dir);
+    }
+}
+
+}  // namespace
+
+namespace {
+
+// Set once the task queue exists, so that shutting down never creates it.
+std::atomic<SerialQueue*> createdTaskQueue{nullptr};
+
+}  // namespace
+
+SerialQueue& TXUtility::taskQueue() {
+    // Never destroyed: the daemon stops its worker (shutdownTaskQueue) before leaving instead.
+    static SerialQueue* queue = [] {
+        auto* made = new SerialQueue("com.zandor.tavrixservices.operationTaskQueue");
+        createdTaskQueue.store(made);
+        return made;
+    }();
+    return *queue;
+}
+
+bool TXUtility::shutdownTaskQueue(std::chrono::milliseconds patience) {
+    SerialQueue* queue = createdTaskQueue.load();
+    return queue == nullptr || queue->shutdown(patience);
+}
+
+void TXUtility::setIsDaemon(bool isDaemon) {
+    gIsDaemon = isDaemon;
+}
+
+bool TXUtility::isDaemon() {
+    return gIsDaemon;
+}
+
+bool TXUtility::isWiFiCapable() {
+    return platform::deviceBooleanAnswer("wi-fi");
+}
+
+bool TXUtility::hasCellularRadio() {
+    return platform::deviceBooleanAnswer("contains-cellular-radio");
+}
+
+const std::optional<std::string>& TXUtility::serialNumber() {
+    static const std::optional<std::string> fact = platform::copyDeviceStringAnswer("SerialNumber");
+    return fact;
+}
+
+const std::optional<std::string>& TXUtility::currentProductCategory() {
+    static const std::optional<std::string> fact = platform::copyDeviceStringAnswer("DeviceClass");
+    return fact;
+}
+
+const std::optional<std::string>& TXUtility::currentProductType() {
+    static const std::optional<std::string> fact = platform::copyDeviceStringAnswer("ProductType");
+    return fact;
+}
+
+const std::optional<std::string>& TXUtility::currentProductVersion() {
+    static const std::optional<std::string> fact =
+        platform::copyDeviceStringAnswer("ProductVersion");
+    return fact;
+}
+
+const std::optional<std::string>& TXUtility::currentProductBuild() {
+    static const std::optional<std::string> fact = platform::copyDeviceStringAnswer("BuildVersion");
+    return fact;
+}
+
+const std::optional<std::string>& TXUtility::currentReleaseType() {
+    static const std::optional<std::string> fact = platform::copyDeviceStringAnswer("ReleaseType");
+    return fact;
+}
+
+const std::optional<std::string>& TXUtility::currentHardwareModel() {
+    static const std::optional<std::string> fact = platform::copyDeviceStringAnswer("HWModelStr");
+    return fact;
+}
+
+bool TXUtility::freeSpaceExceeds(std::uint64_t blockSize, std::uint64_t freeBlocks,
+                                 std::uint64_t bytes) {
+    std::uint64_t freeBytes = 0;
+    if (__builtin_mul_overflow(blockSize, freeBlocks, &freeBytes)) {
+        return true;
+    }
+    return freeBytes > bytes;
+}
+
+bool TXUtility::hasEnoughDiskSpace(std::uint64_t bytes) {
+    auto home = homeDirectory();
+    return home && hasEnoughDiskSpaceAt(*home, bytes);
+}
+
+bool TXUtility::hasEnoughDiskSpaceAt(const std::string& path, std::uint64_t bytes) {
+    struct statfs info {};
+    if (::statfs(path.c_str(), &info) != 0) {
+        return false;
+    }
+    // The block counts are in units of the fragment size, which is the block size on nearly every
+    // file system; older kernels leave it zero.
+    auto unit = static_cast<std::uint64_t>(info.f_frsize > 0 ? info.f_frsize : info.f_bsize);
+    return freeSpaceExceeds(unit, static_cast<std::uint64_t>(info.f_bfree), bytes);
+}
+
+std::optional<std::string> TXUtility::URLIfFileExists(const std::string& path) {
+    struct stat info {};
+    if (path.empty() || ::stat(path.c_str(), &info) != 0) {
+        return std::nullopt;
+    }
+    return path;
+}
+
+GregorianCalendar TXUtility::gregorianCalendar() {
+    return GregorianCalendar();
+}
+
+std::optional<plist::Date> TXUtility::addToDate(plist::Date date, long numberOfDays) {
+    auto result = gregorianCalendar().addingDays(date, numberOfDays);
+    if (!result) {
+        logCFormat("addToDate:numberOfDays: unable to add %ld days to date: %f", numberOfDays,
+                   date.secondsSinceReferenceDate);
+    }
+    return result;
+}
+
+std::string TXUtility::prettyPrintDate(plist::Date date) {
+    double whole = std::floor(date.unixTime());
+    std::tm local{};
+    bool representable = std::isfinite(whole) && whole >= -9.2e18 && whole <= 9.2e18;
+    std::time_t seconds = representable ? static_cast<std::time_t>(whole) : 0;
+    ::tzset();
+    char text[128];
+    if (!representable || ::localtime_r(&seconds, &local) == nullptr ||
+        std::strftime(text, sizeof text, "%x %H:%M", &local) == 0) {
+        // Still something readable for a log line.
+        return std::to_string(date.secondsSinceReferenceDate);
+    }
+    return text;
+}
+
+std::optional<std::string> TXUtility::runStateName(int runState) {
+    switch (runState) {
+        case 1:
+            return "Foreground";
+        case 0:
+            return "Background";
+        default:
+            return std::nullopt;
+    }
+}
+
+}  // namespace tavrix

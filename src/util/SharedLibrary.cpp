@@ -1,0 +1,16 @@
+#include "util/SharedLibrary.h"
+
+namespace tavrix::platform {
+
+std::unique_ptr<SharedLibrary> SharedLibrary::open(const char* name, std::string& error) {
+    // RTLD_NOW: a library too old for a symbol fails here, not in the middle of a transfer.
+    void* handle = ::dlopen(name, RTLD_NOW | RTLD_LOCAL);
+    if (handle == nullptr) {
+        const char* why = ::dlerror();
+        error = why != nullptr ? why : std::string(name) + " cannot be loaded";
+        return nullptr;
+    }
+    return std::unique_ptr<SharedLibrary>(new SharedLibrary(name, handle));
+}
+
+}  // namespace tavrix::platform
