@@ -31,7 +31,7 @@
 
 #include "BenchSupport.h"
 #include "bus/BusHandles.h"
-#include "fs/UniqueFd.h"
+#include "io/UniqueFd.h"
 
 extern char** environ;
 
@@ -386,15 +386,15 @@ std::string readAddress(int fd) {
 // Starts dbus-daemon on the generated configuration and returns its address. Its stderr, and so
 // the services', goes to the log. The caller's DescendantsGuard ends it.
 std::string startBus(const fs::path& directory, const fs::path& log) {
-    UniqueFd logFd(::open(log.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644));
+    io::UniqueFd logFd(::open(log.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644));
     int ends[2];
     if (!logFd || ::pipe2(ends, O_CLOEXEC) != 0) {
         throw std::runtime_error("cannot open the bus's log or address pipe");
     }
-    UniqueFd addressRead(ends[0]);
-    UniqueFd addressWriteLow(ends[1]);
+    io::UniqueFd addressRead(ends[0]);
+    io::UniqueFd addressWriteLow(ends[1]);
     // Above the descriptors the child gets, so that no dup2 below overwrites it.
-    UniqueFd addressWrite(::fcntl(addressWriteLow.get(), F_DUPFD_CLOEXEC, 10));
+    io::UniqueFd addressWrite(::fcntl(addressWriteLow.get(), F_DUPFD_CLOEXEC, 10));
     addressWriteLow.reset();
 
     posix_spawn_file_actions_t actions;
@@ -551,7 +551,7 @@ void stopService(sd_bus* bus, const Service& service) {
     const pid_t pid = ownerPid(bus, service);
     // By pidfd, so that the signal cannot reach another process that got the id in between.
     // (Through syscall: this glibc declares the wrappers without C linkage for C++.)
-    UniqueFd process(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)));
+    io::UniqueFd process(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)));
     if (!process || ::syscall(SYS_pidfd_send_signal, process.get(), SIGTERM, nullptr, 0) != 0) {
         throw std::runtime_error("cannot send SIGTERM to " + std::string(service.label) + " (" +
                                  std::to_string(pid) + "): " + std::strerror(errno));

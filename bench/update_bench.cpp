@@ -28,7 +28,7 @@
 #include "client/TavrixClient.h"
 #include "payload/Archive.h"
 #include "plist/PropertyListFormat.h"
-#include "fs/UniqueFd.h"
+#include "io/UniqueFd.h"
 
 using namespace tavrix;
 using bench::readBytes;
@@ -73,7 +73,7 @@ double millisSince(Clock::time_point start) {
 
 // A port on 127.0.0.1 that nothing listens on now.
 int freePort() {
-    UniqueFd fd(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    io::UniqueFd fd(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
     sockaddr_in address{};
     address.sin_family = AF_INET;
     address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
@@ -86,7 +86,7 @@ int freePort() {
 }
 
 bool accepts(int port) {
-    UniqueFd fd(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    io::UniqueFd fd(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));
     sockaddr_in address{};
     address.sin_family = AF_INET;
     address.sin_addr.s_addr = htonl(INADDR_LOOPBACK);

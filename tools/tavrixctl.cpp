@@ -28,7 +28,7 @@
 #include "publishing/BundleCheck.h"
 #include "client/TavrixClient.h"
 #include "payload/Archive.h"
-#include "fs/UniqueFd.h"
+#include "io/UniqueFd.h"
 
 namespace {
 
@@ -185,7 +185,7 @@ std::optional<double> parseSeconds(const std::string& text) {
 }
 
 std::vector<std::uint8_t> readWholeFile(const std::string& path) {
-    tavrix::UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    tavrix::io::UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
     if (!fd) {
         throw Failure{"cannot read " + path + ": " + std::strerror(errno)};
     }

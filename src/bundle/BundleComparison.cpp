@@ -160,7 +160,7 @@ bool isCandidateBundleNewer(const CarrierBundle& current, const CarrierBundle& m
 }
 
 bool bundleLinksExist(const CarrierBundle& bundle) {
-    payload::FileSystemHelper fileSystem;
+    FileSystemHelper fileSystem;
     bool present = fileSystem.fileExists(bundle.bundleLinkPath) &&
                    fileSystem.fileExists(bundle.bundlePath) &&
                    fileSystem.fileExists(bundle.bundleRealPath);

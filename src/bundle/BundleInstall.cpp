@@ -6,6 +6,7 @@
 #include "bundle/BundleLocations.h"
 #include "bundle/BundleManager.h"
 #include "device/PlatformRoot.h"
+#include "io/Paths.h"
 #include "payload/PayloadUnpack.h"
 #include "util/FileSystemHelper.h"
 #include "util/Log.h"
@@ -37,8 +38,8 @@ bool BundleManager::installBehaviorBundleData(const plist::Data& data, std::stri
     logCFormat("Writing the zipped file into: %s\n", payload::kBundleArchiveTempPath);
     const std::string stagedPath = platform::resolvePath(payload::kBundleArchiveTempPath);
 
-    payload::FileSystemHelper helper;
-    const std::string stagingDirectory = stagedPath.substr(0, stagedPath.find_last_of('/'));
+    FileSystemHelper helper;
+    const std::string stagingDirectory = io::parentDirectory(stagedPath);
     if (!helper.fileExists(stagingDirectory)) {
         helper.createDirectory(stagingDirectory, kTemporaryDirectoryMode, true);
     }

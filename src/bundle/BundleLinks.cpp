@@ -12,8 +12,9 @@
 #include <memory>
 
 #include "bundle/BundleInfo.h"
+#include "io/Paths.h"
+#include "io/UniqueFd.h"
 #include "util/Log.h"
-#include "fs/UniqueFd.h"
 
 namespace tavrix {
 namespace {
@@ -35,7 +36,7 @@ void copyCut(const std::string& path, char (&buffer)[kPathBufferSize]) {
 // Flushes the directory entry of a new link, so that after a power cut the links come back in the
 // order they were written.
 void flushDirectoryOf(const std::string& path) {
-    UniqueFd directory(::open(dirNameOfPath(path).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    io::UniqueFd directory(::open(dirNameOfPath(path).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     if (directory) {
         ::fsync(directory.get());
     }
@@ -139,12 +140,11 @@ std::string realPathOf(const std::string& path) {
 }
 
 std::string readLinkTarget(const std::string& path) {
-    char buffer[kPathBufferSize];
-    ssize_t length = ::readlink(path.c_str(), buffer, kPathBufferSize - 1);
-    if (length < 0) {
-        return {};
+    std::string target = io::readLinkTarget(path).value_or(std::string());
+    if (target.size() > kPathBufferSize - 1) {
+        target.resize(kPathBufferSize - 1);
     }
-    return std::string(buffer, static_cast<std::size_t>(length));
+    return target;
 }
 
 }  // namespace tavrix

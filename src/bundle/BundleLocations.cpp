@@ -2,8 +2,8 @@
 
 #include "device/MobileUser.h"
 #include "device/PlatformRoot.h"
-#include "util/Log.h"
 #include "device/TXUtility.h"
+#include "util/Log.h"
 
 namespace tavrix {
 namespace {
@@ -20,7 +20,7 @@ BundleLocations computeLocations() {
                                             deviceClass.value_or("") + "/" + kDefaultBundleName);
     // Without a known home there is no user bundle; an empty location keeps every install and
     // removal away from paths outside the device root.
-    if (const char* home = payload::MobileUser::homeDirectory()) {
+    if (const char* home = platform::MobileUser::homeDirectory()) {
         computed.user = std::string(home) + kUserBundlesDirectory + kDefaultBundleName;
     }
     return computed;

@@ -14,11 +14,11 @@
 #include "bundle/OverriddenCarrierFile.h"
 #include "bundle/OverrideGeneration.h"
 #include "bundle/VersionCompare.h"
-#include "device/MobileUser.h"
 #include "bus/NotificationCenter.h"
+#include "device/MobileUser.h"
 #include "device/PreferencesStore.h"
-#include "util/SystemLog.h"
 #include "util/Log.h"
+#include "util/SystemLog.h"
 
 namespace tavrix {
 namespace {
@@ -57,7 +57,7 @@ std::optional<std::string> fileSystemPathOf(const std::string& location) {
 }  // namespace
 
 BundleManager::BundleManager() {
-    const char* home = payload::MobileUser::homeDirectory();
+    const char* home = platform::MobileUser::homeDirectory();
     bundleLinkPath_ = homeLinkPath(home, kBundleLinkFormat);
     preferencesLinkPath_ = homeLinkPath(home, kPreferencesLinkFormat);
 
@@ -172,7 +172,7 @@ BundleChangeType BundleManager::runBundleReset() {
         logCFormat("Carrier Bundle Match Result: %s\n", changeTypeName(result));
         return result;
     }
-    const platform::ScopedLogField idField("TAVRIX_BEHAVIOR_ID", *behaviorID_);
+    const ScopedLogField idField("TAVRIX_BEHAVIOR_ID", *behaviorID_);
     logCFormat("\n");
     logCFormat(
         "=========================== Potentially Resetting Behavior Bundle "
@@ -188,7 +188,7 @@ BundleChangeType BundleManager::runBundleReset() {
     OverrideResult behaviorResult = applyMultimodeOverlay(matched, behaviorID_);
     logCFormat("Device overlay decision: %s\n", overrideResultName(behaviorResult));
     logCFormat("Dump state for the bundle after multimode overlay\n");
-    std::optional<platform::ScopedLogField> versionField;
+    std::optional<ScopedLogField> versionField;
     if (!matched.bundleVersion.empty()) {
         versionField.emplace("TAVRIX_BUNDLE_VERSION", matched.bundleVersion);
     }
@@ -210,7 +210,7 @@ BundleChangeType BundleManager::runBundleReset() {
             return kBundleChangeTypeNoChange;
         }
         platform::PreferencesStore::shared().synchronize(kBehaviorPreferencesDomain,
-                                                         payload::MobileUser::name());
+                                                         platform::MobileUser::name());
         platform::postNotification(kBundleChangedNotification);
         pruneOverriddenFilesOfRemovedBundles(currentBundle_.carrierFilePath);
     }

@@ -108,8 +108,8 @@ void takeBody(Transfer& transfer, std::optional<plist::Data>& out) {
     }
     std::optional<std::string> encoding = transfer.field("CONTENT-ENCODING");
     if (!encoding) {
-        platform::writeSystemLog(LOG_NOTICE, "XML file retrieved, file size: " +
-                                                 std::to_string(transfer.body.size()) + "\n");
+        writeSystemLog(LOG_NOTICE, "XML file retrieved, file size: " +
+                                       std::to_string(transfer.body.size()) + "\n");
         out = std::move(transfer.body);
         return;
     }
@@ -118,7 +118,7 @@ void takeBody(Transfer& transfer, std::optional<plist::Data>& out) {
     }
     plist::Data inflated;
     if (inflateGzip(transfer.body, inflated)) {
-        platform::writeSystemLog(
+        writeSystemLog(
             LOG_NOTICE,
             "XML file retrieved, compressed size: " + std::to_string(transfer.body.size()) +
                 ", decompressed size: " + std::to_string(inflated.size()) + "\n");

@@ -4,9 +4,9 @@
 
 #include <string_view>
 
+#include "plist/PropertyListFormat.h"
 #include "util/FileURL.h"
 #include "util/SystemLog.h"
-#include "plist/PropertyListFormat.h"
 
 namespace tavrix {
 namespace {
@@ -29,8 +29,8 @@ std::optional<plist::Value> copyDictionaryFromFile(const std::string& path) {
     std::optional<std::string> url = fileURLFromPath(path);
     if (!url) {
         // As a C string, the way a printf-style "%s" would show it.
-        platform::writeSystemLog(
-            LOG_ERR, "Failed to get the URL for the file " + std::string(path.c_str()) + "\n");
+        writeSystemLog(LOG_ERR,
+                       "Failed to get the URL for the file " + std::string(path.c_str()) + "\n");
         return std::nullopt;
     }
     std::optional<plist::Value> value = copyPropertyListFromURL(*url, kCarrierFileSourceLocal);
@@ -51,7 +51,7 @@ std::optional<plist::Value> copyPropertyListFromURL(const std::string& url,
         loaded = copyDataFromHTTP(url, &data);
     }
     if (!loaded) {
-        platform::writeSystemLog(LOG_ERR, "Failed to load the file\n");
+        writeSystemLog(LOG_ERR, "Failed to load the file\n");
         return std::nullopt;
     }
     // A fetch may succeed without data (an encoding other than gzip); that parses to nothing.

@@ -41,7 +41,7 @@ std::optional<std::string> findDeviceOverlayFileName(const std::string& director
         "extension: '%s'\n",
         prefix.c_str(), extension.c_str());
     std::vector<std::string> names;
-    payload::FileSystemHelper().listDirectory(directory, names, false);
+    FileSystemHelper().listDirectory(directory, names, false);
     // The kernel's order differs between file systems; name order makes the choice repeatable.
     std::sort(names.begin(), names.end());
     for (const std::string& name : names) {

@@ -8,10 +8,10 @@
 #include "bundle/BundleLocations.h"
 #include "bundle/BundleTypes.h"
 #include "bundle/OverriddenCarrierFile.h"
-#include "util/FileSystemUtilities.h"
-#include "payload/PayloadUnpack.h"
-#include "fs/AtomicFile.h"
 #include "device/PlatformRoot.h"
+#include "io/AtomicFile.h"
+#include "payload/PayloadUnpack.h"
+#include "util/FileSystemUtilities.h"
 #include "util/Log.h"
 
 namespace tavrix {
@@ -20,7 +20,7 @@ namespace {
 constexpr std::string_view kPropertyListExtension = ".plist";
 
 void removeLeftover(const std::string& path) {
-    if (payload::removeItemTree(path) == 0) {
+    if (removeItemTree(path) == 0) {
         logCFormat("Removed %s, left by an interrupted change\n", path.c_str());
     }
 }
@@ -28,7 +28,7 @@ void removeLeftover(const std::string& path) {
 // Removes the entries of directory whose names start with prefix.
 void removeEntriesStartingWith(const std::string& directory, std::string_view prefix) {
     std::vector<std::string> names;
-    if (directory.empty() || payload::readDirectoryNames(directory, names) != 0) {
+    if (directory.empty() || readDirectoryNames(directory, names) != 0) {
         return;
     }
     for (const std::string& name : names) {
@@ -60,11 +60,11 @@ void removeLeftoversOfInterruptedChanges(const std::string& bundleLink,
     std::string overlays = overriddenFilesDirectory();
     if (!overlays.empty()) {
         overlays.pop_back();
-        removeEntriesStartingWith(overlays, platform::kAtomicWritePrefix);
+        removeEntriesStartingWith(overlays, io::kAtomicWritePrefix);
     }
     const std::string staged = platform::resolvePath(payload::kBundleArchiveTempPath);
     removeLeftover(staged);
-    removeEntriesStartingWith(dirNameOfPath(staged), platform::kAtomicWritePrefix);
+    removeEntriesStartingWith(dirNameOfPath(staged), io::kAtomicWritePrefix);
     if (const std::string& userBundle = userBundleLocation(); !userBundle.empty()) {
         removeLeftover(payload::extractionStagingPathFor(userBundle));
     }
@@ -73,7 +73,7 @@ void removeLeftoversOfInterruptedChanges(const std::string& bundleLink,
 void pruneOverriddenFilesOfRemovedBundles(const std::string& keep) {
     std::string overlays = overriddenFilesDirectory();
     std::vector<std::string> names;
-    if (overlays.empty() || payload::readDirectoryNames(overlays, names) != 0) {
+    if (overlays.empty() || readDirectoryNames(overlays, names) != 0) {
         return;
     }
     std::vector<std::string> installed;
@@ -95,7 +95,7 @@ void pruneOverriddenFilesOfRemovedBundles(const std::string& keep) {
             std::find(installed.begin(), installed.end(), version) != installed.end()) {
             continue;
         }
-        if (payload::removeItemTree(path) == 0) {
+        if (removeItemTree(path) == 0) {
             logCFormat("Removed the overridden carrier file %s of a bundle no longer installed\n",
                        path.c_str());
         }

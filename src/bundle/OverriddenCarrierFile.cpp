@@ -8,10 +8,10 @@
 
 #include "bundle/BundleLinks.h"
 #include "bundle/BundleLocations.h"
-#include "util/FileSystemHelper.h"
 #include "device/MobileUser.h"
-#include "fs/AtomicFile.h"
+#include "io/AtomicFile.h"
 #include "plist/PropertyListFormat.h"
+#include "util/FileSystemHelper.h"
 #include "util/FileURL.h"
 #include "util/Log.h"
 
@@ -64,14 +64,14 @@ std::string fileNameField(std::string_view key) {
 }
 
 std::string overlayDirectory() {
-    const char* home = payload::MobileUser::homeDirectory();
+    const char* home = platform::MobileUser::homeDirectory();
     return std::string(home != nullptr ? home : "") + kUserBundlesDirectory + kOverlayDirectoryName;
 }
 
 }  // namespace
 
 std::string overriddenFilesDirectory() {
-    return payload::MobileUser::homeDirectory() != nullptr ? overlayDirectory() : std::string();
+    return platform::MobileUser::homeDirectory() != nullptr ? overlayDirectory() : std::string();
 }
 
 std::optional<std::string> overriddenFilePath(OverlayContext& context) {
@@ -105,7 +105,7 @@ std::optional<std::string> overriddenFilePath(OverlayContext& context) {
 
     std::string fileName = fileNameFor(prefix, version);
     // A name the file system cannot hold is no path at all; nothing is written then.
-    if (payload::MobileUser::homeDirectory() == nullptr || fileName.size() > NAME_MAX ||
+    if (platform::MobileUser::homeDirectory() == nullptr || fileName.size() > NAME_MAX ||
         fileName.find_first_of(std::string_view("/\0", 2)) != std::string::npos) {
         return std::nullopt;
     }
@@ -119,7 +119,7 @@ bool writeOverriddenCarrierFile(const plist::Value& dictionary,
         logCFormat("Failed to serialize the overridden dictionary\n");
         return false;
     }
-    payload::FileSystemHelper fileSystem;
+    FileSystemHelper fileSystem;
     if (path) {
         std::string directory = dirNameOfPath(*path);
         if (!fileSystem.fileExists(directory)) {
@@ -130,7 +130,7 @@ bool writeOverriddenCarrierFile(const plist::Value& dictionary,
         logCFormat("Failed to create the file URL\n");
         return false;
     }
-    if (int error = platform::createFileAtomically(*path, xml, kOverriddenFileMode); error != 0) {
+    if (int error = io::createFileAtomically(*path, xml, kOverriddenFileMode); error != 0) {
         logCFormat("Failed to write the overridden carrier bundle with error code: %d\n", error);
         return false;
     }

@@ -8,9 +8,9 @@
 #include "bundle/OverlayConfiguration.h"
 #include "bundle/OverlayContext.h"
 #include "bundle/OverriddenCarrierFile.h"
+#include "device/TXUtility.h"
 #include "util/FileSystemHelper.h"
 #include "util/Log.h"
-#include "device/TXUtility.h"
 
 namespace tavrix {
 namespace {
@@ -104,7 +104,7 @@ OverrideResult determineOverlay(OverlayContext& context, OverlaySource& source) 
     }
 
     std::optional<std::string> path = overriddenFilePath(context);
-    if (path && payload::FileSystemHelper().fileExists(*path)) {
+    if (path && FileSystemHelper().fileExists(*path)) {
         logCFormat("Overridden file %s already exists, not generating again\n", path->c_str());
         pointAtOverriddenFile(context, *path);
         return kOverrideBundleSuccess;

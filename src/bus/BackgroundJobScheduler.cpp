@@ -12,8 +12,8 @@
 #include <system_error>
 #include <vector>
 
-#include "fs/AtomicFile.h"
 #include "device/PlatformRoot.h"
+#include "io/AtomicFile.h"
 #include "plist/PropertyListFormat.h"
 #include "util/ContainExceptions.h"
 #include "util/Log.h"
@@ -250,7 +250,7 @@ void BackgroundJobScheduler::saveLocked() {
         logCFormat("Background jobs: cannot encode the jobs of %s", clientName_.c_str());
         return;
     }
-    if (int failure = replaceFileAtomically(filePath_, bytes, kJobsFileMode); failure != 0) {
+    if (int failure = io::replaceFileAtomically(filePath_, bytes, kJobsFileMode); failure != 0) {
         logCFormat("Background jobs: cannot save %s: %s", filePath_.c_str(),
                    errorText(failure).c_str());
     }

@@ -10,7 +10,7 @@
 
 #include "bus/BusConnection.h"
 #include "bus/BusHandles.h"
-#include "fs/UniqueFd.h"
+#include "io/UniqueFd.h"
 
 namespace tavrix::platform {
 namespace {
@@ -28,7 +28,7 @@ struct MainConnection {
     std::mutex mutex;
     sd_bus* bus = nullptr;
     std::thread::id thread;
-    UniqueFd wake;
+    io::UniqueFd wake;
     EventSourcePtr source;
     std::vector<std::string> pending;
 };

@@ -12,7 +12,9 @@
 #include <string_view>
 
 #include "device/PlatformRoot.h"
-#include "fs/UniqueFd.h"
+#include "io/AtomicFile.h"
+#include "io/FileIO.h"
+#include "io/UniqueFd.h"
 
 namespace tavrix::platform {
 namespace {
@@ -75,7 +77,7 @@ void ServiceManager::closeTransaction() {
 
 bool ServiceManager::readKeepAlive(std::int64_t& value) const {
     std::lock_guard lock(keepAliveMutex_);
-    UniqueFd fd(::open(keepAlivePath_.c_str(), O_RDONLY | O_CLOEXEC));
+    io::UniqueFd fd(::open(keepAlivePath_.c_str(), O_RDONLY | O_CLOEXEC));
     if (!fd) {
         if (errno == ENOENT) {
             value = 0;
@@ -83,14 +85,13 @@ bool ServiceManager::readKeepAlive(std::int64_t& value) const {
         }
         return false;
     }
-    char buffer[32] = {};
-    ssize_t got = ::read(fd.get(), buffer, sizeof buffer - 1);
-    if (got < 0) {
+    std::string text;
+    if (io::readAll(fd.get(), text, 31) != 0) {
         return false;
     }
     char* end = nullptr;
-    long long parsed = std::strtoll(buffer, &end, 10);
-    if (end == buffer) {
+    long long parsed = std::strtoll(text.c_str(), &end, 10);
+    if (end == text.c_str()) {
         return false;
     }
     value = parsed;
@@ -104,20 +105,7 @@ bool ServiceManager::writeKeepAlive(std::int64_t value) {
     if (error) {
         return false;
     }
-    std::string temporary = keepAlivePath_ + ".new";
-    UniqueFd fd(::open(temporary.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644));
-    if (!fd) {
-        return false;
-    }
-    std::string text = std::to_string(value) + "\n";
-    if (::write(fd.get(), text.data(), text.size()) != static_cast<ssize_t>(text.size()) ||
-        ::fsync(fd.get()) != 0) {
-        ::unlink(temporary.c_str());
-        return false;
-    }
-    fd.reset();
-    if (::rename(temporary.c_str(), keepAlivePath_.c_str()) != 0) {
-        ::unlink(temporary.c_str());
+    if (io::replaceFileAtomically(keepAlivePath_, std::to_string(value) + "\n", 0644) != 0) {
         return false;
     }
     noteActivity();

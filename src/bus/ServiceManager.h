@@ -12,7 +12,7 @@
 #include <mutex>
 #include <string>
 
-#include "fs/UniqueFd.h"
+#include "io/UniqueFd.h"
 
 namespace tavrix::platform {
 
@@ -65,7 +65,7 @@ class ServiceManager {
     std::atomic<int> openTransactions_{0};
     std::atomic<std::int64_t> lastActivityTicks_;
     mutable std::mutex keepAliveMutex_;
-    UniqueFd wakeFd_;
+    io::UniqueFd wakeFd_;
 };
 
 // One service-manager transaction, open while the object lives: work the process must finish

@@ -5,12 +5,12 @@
 #include <cerrno>
 #include <cstring>
 
-#include "util/FileSystemUtilities.h"
 #include "catalog/AssetCatalogService.h"
 #include "catalog/AssetDownload.h"
 #include "catalog/CatalogLoader.h"
 #include "catalog/CatalogRollout.h"
 #include "device/DeviceInfoService.h"
+#include "util/FileSystemUtilities.h"
 #include "util/Log.h"
 
 namespace tavrix::platform {
@@ -162,7 +162,7 @@ void Asset::purge(PurgeCompletion completion) {
             }
             bool purged = true;
             for (const std::string& directory : directories) {
-                int error = payload::removeItemTree(directory);
+                int error = removeItemTree(directory);
                 if (error != 0 && error != ENOENT) {
                     purged = false;
                     logCFormat("Asset catalog: cannot purge %s: %s", directory.c_str(),

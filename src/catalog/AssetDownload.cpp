@@ -12,13 +12,15 @@
 #include <ctime>
 #include <vector>
 
-#include "util/FileSystemUtilities.h"
-#include "payload/PayloadUnpack.h"
 #include "catalog/AssetCatalog.h"
 #include "catalog/CatalogCrypto.h"
 #include "http/HttpTransfer.h"
+#include "io/FileIO.h"
+#include "io/Paths.h"
+#include "io/UniqueFd.h"
+#include "payload/PayloadUnpack.h"
+#include "util/FileSystemUtilities.h"
 #include "util/Log.h"
-#include "fs/UniqueFd.h"
 
 namespace tavrix::platform {
 namespace {
@@ -32,10 +34,8 @@ constexpr std::uint64_t kDownloadReportSteps = 4;
 // Removes a staging file or directory when the step that made it is over.
 class StagedPath {
   public:
-    explicit StagedPath(std::string path) : path_(std::move(path)) {
-        payload::removeItemTree(path_);
-    }
-    ~StagedPath() { payload::removeItemTree(path_); }
+    explicit StagedPath(std::string path) : path_(std::move(path)) { removeItemTree(path_); }
+    ~StagedPath() { removeItemTree(path_); }
     StagedPath(const StagedPath&) = delete;
     StagedPath& operator=(const StagedPath&) = delete;
 
@@ -47,20 +47,6 @@ class StagedPath {
 
 std::string errnoText(const char* action, const std::string& path, int error) {
     return std::string("cannot ") + action + " " + path + ": " + std::strerror(error);
-}
-
-bool writeAll(int fd, std::string_view bytes) {
-    while (!bytes.empty()) {
-        ssize_t written = ::write(fd, bytes.data(), bytes.size());
-        if (written < 0 && errno == EINTR) {
-            continue;
-        }
-        if (written <= 0) {
-            return false;
-        }
-        bytes.remove_prefix(static_cast<std::size_t>(written));
-    }
-    return true;
 }
 
 plist::Dictionary progress(const char* operation) {
@@ -88,8 +74,8 @@ std::optional<std::string> downloadArchive(const CatalogEntry& entry, int fd,
                       std::to_string(entry.archiveSize) + " bytes";
             return false;
         }
-        if (!writeAll(fd, bytes)) {
-            refusal = std::string("cannot write the archive: ") + std::strerror(errno);
+        if (int error = io::writeAll(fd, bytes); error != 0) {
+            refusal = std::string("cannot write the archive: ") + std::strerror(error);
             return false;
         }
         digest.update(bytes);
@@ -152,7 +138,7 @@ bool isDownloadName(std::string_view name) {
 
 void removeAbandonedDownloads(const std::string& typeCacheDirectory, bool completedToo) {
     std::vector<std::string> names;
-    if (payload::readDirectoryNames(typeCacheDirectory, names) != 0) {
+    if (readDirectoryNames(typeCacheDirectory, names) != 0) {
         return;
     }
     for (const std::string& name : names) {
@@ -160,7 +146,7 @@ void removeAbandonedDownloads(const std::string& typeCacheDirectory, bool comple
                                                  name.ends_with(kStagedExtractionSuffix));
         if (staging || (completedToo && isDownloadName(name))) {
             logCFormat("Asset catalog: removing the abandoned download %s\n", name.c_str());
-            payload::removeItemTree(typeCacheDirectory + "/" + name);
+            removeItemTree(typeCacheDirectory + "/" + name);
         }
     }
 }
@@ -178,15 +164,15 @@ std::optional<std::string> downloadAndInstallAsset(const CatalogEntry& entry,
                                                    const AssetLimits& limits,
                                                    const AssetProgressReporter& report) {
     report(byteProgress(kAssetOperationStarted, 0, entry.archiveSize));
-    std::string cacheDirectory = location.directory.substr(0, location.directory.rfind('/'));
-    if (int error = payload::createDirectoryAt(cacheDirectory, 0755, true)) {
+    std::string cacheDirectory = io::parentDirectory(location.directory);
+    if (int error = createDirectoryAt(cacheDirectory, 0755, true)) {
         return errnoText("create", cacheDirectory, error);
     }
     removeAbandonedDownloads(cacheDirectory, /*completedToo=*/false);
     StagedPath archive(location.archiveFile);
     {
-        UniqueFd fd(::open(archive.path().c_str(),
-                           O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, 0600));
+        io::UniqueFd fd(::open(archive.path().c_str(),
+                               O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, 0600));
         if (!fd) {
             return errnoText("create", archive.path(), errno);
         }

@@ -4,12 +4,12 @@
 #include <chrono>
 #include <cstring>
 
-#include "util/FileSystemUtilities.h"
-#include "fs/AtomicFile.h"
 #include "catalog/CatalogTrust.h"
-#include "util/Clock.h"
 #include "http/HttpTransfer.h"
+#include "io/AtomicFile.h"
 #include "plist/PropertyListFormat.h"
+#include "util/Clock.h"
+#include "util/FileSystemUtilities.h"
 #include "util/Log.h"
 
 namespace tavrix::platform {
@@ -78,15 +78,15 @@ std::optional<SignedCatalog> fetchFromServer(const AssetTypeSettings& settings,
 void keepLocalCopy(const AssetTypeSettings& settings, const SignedCatalog& catalog) {
     std::string path = settings.cacheDirectory + kLocalCopyName;
     std::string signaturePath = path + kCatalogSignatureSuffix;
-    int error = payload::createDirectoryAt(settings.cacheDirectory, 0755, true);
+    int error = createDirectoryAt(settings.cacheDirectory, 0755, true);
     if (error == 0 && isSigned(settings)) {
-        error = replaceFileAtomically(signaturePath, catalog.signature, 0644);
+        error = io::replaceFileAtomically(signaturePath, catalog.signature, 0644);
     }
     if (error == 0) {
-        error = replaceFileAtomically(path, catalog.bytes, 0644);
+        error = io::replaceFileAtomically(path, catalog.bytes, 0644);
     }
     if (error == 0 && !isSigned(settings)) {
-        payload::removeItemTree(signaturePath);  // a stale signature would only mislead
+        removeItemTree(signaturePath);  // a stale signature would only mislead
     }
     if (error != 0) {
         logCFormat("Asset catalog: cannot keep a local copy of the catalog in %s: %s",

@@ -107,10 +107,9 @@ bool checkFreshness(const CatalogMetadata& metadata, plist::Date now,
 }
 
 std::optional<std::int64_t> readAcceptedSerial(std::string_view assetType) {
-    std::optional<plist::Value> stored =
-        plist::readFile(daemonStateFilePath(serialFileName(assetType)));
-    const plist::Value* serial = stored ? stored->find(kHighestSerialKey) : nullptr;
-    const plist::Integer* number = serial != nullptr ? serial->asInteger() : nullptr;
+    const plist::Dictionary stored = readDaemonStateFile(serialFileName(assetType));
+    auto serial = stored.find(kHighestSerialKey);
+    const plist::Integer* number = serial != stored.end() ? serial->second.asInteger() : nullptr;
     if (number == nullptr || number->isLargeUnsigned()) {
         return std::nullopt;
     }

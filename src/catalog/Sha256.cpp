@@ -7,9 +7,10 @@
 #include <cerrno>
 #include <vector>
 
+#include "io/FileIO.h"
+#include "io/UniqueFd.h"
 #include "util/SharedLibrary.h"
 #include "util/SystemLog.h"
-#include "fs/UniqueFd.h"
 
 namespace tavrix::platform {
 namespace {
@@ -102,26 +103,19 @@ std::string Sha256Digest::finishHex() {
 }
 
 std::optional<std::string> sha256HexOfFile(const std::string& path) {
-    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    io::UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
     if (!fd) {
         return std::nullopt;
     }
     Sha256Digest digest;
-    std::vector<char> buffer(1 << 16);
-    for (;;) {
-        ssize_t count = ::read(fd.get(), buffer.data(), buffer.size());
-        if (count < 0 && errno == EINTR) {
-            continue;
-        }
-        if (count < 0) {
-            return std::nullopt;
-        }
-        if (count == 0) {
-            std::string hex = digest.finishHex();
-            return hex.empty() ? std::nullopt : std::optional<std::string>(std::move(hex));
-        }
-        digest.update(std::string_view(buffer.data(), static_cast<std::size_t>(count)));
+    if (io::readChunks(fd.get(), [&digest](std::string_view chunk) {
+            digest.update(chunk);
+            return 0;
+        }) != 0) {
+        return std::nullopt;
     }
+    std::string hex = digest.finishHex();
+    return hex.empty() ? std::nullopt : std::optional<std::string>(std::move(hex));
 }
 
 }  // namespace tavrix::platform

@@ -3,14 +3,14 @@
 #include <mutex>
 
 #include "bundle/BundleManager.h"
+#include "daemon/UpdateCheckScheduler.h"
 #include "device/BehaviorPreferences.h"
 #include "device/MobileUser.h"
 #include "device/PreferencesStore.h"
+#include "device/TXUtility.h"
 #include "update/ActivityRecord.h"
 #include "update/AssetHandler.h"
-#include "daemon/UpdateCheckScheduler.h"
 #include "util/Log.h"
-#include "device/TXUtility.h"
 #include "util/TextCase.h"
 
 namespace tavrix {
@@ -124,7 +124,7 @@ std::optional<plist::Value> TXManager::copyTavrixValue(const std::string& key) {
         return std::nullopt;
     }
     return platform::PreferencesStore::shared().copyValue(key, kBehaviorSettingsDomain,
-                                                          payload::MobileUser::name());
+                                                          platform::MobileUser::name());
 }
 
 bool TXManager::checkForTavrixBundleUpdate() {

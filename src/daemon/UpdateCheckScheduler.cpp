@@ -2,9 +2,9 @@
 
 #include <atomic>
 
-#include "device/BehaviorPreferences.h"
-#include "daemon/TXManager.h"
 #include "bus/TXTransactionManager.h"
+#include "daemon/TXManager.h"
+#include "device/BehaviorPreferences.h"
 #include "util/Clock.h"
 #include "util/Log.h"
 
@@ -61,7 +61,7 @@ void UpdateCheckScheduler::startTimer() {
     if (nextUpdate == nullptr) {
         logObjectFormat("No previous update time in the preferences list");
         setUpNewTimer(kUpdateCheckIntervalSeconds);
-    } else if (nextUpdate->secondsSinceReferenceDate < platform::Clock::absoluteTimeNow()) {
+    } else if (nextUpdate->secondsSinceReferenceDate < Clock::absoluteTimeNow()) {
         // A missed check is not run now but pushed a whole interval ahead.
         logObjectFormat("Previous update time present is past, resetting it");
         setUpNewTimer(kUpdateCheckIntervalSeconds);
@@ -73,7 +73,7 @@ void UpdateCheckScheduler::startTimer() {
 void UpdateCheckScheduler::setUpNewTimer(double seconds) {
     std::lock_guard lock(_rearmLock);
     logObjectFormat("Setting up a new update check timer");
-    plist::Date nextUpdate{platform::Clock::absoluteTimeNow() + seconds};
+    plist::Date nextUpdate{Clock::absoluteTimeNow() + seconds};
     setBehaviorPreference(kNextUpdateKey, plist::Value(nextUpdate));
     scheduleJob();
 }

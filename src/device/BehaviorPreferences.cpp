@@ -7,12 +7,12 @@ namespace tavrix {
 
 std::optional<plist::Value> copyBehaviorPreference(std::string_view key) {
     return platform::PreferencesStore::shared().copyValue(key, kBehaviorPreferencesDomain,
-                                                          payload::MobileUser::name());
+                                                          platform::MobileUser::name());
 }
 
 bool setBehaviorPreference(std::string_view key, const std::optional<plist::Value>& value) {
     auto& store = platform::PreferencesStore::shared();
-    const std::string& user = payload::MobileUser::name();
+    const std::string& user = platform::MobileUser::name();
     store.setValue(key, value, kBehaviorPreferencesDomain, user);
     return store.synchronize(kBehaviorPreferencesDomain, user);
 }

@@ -2,7 +2,7 @@
 
 #include "device/DeviceInfoService.h"
 
-namespace tavrix::payload {
+namespace tavrix::platform {
 namespace {
 
 const bool* booleanAnswer(const plist::Dictionary& answers, std::string_view key) {
@@ -51,4 +51,4 @@ bool BuildCapabilities::isVendorBuild() {
     return facts().isVendorBuild;
 }
 
-}  // namespace tavrix::payload
+}  // namespace tavrix::platform

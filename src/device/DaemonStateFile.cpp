@@ -1,8 +1,8 @@
 #include "device/DaemonStateFile.h"
 
-#include "util/FileSystemUtilities.h"
-#include "fs/AtomicFile.h"
 #include "device/PlatformRoot.h"
+#include "io/AtomicFile.h"
+#include "util/FileSystemUtilities.h"
 
 namespace tavrix::platform {
 namespace {
@@ -15,14 +15,19 @@ std::string daemonStateFilePath(std::string_view fileName) {
     return resolvePath(kDaemonStateDirectory) + "/" + std::string(fileName);
 }
 
+plist::Dictionary readDaemonStateFile(std::string_view fileName) {
+    std::optional<plist::Value> stored = plist::readFile(daemonStateFilePath(fileName));
+    const plist::Dictionary* values = stored ? stored->asDictionary() : nullptr;
+    return values != nullptr ? *values : plist::Dictionary();
+}
+
 int writeDaemonStateFile(std::string_view fileName, const plist::Value& value, plist::Format format,
                          mode_t mode) {
-    int error =
-        payload::createDirectoryAt(resolvePath(kDaemonStateDirectory), kStateDirectoryMode, true);
+    int error = createDirectoryAt(resolvePath(kDaemonStateDirectory), kStateDirectoryMode, true);
     if (error != 0) {
         return error;
     }
-    return replaceFileAtomically(daemonStateFilePath(fileName), plist::serialize(value, format),
+    return io::replaceFileAtomically(daemonStateFilePath(fileName), plist::serialize(value, format),
                                  mode);
 }
 

@@ -14,6 +14,10 @@ namespace tavrix::platform {
 // "<root>/var/lib/tavrixservicesd/<fileName>".
 std::string daemonStateFilePath(std::string_view fileName);
 
+// The dictionary stored as fileName; empty when the file is missing, unreadable or no dictionary
+// (the state is then as if never recorded).
+plist::Dictionary readDaemonStateFile(std::string_view fileName);
+
 // Writes value as fileName in the state directory, creating the directory when missing. 0, or
 // the errno that stopped it; the file is then as it was.
 int writeDaemonStateFile(std::string_view fileName, const plist::Value& value, plist::Format format,

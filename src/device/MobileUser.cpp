@@ -3,7 +3,7 @@
 #include "device/PlatformRoot.h"
 #include "device/UserDatabase.h"
 
-namespace tavrix::payload {
+namespace tavrix::platform {
 
 MobileUser::Facts MobileUser::lookUpUnder(std::string_view root) {
     Facts facts;
@@ -40,4 +40,4 @@ gid_t MobileUser::gid() {
     return facts().gid;
 }
 
-}  // namespace tavrix::payload
+}  // namespace tavrix::platform

@@ -12,11 +12,13 @@
 #include <vector>
 
 #include "device/UserDatabase.h"
+#include "io/AtomicFile.h"
+#include "io/Paths.h"
+#include "io/UniqueFd.h"
 #include "plist/CachedPropertyListFile.h"
 #include "plist/PropertyListFormat.h"
 #include "util/Log.h"
 #include "util/PropertyListFile.h"
-#include "fs/UniqueFd.h"
 
 namespace tavrix::platform {
 namespace {
@@ -42,14 +44,6 @@ void logFailure(const char* action, const std::string& path, int error) {
 bool isValidComponent(std::string_view name) {
     return !name.empty() && name != "." && name != ".." &&
            name.find_first_of(std::string_view("/\0", 2)) == std::string_view::npos;
-}
-
-std::string parentOf(const std::string& path) {
-    std::size_t slash = path.rfind('/');
-    if (slash == std::string::npos) {
-        return ".";
-    }
-    return slash == 0 ? "/" : path.substr(0, slash);
 }
 
 // Identifies one version of a file, so that damage is logged once per version.
@@ -97,18 +91,11 @@ bool makeDirectories(const std::string& path) {
 }
 
 std::optional<std::string> readLink(const std::string& path) {
-    std::vector<char> buffer(PATH_MAX);
-    for (;;) {
-        ssize_t length = ::readlink(path.c_str(), buffer.data(), buffer.size());
-        if (length < 0) {
-            logFailure("read symbolic link", path, errno);
-            return std::nullopt;
-        }
-        if (static_cast<std::size_t>(length) < buffer.size()) {
-            return std::string(buffer.data(), static_cast<std::size_t>(length));
-        }
-        buffer.resize(buffer.size() * 2);
+    auto target = io::readLinkTarget(path);
+    if (!target) {
+        logFailure("read symbolic link", path, errno);
     }
+    return target;
 }
 
 // The file that writing to path must replace: path itself, or the file at the end of its chain of
@@ -131,90 +118,21 @@ std::optional<std::string> writeTarget(const std::string& path) {
         if (!target) {
             return std::nullopt;
         }
-        current = !target->empty() && target->front() == '/' ? *target
-                                                             : parentOf(current) + "/" + *target;
+        current = !target->empty() && target->front() == '/'
+                      ? *target
+                      : io::parentDirectory(current) + "/" + *target;
     }
     logFailure("follow the symbolic links at", path, ELOOP);
     return std::nullopt;
 }
 
-bool writeAll(int fd, std::string_view bytes) {
-    while (!bytes.empty()) {
-        ssize_t put = ::write(fd, bytes.data(), bytes.size());
-        if (put < 0 && errno == EINTR) {
-            continue;
-        }
-        if (put <= 0) {
-            if (put == 0) {
-                errno = EIO;
-            }
-            return false;
-        }
-        bytes.remove_prefix(static_cast<std::size_t>(put));
-    }
-    return true;
-}
-
-// A temporary file that is removed unless it was renamed into place.
-class TemporaryFile {
-  public:
-    explicit TemporaryFile(std::string path) : path_(std::move(path)) {}
-    ~TemporaryFile() {
-        if (!path_.empty()) {
-            ::unlink(path_.c_str());
-        }
-    }
-    TemporaryFile(const TemporaryFile&) = delete;
-    TemporaryFile& operator=(const TemporaryFile&) = delete;
-
-    const std::string& path() const { return path_; }
-    void keep() { path_.clear(); }
-
-  private:
-    std::string path_;
-};
-
-bool syncDirectory(const std::string& directory) {
-    UniqueFd fd(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (!fd || ::fsync(fd.get()) != 0) {
-        logFailure("flush directory", directory, errno);
-        return false;
-    }
-    return true;
-}
-
 // Replaces the file at target with bytes so that readers see either the old or the new file whole.
 bool replaceFile(const std::string& target, std::string_view bytes) {
-    std::string directory = parentOf(target);
-    std::string pattern = directory + "/.preferences-XXXXXX";
-    UniqueFd fd(::mkostemp(pattern.data(), O_CLOEXEC));
-    if (!fd) {
-        logFailure("create a temporary file in", directory, errno);
+    if (int error = io::replaceFileAtomically(target, bytes, kFileMode); error != 0) {
+        logFailure("replace", target, error);
         return false;
     }
-    TemporaryFile temporary(pattern);
-    if (!writeAll(fd.get(), bytes)) {
-        logFailure("write", temporary.path(), errno);
-        return false;
-    }
-    if (::fsync(fd.get()) != 0) {
-        logFailure("flush", temporary.path(), errno);
-        return false;
-    }
-    if (::fchmod(fd.get(), kFileMode) != 0) {
-        logFailure("set the mode of", temporary.path(), errno);
-        return false;
-    }
-    if (::close(fd.release()) != 0) {
-        logFailure("close", temporary.path(), errno);
-        return false;
-    }
-    if (::rename(temporary.path().c_str(), target.c_str()) != 0) {
-        logFailure("replace", target, errno);
-        return false;
-    }
-    temporary.keep();
-    return syncDirectory(directory);
+    return true;
 }
 
 // Holds an exclusive flock on a descriptor for its lifetime.
@@ -348,7 +266,7 @@ bool PreferencesStore::writePending(Domain& domain) {
         return false;
     }
     // The domain file is replaced by rename, so the lock is on the directory that holds it.
-    UniqueFd directoryFd(::open(domain.directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    io::UniqueFd directoryFd(::open(domain.directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     if (!directoryFd) {
         logFailure("open directory", domain.directory, errno);
         return false;

@@ -10,7 +10,8 @@
 #include <vector>
 
 #include "device/PlatformRoot.h"
-#include "fs/UniqueFd.h"
+#include "io/FileIO.h"
+#include "io/UniqueFd.h"
 
 namespace tavrix::platform {
 namespace {
@@ -31,26 +32,15 @@ std::string_view trim(std::string_view text) {
 
 // sysfs reports a size of 4096 for every attribute, so the file is read to its end instead.
 std::optional<std::string> readSmallFile(const std::string& path) {
-    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    io::UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
     if (!fd) {
         return std::nullopt;
     }
     std::string content;
-    char buffer[4096];
-    while (content.size() < kMaxFileSize) {
-        ssize_t got = ::read(fd.get(), buffer, sizeof buffer);
-        if (got < 0 && errno == EINTR) {
-            continue;
-        }
-        if (got < 0) {
-            return std::nullopt;
-        }
-        if (got == 0) {
-            return content;
-        }
-        content.append(buffer, static_cast<std::size_t>(got));
+    if (io::readAll(fd.get(), content, kMaxFileSize) != 0) {
+        return std::nullopt;
     }
-    return std::nullopt;
+    return content;
 }
 
 // A device-tree property or DMI attribute as text: up to the first NUL (device-tree strings end

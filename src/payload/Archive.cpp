@@ -9,11 +9,13 @@
 #include <limits>
 #include <new>
 
+#include "io/AtomicFile.h"
+#include "io/FileIO.h"
+#include "io/Paths.h"
+#include "io/UniqueFd.h"
 #include "util/FileSystemHelper.h"
-#include "fs/AtomicFile.h"
 #include "util/FileURL.h"
 #include "util/Log.h"
-#include "fs/UniqueFd.h"
 
 namespace tavrix::payload {
 namespace {
@@ -59,7 +61,7 @@ struct FileContents {
 // since it was measured is noticed without reading all of it. Other kinds of files are refused:
 // opening a FIFO or a device could block or never end.
 std::optional<FileContents> readRegularFile(const std::string& path, std::uint64_t limit) {
-    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+    io::UniqueFd fd(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
     if (!fd) {
         return std::nullopt;
     }
@@ -67,26 +69,15 @@ std::optional<FileContents> readRegularFile(const std::string& path, std::uint64
     if (::fstat(fd.get(), &contents.info) != 0 || !S_ISREG(contents.info.st_mode)) {
         return std::nullopt;
     }
-    std::uint8_t buffer[65536];
-    while (contents.bytes.size() <= limit) {
-        ssize_t got = ::read(fd.get(), buffer, sizeof buffer);
-        if (got == 0) {
-            return contents;
-        }
-        if (got < 0) {
-            if (errno == EINTR) {
-                continue;
-            }
-            return std::nullopt;
-        }
-        contents.bytes.insert(contents.bytes.end(), buffer, buffer + got);
+    // Reading stops once past limit; the caller sees the size and refuses.
+    int error = io::readChunks(fd.get(), [&contents, limit](std::string_view chunk) {
+        contents.bytes.insert(contents.bytes.end(), chunk.begin(), chunk.end());
+        return contents.bytes.size() > limit ? EFBIG : 0;
+    });
+    if (error != 0 && error != EFBIG) {
+        return std::nullopt;
     }
     return contents;
-}
-
-std::string lastPathComponent(const std::string& path) {
-    auto slash = path.find_last_of('/');
-    return slash == std::string::npos ? path : path.substr(slash + 1);
 }
 
 // The file-system path of a file URL, or the text itself when it has no scheme.
@@ -190,7 +181,7 @@ bool Archive::addFile(const std::string& path, const std::string& asFile) {
 }
 
 bool Archive::addFile(const std::string& path) {
-    return addFile(path, lastPathComponent(path));
+    return addFile(path, io::lastPathComponent(path));
 }
 
 bool Archive::addFileURL(const std::string& url) {
@@ -203,7 +194,7 @@ bool Archive::close() {
 }
 
 bool Archive::writeToFile(const std::string& path) const {
-    return platform::replaceFileAtomically(path, archiveData_, kArchiveFileMode) == 0;
+    return io::replaceFileAtomically(path, archiveData_, kArchiveFileMode) == 0;
 }
 
 std::uint64_t Archive::sizeOnDiskForPath(const std::string& path) {

@@ -12,21 +12,21 @@ namespace {
 constexpr const char* kLibraryName = "libarchive.so.13";
 
 struct LoadedArchive {
-    std::unique_ptr<platform::SharedLibrary> library;
+    std::unique_ptr<SharedLibrary> library;
     ArchiveLibrary functions;
 };
 
 LoadedArchive load() {
     LoadedArchive loaded;
     std::string error;
-    auto library = platform::SharedLibrary::open(kLibraryName, error);
+    auto library = SharedLibrary::open(kLibraryName, error);
     bool bound = library != nullptr;
 #define TAVRIX_ARCHIVE_BIND(name) \
     bound = bound && library->bind(loaded.functions.name, #name, error);
     TAVRIX_ARCHIVE_FUNCTIONS(TAVRIX_ARCHIVE_BIND)
 #undef TAVRIX_ARCHIVE_BIND
     if (!bound) {
-        platform::writeSystemLog(LOG_ERR, "Archives are unavailable: " + error);
+        writeSystemLog(LOG_ERR, "Archives are unavailable: " + error);
         return LoadedArchive{};
     }
     loaded.library = std::move(library);

@@ -4,8 +4,8 @@
 #include <cstdio>
 #include <cstring>
 
-#include "fs/AtomicFile.h"
 #include "device/PlatformRoot.h"
+#include "io/AtomicFile.h"
 #include "util/Log.h"
 
 namespace tavrix {
@@ -21,7 +21,7 @@ std::string extractionStagingPathFor(const std::string& bundleDirectory) {
 }
 
 bool writeDataToFile(const plist::Data& data, const std::string& path) {
-    if (platform::replaceFileAtomically(path, data, kStagedFileMode) == 0) {
+    if (io::replaceFileAtomically(path, data, kStagedFileMode) == 0) {
         logCFormat("Successfully wrote the KW Data to file: %s\n", path.c_str());
     } else {
         logCFormat("Failed to write the zipped file: %s\n", path.c_str());

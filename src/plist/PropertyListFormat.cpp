@@ -16,8 +16,10 @@
 #include <memory>
 #include <vector>
 
+#include "io/AtomicFile.h"
+#include "io/FileIO.h"
+#include "io/UniqueFd.h"
 #include "plist/PropertyListWriter.h"
-#include "fs/UniqueFd.h"
 
 namespace tavrix::plist {
 namespace {
@@ -351,7 +353,7 @@ std::optional<std::string> readFileBytes(const std::string& path, Refusal* refus
         return std::nullopt;
     };
     // Without O_NONBLOCK, opening a FIFO would wait for a writer for ever.
-    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
+    io::UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
     if (!fd) {
         int error = errno;
         return refuse(error, std::strerror(error));
@@ -367,34 +369,11 @@ std::optional<std::string> readFileBytes(const std::string& path, Refusal* refus
     if (info.st_size < 0 || static_cast<std::uint64_t>(info.st_size) > kMaxPropertyListBytes) {
         return refuse(0, tooLarge());
     }
-    // One byte beyond the size tells a file that grew since fstat; growth is read in chunks up to
-    // one byte beyond the cap.
-    std::string bytes(static_cast<std::size_t>(info.st_size) + 1, '\0');
-    std::size_t filled = 0;
-    for (;;) {
-        if (filled == bytes.size()) {
-            if (filled > kMaxPropertyListBytes) {
-                return refuse(0, tooLarge());
-            }
-            bytes.resize(std::min(filled + 65536, kMaxPropertyListBytes + 1));
-        }
-        ssize_t got = ::read(fd.get(), bytes.data() + filled, bytes.size() - filled);
-        if (got < 0 && errno == EINTR) {
-            continue;
-        }
-        if (got < 0) {
-            int error = errno;
-            return refuse(error, std::strerror(error));
-        }
-        if (got == 0) {
-            break;
-        }
-        filled += static_cast<std::size_t>(got);
+    // A file that grew since fstat is still held to the cap.
+    std::string bytes;
+    if (int error = io::readAll(fd.get(), bytes, kMaxPropertyListBytes); error != 0) {
+        return error == EFBIG ? refuse(0, tooLarge()) : refuse(error, std::strerror(error));
     }
-    if (filled > kMaxPropertyListBytes) {
-        return refuse(0, tooLarge());
-    }
-    bytes.resize(filled);
     return bytes;
 }
 
@@ -415,22 +394,7 @@ bool writeFile(const std::string& path, const Value& value, Format format) {
     if (bytes.empty()) {
         return false;
     }
-    UniqueFd fd(::open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644));
-    if (!fd) {
-        return false;
-    }
-    std::size_t written = 0;
-    while (written < bytes.size()) {
-        ssize_t put = ::write(fd.get(), bytes.data() + written, bytes.size() - written);
-        if (put < 0 && errno == EINTR) {
-            continue;
-        }
-        if (put <= 0) {
-            return false;
-        }
-        written += static_cast<std::size_t>(put);
-    }
-    return true;
+    return io::replaceFileAtomically(path, bytes, 0644) == 0;
 }
 
 }  // namespace tavrix::plist

@@ -3,9 +3,9 @@
 #include <cstring>
 #include <mutex>
 
-#include "util/Clock.h"
 #include "device/DaemonStateFile.h"
 #include "plist/PropertyListFormat.h"
+#include "util/Clock.h"
 #include "util/Log.h"
 
 namespace tavrix {
@@ -21,16 +21,11 @@ std::mutex& recordLock() {
 }
 
 plist::Dictionary readRecordLocked() {
-    std::optional<plist::Value> record = plist::readFile(activityRecordPath());
-    if (record && record->asDictionary() != nullptr) {
-        return *record->asDictionary();
-    }
-    return {};
+    return platform::readDaemonStateFile(kRecordFileName);
 }
 
 void replaceEntry(const char* key, plist::Dictionary entry) {
-    entry.insert_or_assign(kActivityTimeKey,
-                           plist::Value(plist::Date{platform::Clock::absoluteTimeNow()}));
+    entry.insert_or_assign(kActivityTimeKey, plist::Value(plist::Date{Clock::absoluteTimeNow()}));
     std::lock_guard lock(recordLock());
     plist::Dictionary record = readRecordLocked();
     record.insert_or_assign(key, plist::Value(std::move(entry)));

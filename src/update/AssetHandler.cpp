@@ -13,15 +13,15 @@
 #include "bundle/BundleManager.h"
 #include "bundle/VersionCompare.h"
 #include "device/BehaviorPreferences.h"
-#include "util/FileSystemHelper.h"
-#include "util/FileSystemUtilities.h"
 #include "device/MobileUser.h"
+#include "device/TXUtility.h"
 #include "payload/PayloadUnpack.h"
-#include "util/SystemLog.h"
 #include "update/ActivityRecord.h"
 #include "update/PendingInstall.h"
+#include "util/FileSystemHelper.h"
+#include "util/FileSystemUtilities.h"
 #include "util/Log.h"
-#include "device/TXUtility.h"
+#include "util/SystemLog.h"
 
 namespace tavrix {
 namespace {
@@ -231,7 +231,7 @@ void AssetHandler::handleDownloadProgress(const AssetPtr& asset, const plist::Di
         running->finish();
         return;
     }
-    std::optional<platform::ScopedLogField> versionField;
+    std::optional<ScopedLogField> versionField;
     auto version = asset->attributes().find(kAssetAttributeVersion);
     if (version != asset->attributes().end()) {
         versionField.emplace("TAVRIX_BUNDLE_VERSION", versionText(version->second));
@@ -252,8 +252,7 @@ void AssetHandler::handleDownloadProgress(const AssetPtr& asset, const plist::Di
         logObjectFormat("Best candidate asset has been purged");
         running->finish();
     });
-    endCheck(installed ? kInstallDoneDelaySeconds
-                                              : kInstallRetryDelaySeconds);
+    endCheck(installed ? kInstallDoneDelaySeconds : kInstallRetryDelaySeconds);
 }
 
 bool AssetHandler::installDownloadedBundle(const std::string& source) {
@@ -265,8 +264,8 @@ bool AssetHandler::installDownloadedBundle(const std::string& source) {
     BundleManager& bundles = BundleManager::sharedInstance();
     std::lock_guard lock(bundles.operationLock());
     // The new bundle is copied while the old one still stands, so both must fit.
-    const std::uint64_t needed = payload::diskBytesOfTree(source);
-    const char* home = payload::MobileUser::homeDirectory();
+    const std::uint64_t needed = diskBytesOfTree(source);
+    const char* home = platform::MobileUser::homeDirectory();
     if (home == nullptr || !TXUtility::hasEnoughDiskSpaceAt(home, needed)) {
         logCFormat("Not enough free space to install %s (%llu bytes), keeping the bundle\n",
                    source.c_str(), static_cast<unsigned long long>(needed));
@@ -293,7 +292,7 @@ bool AssetHandler::installDownloadedBundle(const std::string& source) {
 }
 
 bool AssetHandler::copyDownloadedBundle(const std::string& source, const std::string& destination) {
-    payload::FileSystemHelper files;
+    FileSystemHelper files;
     // Copied beside the user bundle and put in its place only when whole: a copy that fails (a
     // disk that fills) leaves the old bundle as it was, and every file in the copy appears whole
     // or not at all.
@@ -310,7 +309,7 @@ bool AssetHandler::copyDownloadedBundle(const std::string& source, const std::st
     for (std::size_t index = 0; error == 0 && index < names.size(); ++index) {
         const std::string entry = source + "/" + names[index];
         logCFormat("Copying %s\n", entry.c_str());
-        error = payload::copyItemTree(entry, staging + "/" + names[index]);
+        error = copyItemTree(entry, staging + "/" + names[index]);
     }
     if (error == 0) {
         logCFormat("Removing the directory %s\n", destination.c_str());
@@ -341,14 +340,14 @@ void AssetHandler::resumeInterruptedInstall() {
 void AssetHandler::resumePendingInstall(const PendingInstall& pendingInstall) {
     const PendingInstall* pending = &pendingInstall;
     const std::string& asset = pending->assetDirectory;
-    if (!pending->installed && payload::itemKind(asset) == payload::ItemKind::Directory) {
+    if (!pending->installed && itemKind(asset) == ItemKind::Directory) {
         logCFormat("Completing the interrupted install of %s\n", asset.c_str());
         installDownloadedBundle(asset);
     } else if (!pending->installed) {
         logCFormat("The interrupted install of %s cannot be completed: the download is gone\n",
                    asset.c_str());
     }
-    payload::removeItemTree(asset);
+    removeItemTree(asset);
     removePendingInstall();
     logCFormat("Purged the download %s of the interrupted install\n", asset.c_str());
 }

@@ -3,9 +3,9 @@
 #include <cerrno>
 #include <cstring>
 
-#include "util/FileSystemUtilities.h"
 #include "device/DaemonStateFile.h"
 #include "plist/PropertyListFormat.h"
+#include "util/FileSystemUtilities.h"
 #include "util/Log.h"
 
 namespace tavrix {
@@ -37,22 +37,18 @@ bool writePendingInstall(const PendingInstall& install) {
 }
 
 std::optional<PendingInstall> readPendingInstall() {
-    std::optional<plist::Value> marker = plist::readFile(pendingInstallMarkerPath());
-    const plist::Dictionary* values = marker ? marker->asDictionary() : nullptr;
-    if (values == nullptr) {
+    const plist::Dictionary values = platform::readDaemonStateFile(kMarkerFileName);
+    auto directory = values.find(kAssetDirectoryKey);
+    if (directory == values.end() || directory->second.asString() == nullptr) {
         return std::nullopt;
     }
-    auto directory = values->find(kAssetDirectoryKey);
-    if (directory == values->end() || directory->second.asString() == nullptr) {
-        return std::nullopt;
-    }
-    auto installed = values->find(kInstalledKey);
-    const bool* flag = installed != values->end() ? installed->second.asBoolean() : nullptr;
+    auto installed = values.find(kInstalledKey);
+    const bool* flag = installed != values.end() ? installed->second.asBoolean() : nullptr;
     return PendingInstall{*directory->second.asString(), flag != nullptr && *flag};
 }
 
 void removePendingInstall() {
-    payload::removeItemTree(pendingInstallMarkerPath());
+    removeItemTree(pendingInstallMarkerPath());
 }
 
 }  // namespace tavrix

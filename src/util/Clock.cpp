@@ -7,7 +7,7 @@
 
 #include "plist/Value.h"
 
-namespace tavrix::platform {
+namespace tavrix {
 namespace {
 
 // Ticks of the system clock's duration; trivially destructible, so threads still running while
@@ -64,4 +64,4 @@ Clock::ChangeSubscription::~ChangeSubscription() {
     callbacks.erase(std::remove(callbacks.begin(), callbacks.end(), callback_), callbacks.end());
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix

@@ -6,7 +6,7 @@
 #include <functional>
 #include <memory>
 
-namespace tavrix::platform {
+namespace tavrix {
 
 class Clock {
   public:
@@ -51,4 +51,4 @@ class ScopedClockOffset {
     Clock::Offset previous_;
 };
 
-}  // namespace tavrix::platform
+}  // namespace tavrix

@@ -3,20 +3,11 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include "io/Paths.h"
 #include "util/FileSystemUtilities.h"
 
-namespace tavrix::payload {
+namespace tavrix {
 namespace {
-
-// The last component of path, trailing slashes ignored ("/" for the root itself).
-std::string lastComponent(std::string_view path) {
-    while (path.size() > 1 && path.back() == '/') {
-        path.remove_suffix(1);
-    }
-    std::size_t slash = path.rfind('/');
-    return std::string(
-        slash == std::string_view::npos || path.size() == 1 ? path : path.substr(slash + 1));
-}
 
 void giveOwner(const std::string& path, uid_t uid, gid_t gid) {
     if (::lchown(path.c_str(), uid, gid) != 0) {
@@ -79,7 +70,7 @@ int FileSystemHelper::transferItem(const std::string& source, const std::string&
             return copy ? copyItemTree(source, destination) : moveItemTree(source, destination);
         }
         case ItemKind::Directory: {
-            std::string target = destination + "/" + lastComponent(source);
+            std::string target = destination + "/" + io::lastPathComponent(source);
             if (itemKind(target) == ItemKind::Other) {
                 removeItemTree(target);
             }
@@ -121,4 +112,4 @@ int FileSystemHelper::copyFileBetweenDirectories(const std::string& sourceDirect
                         ::getgid(), true);
 }
 
-}  // namespace tavrix::payload
+}  // namespace tavrix

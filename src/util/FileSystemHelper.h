@@ -9,7 +9,7 @@
 #include <string>
 #include <vector>
 
-namespace tavrix::payload {
+namespace tavrix {
 
 class FileSystemHelper {
   public:
@@ -62,4 +62,4 @@ class FileSystemHelper {
                                    const std::string& name) const;
 };
 
-}  // namespace tavrix::payload
+}  // namespace tavrix

@@ -15,12 +15,14 @@
 #include <memory>
 #include <system_error>
 
-#include "fs/AtomicFile.h"
+#include "io/AtomicFile.h"
+#include "io/FileIO.h"
+#include "io/Paths.h"
+#include "io/UniqueFd.h"
 #include "plist/PropertyListFormat.h"
 #include "util/PropertyListFile.h"
-#include "fs/UniqueFd.h"
 
-namespace tavrix::payload {
+namespace tavrix {
 namespace {
 
 // errno after a failed call; EIO for the rare failure that sets none.
@@ -32,68 +34,25 @@ std::string joinPath(const std::string& directory, const std::string& name) {
     return directory + "/" + name;
 }
 
-// The directory holding path ("" for a bare name, "/" for a top-level entry).
-std::string parentOf(std::string_view path) {
-    while (path.size() > 1 && path.back() == '/') {
-        path.remove_suffix(1);
-    }
-    std::size_t slash = path.rfind('/');
-    if (slash == std::string_view::npos) {
-        return {};
-    }
-    std::string_view parent = path.substr(0, slash);
-    while (parent.size() > 1 && parent.back() == '/') {
-        parent.remove_suffix(1);
-    }
-    return std::string(parent.empty() ? "/" : parent);
-}
-
 // The copy appears under its final name complete, with the source's mode, or not at all: a full
 // disk or a crash part way must never leave a truncated file that looks installed.
 int copyFileContents(const std::string& source, const std::string& destination, mode_t mode) {
-    UniqueFd in(::open(source.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW));
+    io::UniqueFd in(::open(source.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW));
     if (!in) {
         return lastError();
     }
-    return platform::createFileAtomicallyWith(destination, mode & 07777, [&in](int out) {
-        std::unique_ptr<char[]> buffer(new char[1 << 16]);
-        for (;;) {
-            ssize_t got = ::read(in.get(), buffer.get(), 1 << 16);
-            if (got < 0 && errno == EINTR) {
-                continue;
-            }
-            if (got < 0) {
-                return lastError();
-            }
-            if (got == 0) {
-                return 0;
-            }
-            for (ssize_t written = 0; written < got;) {
-                errno = 0;
-                ssize_t put =
-                    ::write(out, buffer.get() + written, static_cast<std::size_t>(got - written));
-                if (put < 0 && errno == EINTR) {
-                    continue;
-                }
-                if (put <= 0) {
-                    return lastError();
-                }
-                written += put;
-            }
-        }
+    return io::createFileAtomicallyWith(destination, mode & 07777, [&in](int out) {
+        return io::readChunks(in.get(),
+                              [out](std::string_view chunk) { return io::writeAll(out, chunk); });
     });
 }
 
-int copySymbolicLink(const std::string& source, const std::string& destination, off_t size) {
-    std::string target(static_cast<std::size_t>(size) + 1, '\0');
-    errno = 0;
-    ssize_t length = ::readlink(source.c_str(), target.data(), target.size());
-    if (length < 0 || static_cast<std::size_t>(length) >= target.size()) {
-        // A link that grew since lstat is reported as an I/O error.
+int copySymbolicLink(const std::string& source, const std::string& destination) {
+    auto target = io::readLinkTarget(source);
+    if (!target) {
         return lastError();
     }
-    target.resize(static_cast<std::size_t>(length));
-    return ::symlink(target.c_str(), destination.c_str()) == 0 ? 0 : lastError();
+    return ::symlink(target->c_str(), destination.c_str()) == 0 ? 0 : lastError();
 }
 
 int copyEntry(const std::string& source, const std::string& destination, const struct stat& info) {
@@ -101,7 +60,7 @@ int copyEntry(const std::string& source, const std::string& destination, const s
         return copyFileContents(source, destination, info.st_mode);
     }
     if (S_ISLNK(info.st_mode)) {
-        return copySymbolicLink(source, destination, info.st_size);
+        return copySymbolicLink(source, destination);
     }
     if (!S_ISDIR(info.st_mode)) {
         return ENOTSUP;
@@ -285,7 +244,7 @@ int createDirectoryAt(const std::string& path, std::optional<mode_t> mode, bool 
         if (itemKind(path) == ItemKind::Directory) {
             return 0;
         }
-        std::string parent = parentOf(path);
+        std::string parent = io::parentDirectory(path);
         if (!parent.empty() && itemKind(parent) != ItemKind::Directory) {
             if (int error = createDirectoryAt(parent, std::nullopt, true)) {
                 return error;
@@ -559,4 +518,4 @@ std::optional<plist::Value> loadDictionaryAtPath(const std::string& path) {
     return value;
 }
 
-}  // namespace tavrix::payload
+}  // namespace tavrix

@@ -17,7 +17,7 @@
 
 #include "plist/Value.h"
 
-namespace tavrix::payload {
+namespace tavrix {
 
 // The fixed codes: an I/O error (also "failed without an errno") and "already exists".
 inline constexpr int kIOErrorCode = 5;
@@ -123,4 +123,4 @@ char* copyCStringFromString(const CStringAllocator& allocator, std::string_view 
 // or holds something other than a dictionary.
 std::optional<plist::Value> loadDictionaryAtPath(const std::string& path);
 
-}  // namespace tavrix::payload
+}  // namespace tavrix

@@ -7,8 +7,8 @@
 #include <cwchar>
 #include <string_view>
 
-#include "util/SystemLog.h"
 #include "plist/Value.h"
+#include "util/SystemLog.h"
 
 namespace tavrix {
 namespace {
@@ -287,7 +287,7 @@ std::string formatObjectMessage(const char* format, va_list arguments) {
 }
 
 void logObjectFormatV(const char* format, va_list arguments) {
-    platform::writeSystemLog(priorityOf(format), formatObjectMessage(format, arguments));
+    writeSystemLog(priorityOf(format), formatObjectMessage(format, arguments));
 }
 
 void logObjectFormat(const char* format, ...) {

@@ -1,6 +1,6 @@
 #include "util/SharedLibrary.h"
 
-namespace tavrix::platform {
+namespace tavrix {
 
 std::unique_ptr<SharedLibrary> SharedLibrary::open(const char* name, std::string& error) {
     // RTLD_NOW: a library too old for a symbol fails here, not in the middle of a transfer.
@@ -13,4 +13,4 @@ std::unique_ptr<SharedLibrary> SharedLibrary::open(const char* name, std::string
     return std::unique_ptr<SharedLibrary>(new SharedLibrary(name, handle));
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix

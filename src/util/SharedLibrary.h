@@ -7,7 +7,7 @@
 #include <memory>
 #include <string>
 
-namespace tavrix::platform {
+namespace tavrix {
 
 class SharedLibrary {
   public:
@@ -39,4 +39,4 @@ class SharedLibrary {
     std::unique_ptr<void, Close> handle_;
 };
 
-}  // namespace tavrix::platform
+}  // namespace tavrix

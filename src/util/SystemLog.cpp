@@ -11,7 +11,9 @@
 #include <cstdlib>
 #include <cstring>
 
-namespace tavrix::platform {
+#include "io/FileIO.h"
+
+namespace tavrix {
 namespace {
 
 constexpr const char* kIdent = "tavrixservicesd";
@@ -35,16 +37,6 @@ bool stderrIsJournal() {
     return ::fstat(STDERR_FILENO, &info) == 0 && info.st_dev == device && info.st_ino == inode;
 }
 
-void writeAll(int fd, std::string_view bytes) {
-    while (!bytes.empty()) {
-        ssize_t put = ::write(fd, bytes.data(), bytes.size());
-        if (put <= 0) {
-            return;
-        }
-        bytes.remove_prefix(static_cast<std::size_t>(put));
-    }
-}
-
 class StderrSink : public LogSink {
   public:
     explicit StderrSink(bool withPriorityPrefix) : withPriorityPrefix_(withPriorityPrefix) {}
@@ -59,7 +51,7 @@ class StderrSink : public LogSink {
         if (line.empty() || line.back() != '\n') {
             line += '\n';
         }
-        writeAll(STDERR_FILENO, line);  // one write per line keeps lines whole across threads
+        io::writeAll(STDERR_FILENO, line);  // one write per line keeps lines whole across threads
     }
 
   private:
@@ -179,4 +171,4 @@ void CapturingLogSink::clear() {
     priorities_.clear();
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix

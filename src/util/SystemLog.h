@@ -14,7 +14,7 @@
 #include <utility>
 #include <vector>
 
-namespace tavrix::platform {
+namespace tavrix {
 
 class LogSink {
   public:
@@ -67,4 +67,4 @@ class CapturingLogSink : public LogSink {
     std::vector<int> priorities_;
 };
 
-}  // namespace tavrix::platform
+}  // namespace tavrix

@@ -72,7 +72,7 @@ void makeRemovable(const fs::path& path) {
 }
 
 // The extractor logs refused entries; a fuzzing run would drown in them.
-class DiscardingLogSink : public tavrix::platform::LogSink {
+class DiscardingLogSink : public tavrix::LogSink {
   public:
     void write(int, std::string_view) override {}
 };
@@ -137,7 +137,7 @@ extern "C" int LLVMFuzzerInitialize(int* argc, char*** argv) {
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
     static DiscardingLogSink sink;
-    static tavrix::platform::ScopedLogSink quiet(sink);
+    static tavrix::ScopedLogSink quiet(sink);
     static WorkDirectory workDirectory;
     const fs::path& work = workDirectory.path();
     const fs::path archivePath = work / "payload";

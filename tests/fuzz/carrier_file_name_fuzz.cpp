@@ -13,7 +13,7 @@
 
 namespace {
 
-class DiscardingLogSink : public tavrix::platform::LogSink {
+class DiscardingLogSink : public tavrix::LogSink {
   public:
     void write(int, std::string_view) override {}
 };
@@ -37,7 +37,7 @@ void checkName(const std::string& name) {
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
     static DiscardingLogSink sink;
-    static tavrix::platform::ScopedLogSink scope(sink);
+    static tavrix::ScopedLogSink scope(sink);
 
     std::string_view input(reinterpret_cast<const char*>(data), size);
     std::string first(input.substr(0, size / 2));

@@ -17,7 +17,7 @@ namespace {
 using tavrix::plist::Dictionary;
 using tavrix::plist::Value;
 
-class SilentSink : public tavrix::platform::LogSink {
+class SilentSink : public tavrix::LogSink {
   public:
     void write(int, std::string_view) override {}
 };
@@ -114,7 +114,7 @@ void mergeAndCheck(const Dictionary& base, const Dictionary& overlay) {
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
     static SilentSink sink;
-    static tavrix::platform::ScopedLogSink quiet(sink);
+    static tavrix::ScopedLogSink quiet(sink);
     auto value = tavrix::plist::parse(std::string_view(reinterpret_cast<const char*>(data), size));
     if (!value) {
         return 0;

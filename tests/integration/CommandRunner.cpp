@@ -7,7 +7,7 @@
 
 #include <cerrno>
 
-#include "fs/UniqueFd.h"
+#include "io/UniqueFd.h"
 
 extern char** environ;
 
@@ -18,8 +18,8 @@ CommandResult runCommand(const std::vector<std::string>& argv) {
     if (argv.empty() || ::pipe2(ends, O_CLOEXEC) != 0) {
         return {};
     }
-    UniqueFd readEnd(ends[0]);
-    UniqueFd writeEnd(ends[1]);
+    io::UniqueFd readEnd(ends[0]);
+    io::UniqueFd writeEnd(ends[1]);
     posix_spawn_file_actions_t actions;
     posix_spawn_file_actions_init(&actions);
     posix_spawn_file_actions_adddup2(&actions, writeEnd.get(), 1);

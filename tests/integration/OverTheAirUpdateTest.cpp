@@ -27,7 +27,7 @@
 #include "util/Clock.h"
 #include "plist/PropertyListFormat.h"
 #include "daemon/UpdateCheckScheduler.h"
-#include "fs/UniqueFd.h"
+#include "io/UniqueFd.h"
 
 namespace tavrix::integration {
 namespace {
@@ -95,7 +95,7 @@ class OverTheAirUpdateTest : public BusFixture {
         writeText(site() / "catalog.plist.sig", signature);
     }
 
-    static double now() { return platform::Clock::absoluteTimeNow(); }
+    static double now() { return Clock::absoluteTimeNow(); }
     fs::path at(const char* absolutePath) { return device().path(absolutePath); }
     fs::path site() { return device().base() / "site"; }
     fs::path secretKey() { return keys_ / "secret"; }
@@ -520,7 +520,7 @@ TEST_F(OverTheAirUpdateTest, AnUpdateThatDoesNotFitLeavesTheOldBundleLinked) {
         struct statvfs space {};
         ASSERT_EQ(::statvfs(home.c_str(), &space), 0);
         const off_t filler = static_cast<off_t>(space.f_bavail * space.f_frsize) - (2 << 20);
-        UniqueFd fd(::open((home / "filler").c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600));
+        io::UniqueFd fd(::open((home / "filler").c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600));
         ASSERT_TRUE(fd);
         ASSERT_EQ(::posix_fallocate(fd.get(), 0, filler), 0);
     }

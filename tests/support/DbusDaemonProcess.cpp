@@ -13,7 +13,7 @@
 #include <stdexcept>
 #include <thread>
 
-#include "fs/UniqueFd.h"
+#include "io/UniqueFd.h"
 
 extern char** environ;
 
@@ -91,15 +91,15 @@ std::filesystem::path writeBusConfiguration(const std::filesystem::path& directo
 DbusDaemonProcess::DbusDaemonProcess(const std::filesystem::path& configFile,
                                      const std::filesystem::path& logFile,
                                      const std::optional<std::vector<std::string>>& environment) {
-    UniqueFd logFd(::open(logFile.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644));
+    io::UniqueFd logFd(::open(logFile.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644));
     int ends[2];
     if (!logFd || ::pipe2(ends, O_CLOEXEC) != 0) {
         throw std::runtime_error("cannot prepare the bus's log or address pipe");
     }
-    UniqueFd addressRead(ends[0]);
-    UniqueFd addressWriteLow(ends[1]);
+    io::UniqueFd addressRead(ends[0]);
+    io::UniqueFd addressWriteLow(ends[1]);
     // Above the descriptors the child is given, so that no dup2 below overwrites it.
-    UniqueFd addressWrite(::fcntl(addressWriteLow.get(), F_DUPFD_CLOEXEC, 10));
+    io::UniqueFd addressWrite(::fcntl(addressWriteLow.get(), F_DUPFD_CLOEXEC, 10));
     addressWriteLow.reset();
 
     SpawnActions actions;

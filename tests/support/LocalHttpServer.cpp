@@ -229,7 +229,7 @@ void LocalHttpServer::acceptLoop() {
 }
 
 void LocalHttpServer::handleConnection(int rawFd) {
-    UniqueFd fd(rawFd);
+    io::UniqueFd fd(rawFd);
     timeval timeout{kSocketTimeoutSeconds, 0};
     ::setsockopt(fd.get(), SOL_SOCKET, SO_RCVTIMEO, &timeout, sizeof timeout);
     ::setsockopt(fd.get(), SOL_SOCKET, SO_SNDTIMEO, &timeout, sizeof timeout);

@@ -18,7 +18,7 @@
 #include <utility>
 #include <vector>
 
-#include "fs/UniqueFd.h"
+#include "io/UniqueFd.h"
 
 namespace tavrix::test {
 
@@ -81,10 +81,10 @@ class LocalHttpServer {
     void sendTrickling(int fd, const std::string& head, std::string_view body,
                        std::size_t bytesPerSecond);
 
-    UniqueFd listenFd_;
+    io::UniqueFd listenFd_;
     // Written to on destruction, to wake the accept loop.
-    UniqueFd wakeReadFd_;
-    UniqueFd wakeWriteFd_;
+    io::UniqueFd wakeReadFd_;
+    io::UniqueFd wakeWriteFd_;
     std::uint16_t port_ = 0;
     mutable std::mutex mutex_;
     std::map<std::string, Response> responses_;

@@ -187,8 +187,8 @@ TEST(Archive, EntryNamesFromPathsAndFileURLs) {
 
 // One level of a directory: every entry is logged, regular files are packed, the rest left out.
 TEST(ArchiveDirectory, PacksTheFilesOfOneLevel) {
-    platform::CapturingLogSink log;
-    platform::ScopedLogSink logGuard{log};
+    CapturingLogSink log;
+    ScopedLogSink logGuard{log};
     TempDir dir;
     writeText(dir / "in/a.plist", "a");
     writeText(dir / "in/b.plist", "b");

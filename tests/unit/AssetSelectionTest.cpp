@@ -103,8 +103,8 @@ class AssetSelectionTest : public testing::Test {
 
     test::TempDir work;
     test::LocalHttpServer server;
-    platform::CapturingLogSink sink;
-    platform::ScopedLogSink guard{sink};
+    CapturingLogSink sink;
+    ScopedLogSink guard{sink};
 };
 
 // Removes "Version" from the first asset's attributes.

@@ -23,8 +23,8 @@ class CapturedLog : public ::testing::Test {
     std::vector<std::string> lines() const { return sink_.messages(); }
     bool logged(const std::string& line) const { return sink_.contains(line); }
 
-    platform::CapturingLogSink sink_;
-    platform::ScopedLogSink scope_{sink_};
+    CapturingLogSink sink_;
+    ScopedLogSink scope_{sink_};
 };
 
 // --- The carrier file-name grammar ---

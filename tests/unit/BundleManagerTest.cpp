@@ -67,8 +67,8 @@ class BundleDevice : public ::testing::Test {
     }
 
     // Keeps the test's output quiet.
-    platform::CapturingLogSink sink_;
-    platform::ScopedLogSink scope_{sink_};
+    CapturingLogSink sink_;
+    ScopedLogSink scope_{sink_};
 };
 
 struct LinkState {

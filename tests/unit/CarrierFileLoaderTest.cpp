@@ -21,7 +21,7 @@ namespace {
 using Line = std::pair<int, std::string>;
 
 // Keeps each message with its priority: the loader's lines carry their own.
-class PrioritySink : public platform::LogSink {
+class PrioritySink : public LogSink {
   public:
     void write(int priority, std::string_view message) override {
         std::lock_guard lock(mutex_);
@@ -62,7 +62,7 @@ class CarrierFileLoaderTest : public testing::Test {
   protected:
     test::TempDir dir;
     PrioritySink sink;
-    platform::ScopedLogSink guard{sink};
+    ScopedLogSink guard{sink};
 };
 
 TEST_F(CarrierFileLoaderTest, LoadsDictionariesInEitherFormatFromAnyPath) {

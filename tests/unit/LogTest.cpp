@@ -9,8 +9,8 @@ namespace {
 
 class LogTest : public testing::Test {
   protected:
-    platform::CapturingLogSink sink;
-    platform::ScopedLogSink guard{sink};
+    CapturingLogSink sink;
+    ScopedLogSink guard{sink};
 
     std::string only() {
         auto messages = sink.messages();
@@ -77,17 +77,17 @@ TEST_F(LogTest, JournalEntriesCarryPriorityAndScopedFields) {
     logCFormat("Copying %s\n", "refused error failed");
     EXPECT_EQ(sink.priorities(), (std::vector<int>{LOG_WARNING, LOG_NOTICE}));
 
-    platform::ScopedLogField outer("TAVRIX_BEHAVIOR_ID", "outer");
+    ScopedLogField outer("TAVRIX_BEHAVIOR_ID", "outer");
     {
-        platform::ScopedLogField id("TAVRIX_BEHAVIOR_ID", "abc\ndef");
-        platform::ScopedLogField version("TAVRIX_BUNDLE_VERSION", "2.0");
+        ScopedLogField id("TAVRIX_BEHAVIOR_ID", "abc\ndef");
+        ScopedLogField version("TAVRIX_BUNDLE_VERSION", "2.0");
         EXPECT_EQ(
-            platform::journalFields(LOG_WARNING, "line one\nline two\n"),
+            journalFields(LOG_WARNING, "line one\nline two\n"),
             (std::vector<std::string>{"MESSAGE=line one\nline two", "PRIORITY=4",
                                       "SYSLOG_IDENTIFIER=tavrixservicesd",
                                       "TAVRIX_BUNDLE_VERSION=2.0", "TAVRIX_BEHAVIOR_ID=abc\ndef"}));
     }
-    EXPECT_EQ(platform::journalFields(LOG_NOTICE, "x").back(), "TAVRIX_BEHAVIOR_ID=outer");
+    EXPECT_EQ(journalFields(LOG_NOTICE, "x").back(), "TAVRIX_BEHAVIOR_ID=outer");
 }
 
 }  // namespace

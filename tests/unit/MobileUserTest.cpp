@@ -7,7 +7,7 @@
 #include "device/MobileUser.h"
 #include "plist/PropertyListFormat.h"
 
-namespace tavrix::payload {
+namespace tavrix::platform {
 namespace {
 
 TEST(MobileUser, UnknownUserLeavesIdsZeroAndNoHome) {
@@ -99,4 +99,4 @@ TEST(BuildCapabilities, AccessorsReadTheDeviceTableOnce) {
 }
 
 }  // namespace
-}  // namespace tavrix::payload
+}  // namespace tavrix::platform

@@ -38,8 +38,8 @@ Value baseWith(Dictionary overrides) {
 
 class OverlayConfigurationTest : public testing::Test {
   protected:
-    platform::CapturingLogSink sink;
-    platform::ScopedLogSink guard{sink};
+    CapturingLogSink sink;
+    ScopedLogSink guard{sink};
 };
 
 // ---- the override map ----

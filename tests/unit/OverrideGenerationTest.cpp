@@ -83,8 +83,8 @@ class OverrideGenerationTest : public testing::Test {
         return record;
     }
 
-    platform::CapturingLogSink sink;
-    platform::ScopedLogSink guard{sink};
+    CapturingLogSink sink;
+    ScopedLogSink guard{sink};
 };
 
 struct FileIdentity {

@@ -43,8 +43,8 @@ class PayloadExtraction : public testing::Test {
   protected:
     TempDir dir;
     std::string destination = dir / "dest";
-    platform::CapturingLogSink log;
-    platform::ScopedLogSink logGuard{log};
+    CapturingLogSink log;
+    ScopedLogSink logGuard{log};
 
     // Writes bytes as the archive file and extracts it into destination.
     bool extract(const std::string& bytes, ExtractionSafety safety = ExtractionSafety::AsArchived) {
@@ -281,8 +281,8 @@ TEST_F(PayloadExtraction, PathSafeFollowsSymbolicLinksInTheDestinationItself) {
 
 class BundleInstall : public testing::Test {
   protected:
-    platform::CapturingLogSink log;
-    platform::ScopedLogSink logGuard{log};
+    CapturingLogSink log;
+    ScopedLogSink logGuard{log};
     const fs::path root = test::unitTestRoot();
     const fs::path bundle = root / "var/mobile/Library/TavrixBundles/Default.bundle";
     const fs::path staged = root / "tmp/behaviorbundle_zipped.tgz";
@@ -316,8 +316,8 @@ TEST_F(BundleInstall, EachPayloadReplacesTheUserBundle) {
 }
 
 TEST(WriteDataToFile, ReplacesTheFileAndLogsEitherWay) {
-    platform::CapturingLogSink log;
-    platform::ScopedLogSink logGuard{log};
+    CapturingLogSink log;
+    ScopedLogSink logGuard{log};
     TempDir dir;
     const std::string path = dir / "staged.tgz";
     writeText(path, "older and longer content");

@@ -62,8 +62,8 @@ class PreferencesStoreTest : public testing::Test {
     // Tests may share one device root when run in one process.
     void SetUp() override { fs::remove_all(preferencesDirectory()); }
 
-    platform::CapturingLogSink sink;
-    platform::ScopedLogSink guard{sink};
+    CapturingLogSink sink;
+    ScopedLogSink guard{sink};
     PreferencesStore store;
 };
 
@@ -322,8 +322,8 @@ TEST_F(PreferencesStoreTest, ThreadsSharingOneStoreLoseNoUpdate) {
 
 class BehaviorPreferencesTest : public testing::Test {
   protected:
-    platform::CapturingLogSink sink;
-    platform::ScopedLogSink guard{sink};
+    CapturingLogSink sink;
+    ScopedLogSink guard{sink};
 };
 
 TEST_F(BehaviorPreferencesTest, KeysKeepTheirTypesAndNothingRemoves) {

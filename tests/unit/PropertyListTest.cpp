@@ -268,8 +268,8 @@ TEST(PropertyListDamage, HostileFilesAreRefusedWithAReason) {
         {"binary offset past the end", bytes(binaryList({arrayOf({7})})), "no object"},
         {"XML cut short", bytes(nestedXml(3).substr(0, 20)), "not a complete XML property list"},
     };
-    platform::CapturingLogSink sink;
-    platform::ScopedLogSink capture(sink);
+    CapturingLogSink sink;
+    ScopedLogSink capture(sink);
     for (const Case& c : cases) {
         SCOPED_TRACE(c.name);
         std::string path = dir / (std::string(c.name) + ".plist");

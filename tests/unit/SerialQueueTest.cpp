@@ -82,8 +82,8 @@ TEST(SerialQueue, SyncWaitsForEarlierTasksAndRunsInlineOnItsOwnThread) {
 }
 
 TEST(SerialQueue, ThrowingTaskIsLoggedAndTheQueueGoesOn) {
-    platform::CapturingLogSink sink;
-    platform::ScopedLogSink guard(sink);
+    CapturingLogSink sink;
+    ScopedLogSink guard(sink);
     SerialQueue queue("test.throw");
     queue.dispatchAsync([] { throw std::runtime_error("boom"); });
     queue.dispatchAsync([] { throw 42; });
@@ -99,8 +99,8 @@ TEST(SerialQueue, ThrowingTaskIsLoggedAndTheQueueGoesOn) {
 }
 
 TEST(SerialQueue, DestructionRunsQueuedWorkAndRefusesNewWork) {
-    platform::CapturingLogSink sink;
-    platform::ScopedLogSink guard(sink);
+    CapturingLogSink sink;
+    ScopedLogSink guard(sink);
     std::promise<void> release;
     std::shared_future<void> released = release.get_future().share();
     int count = 0;
@@ -129,8 +129,8 @@ TEST(SerialQueue, DestructionRunsQueuedWorkAndRefusesNewWork) {
 // The daemon's bounded stop: a worker still busy when patience runs out is left running (and
 // said so), new work is refused meanwhile, and a later stop joins it once it is done.
 TEST(SerialQueue, ShutdownWithPatienceGivesUpOnABusyWorkerThenJoinsItLater) {
-    platform::CapturingLogSink sink;
-    platform::ScopedLogSink guard(sink);
+    CapturingLogSink sink;
+    ScopedLogSink guard(sink);
     SerialQueue queue("test.patience");
     std::promise<void> release;
     std::atomic<bool> finished{false};

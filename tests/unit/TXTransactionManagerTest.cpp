@@ -25,8 +25,8 @@ class TXTransactionManagerTest : public testing::Test {
     platform::ServiceManager& serviceManager() { return platform::ServiceManager::shared(); }
 
     std::string runtime_;
-    platform::CapturingLogSink log_;
-    platform::ScopedLogSink guard_{log_};
+    CapturingLogSink log_;
+    ScopedLogSink guard_{log_};
 };
 
 TEST_F(TXTransactionManagerTest, NamesAreCountedOnceAndEndingUnknownNamesIsHarmless) {

@@ -132,8 +132,8 @@ class CalendarInZone : public testing::Test {
         return plist::Date::fromUnixTime(static_cast<double>(std::mktime(&fields)));
     }
 
-    platform::CapturingLogSink sink;
-    platform::ScopedLogSink guard{sink};
+    CapturingLogSink sink;
+    ScopedLogSink guard{sink};
 
   private:
     std::optional<std::string> saved_ = [] {

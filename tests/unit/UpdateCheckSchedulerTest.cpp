@@ -32,7 +32,7 @@ constexpr const char* kCheckEnded =
 constexpr const char* kCheckFailed = "Update check has failed, rescheduling the next update";
 
 // Keeps the log and lets a test wait for a line written on another thread.
-class WaitableLogSink : public platform::LogSink {
+class WaitableLogSink : public LogSink {
   public:
     void write(int, std::string_view message) override {
         std::lock_guard lock(mutex_);
@@ -89,7 +89,7 @@ class UpdateCheckSchedulerTest : public testing::Test {
     static void expectArmedFifteenDaysAhead() {
         auto next = nextUpdate();
         ASSERT_TRUE(next);
-        EXPECT_LT(std::fabs(*next - (platform::Clock::absoluteTimeNow() + 1296000.0)), 60.0);
+        EXPECT_LT(std::fabs(*next - (Clock::absoluteTimeNow() + 1296000.0)), 60.0);
         plist::Dictionary jobs = registeredJobs();
         ASSERT_EQ(jobs.size(), 1u);
         EXPECT_EQ(jobs.begin()->first, "Behavior Bundle Update Check");
@@ -106,7 +106,7 @@ class UpdateCheckSchedulerTest : public testing::Test {
 
     std::string runtime_;
     WaitableLogSink log_;
-    platform::ScopedLogSink logGuard_{log_};
+    ScopedLogSink logGuard_{log_};
 };
 
 // A stored time still ahead is kept; none, a mistyped one or a past one is replaced by one 15 days
@@ -118,7 +118,7 @@ TEST_F(UpdateCheckSchedulerTest, ArmsFifteenDaysAheadUnlessAFutureTimeIsStored) 
     EXPECT_EQ(log_.count("No previous update time in the preferences list"), 1);
     expectArmedFifteenDaysAhead();
 
-    const double ahead = std::floor(platform::Clock::absoluteTimeNow()) + 86400.0;
+    const double ahead = std::floor(Clock::absoluteTimeNow()) + 86400.0;
     setNextUpdate(ahead);
     scheduler.startTimer();
     EXPECT_EQ(nextUpdate(), std::optional<double>(ahead));
@@ -130,7 +130,7 @@ TEST_F(UpdateCheckSchedulerTest, ArmsFifteenDaysAheadUnlessAFutureTimeIsStored) 
     EXPECT_EQ(log_.count("No previous update time in the preferences list"), 2);
     expectArmedFifteenDaysAhead();
 
-    setNextUpdate(platform::Clock::absoluteTimeNow() - 600.0);
+    setNextUpdate(Clock::absoluteTimeNow() - 600.0);
     scheduler.startTimer();
     EXPECT_EQ(log_.count("Previous update time present is past, resetting it"), 1);
     expectArmedFifteenDaysAhead();
@@ -139,7 +139,7 @@ TEST_F(UpdateCheckSchedulerTest, ArmsFifteenDaysAheadUnlessAFutureTimeIsStored) 
 
 TEST_F(UpdateCheckSchedulerTest, UnsupportedDeviceRegistersNothingAndKeepsNextUpdate) {
     enableSupport(false);
-    const double stale = std::floor(platform::Clock::absoluteTimeNow()) - 86400.0;
+    const double stale = std::floor(Clock::absoluteTimeNow()) - 86400.0;
     setNextUpdate(stale);
     UpdateCheckScheduler::sharedInstance();
     EXPECT_EQ(log_.count("Behavior bundle is not supported, not starting the update check timer"),
@@ -155,7 +155,7 @@ TEST_F(UpdateCheckSchedulerTest, FiredJobWhoseCheckFailsReArmsAndLeavesNothingOp
     enableSupport(true);
     UpdateCheckScheduler& scheduler = UpdateCheckScheduler::sharedInstance();
 
-    platform::ScopedClockOffset fortnightLater(std::chrono::seconds(1296000 + 5));
+    ScopedClockOffset fortnightLater(std::chrono::seconds(1296000 + 5));
     ASSERT_TRUE(log_.waitFor(kCheckEnded));
     EXPECT_EQ(log_.count(kCheckBegun), 1);
     EXPECT_EQ(log_.count(kCheckFailed), 1);

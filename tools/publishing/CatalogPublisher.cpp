@@ -14,10 +14,10 @@
 #include "publishing/BundleCheck.h"
 #include "payload/Archive.h"
 #include "catalog/AssetCatalogFormat.h"
-#include "fs/AtomicFile.h"
+#include "io/AtomicFile.h"
 #include "catalog/CatalogTrust.h"
 #include "plist/PropertyListFormat.h"
-#include "fs/UniqueFd.h"
+#include "io/UniqueFd.h"
 
 namespace tavrix::tools {
 namespace {
@@ -240,7 +240,7 @@ void addOrReplace(plist::Array& entries, plist::Value entry) {
 }
 
 bool writeFile(const std::string& path, const std::string& bytes, mode_t mode) {
-    return platform::replaceFileAtomically(path, bytes, mode) == 0;
+    return io::replaceFileAtomically(path, bytes, mode) == 0;
 }
 
 // Writes the catalog and, with a key, its detached signature of exactly those bytes. The
@@ -328,7 +328,7 @@ std::optional<std::string> generateKeyPair(const std::string& secretKeyPath,
     platform::CatalogSecretKey secretKey{};
     crypto_sign_keypair(publicKey.data(), secretKey.data());
     std::string publicText = platform::base64Encode(publicKey.data(), publicKey.size());
-    UniqueFd fd(::open(secretKeyPath.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
+    io::UniqueFd fd(::open(secretKeyPath.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
     bool written = fd && ::write(fd.get(), secretKey.data(), secretKey.size()) ==
                              static_cast<ssize_t>(secretKey.size());
     int writeError = errno;

@@ -1,4 +1,4 @@
-#include "fs/AtomicFile.h"
+#include "io/AtomicFile.h"
 
 #include <fcntl.h>
 #include <stdio.h>
@@ -7,31 +7,16 @@
 
 #include <cerrno>
 
-#include "fs/UniqueFd.h"
+#include "io/FileIO.h"
+#include "io/Paths.h"
+#include "io/UniqueFd.h"
 
-namespace tavrix::platform {
+namespace tavrix::io {
 namespace {
 
 std::string directoryOf(const std::string& path) {
-    std::size_t slash = path.rfind('/');
-    if (slash == std::string::npos) {
-        return ".";
-    }
-    return slash == 0 ? "/" : path.substr(0, slash);
-}
-
-int writeAll(int fd, std::string_view bytes) {
-    while (!bytes.empty()) {
-        ssize_t written = ::write(fd, bytes.data(), bytes.size());
-        if (written < 0 && errno == EINTR) {
-            continue;
-        }
-        if (written <= 0) {
-            return written == 0 ? EIO : errno;
-        }
-        bytes.remove_prefix(static_cast<std::size_t>(written));
-    }
-    return 0;
+    std::string parent = parentDirectory(path);
+    return parent.empty() ? "." : parent;
 }
 
 // Removes the temporary file unless it was renamed into place.
@@ -126,4 +111,4 @@ int createFileAtomicallyWith(const std::string& path, mode_t mode,
     return writeAtomically(path, mode, /*replace=*/false, fill);
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::io

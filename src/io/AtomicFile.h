@@ -10,7 +10,7 @@
 #include <string_view>
 #include <vector>
 
-namespace tavrix::platform {
+namespace tavrix::io {
 
 // Writes bytes to a temporary file beside path, flushes it to disk, gives it mode and renames it
 // over path. Answers 0, or the errno of the step that failed (nothing is left behind then).
@@ -31,4 +31,4 @@ inline int replaceFileAtomically(const std::string& path, const std::vector<std:
         path, std::string_view(reinterpret_cast<const char*>(bytes.data()), bytes.size()), mode);
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::io

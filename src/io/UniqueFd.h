@@ -5,7 +5,7 @@
 
 #include <utility>
 
-namespace tavrix {
+namespace tavrix::io {
 
 class UniqueFd {
   public:
@@ -40,4 +40,4 @@ class UniqueFd {
     int fd_ = -1;
 };
 
-}  // namespace tavrix
+}  // namespace tavrix::io
