@@ -36,10 +36,10 @@
 extern char** environ;
 
 using namespace tavrix;
-using platform::BusError;
-using platform::BusMessagePtr;
-using platform::BusPtr;
-using platform::BusSlotPtr;
+using bus::BusError;
+using bus::BusMessagePtr;
+using bus::BusPtr;
+using bus::BusSlotPtr;
 
 namespace {
 

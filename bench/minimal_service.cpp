@@ -9,10 +9,10 @@
 
 #include "bus/BusHandles.h"
 
-using tavrix::platform::BusPtr;
-using tavrix::platform::BusSlotPtr;
-using tavrix::platform::EventPtr;
-using tavrix::platform::EventSourcePtr;
+using tavrix::bus::BusPtr;
+using tavrix::bus::BusSlotPtr;
+using tavrix::bus::EventPtr;
+using tavrix::bus::EventSourcePtr;
 
 namespace {
 

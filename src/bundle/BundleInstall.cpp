@@ -36,7 +36,7 @@ bool BundleManager::installBehaviorBundleData(const plist::Data& data, std::stri
         return refuse("the mobile user's home directory is unknown");
     }
     logCFormat("Writing the zipped file into: %s\n", payload::kBundleArchiveTempPath);
-    const std::string stagedPath = platform::resolvePath(payload::kBundleArchiveTempPath);
+    const std::string stagedPath = device::resolvePath(payload::kBundleArchiveTempPath);
 
     FileSystemHelper helper;
     const std::string stagingDirectory = io::parentDirectory(stagedPath);

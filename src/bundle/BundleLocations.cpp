@@ -16,11 +16,11 @@ struct BundleLocations {
 BundleLocations computeLocations() {
     const std::optional<std::string>& deviceClass = TXUtility::currentProductCategory();
     BundleLocations computed;
-    computed.system = platform::resolvePath(std::string(kSystemBundlesDirectory) +
-                                            deviceClass.value_or("") + "/" + kDefaultBundleName);
+    computed.system = device::resolvePath(std::string(kSystemBundlesDirectory) +
+                                          deviceClass.value_or("") + "/" + kDefaultBundleName);
     // Without a known home there is no user bundle; an empty location keeps every install and
     // removal away from paths outside the device root.
-    if (const char* home = platform::MobileUser::homeDirectory()) {
+    if (const char* home = device::MobileUser::homeDirectory()) {
         computed.user = std::string(home) + kUserBundlesDirectory + kDefaultBundleName;
     }
     return computed;

@@ -57,7 +57,7 @@ std::optional<std::string> fileSystemPathOf(const std::string& location) {
 }  // namespace
 
 BundleManager::BundleManager() {
-    const char* home = platform::MobileUser::homeDirectory();
+    const char* home = device::MobileUser::homeDirectory();
     bundleLinkPath_ = homeLinkPath(home, kBundleLinkFormat);
     preferencesLinkPath_ = homeLinkPath(home, kPreferencesLinkFormat);
 
@@ -209,9 +209,9 @@ BundleChangeType BundleManager::runBundleReset() {
             logCFormat("Could not link bundle file!\n");
             return kBundleChangeTypeNoChange;
         }
-        platform::PreferencesStore::shared().synchronize(kBehaviorPreferencesDomain,
-                                                         platform::MobileUser::name());
-        platform::postNotification(kBundleChangedNotification);
+        device::PreferencesStore::shared().synchronize(kBehaviorPreferencesDomain,
+                                                       device::MobileUser::name());
+        bus::postNotification(kBundleChangedNotification);
         pruneOverriddenFilesOfRemovedBundles(currentBundle_.carrierFilePath);
     }
     logCFormat("Carrier Bundle Match Result: %s\n", changeTypeName(result));

@@ -23,7 +23,7 @@ constexpr std::size_t kMaxBodyBytes = kMaxInflatedBytes;
 // A redirect loop ends the transfer as failed.
 constexpr long kMaxRedirects = 20;
 
-using HeaderList = platform::CurlHeaderList;
+using HeaderList = http::CurlHeaderList;
 
 bool equalsIgnoringCase(std::string_view a, std::string_view b) {
     if (a.size() != b.size()) {
@@ -133,11 +133,11 @@ bool copyDataFromHTTP(const std::string& url, std::optional<plist::Data>* out) {
         return false;
     }
     out->reset();
-    const platform::CurlLibrary* libcurl = platform::loadCurl();
+    const http::CurlLibrary* libcurl = http::loadCurl();
     if (libcurl == nullptr) {
         return false;
     }
-    platform::CurlEasy handle(libcurl->easy_init());
+    http::CurlEasy handle(libcurl->easy_init());
     HeaderList headers(libcurl->slist_append(nullptr, "Accept-Encoding: compress, gzip"));
     if (!handle || !headers) {
         return false;

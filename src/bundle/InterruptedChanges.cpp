@@ -62,7 +62,7 @@ void removeLeftoversOfInterruptedChanges(const std::string& bundleLink,
         overlays.pop_back();
         removeEntriesStartingWith(overlays, io::kAtomicWritePrefix);
     }
-    const std::string staged = platform::resolvePath(payload::kBundleArchiveTempPath);
+    const std::string staged = device::resolvePath(payload::kBundleArchiveTempPath);
     removeLeftover(staged);
     removeEntriesStartingWith(dirNameOfPath(staged), io::kAtomicWritePrefix);
     if (const std::string& userBundle = userBundleLocation(); !userBundle.empty()) {

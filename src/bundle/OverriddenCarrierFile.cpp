@@ -64,14 +64,14 @@ std::string fileNameField(std::string_view key) {
 }
 
 std::string overlayDirectory() {
-    const char* home = platform::MobileUser::homeDirectory();
+    const char* home = device::MobileUser::homeDirectory();
     return std::string(home != nullptr ? home : "") + kUserBundlesDirectory + kOverlayDirectoryName;
 }
 
 }  // namespace
 
 std::string overriddenFilesDirectory() {
-    return platform::MobileUser::homeDirectory() != nullptr ? overlayDirectory() : std::string();
+    return device::MobileUser::homeDirectory() != nullptr ? overlayDirectory() : std::string();
 }
 
 std::optional<std::string> overriddenFilePath(OverlayContext& context) {
@@ -105,7 +105,7 @@ std::optional<std::string> overriddenFilePath(OverlayContext& context) {
 
     std::string fileName = fileNameFor(prefix, version);
     // A name the file system cannot hold is no path at all; nothing is written then.
-    if (platform::MobileUser::homeDirectory() == nullptr || fileName.size() > NAME_MAX ||
+    if (device::MobileUser::homeDirectory() == nullptr || fileName.size() > NAME_MAX ||
         fileName.find_first_of(std::string_view("/\0", 2)) != std::string::npos) {
         return std::nullopt;
     }

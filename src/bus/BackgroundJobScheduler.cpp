@@ -19,7 +19,7 @@
 #include "util/Log.h"
 #include "util/PropertyListFile.h"
 
-namespace tavrix::platform {
+namespace tavrix::bus {
 namespace {
 
 constexpr std::string_view kJobsFileSuffix = ".jobs.plist";
@@ -71,13 +71,13 @@ std::optional<Window> windowOf(const plist::Dictionary& criteria) {
 }  // namespace
 
 std::string BackgroundJobScheduler::jobsFilePath(std::string_view clientName) {
-    return jobsFilePathUnder(platformRoot(), clientName);
+    return jobsFilePathUnder(device::platformRoot(), clientName);
 }
 
 std::string BackgroundJobScheduler::jobsFilePathUnder(std::string_view root,
                                                       std::string_view clientName) {
-    return resolvePathUnder(root, kDaemonStateDirectory) + "/" + std::string(clientName) +
-           std::string(kJobsFileSuffix);
+    return device::resolvePathUnder(root, device::kDaemonStateDirectory) + "/" +
+           std::string(clientName) + std::string(kJobsFileSuffix);
 }
 
 BackgroundJobScheduler::BackgroundJobScheduler(std::string clientName, SerialQueue& queue,
@@ -293,4 +293,4 @@ void BackgroundJobScheduler::runTimer() {
     }
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::bus

@@ -21,11 +21,11 @@
 #include <string_view>
 #include <thread>
 
-#include "util/Clock.h"
 #include "plist/Value.h"
+#include "util/Clock.h"
 #include "util/SerialQueue.h"
 
-namespace tavrix::platform {
+namespace tavrix::bus {
 
 // Criteria keys. The window bounds are numbers: seconds since 2001-01-01 00:00:00 UTC.
 inline constexpr std::string_view kJobWindowStartDate = "WindowStartDate";
@@ -94,4 +94,4 @@ class BackgroundJobScheduler {
     std::thread timer_;
 };
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::bus

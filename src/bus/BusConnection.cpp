@@ -2,7 +2,7 @@
 
 #include <cstdlib>
 
-namespace tavrix::platform {
+namespace tavrix::bus {
 
 BusPtr openDaemonBus() {
     sd_bus* raw = nullptr;
@@ -21,4 +21,4 @@ BusPtr openDaemonBus() {
     return bus;
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::bus

@@ -4,9 +4,9 @@
 
 #include "bus/BusHandles.h"
 
-namespace tavrix::platform {
+namespace tavrix::bus {
 
 // A started connection, or null when no bus can be reached.
 BusPtr openDaemonBus();
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::bus

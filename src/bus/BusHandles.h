@@ -7,7 +7,7 @@
 
 #include <memory>
 
-namespace tavrix::platform {
+namespace tavrix::bus {
 
 namespace detail {
 
@@ -69,4 +69,4 @@ class BusError {
     sd_bus_error error_ = SD_BUS_ERROR_NULL;
 };
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::bus

@@ -4,7 +4,7 @@
 #include <string_view>
 #include <type_traits>
 
-namespace tavrix::platform {
+namespace tavrix::bus {
 namespace {
 
 using plist::Type;
@@ -430,4 +430,4 @@ int readOptionalBytes(sd_bus_message* message, std::optional<std::vector<std::ui
     return 1;
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::bus

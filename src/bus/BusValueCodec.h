@@ -21,7 +21,7 @@
 
 #include "plist/Value.h"
 
-namespace tavrix::platform {
+namespace tavrix::bus {
 
 // How deeply containers may nest inside one value (a scalar at the top is depth 1). The bus
 // daemon drops a peer whose message nests more than 64 containers; a dictionary level costs
@@ -52,4 +52,4 @@ int appendOptionalBytes(sd_bus_message* message,
 // Reads "aay"; more than one element is -EINVAL.
 int readOptionalBytes(sd_bus_message* message, std::optional<std::vector<std::uint8_t>>& out);
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::bus

@@ -12,7 +12,7 @@
 #include "bus/BusHandles.h"
 #include "io/UniqueFd.h"
 
-namespace tavrix::platform {
+namespace tavrix::bus {
 namespace {
 
 int emit(sd_bus* bus, const std::string& name) {
@@ -108,4 +108,4 @@ bool postNotification(const std::string& name) {
     return own && emit(own.get(), name) >= 0;
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::bus

@@ -7,7 +7,7 @@
 
 #include <string>
 
-namespace tavrix::platform {
+namespace tavrix::bus {
 
 inline constexpr const char* kNotificationInterface = "com.zandor.NotificationCenter";
 inline constexpr const char* kNotificationMember = "Posted";
@@ -23,4 +23,4 @@ bool postNotification(const std::string& name);
 // calling thread owns it, and it must be attached to that thread's event loop.
 void setNotificationBus(sd_bus* bus);
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::bus

@@ -7,7 +7,7 @@
 #include "util/ContainExceptions.h"
 #include "util/Log.h"
 
-namespace tavrix::platform {
+namespace tavrix::bus {
 
 ServiceListener::ServiceListener(std::string serviceName, Delegate& delegate)
     : serviceName_(std::move(serviceName)), delegate_(delegate) {}
@@ -161,4 +161,4 @@ void ServiceListener::releaseNameAndDrain() {
     sd_bus_flush(bus_.get());
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::bus

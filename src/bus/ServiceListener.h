@@ -17,7 +17,7 @@
 
 #include "bus/BusHandles.h"
 
-namespace tavrix::platform {
+namespace tavrix::bus {
 
 struct ExportedInterface {
     const char* name;
@@ -91,4 +91,4 @@ class ServiceListener {
     bool nameOwned_ = false;
 };
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::bus

@@ -16,7 +16,7 @@
 #include "io/FileIO.h"
 #include "io/UniqueFd.h"
 
-namespace tavrix::platform {
+namespace tavrix::bus {
 namespace {
 
 constexpr std::chrono::seconds kDefaultIdleGrace{30};
@@ -41,7 +41,7 @@ std::string runtimeDirectoryFromEnvironment() {
         std::string_view value(configured);
         return std::string(value.substr(0, value.find(':')));
     }
-    return resolvePath("/run/tavrixservicesd");
+    return device::resolvePath("/run/tavrixservicesd");
 }
 
 std::int64_t ticksNow() {
@@ -158,4 +158,4 @@ void ServiceManager::notifyStopping() {
     sd_notify(0, "STOPPING=1\nSTATUS=Leaving");
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::bus

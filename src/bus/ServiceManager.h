@@ -14,7 +14,7 @@
 
 #include "io/UniqueFd.h"
 
-namespace tavrix::platform {
+namespace tavrix::bus {
 
 class ServiceManager {
   public:
@@ -78,4 +78,4 @@ class ScopedServiceTransaction {
     ScopedServiceTransaction& operator=(const ScopedServiceTransaction&) = delete;
 };
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::bus

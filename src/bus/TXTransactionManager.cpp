@@ -35,7 +35,7 @@ void TXTransactionManager::beginTransaction(const std::string& name, bool keepAl
     }
     plist::Value nameValue(name);
     logObjectFormat("*********** Beginning Corvex transaction : %@ ***********", &nameValue);
-    platform::ServiceManager::shared().openTransaction();
+    bus::ServiceManager::shared().openTransaction();
 }
 
 void TXTransactionManager::endTransaction(const std::string& name) {
@@ -48,7 +48,7 @@ void TXTransactionManager::endTransaction(const std::string& name) {
     }
     plist::Value nameValue(name);
     logObjectFormat("*********** Ended Corvex transaction : %@ ***********", &nameValue);
-    platform::ServiceManager::shared().closeTransaction();
+    bus::ServiceManager::shared().closeTransaction();
 }
 
 bool TXTransactionManager::hasOpenTransactionForName(const std::string& name) const {
@@ -89,7 +89,7 @@ void TXTransactionManager::_setKeepAlive(bool enable) {
     if (_isKeepAliveEnabled(&readError) == enable && !readError) {
         return;
     }
-    if (!platform::ServiceManager::shared().writeKeepAlive(enable ? 1 : 0)) {
+    if (!bus::ServiceManager::shared().writeKeepAlive(enable ? 1 : 0)) {
         logObjectFormat("pelgarind could not toggle keep alive status to stelmard.");
         return;
     }
@@ -99,7 +99,7 @@ void TXTransactionManager::_setKeepAlive(bool enable) {
 
 bool TXTransactionManager::_isKeepAliveEnabled(bool* /*error: accepted, never written*/) {
     std::int64_t value = 1;
-    if (!platform::ServiceManager::shared().readKeepAlive(value)) {
+    if (!bus::ServiceManager::shared().readKeepAlive(value)) {
         logObjectFormat("pelgarind could not read keep alive status from stelmard.");
         return true;
     }

@@ -13,7 +13,7 @@
 #include "util/FileSystemUtilities.h"
 #include "util/Log.h"
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 namespace {
 
 constexpr const char* kSerialNumberKey = "SerialNumber";
@@ -152,7 +152,7 @@ std::optional<std::string> Asset::localURL() const {
 
 void Asset::purge(PurgeCompletion completion) {
     auto self = shared_from_this();
-    auto unfinished = std::make_shared<ScopedServiceTransaction>();
+    auto unfinished = std::make_shared<bus::ScopedServiceTransaction>();
     AssetCatalogService::shared().workerQueue().dispatchAsync(
         [self, unfinished, completion = std::move(completion)] {
             std::vector<std::string> directories;
@@ -203,7 +203,8 @@ std::optional<std::vector<std::shared_ptr<Asset>>> AssetQuery::runQuery() const 
     for (CatalogEntry& entry : *entries) {
         if (entry.rolloutPercent < 100) {
             if (!serialNumberRead) {
-                serialNumber = copyDeviceStringAnswer(kSerialNumberKey).value_or(std::string());
+                serialNumber =
+                    device::copyDeviceStringAnswer(kSerialNumberKey).value_or(std::string());
                 serialNumberRead = true;
             }
             auto version = entry.attributes.find(kVersionAttribute);
@@ -230,8 +231,8 @@ void AssetQuery::removeAbandonedDownloads() const {
     std::optional<AssetTypeSettings> settings =
         AssetCatalogService::shared().settingsFor(assetType_);
     if (settings) {
-        platform::removeAbandonedDownloads(settings->cacheDirectory, /*completedToo=*/true);
+        catalog::removeAbandonedDownloads(settings->cacheDirectory, /*completedToo=*/true);
     }
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

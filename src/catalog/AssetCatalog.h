@@ -21,12 +21,12 @@
 #include <string>
 #include <vector>
 
+#include "bus/ServiceManager.h"
 #include "catalog/AssetCatalogFormat.h"
 #include "catalog/AssetCatalogSettings.h"
-#include "bus/ServiceManager.h"
 #include "plist/Value.h"
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 
 // The key of a progress report's current operation, a string with one of the values below.
 inline constexpr const char* kAssetProgressOperationKey = "Operation";
@@ -89,7 +89,7 @@ class Asset : public std::enable_shared_from_this<Asset> {
     ProgressHandler handler_;
     std::deque<plist::Dictionary> undelivered_;
     // Open from beginDownload until the last report has been handled.
-    std::optional<ScopedServiceTransaction> unfinished_;
+    std::optional<bus::ScopedServiceTransaction> unfinished_;
 };
 
 // How the last runQuery() went, for a caller that tells "nothing newer" from "could not ask".
@@ -128,4 +128,4 @@ class AssetQuery {
     mutable QueryResult lastResult_;
 };
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

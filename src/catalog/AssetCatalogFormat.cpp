@@ -8,7 +8,7 @@
 #include "plist/PropertyListFormat.h"
 #include "util/Log.h"
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 namespace {
 
 // The entry as a CatalogEntry, or nothing with whyNot set.
@@ -31,7 +31,7 @@ std::optional<CatalogEntry> readEntry(const plist::Value& value, const std::stri
         whyNot = "ArchiveURL is missing or not a string";
         return std::nullopt;
     }
-    std::optional<std::string> resolved = resolveHttpURL(catalogURL, *url->asString());
+    std::optional<std::string> resolved = http::resolveHttpURL(catalogURL, *url->asString());
     if (!resolved) {
         whyNot = "ArchiveURL is not a valid http or https URL";
         return std::nullopt;
@@ -111,4 +111,4 @@ std::optional<std::vector<CatalogEntry>> readCatalogEntries(const plist::Value& 
     return entries;
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

@@ -25,7 +25,7 @@
 
 #include "plist/Value.h"
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 
 inline constexpr const char* kCatalogAssetTypeKey = "AssetType";
 inline constexpr const char* kCatalogAssetsKey = "Assets";
@@ -62,4 +62,4 @@ std::optional<std::vector<CatalogEntry>> readCatalogEntries(const plist::Value& 
                                                             std::string_view assetType,
                                                             std::string& whyNot);
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

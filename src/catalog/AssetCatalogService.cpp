@@ -5,7 +5,7 @@
 #include "device/PlatformRoot.h"
 #include "util/Log.h"
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 
 namespace {
 
@@ -34,7 +34,7 @@ bool AssetCatalogService::shutdownIfStarted(std::chrono::milliseconds patience) 
 }
 
 AssetCatalogService::AssetCatalogService()
-    : settingsFile_(resolvePath(kAssetCatalogSettingsPath)),
+    : settingsFile_(device::resolvePath(kAssetCatalogSettingsPath)),
       worker_("com.zandor.tavrixservicesd.AssetDownloads"),
       delivery_("com.zandor.tavrixservicesd.AssetProgress") {}
 
@@ -70,4 +70,4 @@ void AssetCatalogService::noteSettingsProblem(std::string_view assetType,
     }
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

@@ -13,7 +13,7 @@
 #include "plist/CachedPropertyListFile.h"
 #include "util/SerialQueue.h"
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 
 class AssetCatalogService {
   public:
@@ -44,4 +44,4 @@ class AssetCatalogService {
     SerialQueue delivery_;
 };
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

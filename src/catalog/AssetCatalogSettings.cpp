@@ -5,7 +5,7 @@
 
 #include "device/PlatformRoot.h"
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 namespace {
 
 // The asset type names a directory in the cache, so it must be one plain path component.
@@ -104,12 +104,12 @@ bool readLimits(const plist::Value& settings, AssetLimits& limits, std::string& 
 
 }  // namespace
 
-HttpTransferLimits AssetLimits::archiveTransfer() const {
+http::HttpTransferLimits AssetLimits::archiveTransfer() const {
     return {connectTimeoutSeconds, lowSpeedBytesPerSecond, lowSpeedSeconds,
             archiveTimeoutSeconds * 1000};
 }
 
-HttpTransferLimits AssetLimits::catalogTransfer(long remainingMilliseconds) const {
+http::HttpTransferLimits AssetLimits::catalogTransfer(long remainingMilliseconds) const {
     return {connectTimeoutSeconds, lowSpeedBytesPerSecond, lowSpeedSeconds,
             std::max(remainingMilliseconds, 1L)};
 }
@@ -161,8 +161,8 @@ std::optional<AssetTypeSettings> parseAssetTypeSettings(const plist::Value& sett
         }
         result.allowUnsigned = *allow->asBoolean();
     }
-    result.cacheDirectory = resolvePath(cacheDirectory) + "/" + result.assetType;
+    result.cacheDirectory = device::resolvePath(cacheDirectory) + "/" + result.assetType;
     return result;
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

@@ -24,7 +24,7 @@
 #include "http/HttpTransfer.h"
 #include "plist/Value.h"
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 
 inline constexpr const char* kAssetCatalogSettingsPath = "/etc/tavrix/AssetCatalog.plist";
 inline constexpr const char* kDefaultAssetCacheDirectory = "/var/cache/tavrixservicesd";
@@ -59,10 +59,10 @@ struct AssetLimits {
     long catalogTimeoutSeconds = 5;
     long archiveTimeoutSeconds = 1800;
 
-    HttpTransferLimits archiveTransfer() const;
+    http::HttpTransferLimits archiveTransfer() const;
     // For what is left of the catalog's time; never below one millisecond, which curl would
     // take as no limit.
-    HttpTransferLimits catalogTransfer(long remainingMilliseconds) const;
+    http::HttpTransferLimits catalogTransfer(long remainingMilliseconds) const;
 };
 
 struct AssetTypeSettings {
@@ -84,4 +84,4 @@ std::optional<AssetTypeSettings> parseAssetTypeSettings(const plist::Value& sett
                                                         std::string_view assetType,
                                                         std::string& whyNot);
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

@@ -22,7 +22,7 @@
 #include "util/FileSystemUtilities.h"
 #include "util/Log.h"
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 namespace {
 
 constexpr const char* kStagedArchiveSuffix = ".download";
@@ -68,7 +68,7 @@ std::optional<std::string> downloadArchive(const CatalogEntry& entry, int fd,
     std::uint64_t received = 0;
     const std::uint64_t step = std::max<std::uint64_t>(entry.archiveSize / kDownloadReportSteps, 1);
     std::uint64_t nextReport = step;
-    HttpBodyReceiver receiver = [&](std::string_view bytes, std::string& refusal) {
+    http::HttpBodyReceiver receiver = [&](std::string_view bytes, std::string& refusal) {
         if (bytes.size() > entry.archiveSize - received) {
             refusal = "the server sent more than the catalog's " +
                       std::to_string(entry.archiveSize) + " bytes";
@@ -87,7 +87,7 @@ std::optional<std::string> downloadArchive(const CatalogEntry& entry, int fd,
         return true;
     };
     std::string error;
-    if (!transferHttpBody(entry.archiveURL, receiver, limits.archiveTransfer(), error)) {
+    if (!http::transferHttpBody(entry.archiveURL, receiver, limits.archiveTransfer(), error)) {
         return "cannot download " + entry.archiveURL + ": " + error;
     }
     if (received != entry.archiveSize) {
@@ -195,4 +195,4 @@ std::optional<std::string> downloadAndInstallAsset(const CatalogEntry& entry,
     return std::nullopt;
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

@@ -10,7 +10,7 @@
 #include "catalog/AssetCatalogSettings.h"
 #include "plist/Value.h"
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 
 // Where one download of an asset lives in its type's cache directory. Every download gets names
 // of its own (the archive's digest and a random suffix), so two downloads of the same asset that
@@ -41,4 +41,4 @@ std::optional<std::string> downloadAndInstallAsset(const CatalogEntry& entry,
                                                    const AssetLimits& limits,
                                                    const AssetProgressReporter& report);
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

@@ -1,6 +1,6 @@
 #include "catalog/CatalogCrypto.h"
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 
 bool sodiumReady() {
     static const bool ready = sodium_init() >= 0;
@@ -53,4 +53,4 @@ std::optional<std::string> base64Decode(std::string_view text) {
     return bytes;
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

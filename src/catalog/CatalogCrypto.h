@@ -12,7 +12,7 @@
 
 #include "catalog/Sha256.h"
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 
 using CatalogPublicKey = std::array<std::uint8_t, crypto_sign_PUBLICKEYBYTES>;
 using CatalogSecretKey = std::array<std::uint8_t, crypto_sign_SECRETKEYBYTES>;
@@ -34,4 +34,4 @@ std::string base64Encode(const std::uint8_t* bytes, std::size_t length);
 // base64.
 std::optional<std::string> base64Decode(std::string_view text);
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

@@ -12,7 +12,7 @@
 #include "util/FileSystemUtilities.h"
 #include "util/Log.h"
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 namespace {
 
 constexpr const char* kLocalCopyName = "/catalog.plist";
@@ -52,8 +52,8 @@ std::optional<SignedCatalog> fetchFromServer(const AssetTypeSettings& settings,
     const AssetLimits& limits = settings.limits;
     FetchDeadline deadline(limits.catalogTimeoutSeconds);
     std::optional<std::string> bytes =
-        fetchHttpBody(settings.catalogURL, kMaxCatalogBytes,
-                      limits.catalogTransfer(deadline.remainingMilliseconds()), error);
+        http::fetchHttpBody(settings.catalogURL, kMaxCatalogBytes,
+                            limits.catalogTransfer(deadline.remainingMilliseconds()), error);
     if (!bytes) {
         refusal = {CatalogRefusalKind::FetchFailed, "cannot fetch it: " + error};
         return std::nullopt;
@@ -62,8 +62,8 @@ std::optional<SignedCatalog> fetchFromServer(const AssetTypeSettings& settings,
     if (isSigned(settings)) {
         std::string signatureURL = settings.catalogURL + kCatalogSignatureSuffix;
         std::optional<std::string> signature =
-            fetchHttpBody(signatureURL, kMaxSignatureBytes,
-                          limits.catalogTransfer(deadline.remainingMilliseconds()), error);
+            http::fetchHttpBody(signatureURL, kMaxSignatureBytes,
+                                limits.catalogTransfer(deadline.remainingMilliseconds()), error);
         if (!signature) {
             refusal = {CatalogRefusalKind::MissingSignature,
                        "cannot fetch its signature " + signatureURL + ": " + error};
@@ -187,4 +187,4 @@ std::optional<std::vector<CatalogEntry>> loadCatalogEntries(const AssetTypeSetti
     return entries;
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

@@ -11,7 +11,7 @@
 #include "catalog/AssetCatalogSettings.h"
 #include "catalog/CatalogRefusal.h"
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 
 // The catalog's entries. From the server (localOnly false) the catalog and its signature are
 // fetched and verified with the trusted key the catalog names, checked against its expiry and
@@ -24,4 +24,4 @@ std::optional<std::vector<CatalogEntry>> loadCatalogEntries(const AssetTypeSetti
                                                             bool localOnly,
                                                             CatalogRefusal& refusal);
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

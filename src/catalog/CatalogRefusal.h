@@ -5,7 +5,7 @@
 
 #include <string>
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 
 enum class CatalogRefusalKind {
     FetchFailed,
@@ -57,4 +57,4 @@ inline const char* CatalogRefusal::reason() const {
     return "refused";
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

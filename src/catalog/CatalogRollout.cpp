@@ -4,7 +4,7 @@
 
 #include "catalog/CatalogCrypto.h"
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 
 int rolloutBucket(std::string_view deviceSerialNumber, std::string_view version) {
     Sha256Digest digest;
@@ -27,4 +27,4 @@ bool takesPartInRollout(std::string_view deviceSerialNumber, std::string_view ve
     return rolloutBucket(deviceSerialNumber, version) < percent;
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

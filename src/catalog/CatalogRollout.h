@@ -5,7 +5,7 @@
 
 #include <string_view>
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 
 // The device's place in the rollout of this version, from 0 to 99.
 int rolloutBucket(std::string_view deviceSerialNumber, std::string_view version);
@@ -15,4 +15,4 @@ int rolloutBucket(std::string_view deviceSerialNumber, std::string_view version)
 // fall into one bucket together.
 bool takesPartInRollout(std::string_view deviceSerialNumber, std::string_view version, int percent);
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

@@ -5,7 +5,7 @@
 #include "device/DaemonStateFile.h"
 #include "plist/PropertyListFormat.h"
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 namespace {
 
 constexpr const char* kSerialFilePrefix = "catalog-serial-";
@@ -107,7 +107,7 @@ bool checkFreshness(const CatalogMetadata& metadata, plist::Date now,
 }
 
 std::optional<std::int64_t> readAcceptedSerial(std::string_view assetType) {
-    const plist::Dictionary stored = readDaemonStateFile(serialFileName(assetType));
+    const plist::Dictionary stored = device::readDaemonStateFile(serialFileName(assetType));
     auto serial = stored.find(kHighestSerialKey);
     const plist::Integer* number = serial != stored.end() ? serial->second.asInteger() : nullptr;
     if (number == nullptr || number->isLargeUnsigned()) {
@@ -119,7 +119,8 @@ std::optional<std::int64_t> readAcceptedSerial(std::string_view assetType) {
 int recordAcceptedSerial(std::string_view assetType, std::int64_t serial) {
     const plist::Value record(
         plist::Dictionary{{kHighestSerialKey, plist::Value(static_cast<long long>(serial))}});
-    return writeDaemonStateFile(serialFileName(assetType), record, plist::Format::Xml, 0644);
+    return device::writeDaemonStateFile(serialFileName(assetType), record, plist::Format::Xml,
+                                        0644);
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

@@ -14,7 +14,7 @@
 #include "catalog/CatalogRefusal.h"
 #include "plist/Value.h"
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 
 struct TrustedCatalogKey {
     std::string identifier;
@@ -58,4 +58,4 @@ std::optional<std::int64_t> readAcceptedSerial(std::string_view assetType);
 // Records serial as the highest accepted for assetType. 0 or an errno.
 int recordAcceptedSerial(std::string_view assetType, std::int64_t serial);
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

@@ -12,7 +12,7 @@
 #include "util/SharedLibrary.h"
 #include "util/SystemLog.h"
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 namespace {
 
 constexpr const char* kLibraryName = "libcrypto.so.3";
@@ -118,4 +118,4 @@ std::optional<std::string> sha256HexOfFile(const std::string& path) {
     return hex.empty() ? std::nullopt : std::optional<std::string>(std::move(hex));
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

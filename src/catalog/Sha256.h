@@ -8,7 +8,7 @@
 #include <string>
 #include <string_view>
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 
 inline constexpr std::size_t kSha256HexLength = 64;
 
@@ -33,4 +33,4 @@ class Sha256Digest {
 // The SHA-256 of the file at path as lower-case hex, or nothing when it cannot be read or hashed.
 std::optional<std::string> sha256HexOfFile(const std::string& path);
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

@@ -11,9 +11,9 @@
 
 namespace tavrix::client {
 
-using platform::BusError;
-using platform::BusMessagePtr;
-using platform::BusPtr;
+using bus::BusError;
+using bus::BusMessagePtr;
+using bus::BusPtr;
 
 namespace {
 
@@ -54,7 +54,7 @@ struct NotificationSubscription::Target {
     NotificationHandler handler;
     std::shared_ptr<Deliveries> deliveries;
     // Last, so that it is released before what it points to.
-    platform::BusSlotPtr slot;
+    bus::BusSlotPtr slot;
 };
 
 NotificationSubscription::NotificationSubscription() = default;
@@ -234,7 +234,7 @@ bool TavrixClient::setTavrixID(const std::string& tavrixID,
                                const std::optional<std::vector<std::uint8_t>>& bundle) {
     Call call(state_->bus.get(), "SetTavrixID");
     call.appendString(tavrixID, "behavior ID");
-    call.check(platform::appendOptionalBytes(call.message(), bundle), "cannot encode the bundle");
+    call.check(bus::appendOptionalBytes(call.message(), bundle), "cannot encode the bundle");
     return call.sendForBoolean(state_->bus.get());
 }
 
@@ -247,7 +247,7 @@ std::optional<plist::Value> TavrixClient::copyTavrixValue(const std::string& key
     call.appendString(key, "key");
     BusMessagePtr reply = call.send(state_->bus.get(), "av");
     std::optional<plist::Value> value;
-    int r = platform::readOptionalValue(reply.get(), value);
+    int r = bus::readOptionalValue(reply.get(), value);
     if (r < 0) {
         call.fail("malformed reply: " + errnoText(r));
     }
@@ -347,7 +347,7 @@ plist::Dictionary TavrixClient::status() {
     Call call(state_->bus.get(), "GetStatus", kStatusInterface);
     BusMessagePtr reply = call.send(state_->bus.get(), "a{sv}");
     plist::Dictionary status;
-    int r = platform::readDictionary(reply.get(), status);
+    int r = bus::readDictionary(reply.get(), status);
     if (r < 0) {
         call.fail("malformed reply: " + errnoText(r));
     }

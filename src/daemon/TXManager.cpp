@@ -123,8 +123,8 @@ std::optional<plist::Value> TXManager::copyTavrixValue(const std::string& key) {
         logObjectFormat("Copy behavior setting: Device has cellular radio, no tavrix bundle");
         return std::nullopt;
     }
-    return platform::PreferencesStore::shared().copyValue(key, kBehaviorSettingsDomain,
-                                                          platform::MobileUser::name());
+    return device::PreferencesStore::shared().copyValue(key, kBehaviorSettingsDomain,
+                                                        device::MobileUser::name());
 }
 
 bool TXManager::checkForTavrixBundleUpdate() {

@@ -9,16 +9,16 @@
 #include <cstring>
 #include <thread>
 
-#include "daemon/TXManager.h"
-#include "daemon/TXManagerStatus.h"
-#include "bus/TXTransactionManager.h"
-#include "catalog/AssetCatalogService.h"
 #include "bus/NotificationCenter.h"
 #include "bus/ServiceManager.h"
+#include "bus/TXTransactionManager.h"
+#include "catalog/AssetCatalogService.h"
+#include "daemon/TXManager.h"
+#include "daemon/TXManagerStatus.h"
 #include "daemon/UpdateCheckScheduler.h"
+#include "device/TXUtility.h"
 #include "util/ContainExceptions.h"
 #include "util/Log.h"
-#include "device/TXUtility.h"
 
 namespace tavrix {
 namespace {
@@ -78,7 +78,7 @@ TXManager& TXManagerServer::manager() {
 int TXManagerServer::runUntilIdleExit() {
     mainThreadId = std::this_thread::get_id();
     auto& transactions = TXTransactionManager::sharedInstance();
-    auto& serviceManager = platform::ServiceManager::shared();
+    auto& serviceManager = bus::ServiceManager::shared();
     transactions.setKeepAliveClearable(false);
 
     if (serverLogStyle() == kServerLogStyleVerbose) {
@@ -94,7 +94,7 @@ int TXManagerServer::runUntilIdleExit() {
         _stopWorkers();
         return 1;
     }
-    platform::setNotificationBus(_listener.bus());
+    bus::setNotificationBus(_listener.bus());
 
     logObjectFormat("Notifying observers of start");
     _notifyServerStart();
@@ -109,7 +109,7 @@ int TXManagerServer::runUntilIdleExit() {
     _stopWorkers();
 
     transactions.clearKeepAliveIfNecessary(true);
-    platform::setNotificationBus(nullptr);
+    bus::setNotificationBus(nullptr);
     return 0;
 }
 
@@ -129,7 +129,7 @@ bool TXManagerServer::_startServing() {
     };
     // Transactions closed on other threads wake the loop, so that it looks at idleness again.
     auto onWake = [](sd_event_source*, int, uint32_t, void*) -> int {
-        platform::ServiceManager::shared().consumeWake();
+        bus::ServiceManager::shared().consumeWake();
         return 0;
     };
     sd_event_source* terminate = nullptr;
@@ -140,7 +140,7 @@ bool TXManagerServer::_startServing() {
         r = sd_event_add_signal(event, &interrupt, SIGINT, onSignal, this);
         _interruptSource.reset(interrupt);
     }
-    const int wakeFd = platform::ServiceManager::shared().wakeFd();
+    const int wakeFd = bus::ServiceManager::shared().wakeFd();
     if (r >= 0 && wakeFd >= 0) {
         sd_event_source* wake = nullptr;
         r = sd_event_add_io(event, &wake, wakeFd, EPOLLIN, onWake, nullptr);
@@ -154,7 +154,7 @@ bool TXManagerServer::_startServing() {
     if (!_listener.resume(event, kTXServiceObjectPath,
                           {{kTXServiceInterface, managerServerVTable()},
                            {kTXStatusInterface, statusVTable()},
-                           {platform::kNotificationInterface, notificationCenterVTable()}},
+                           {bus::kNotificationInterface, notificationCenterVTable()}},
                           this)) {
         return false;
     }
@@ -179,7 +179,7 @@ bool TXManagerServer::_startServing() {
 
 void TXManagerServer::_run() {
     using namespace std::chrono;
-    auto& serviceManager = platform::ServiceManager::shared();
+    auto& serviceManager = bus::ServiceManager::shared();
     auto& transactions = TXTransactionManager::sharedInstance();
     const auto slice = duration_cast<microseconds>(duration<double>(kRunLoopSliceSeconds));
     std::string lastStatus;
@@ -234,7 +234,7 @@ void TXManagerServer::_finish() {
     }
     _finishing = true;
     _drainDeadline = std::chrono::steady_clock::now() + kDrainLimit;
-    platform::ServiceManager::shared().notifyStopping();
+    bus::ServiceManager::shared().notifyStopping();
     // The launch transaction only guards a fresh daemon against idleness; leaving on a signal
     // does not wait for it.
     _launchTimer.reset();
@@ -246,17 +246,17 @@ void TXManagerServer::_stopWorkers() {
     // Producers before consumers: the job timer and its queue start downloads, downloads queue
     // progress reports, reports install bundles.
     const bool scheduler = UpdateCheckScheduler::shutdownIfStarted(kWorkerStopPatience);
-    const bool catalog = platform::AssetCatalogService::shutdownIfStarted(kWorkerStopPatience);
+    const bool catalog = catalog::AssetCatalogService::shutdownIfStarted(kWorkerStopPatience);
     const bool tasks = TXUtility::shutdownTaskQueue(kWorkerStopPatience);
     _workersStopped = scheduler && catalog && tasks;
 }
 
 void TXManagerServer::_notifyServerStart() {
-    platform::postNotification(kDaemonStartedNotification);
+    bus::postNotification(kDaemonStartedNotification);
 }
 
-bool TXManagerServer::shouldAcceptNewConnection(platform::ServiceListener& listener,
-                                                const platform::PeerConnection& connection) {
+bool TXManagerServer::shouldAcceptNewConnection(bus::ServiceListener& listener,
+                                                const bus::PeerConnection& connection) {
     auto& transactions = TXTransactionManager::sharedInstance();
     transactions.beginTransaction(kAddClientTransaction);
     addClient(std::make_shared<TXManagerServerClient>(

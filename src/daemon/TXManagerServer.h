@@ -18,9 +18,9 @@
 #include <string>
 #include <vector>
 
-#include "daemon/TXManagerServerClient.h"
 #include "bus/BusHandles.h"
 #include "bus/ServiceListener.h"
+#include "daemon/TXManagerServerClient.h"
 #include "plist/Value.h"
 
 namespace tavrix {
@@ -33,7 +33,7 @@ inline constexpr const char* kTXServiceInterface = "com.zandor.TXManagerServerIn
 // Read-only, beside the service interface: the status view for operators.
 inline constexpr const char* kTXStatusInterface = "com.zandor.TXManagerStatusInterface";
 
-class TXManagerServer : private platform::ServiceListener::Delegate {
+class TXManagerServer : private bus::ServiceListener::Delegate {
   public:
     // How long a fresh daemon holds "TXMinimumLaunchTransaction".
     static constexpr std::uint64_t kMinimumLaunchSeconds = 10;
@@ -75,14 +75,14 @@ class TXManagerServer : private platform::ServiceListener::Delegate {
     // A copy of the client list; the copy keeps its clients alive.
     std::vector<std::shared_ptr<const TXManagerServerClient>> clients() const;
 
-    platform::ServiceListener& listener() { return _listener; }
+    bus::ServiceListener& listener() { return _listener; }
 
   private:
     TXManagerServer();
 
     // Listener delegate.
-    bool shouldAcceptNewConnection(platform::ServiceListener& listener,
-                                   const platform::PeerConnection& connection) override;
+    bool shouldAcceptNewConnection(bus::ServiceListener& listener,
+                                   const bus::PeerConnection& connection) override;
     bool isAcceptedConnection(const std::string& uniqueName) const override;
     void connectionInvalidated(const std::string& uniqueName) override;
 
@@ -100,12 +100,12 @@ class TXManagerServer : private platform::ServiceListener::Delegate {
 
     TXManager* _manager = nullptr;
     std::vector<std::shared_ptr<TXManagerServerClient>> _clients;
-    platform::ServiceListener _listener;
-    platform::EventPtr _event;
-    platform::EventSourcePtr _launchTimer;
-    platform::EventSourcePtr _terminateSource;
-    platform::EventSourcePtr _interruptSource;
-    platform::EventSourcePtr _wakeSource;
+    bus::ServiceListener _listener;
+    bus::EventPtr _event;
+    bus::EventSourcePtr _launchTimer;
+    bus::EventSourcePtr _terminateSource;
+    bus::EventSourcePtr _interruptSource;
+    bus::EventSourcePtr _wakeSource;
     bool _finishing = false;
     std::chrono::steady_clock::time_point _drainDeadline;
     bool _workersStopped = true;

@@ -8,7 +8,7 @@ namespace tavrix {
 
 TXManagerServerClient::TXManagerServerClient(std::string connection, pid_t pid,
                                              std::optional<std::string> identifier,
-                                             platform::BusSlotPtr invalidationWatch)
+                                             bus::BusSlotPtr invalidationWatch)
     : _connection(std::move(connection)),
       _identifier(std::move(identifier)),
       _pid(pid),

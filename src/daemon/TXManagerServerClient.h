@@ -17,7 +17,7 @@ class TXManagerServerClient {
     // peer's credentials and may be unknown. invalidationWatch is what reports the peer leaving
     // the bus; it is dropped with the connection.
     TXManagerServerClient(std::string connection, pid_t pid, std::optional<std::string> identifier,
-                          platform::BusSlotPtr invalidationWatch = nullptr);
+                          bus::BusSlotPtr invalidationWatch = nullptr);
     ~TXManagerServerClient();
     TXManagerServerClient(const TXManagerServerClient&) = delete;
     TXManagerServerClient& operator=(const TXManagerServerClient&) = delete;
@@ -36,7 +36,7 @@ class TXManagerServerClient {
     std::string _connection;
     std::optional<std::string> _identifier;
     pid_t _pid;
-    platform::BusSlotPtr _invalidationWatch;
+    bus::BusSlotPtr _invalidationWatch;
 };
 
 }  // namespace tavrix

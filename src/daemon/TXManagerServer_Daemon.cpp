@@ -7,10 +7,10 @@
 
 #include <cstring>
 
-#include "daemon/TXManagerServer.h"
 #include "bus/BusValueCodec.h"
 #include "bus/NotificationCenter.h"
 #include "bus/ServiceManager.h"
+#include "daemon/TXManagerServer.h"
 #include "util/ContainExceptions.h"
 #include "util/Log.h"
 
@@ -22,7 +22,7 @@ namespace {
 class MessageScope {
   public:
     MessageScope(TXManagerServer& server, sd_bus_message* message) : listener_(server.listener()) {
-        platform::ServiceManager::shared().noteActivity();
+        bus::ServiceManager::shared().noteActivity();
         try {
             listener_.beginMessage(message);
         } catch (...) {
@@ -32,13 +32,13 @@ class MessageScope {
     }
     ~MessageScope() {
         listener_.endMessage();
-        platform::ServiceManager::shared().noteActivity();
+        bus::ServiceManager::shared().noteActivity();
     }
     MessageScope(const MessageScope&) = delete;
     MessageScope& operator=(const MessageScope&) = delete;
 
   private:
-    platform::ServiceListener& listener_;
+    bus::ServiceListener& listener_;
 };
 
 int invalidArguments(sd_bus_error* error, int r) {
@@ -67,7 +67,7 @@ int handleSetTavrixID(sd_bus_message* message, void* userdata, sd_bus_error* err
     std::optional<std::vector<std::uint8_t>> bundle;
     int r = sd_bus_message_read(message, "s", &tavrixID);
     if (r >= 0) {
-        r = platform::readOptionalBytes(message, bundle);
+        r = bus::readOptionalBytes(message, bundle);
     }
     if (r < 0) {
         return sd_bus_error_set(error, SD_BUS_ERROR_INVALID_ARGS,
@@ -87,13 +87,13 @@ int handleIsTavrixBundleSupported(sd_bus_message* message, void* userdata, sd_bu
     return replyBoolean(message, answer);
 }
 
-platform::BusMessagePtr valueReply(sd_bus_message* call, const std::optional<plist::Value>& value) {
+bus::BusMessagePtr valueReply(sd_bus_message* call, const std::optional<plist::Value>& value) {
     sd_bus_message* raw = nullptr;
     if (sd_bus_message_new_method_return(call, &raw) < 0) {
         return nullptr;
     }
-    platform::BusMessagePtr reply(raw);
-    return platform::appendOptionalValue(reply.get(), value) < 0 ? nullptr : std::move(reply);
+    bus::BusMessagePtr reply(raw);
+    return bus::appendOptionalValue(reply.get(), value) < 0 ? nullptr : std::move(reply);
 }
 
 int handleCopyTavrixValue(sd_bus_message* message, void* userdata, sd_bus_error* error) {
@@ -103,7 +103,7 @@ int handleCopyTavrixValue(sd_bus_message* message, void* userdata, sd_bus_error*
     if (r < 0) {
         return invalidArguments(error, r);
     }
-    platform::BusMessagePtr replyMessage;
+    bus::BusMessagePtr replyMessage;
     containExceptions("Copy Tavrix Value", [&] {
         auto answer = answerOf(
             "Copy Tavrix Value", server, message, std::optional<plist::Value>(),
@@ -158,9 +158,9 @@ int handleGetStatus(sd_bus_message* message, void* userdata, sd_bus_error*) {
         });
     sd_bus_message* raw = nullptr;
     int r = sd_bus_message_new_method_return(message, &raw);
-    platform::BusMessagePtr replyMessage(raw);
+    bus::BusMessagePtr replyMessage(raw);
     if (r >= 0) {
-        r = platform::appendDictionary(replyMessage.get(), status);
+        r = bus::appendDictionary(replyMessage.get(), status);
     }
     if (r < 0) {
         // A value the bus cannot carry (text that is not UTF-8 in a path): the empty view rather
@@ -169,7 +169,7 @@ int handleGetStatus(sd_bus_message* message, void* userdata, sd_bus_error*) {
         r = sd_bus_message_new_method_return(message, &raw);
         replyMessage.reset(raw);
         if (r >= 0) {
-            r = platform::appendDictionary(replyMessage.get(), {});
+            r = bus::appendDictionary(replyMessage.get(), {});
         }
         if (r < 0) {
             return r;

@@ -89,10 +89,10 @@ void UpdateCheckScheduler::scheduleJob() {
     }
     const double start = nextUpdate->secondsSinceReferenceDate;
     plist::Dictionary criteria{
-        {std::string(platform::kJobWindowStartDate), start},
-        {std::string(platform::kJobWindowEndDate), start + kUpdateCheckWindowSeconds},
-        {std::string(platform::kJobPowerOptimizationLevel), plist::Integer(1)},
-        {std::string(platform::kJobAllowedDuringVoiceCall), true},
+        {std::string(bus::kJobWindowStartDate), start},
+        {std::string(bus::kJobWindowEndDate), start + kUpdateCheckWindowSeconds},
+        {std::string(bus::kJobPowerOptimizationLevel), plist::Integer(1)},
+        {std::string(bus::kJobAllowedDuringVoiceCall), true},
     };
     // Every supported launch comes here: a registration that is already as asked is left alone,
     // rather than written to the job store (with its fsync) again.
@@ -140,7 +140,7 @@ std::optional<double> UpdateCheckScheduler::nextCheckTime() const {
     if (criteria == nullptr) {
         return std::nullopt;
     }
-    auto start = criteria->find(std::string(platform::kJobWindowStartDate));
+    auto start = criteria->find(std::string(bus::kJobWindowStartDate));
     if (start == criteria->end()) {
         return std::nullopt;
     }

@@ -54,7 +54,7 @@ class UpdateCheckScheduler {
     UpdateCheckScheduler();
 
     SerialQueue _schedulerQueue;
-    std::optional<platform::BackgroundJobScheduler> _jobScheduler;
+    std::optional<bus::BackgroundJobScheduler> _jobScheduler;
     // Re-arming runs on the main thread, the scheduler queue and the download thread; this keeps
     // "NextUpdate" and the registered job in step.
     std::recursive_mutex _rearmLock;

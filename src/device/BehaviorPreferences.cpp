@@ -6,13 +6,13 @@
 namespace tavrix {
 
 std::optional<plist::Value> copyBehaviorPreference(std::string_view key) {
-    return platform::PreferencesStore::shared().copyValue(key, kBehaviorPreferencesDomain,
-                                                          platform::MobileUser::name());
+    return device::PreferencesStore::shared().copyValue(key, kBehaviorPreferencesDomain,
+                                                        device::MobileUser::name());
 }
 
 bool setBehaviorPreference(std::string_view key, const std::optional<plist::Value>& value) {
-    auto& store = platform::PreferencesStore::shared();
-    const std::string& user = platform::MobileUser::name();
+    auto& store = device::PreferencesStore::shared();
+    const std::string& user = device::MobileUser::name();
     store.setValue(key, value, kBehaviorPreferencesDomain, user);
     return store.synchronize(kBehaviorPreferencesDomain, user);
 }

@@ -2,7 +2,7 @@
 
 #include "device/DeviceInfoService.h"
 
-namespace tavrix::platform {
+namespace tavrix::device {
 namespace {
 
 const bool* booleanAnswer(const plist::Dictionary& answers, std::string_view key) {
@@ -35,7 +35,7 @@ BuildCapabilities::Facts BuildCapabilities::decide(const plist::Dictionary& answ
 
 const BuildCapabilities::Facts& BuildCapabilities::facts() {
     static const Facts kFacts = decide(
-        platform::copyDeviceAnswers({"InternalBuild", "CarrierInstallCapability", "ReleaseType"}));
+        device::copyDeviceAnswers({"InternalBuild", "CarrierInstallCapability", "ReleaseType"}));
     return kFacts;
 }
 
@@ -51,4 +51,4 @@ bool BuildCapabilities::isVendorBuild() {
     return facts().isVendorBuild;
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::device

@@ -4,7 +4,7 @@
 
 #include "plist/Value.h"
 
-namespace tavrix::platform {
+namespace tavrix::device {
 
 class BuildCapabilities {
   public:
@@ -28,4 +28,4 @@ class BuildCapabilities {
     static const Facts& facts();
 };
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::device

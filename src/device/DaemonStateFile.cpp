@@ -4,7 +4,7 @@
 #include "io/AtomicFile.h"
 #include "util/FileSystemUtilities.h"
 
-namespace tavrix::platform {
+namespace tavrix::device {
 namespace {
 
 constexpr mode_t kStateDirectoryMode = 0755;
@@ -28,7 +28,7 @@ int writeDaemonStateFile(std::string_view fileName, const plist::Value& value, p
         return error;
     }
     return io::replaceFileAtomically(daemonStateFilePath(fileName), plist::serialize(value, format),
-                                 mode);
+                                     mode);
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::device

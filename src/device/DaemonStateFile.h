@@ -9,7 +9,7 @@
 
 #include "plist/PropertyListFormat.h"
 
-namespace tavrix::platform {
+namespace tavrix::device {
 
 // "<root>/var/lib/tavrixservicesd/<fileName>".
 std::string daemonStateFilePath(std::string_view fileName);
@@ -23,4 +23,4 @@ plist::Dictionary readDaemonStateFile(std::string_view fileName);
 int writeDaemonStateFile(std::string_view fileName, const plist::Value& value, plist::Format format,
                          mode_t mode);
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::device

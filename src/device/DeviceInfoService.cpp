@@ -8,7 +8,7 @@
 #include "util/Log.h"
 #include "util/PropertyListFile.h"
 
-namespace tavrix::platform {
+namespace tavrix::device {
 namespace {
 
 plist::CachedPropertyListFile& tableFile() {
@@ -81,4 +81,4 @@ plist::Dictionary copyDeviceAnswers(const std::vector<std::string>& keys) {
     return answers;
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::device

@@ -12,7 +12,7 @@
 
 #include "plist/Value.h"
 
-namespace tavrix::platform {
+namespace tavrix::device {
 
 // The answer for key, of whatever type the table holds, or nothing.
 std::optional<plist::Value> copyDeviceAnswer(std::string_view key);
@@ -26,4 +26,4 @@ bool deviceBooleanAnswer(std::string_view key);
 // Several answers at once: a dictionary holding an entry for every key that has an answer.
 plist::Dictionary copyDeviceAnswers(const std::vector<std::string>& keys);
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::device

@@ -3,11 +3,11 @@
 #include "device/PlatformRoot.h"
 #include "device/UserDatabase.h"
 
-namespace tavrix::platform {
+namespace tavrix::device {
 
 MobileUser::Facts MobileUser::lookUpUnder(std::string_view root) {
     Facts facts;
-    if (auto record = platform::lookupUserUnder(root, name())) {
+    if (auto record = device::lookupUserUnder(root, name())) {
         facts.uid = record->uid;
         facts.gid = record->gid;
         if (!record->homeDirectory.empty()) {
@@ -23,7 +23,7 @@ const std::string& MobileUser::name() {
 }
 
 const MobileUser::Facts& MobileUser::facts() {
-    static const Facts kFacts = lookUpUnder(platform::platformRoot());
+    static const Facts kFacts = lookUpUnder(device::platformRoot());
     return kFacts;
 }
 
@@ -40,4 +40,4 @@ gid_t MobileUser::gid() {
     return facts().gid;
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::device

@@ -9,7 +9,7 @@
 #include <string>
 #include <string_view>
 
-namespace tavrix::platform {
+namespace tavrix::device {
 
 class MobileUser {
   public:
@@ -35,4 +35,4 @@ class MobileUser {
     static const Facts& facts();
 };
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::device

@@ -2,7 +2,7 @@
 
 #include <cstdlib>
 
-namespace tavrix::platform {
+namespace tavrix::device {
 
 const std::string& platformRoot() {
     static const std::string root = [] {
@@ -32,4 +32,4 @@ std::string resolvePath(std::string_view absolutePath) {
     return resolvePathUnder(platformRoot(), absolutePath);
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::device

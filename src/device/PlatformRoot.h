@@ -6,7 +6,7 @@
 #include <string>
 #include <string_view>
 
-namespace tavrix::platform {
+namespace tavrix::device {
 
 // The daemon's own durable state (scheduled jobs, the record of an install under way).
 inline constexpr std::string_view kDaemonStateDirectory = "/var/lib/tavrixservicesd";
@@ -20,4 +20,4 @@ std::string resolvePath(std::string_view absolutePath);
 // absolutePath under the given root (the same rule, for a root other than the process's own).
 std::string resolvePathUnder(std::string_view root, std::string_view absolutePath);
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::device

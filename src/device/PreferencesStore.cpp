@@ -20,7 +20,7 @@
 #include "util/Log.h"
 #include "util/PropertyListFile.h"
 
-namespace tavrix::platform {
+namespace tavrix::device {
 namespace {
 
 const plist::Refusal kNotADictionary{0, "it is not a dictionary"};
@@ -329,4 +329,4 @@ void PreferencesStore::logDamage(Domain& domain, const plist::Refusal& refusal) 
     logPropertyListRefusal(domain.path, refusal, "reading it as empty");
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::device

@@ -19,7 +19,7 @@
 #include "plist/PropertyListFormat.h"
 #include "plist/Value.h"
 
-namespace tavrix::platform {
+namespace tavrix::device {
 
 class PreferencesStore {
   public:
@@ -59,4 +59,4 @@ class PreferencesStore {
     std::map<std::string, UserDomains, std::less<>> users_;
 };
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::device

@@ -13,7 +13,7 @@
 #include "io/FileIO.h"
 #include "io/UniqueFd.h"
 
-namespace tavrix::platform {
+namespace tavrix::device {
 namespace {
 
 // Release files and sysfs attributes are small; anything larger is not what we are looking for.
@@ -256,4 +256,4 @@ std::optional<plist::Value> runningSystemAnswer(std::string_view root, std::stri
     return std::nullopt;
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::device

@@ -11,7 +11,7 @@
 
 #include "plist/Value.h"
 
-namespace tavrix::platform {
+namespace tavrix::device {
 
 // The assignments of an os-release file ("KEY=value", the value optionally in single or double
 // quotes). Comments, blank lines and malformed lines are skipped.
@@ -21,4 +21,4 @@ std::map<std::string, std::string, std::less<>> parseOsRelease(std::string_view 
 // not know it. Booleans are answered as booleans, everything else as strings.
 std::optional<plist::Value> runningSystemAnswer(std::string_view root, std::string_view key);
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::device

@@ -75,46 +75,45 @@ bool TXUtility::isDaemon() {
 }
 
 bool TXUtility::isWiFiCapable() {
-    return platform::deviceBooleanAnswer("wi-fi");
+    return device::deviceBooleanAnswer("wi-fi");
 }
 
 bool TXUtility::hasCellularRadio() {
-    return platform::deviceBooleanAnswer("contains-cellular-radio");
+    return device::deviceBooleanAnswer("contains-cellular-radio");
 }
 
 const std::optional<std::string>& TXUtility::serialNumber() {
-    static const std::optional<std::string> fact = platform::copyDeviceStringAnswer("SerialNumber");
+    static const std::optional<std::string> fact = device::copyDeviceStringAnswer("SerialNumber");
     return fact;
 }
 
 const std::optional<std::string>& TXUtility::currentProductCategory() {
-    static const std::optional<std::string> fact = platform::copyDeviceStringAnswer("DeviceClass");
+    static const std::optional<std::string> fact = device::copyDeviceStringAnswer("DeviceClass");
     return fact;
 }
 
 const std::optional<std::string>& TXUtility::currentProductType() {
-    static const std::optional<std::string> fact = platform::copyDeviceStringAnswer("ProductType");
+    static const std::optional<std::string> fact = device::copyDeviceStringAnswer("ProductType");
     return fact;
 }
 
 const std::optional<std::string>& TXUtility::currentProductVersion() {
-    static const std::optional<std::string> fact =
-        platform::copyDeviceStringAnswer("ProductVersion");
+    static const std::optional<std::string> fact = device::copyDeviceStringAnswer("ProductVersion");
     return fact;
 }
 
 const std::optional<std::string>& TXUtility::currentProductBuild() {
-    static const std::optional<std::string> fact = platform::copyDeviceStringAnswer("BuildVersion");
+    static const std::optional<std::string> fact = device::copyDeviceStringAnswer("BuildVersion");
     return fact;
 }
 
 const std::optional<std::string>& TXUtility::currentReleaseType() {
-    static const std::optional<std::string> fact = platform::copyDeviceStringAnswer("ReleaseType");
+    static const std::optional<std::string> fact = device::copyDeviceStringAnswer("ReleaseType");
     return fact;
 }
 
 const std::optional<std::string>& TXUtility::currentHardwareModel() {
-    static const std::optional<std::string> fact = platform::copyDeviceStringAnswer("HWModelStr");
+    static const std::optional<std::string> fact = device::copyDeviceStringAnswer("HWModelStr");
     return fact;
 }
 

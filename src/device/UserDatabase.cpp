@@ -9,7 +9,7 @@
 
 #include "device/PlatformRoot.h"
 
-namespace tavrix::platform {
+namespace tavrix::device {
 namespace {
 
 struct FileCloser {
@@ -83,4 +83,4 @@ std::optional<UserRecord> lookupUser(std::string_view name) {
     return lookupUserUnder(platformRoot(), name);
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::device

@@ -8,7 +8,7 @@
 #include <string>
 #include <string_view>
 
-namespace tavrix::platform {
+namespace tavrix::device {
 
 struct UserRecord {
     std::string name;
@@ -24,4 +24,4 @@ std::optional<UserRecord> lookupUser(std::string_view name);
 // The entry for name in the user database of the given root ("" or "/" for the system's own).
 std::optional<UserRecord> lookupUserUnder(std::string_view root, std::string_view name);
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::device

@@ -6,7 +6,7 @@
 
 #include "http/CurlLibrary.h"
 
-namespace tavrix::platform {
+namespace tavrix::http {
 
 struct CurlEasyCleanup {
     void operator()(CURL* handle) const { loadCurl()->easy_cleanup(handle); }
@@ -27,4 +27,4 @@ using CurlHeaderList = std::unique_ptr<curl_slist, CurlSlistFree>;
 // A string that libcurl allocated.
 using CurlString = std::unique_ptr<char, CurlFree>;
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::http

@@ -5,7 +5,7 @@
 #include "util/SharedLibrary.h"
 #include "util/SystemLog.h"
 
-namespace tavrix::platform {
+namespace tavrix::http {
 namespace {
 
 constexpr const char* kLibraryName = "libcurl.so.4";
@@ -62,4 +62,4 @@ const CurlLibrary* loadCurl(std::string* error) {
     return &loaded.functions;
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::http

@@ -8,7 +8,7 @@
 
 #include <string>
 
-namespace tavrix::platform {
+namespace tavrix::http {
 
 struct CurlLibrary {
     decltype(&::curl_easy_init) easy_init = nullptr;
@@ -30,4 +30,4 @@ struct CurlLibrary {
 // be, with error saying why. The failure is logged once; each caller fails its own operation.
 const CurlLibrary* loadCurl(std::string* error = nullptr);
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::http

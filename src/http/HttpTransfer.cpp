@@ -4,7 +4,7 @@
 
 #include "http/CurlHandles.h"
 
-namespace tavrix::platform {
+namespace tavrix::http {
 namespace {
 
 constexpr long kMaxRedirects = 5;
@@ -130,4 +130,4 @@ std::optional<std::string> resolveHttpURL(const std::string& base, const std::st
     return std::string(resolved.get());
 }
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::http

@@ -9,7 +9,7 @@
 #include <string>
 #include <string_view>
 
-namespace tavrix::platform {
+namespace tavrix::http {
 
 // Receives the body piece by piece. Answering false stops the transfer; refusal then says why.
 using HttpBodyReceiver = std::function<bool(std::string_view bytes, std::string& refusal)>;
@@ -39,4 +39,4 @@ std::optional<std::string> fetchHttpBody(const std::string& url, std::size_t max
 // result is not a valid http or https URL.
 std::optional<std::string> resolveHttpURL(const std::string& base, const std::string& reference);
 
-}  // namespace tavrix::platform
+}  // namespace tavrix::http

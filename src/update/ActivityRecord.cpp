@@ -21,7 +21,7 @@ std::mutex& recordLock() {
 }
 
 plist::Dictionary readRecordLocked() {
-    return platform::readDaemonStateFile(kRecordFileName);
+    return device::readDaemonStateFile(kRecordFileName);
 }
 
 void replaceEntry(const char* key, plist::Dictionary entry) {
@@ -30,8 +30,8 @@ void replaceEntry(const char* key, plist::Dictionary entry) {
     plist::Dictionary record = readRecordLocked();
     record.insert_or_assign(key, plist::Value(std::move(entry)));
     // Binary keeps the fraction of a second, so two checks within a second stay apart.
-    if (int error = platform::writeDaemonStateFile(kRecordFileName, plist::Value(std::move(record)),
-                                                   plist::Format::Binary, kRecordMode);
+    if (int error = device::writeDaemonStateFile(kRecordFileName, plist::Value(std::move(record)),
+                                                 plist::Format::Binary, kRecordMode);
         error != 0) {
         logCFormat("Could not record the %s in %s: %s\n", key, activityRecordPath().c_str(),
                    std::strerror(error));
@@ -41,7 +41,7 @@ void replaceEntry(const char* key, plist::Dictionary entry) {
 }  // namespace
 
 std::string activityRecordPath() {
-    return platform::daemonStateFilePath(kRecordFileName);
+    return device::daemonStateFilePath(kRecordFileName);
 }
 
 void recordUpdateCheck(const std::string& outcome, const std::string& reason) {

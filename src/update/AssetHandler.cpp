@@ -78,25 +78,25 @@ bool fitsThisDevice(const plist::Dictionary& attributes, const plist::Value& pro
     return true;
 }
 
-std::string assetVersionText(const platform::Asset& asset) {
+std::string assetVersionText(const catalog::Asset& asset) {
     auto version = asset.attributes().find(kAssetAttributeVersion);
     return version != asset.attributes().end() ? versionText(version->second) : "(unknown)";
 }
 
 // Why a check found nothing to download, in the words the status view shows.
-void recordQueryWithoutCandidate(const platform::QueryResult& query) {
+void recordQueryWithoutCandidate(const catalog::QueryResult& query) {
     switch (query.outcome) {
-        case platform::QueryOutcome::NoCatalogConfigured:
+        case catalog::QueryOutcome::NoCatalogConfigured:
             recordUpdateCheck(kCheckNoCatalog, "no catalog configured");
             return;
-        case platform::QueryOutcome::FetchFailed:
+        case catalog::QueryOutcome::FetchFailed:
             recordUpdateCheck(kCheckFetchFailed, "catalog fetch failed: " + query.reason);
             return;
-        case platform::QueryOutcome::Refused:
+        case catalog::QueryOutcome::Refused:
             recordUpdateCheck(kCheckCatalogRefused, "catalog refused: " + query.reason);
             return;
-        case platform::QueryOutcome::Answered:
-        case platform::QueryOutcome::NotRun:
+        case catalog::QueryOutcome::Answered:
+        case catalog::QueryOutcome::NotRun:
             break;
     }
     std::optional<std::string> installed = BundleManager::sharedInstance().copyBundleVersion();
@@ -108,8 +108,8 @@ void recordQueryWithoutCandidate(const platform::QueryResult& query) {
 }  // namespace
 
 std::optional<std::vector<AssetHandler::AssetPtr>> AssetHandler::downloadAvailableAssets(
-    platform::QueryResult* result) {
-    platform::AssetQuery query(kAssetTypeTavrixBundles);
+    catalog::QueryResult* result) {
+    catalog::AssetQuery query(kAssetTypeTavrixBundles);
     query.setQueriesLocalInformationOnly(false);
     logCFormat("Issuing query\n");
     auto results = query.runQuery();
@@ -121,7 +121,7 @@ std::optional<std::vector<AssetHandler::AssetPtr>> AssetHandler::downloadAvailab
     return results;
 }
 
-AssetHandler::AssetPtr AssetHandler::findTheBestAsset(platform::QueryResult* result) {
+AssetHandler::AssetPtr AssetHandler::findTheBestAsset(catalog::QueryResult* result) {
     std::optional<std::string> installed = BundleManager::sharedInstance().copyBundleVersion();
     if (!installed) {
         logObjectFormat("No bundle version available, initializing with 0.0");
@@ -177,7 +177,7 @@ bool AssetHandler::downloadUpdateIfAvailable(EndCheck endCheck) {
     }
     auto running = std::make_shared<RunningCheck>(checkRunning);
 
-    platform::QueryResult query;
+    catalog::QueryResult query;
     AssetPtr asset = findTheBestAsset(&query);
     if (!asset) {
         logObjectFormat("Best candidate passed in is nil");
@@ -200,7 +200,7 @@ bool AssetHandler::downloadUpdateIfAvailable(EndCheck endCheck) {
 void AssetHandler::handleDownloadProgress(const AssetPtr& asset, const plist::Dictionary& progress,
                                           const std::shared_ptr<RunningCheck>& running,
                                           const EndCheck& endCheck) {
-    auto operation = progress.find(platform::kAssetProgressOperationKey);
+    auto operation = progress.find(catalog::kAssetProgressOperationKey);
     if (operation == progress.end()) {
         logObjectFormat("Operation is not available?");
         endCheck(kInstallRetryDelaySeconds);
@@ -208,17 +208,17 @@ void AssetHandler::handleDownloadProgress(const AssetPtr& asset, const plist::Di
     }
     logObjectFormat("Current operation: %@", &operation->second);
     const std::string* name = operation->second.asString();
-    if (name == nullptr || *name != platform::kAssetOperationCompleted) {
+    if (name == nullptr || *name != catalog::kAssetOperationCompleted) {
         // Every report but the last ends the check and re-arms it a day ahead; the last one
         // re-arms it again.
-        if (name != nullptr && *name == platform::kAssetOperationFailed) {
-            auto error = progress.find(platform::kAssetProgressErrorKey);
+        if (name != nullptr && *name == catalog::kAssetOperationFailed) {
+            auto error = progress.find(catalog::kAssetProgressErrorKey);
             const std::string* why = error != progress.end() ? error->second.asString() : nullptr;
             recordUpdateCheck(kCheckDownloadFailed,
                               "download failed: " + (why != nullptr ? *why : "no reason given"));
         }
         endCheck(kInstallRetryDelaySeconds);
-        if (name != nullptr && *name == platform::kAssetOperationFailed) {
+        if (name != nullptr && *name == catalog::kAssetOperationFailed) {
             running->finish();
         }
         return;
@@ -265,7 +265,7 @@ bool AssetHandler::installDownloadedBundle(const std::string& source) {
     std::lock_guard lock(bundles.operationLock());
     // The new bundle is copied while the old one still stands, so both must fit.
     const std::uint64_t needed = diskBytesOfTree(source);
-    const char* home = platform::MobileUser::homeDirectory();
+    const char* home = device::MobileUser::homeDirectory();
     if (home == nullptr || !TXUtility::hasEnoughDiskSpaceAt(home, needed)) {
         logCFormat("Not enough free space to install %s (%llu bytes), keeping the bundle\n",
                    source.c_str(), static_cast<unsigned long long>(needed));
@@ -334,7 +334,7 @@ void AssetHandler::resumeInterruptedInstall() {
         resumePendingInstall(*pending);
     }
     // Whatever else a killed process left in the cache is never installed now.
-    platform::AssetQuery(kAssetTypeTavrixBundles).removeAbandonedDownloads();
+    catalog::AssetQuery(kAssetTypeTavrixBundles).removeAbandonedDownloads();
 }
 
 void AssetHandler::resumePendingInstall(const PendingInstall& pendingInstall) {

@@ -29,16 +29,16 @@ class AssetHandler {
   public:
     AssetHandler() = delete;
 
-    using AssetPtr = std::shared_ptr<platform::Asset>;
+    using AssetPtr = std::shared_ptr<catalog::Asset>;
 
     // Every asset of the bundle type the catalog lists (asking its server), or nothing when the
     // query failed; result, when given, says how the query went.
     static std::optional<std::vector<AssetPtr>> downloadAvailableAssets(
-        platform::QueryResult* result = nullptr);
+        catalog::QueryResult* result = nullptr);
 
     // The asset with the highest version strictly above the installed bundle's that fits this
     // device's OS version and product type; the first of equal versions wins. Null when none.
-    static AssetPtr findTheBestAsset(platform::QueryResult* result = nullptr);
+    static AssetPtr findTheBestAsset(catalog::QueryResult* result = nullptr);
 
     // Starts downloading the best asset; its completion installs it as the user bundle and redoes
     // the bundle match. True when a download was started. One check at a time: while one runs

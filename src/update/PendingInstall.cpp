@@ -19,15 +19,15 @@ constexpr mode_t kMarkerMode = 0600;
 }  // namespace
 
 std::string pendingInstallMarkerPath() {
-    return platform::daemonStateFilePath(kMarkerFileName);
+    return device::daemonStateFilePath(kMarkerFileName);
 }
 
 bool writePendingInstall(const PendingInstall& install) {
     const std::string& assetDirectory = install.assetDirectory;
     const plist::Value record(plist::Dictionary{{kAssetDirectoryKey, plist::Value(assetDirectory)},
                                                 {kInstalledKey, plist::Value(install.installed)}});
-    if (int error = platform::writeDaemonStateFile(kMarkerFileName, record, plist::Format::Xml,
-                                                   kMarkerMode);
+    if (int error =
+            device::writeDaemonStateFile(kMarkerFileName, record, plist::Format::Xml, kMarkerMode);
         error != 0) {
         logCFormat("Could not record the install of %s: %s\n", assetDirectory.c_str(),
                    std::strerror(error));
@@ -37,7 +37,7 @@ bool writePendingInstall(const PendingInstall& install) {
 }
 
 std::optional<PendingInstall> readPendingInstall() {
-    const plist::Dictionary values = platform::readDaemonStateFile(kMarkerFileName);
+    const plist::Dictionary values = device::readDaemonStateFile(kMarkerFileName);
     auto directory = values.find(kAssetDirectoryKey);
     if (directory == values.end() || directory->second.asString() == nullptr) {
         return std::nullopt;

@@ -21,7 +21,7 @@
 
 namespace {
 
-using tavrix::platform::BusMessagePtr;
+using tavrix::bus::BusMessagePtr;
 
 // Messages need a started bus object, not a bus: one over a socket pair is enough, since nothing
 // is ever sent.
@@ -220,11 +220,11 @@ bool seal(sd_bus_message* message) {
 // A decoded value must survive the trip back; NaN is compared by its description.
 void checkRoundTrip(const tavrix::plist::Value& value) {
     BusMessagePtr again = newMessage();
-    if (tavrix::platform::appendValue(again.get(), value) < 0) {
+    if (tavrix::bus::appendValue(again.get(), value) < 0) {
         return;  // deeper than the encoding carries, or a string with a NUL
     }
     std::optional<tavrix::plist::Value> back;
-    if (!seal(again.get()) || tavrix::platform::readValue(again.get(), back) < 0 || !back ||
+    if (!seal(again.get()) || tavrix::bus::readValue(again.get(), back) < 0 || !back ||
         (*back != value && back->description() != value.description())) {
         std::abort();
     }
@@ -241,16 +241,16 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
         return 0;
     }
     std::optional<tavrix::plist::Value> value;
-    if (tavrix::platform::readValue(message.get(), value) >= 0 && value) {
+    if (tavrix::bus::readValue(message.get(), value) >= 0 && value) {
         checkRoundTrip(*value);
     }
     sd_bus_message_rewind(message.get(), 1);
     std::optional<tavrix::plist::Value> optional;
-    if (tavrix::platform::readOptionalValue(message.get(), optional) >= 0 && optional) {
+    if (tavrix::bus::readOptionalValue(message.get(), optional) >= 0 && optional) {
         checkRoundTrip(*optional);
     }
     sd_bus_message_rewind(message.get(), 1);
     std::optional<std::vector<std::uint8_t>> bytes;
-    (void)tavrix::platform::readOptionalBytes(message.get(), bytes);
+    (void)tavrix::bus::readOptionalBytes(message.get(), bytes);
     return 0;
 }

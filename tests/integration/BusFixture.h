@@ -17,8 +17,8 @@
 #include "BusWatcher.h"
 #include "DeviceRoot.h"
 #include "PrivateBus.h"
-#include "client/TavrixClient.h"
 #include "bus/BusHandles.h"
+#include "client/TavrixClient.h"
 
 namespace tavrix::integration {
 
@@ -41,7 +41,7 @@ class BusFixture : public ::testing::Test {
         return client::TavrixClient::connectToAddress(busAddress());
     }
     // A plain bus connection, for calls the client library would not make.
-    platform::BusPtr rawConnection() { return connectToBus(busAddress()); }
+    bus::BusPtr rawConnection() { return connectToBus(busAddress()); }
 
     bool waitForNameOwner(std::chrono::milliseconds timeout = 10s) {
         return watcher_->waitForNameOwner(timeout);

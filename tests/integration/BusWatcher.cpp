@@ -21,10 +21,10 @@ void check(int result, const char* what) {
 
 }  // namespace
 
-platform::BusPtr connectToBus(const std::string& address) {
+bus::BusPtr connectToBus(const std::string& address) {
     sd_bus* raw = nullptr;
     check(sd_bus_new(&raw), "sd_bus_new");
-    platform::BusPtr bus(raw);
+    bus::BusPtr bus(raw);
     check(sd_bus_set_address(bus.get(), address.c_str()), "sd_bus_set_address");
     check(sd_bus_set_bus_client(bus.get(), 1), "sd_bus_set_bus_client");
     check(sd_bus_start(bus.get()), "sd_bus_start");
@@ -40,12 +40,12 @@ BusWatcher::BusWatcher(const std::string& address) : bus_(connectToBus(address))
     postedSlot_.reset(slot);
 
     // Asked after subscribing, so that no change falls between the answer and the signals.
-    platform::BusError error;
+    bus::BusError error;
     sd_bus_message* reply = nullptr;
     if (sd_bus_call_method(bus_.get(), "org.freedesktop.DBus", "/org/freedesktop/DBus",
                            "org.freedesktop.DBus", "GetNameOwner", error.get(), &reply, "s",
                            kDaemonBusName) >= 0) {
-        platform::BusMessagePtr owned(reply);
+        bus::BusMessagePtr owned(reply);
         const char* owner = nullptr;
         if (sd_bus_message_read(reply, "s", &owner) >= 0 && owner != nullptr) {
             owner_ = owner;
@@ -79,14 +79,14 @@ bool BusWatcher::waitForNoNameOwner(std::chrono::milliseconds timeout) {
 }
 
 std::optional<pid_t> BusWatcher::ownerPid() {
-    platform::BusError error;
+    bus::BusError error;
     sd_bus_message* reply = nullptr;
     if (sd_bus_call_method(bus_.get(), "org.freedesktop.DBus", "/org/freedesktop/DBus",
                            "org.freedesktop.DBus", "GetConnectionUnixProcessID", error.get(),
                            &reply, "s", kDaemonBusName) < 0) {
         return std::nullopt;
     }
-    platform::BusMessagePtr owned(reply);
+    bus::BusMessagePtr owned(reply);
     std::uint32_t pid = 0;
     if (sd_bus_message_read(reply, "u", &pid) < 0) {
         return std::nullopt;

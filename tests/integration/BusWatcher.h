@@ -18,7 +18,7 @@ namespace tavrix::integration {
 inline constexpr const char* kDaemonBusName = "com.zandor.tavrixservicesd";
 
 // A new client connection to the bus at address; throws std::runtime_error when it fails.
-platform::BusPtr connectToBus(const std::string& address);
+bus::BusPtr connectToBus(const std::string& address);
 
 class BusWatcher {
   public:
@@ -44,9 +44,9 @@ class BusWatcher {
     static int onNameOwnerChanged(sd_bus_message* message, void* self, sd_bus_error*);
     static int onPosted(sd_bus_message* message, void* self, sd_bus_error*);
 
-    platform::BusPtr bus_;
-    platform::BusSlotPtr ownerSlot_;
-    platform::BusSlotPtr postedSlot_;
+    bus::BusPtr bus_;
+    bus::BusSlotPtr ownerSlot_;
+    bus::BusSlotPtr postedSlot_;
     std::string owner_;
     int releases_ = 0;
     std::map<std::string, int> notifications_;

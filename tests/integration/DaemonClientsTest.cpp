@@ -47,7 +47,7 @@ TEST_F(DaemonClientsTest, WrongSignatureGetsInvalidArgsAndTheDaemonCarriesOn) {
     };
     for (const BadCall& call : {BadCall{"SetTavrixID", "i"}, BadCall{"CopyTavrixValue", "i"},
                                 BadCall{"SetClientType", "s"}}) {
-        platform::BusError error;
+        bus::BusError error;
         sd_bus_message* reply = nullptr;
         int result = 0;
         if (std::string_view(call.signature) == "i") {
@@ -59,7 +59,7 @@ TEST_F(DaemonClientsTest, WrongSignatureGetsInvalidArgsAndTheDaemonCarriesOn) {
                 sd_bus_call_method(bus.get(), kDaemonBusName, kDaemonObjectPath, kDaemonInterface,
                                    call.member, error.get(), &reply, "s", "42");
         }
-        platform::BusMessagePtr owned(reply);
+        bus::BusMessagePtr owned(reply);
         EXPECT_LT(result, 0) << call.member;
         EXPECT_STREQ(error.name(), SD_BUS_ERROR_INVALID_ARGS) << call.member;
     }

@@ -24,10 +24,10 @@
 #include "LocalHttpServer.h"
 #include "TestSupport.h"
 #include "bus/BackgroundJobScheduler.h"
-#include "util/Clock.h"
-#include "plist/PropertyListFormat.h"
 #include "daemon/UpdateCheckScheduler.h"
 #include "io/UniqueFd.h"
+#include "plist/PropertyListFormat.h"
+#include "util/Clock.h"
 
 namespace tavrix::integration {
 namespace {
@@ -634,14 +634,13 @@ TEST_F(OverTheAirKeepAliveTest, ScheduledCheckKeepsTheDaemonUntilTheDownloadIsIn
     // The job's window came while the daemon was away: it fires when the daemon starts.
     const double due = now() - 60.0;
     setNextUpdate(due);
-    const std::string jobsFile = platform::BackgroundJobScheduler::jobsFilePathUnder(
+    const std::string jobsFile = bus::BackgroundJobScheduler::jobsFilePathUnder(
         device().root().string(), kUpdateCheckClientName);
     fs::create_directories(fs::path(jobsFile).parent_path());
-    plist::Dictionary job{
-        {std::string(platform::kJobWindowStartDate), due},
-        {std::string(platform::kJobWindowEndDate), due + kUpdateCheckWindowSeconds},
-        {std::string(platform::kJobPowerOptimizationLevel), plist::Integer(1)},
-        {std::string(platform::kJobAllowedDuringVoiceCall), true}};
+    plist::Dictionary job{{std::string(bus::kJobWindowStartDate), due},
+                          {std::string(bus::kJobWindowEndDate), due + kUpdateCheckWindowSeconds},
+                          {std::string(bus::kJobPowerOptimizationLevel), plist::Integer(1)},
+                          {std::string(bus::kJobAllowedDuringVoiceCall), true}};
     ASSERT_TRUE(
         plist::writeFile(jobsFile, plist::Value(plist::Dictionary{{kUpdateCheckJobName, job}})));
 

@@ -21,12 +21,12 @@
 #include "catalog/AssetCatalog.h"
 #include "catalog/AssetCatalogSettings.h"
 #include "catalog/CatalogCrypto.h"
-#include "util/Clock.h"
 #include "device/PlatformRoot.h"
-#include "util/SystemLog.h"
 #include "plist/PropertyListFormat.h"
+#include "util/Clock.h"
+#include "util/SystemLog.h"
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 namespace {
 
 namespace fs = std::filesystem;
@@ -110,9 +110,9 @@ class AssetCatalogTest : public testing::Test {
   protected:
     void SetUp() override {
         std::error_code ignored;
-        fs::remove_all(resolvePath("/etc/tavrix"), ignored);
-        fs::remove_all(resolvePath("/var/cache"), ignored);
-        fs::remove_all(resolvePath(std::string(kDaemonStateDirectory)), ignored);
+        fs::remove_all(device::resolvePath("/etc/tavrix"), ignored);
+        fs::remove_all(device::resolvePath("/var/cache"), ignored);
+        fs::remove_all(device::resolvePath(std::string(device::kDaemonStateDirectory)), ignored);
         ASSERT_EQ(tool({"keygen", work / "secret.key", work / "public.key"}), 0);
         ASSERT_EQ(tool({"keygen", work / "new.key", work / "new.pub"}), 0);
         publicKey = readText(work / "public.key");
@@ -160,7 +160,7 @@ class AssetCatalogTest : public testing::Test {
     }
 
     void writeSettingsValue(const plist::Value& settings) {
-        std::string path = resolvePath(kAssetCatalogSettingsPath);
+        std::string path = device::resolvePath(kAssetCatalogSettingsPath);
         fs::create_directories(fs::path(path).parent_path());
         ASSERT_TRUE(plist::writeFile(path, settings));
     }
@@ -168,7 +168,7 @@ class AssetCatalogTest : public testing::Test {
     std::string catalogURL() const { return server.url("/catalog/catalog.plist"); }
     std::string out(const std::string& relative) const { return work / ("out/" + relative); }
     std::string typeCache() const {
-        return resolvePath(kDefaultAssetCacheDirectory) + "/" + kAssetType;
+        return device::resolvePath(kDefaultAssetCacheDirectory) + "/" + kAssetType;
     }
 
     std::optional<Assets> query(bool localOnly = false) {
@@ -232,7 +232,7 @@ TEST_F(AssetCatalogTest, WithoutUsableSettingsQueriesAnswerNoAssetsAndSayWhyOnce
     std::vector<Case> cases{
         {"no file", [] {}, "there is no settings file"},
         {"damaged file",
-         [] { writeText(resolvePath(kAssetCatalogSettingsPath), "<plist><dict><key>"); },
+         [] { writeText(device::resolvePath(kAssetCatalogSettingsPath), "<plist><dict><key>"); },
          "not a property list"},
         {"other type only",
          [this] {
@@ -420,7 +420,7 @@ TEST_F(AssetCatalogTest, UnsignedCatalogsAreAnnouncedAndRolloutsAreStablePerDevi
         publishAt(std::to_string(percent).c_str());
         for (int device = 0; device < 12; ++device) {
             std::string serialNumber = "SN" + std::to_string(device);
-            writeText(resolvePath("/etc/tavrix/DeviceInfo.plist"),
+            writeText(device::resolvePath("/etc/tavrix/DeviceInfo.plist"),
                       plist::serialize(plist::Value(
                           plist::Dictionary{{"SerialNumber", plist::Value(serialNumber)}})));
             bool taking = query().value_or(Assets()).size() == 1;
@@ -432,7 +432,7 @@ TEST_F(AssetCatalogTest, UnsignedCatalogsAreAnnouncedAndRolloutsAreStablePerDevi
     std::size_t taking = std::count_if(at40.begin(), at40.end(), [](auto& e) { return e.second; });
     EXPECT_GT(taking, 0u);
     EXPECT_LT(taking, at40.size());
-    fs::remove(resolvePath("/etc/tavrix/DeviceInfo.plist"));
+    fs::remove(device::resolvePath("/etc/tavrix/DeviceInfo.plist"));
 }
 
 TEST_F(AssetCatalogTest, DamagedCatalogsAreRefusedAndMalformedEntriesSkipped) {
@@ -695,4 +695,4 @@ TEST_F(AssetCatalogTest, DownloadsOfOneAssetKeepTheirOwnDirectories) {
 }
 
 }  // namespace
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

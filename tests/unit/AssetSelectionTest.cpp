@@ -14,9 +14,9 @@
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
 #include "catalog/AssetCatalogSettings.h"
-#include "util/SystemLog.h"
 #include "plist/PropertyListFormat.h"
 #include "update/AssetHandler.h"
+#include "util/SystemLog.h"
 
 namespace tavrix {
 namespace {
@@ -61,12 +61,12 @@ class AssetSelectionTest : public testing::Test {
         ASSERT_TRUE(plist::writeFile(
             (root / "etc/tavrix/AssetCatalog.plist").string(),
             plist::Value(plist::Dictionary{
-                {platform::kSettingsAssetTypesKey,
+                {catalog::kSettingsAssetTypesKey,
                  plist::Dictionary{
                      {kAssetTypeTavrixBundles,
                       plist::Dictionary{
-                          {platform::kSettingsCatalogURLKey, server.url("/catalog/catalog.plist")},
-                          {platform::kSettingsAllowUnsignedKey, true}}}}}})));
+                          {catalog::kSettingsCatalogURLKey, server.url("/catalog/catalog.plist")},
+                          {catalog::kSettingsAllowUnsignedKey, true}}}}}})));
     }
 
     // Publishes the case's assets as a new catalog, each from a bundle directory of its own.

@@ -13,10 +13,10 @@
 
 #include "TestSupport.h"
 #include "bus/BackgroundJobScheduler.h"
-#include "util/SystemLog.h"
 #include "plist/PropertyListFormat.h"
+#include "util/SystemLog.h"
 
-namespace tavrix::platform {
+namespace tavrix::bus {
 namespace {
 
 using namespace std::chrono_literals;
@@ -187,4 +187,4 @@ TEST_F(BackgroundJobSchedulerTest, RelaunchFiresDueJobsDropsPassedOnesAndFollows
 }
 
 }  // namespace
-}  // namespace tavrix::platform
+}  // namespace tavrix::bus

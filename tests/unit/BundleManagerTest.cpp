@@ -13,8 +13,8 @@
 #include "bundle/BundleLocations.h"
 #include "bundle/BundleManager.h"
 #include "device/PlatformRoot.h"
-#include "util/SystemLog.h"
 #include "plist/PropertyListFormat.h"
+#include "util/SystemLog.h"
 
 namespace tavrix {
 namespace {
@@ -35,7 +35,7 @@ class BundleDevice : public ::testing::Test {
     static std::string root() { return test::unitTestRoot().string(); }
     static std::string home() { return root() + "/var/mobile"; }
     static std::string systemBundle() {
-        return platform::resolvePath("/System/Library/TavrixBundles/Tablet/Default.bundle");
+        return device::resolvePath("/System/Library/TavrixBundles/Tablet/Default.bundle");
     }
     static std::string userBundle() { return home() + "/Library/TavrixBundles/Default.bundle"; }
     static std::string bundleLink() { return home() + "/Library/Tavrix.bundle"; }
@@ -144,8 +144,7 @@ TEST_F(BundleLocationsTest, FindBundleTakesTheNewerAndTheUserOneOnATie) {
 TEST_F(BundleLocationsTest, WithoutAHomeNothingIsLinkedOrInstalledAnywhere) {
     // No "mobile" user and no device table: the user location and both link paths are empty.
     test::writeText(root() + "/etc/passwd", "root:x:0:0:root:/root:/bin/sh\n");
-    const std::string system =
-        platform::resolvePath("/System/Library/TavrixBundles//Default.bundle");
+    const std::string system = device::resolvePath("/System/Library/TavrixBundles//Default.bundle");
     writeBundle(system, Value("5"));
 
     BundleManager& manager = BundleManager::sharedInstance();

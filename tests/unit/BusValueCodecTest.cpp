@@ -10,7 +10,7 @@
 #include "bus/BusHandles.h"
 #include "bus/BusValueCodec.h"
 
-namespace tavrix::platform {
+namespace tavrix::bus {
 namespace {
 
 using plist::Array;
@@ -291,4 +291,4 @@ TEST_F(BusValueCodec, NestingStopsAtTheDeepestValueTheBusCarries) {
 }
 
 }  // namespace
-}  // namespace tavrix::platform
+}  // namespace tavrix::bus

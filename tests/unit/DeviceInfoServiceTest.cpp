@@ -6,10 +6,10 @@
 #include "UnitTestRoot.h"
 #include "device/DeviceInfoService.h"
 #include "device/RunningSystemFacts.h"
-#include "util/SystemLog.h"
 #include "plist/PropertyListFormat.h"
+#include "util/SystemLog.h"
 
-namespace tavrix::platform {
+namespace tavrix::device {
 namespace {
 
 using plist::Value;
@@ -169,4 +169,4 @@ TEST(DeviceInfoRunningSystem, ReadsDmiAndModemClassWithoutDeviceTree) {
 }
 
 }  // namespace
-}  // namespace tavrix::platform
+}  // namespace tavrix::device

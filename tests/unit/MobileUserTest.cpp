@@ -7,7 +7,7 @@
 #include "device/MobileUser.h"
 #include "plist/PropertyListFormat.h"
 
-namespace tavrix::platform {
+namespace tavrix::device {
 namespace {
 
 TEST(MobileUser, UnknownUserLeavesIdsZeroAndNoHome) {
@@ -99,4 +99,4 @@ TEST(BuildCapabilities, AccessorsReadTheDeviceTableOnce) {
 }
 
 }  // namespace
-}  // namespace tavrix::platform
+}  // namespace tavrix::device

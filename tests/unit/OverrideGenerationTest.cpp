@@ -13,8 +13,8 @@
 #include "bundle/BundleLinks.h"
 #include "bundle/OverrideGeneration.h"
 #include "device/PlatformRoot.h"
-#include "util/SystemLog.h"
 #include "plist/PropertyListFormat.h"
+#include "util/SystemLog.h"
 
 namespace tavrix {
 namespace {
@@ -30,14 +30,14 @@ class OverrideGenerationTest : public testing::Test {
   protected:
     void TearDown() override {
         std::error_code ignored;
-        fs::remove_all(platform::resolvePath("/System"), ignored);
-        fs::remove_all(platform::resolvePath("/etc/tavrix"), ignored);
+        fs::remove_all(device::resolvePath("/System"), ignored);
+        fs::remove_all(device::resolvePath("/etc/tavrix"), ignored);
         fs::remove_all(home() + "/Library", ignored);
     }
 
     static std::string home() { return test::unitTestRoot().string() + "/var/mobile"; }
     static std::string bundle() {
-        return platform::resolvePath("/System/Library/TavrixBundles/Phone/Default.bundle");
+        return device::resolvePath("/System/Library/TavrixBundles/Phone/Default.bundle");
     }
     static std::string baseFile() { return bundle() + "/behavior.plist"; }
     static std::string overlayFile(const std::string& name) {
@@ -63,7 +63,7 @@ class OverrideGenerationTest : public testing::Test {
         if (model) {
             table.emplace("HWModelStr", *model);
         }
-        std::string path = platform::resolvePath("/etc/tavrix/DeviceInfo.plist");
+        std::string path = device::resolvePath("/etc/tavrix/DeviceInfo.plist");
         fs::create_directories(fs::path(path).parent_path());
         ASSERT_TRUE(plist::writeFile(path, Value(table)));
     }

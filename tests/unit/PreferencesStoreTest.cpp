@@ -13,14 +13,14 @@
 #include "UnitTestRoot.h"
 #include "device/BehaviorPreferences.h"
 #include "device/PreferencesStore.h"
-#include "util/SystemLog.h"
 #include "plist/PropertyListFormat.h"
+#include "util/SystemLog.h"
 
 namespace tavrix {
 namespace {
 
 namespace fs = std::filesystem;
-using platform::PreferencesStore;
+using device::PreferencesStore;
 using plist::Value;
 
 constexpr const char* kUser = "mobile";

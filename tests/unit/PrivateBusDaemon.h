@@ -25,12 +25,12 @@ class PrivateBusDaemon {
     const std::string& address() const { return process_->address(); }
 
     // A new client connection to this bus, its unique name already assigned.
-    platform::BusPtr connect() const {
+    bus::BusPtr connect() const {
         sd_bus* raw = nullptr;
         if (sd_bus_new(&raw) < 0) {
             throw std::runtime_error("sd_bus_new failed");
         }
-        platform::BusPtr bus(raw);
+        bus::BusPtr bus(raw);
         const char* name = nullptr;
         if (sd_bus_set_address(bus.get(), address().c_str()) < 0 ||
             sd_bus_set_bus_client(bus.get(), 1) < 0 || sd_bus_start(bus.get()) < 0 ||

@@ -5,7 +5,7 @@
 #include "catalog/Sha256.h"
 #include "util/SharedLibrary.h"
 
-namespace tavrix::platform {
+namespace tavrix::catalog {
 namespace {
 
 // The digest is libcrypto's, loaded on first use: known vectors, fed in pieces that cross its
@@ -38,4 +38,4 @@ TEST(SharedLibrary, MissingLibraryOrSymbolSaysWhich) {
 }
 
 }  // namespace
-}  // namespace tavrix::platform
+}  // namespace tavrix::catalog

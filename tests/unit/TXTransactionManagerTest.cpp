@@ -5,8 +5,8 @@
 
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
-#include "bus/TXTransactionManager.h"
 #include "bus/ServiceManager.h"
+#include "bus/TXTransactionManager.h"
 #include "util/SystemLog.h"
 
 namespace tavrix {
@@ -22,7 +22,7 @@ class TXTransactionManagerTest : public testing::Test {
     }
 
     std::string flag() const { return test::readText(runtime_ + "/keep-alive"); }
-    platform::ServiceManager& serviceManager() { return platform::ServiceManager::shared(); }
+    bus::ServiceManager& serviceManager() { return bus::ServiceManager::shared(); }
 
     std::string runtime_;
     CapturingLogSink log_;

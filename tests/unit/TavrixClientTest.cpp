@@ -10,15 +10,15 @@
 #include <vector>
 
 #include "PrivateBusDaemon.h"
-#include "client/TavrixClient.h"
 #include "bus/BusValueCodec.h"
+#include "client/TavrixClient.h"
 
 namespace tavrix::client {
 namespace {
 
 using namespace std::chrono_literals;
-using platform::BusMessagePtr;
-using platform::BusPtr;
+using bus::BusMessagePtr;
+using bus::BusPtr;
 using plist::Value;
 using testing::HasSubstr;
 
@@ -82,7 +82,7 @@ class StubService {
             const char* id = nullptr;
             std::optional<std::vector<std::uint8_t>> bundle;
             sd_bus_message_read_basic(call, 's', &id);
-            int r = platform::readOptionalBytes(call, bundle);
+            int r = bus::readOptionalBytes(call, bundle);
             sd_bus_reply_method_return(call, "b", r >= 0 && bundle.has_value());
         } else if (member == "IsTavrixBundleSupported") {
             sd_bus_reply_method_errorf(call, SD_BUS_ERROR_ACCESS_DENIED, "Not for you");
@@ -94,9 +94,9 @@ class StubService {
             if (std::string(key) == "two values") {
                 sd_bus_message_append(reply.get(), "av", 2, "s", "a", "s", "b");
             } else if (std::string(key) == "missing") {
-                platform::appendOptionalValue(reply.get(), std::nullopt);
+                bus::appendOptionalValue(reply.get(), std::nullopt);
             } else {
-                platform::appendOptionalValue(reply.get(), sampleValue());
+                bus::appendOptionalValue(reply.get(), sampleValue());
             }
             sd_bus_send(nullptr, reply.get(), nullptr);
         } else if (member == "CheckForTavrixBundleUpdate") {

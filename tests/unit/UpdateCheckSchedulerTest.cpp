@@ -13,12 +13,12 @@
 
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
-#include "device/BehaviorPreferences.h"
 #include "bus/TXTransactionManager.h"
+#include "daemon/UpdateCheckScheduler.h"
+#include "device/BehaviorPreferences.h"
+#include "plist/PropertyListFormat.h"
 #include "util/Clock.h"
 #include "util/SystemLog.h"
-#include "plist/PropertyListFormat.h"
-#include "daemon/UpdateCheckScheduler.h"
 
 namespace tavrix {
 namespace {
@@ -81,7 +81,7 @@ class UpdateCheckSchedulerTest : public testing::Test {
     }
     static plist::Dictionary registeredJobs() {
         auto stored =
-            plist::readFile(platform::BackgroundJobScheduler::jobsFilePath(kUpdateCheckClientName));
+            plist::readFile(bus::BackgroundJobScheduler::jobsFilePath(kUpdateCheckClientName));
         return stored && stored->isDictionary() ? *stored->asDictionary() : plist::Dictionary{};
     }
     // The one registered job is the update check, with a one-hour window at "NextUpdate", and
@@ -98,10 +98,10 @@ class UpdateCheckSchedulerTest : public testing::Test {
             const plist::Value* value = job.find(key);
             return value != nullptr ? std::optional<plist::Value>(*value) : std::nullopt;
         };
-        EXPECT_EQ(criterion(platform::kJobWindowStartDate), plist::Value(*next));
-        EXPECT_EQ(criterion(platform::kJobWindowEndDate), plist::Value(*next + 3600.0));
-        EXPECT_EQ(criterion(platform::kJobPowerOptimizationLevel), plist::Value(plist::Integer(1)));
-        EXPECT_EQ(criterion(platform::kJobAllowedDuringVoiceCall), plist::Value(true));
+        EXPECT_EQ(criterion(bus::kJobWindowStartDate), plist::Value(*next));
+        EXPECT_EQ(criterion(bus::kJobWindowEndDate), plist::Value(*next + 3600.0));
+        EXPECT_EQ(criterion(bus::kJobPowerOptimizationLevel), plist::Value(plist::Integer(1)));
+        EXPECT_EQ(criterion(bus::kJobAllowedDuringVoiceCall), plist::Value(true));
     }
 
     std::string runtime_;

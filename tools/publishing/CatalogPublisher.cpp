@@ -11,13 +11,13 @@
 #include <filesystem>
 #include <system_error>
 
-#include "publishing/BundleCheck.h"
-#include "payload/Archive.h"
 #include "catalog/AssetCatalogFormat.h"
-#include "io/AtomicFile.h"
 #include "catalog/CatalogTrust.h"
-#include "plist/PropertyListFormat.h"
+#include "io/AtomicFile.h"
 #include "io/UniqueFd.h"
+#include "payload/Archive.h"
+#include "plist/PropertyListFormat.h"
+#include "publishing/BundleCheck.h"
 
 namespace tavrix::tools {
 namespace {
@@ -166,25 +166,25 @@ std::optional<plist::Value> publishBundle(const PublishRequest& request,
     }
     std::error_code code;
     std::uintmax_t size = fs::file_size(archivePath, code);
-    std::optional<std::string> digest = platform::sha256HexOfFile(archivePath);
+    std::optional<std::string> digest = catalog::sha256HexOfFile(archivePath);
     if (code || !digest) {
         error = "cannot read back " + archivePath;
         return std::nullopt;
     }
-    if (size > platform::kMaxArchiveBytes) {
+    if (size > catalog::kMaxArchiveBytes) {
         error = archivePath + " is larger than devices accept";
         return std::nullopt;
     }
     std::printf("packed %s: %zu files, %ju bytes, Version %s\n", relativeURL.c_str(), files->size(),
                 size, version->c_str());
     plist::Dictionary entry{
-        {platform::kCatalogAttributesKey, attributesFor(bundle, *version)},
-        {platform::kCatalogArchiveURLKey, plist::Value(relativeURL)},
-        {platform::kCatalogArchiveSizeKey, plist::Value(static_cast<long long>(size))},
-        {platform::kCatalogArchiveSHA256Key, plist::Value(*digest)},
+        {catalog::kCatalogAttributesKey, attributesFor(bundle, *version)},
+        {catalog::kCatalogArchiveURLKey, plist::Value(relativeURL)},
+        {catalog::kCatalogArchiveSizeKey, plist::Value(static_cast<long long>(size))},
+        {catalog::kCatalogArchiveSHA256Key, plist::Value(*digest)},
     };
     if (bundle.rolloutPercent) {
-        entry.emplace(platform::kCatalogRolloutPercentKey, plist::Value(*bundle.rolloutPercent));
+        entry.emplace(catalog::kCatalogRolloutPercentKey, plist::Value(*bundle.rolloutPercent));
     }
     return plist::Value(std::move(entry));
 }
@@ -194,7 +194,7 @@ std::optional<plist::Value> publishBundle(const PublishRequest& request,
 std::int64_t previousSerial(const PublishRequest& request) {
     std::string path = (fs::path(request.outputDirectory) / kCatalogFileName).string();
     std::optional<plist::Value> catalog = plist::readFile(path);
-    const plist::Value* serial = catalog ? catalog->find(platform::kCatalogSerialKey) : nullptr;
+    const plist::Value* serial = catalog ? catalog->find(catalog::kCatalogSerialKey) : nullptr;
     const plist::Integer* number = serial != nullptr ? serial->asInteger() : nullptr;
     return number != nullptr && !number->isLargeUnsigned() && number->signedValue() > 0
                ? number->signedValue()
@@ -214,8 +214,8 @@ std::optional<plist::Array> existingEntries(const PublishRequest& request, std::
         error = path + ": " + refusal.reason + "; use --fresh to replace it";
         return std::nullopt;
     }
-    const plist::Value* type = catalog ? catalog->find(platform::kCatalogAssetTypeKey) : nullptr;
-    const plist::Value* assets = catalog ? catalog->find(platform::kCatalogAssetsKey) : nullptr;
+    const plist::Value* type = catalog ? catalog->find(catalog::kCatalogAssetTypeKey) : nullptr;
+    const plist::Value* assets = catalog ? catalog->find(catalog::kCatalogAssetsKey) : nullptr;
     if (assets == nullptr || assets->asArray() == nullptr) {
         error = path + " is not a catalog; use --fresh to replace it";
         return std::nullopt;
@@ -228,9 +228,9 @@ std::optional<plist::Array> existingEntries(const PublishRequest& request, std::
 }
 
 void addOrReplace(plist::Array& entries, plist::Value entry) {
-    const plist::Value* url = entry.find(platform::kCatalogArchiveURLKey);
+    const plist::Value* url = entry.find(catalog::kCatalogArchiveURLKey);
     for (plist::Value& existing : entries) {
-        const plist::Value* existingURL = existing.find(platform::kCatalogArchiveURLKey);
+        const plist::Value* existingURL = existing.find(catalog::kCatalogArchiveURLKey);
         if (existingURL != nullptr && url != nullptr && *existingURL == *url) {
             existing = std::move(entry);
             return;
@@ -248,18 +248,18 @@ bool writeFile(const std::string& path, const std::string& bytes, mode_t mode) {
 // pair that does not verify and fetches again, never an old catalog taken as new.
 Failure writeCatalog(const PublishRequest& request, std::int64_t serial, plist::Array entries) {
     std::string path = (fs::path(request.outputDirectory) / kCatalogFileName).string();
-    std::string signaturePath = path + platform::kCatalogSignatureSuffix;
+    std::string signaturePath = path + catalog::kCatalogSignatureSuffix;
     double now = static_cast<double>(std::time(nullptr));
     plist::Dictionary catalog{
-        {platform::kCatalogAssetTypeKey, plist::Value(request.assetType)},
-        {platform::kCatalogSerialKey, plist::Value(static_cast<long long>(serial))},
-        {platform::kCatalogExpiresKey,
+        {catalog::kCatalogAssetTypeKey, plist::Value(request.assetType)},
+        {catalog::kCatalogSerialKey, plist::Value(static_cast<long long>(serial))},
+        {catalog::kCatalogExpiresKey,
          plist::Value(plist::Date::fromUnixTime(now + request.expiresInDays * kSecondsPerDay))},
-        {platform::kCatalogAssetsKey, plist::Value(std::move(entries))},
+        {catalog::kCatalogAssetsKey, plist::Value(std::move(entries))},
     };
     if (request.secretKey) {
         catalog.emplace(
-            platform::kCatalogKeyIDKey,
+            catalog::kCatalogKeyIDKey,
             plist::Value(request.keyIdentifier.empty() ? keyIdentifierOf(*request.secretKey)
                                                        : request.keyIdentifier));
     }
@@ -268,7 +268,7 @@ Failure writeCatalog(const PublishRequest& request, std::int64_t serial, plist::
         std::error_code ignored;
         fs::remove(signaturePath, ignored);  // a stale signature would make devices refuse it
     } else {
-        std::string signature(platform::kCatalogSignatureBytes, '\0');
+        std::string signature(catalog::kCatalogSignatureBytes, '\0');
         crypto_sign_detached(reinterpret_cast<unsigned char*>(signature.data()), nullptr,
                              reinterpret_cast<const unsigned char*>(bytes.data()), bytes.size(),
                              request.secretKey->data());
@@ -285,7 +285,7 @@ Failure writeCatalog(const PublishRequest& request, std::int64_t serial, plist::
 }  // namespace
 
 std::optional<std::string> publishCatalog(const PublishRequest& request) {
-    if (!platform::sodiumReady()) {
+    if (!catalog::sodiumReady()) {
         return "libsodium cannot be initialised";
     }
     std::string archives = (fs::path(request.outputDirectory) / kArchivesDirectoryName).string();
@@ -320,14 +320,14 @@ std::optional<std::string> publishCatalog(const PublishRequest& request) {
 
 std::optional<std::string> generateKeyPair(const std::string& secretKeyPath,
                                            const std::string& publicKeyPath, std::string& error) {
-    if (!platform::sodiumReady()) {
+    if (!catalog::sodiumReady()) {
         error = "libsodium cannot be initialised";
         return std::nullopt;
     }
-    platform::CatalogPublicKey publicKey{};
-    platform::CatalogSecretKey secretKey{};
+    catalog::CatalogPublicKey publicKey{};
+    catalog::CatalogSecretKey secretKey{};
     crypto_sign_keypair(publicKey.data(), secretKey.data());
-    std::string publicText = platform::base64Encode(publicKey.data(), publicKey.size());
+    std::string publicText = catalog::base64Encode(publicKey.data(), publicKey.size());
     io::UniqueFd fd(::open(secretKeyPath.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
     bool written = fd && ::write(fd.get(), secretKey.data(), secretKey.size()) ==
                              static_cast<ssize_t>(secretKey.size());
@@ -347,16 +347,16 @@ std::optional<std::string> generateKeyPair(const std::string& secretKeyPath,
     return publicText;
 }
 
-std::string keyIdentifierOf(const platform::CatalogSecretKey& secretKey) {
-    platform::CatalogPublicKey publicKey{};
+std::string keyIdentifierOf(const catalog::CatalogSecretKey& secretKey) {
+    catalog::CatalogPublicKey publicKey{};
     crypto_sign_ed25519_sk_to_pk(publicKey.data(), secretKey.data());
-    return platform::defaultKeyIdentifier(publicKey);
+    return catalog::defaultKeyIdentifier(publicKey);
 }
 
-std::optional<platform::CatalogSecretKey> readSecretKey(const std::string& path,
-                                                        std::string& error) {
+std::optional<catalog::CatalogSecretKey> readSecretKey(const std::string& path,
+                                                       std::string& error) {
     std::optional<std::string> bytes = plist::readFileBytes(path);
-    platform::CatalogSecretKey key{};
+    catalog::CatalogSecretKey key{};
     if (!bytes || bytes->size() != key.size()) {
         error = path + " is not a secret key made by 'tavrix-catalog keygen'";
         return std::nullopt;

@@ -29,7 +29,7 @@ struct PublishRequest {
     std::string outputDirectory;
     std::string assetType;
     // Nothing: the catalog is published unsigned.
-    std::optional<platform::CatalogSecretKey> secretKey;
+    std::optional<catalog::CatalogSecretKey> secretKey;
     // The identifier devices know the key by; empty: its default identifier.
     std::string keyIdentifier;
     // Nothing: one more than the catalog it replaces.
@@ -54,10 +54,9 @@ std::optional<std::string> generateKeyPair(const std::string& secretKeyPath,
                                            const std::string& publicKeyPath, std::string& error);
 
 // The default identifier of the public half of secretKey.
-std::string keyIdentifierOf(const platform::CatalogSecretKey& secretKey);
+std::string keyIdentifierOf(const catalog::CatalogSecretKey& secretKey);
 
 // The secret key in the file keygen wrote, or nothing with error set.
-std::optional<platform::CatalogSecretKey> readSecretKey(const std::string& path,
-                                                        std::string& error);
+std::optional<catalog::CatalogSecretKey> readSecretKey(const std::string& path, std::string& error);
 
 }  // namespace tavrix::tools

@@ -19,7 +19,7 @@ namespace fs = std::filesystem;
 // the directory; archives listed with an absolute URL are fetched.
 constexpr std::string_view kDirectoryBase = "http://published.invalid/";
 constexpr std::size_t kMaxSignatureBytes = 4096;
-const platform::HttpTransferLimits kTransferLimits{15, 1024, 30, 0};
+const http::HttpTransferLimits kTransferLimits{15, 1024, 30, 0};
 
 bool isURL(const std::string& source) {
     return source.starts_with("http://") || source.starts_with("https://");
@@ -28,7 +28,7 @@ bool isURL(const std::string& source) {
 std::optional<std::string> readSource(const std::string& location, std::size_t maxBytes,
                                       std::string& error) {
     if (isURL(location)) {
-        return platform::fetchHttpBody(location, maxBytes, kTransferLimits, error);
+        return http::fetchHttpBody(location, maxBytes, kTransferLimits, error);
     }
     std::optional<std::string> bytes = plist::readFileBytes(location);
     if (!bytes) {
@@ -40,22 +40,22 @@ std::optional<std::string> readSource(const std::string& location, std::size_t m
 // The size and SHA-256 of an archive, or nothing with error set. Reading stops past the size
 // listed, as a device's download does.
 std::optional<std::pair<std::uint64_t, std::string>> measureArchive(
-    const std::string& directory, const platform::CatalogEntry& entry, std::string& error) {
+    const std::string& directory, const catalog::CatalogEntry& entry, std::string& error) {
     if (entry.archiveURL.starts_with(kDirectoryBase)) {
         std::string path =
             (fs::path(directory) / entry.archiveURL.substr(kDirectoryBase.size())).string();
         std::error_code code;
         std::uintmax_t size = fs::file_size(path, code);
-        std::optional<std::string> digest = platform::sha256HexOfFile(path);
+        std::optional<std::string> digest = catalog::sha256HexOfFile(path);
         if (code || !digest) {
             error = "cannot read " + path;
             return std::nullopt;
         }
         return std::make_pair(static_cast<std::uint64_t>(size), *digest);
     }
-    platform::Sha256Digest digest;
+    catalog::Sha256Digest digest;
     std::uint64_t size = 0;
-    bool fetched = platform::transferHttpBody(
+    bool fetched = http::transferHttpBody(
         entry.archiveURL,
         [&](std::string_view bytes, std::string& refusal) {
             size += bytes.size();
@@ -87,22 +87,22 @@ bool verifyPublishedCatalog(const VerifyRequest& request) {
         remote ? request.source : (fs::path(request.source) / kCatalogFileName).string();
     std::string error;
     std::optional<std::string> bytes =
-        readSource(catalogLocation, platform::kMaxCatalogBytes, error);
+        readSource(catalogLocation, catalog::kMaxCatalogBytes, error);
     if (!bytes) {
         return problem("fetch failed: " + error);
     }
-    std::optional<plist::Value> catalog = platform::parseCatalog(*bytes, error);
+    std::optional<plist::Value> catalog = catalog::parseCatalog(*bytes, error);
     if (!catalog) {
         return problem("malformed: " + error);
     }
-    platform::CatalogRefusal refusal;
+    catalog::CatalogRefusal refusal;
     bool good = true;
     if (!request.keys.empty()) {
-        std::string signature = readSource(catalogLocation + platform::kCatalogSignatureSuffix,
+        std::string signature = readSource(catalogLocation + catalog::kCatalogSignatureSuffix,
                                            kMaxSignatureBytes, error)
                                     .value_or(std::string());
-        std::optional<std::string> keyID = platform::catalogKeyID(*catalog);
-        if (platform::verifyWithTrustedKey(*bytes, signature, keyID, request.keys, refusal)) {
+        std::optional<std::string> keyID = catalog::catalogKeyID(*catalog);
+        if (catalog::verifyWithTrustedKey(*bytes, signature, keyID, request.keys, refusal)) {
             std::printf("signature: verified with the key %s\n", keyID->c_str());
         } else {
             good = problem(refusal.what());
@@ -110,30 +110,30 @@ bool verifyPublishedCatalog(const VerifyRequest& request) {
     } else {
         std::printf("signature: not checked (--allow-unsigned)\n");
     }
-    std::optional<platform::CatalogMetadata> metadata =
-        platform::readCatalogMetadata(*catalog, refusal);
+    std::optional<catalog::CatalogMetadata> metadata =
+        catalog::readCatalogMetadata(*catalog, refusal);
     if (!metadata) {
         return problem(refusal.what());
     }
     std::printf("serial: %lld\nexpires: %s\n", static_cast<long long>(metadata->serial),
-                platform::catalogDateText(metadata->expires).c_str());
+                catalog::catalogDateText(metadata->expires).c_str());
     plist::Date now = plist::Date::fromUnixTime(static_cast<double>(std::time(nullptr)));
-    if (!platform::checkFreshness(*metadata, now, request.minimumSerial, refusal)) {
+    if (!catalog::checkFreshness(*metadata, now, request.minimumSerial, refusal)) {
         good = problem(refusal.what());
     }
     std::string base = remote ? request.source : std::string(kDirectoryBase) + kCatalogFileName;
-    std::optional<std::vector<platform::CatalogEntry>> entries =
-        platform::readCatalogEntries(*catalog, base, request.assetType, error);
+    std::optional<std::vector<catalog::CatalogEntry>> entries =
+        catalog::readCatalogEntries(*catalog, base, request.assetType, error);
     if (!entries) {
         return problem("malformed: " + error);
     }
     // Devices skip malformed entries; a publisher wants to hear of them.
-    std::size_t listed = catalog->find(platform::kCatalogAssetsKey)->asArray()->size();
+    std::size_t listed = catalog->find(catalog::kCatalogAssetsKey)->asArray()->size();
     if (entries->size() != listed) {
         good = problem(std::to_string(listed - entries->size()) + " of " + std::to_string(listed) +
                        " entries are malformed and skipped by devices");
     }
-    for (const platform::CatalogEntry& entry : *entries) {
+    for (const catalog::CatalogEntry& entry : *entries) {
         std::string name = entry.archiveURL.starts_with(kDirectoryBase)
                                ? entry.archiveURL.substr(kDirectoryBase.size())
                                : entry.archiveURL;
@@ -155,19 +155,18 @@ bool verifyPublishedCatalog(const VerifyRequest& request) {
     return good;
 }
 
-std::optional<platform::TrustedCatalogKey> readPublicKey(const std::string& path,
-                                                         const std::string& identifier,
-                                                         std::string& error) {
+std::optional<catalog::TrustedCatalogKey> readPublicKey(const std::string& path,
+                                                        const std::string& identifier,
+                                                        std::string& error) {
     std::optional<std::string> text = plist::readFileBytes(path);
-    std::optional<std::string> bytes = text ? platform::base64Decode(*text) : std::nullopt;
-    platform::TrustedCatalogKey key;
+    std::optional<std::string> bytes = text ? catalog::base64Decode(*text) : std::nullopt;
+    catalog::TrustedCatalogKey key;
     if (!bytes || bytes->size() != key.publicKey.size()) {
         error = path + " is not a public key made by 'tavrix-catalog keygen'";
         return std::nullopt;
     }
     std::memcpy(key.publicKey.data(), bytes->data(), key.publicKey.size());
-    key.identifier =
-        identifier.empty() ? platform::defaultKeyIdentifier(key.publicKey) : identifier;
+    key.identifier = identifier.empty() ? catalog::defaultKeyIdentifier(key.publicKey) : identifier;
     return key;
 }
 

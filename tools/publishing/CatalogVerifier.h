@@ -15,7 +15,7 @@ struct VerifyRequest {
     // An http(s) URL of the catalog, or the directory publish wrote.
     std::string source;
     std::string assetType;
-    std::vector<platform::TrustedCatalogKey> keys;
+    std::vector<catalog::TrustedCatalogKey> keys;
     // Without keys, check everything but the signature.
     bool allowUnsigned = false;
     // The serial a device already holds: a lower one is a rollback.
@@ -27,8 +27,8 @@ bool verifyPublishedCatalog(const VerifyRequest& request);
 
 // The public key in the file keygen wrote, named identifier (its default identifier when empty),
 // or nothing with error set.
-std::optional<platform::TrustedCatalogKey> readPublicKey(const std::string& path,
-                                                         const std::string& identifier,
-                                                         std::string& error);
+std::optional<catalog::TrustedCatalogKey> readPublicKey(const std::string& path,
+                                                        const std::string& identifier,
+                                                        std::string& error);
 
 }  // namespace tavrix::tools
