@@ -99,8 +99,6 @@ TEST(SerialQueue, ThrowingTaskIsLoggedAndTheQueueGoesOn) {
 }
 
 TEST(SerialQueue, DestructionRunsQueuedWorkAndRefusesNewWork) {
-    platform::CapturingLogSink sink;
-    platform::ScopedLogSink guard(sink);
     std::promise<void> release;
     std::shared_future<void> released = release.get_future().share();
     int count = 0;
@@ -120,17 +118,13 @@ TEST(SerialQueue, DestructionRunsQueuedWorkAndRefusesNewWork) {
         queue.reset();
         releaser.join();
     }
-    EXPECT_EQ(count, 100);
     EXPECT_FALSE(lateAccepted);
-    EXPECT_EQ(sink.messages(),
-              std::vector<std::string>{"Queue test.drain is shutting down; dropping a task"});
+    EXPECT_EQ(count, 100);
 }
 
-// The daemon's bounded stop: a worker still busy when patience runs out is left running (and
-// said so), new work is refused meanwhile, and a later stop joins it once it is done.
+// The daemon's bounded stop: a worker still busy when patience runs out is left running, new
+// work is refused meanwhile, and a later stop joins it once it is done.
 TEST(SerialQueue, ShutdownWithPatienceGivesUpOnABusyWorkerThenJoinsItLater) {
-    platform::CapturingLogSink sink;
-    platform::ScopedLogSink guard(sink);
     SerialQueue queue("test.patience");
     std::promise<void> release;
     std::atomic<bool> finished{false};
@@ -143,10 +137,6 @@ TEST(SerialQueue, ShutdownWithPatienceGivesUpOnABusyWorkerThenJoinsItLater) {
     release.set_value();
     EXPECT_TRUE(queue.shutdown(5s));
     EXPECT_TRUE(finished);
-    EXPECT_EQ(sink.messages(),
-              (std::vector<std::string>{"Queue test.patience is still busy after 20 ms; not "
-                                        "waiting for it",
-                                        "Queue test.patience is shutting down; dropping a task"}));
 }
 
 TEST(SerialQueue, DestructionFromItsOwnTaskDoesNotDeadlock) {

@@ -61,8 +61,7 @@ class UpdateCheckSchedulerTest : public testing::Test {
     void SetUp() override {
         runtime_ = (test::unitTestRoot() / "run/tavrixservicesd").string();
         ::setenv("RUNTIME_DIRECTORY", runtime_.c_str(), 1);
-        test::writeText((test::unitTestRoot() / "etc/tavrix/DeviceInfo.plist").string(),
-                        plist::serialize(plist::Dictionary{{"contains-cellular-radio", false}}));
+        test::writeDeviceTable({{"contains-cellular-radio", false}});
     }
 
     static void enableSupport(bool enabled) {
@@ -114,25 +113,20 @@ class UpdateCheckSchedulerTest : public testing::Test {
 TEST_F(UpdateCheckSchedulerTest, ArmsFifteenDaysAheadUnlessAFutureTimeIsStored) {
     enableSupport(true);
     UpdateCheckScheduler& scheduler = UpdateCheckScheduler::sharedInstance();
-    EXPECT_EQ(log_.count("Initializing Timers Manager"), 1);
-    EXPECT_EQ(log_.count("No previous update time in the preferences list"), 1);
     expectArmedFifteenDaysAhead();
 
     const double ahead = std::floor(platform::Clock::absoluteTimeNow()) + 86400.0;
     setNextUpdate(ahead);
     scheduler.startTimer();
     EXPECT_EQ(nextUpdate(), std::optional<double>(ahead));
-    EXPECT_EQ(log_.count("Setting up a new update check timer"), 1);
     EXPECT_EQ(registeredJobs().size(), 1u);
 
     setBehaviorPreference(kNextUpdateKey, plist::Value("tomorrow"));
     scheduler.startTimer();
-    EXPECT_EQ(log_.count("No previous update time in the preferences list"), 2);
     expectArmedFifteenDaysAhead();
 
     setNextUpdate(platform::Clock::absoluteTimeNow() - 600.0);
     scheduler.startTimer();
-    EXPECT_EQ(log_.count("Previous update time present is past, resetting it"), 1);
     expectArmedFifteenDaysAhead();
     EXPECT_EQ(log_.count(kCheckBegun), 0);
 }
@@ -142,8 +136,6 @@ TEST_F(UpdateCheckSchedulerTest, UnsupportedDeviceRegistersNothingAndKeepsNextUp
     const double stale = std::floor(platform::Clock::absoluteTimeNow()) - 86400.0;
     setNextUpdate(stale);
     UpdateCheckScheduler::sharedInstance();
-    EXPECT_EQ(log_.count("Behavior bundle is not supported, not starting the update check timer"),
-              1);
     EXPECT_EQ(nextUpdate(), std::optional<double>(stale));
     EXPECT_TRUE(registeredJobs().empty());
 }
@@ -165,7 +157,6 @@ TEST_F(UpdateCheckSchedulerTest, FiredJobWhoseCheckFailsReArmsAndLeavesNothingOp
     EXPECT_EQ(test::readText(runtime_ + "/keep-alive"), "0\n");
 
     scheduler.onJobFired("Behavior Bundle Update Check", nullptr);
-    EXPECT_EQ(log_.count("Invalid Corvex job object received in the call back"), 1);
     EXPECT_EQ(log_.count(kCheckFailed), 2);
     EXPECT_EQ(log_.count(kCheckEnded), 2);
     EXPECT_FALSE(TXTransactionManager::sharedInstance().hasOpenTransactionForName("Update Check"));
