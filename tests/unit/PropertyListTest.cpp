@@ -199,8 +199,8 @@ std::string binaryChain(int length, bool shared) {
 }
 
 // Whatever a file holds, reading it answers promptly with a value or a reason, never waits, runs
-// out of memory or crashes; the daemon's reader logs the reason with the file's name. (FIFOs, huge
-// sparse files and deep or self-sharing nesting are refused on the real daemon too.)
+// out of memory or crashes; the daemon's reader logs the reason with the file's name. (FIFOs and
+// deep or self-sharing nesting are refused on the real daemon too.)
 TEST(PropertyListDamage, HostileFilesAreRefusedWithAReason) {
     test::TempDir dir;
     struct Case {
@@ -215,6 +215,12 @@ TEST(PropertyListDamage, HostileFilesAreRefusedWithAReason) {
         {"device behind a link",
          [](const std::string& path) { std::filesystem::create_symlink("/dev/zero", path); },
          "not a regular file"},
+        {"sparse 100 GiB",
+         [](const std::string& path) {
+             test::writeText(path, "");
+             std::filesystem::resize_file(path, std::uintmax_t{100} << 30);
+         },
+         "larger than"},
         {"a byte over the cap", bytes(std::string(kMaxPropertyListBytes + 1, ' ')), "larger than"},
         {"deep XML whose tags look self-closing", bytes(quotedSlashXml(600)), "deeper than 512"},
         {"binary array inside itself", bytes(binaryList({arrayOf({0})})), "contains itself"},
