@@ -2,7 +2,6 @@
 #include <zlib.h>
 
 #include <cstdlib>
-#include <mutex>
 #include <span>
 #include <string>
 #include <utility>
@@ -19,27 +18,6 @@ namespace tavrix {
 namespace {
 
 using Line = std::pair<int, std::string>;
-
-// Keeps each message with its priority: the loader's lines carry their own.
-class PrioritySink : public platform::LogSink {
-  public:
-    void write(int priority, std::string_view message) override {
-        std::lock_guard lock(mutex_);
-        lines_.emplace_back(priority, std::string(message));
-    }
-    std::vector<Line> lines() const {
-        std::lock_guard lock(mutex_);
-        return lines_;
-    }
-    void clear() {
-        std::lock_guard lock(mutex_);
-        lines_.clear();
-    }
-
-  private:
-    mutable std::mutex mutex_;
-    std::vector<Line> lines_;
-};
 
 const plist::Value kCarrier(plist::Dictionary{
     {"CarrierName", "Zed"},
@@ -62,10 +40,19 @@ std::string gzipped(const std::string& bytes) {
     return out;
 }
 
+// The loader's lines carry their own priorities.
 class CarrierFileLoaderTest : public testing::Test {
   protected:
+    std::vector<Line> lines() const {
+        std::vector<Line> lines;
+        for (std::size_t i = 0; i < sink.messages().size(); ++i) {
+            lines.emplace_back(sink.priorities()[i], sink.messages()[i]);
+        }
+        return lines;
+    }
+
     test::TempDir dir;
-    PrioritySink sink;
+    platform::CapturingLogSink sink;
     platform::ScopedLogSink guard{sink};
 };
 
@@ -87,15 +74,14 @@ TEST_F(CarrierFileLoaderTest, LocalFilesLoadOnlyWhenTheyHoldADictionary) {
         test::writeText(dir / "carrier.plist", content);
         EXPECT_FALSE(copyDictionaryFromFile(dir / "carrier.plist")) << content;
     }
-    EXPECT_TRUE(sink.lines().empty());
+    EXPECT_TRUE(lines().empty());
 
     EXPECT_FALSE(copyDictionaryFromFile(dir / "missing.plist"));
     EXPECT_FALSE(copyDictionaryFromFile(dir.path().string()));  // a directory
     EXPECT_FALSE(copyDictionaryFromFile(""));
-    EXPECT_EQ(sink.lines(),
-              (std::vector<Line>{{LOG_ERR, "Failed to load the file\n"},
-                                 {LOG_ERR, "Failed to load the file\n"},
-                                 {LOG_ERR, "Failed to get the URL for the file \n"}}));
+    EXPECT_EQ(lines(), (std::vector<Line>{{LOG_ERR, "Failed to load the file\n"},
+                                          {LOG_ERR, "Failed to load the file\n"},
+                                          {LOG_ERR, "Failed to get the URL for the file \n"}}));
 }
 
 // Over HTTP whatever body arrives is the file: gzip (named in any letter case) is inflated, no
@@ -166,7 +152,7 @@ TEST_F(CarrierFileLoaderTest, HttpBodiesAreTheFileWhateverTheStatus) {
         SCOPED_TRACE(c.path);
         sink.clear();
         EXPECT_EQ(copyPropertyListFromURL(server.url(c.path), kCarrierFileSourceRemote), c.loaded);
-        EXPECT_EQ(sink.lines(), c.lines);
+        EXPECT_EQ(lines(), c.lines);
     }
     // A transfer that ended well answers true even with nothing to show.
     std::optional<plist::Data> data{plist::Data{1}};
