@@ -137,13 +137,11 @@ struct ReadEntry {
     std::time_t mtime = 0;
     bool hasOwnerNames = false;
     std::int64_t uid = 0;
-    std::string content;
 };
 
 struct ReadArchive {
-    // The first filter's code (ARCHIVE_FILTER_GZIP, ...) and the format code.
+    // The first filter's code (ARCHIVE_FILTER_GZIP, ...).
     int filter = 0;
-    int format = 0;
     std::vector<ReadEntry> entries;
 };
 
@@ -169,17 +167,12 @@ inline ReadArchive readArchive(const void* bytes, std::size_t size) {
         read.hasOwnerNames =
             present(archive_entry_uname(entry)) || present(archive_entry_gname(entry));
         read.uid = archive_entry_uid(entry);
-        read.content.resize(static_cast<std::size_t>(read.size));
-        if (read.size > 0) {
-            archive_read_data(reader.get(), read.content.data(), read.content.size());
-        }
         result.entries.push_back(std::move(read));
     }
     if (status != ARCHIVE_EOF) {
         throw std::runtime_error(archive_error_string(reader.get()));
     }
     result.filter = archive_filter_code(reader.get(), 0);
-    result.format = archive_format(reader.get());
     return result;
 }
 

@@ -10,8 +10,8 @@
 #include <future>
 #include <map>
 #include <mutex>
-#include <random>
 #include <thread>
+#include <tuple>
 
 #include "ArchiveFixtures.h"
 #include "CatalogToolRunner.h"
@@ -21,10 +21,10 @@
 #include "catalog/AssetCatalog.h"
 #include "catalog/AssetCatalogSettings.h"
 #include "catalog/CatalogCrypto.h"
-#include "device/PlatformRoot.h"
-#include "plist/PropertyListFormat.h"
 #include "util/Clock.h"
+#include "device/PlatformRoot.h"
 #include "util/SystemLog.h"
+#include "plist/PropertyListFormat.h"
 
 namespace tavrix::catalog {
 namespace {
@@ -38,15 +38,6 @@ constexpr const char* kAssetType = "com.zandor.Grellas.TavrixBundles";
 constexpr auto kPatience = std::chrono::seconds(60);
 
 using Assets = std::vector<std::shared_ptr<Asset>>;
-
-std::string incompressibleBytes(std::size_t count) {
-    std::mt19937 generator(7);
-    std::string bytes(count, '\0');
-    for (char& byte : bytes) {
-        byte = static_cast<char>(generator());
-    }
-    return bytes;
-}
 
 LocalHttpServer::Response bodyResponse(std::string body,
                                        std::optional<std::size_t> cutAfter = std::nullopt) {
@@ -223,6 +214,8 @@ class AssetCatalogTest : public testing::Test {
     ScopedLogSink guard{sink};
 };
 
+// Settings that cannot be used answer no assets, say why once and ask no server. (No settings file
+// at all, and a rollout that leaves the device out, show on the real daemon.)
 TEST_F(AssetCatalogTest, WithoutUsableSettingsQueriesAnswerNoAssetsAndSayWhyOnce) {
     struct Case {
         const char* name;
@@ -230,7 +223,6 @@ TEST_F(AssetCatalogTest, WithoutUsableSettingsQueriesAnswerNoAssetsAndSayWhyOnce
         const char* reason;
     };
     std::vector<Case> cases{
-        {"no file", [] {}, "there is no settings file"},
         {"damaged file",
          [] { writeText(device::resolvePath(kAssetCatalogSettingsPath), "<plist><dict><key>"); },
          "not a property list"},
@@ -410,19 +402,13 @@ TEST_F(AssetCatalogTest, UnsignedCatalogsAreAnnouncedAndRolloutsAreStablePerDevi
         EXPECT_EQ(query().value_or(Assets()).size(), 1u);
         EXPECT_EQ(logLinesContaining("AllowUnsigned is set"), static_cast<std::size_t>(use));
     }
-    publishAt("0");
-    EXPECT_TRUE(query().value_or(Assets{nullptr}).empty());
-    EXPECT_EQ(logLinesContaining("outside the rollout of 1.0 (0%)"), 1u);
-
     // Each device decides the same way every time; raising the share keeps those it had.
     std::map<std::string, bool> at40;
     for (int percent : {40, 70}) {
         publishAt(std::to_string(percent).c_str());
         for (int device = 0; device < 12; ++device) {
             std::string serialNumber = "SN" + std::to_string(device);
-            writeText(device::resolvePath("/etc/tavrix/DeviceInfo.plist"),
-                      plist::serialize(plist::Value(
-                          plist::Dictionary{{"SerialNumber", plist::Value(serialNumber)}})));
+            test::writeDeviceTable({{"SerialNumber", serialNumber}});
             bool taking = query().value_or(Assets()).size() == 1;
             EXPECT_EQ(query().value_or(Assets()).size() == 1, taking) << serialNumber;
             EXPECT_TRUE(percent == 40 || taking || !at40[serialNumber]) << serialNumber;
@@ -436,7 +422,7 @@ TEST_F(AssetCatalogTest, UnsignedCatalogsAreAnnouncedAndRolloutsAreStablePerDevi
 }
 
 TEST_F(AssetCatalogTest, DamagedCatalogsAreRefusedAndMalformedEntriesSkipped) {
-    writeSettings(std::nullopt);
+    writeSettings(std::nullopt, {{kSettingsCatalogTimeoutKey, plist::Value(1)}});
     plist::Dictionary good{{"ArchiveURL", plist::Value("a.tgz")},
                            {"ArchiveSize", plist::Value(10)},
                            {"ArchiveSHA256", plist::Value(std::string(64, 'A'))},
@@ -472,32 +458,43 @@ TEST_F(AssetCatalogTest, DamagedCatalogsAreRefusedAndMalformedEntriesSkipped) {
     EXPECT_EQ(assets->front()->attributes(), *good.at("Attributes").asDictionary());
     EXPECT_EQ(logLinesContaining("skipping entry"), entries.size() - 1);
 
-    std::vector<std::pair<const char*, std::string>> refused{
-        {"not a property list", "\x89PNG garbage"},
-        {"another type", catalogWith("other.type", entries)},
-        {"assets of the wrong type", catalogWith(kAssetType, plist::Value("x"))},
-        {"over the size cap", std::string(9u << 20, ' ')},
-        {"no serial", plist::serialize(plist::Value(plist::Dictionary{
-                          {"AssetType", plist::Value(kAssetType)}, {"Assets", entries}}))},
+    LocalHttpServer::Response trickling = bodyResponse(std::string(4096, ' '));
+    trickling.trickleBytesPerSecond = 2000;
+    const std::vector<std::tuple<const char*, LocalHttpServer::Response, const char*>> refused{
+        {"not a property list", bodyResponse("\x89PNG garbage"), "not a property list"},
+        {"another type", bodyResponse(catalogWith("other.type", entries)), "AssetType is not"},
+        {"assets of the wrong type", bodyResponse(catalogWith(kAssetType, plist::Value("x"))),
+         "no Assets array"},
+        {"over the size cap", bodyResponse(std::string(9u << 20, ' ')), "cannot fetch it"},
+        {"no serial",
+         bodyResponse(plist::serialize(plist::Value(
+             plist::Dictionary{{"AssetType", plist::Value(kAssetType)}, {"Assets", entries}}))),
+         "no Serial"},
+        {"server error", statusResponse(500, "Oops"), "HTTP status 500"},
+        {"trickling server", trickling, "cannot fetch it"},
     };
-    for (const auto& [name, body] : refused) {
+    for (const auto& [name, response, reason] : refused) {
         SCOPED_TRACE(name);
-        server.serve("/catalog/catalog.plist", bodyResponse(body));
+        sink.clear();
+        server.serve("/catalog/catalog.plist", response);
         EXPECT_FALSE(query().has_value());
+        EXPECT_EQ(logLinesContaining(reason), 1u);
     }
-    server.serve("/catalog/catalog.plist", statusResponse(500, "Oops"));
-    EXPECT_FALSE(query().has_value());
-    EXPECT_EQ(logLinesContaining("HTTP status 500"), 1u);
 }
 
+// A download reports its steps in order, installs identical files in a directory of its own and
+// purges only that.
 TEST_F(AssetCatalogTest, DownloadReportsStepsInOrderInstallsIdenticalFilesAndPurges) {
-    std::string payload = incompressibleBytes(300 * 1024);
+    std::string payload = test::randomBytes(300 * 1024, 7);
     test::makeBundle(work / "b/Default.bundle", "1.0",
                      {{"a.plist", "<plist/>"}, {"b/deep/payload.bin", payload}});
     tool({"publish", work / "out", "--key", work / "secret.key", work / "b/Default.bundle"});
     writeSettings(publicKey);
     std::shared_ptr<Asset> asset = onlyAsset();
     ASSERT_TRUE(asset);
+    // Staging that an ended process left behind is cleared by the next download.
+    writeText(typeCache() + "/.abandoned.extracting/a.plist", "old");
+    writeText(typeCache() + "/.abandoned.download", "old");
 
     // Reports made before a handler exists wait for it.
     asset->beginDownload();
@@ -535,11 +532,17 @@ TEST_F(AssetCatalogTest, DownloadReportsStepsInOrderInstallsIdenticalFilesAndPur
     EXPECT_EQ(readText(*local + "/Info.plist"), readText(work / "b/Default.bundle/Info.plist"));
     EXPECT_EQ(cachedAssetEntries().size(), 1u) << "no staging files are left";
 
+    // A second download of the asset has its own directory: purging the first leaves it.
+    std::shared_ptr<Asset> second = onlyAsset();
+    ASSERT_EQ(download(second).back(), kAssetOperationCompleted);
+    ASSERT_TRUE(second->localURL().has_value());
+    EXPECT_NE(*second->localURL(), *local);
     std::promise<bool> purged;
     asset->purge([&](bool done) { purged.set_value(done); });
     ASSERT_EQ(purged.get_future().wait_for(kPatience), std::future_status::ready);
     EXPECT_FALSE(asset->localURL().has_value());
     EXPECT_FALSE(fs::exists(*local));
+    EXPECT_EQ(readText(*second->localURL() + "/a.plist"), "<plist/>");
 
     // The handler captured the asset; once the last report is delivered nothing keeps it.
     std::weak_ptr<Asset> weak = asset;
@@ -551,74 +554,59 @@ TEST_F(AssetCatalogTest, DownloadReportsStepsInOrderInstallsIdenticalFilesAndPur
     EXPECT_TRUE(weak.expired());
 }
 
-TEST_F(AssetCatalogTest, FailedDownloadsReportFailureAndLeaveNothingBehind) {
-    test::makeBundle(work / "b/Default.bundle", "1.0",
-                     {{"payload.bin", incompressibleBytes(64 * 1024)}});
-    tool({"publish", work / "out", "--key", work / "secret.key", work / "b/Default.bundle"});
-    writeSettings(publicKey);
-    const std::string archivePath = "/catalog/archives/Default-1.0.tgz";
-    const std::string archive = readText(out("archives/Default-1.0.tgz"));
-    std::string flipped = archive;
-    flipped[flipped.size() / 2] ^= 0x55;
-
-    struct Case {
-        const char* name;
-        LocalHttpServer::Response response;
-        const char* reason;
-    };
-    std::vector<Case> cases{
-        {"altered archive", bodyResponse(flipped), "SHA-256"},
-        {"cut connection", bodyResponse(archive, archive.size() / 2), "cannot download"},
-        {"longer than listed", bodyResponse(archive + "tail"), "more than the catalog's"},
-        {"not found", statusResponse(404, "Not Found"), "HTTP status 404"},
-    };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.name);
-        sink.clear();
-        server.serve(archivePath, c.response);
-        std::shared_ptr<Asset> asset = onlyAsset();
-        ASSERT_TRUE(asset);
-        std::vector<std::string> operations = download(asset);
-        ASSERT_FALSE(operations.empty());
-        EXPECT_EQ(operations.back(), kAssetOperationFailed);
-        EXPECT_EQ(logLinesContaining(c.reason), 1u);
-        EXPECT_FALSE(asset->localURL().has_value());
-        EXPECT_TRUE(cachedAssetEntries().empty());
-    }
-}
-
-// Archives from the network that could reach outside the cache, or that unpack to far more than
-// they weigh, are refused whole by the real binding: the download fails with one line saying why,
-// nothing is written outside, and no local URL is ever offered. Each entry kind the extraction
+// Every way a download can go wrong ends in one failure report with one line saying why, no
+// local URL and nothing left in the cache. Archives that could reach outside the cache or unpack
+// to far more than they weigh are refused whole by the real binding (each entry kind extraction
 // refuses is covered where extraction is tested; here, that the binding asks for path-safe
-// extraction with its own settings' limits.
-TEST_F(AssetCatalogTest, HostileArchivesAreRefusedWholeAndNeverComplete) {
+// extraction with its own settings' limits), and a server that trickles is cut off.
+TEST_F(AssetCatalogTest, FailedDownloadsReportFailureAndLeaveNothingBehind) {
     const std::string outside = work / "outside";
     writeText(outside + "/secret", "secret");
     std::vector<test::ArchiveItem> manyEntries;
     for (int index = 0; index < 30; ++index) {
         manyEntries.push_back(test::fileItem("f" + std::to_string(index), "x"));
     }
+    const std::vector<test::ArchiveItem> plain{test::fileItem("a", test::randomBytes(8192, 7))};
+    const std::string archive =
+        test::buildArchive(test::Container::Tar, test::Compression::Gzip,
+                           {test::fileItem("Info.plist", "<plist/>"), plain.front()});
+    std::string flipped = archive;
+    flipped[flipped.size() / 2] ^= 0x55;
+    LocalHttpServer::Response trickle = bodyResponse(archive);
+    trickle.trickleBytesPerSecond = 2;
     struct Case {
         const char* name;
         std::vector<test::ArchiveItem> items;
+        std::optional<LocalHttpServer::Response> response;
         const char* reason;
-        plist::Dictionary settings;
+        plist::Dictionary settings = {};
     };
     const plist::Dictionary small{{kSettingsMaxExpandedBytesKey, plist::Value(1 << 20)},
                                   {kSettingsMaxArchiveEntriesKey, plist::Value(20)}};
     const std::vector<Case> cases{
+        {"altered archive", plain, bodyResponse(flipped), "SHA-256"},
+        {"cut connection", plain, bodyResponse(archive, archive.size() / 2), "cannot download"},
+        {"longer than listed", plain, bodyResponse(archive + "tail"), "more than the catalog's"},
+        {"not found", plain, statusResponse(404, "Not Found"), "HTTP status 404"},
+        {"trickling server",
+         plain,
+         trickle,
+         "cannot download",
+         {{kSettingsLowSpeedSecondsKey, plist::Value(1)}}},
         {"absolute symlink",
          {test::symlinkItem("escape", outside), test::fileItem("escape/planted", "p")},
+         std::nullopt,
          "leads outside",
          small},
         {"gzip bomb",
          {test::fileItem("bomb", std::string(4u << 20, '\0'))},
+         std::nullopt,
          "more than 1048576 bytes",
          small},
-        {"too many entries", manyEntries, "more than 20 entries", small},
+        {"too many entries", manyEntries, std::nullopt, "more than 20 entries", small},
         {"no room for the installer's copy",
-         {test::fileItem("a", "a")},
+         plain,
+         std::nullopt,
          "bytes free",
          {{kSettingsFreeSpaceReserveKey,
            plist::Value(plist::Integer::fromUnsigned(UINT64_MAX / 2))}}},
@@ -630,6 +618,9 @@ TEST_F(AssetCatalogTest, HostileArchivesAreRefusedWholeAndNeverComplete) {
         std::vector<test::ArchiveItem> items{test::fileItem("Info.plist", "<plist/>")};
         items.insert(items.end(), c.items.begin(), c.items.end());
         publishArchive(test::buildArchive(test::Container::Tar, test::Compression::Gzip, items));
+        if (c.response) {
+            server.serve("/catalog/archive.tgz", *c.response);
+        }
         std::shared_ptr<Asset> asset = onlyAsset();
         ASSERT_TRUE(asset);
 
@@ -643,55 +634,6 @@ TEST_F(AssetCatalogTest, HostileArchivesAreRefusedWholeAndNeverComplete) {
             EXPECT_NE(found.path().filename(), "planted") << found.path();
         }
     }
-}
-
-// A server that answers but trickles cannot hold a download or a catalog fetch: both end within
-// the configured limits and are reported as failures.
-TEST_F(AssetCatalogTest, TricklingServersAreCutOff) {
-    const std::string archive =
-        test::buildArchive(test::Container::Tar, test::Compression::Gzip,
-                           {test::fileItem("a", incompressibleBytes(8192))});
-    writeSettings(std::nullopt, {{kSettingsLowSpeedSecondsKey, plist::Value(1)},
-                                 {kSettingsCatalogTimeoutKey, plist::Value(1)}});
-    publishArchive(archive);
-    LocalHttpServer::Response trickle = bodyResponse(archive);
-    trickle.trickleBytesPerSecond = 2;
-    server.serve("/catalog/archive.tgz", trickle);
-    std::shared_ptr<Asset> asset = onlyAsset();
-    ASSERT_TRUE(asset);
-    EXPECT_EQ(download(asset).back(), kAssetOperationFailed);
-    EXPECT_FALSE(asset->localURL().has_value());
-
-    LocalHttpServer::Response slowCatalog = bodyResponse(std::string(4096, ' '));
-    slowCatalog.trickleBytesPerSecond = 2000;
-    server.serve("/catalog/catalog.plist", slowCatalog);
-    EXPECT_FALSE(query().has_value());
-    EXPECT_EQ(logLinesContaining("cannot fetch it"), 1u);
-}
-
-// Two downloads of one asset never share files: purging one leaves the other's in place. Staging
-// that an ended process left behind is cleared by the next download.
-TEST_F(AssetCatalogTest, DownloadsOfOneAssetKeepTheirOwnDirectories) {
-    test::makeBundle(work / "b/Default.bundle", "1.0", {{"a.plist", "one"}});
-    tool({"publish", work / "out", "--key", work / "secret.key", work / "b/Default.bundle"});
-    writeSettings(publicKey);
-    std::shared_ptr<Asset> first = onlyAsset();
-    std::shared_ptr<Asset> second = onlyAsset();
-    ASSERT_TRUE(first && second);
-    writeText(typeCache() + "/.abandoned.extracting/a.plist", "old");
-    writeText(typeCache() + "/.abandoned.download", "old");
-    ASSERT_EQ(download(first).back(), kAssetOperationCompleted);
-    EXPECT_EQ(cachedAssetEntries().size(), 1u);
-    ASSERT_EQ(download(second).back(), kAssetOperationCompleted);
-    ASSERT_TRUE(first->localURL() && second->localURL());
-    EXPECT_NE(*first->localURL(), *second->localURL());
-
-    std::promise<bool> purged;
-    first->purge([&](bool done) { purged.set_value(done); });
-    ASSERT_EQ(purged.get_future().wait_for(kPatience), std::future_status::ready);
-    EXPECT_FALSE(first->localURL().has_value());
-    ASSERT_TRUE(second->localURL().has_value());
-    EXPECT_EQ(readText(*second->localURL() + "/a.plist"), "one");
 }
 
 }  // namespace

@@ -2,7 +2,6 @@
 #include <zlib.h>
 
 #include <cstdlib>
-#include <mutex>
 #include <span>
 #include <string>
 #include <utility>
@@ -19,23 +18,6 @@ namespace tavrix {
 namespace {
 
 using Line = std::pair<int, std::string>;
-
-// Keeps each message with its priority: the loader's lines carry their own.
-class PrioritySink : public LogSink {
-  public:
-    void write(int priority, std::string_view message) override {
-        std::lock_guard lock(mutex_);
-        lines_.emplace_back(priority, std::string(message));
-    }
-    std::vector<Line> lines() const {
-        std::lock_guard lock(mutex_);
-        return lines_;
-    }
-
-  private:
-    mutable std::mutex mutex_;
-    std::vector<Line> lines_;
-};
 
 const plist::Value kCarrier(plist::Dictionary{
     {"CarrierName", "Zed"},
@@ -58,173 +40,133 @@ std::string gzipped(const std::string& bytes) {
     return out;
 }
 
+// The loader's lines carry their own priorities.
 class CarrierFileLoaderTest : public testing::Test {
   protected:
+    std::vector<Line> lines() const {
+        std::vector<Line> lines;
+        for (std::size_t i = 0; i < sink.messages().size(); ++i) {
+            lines.emplace_back(sink.priorities()[i], sink.messages()[i]);
+        }
+        return lines;
+    }
+
     test::TempDir dir;
-    PrioritySink sink;
+    CapturingLogSink sink;
     ScopedLogSink guard{sink};
 };
 
-TEST_F(CarrierFileLoaderTest, LoadsDictionariesInEitherFormatFromAnyPath) {
+// Dictionaries load in either format from any path; other content yields nothing silently, and
+// only a file that cannot be read is logged, at error priority.
+TEST_F(CarrierFileLoaderTest, LocalFilesLoadOnlyWhenTheyHoldADictionary) {
     // Spaces, '%', '+' and non-ASCII bytes must survive the trip through a file URL.
     for (const std::string name :
          {"behavior.plist", "dir with space/a%20b+c.plist", "d\xC3\xA9j\xC3\xA0/x#y?.plist"}) {
         for (plist::Format format : {plist::Format::Xml, plist::Format::Binary}) {
-            std::string path = dir / name;
-            test::writeText(path, plist::serialize(kCarrier, format));
-            std::optional<plist::Value> loaded = copyDictionaryFromFile(path);
-            ASSERT_TRUE(loaded) << name;
-            EXPECT_EQ(*loaded, kCarrier);
+            test::writeText(dir / name, plist::serialize(kCarrier, format));
+            EXPECT_EQ(copyDictionaryFromFile(dir / name), kCarrier) << name;
         }
     }
-    EXPECT_TRUE(sink.lines().empty());
-}
+    for (const std::string& content :
+         {plist::serialize(plist::Value(plist::Array{"a", "b"})),
+          plist::serialize(plist::Value("text"), plist::Format::Binary), std::string(),
+          std::string("<plist><dict><key>cut")}) {
+        test::writeText(dir / "carrier.plist", content);
+        EXPECT_FALSE(copyDictionaryFromFile(dir / "carrier.plist")) << content;
+    }
+    EXPECT_TRUE(lines().empty());
 
-TEST_F(CarrierFileLoaderTest, UnreadableFilesLogAtErrorPriority) {
     EXPECT_FALSE(copyDictionaryFromFile(dir / "missing.plist"));
     EXPECT_FALSE(copyDictionaryFromFile(dir.path().string()));  // a directory
     EXPECT_FALSE(copyDictionaryFromFile(""));
-    EXPECT_EQ(sink.lines(),
-              (std::vector<Line>{{LOG_ERR, "Failed to load the file\n"},
-                                 {LOG_ERR, "Failed to load the file\n"},
-                                 {LOG_ERR, "Failed to get the URL for the file \n"}}));
+    EXPECT_EQ(lines(), (std::vector<Line>{{LOG_ERR, "Failed to load the file\n"},
+                                          {LOG_ERR, "Failed to load the file\n"},
+                                          {LOG_ERR, "Failed to get the URL for the file \n"}}));
 }
 
-TEST_F(CarrierFileLoaderTest, ContentThatIsNoDictionaryYieldsNothingSilently) {
-    const std::vector<std::string> contents = {
-        plist::serialize(plist::Value(plist::Array{"a", "b"})),
-        plist::serialize(plist::Value("just a string"), plist::Format::Binary),
-        "",
-        "<plist><dict><key>cut",
-        "\x00\x01garbage",
-    };
-    for (const std::string& content : contents) {
-        test::writeText(dir / "carrier.plist", content);
-        EXPECT_FALSE(copyDictionaryFromFile(dir / "carrier.plist"));
-    }
-    EXPECT_TRUE(sink.lines().empty());
-}
-
-class CarrierFileHttpTest : public CarrierFileLoaderTest {
-  protected:
-    void SetUp() override {
-        // A proxy from the environment must not stand between the loader and the local server.
-        ::setenv("no_proxy", "127.0.0.1", 1);
-        ::setenv("NO_PROXY", "127.0.0.1", 1);
-    }
-
-    void serve(const std::string& path, std::string body,
-               std::vector<std::pair<std::string, std::string>> headers = {}) {
-        test::LocalHttpServer::Response response;
-        response.body = std::move(body);
-        response.headers = std::move(headers);
-        server.serve(path, std::move(response));
-    }
-
+// Over HTTP whatever body arrives is the file: gzip (named in any letter case) is inflated, no
+// encoding is taken as it is, any other encoding or a broken gzip body yields nothing silently,
+// an error page parses to nothing, and only a broken transfer is a failure.
+TEST_F(CarrierFileLoaderTest, HttpBodiesAreTheFileWhateverTheStatus) {
+    // A proxy from the environment must not stand between the loader and the local server.
+    ::setenv("no_proxy", "127.0.0.1", 1);
+    ::setenv("NO_PROXY", "127.0.0.1", 1);
     test::LocalHttpServer server;
     const std::string xml = plist::serialize(kCarrier);
-};
-
-TEST_F(CarrierFileHttpTest, GzipBodiesAreInflatedWhateverTheLetterCase) {
-    std::string compressed = gzipped(xml);
-    serve("/lower", compressed, {{"Content-Encoding", "gzip"}});
-    serve("/mixed", compressed, {{"content-encoding", "x-GZip"}});
-    for (const char* path : {"/lower", "/mixed"}) {
-        EXPECT_EQ(copyPropertyListFromURL(server.url(path), kCarrierFileSourceRemote), kCarrier);
-    }
-    Line sizes{LOG_NOTICE,
-               "XML file retrieved, compressed size: " + std::to_string(compressed.size()) +
-                   ", decompressed size: " + std::to_string(xml.size()) + "\n"};
-    EXPECT_EQ(sink.lines(), (std::vector<Line>{sizes, sizes}));
-}
-
-TEST_F(CarrierFileHttpTest, PlainBodiesAreTakenWholeAcrossManyReads) {
+    const std::string compressed = gzipped(xml);
     plist::Dictionary large;
     for (int i = 0; i < 5000; ++i) {
         large.emplace("Key" + std::to_string(i), std::string(20, 'a' + i % 26));
     }
-    std::string body = plist::serialize(plist::Value(large));
-    ASSERT_GT(body.size(), 100000u);
-    serve("/large.plist", body);
-    EXPECT_EQ(copyPropertyListFromURL(server.url("/large.plist"), kCarrierFileSourceRemote),
-              plist::Value(large));
-    EXPECT_EQ(sink.lines(),
-              (std::vector<Line>{{LOG_NOTICE, "XML file retrieved, file size: " +
-                                                  std::to_string(body.size()) + "\n"}}));
-}
-
-TEST_F(CarrierFileHttpTest, RequestIsHttp10OfferingCompressAndGzip) {
-    serve("/carrier.plist", xml);
-    std::optional<plist::Data> data;
-    EXPECT_TRUE(copyDataFromHTTP(server.url("/carrier.plist"), &data));
-    std::vector<test::LocalHttpServer::Request> requests = server.requests();
-    ASSERT_EQ(requests.size(), 1u);
-    EXPECT_EQ(requests[0].method, "GET");
-    EXPECT_EQ(requests[0].version, "HTTP/1.0");
-    EXPECT_EQ(requests[0].header("Accept-Encoding"), "compress, gzip");
-    EXPECT_FALSE(copyDataFromHTTP(server.url("/carrier.plist"), nullptr));
-}
-
-TEST_F(CarrierFileHttpTest, OtherEncodingsAndBadGzipYieldNothingSilently) {
-    serve("/deflate", xml, {{"Content-Encoding", "deflate"}});
-    serve("/compress", xml, {{"Content-Encoding", "compress"}});
-    serve("/damaged", xml, {{"Content-Encoding", "gzip"}});
-    serve("/empty", "", {{"Content-Encoding", "gzip"}});
-    for (const char* path : {"/deflate", "/compress", "/damaged", "/empty"}) {
-        std::optional<plist::Data> data{plist::Data{1}};
-        EXPECT_TRUE(copyDataFromHTTP(server.url(path), &data)) << path;
-        EXPECT_FALSE(data) << path;
-        EXPECT_FALSE(copyPropertyListFromURL(server.url(path), kCarrierFileSourceRemote));
-    }
-    EXPECT_TRUE(sink.lines().empty());
-}
-
-TEST_F(CarrierFileHttpTest, ErrorPagesAreTakenAsTheBodyAndParseToNothing) {
-    std::optional<plist::Data> data;
-    EXPECT_TRUE(copyDataFromHTTP(server.url("/nowhere.plist"), &data));
-    ASSERT_TRUE(data);
-    EXPECT_NE(std::string(data->begin(), data->end()).find("404 Not Found"), std::string::npos);
-    EXPECT_FALSE(copyPropertyListFromURL(server.url("/nowhere.plist"), kCarrierFileSourceRemote));
-    for (const Line& line : sink.lines()) {
-        EXPECT_EQ(line.first, LOG_NOTICE);
-        EXPECT_TRUE(line.second.starts_with("XML file retrieved, file size: "));
-    }
-}
-
-TEST_F(CarrierFileHttpTest, RedirectsAreFollowedToTheFinalResponse) {
-    test::LocalHttpServer::Response moved;
-    moved.status = 302;
+    const std::string largeXml = plist::serialize(plist::Value(large));
+    ASSERT_GT(largeXml.size(), 100000u);
+    auto response = [](std::string body, std::vector<std::pair<std::string, std::string>> headers,
+                       int status = 200) {
+        test::LocalHttpServer::Response response;
+        response.body = std::move(body);
+        response.headers = std::move(headers);
+        response.status = status;
+        return response;
+    };
+    const std::string fileSize = "XML file retrieved, file size: ";
+    const Line inflated{
+        LOG_NOTICE, "XML file retrieved, compressed size: " + std::to_string(compressed.size()) +
+                        ", decompressed size: " + std::to_string(xml.size()) + "\n"};
+    test::LocalHttpServer::Response cut = response(xml, {});
+    cut.cutAfterBodyBytes = xml.size() / 2;
+    test::LocalHttpServer::Response moved = response("", {}, 302);
     moved.reason = "Found";
     // The redirect's own encoding must not decide how the final body is read.
-    moved.headers = {{"Location", "/final.plist.gz"}, {"Content-Encoding", "deflate"}};
-    server.serve("/start", moved);
-    test::writeText(dir / "final.plist.gz", gzipped(xml));
-    server.serveDirectory("/", dir.path());
-    // The directory server sends no encoding, so the final response is taken as it is; the gzip
-    // bytes are no property list.
-    std::optional<plist::Data> data;
-    EXPECT_TRUE(copyDataFromHTTP(server.url("/start"), &data));
-    ASSERT_TRUE(data);
-    EXPECT_EQ(std::string(data->begin(), data->end()), gzipped(xml));
-    ASSERT_EQ(server.requests().size(), 2u);
-    EXPECT_EQ(server.requests()[1].target, "/final.plist.gz");
-}
-
-TEST_F(CarrierFileHttpTest, BrokenTransfersFailAndAreLogged) {
-    test::LocalHttpServer::Response cut;
-    cut.body = xml;
-    cut.cutAfterBodyBytes = xml.size() / 2;
-    server.serve("/cut", cut);
-    std::optional<plist::Data> data;
-    EXPECT_FALSE(copyDataFromHTTP(server.url("/cut"), &data));
+    moved.headers = {{"Location", "/large"}, {"Content-Encoding", "deflate"}};
+    struct Case {
+        const char* path;
+        test::LocalHttpServer::Response response;
+        std::optional<plist::Value> loaded;
+        std::vector<Line> lines;
+    };
+    const std::vector<Case> cases{
+        {"/gzip", response(compressed, {{"Content-Encoding", "gzip"}}), kCarrier, {inflated}},
+        {"/mixed", response(compressed, {{"content-encoding", "x-GZip"}}), kCarrier, {inflated}},
+        {"/large",
+         response(largeXml, {}),
+         plist::Value(large),
+         {{LOG_NOTICE, fileSize + std::to_string(largeXml.size()) + "\n"}}},
+        {"/redirected",
+         moved,
+         plist::Value(large),
+         {{LOG_NOTICE, fileSize + std::to_string(largeXml.size()) + "\n"}}},
+        {"/compress", response(xml, {{"Content-Encoding", "compress"}}), std::nullopt, {}},
+        {"/damaged", response(xml, {{"Content-Encoding", "gzip"}}), std::nullopt, {}},
+        {"/empty", response("", {{"Content-Encoding", "gzip"}}), std::nullopt, {}},
+        {"/missing",
+         response("404 Not Found", {}, 404),
+         std::nullopt,
+         {{LOG_NOTICE, fileSize + "13\n"}}},
+        {"/cut", cut, std::nullopt, {{LOG_ERR, "Failed to load the file\n"}}},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.path);
+        server.serve(c.path, c.response);
+    }
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.path);
+        sink.clear();
+        EXPECT_EQ(copyPropertyListFromURL(server.url(c.path), kCarrierFileSourceRemote), c.loaded);
+        EXPECT_EQ(lines(), c.lines);
+    }
+    // A transfer that ended well answers true even with nothing to show.
+    std::optional<plist::Data> data{plist::Data{1}};
+    EXPECT_TRUE(copyDataFromHTTP(server.url("/compress"), &data));
     EXPECT_FALSE(data);
-    EXPECT_FALSE(copyPropertyListFromURL(server.url("/cut"), kCarrierFileSourceRemote));
+    EXPECT_FALSE(copyDataFromHTTP(server.url("/gzip"), nullptr));
+    const test::LocalHttpServer::Request request = server.requests().front();
+    EXPECT_EQ(request.method, "GET");
+    EXPECT_EQ(request.version, "HTTP/1.0");
+    EXPECT_EQ(request.header("Accept-Encoding"), "compress, gzip");
     // Only HTTP is fetched over the remote source.
     test::writeText(dir / "local.plist", xml);
     EXPECT_FALSE(
         copyPropertyListFromURL("file://" + dir / "local.plist", kCarrierFileSourceRemote));
-    EXPECT_EQ(sink.lines(), (std::vector<Line>{{LOG_ERR, "Failed to load the file\n"},
-                                               {LOG_ERR, "Failed to load the file\n"}}));
 }
 
 TEST(GzipInflaterTest, RefusesResultsBeyondTheCap) {

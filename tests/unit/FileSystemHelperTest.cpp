@@ -8,7 +8,8 @@
 #include <cerrno>
 #include <climits>
 #include <cmath>
-#include <map>
+#include <functional>
+#include <sstream>
 
 #include "TestSupport.h"
 #include "util/FileSystemHelper.h"
@@ -20,11 +21,10 @@ namespace {
 
 namespace fs = std::filesystem;
 using test::readText;
+using test::snapshotTree;
 using test::TempDir;
 using test::Tree;
 using test::writeText;
-
-using test::snapshotTree;
 
 mode_t modeOf(const std::string& path) {
     struct stat info {};
@@ -32,122 +32,109 @@ mode_t modeOf(const std::string& path) {
     return info.st_mode & 07777;
 }
 
-class FileSystemHelperTransfer : public testing::Test {
-  protected:
+// A tree as one line, sorted: "dir/", "file=content", "link->target".
+std::string treeLine(const fs::path& root) {
+    std::string line;
+    for (const auto& [path, content] : snapshotTree(root)) {
+        line += (line.empty() ? "" : " ") + path +
+                (content == "/"               ? "/"
+                 : content.starts_with("-> ") ? content.substr(1)
+                                              : "=" + content);
+    }
+    return line;
+}
+
+// Makes the files (with their parents) and directories of a tree line.
+void makeTree(const fs::path& root, const std::string& line) {
+    std::istringstream entries(line);
+    for (std::string entry; entries >> entry;) {
+        auto equals = entry.find('=');
+        if (equals == std::string::npos) {
+            fs::create_directories(root / entry);
+        } else {
+            writeText((root / entry.substr(0, equals)).string(), entry.substr(equals + 1));
+        }
+    }
+}
+
+// Every transfer operation on "payload" (the source) and "installed" (the destination): the
+// answer, and the whole directory afterwards.
+TEST(FileSystemHelperTransfer, AnswersAndResultingTreesFollowWhatLiesAtBothEnds) {
+    using Operation = std::function<int(FileSystemHelper&, const std::string&, const std::string&)>;
+    const Operation copy = [](FileSystemHelper& h, auto& s, auto& d) { return h.copyItem(s, d); };
+    const Operation move = [](FileSystemHelper& h, auto& s, auto& d) { return h.moveItem(s, d); };
+    const std::string overlapping =
+        "payload/a.txt=new payload/sub/b.txt=b payload/sub/deep/c.txt=c "
+        "installed/payload/a.txt=old "
+        "installed/payload/keep.txt=keep installed/payload/sub/other.txt=other";
+    const std::string merged =
+        "installed/ installed/payload/ installed/payload/a.txt=new installed/payload/keep.txt=keep "
+        "installed/payload/sub/ installed/payload/sub/b.txt=b installed/payload/sub/deep/ "
+        "installed/payload/sub/deep/c.txt=c installed/payload/sub/other.txt=other";
+    const std::string directoryOntoFile = "installed=file payload/ payload/x=x";
+    struct Case {
+        const char* name;
+        std::string before;
+        Operation operation;
+        int answer;
+        std::string after;
+    };
+    const std::vector<Case> cases{
+        {"move merges into the directory of the source's name", overlapping, move, 0, merged},
+        {"copy merges and keeps the source", overlapping, copy, 0,
+         merged + " payload/ payload/a.txt=new payload/sub/ payload/sub/b.txt=b "
+                  "payload/sub/deep/ payload/sub/deep/c.txt=c"},
+        {"a file where the source's directory belongs is replaced",
+         "payload/x=x installed/payload=file",
+         [](FileSystemHelper& h, auto& s, auto& d) {
+             return h.moveItemWithOwner(s, d, ::getuid(), ::getgid());
+         },
+         0, "installed/ installed/payload/ installed/payload/x=x"},
+        {"move of a directory onto a file", directoryOntoFile, move, 17, directoryOntoFile},
+        {"copy of a directory onto a file", directoryOntoFile, copy, 17, directoryOntoFile},
+        {"file onto file replaces it", "payload=new installed=old", move, 0, "installed=new"},
+        {"missing source, copy", "", copy, -1, ""},
+        {"missing source, move", "", move, -1, ""},
+        {"plain copy passes errno through", "payload=s",
+         [](FileSystemHelper& h, auto& s, auto& d) { return h.copyItem(s, d + "/no/parent"); },
+         ENOENT, "payload=s"},
+        {"copy between directories creates the destination", "payload/name=n",
+         [](FileSystemHelper& h, auto& s, auto& d) {
+             return h.copyFileBetweenDirectories(s, d + "/deeper", "name");
+         },
+         0, "installed/ installed/deeper/ installed/deeper/name=n payload/ payload/name=n"},
+        {"copy between directories below a file", "payload/name=n installed=file",
+         [](FileSystemHelper& h, auto& s, auto& d) {
+             return h.copyFileBetweenDirectories(s, d + "/sub", "name");
+         },
+         -1, "installed=file payload/ payload/name=n"},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
+        TempDir dir;
+        makeTree(dir.path(), c.before);
+        FileSystemHelper helper;
+        EXPECT_EQ(c.operation(helper, dir / "payload", dir / "installed"), c.answer);
+        EXPECT_EQ(treeLine(dir.path()), c.after);
+    }
+}
+
+TEST(FileSystemHelperTransfer, CopyKeepsModesAndLinks) {
     TempDir dir;
-    FileSystemHelper helper;
-    std::string source = dir / "payload";
-    std::string destination = dir / "installed";
-
-    // A source tree and a destination that already holds a directory of the source's name.
-    void makeOverlappingTrees() {
-        writeText(source + "/a.txt", "new a");
-        writeText(source + "/sub/b.txt", "b");
-        writeText(source + "/sub/deep/c.txt", "c");
-        writeText(destination + "/payload/a.txt", "old a");
-        writeText(destination + "/payload/keep.txt", "keep");
-        writeText(destination + "/payload/sub/other.txt", "other");
-    }
-
-    const Tree mergedTree{{"a.txt", "new a"},        {"keep.txt", "keep"}, {"sub", "/"},
-                          {"sub/b.txt", "b"},        {"sub/deep", "/"},    {"sub/deep/c.txt", "c"},
-                          {"sub/other.txt", "other"}};
-};
-
-TEST_F(FileSystemHelperTransfer, MoveIntoExistingDirectoryMergesAndRemovesTheSource) {
-    makeOverlappingTrees();
-    EXPECT_EQ(helper.moveItem(source, destination), 0);
-    EXPECT_EQ(snapshotTree(destination + "/payload"), mergedTree);
-    EXPECT_FALSE(fs::exists(source));
-}
-
-TEST_F(FileSystemHelperTransfer, CopyIntoExistingDirectoryMergesAndKeepsTheSource) {
-    makeOverlappingTrees();
-    Tree before = snapshotTree(source);
-    EXPECT_EQ(helper.copyItem(source, destination), 0);
-    EXPECT_EQ(snapshotTree(destination + "/payload"), mergedTree);
-    EXPECT_EQ(snapshotTree(source), before);
-}
-
-TEST_F(FileSystemHelperTransfer, CopyKeepsModesAndLinksAndPlacesTheSourceInsideADirectory) {
-    writeText(source + "/script", "#!/bin/sh\n");
-    ::chmod((source + "/script").c_str(), 0750);
-    ::chmod(source.c_str(), 0705);
-    fs::create_directory_symlink("../elsewhere", source + "/link");
-    fs::create_directories(destination);
-    EXPECT_EQ(helper.copyItem(source, destination + "/"), 0);
-    EXPECT_EQ(snapshotTree(destination + "/payload"),
+    writeText(dir / "payload/script", "#!/bin/sh\n");
+    ::chmod((dir / "payload/script").c_str(), 0750);
+    ::chmod((dir / "payload").c_str(), 0705);
+    fs::create_directory_symlink("../elsewhere", dir / "payload/link");
+    fs::create_directories(dir / "installed");
+    EXPECT_EQ(FileSystemHelper().copyItem(dir / "payload", dir / "installed/"), 0);
+    EXPECT_EQ(snapshotTree(dir / "installed/payload"),
               (Tree{{"script", "#!/bin/sh\n"}, {"link", "-> ../elsewhere"}}));
-    EXPECT_EQ(modeOf(destination + "/payload/script"), 0750u);
-    EXPECT_EQ(modeOf(destination + "/payload"), 0705u);
+    EXPECT_EQ(modeOf(dir / "installed/payload/script"), 0750u);
+    EXPECT_EQ(modeOf(dir / "installed/payload"), 0705u);
 }
 
-TEST_F(FileSystemHelperTransfer, NonDirectoryInsideTheDestinationIsReplaced) {
-    writeText(source + "/x", "x");
-    writeText(destination + "/payload", "a file in the way");
-    EXPECT_EQ(helper.moveItemWithOwner(source, destination, ::getuid(), ::getgid()), 0);
-    EXPECT_EQ(snapshotTree(destination), (Tree{{"payload", "/"}, {"payload/x", "x"}}));
-}
-
-TEST_F(FileSystemHelperTransfer, DirectoryOntoRegularFileAnswers17AndChangesNothing) {
-    writeText(source + "/x", "x");
-    writeText(destination, "file");
-    Tree before = snapshotTree(dir.path());
-    EXPECT_EQ(helper.moveItem(source, destination), 17);
-    EXPECT_EQ(helper.copyItem(source, destination), 17);
-    EXPECT_EQ(snapshotTree(dir.path()), before);
-}
-
-TEST_F(FileSystemHelperTransfer, FileOntoRegularFileReplacesIt) {
-    writeText(source, "new");
-    writeText(destination, "old");
-    EXPECT_EQ(helper.moveItem(source, destination), 0);
-    EXPECT_EQ(readText(destination), "new");
-    EXPECT_FALSE(fs::exists(source));
-}
-
-TEST_F(FileSystemHelperTransfer, MissingSourceAnswersMinusOne) {
-    EXPECT_EQ(helper.copyItem(source, destination), -1);
-    EXPECT_EQ(helper.moveItem(source, destination), -1);
-    EXPECT_FALSE(fs::exists(destination));
-}
-
-TEST_F(FileSystemHelperTransfer, PlainTransferPassesErrnoThrough) {
-    writeText(source, "s");
-    EXPECT_EQ(helper.copyItem(source, dir / "missing/parent/x"), ENOENT);
-    EXPECT_EQ(helper.moveItem(source, destination), 0);
-    EXPECT_EQ(readText(destination), "s");
-}
-
-TEST_F(FileSystemHelperTransfer, CopyFileBetweenDirectoriesCreatesTheDestination) {
-    writeText(source + "/name", "content");
-    EXPECT_EQ(helper.copyFileBetweenDirectories(source, destination + "/deeper", "name"), 0);
-    EXPECT_EQ(readText(destination + "/deeper/name"), "content");
-    EXPECT_EQ(modeOf(destination + "/deeper"), 0755u);
-    EXPECT_TRUE(fs::exists(source + "/name"));
-    writeText(dir / "blocker", "");
-    EXPECT_EQ(helper.copyFileBetweenDirectories(source, dir / "blocker/sub", "name"), -1);
-}
-
-TEST(FileSystemPrimitives, MoveAcrossFileSystemsCopiesAndRemoves) {
-    TempDir local;
-    struct stat here {
-    }, shm{};
-    if (::stat(local.path().c_str(), &here) != 0 || ::stat("/dev/shm", &shm) != 0 ||
-        here.st_dev == shm.st_dev || ::access("/dev/shm", W_OK) != 0) {
-        GTEST_SKIP() << "no second writable file system";
-    }
-    std::string target = "/dev/shm/tavrix-move-" + std::to_string(::getpid());
-    writeText(local / "tree/f", "f");
-    fs::create_symlink("f", local / "tree/l");
-    ASSERT_EQ(moveItemTree(local / "tree", target), 0);
-    EXPECT_EQ(snapshotTree(target), (Tree{{"f", "f"}, {"l", "-> f"}}));
-    EXPECT_FALSE(fs::exists(local / "tree"));
-    EXPECT_EQ(moveItemTree(target, target), EEXIST);
-    fs::remove_all(target);
-}
-
-TEST(FileSystemPrimitives, CopyAndMoveRefuseAnExistingDestination) {
+// The primitives never replace; across file systems a move copies and removes.
+TEST(FileSystemPrimitives, CopyAndMoveRefuseAnExistingDestinationAndMoveAcrossFileSystems) {
     TempDir dir;
     writeText(dir / "a", "a");
     writeText(dir / "b", "b");
@@ -157,9 +144,23 @@ TEST(FileSystemPrimitives, CopyAndMoveRefuseAnExistingDestination) {
     EXPECT_EQ(moveItemTree(dir / "a", dir / "dangling"), EEXIST);
     EXPECT_EQ(readText(dir / "b"), "b");
     EXPECT_EQ(readText(dir / "a"), "a");
+
+    struct stat here {
+    }, shm{};
+    if (::stat(dir.path().c_str(), &here) != 0 || ::stat("/dev/shm", &shm) != 0 ||
+        here.st_dev == shm.st_dev || ::access("/dev/shm", W_OK) != 0) {
+        GTEST_SKIP() << "no second writable file system";
+    }
+    std::string target = "/dev/shm/tavrix-move-" + std::to_string(::getpid());
+    writeText(dir / "tree/f", "f");
+    fs::create_symlink("f", dir / "tree/l");
+    ASSERT_EQ(moveItemTree(dir / "tree", target), 0);
+    EXPECT_EQ(snapshotTree(target), (Tree{{"f", "f"}, {"l", "-> f"}}));
+    EXPECT_FALSE(fs::exists(dir / "tree"));
+    fs::remove_all(target);
 }
 
-TEST(FileSystemHelper, ListDirectoryReplacesTheListOrLeavesItOnFailure) {
+TEST(FileSystemHelper, ListCreateAndRemove) {
     TempDir dir;
     FileSystemHelper helper;
     std::vector<std::string> list{"untouched"};
@@ -173,32 +174,23 @@ TEST(FileSystemHelper, ListDirectoryReplacesTheListOrLeavesItOnFailure) {
     ASSERT_EQ(helper.listDirectory(dir / "d", list, true), 0);
     std::sort(list.begin(), list.end());
     EXPECT_EQ(list, (std::vector<std::string>{dir / "d/one", dir / "d/sub"}));
-}
 
-TEST(FileSystemHelper, CreateDirectorySetsTheExactModeAndHonoursIntermediates) {
-    TempDir dir;
-    FileSystemHelper helper;
+    // The mode is set exactly on the new directory; intermediates get the umask default.
     EXPECT_EQ(helper.createDirectory(dir / "a/b", 0777, false), ENOENT);
     EXPECT_EQ(helper.createDirectory(dir / "a/b", 0777, true), 0);
     EXPECT_EQ(modeOf(dir / "a/b"), 0777u);
     EXPECT_EQ(modeOf(dir / "a"), 0777u & ~0022u);
     EXPECT_EQ(helper.createDirectory(dir / "a/b", 0700, true), 0);
     EXPECT_EQ(helper.createDirectory(dir / "a/b", 0700, false), EEXIST);
-    writeText(dir / "file", "");
-    EXPECT_NE(helper.createDirectory(dir / "file", 0755, true), 0);
-}
+    EXPECT_NE(helper.createDirectory(dir / "d/one", 0755, true), 0);
 
-TEST(FileSystemHelper, RemoveItemRemovesTreesAndLinksButNotLinkTargets) {
-    TempDir dir;
-    FileSystemHelper helper;
-    writeText(dir / "tree/x/y", "");
-    writeText(dir / "kept/z", "z");
-    fs::create_directory_symlink(dir / "kept", dir / "tree/link");
-    EXPECT_TRUE(helper.fileExists(dir / "tree/link/z"));
-    EXPECT_EQ(helper.removeItem(dir / "tree"), 0);
-    EXPECT_FALSE(helper.fileExists(dir / "tree"));
-    EXPECT_EQ(readText(dir / "kept/z"), "z");
-    EXPECT_EQ(helper.removeItem(dir / "tree"), ENOENT);
+    // Links inside a removed tree go, their targets stay.
+    fs::create_directory_symlink(dir / "a", dir / "d/link");
+    EXPECT_TRUE(helper.fileExists(dir / "d/link/b"));
+    EXPECT_EQ(helper.removeItem(dir / "d"), 0);
+    EXPECT_FALSE(helper.fileExists(dir / "d"));
+    EXPECT_TRUE(fs::is_directory(dir / "a/b"));
+    EXPECT_EQ(helper.removeItem(dir / "d"), ENOENT);
 }
 
 // A tree that an unprivileged daemon extracted with a directory it may not write: removing the
@@ -251,7 +243,9 @@ TEST(FileSystemPrimitives, ACopyThatRunsOutOfSpaceLeavesNoFileBehind) {
     EXPECT_EQ(snapshotTree(small).size(), 1u);
 }
 
-TEST(FileSystemAttributes, PermissionsApplyToTheWholeTreeButNotThroughLinks) {
+// Attributes reach the whole tree but not through links; a missing path answers 5 recursively
+// and -1 otherwise.
+TEST(FileSystemAttributes, RecursiveAttributesStayInsideTheTree) {
     TempDir dir;
     FileSystemHelper helper;
     writeText(dir / "tree/f", "");
@@ -267,20 +261,16 @@ TEST(FileSystemAttributes, PermissionsApplyToTheWholeTreeButNotThroughLinks) {
     EXPECT_EQ(helper.setPermissions(dir / "tree/f", 0644, false), 0);
     EXPECT_EQ(modeOf(dir / "tree/f"), 0644u);
     EXPECT_EQ(helper.setOwner(dir / "tree", ::getuid(), ::getgid(), true), 0);
-}
 
-TEST(FileSystemAttributes, MissingPathAnswers5RecursivelyAndMinusOneOtherwise) {
-    TempDir dir;
-    FileSystemHelper helper;
     EXPECT_EQ(setAttributesRecursively(dir / "missing", Permissions{0755}), 5);
     EXPECT_EQ(helper.setOwner(dir / "missing", ::getuid(), ::getgid(), true), 5);
     EXPECT_EQ(helper.setPermissions(dir / "missing", 0755, false), -1);
 }
 
-TEST(FileSystemUtilities, MakeDirectoryPathCreatesOnlyPrefixesEndingInASlash) {
+// Only prefixes that end in a slash are made, and nothing past 1022 characters.
+TEST(FileSystemUtilities, MakeDirectoryPath) {
     TempDir dir;
     EXPECT_EQ(makeDirectoryPath(dir / "a/b/c", ::getuid(), ::getgid(), 0750), 0);
-    EXPECT_TRUE(fs::is_directory(dir / "a/b"));
     EXPECT_EQ(modeOf(dir / "a/b"), 0750u);
     EXPECT_FALSE(fs::exists(dir / "a/b/c"));
     EXPECT_EQ(makeDirectoryPath(dir / "a/b/c/", ::getuid(), ::getgid(), 0750), 0);
@@ -288,14 +278,10 @@ TEST(FileSystemUtilities, MakeDirectoryPathCreatesOnlyPrefixesEndingInASlash) {
     writeText(dir / "file", "");
     // "file/" cannot be examined, so it is made, which fails because the file is there.
     EXPECT_EQ(makeDirectoryPath(dir / "file/x/", ::getuid(), ::getgid(), 0750), EEXIST);
-}
 
-TEST(FileSystemUtilities, MakeDirectoryPathStopsSilentlyAfter1022Characters) {
-    TempDir dir;
     std::string path = dir.path().string() + "/";
-    std::string component(100, 'x');
     while (path.size() < 1000) {
-        path += component.substr(0, std::min<std::size_t>(100, 1000 - path.size())) + "/";
+        path += std::string(std::min<std::size_t>(100, 1000 - path.size()), 'x') + "/";
     }
     std::string beyond = path + std::string(50, 'y') + "/";
     EXPECT_EQ(makeDirectoryPath(beyond, ::getuid(), ::getgid(), 0755), 0);
@@ -319,11 +305,19 @@ TEST(FileSystemUtilities, CompareNumbersNullsFirst) {
     EXPECT_EQ(compareNumbersNullsFirst(&text, &one), -1);
 }
 
-TEST(FileSystemUtilities, CopyProcessNameForPID) {
+TEST(FileSystemUtilities, ProcessNamesAndDictionaryFiles) {
     // The kernel keeps the first 15 bytes of the executable's name.
     std::string ownName = std::string(program_invocation_short_name).substr(0, 15);
     EXPECT_EQ(copyProcessNameForPID(::getpid()), std::optional<std::string>(ownName));
     EXPECT_EQ(copyProcessNameForPID(INT_MAX), std::nullopt);
+
+    TempDir dir;
+    plist::Dictionary dictionary{{"key", plist::Value("value")}};
+    ASSERT_TRUE(plist::writeFile(dir / "d.plist", dictionary));
+    ASSERT_TRUE(plist::writeFile(dir / "a.plist", plist::Array{plist::Value(1)}));
+    EXPECT_EQ(loadDictionaryAtPath(dir / "d.plist"), std::optional<plist::Value>(dictionary));
+    EXPECT_EQ(loadDictionaryAtPath(dir / "a.plist"), std::nullopt);
+    EXPECT_EQ(loadDictionaryAtPath(dir / "missing.plist"), std::nullopt);
 }
 
 int allocations = 0;
@@ -335,9 +329,10 @@ void* failingAllocate(std::size_t) {
     return nullptr;
 }
 
-TEST(FileSystemUtilities, CopyCStringFromStringUsesTheBufferOnlyWhenTheStringAndNulFit) {
+// The caller's buffer is used only when the string and its NUL fit; a failed allocation answers
+// the buffer emptied, or nothing, with length 0.
+TEST(FileSystemUtilities, CopyCStringFromString) {
     CStringAllocator allocator{countingAllocate, std::free};
-    allocations = 0;
     char buffer[6];
     std::size_t length = sizeof buffer;
     EXPECT_EQ(copyCStringFromString(allocator, "hello", buffer, &length), buffer);
@@ -356,28 +351,15 @@ TEST(FileSystemUtilities, CopyCStringFromStringUsesTheBufferOnlyWhenTheStringAnd
     copy = copyCStringFromString(CStringAllocator{}, "/var/mobile", nullptr, nullptr);
     EXPECT_STREQ(copy, "/var/mobile");
     std::free(copy);
-}
 
-TEST(FileSystemUtilities, CopyCStringFromStringWhenAllocationFails) {
     CStringAllocator failing{failingAllocate, std::free};
-    char buffer[4] = "abc";
-    std::size_t length = sizeof buffer;
+    length = 4;
     EXPECT_EQ(copyCStringFromString(failing, "too long", buffer, &length), buffer);
     EXPECT_EQ(buffer[0], '\0');
     EXPECT_EQ(length, 0u);
     length = 99;
     EXPECT_EQ(copyCStringFromString(failing, "x", nullptr, &length), nullptr);
     EXPECT_EQ(length, 0u);
-}
-
-TEST(FileSystemUtilities, LoadDictionaryAtPathAnswersDictionariesOnly) {
-    TempDir dir;
-    plist::Dictionary dictionary{{"key", plist::Value("value")}};
-    ASSERT_TRUE(plist::writeFile(dir / "d.plist", dictionary));
-    ASSERT_TRUE(plist::writeFile(dir / "a.plist", plist::Array{plist::Value(1)}));
-    EXPECT_EQ(loadDictionaryAtPath(dir / "d.plist"), std::optional<plist::Value>(dictionary));
-    EXPECT_EQ(loadDictionaryAtPath(dir / "a.plist"), std::nullopt);
-    EXPECT_EQ(loadDictionaryAtPath(dir / "missing.plist"), std::nullopt);
 }
 
 }  // namespace

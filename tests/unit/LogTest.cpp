@@ -11,43 +11,26 @@ class LogTest : public testing::Test {
   protected:
     CapturingLogSink sink;
     ScopedLogSink guard{sink};
-
-    std::string only() {
-        auto messages = sink.messages();
-        EXPECT_EQ(messages.size(), 1u);
-        return messages.empty() ? std::string() : messages.back();
-    }
 };
 
-TEST_F(LogTest, ObjectConversionUsesTheDescriptionAndNullForNil) {
-    plist::Value id("abc");
-    plist::Value set(plist::Array{plist::Value("TXMinimumLaunchTransaction")});
-    logObjectFormat("Handling Set Tavrix ID with %@", &id);
-    EXPECT_EQ(only(), "Handling Set Tavrix ID with abc");
-    sink.clear();
-    logObjectFormat("Removed client: %@, count: %u", static_cast<const plist::Value*>(nullptr), 0u);
-    EXPECT_EQ(only(), "Removed client: (null), count: 0");
-    sink.clear();
-    logObjectFormat("transactions: %@", &set);
-    // One message stays one line, so one journal entry.
-    EXPECT_EQ(only(), "transactions: (\\n    TXMinimumLaunchTransaction\\n)");
-}
-
-TEST_F(LogTest, ObjectFormatMixesPrintfConversionsInOrder) {
+// Objects show their description, nil "(null)", printf conversions mix in order, and a message is
+// kept exactly, its trailing line break too; one message stays one line.
+TEST_F(LogTest, FormatsAreKeptExactly) {
     plist::Value key("k");
+    plist::Value set(plist::Array{plist::Value("TXMinimumLaunchTransaction")});
     logObjectFormat("%s|%5d|%-3s|%lu|%lld|%.2f|%x|%c|%%|%@|%*d|%.*s|%zu|%p", "a", 42, "b", 7ul,
                     -9ll, 3.14159, 255u, 'z', &key, 4, 1, 2, "xyz", std::size_t{5}, nullptr);
-    EXPECT_EQ(only(), "a|   42|b  |7|-9|3.14|ff|z|%|k|   1|xy|5|(nil)");
-}
-
-TEST_F(LogTest, MessagesAreKeptExactlyIncludingTrailingNewlines) {
+    logObjectFormat("Removed client: %@, count: %u", static_cast<const plist::Value*>(nullptr), 0u);
+    logObjectFormat("transactions: %@", &set);
     logCFormat("Behavior ID %s is already sent, redoing bundle match\n", "abc");
     logCFormat("no newline %d", 1);
-    logObjectFormat("50%% done");
     logObjectFormat("trailing %");
     EXPECT_EQ(sink.messages(),
-              (std::vector<std::string>{"Behavior ID abc is already sent, redoing bundle match\n",
-                                        "no newline 1", "50% done", "trailing %"}));
+              (std::vector<std::string>{"a|   42|b  |7|-9|3.14|ff|z|%|k|   1|xy|5|(nil)",
+                                        "Removed client: (null), count: 0",
+                                        "transactions: (\\n    TXMinimumLaunchTransaction\\n)",
+                                        "Behavior ID abc is already sent, redoing bundle match\n",
+                                        "no newline 1", "trailing %"}));
 }
 
 // A client's text can neither forge a journal entry (a new line with a priority prefix) nor

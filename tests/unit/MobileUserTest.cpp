@@ -1,6 +1,8 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <tuple>
+
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
 #include "device/BuildCapabilities.h"
@@ -34,68 +36,43 @@ TEST(MobileUser, AccessorsComeFromTheDatabaseUnderThePlatformRoot) {
     EXPECT_EQ(MobileUser::gid(), ::getgid());
 }
 
-struct DecisionCase {
-    const char* description;
-    plist::Dictionary answers;
-    bool internal, carrierInstall, vendor;
-    friend void PrintTo(const DecisionCase& c, std::ostream* out) { *out << c.description; }
-};
+using plist::Value;
 
-class BuildCapabilitiesDecision : public testing::TestWithParam<DecisionCase> {};
-
-TEST_P(BuildCapabilitiesDecision, FollowsTheAnswers) {
-    const DecisionCase& c = GetParam();
-    BuildCapabilities::Facts facts = BuildCapabilities::decide(c.answers);
-    EXPECT_EQ(facts.isInternalBuild, c.internal) << c.description;
-    EXPECT_EQ(facts.hasCarrierInstallCapability, c.carrierInstall) << c.description;
-    EXPECT_EQ(facts.isVendorBuild, c.vendor) << c.description;
+// Internal, carrier install, vendor from the three answers; only booleans and strings count, and
+// the release type is read only when the build is not internal already.
+TEST(BuildCapabilities, DecisionFollowsTheAnswers) {
+    const std::tuple<const char*, plist::Dictionary, bool, bool, bool> cases[] = {
+        {"nothing answered", {}, false, false, false},
+        {"Desense", {{"ReleaseType", Value("Desense")}}, true, false, false},
+        {"Vendor", {{"ReleaseType", Value("Vendor")}}, false, false, true},
+        {"case matters", {{"ReleaseType", Value("vendor")}}, false, false, false},
+        {"internal wins", {{"InternalBuild", true}, {"ReleaseType", "Vendor"}}, true, false, false},
+        {"not internal", {{"InternalBuild", false}, {"ReleaseType", "Vendor"}}, false, false, true},
+        {"carrier install", {{"CarrierInstallCapability", true}}, false, true, false},
+        {"other types ignored",
+         {{"InternalBuild", 1},
+          {"CarrierInstallCapability", "true"},
+          {"ReleaseType", plist::Array{"Vendor"}}},
+         false,
+         false,
+         false},
+    };
+    for (const auto& [name, answers, internal, carrierInstall, vendor] : cases) {
+        SCOPED_TRACE(name);
+        BuildCapabilities::Facts facts = BuildCapabilities::decide(answers);
+        EXPECT_EQ(facts.isInternalBuild, internal);
+        EXPECT_EQ(facts.hasCarrierInstallCapability, carrierInstall);
+        EXPECT_EQ(facts.isVendorBuild, vendor);
+    }
 }
 
-using plist::Value;
-INSTANTIATE_TEST_SUITE_P(
-    BuildCapabilitiesTable, BuildCapabilitiesDecision,
-    testing::Values(
-        DecisionCase{"NothingAnswered", {}, false, false, false},
-        DecisionCase{"Desense", {{"ReleaseType", Value("Desense")}}, true, false, false},
-        DecisionCase{"Vendor", {{"ReleaseType", Value("Vendor")}}, false, false, true},
-        DecisionCase{"CaseMatters", {{"ReleaseType", Value("vendor")}}, false, false, false},
-        DecisionCase{"InternalWinsOverVendor",
-                     {{"InternalBuild", Value(true)}, {"ReleaseType", Value("Vendor")}},
-                     true,
-                     false,
-                     false},
-        DecisionCase{"InternalFalseStillReadsReleaseType",
-                     {{"InternalBuild", Value(false)}, {"ReleaseType", Value("Vendor")}},
-                     false,
-                     false,
-                     true},
-        DecisionCase{"CarrierInstall",
-                     {{"CarrierInstallCapability", Value(true)}, {"ReleaseType", Value("User")}},
-                     false,
-                     true,
-                     false},
-        DecisionCase{"OtherTypesIgnored",
-                     {{"InternalBuild", Value(1)},
-                      {"CarrierInstallCapability", Value("true")},
-                      {"ReleaseType", Value(plist::Array{Value("Vendor")})}},
-                     false,
-                     false,
-                     false}),
-    [](const testing::TestParamInfo<DecisionCase>& info) {
-        return std::string(info.param.description);
-    });
-
 TEST(BuildCapabilities, AccessorsReadTheDeviceTableOnce) {
-    std::string table = (test::unitTestRoot() / "etc/tavrix/DeviceInfo.plist").string();
-    std::filesystem::create_directories(test::unitTestRoot() / "etc/tavrix");
-    ASSERT_TRUE(plist::writeFile(table, plist::Dictionary{{"CarrierInstallCapability", Value(true)},
-                                                          {"ReleaseType", Value("Vendor")}}));
+    test::writeDeviceTable({{"CarrierInstallCapability", true}, {"ReleaseType", "Vendor"}});
     EXPECT_FALSE(BuildCapabilities::isInternalBuild());
     EXPECT_TRUE(BuildCapabilities::hasCarrierInstallCapability());
     EXPECT_TRUE(BuildCapabilities::isVendorBuild());
-    ASSERT_TRUE(plist::writeFile(table, plist::Dictionary{{"InternalBuild", Value(true)}}));
+    test::writeDeviceTable({{"InternalBuild", true}});
     EXPECT_FALSE(BuildCapabilities::isInternalBuild());
-    std::filesystem::remove(table);
 }
 
 }  // namespace

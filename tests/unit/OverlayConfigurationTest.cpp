@@ -1,6 +1,7 @@
 #include <gtest/gtest.h>
 
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include "bundle/OverlayConfiguration.h"
@@ -67,7 +68,7 @@ TEST_F(OverlayConfigurationTest, MapsEveryListedIDLowercasedToItsGroupsConfigura
     EXPECT_EQ(shared->at("abc").get(), shared->at("mixed-\xC3\xA9t\xC3\xA9").get());
 }
 
-TEST_F(OverlayConfigurationTest, MalformedGroupsAreLoggedAndSkipped) {
+TEST_F(OverlayConfigurationTest, MalformedGroupsAreSkipped) {
     Dictionary good{{"Name", "Good"}};
     Value base = baseWith({
         {"1", "not a group"},
@@ -80,51 +81,32 @@ TEST_F(OverlayConfigurationTest, MalformedGroupsAreLoggedAndSkipped) {
     std::optional<Dictionary> map = resolvedOverrides(base);
     ASSERT_TRUE(map);
     EXPECT_EQ(*map, (Dictionary{{"ok", good}}));
-    EXPECT_EQ(sink.messages(),
-              (std::vector<std::string>{
-                  "Failed to get the config dictionary in Allowed Multimode SIMs section\n",
-                  "No Supported Behavior IDs found in the config dictionary\n",
-                  "No Supported Behavior IDs found in the config dictionary\n",
-                  "No Override Configuration found in the config dictionary\n",
-                  "No Override Configuration found in the config dictionary\n",
-              }));
 }
 
-TEST_F(OverlayConfigurationTest, NoUsableSectionMeansNoMapAndNoKey) {
-    for (const Value& base : {Value(Dictionary{{"CarrierName", "Base"}}),
-                              Value(Dictionary{{"BehaviorOverrides", Array{}}}), Value("text")}) {
-        sink.clear();
-        BehaviorOverlayConfiguration configuration("abc", base);
-        EXPECT_TRUE(configuration.overlayKey().empty());
-        EXPECT_FALSE(configuration.overrideConfiguration());
-        EXPECT_EQ(configuration.baseDictionary(), base);
-        EXPECT_EQ(sink.messages(),
-                  (std::vector<std::string>{
-                      "There are no behavior overrides in the base bundle\n",
-                      "There is no merged allowed Behavior overlay configuration\n"}));
-    }
-    // A section without groups is a section: the key is set, nothing matches.
-    BehaviorOverlayConfiguration empty("abc", baseWith({}));
-    EXPECT_EQ(empty.overlayKey(), "abc");
-    EXPECT_FALSE(empty.overrideConfiguration());
-}
-
+// The ID is looked up as given (IDs reach this point lowercased already); without a usable
+// section there is no key, while a section without groups sets the key and matches nothing.
 TEST_F(OverlayConfigurationTest, TheBehaviorIDIsLookedUpAsGiven) {
     Dictionary configuration{{"Name", "Abc"}};
     Value base = baseWith({{"g", group({"ABC"}, configuration)}});
-    BehaviorOverlayConfiguration listed("abc", base);
-    EXPECT_EQ(listed.overlayKey(), "abc");
-    ASSERT_TRUE(listed.overrideConfiguration());
-    EXPECT_EQ(*listed.overrideConfiguration(), configuration);
-    // IDs reach this point lowercased already; an upper-case ID is a different one.
-    BehaviorOverlayConfiguration upper("ABC", base);
-    EXPECT_EQ(upper.overlayKey(), "ABC");
-    EXPECT_FALSE(upper.overrideConfiguration());
-    BehaviorOverlayConfiguration unlisted("xyz", base);
-    EXPECT_EQ(unlisted.overlayKey(), "xyz");
-    EXPECT_FALSE(unlisted.overrideConfiguration());
-    BehaviorOverlayConfiguration none("", base);
-    EXPECT_TRUE(none.overlayKey().empty());
+    const std::tuple<std::string, Value, std::string, std::optional<Dictionary>> cases[] = {
+        {"abc", base, "abc", configuration},
+        {"ABC", base, "ABC", std::nullopt},
+        {"xyz", base, "xyz", std::nullopt},
+        {"", base, "", std::nullopt},
+        {"abc", baseWith({}), "abc", std::nullopt},
+        {"abc", Value(Dictionary{{"CarrierName", "Base"}}), "", std::nullopt},
+        {"abc", Value(Dictionary{{"BehaviorOverrides", Array{}}}), "", std::nullopt},
+        {"abc", Value("text"), "", std::nullopt},
+    };
+    for (const auto& [id, carrier, key, found] : cases) {
+        SCOPED_TRACE(id + " in " + carrier.description());
+        BehaviorOverlayConfiguration overlay(id, carrier);
+        EXPECT_EQ(overlay.overlayKey(), key);
+        EXPECT_EQ(overlay.overrideConfiguration() ? std::optional(*overlay.overrideConfiguration())
+                                                  : std::nullopt,
+                  found);
+        EXPECT_EQ(overlay.baseDictionary(), carrier);
+    }
 }
 
 // ---- merging ----

@@ -110,8 +110,6 @@ TEST_F(PayloadExtraction, UnreadablePayloadsAnswerFalseWithAnEmptyDestination) {
     const std::map<std::string, std::string> payloads = {
         {"empty", ""},
         {"not an archive", "this is plainly not an archive\n" + randomBytes(3000, 1)},
-        {"bzip2",
-         buildArchive(Container::Tar, Compression::Bzip2, {test::fileItem("Info.plist", "x")})},
         {"gzip of no archive",
          "\x1f\x8b\x08\x00\x00\x00\x00\x00\x00\x03\x03\x00\x00\x00\x00\x00"
          "\x00\x00\x00\x00"},
@@ -141,14 +139,13 @@ TEST_F(PayloadExtraction, TruncatedArchiveKeepsTheEntriesBeforeTheDamage) {
     EXPECT_FALSE(fs::exists(dir / "dest/last.txt"));
 }
 
-// An entry that cannot be created logs an empty line; the others are still extracted.
+// An entry that cannot be created is skipped; the others are still extracted.
 TEST_F(PayloadExtraction, EntryThatCannotBeCreatedIsSkipped) {
     EXPECT_TRUE(extract(buildArchive(
         Container::Tar, Compression::Gzip,
         {test::fileItem("before.txt", "before"), test::hardlinkItem("orphan", "no-such-target"),
          test::fileItem("after.txt", "after")})));
     EXPECT_EQ(snapshotTree(destination), (Tree{{"before.txt", "before"}, {"after.txt", "after"}}));
-    EXPECT_TRUE(log.contains(""));
 }
 
 // The client's own payload is written where its entries point, outside the destination too.
@@ -204,15 +201,18 @@ TEST_F(PayloadExtraction, PathSafeStopsAtTheFirstEntryThatCouldLeave) {
         EXPECT_EQ(log.messages().size(), 1u);
         EXPECT_TRUE(log.messages().front().starts_with("Refusing the archive entry"));
     }
-    // Links that stay inside, however they are spelled, are taken as they are.
-    fs::remove_all(destination);
+    // Links that stay inside, however they are spelled, are taken as they are, and a destination
+    // reached through a link of the caller's is fine.
+    fs::create_directories(dir / "real");
+    fs::create_directory_symlink(dir / "real", dir / "via");
+    destination = dir / "via/bundle";
     EXPECT_TRUE(extract(
         buildArchive(Container::Cpio, Compression::Gzip,
                      {test::fileItem("data.txt", "data"), test::directoryItem("a/b"),
                       test::symlinkItem("a/b/up", "../../data.txt"),
                       test::symlinkItem("a/here", "./b/."), test::symlinkItem("top", "a/here/up")}),
         ExtractionSafety::PathSafe));
-    EXPECT_EQ(readText(dir / "dest/top"), "data");
+    EXPECT_EQ(readText(dir / "real/bundle/top"), "data");
 }
 
 // Every limit stops a payload where it is reached, whichever way its entries are trusted: what
@@ -268,21 +268,8 @@ TEST_F(PayloadExtraction, LimitsCutBombsShortWithOneLine) {
     }
 }
 
-// A destination reached through a symbolic link of the caller's is fine in PathSafe mode.
-TEST_F(PayloadExtraction, PathSafeFollowsSymbolicLinksInTheDestinationItself) {
-    fs::create_directories(dir / "real");
-    fs::create_directory_symlink(dir / "real", dir / "via");
-    destination = dir / "via/bundle";
-    EXPECT_TRUE(
-        extract(buildArchive(Container::Cpio, Compression::Gzip, {test::fileItem("a/b.txt", "b")}),
-                ExtractionSafety::PathSafe));
-    EXPECT_EQ(readText(dir / "real/bundle/a/b.txt"), "b");
-}
-
 class BundleInstall : public testing::Test {
   protected:
-    CapturingLogSink log;
-    ScopedLogSink logGuard{log};
     const fs::path root = test::unitTestRoot();
     const fs::path bundle = root / "var/mobile/Library/TavrixBundles/Default.bundle";
     const fs::path staged = root / "tmp/behaviorbundle_zipped.tgz";
@@ -315,9 +302,8 @@ TEST_F(BundleInstall, EachPayloadReplacesTheUserBundle) {
     EXPECT_FALSE(fs::exists(staged));
 }
 
-TEST(WriteDataToFile, ReplacesTheFileAndLogsEitherWay) {
-    CapturingLogSink log;
-    ScopedLogSink logGuard{log};
+// The staged file is replaced whole; a file that cannot be written still answers YES.
+TEST(WriteDataToFile, ReplacesTheFile) {
     TempDir dir;
     const std::string path = dir / "staged.tgz";
     writeText(path, "older and longer content");
@@ -328,7 +314,7 @@ TEST(WriteDataToFile, ReplacesTheFileAndLogsEitherWay) {
 
     const std::string unwritable = dir / "missing/staged.tgz";
     EXPECT_TRUE(writeDataToFile(plist::Data{'x'}, unwritable));
-    EXPECT_TRUE(log.contains("Failed to write the zipped file: " + unwritable + "\n"));
+    EXPECT_FALSE(fs::exists(unwritable));
 }
 
 }  // namespace
