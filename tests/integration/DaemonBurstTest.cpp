@@ -13,7 +13,7 @@ namespace {
 
 class DaemonBurstTest : public BusFixture {
   protected:
-    DaemonBurstTest() { busOptions.idleExitSeconds = 1; }
+    DaemonBurstTest() { idleExitSeconds = 1; }
 };
 
 struct Tally {

@@ -7,7 +7,6 @@
 #include <thread>
 
 #include "BusFixture.h"
-#include "CommandRunner.h"
 
 namespace tavrix::integration {
 namespace {
@@ -20,7 +19,7 @@ constexpr const char* kStartedNotification = "TXDaemonStartedNotification";
 
 class DaemonLifecycleTest : public BusFixture {
   protected:
-    DaemonLifecycleTest() { busOptions.idleExitSeconds = 1; }
+    DaemonLifecycleTest() { idleExitSeconds = 1; }
 
     // Position of the first whole line equal to text, or the line count when there is none.
     std::size_t lineIndex(const std::string& text) const {
@@ -70,7 +69,7 @@ TEST_F(DaemonLifecycleTest, StartsOnCallStaysForLaunchTransactionLeavesWhenIdleA
 // A keep-alive flag left set by an earlier run is seen at start and cleared once started;
 // SIGTERM, even with the launch transaction open, ends the daemon with 0 and the flag clear.
 TEST_F(DaemonLifecycleTest, KeepAliveLeftByEarlierRunIsClearedAndSigtermExitsCleanly) {
-    device().setKeepAliveFlag("1");
+    test::writeText(device().runtimeDirectory() / "keep-alive", "1");
     auto caller = client();
     EXPECT_TRUE(caller.setClientType(0));
     const auto pid = daemonPid();
@@ -87,7 +86,7 @@ TEST_F(DaemonLifecycleTest, KeepAliveLeftByEarlierRunIsClearedAndSigtermExitsCle
 
 class DaemonActivityTest : public DaemonLifecycleTest {
   protected:
-    DaemonActivityTest() { busOptions.idleExitSeconds = 2; }
+    DaemonActivityTest() { idleExitSeconds = 2; }
 };
 
 // A client calling once a second, from before the launch transaction ends until well past it,

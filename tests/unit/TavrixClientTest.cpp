@@ -9,7 +9,7 @@
 #include <thread>
 #include <vector>
 
-#include "PrivateBusDaemon.h"
+#include "PrivateBus.h"
 #include "client/TavrixClient.h"
 #include "platform/BusValueCodec.h"
 
@@ -33,7 +33,7 @@ Value sampleValue() {
 // exercise the client: right ones, error replies and replies of the wrong shape.
 class StubService {
   public:
-    explicit StubService(const test::PrivateBusDaemon& daemon) : bus_(daemon.connect()) {
+    explicit StubService(const test::PrivateBus& daemon) : bus_(daemon.connect()) {
         if (sd_bus_request_name(bus_.get(), kServiceName, 0) < 0) {
             throw std::runtime_error("cannot own the service name");
         }
@@ -77,14 +77,7 @@ class StubService {
     void answer(sd_bus_message* call) {
         const std::string member = sd_bus_message_get_member(call);
         sd_bus_message* raw = nullptr;
-        if (member == "SetTavrixID") {
-            // Answers whether a bundle came, so that absent and empty can be told apart.
-            const char* id = nullptr;
-            std::optional<std::vector<std::uint8_t>> bundle;
-            sd_bus_message_read_basic(call, 's', &id);
-            int r = platform::readOptionalBytes(call, bundle);
-            sd_bus_reply_method_return(call, "b", r >= 0 && bundle.has_value());
-        } else if (member == "IsTavrixBundleSupported") {
+        if (member == "IsTavrixBundleSupported") {
             sd_bus_reply_method_errorf(call, SD_BUS_ERROR_ACCESS_DENIED, "Not for you");
         } else if (member == "CopyTavrixValue") {
             const char* key = nullptr;
@@ -125,7 +118,7 @@ std::string failureOf(const std::function<void()>& operation) {
 }
 
 TEST(TavrixClient, ConnectingWhereNothingListensNamesTheProblem) {
-    test::PrivateBusDaemon bus;
+    test::PrivateBus bus;
     EXPECT_THAT(failureOf([&] { TavrixClient::connectToAddress(bus.deadAddress()); }),
                 HasSubstr("cannot connect to " + bus.deadAddress() + ": No such file"));
     ::setenv("DBUS_SYSTEM_BUS_ADDRESS", bus.deadAddress().c_str(), 1);
@@ -137,7 +130,7 @@ TEST(TavrixClient, ConnectingWhereNothingListensNamesTheProblem) {
 }
 
 TEST(TavrixClient, EveryOperationReportsAMissingDaemon) {
-    test::PrivateBusDaemon bus;
+    test::PrivateBus bus;
     TavrixClient client = TavrixClient::connectToAddress(bus.address());
     const std::pair<const char*, std::function<void()>> operations[] = {
         {"SetTavrixID", [&] { client.setTavrixID("id", std::nullopt); }},
@@ -155,12 +148,10 @@ TEST(TavrixClient, EveryOperationReportsAMissingDaemon) {
 }
 
 TEST(TavrixClient, DecodesRepliesAndRefusesMalformedOnes) {
-    test::PrivateBusDaemon bus;
+    test::PrivateBus bus;
     StubService stub(bus);
     TavrixClient client = TavrixClient::connectToAddress(bus.address());
 
-    EXPECT_FALSE(client.setTavrixID("id", std::nullopt));
-    EXPECT_TRUE(client.setTavrixID("id", std::vector<std::uint8_t>{}));
     EXPECT_TRUE(client.setClientType(7));
     EXPECT_FALSE(client.setClientType(-7));
     EXPECT_EQ(client.copyTavrixValue("sample"), sampleValue());
@@ -182,7 +173,7 @@ TEST(TavrixClient, DecodesRepliesAndRefusesMalformedOnes) {
 }
 
 TEST(TavrixClient, DeliversNotificationsWhileSubscribed) {
-    test::PrivateBusDaemon bus;
+    test::PrivateBus bus;
     StubService stub(bus);
     TavrixClient client = TavrixClient::connectToAddress(bus.address());
     std::vector<std::string> names;
@@ -209,7 +200,7 @@ TEST(TavrixClient, DeliversNotificationsWhileSubscribed) {
 
 TEST(TavrixClient, HandlerExceptionsComeOutOfProcessing) {
     struct HandlerBroke {};
-    test::PrivateBusDaemon bus;
+    test::PrivateBus bus;
     StubService stub(bus);
     TavrixClient client = TavrixClient::connectToAddress(bus.address());
     auto subscription = client.subscribe([](const std::string&) { throw HandlerBroke{}; });
@@ -218,7 +209,7 @@ TEST(TavrixClient, HandlerExceptionsComeOutOfProcessing) {
 }
 
 TEST(TavrixClient, ReportsALostBus) {
-    test::PrivateBusDaemon bus;
+    test::PrivateBus bus;
     TavrixClient client = TavrixClient::connectToAddress(bus.address());
     std::optional<NotificationSubscription> subscription =
         client.subscribe([](const std::string&) {});
