@@ -17,6 +17,7 @@
 #include <iostream>
 #include <map>
 #include <random>
+#include <sstream>
 #include <thread>
 
 #include "BusFixture.h"
@@ -114,18 +115,8 @@ class OverTheAirUpdateTest : public BusFixture {
         return site() / urlPath.substr(std::string("/updates/").size());
     }
 
-    // Every file of the user bundle with its content.
-    std::map<std::string, std::string> userBundleFiles() {
-        std::map<std::string, std::string> files;
-        std::error_code error;
-        for (auto it = fs::recursive_directory_iterator(at(kUserBundle), error);
-             !error && it != fs::recursive_directory_iterator(); it.increment(error)) {
-            if (it->is_regular_file()) {
-                files[fs::relative(it->path(), at(kUserBundle)).string()] = readText(it->path());
-            }
-        }
-        return files;
-    }
+    // Every entry of the user bundle: directories, and files with their content.
+    test::Tree userBundleFiles() { return test::snapshotTree(at(kUserBundle)); }
 
     // What the cache holds besides the kept catalog: downloads, staging and installed assets.
     std::vector<std::string> cachedAssets() {
@@ -179,10 +170,10 @@ class OverTheAirUpdateTest : public BusFixture {
     }
 
     // The installed bundle of this version is linked and read as the behavior settings.
-    void expectInstalled(const std::string& version, std::size_t files = 3) {
+    void expectInstalled(const std::string& version, std::size_t entries = 4) {
         auto installed = userBundleFiles();
         EXPECT_EQ(installed.count("Resources/only-in-" + version + ".txt"), 1u) << version;
-        EXPECT_EQ(installed.size(), files) << "entries of the previous bundle are gone";
+        EXPECT_EQ(installed.size(), entries) << "entries of the previous bundle are gone";
         EXPECT_EQ(linkTarget(kBundleLink), at(kUserBundle).string());
         EXPECT_EQ(linkTarget(kPreferencesLink), (at(kUserBundle) / "behavior.plist").string());
         EXPECT_EQ(client().copyTavrixValue("CarrierName"),
@@ -197,43 +188,38 @@ class OverTheAirUpdateTest : public BusFixture {
     }
 
     // tavrixctl with --json at the end of the line, where global options may also go; its
-    // answer read back.
-    plist::Dictionary tavrixctlJson(std::vector<std::string> arguments, int expectedStatus = 0) {
+    // answer parsed by Python's strict parser (malformed output or trailing text fails) and
+    // flattened: "LinkedBundle.Version" to "2", a dictionary to "{}", booleans as true or false.
+    std::map<std::string, std::string> tavrixctlJson(std::vector<std::string> arguments,
+                                                     int expectedStatus = 0) {
         arguments.insert(arguments.begin(), {TAVRIX_CTL_PATH, "--address", busAddress()});
         arguments.push_back("--json");
         CommandResult run = runCommand(arguments);
         EXPECT_EQ(run.status, expectedStatus) << run.output;
-        // Python's strict parser: malformed output or trailing text fails.
         const fs::path answerFile = device().base() / "answer.json";
         writeText(answerFile, run.output);
-        CommandResult converted =
-            runCommand({"/usr/bin/python3", "-c",
-                        "import json,plistlib,sys; "
-                        "sys.stdout.write(plistlib.dumps(json.load(open(sys.argv[1]))).decode())",
-                        answerFile.string()});
-        std::optional<plist::Value> answer =
-            converted.status == 0 ? plist::parse(converted.output) : std::nullopt;
-        EXPECT_TRUE(answer && answer->asDictionary() != nullptr) << run.output;
-        return answer && answer->asDictionary() ? *answer->asDictionary() : plist::Dictionary();
+        CommandResult flat = runCommand({"/usr/bin/python3", "-c", R"(import json, sys
+def walk(prefix, value):
+    for key, item in value.items():
+        text = "{}" if isinstance(item, dict) else item if isinstance(item, str) else json.dumps(item)
+        print(prefix + key + "=" + text)
+        if isinstance(item, dict):
+            walk(prefix + key + ".", item)
+walk("", json.load(open(sys.argv[1]))))",
+                                         answerFile.string()});
+        EXPECT_EQ(flat.status, 0) << run.output << flat.output;
+        std::map<std::string, std::string> answer;
+        std::istringstream lines(flat.output);
+        for (std::string line; std::getline(lines, line);) {
+            answer[line.substr(0, line.find('='))] = line.substr(line.find('=') + 1);
+        }
+        return answer;
     }
 
-    // The text at a path of keys in a JSON answer, or "(absent)".
-    static std::string textAt(const plist::Dictionary& answer,
-                              std::initializer_list<const char*> keys) {
-        const plist::Value* value = nullptr;
-        const plist::Dictionary* in = &answer;
-        for (const char* key : keys) {
-            auto found = in != nullptr ? in->find(key) : plist::Dictionary::const_iterator();
-            if (in == nullptr || found == in->end()) {
-                return "(absent)";
-            }
-            value = &found->second;
-            in = value->asDictionary();
-        }
-        if (const bool* flag = value->asBoolean()) {
-            return *flag ? "true" : "false";
-        }
-        return value->asString() != nullptr ? *value->asString() : value->description();
+    static std::string textAt(const std::map<std::string, std::string>& answer,
+                              const std::string& key) {
+        auto found = answer.find(key);
+        return found == answer.end() ? "(absent)" : found->second;
     }
 
     test::LocalHttpServer server;
@@ -248,18 +234,18 @@ class OverTheAirUpdateTest : public BusFixture {
 // catalog (kept across the daemon's exit); no catalog at all; a broken payload.
 TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
     setIDWithBundle("1");
-    plist::Dictionary status = tavrixctlJson({"status"});
-    EXPECT_EQ(textAt(status, {"BehaviorID"}), kBehaviorID);
-    EXPECT_EQ(textAt(status, {"Supported"}), "true");
-    EXPECT_EQ(textAt(status, {"WhyNotSupported"}), "(absent)");
-    EXPECT_EQ(textAt(status, {"LinkedBundle", "Identifier"}), "com.zandor.tavrix.bundle.test");
-    EXPECT_EQ(textAt(status, {"LinkedBundle", "Version"}), "1");
-    EXPECT_EQ(textAt(status, {"LinkedBundle", "OverlayType"}), "kNoOverlay");
-    EXPECT_EQ(textAt(status, {"UserBundleVersion"}), "1");
-    EXPECT_EQ(textAt(status, {"LastPayload", "Extracted"}), "true");
-    EXPECT_EQ(textAt(status, {"LastCheck"}), "(absent)");
-    EXPECT_NE(textAt(status, {"NextUpdateCheck"}), "(absent)");
-    EXPECT_NE(textAt(status, {"DaemonVersion"}), "(absent)");
+    auto status = tavrixctlJson({"status"});
+    EXPECT_EQ(textAt(status, "BehaviorID"), kBehaviorID);
+    EXPECT_EQ(textAt(status, "Supported"), "true");
+    EXPECT_EQ(textAt(status, "WhyNotSupported"), "(absent)");
+    EXPECT_EQ(textAt(status, "LinkedBundle.Identifier"), "com.zandor.tavrix.bundle.test");
+    EXPECT_EQ(textAt(status, "LinkedBundle.Version"), "1");
+    EXPECT_EQ(textAt(status, "LinkedBundle.OverlayType"), "kNoOverlay");
+    EXPECT_EQ(textAt(status, "UserBundleVersion"), "1");
+    EXPECT_EQ(textAt(status, "LastPayload.Extracted"), "true");
+    EXPECT_EQ(textAt(status, "LastCheck"), "(absent)");
+    EXPECT_NE(textAt(status, "NextUpdateCheck"), "(absent)");
+    EXPECT_NE(textAt(status, "DaemonVersion"), "(absent)");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
 
     const std::string archive = publish("2");
@@ -267,22 +253,22 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
     held.body = readText(published(archive));
     held.holdAfterBodyBytes = held.body.size() / 2;
     server.serve(archive, held);
-    plist::Dictionary check;
+    std::map<std::string, std::string> check;
     std::thread operatorCheck([&] { check = tavrixctlJson({"check-update", "--wait", "30"}); });
     ASSERT_TRUE(server.waitForHeldResponse(30s));
     EXPECT_FALSE(client().checkForTavrixBundleUpdate());
     server.releaseHeldResponses();
     operatorCheck.join();
-    EXPECT_EQ(textAt(check, {"started"}), "true");
-    EXPECT_EQ(textAt(check, {"outcome"}), "installed");
-    EXPECT_EQ(textAt(check, {"reason"}), "installed version 2");
+    EXPECT_EQ(textAt(check, "started"), "true");
+    EXPECT_EQ(textAt(check, "outcome"), "installed");
+    EXPECT_EQ(textAt(check, "reason"), "installed version 2");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 2, 30s));
     expectInstalled("2");
     EXPECT_EQ(cachedAssets(), std::vector<std::string>{});
     EXPECT_TRUE(waitForNextUpdateIn(kFifteenDays));
     status = tavrixctlJson({"status"});
-    EXPECT_EQ(textAt(status, {"LinkedBundle", "Version"}), "2");
-    EXPECT_EQ(textAt(status, {"LastCheck", "Outcome"}), "installed");
+    EXPECT_EQ(textAt(status, "LinkedBundle.Version"), "2");
+    EXPECT_EQ(textAt(status, "LastCheck.Outcome"), "installed");
 
     // Plain output this time.
     CommandResult upToDate =
@@ -297,28 +283,28 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
     signature[0] = static_cast<char>(signature[0] ^ 1);
     writeText(site() / "catalog.plist.sig", signature);
     check = tavrixctlJson({"check-update"}, 1);
-    EXPECT_EQ(textAt(check, {"outcome"}), "catalog-refused");
-    EXPECT_TRUE(textAt(check, {"reason"}).starts_with("catalog refused: bad signature: "))
-        << textAt(check, {"reason"});
+    EXPECT_EQ(textAt(check, "outcome"), "catalog-refused");
+    EXPECT_TRUE(textAt(check, "reason").starts_with("catalog refused: bad signature: "))
+        << textAt(check, "reason");
     // What the daemon recorded is still there after it left and was started again.
     const auto pid = daemonPid();
     ASSERT_TRUE(pid);
     ::kill(*pid, SIGTERM);
     EXPECT_EQ(waitForDaemonExit(*pid, 90s), std::optional<int>(0));
     status = tavrixctlJson({"status"});
-    EXPECT_EQ(textAt(status, {"LastCheck", "Outcome"}), "catalog-refused");
-    EXPECT_EQ(textAt(status, {"LinkedBundle", "Version"}), "2");
+    EXPECT_EQ(textAt(status, "LastCheck.Outcome"), "catalog-refused");
+    EXPECT_EQ(textAt(status, "LinkedBundle.Version"), "2");
 
     fs::remove(at("/etc/tavrix/AssetCatalog.plist"));
     check = tavrixctlJson({"check-update"}, 1);
-    EXPECT_EQ(textAt(check, {"started"}), "false");
-    EXPECT_EQ(textAt(check, {"reason"}), "no catalog configured");
+    EXPECT_EQ(textAt(check, "started"), "false");
+    EXPECT_EQ(textAt(check, "reason"), "no catalog configured");
 
     ASSERT_TRUE(client().setTavrixID(kBehaviorID, std::vector<std::uint8_t>{'n', 'o', 't'}));
     status = tavrixctlJson({"status"});
-    EXPECT_EQ(textAt(status, {"LastPayload", "Extracted"}), "false");
-    EXPECT_NE(textAt(status, {"LastPayload", "Reason"}), "");
-    EXPECT_EQ(textAt(status, {"LastCheck", "Outcome"}), "no-catalog");
+    EXPECT_EQ(textAt(status, "LastPayload.Extracted"), "false");
+    EXPECT_NE(textAt(status, "LastPayload.Reason"), "");
+    EXPECT_EQ(textAt(status, "LastCheck.Outcome"), "no-catalog");
 }
 
 // Each way an update can go wrong leaves the linked bundle and its files as they were, posts
@@ -517,7 +503,7 @@ TEST_F(OverTheAirUpdateTest, KilledAnywhereInAnUpdateTheNextLaunchCompletesOrRed
             // The check has ended once its download is purged.
             EXPECT_TRUE(waitForLogLine(kPurged, 30s, purged + 1));
         }
-        expectInstalled(version, 4);
+        expectInstalled(version, 5);
         EXPECT_EQ(cachedAssets(), std::vector<std::string>{});
     }
     EXPECT_EQ(cachedAssets(), std::vector<std::string>{});
