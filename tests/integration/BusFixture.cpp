@@ -19,8 +19,6 @@ using Clock = std::chrono::steady_clock;
 
 constexpr std::string_view kDaemonPreferences =
     "/var/mobile/Library/Preferences/com.zandor.tavrixservices.plist";
-// The log and the launch records are files written by other processes: they are polled.
-constexpr auto kFilePollInterval = 20ms;
 
 void check(int result, const char* what) {
     if (result < 0) {
@@ -101,19 +99,7 @@ BusWatcher::BusWatcher(const std::string& address) : bus_(test::connectToBus(add
                          &onPosted, this),
         "sd_bus_add_match");
     postedSlot_.reset(slot);
-
-    // Asked after subscribing, so that no change falls between the answer and the signals.
-    platform::BusError error;
-    sd_bus_message* reply = nullptr;
-    if (sd_bus_call_method(bus_.get(), "org.freedesktop.DBus", "/org/freedesktop/DBus",
-                           "org.freedesktop.DBus", "GetNameOwner", error.get(), &reply, "s",
-                           kDaemonBusName) >= 0) {
-        platform::BusMessagePtr owned(reply);
-        const char* owner = nullptr;
-        if (sd_bus_message_read(reply, "s", &owner) >= 0 && owner != nullptr) {
-            owner_ = owner;
-        }
-    }
+    // The bus is new: nobody owns the name yet.
 }
 
 bool BusWatcher::waitUntil(const std::function<bool()>& done, std::chrono::milliseconds timeout) {
@@ -257,30 +243,21 @@ int BusFixture::countLogLines(const std::string& line) const {
 
 bool BusFixture::waitForLogLine(const std::string& line, std::chrono::milliseconds timeout,
                                 int count) const {
-    const auto deadline = Clock::now() + timeout;
-    while (countLogLines(line) < count) {
-        if (Clock::now() > deadline) {
-            return false;
-        }
-        std::this_thread::sleep_for(kFilePollInterval);
-    }
-    return true;
+    return pollUntil([&] { return countLogLines(line) >= count; }, timeout);
 }
 
 std::optional<int> BusFixture::waitForDaemonExit(pid_t pid,
                                                  std::chrono::milliseconds timeout) const {
-    const auto deadline = Clock::now() + timeout;
-    for (;;) {
-        for (const test::DaemonLaunch& launch : bus_->launches()) {
-            if (launch.pid == pid && launch.exitStatus) {
-                return launch.exitStatus;
+    std::optional<int> status;
+    pollUntil(
+        [&] {
+            for (const test::DaemonLaunch& launch : bus_->launches()) {
+                status = launch.pid == pid ? launch.exitStatus : status;
             }
-        }
-        if (Clock::now() > deadline) {
-            return std::nullopt;
-        }
-        std::this_thread::sleep_for(kFilePollInterval);
-    }
+            return status.has_value();
+        },
+        timeout);
+    return status;
 }
 
 }  // namespace tavrix::integration

@@ -140,17 +140,12 @@ class OverTheAirUpdateTest : public BusFixture {
 
     // Waits until "NextUpdate" is within a minute of now + seconds.
     bool waitForNextUpdateIn(double seconds, std::chrono::milliseconds timeout = 10s) {
-        const auto deadline = std::chrono::steady_clock::now() + timeout;
-        for (;;) {
-            auto next = nextUpdate();
-            if (next && std::fabs(*next - (now() + seconds)) < 60.0) {
-                return true;
-            }
-            if (std::chrono::steady_clock::now() > deadline) {
-                return false;
-            }
-            std::this_thread::sleep_for(20ms);
-        }
+        return pollUntil(
+            [&] {
+                auto next = nextUpdate();
+                return next && std::fabs(*next - (now() + seconds)) < 60.0;
+            },
+            timeout);
     }
 
     void setNextUpdate(double when) {
@@ -179,12 +174,7 @@ class OverTheAirUpdateTest : public BusFixture {
         EXPECT_EQ(client().copyTavrixValue("CarrierName"),
                   std::optional<plist::Value>("Bundle " + version));
         // The record goes with the purge, which follows the announcement.
-        const auto deadline = std::chrono::steady_clock::now() + 10s;
-        while (fs::exists(device().path(kPendingInstall)) &&
-               std::chrono::steady_clock::now() < deadline) {
-            std::this_thread::sleep_for(20ms);
-        }
-        EXPECT_FALSE(fs::exists(device().path(kPendingInstall)));
+        EXPECT_TRUE(pollUntil([&] { return !fs::exists(at(kPendingInstall)); }, 10s));
     }
 
     // tavrixctl with --json at the end of the line, where global options may also go; its

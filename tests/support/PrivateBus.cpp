@@ -1,12 +1,12 @@
 #include "PrivateBus.h"
 
 #include <fcntl.h>
-#include <poll.h>
 #include <signal.h>
 #include <spawn.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <map>
@@ -67,26 +67,16 @@ std::vector<std::string> busEnvironment() {
     return result;
 }
 
-// What the child prints on fd up to the first line break, or "" when it stops or takes too long.
+// What the child prints on fd up to the first line break, or "" when it ends first.
 std::string readLine(int fd) {
     std::string text;
-    const auto deadline = std::chrono::steady_clock::now() + 10s;
+    char buffer[256];
     while (text.find('\n') == std::string::npos) {
-        auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
-            deadline - std::chrono::steady_clock::now());
-        pollfd entry{fd, POLLIN, 0};
-        int ready = left > 0ms ? ::poll(&entry, 1, static_cast<int>(left.count())) : -1;
-        if (ready < 0 && (left <= 0ms || errno != EINTR)) {
+        ssize_t got = ::read(fd, buffer, sizeof buffer);
+        if (got == 0 || (got < 0 && errno != EINTR)) {
             return {};
         }
-        char buffer[256];
-        ssize_t got = ready > 0 ? ::read(fd, buffer, sizeof buffer) : -1;
-        if (got == 0 || (got < 0 && ready > 0 && errno != EINTR)) {
-            return {};
-        }
-        if (got > 0) {
-            text.append(buffer, static_cast<std::size_t>(got));
-        }
+        text.append(buffer, static_cast<std::size_t>(std::max<ssize_t>(got, 0)));
     }
     return text.substr(0, text.find('\n'));
 }

