@@ -318,12 +318,10 @@ TEST_F(BundleFlowTest, KilledAnywhereInSetTavrixIDTheNextLaunchFindsOneWholeStat
     for (const auto& [state, count] : statesFound) {
         std::cout << " " << state << ": " << count << ";";
     }
-    int repairs = 0;
-    for (const std::string& line : daemonLogLines()) {
-        repairs += line.find("disagree, linking again") != std::string::npos ||
-                   line.find("left by an interrupted change") != std::string::npos;
-    }
-    std::cout << " repairs: " << repairs << "\n";
+    std::cout << " repairs: "
+              << countLogLinesContaining("disagree, linking again") +
+                     countLogLinesContaining("left by an interrupted change")
+              << "\n";
 }
 
 }  // namespace

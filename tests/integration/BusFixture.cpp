@@ -20,12 +20,6 @@ using Clock = std::chrono::steady_clock;
 constexpr std::string_view kDaemonPreferences =
     "/var/mobile/Library/Preferences/com.zandor.tavrixservices.plist";
 
-void check(int result, const char* what) {
-    if (result < 0) {
-        throw std::runtime_error(std::string(what) + " failed: " + std::to_string(-result));
-    }
-}
-
 }  // namespace
 
 DeviceRoot::DeviceRoot() {
@@ -87,13 +81,14 @@ void DeviceRoot::writePropertyList(std::string_view absolutePath, const plist::D
 
 BusWatcher::BusWatcher(const std::string& address) : bus_(test::connectToBus(address)) {
     sd_bus_slot* slot = nullptr;
-    check(sd_bus_add_match(bus_.get(), &slot,
-                           "type='signal',sender='org.freedesktop.DBus',interface='org.freedesktop."
-                           "DBus',member='NameOwnerChanged',arg0='com.zandor.tavrixservicesd'",
-                           &onNameOwnerChanged, this),
-          "sd_bus_add_match");
+    test::check(
+        sd_bus_add_match(bus_.get(), &slot,
+                         "type='signal',sender='org.freedesktop.DBus',interface='org.freedesktop."
+                         "DBus',member='NameOwnerChanged',arg0='com.zandor.tavrixservicesd'",
+                         &onNameOwnerChanged, this),
+        "sd_bus_add_match");
     ownerSlot_.reset(slot);
-    check(
+    test::check(
         sd_bus_add_match(bus_.get(), &slot,
                          "type='signal',interface='com.zandor.NotificationCenter',member='Posted'",
                          &onPosted, this),
@@ -239,6 +234,13 @@ std::vector<std::string> BusFixture::daemonLogLines() const {
 int BusFixture::countLogLines(const std::string& line) const {
     const auto lines = daemonLogLines();
     return static_cast<int>(std::count(lines.begin(), lines.end(), line));
+}
+
+int BusFixture::countLogLinesContaining(const std::string& text) const {
+    const auto lines = daemonLogLines();
+    return static_cast<int>(std::count_if(lines.begin(), lines.end(), [&](const std::string& line) {
+        return line.find(text) != std::string::npos;
+    }));
 }
 
 bool BusFixture::waitForLogLine(const std::string& line, std::chrono::milliseconds timeout,

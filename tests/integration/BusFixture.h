@@ -78,6 +78,12 @@ class DeviceRoot {
     // The daemon's own preferences and the behavior settings domain of the mobile user.
     void writeDaemonPreferences(const plist::Dictionary& values);
     std::optional<plist::Value> readDaemonPreferences() const;
+    // One key of the daemon's preferences, or nothing.
+    std::optional<plist::Value> daemonPreference(const std::string& key) const {
+        auto preferences = readDaemonPreferences();
+        const plist::Value* value = preferences ? preferences->find(key) : nullptr;
+        return value != nullptr ? std::optional(*value) : std::nullopt;
+    }
     void writeBehaviorSettings(const plist::Dictionary& values);
     // The keep-alive flag file's text (trailing white space dropped), or nothing.
     std::optional<std::string> keepAliveFlag() const;
@@ -162,8 +168,9 @@ class BusFixture : public ::testing::Test {
 
     // The log's lines, in order.
     std::vector<std::string> daemonLogLines() const;
-    // How often line appears in the log as a whole line.
+    // How often line appears in the log as a whole line, or contains text.
     int countLogLines(const std::string& line) const;
+    int countLogLinesContaining(const std::string& text) const;
     // Waits until line has appeared count times (the log is a file, so this polls it).
     bool waitForLogLine(const std::string& line, std::chrono::milliseconds timeout = 10s,
                         int count = 1) const;

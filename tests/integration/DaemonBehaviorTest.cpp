@@ -8,15 +8,6 @@ namespace {
 
 using DaemonBehaviorTest = BusFixture;
 
-std::optional<plist::Value> storedTavrixID(const DeviceRoot& device) {
-    auto preferences = device.readDaemonPreferences();
-    if (!preferences) {
-        return std::nullopt;
-    }
-    const plist::Value* id = preferences->find("TavrixID");
-    return id == nullptr ? std::nullopt : std::optional<plist::Value>(*id);
-}
-
 // Everything else in place, a cellular radio alone refuses the ID and supports nothing.
 TEST_F(DaemonBehaviorTest, CellularDeviceRefusesTheIdAndSupportsNothing) {
     device().setCellularRadio(true);
@@ -25,7 +16,7 @@ TEST_F(DaemonBehaviorTest, CellularDeviceRefusesTheIdAndSupportsNothing) {
     auto caller = client();
 
     EXPECT_FALSE(caller.setTavrixID("xyz", std::nullopt));
-    EXPECT_EQ(storedTavrixID(device()), std::optional<plist::Value>("abc"));
+    EXPECT_EQ(device().daemonPreference("TavrixID"), std::optional<plist::Value>("abc"));
     EXPECT_FALSE(caller.isTavrixBundleSupported());
     EXPECT_EQ(caller.copyTavrixValue("CarrierName"), std::nullopt);
     EXPECT_FALSE(caller.checkForTavrixBundleUpdate());
@@ -37,7 +28,7 @@ TEST_F(DaemonBehaviorTest, CellularDeviceRefusesTheIdAndSupportsNothing) {
 TEST_F(DaemonBehaviorTest, IdIsStoredLowerCasedWhetherOrNotSupportIsEnabled) {
     auto caller = client();
     EXPECT_TRUE(caller.setTavrixID("AbC", std::nullopt));
-    EXPECT_EQ(storedTavrixID(device()), std::optional<plist::Value>("abc"));
+    EXPECT_EQ(device().daemonPreference("TavrixID"), std::optional<plist::Value>("abc"));
     EXPECT_FALSE(caller.isTavrixBundleSupported());
 
     EXPECT_TRUE(
@@ -45,9 +36,9 @@ TEST_F(DaemonBehaviorTest, IdIsStoredLowerCasedWhetherOrNotSupportIsEnabled) {
                            "COLE-\xC3\x84"
                            "BC",
                            std::vector<std::uint8_t>{}));
-    EXPECT_EQ(storedTavrixID(device()), std::optional<plist::Value>("\xC3\xA9"
-                                                                    "cole-\xC3\xA4"
-                                                                    "bc"));
+    EXPECT_EQ(device().daemonPreference("TavrixID"), std::optional<plist::Value>("\xC3\xA9"
+                                                                                 "cole-\xC3\xA4"
+                                                                                 "bc"));
     EXPECT_EQ(countLogLines("No bundle data given"), 1);
 }
 

@@ -41,14 +41,9 @@ TEST_F(DaemonLifecycleTest, StartsOnCallStaysForLaunchTransactionLeavesWhenIdleA
     ASSERT_TRUE(firstPid);
     EXPECT_TRUE(watcher().waitForNotification(kStartedNotification, 1, 5s));
 
-    const std::size_t starting = lineIndex("Starting the server: keepAlive = DISABLED");
-    const std::size_t begun = lineIndex(kLaunchBegun);
-    const std::size_t notifying = lineIndex("Notifying observers of start");
-    const std::size_t lineCount = daemonLogLines().size();
-    EXPECT_LT(starting, begun);
-    EXPECT_LT(begun, notifying);
-    EXPECT_LT(notifying, lineCount);
-    EXPECT_EQ(countLogLines("Starting the server."), 0);
+    // The launch transaction is open before the start is announced.
+    EXPECT_LT(lineIndex("Starting the server: keepAlive = DISABLED"), lineIndex(kLaunchBegun));
+    EXPECT_LT(lineIndex(kLaunchBegun), lineIndex("Notifying observers of start"));
 
     ASSERT_TRUE(waitForLogLine(kLaunchEnded, 20s));
     watcher().waitUntil([] { return false; }, 0ms);  // take in what the bus has reported so far
@@ -75,7 +70,6 @@ TEST_F(DaemonLifecycleTest, KeepAliveLeftByEarlierRunIsClearedAndSigtermExitsCle
     const auto pid = daemonPid();
     ASSERT_TRUE(pid);
     EXPECT_TRUE(waitForLogLine("Starting the server: keepAlive = ENABLED"));
-    EXPECT_TRUE(waitForLogLine("Keep alive status: Disabled"));
     EXPECT_EQ(device().keepAliveFlag(), std::optional<std::string>("0"));
 
     ASSERT_EQ(::kill(*pid, SIGTERM), 0);

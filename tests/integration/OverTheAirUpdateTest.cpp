@@ -131,11 +131,9 @@ class OverTheAirUpdateTest : public BusFixture {
     }
 
     std::optional<double> nextUpdate() {
-        auto preferences = device().readDaemonPreferences();
-        const plist::Value* value = preferences ? preferences->find("NextUpdate") : nullptr;
-        return value != nullptr && value->asDate() != nullptr
-                   ? std::optional(value->asDate()->secondsSinceReferenceDate)
-                   : std::nullopt;
+        auto next = device().daemonPreference("NextUpdate");
+        return next && next->asDate() ? std::optional(next->asDate()->secondsSinceReferenceDate)
+                                      : std::nullopt;
     }
 
     // Waits until "NextUpdate" is within a minute of now + seconds.
@@ -154,14 +152,6 @@ class OverTheAirUpdateTest : public BusFixture {
         plist::Dictionary values = *preferences->asDictionary();
         values.insert_or_assign("NextUpdate", plist::Date{when});
         device().writeDaemonPreferences(values);
-    }
-
-    int countLogLinesContaining(const std::string& text) const {
-        int count = 0;
-        for (const std::string& line : daemonLogLines()) {
-            count += line.find(text) != std::string::npos ? 1 : 0;
-        }
-        return count;
     }
 
     // The installed bundle of this version is linked and read as the behavior settings.

@@ -54,7 +54,6 @@ std::string quoted(const fs::path& path) {
     return "'" + path.string() + "'";
 }
 
-// The test's environment without anything that could point a daemon at another bus or root.
 std::vector<std::string> busEnvironment() {
     std::vector<std::string> result;
     for (char** entry = environ; *entry != nullptr; ++entry) {
@@ -112,16 +111,9 @@ int waitForExit(pid_t pid) {
     return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
 }
 
-void check(int result, const char* what) {
-    if (result < 0) {
-        throw std::runtime_error(std::string(what) + " failed: " + std::to_string(-result));
-    }
-}
-
 }  // namespace
 
-DbusDaemonProcess::DbusDaemonProcess(const fs::path& configFile, const fs::path& logFile,
-                                     const std::optional<std::vector<std::string>>& environment) {
+DbusDaemonProcess::DbusDaemonProcess(const fs::path& configFile, const fs::path& logFile) {
     UniqueFd log(::open(logFile.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644));
     int ends[2];
     if (!log || ::pipe2(ends, O_CLOEXEC) != 0) {
@@ -132,15 +124,15 @@ DbusDaemonProcess::DbusDaemonProcess(const fs::path& configFile, const fs::path&
     UniqueFd addressWrite(::fcntl(ends[1], F_DUPFD_CLOEXEC, 10));
     ::close(ends[1]);
 
-    std::vector<std::string> environmentCopy = environment.value_or(std::vector<std::string>());
+    std::vector<std::string> environment = busEnvironment();
     std::vector<char*> pointers;
-    for (std::string& entry : environmentCopy) {
+    for (std::string& entry : environment) {
         pointers.push_back(entry.data());
     }
     pointers.push_back(nullptr);
     pid_ = spawn(
         {"dbus-daemon", "--config-file=" + configFile.string(), "--nofork", "--print-address=3"},
-        log.get(), addressWrite.get(), environment ? pointers.data() : environ);
+        log.get(), addressWrite.get(), pointers.data());
     if (pid_ < 0) {
         throw std::runtime_error("cannot start dbus-daemon");
     }
@@ -196,6 +188,12 @@ CommandResult runCommand(const std::vector<std::string>& argv) {
     return result;
 }
 
+void check(int result, const char* what) {
+    if (result < 0) {
+        throw std::runtime_error(std::string(what) + " failed: " + std::to_string(-result));
+    }
+}
+
 platform::BusPtr connectToBus(const std::string& address) {
     sd_bus* raw = nullptr;
     check(sd_bus_new(&raw), "sd_bus_new");
@@ -241,7 +239,7 @@ PrivateBus::PrivateBus(const std::optional<ActivatedDaemon>& daemon,
               "<busconfig>\n  <type>session</type>\n  <listen>unix:path=" +
                   (directory / "socket").string() + "</listen>\n  <auth>EXTERNAL</auth>\n" + extra +
                   "</busconfig>\n");
-    process_.emplace(directory / "bus.conf", directory / "bus.log", busEnvironment());
+    process_.emplace(directory / "bus.conf", directory / "bus.log");
 }
 
 std::vector<DaemonLaunch> PrivateBus::launches() const {

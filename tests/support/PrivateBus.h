@@ -20,10 +20,11 @@ namespace tavrix::test {
 // address read from the descriptor it prints it on. SIGTERM, then SIGKILL, when it goes.
 class DbusDaemonProcess {
   public:
-    // environment: the bus's whole environment; without one it inherits the test's. Throws
-    // std::runtime_error, with the log, when the bus ends before it reports its address.
-    DbusDaemonProcess(const std::filesystem::path& configFile, const std::filesystem::path& logFile,
-                      const std::optional<std::vector<std::string>>& environment = std::nullopt);
+    // Its environment is the test's without anything that could point the services it starts at
+    // another bus or root. Throws std::runtime_error, with the log, when the bus ends before it
+    // reports its address.
+    DbusDaemonProcess(const std::filesystem::path& configFile,
+                      const std::filesystem::path& logFile);
     ~DbusDaemonProcess() { stop(); }
     DbusDaemonProcess(const DbusDaemonProcess&) = delete;
     DbusDaemonProcess& operator=(const DbusDaemonProcess&) = delete;
@@ -43,6 +44,9 @@ struct CommandResult {
 };
 // Runs argv (argv[0] a path) to its end with the test's environment.
 CommandResult runCommand(const std::vector<std::string>& argv);
+
+// Throws std::runtime_error naming what failed when result is an error.
+void check(int result, const char* what);
 
 // A new client connection to the bus at address, its unique name assigned; throws
 // std::runtime_error when that fails.

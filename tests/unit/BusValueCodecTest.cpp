@@ -28,9 +28,7 @@ class BusValueCodec : public testing::Test {
   protected:
     BusValueCodec() : sender_(daemon_.connect()), receiver_(daemon_.connect()) {
         const char* name = nullptr;
-        if (sd_bus_get_unique_name(receiver_.get(), &name) < 0) {
-            throw std::runtime_error("the receiver has no name");
-        }
+        test::check(sd_bus_get_unique_name(receiver_.get(), &name), "sd_bus_get_unique_name");
         receiverName_ = name;
     }
 
