@@ -188,6 +188,20 @@ std::string BusFixture::linkTarget(std::string_view absolutePath) const {
     return error ? std::string() : target.string();
 }
 
+std::string BusFixture::linkState() const {
+    std::error_code error;
+    const fs::path bundle = fs::canonical(at(kBundleLink), error);
+    const std::string carrierFile =
+        error ? std::string() : fs::canonical(at(kPreferencesLink), error).string();
+    if (error || !fs::is_directory(bundle) || !fs::is_regular_file(carrierFile)) {
+        return "links dangle";
+    }
+    return carrierFile.starts_with(bundle.string() + "/") ||
+                   carrierFile.starts_with(at(kOverlayDirectory).string() + "/")
+               ? "links agree"
+               : "links disagree";
+}
+
 std::string BusFixture::linkedVersion() const {
     auto info = plist::readFile((at(kBundleLink) / "Info.plist").string());
     const plist::Value* version = info ? info->find("QZBundleVersion") : nullptr;

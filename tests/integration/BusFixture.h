@@ -35,6 +35,7 @@ inline constexpr const char* kChanged = "kTVXBehaviorBundleChangedNotification";
 // Paths of the device.
 inline constexpr const char* kSystemBundle = "/System/Library/TavrixBundles/Tablet/Default.bundle";
 inline constexpr const char* kUserBundle = "/var/mobile/Library/TavrixBundles/Default.bundle";
+inline constexpr const char* kOverlayDirectory = "/var/mobile/Library/TavrixBundles/Overlay";
 inline constexpr const char* kBundleLink = "/var/mobile/Library/Tavrix.bundle";
 inline constexpr const char* kPreferencesLink =
     "/var/mobile/Library/Preferences/com.zandor.tavrix.plist";
@@ -140,6 +141,9 @@ class BusFixture : public ::testing::Test {
     }
     // Where the device's link at absolutePath points, or "" when it is no link.
     std::string linkTarget(std::string_view absolutePath) const;
+    // "links agree" when both links resolve and the carrier file lies in the linked bundle or
+    // among the generated files; else "links dangle" or "links disagree".
+    std::string linkState() const;
     // The version of the bundle the bundle link points at, or "".
     std::string linkedVersion() const;
     // A bundle directory: Info.plist naming the version, and the base carrier file.
