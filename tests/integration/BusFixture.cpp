@@ -60,14 +60,6 @@ void DeviceRoot::writeBehaviorSettings(const plist::Dictionary& values) {
     writePropertyList("/var/mobile/Library/Preferences/com.zandor.tavrix.plist", values);
 }
 
-std::optional<std::string> DeviceRoot::keepAliveFlag() const {
-    if (!fs::exists(runtimeDirectory() / "keep-alive")) {
-        return std::nullopt;
-    }
-    std::string text = test::readText(runtimeDirectory() / "keep-alive");
-    return text.substr(0, text.find_last_not_of("\n ") + 1);
-}
-
 void DeviceRoot::writePropertyList(std::string_view absolutePath, const plist::Dictionary& values) {
     fs::path target = path(absolutePath);
     fs::create_directories(target.parent_path());

@@ -86,8 +86,8 @@ class DeviceRoot {
         return value != nullptr ? std::optional(*value) : std::nullopt;
     }
     void writeBehaviorSettings(const plist::Dictionary& values);
-    // The keep-alive flag file's text (trailing white space dropped), or nothing.
-    std::optional<std::string> keepAliveFlag() const;
+    // The keep-alive flag file's text, "" when there is none.
+    std::string keepAliveFlag() const { return test::readText(runtimeDirectory() / "keep-alive"); }
 
   private:
     // In one step, so that the daemon never reads half of the file and its cache sees a new one.

@@ -70,12 +70,12 @@ TEST_F(DaemonLifecycleTest, KeepAliveLeftByEarlierRunIsClearedAndSigtermExitsCle
     const auto pid = daemonPid();
     ASSERT_TRUE(pid);
     EXPECT_TRUE(waitForLogLine("Starting the server: keepAlive = ENABLED"));
-    EXPECT_EQ(device().keepAliveFlag(), std::optional<std::string>("0"));
+    EXPECT_EQ(device().keepAliveFlag(), "0\n");
 
     ASSERT_EQ(::kill(*pid, SIGTERM), 0);
     EXPECT_TRUE(waitForNoNameOwner());
     EXPECT_EQ(waitForDaemonExit(*pid), std::optional<int>(0));
-    EXPECT_EQ(device().keepAliveFlag(), std::optional<std::string>("0"));
+    EXPECT_EQ(device().keepAliveFlag(), "0\n");
 }
 
 class DaemonActivityTest : public DaemonLifecycleTest {

@@ -547,7 +547,7 @@ TEST_F(OverTheAirKeepAliveTest, ScheduledCheckKeepsTheDaemonUntilTheDownloadIsIn
     expectInstalled("2");
     EXPECT_TRUE(waitForNextUpdateIn(kFifteenDays));
     EXPECT_EQ(waitForDaemonExit(*second), std::optional<int>(0));
-    EXPECT_EQ(device().keepAliveFlag(), std::optional<std::string>("0"));
+    EXPECT_EQ(device().keepAliveFlag(), "0\n");
     // Start-up also found "NextUpdate" past and re-armed the job; the check still ran once.
     EXPECT_EQ(countLogLines("*********** Beginning Corvex transaction : Update Check ***********"),
               1);

@@ -9,7 +9,10 @@
 #include <algorithm>
 #include <cerrno>
 #include <chrono>
+#include <cstdio>
+#include <cstring>
 #include <map>
+#include <memory>
 #include <sstream>
 #include <stdexcept>
 #include <thread>
@@ -64,20 +67,6 @@ std::vector<std::string> busEnvironment() {
         }
     }
     return result;
-}
-
-// What the child prints on fd up to the first line break, or "" when it ends first.
-std::string readLine(int fd) {
-    std::string text;
-    char buffer[256];
-    while (text.find('\n') == std::string::npos) {
-        ssize_t got = ::read(fd, buffer, sizeof buffer);
-        if (got == 0 || (got < 0 && errno != EINTR)) {
-            return {};
-        }
-        text.append(buffer, static_cast<std::size_t>(std::max<ssize_t>(got, 0)));
-    }
-    return text.substr(0, text.find('\n'));
 }
 
 // Starts argv[0] (a path, or a name looked up in PATH) with stdin from /dev/null, stdout and
@@ -137,7 +126,12 @@ DbusDaemonProcess::DbusDaemonProcess(const fs::path& configFile, const fs::path&
         throw std::runtime_error("cannot start dbus-daemon");
     }
     addressWrite.reset();
-    address_ = readLine(addressRead.get());
+    // The first line it prints, or nothing when it ends first.
+    std::unique_ptr<FILE, int (*)(FILE*)> in(::fdopen(addressRead.release(), "r"), &std::fclose);
+    char line[512] = "";
+    if (in && std::fgets(line, sizeof line, in.get()) != nullptr && std::strchr(line, '\n')) {
+        address_.assign(line, std::strcspn(line, "\n"));
+    }
     if (address_.empty()) {
         stop();
         throw std::runtime_error("dbus-daemon did not report its address:\n" +
