@@ -15,7 +15,7 @@
 #include <string>
 #include <vector>
 
-#include "DbusDaemonProcess.h"
+#include "PrivateBus.h"
 
 namespace tavrix::bench {
 

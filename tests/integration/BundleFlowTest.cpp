@@ -12,20 +12,12 @@
 #include <thread>
 
 #include "BusFixture.h"
-#include "CommandRunner.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix::integration {
 namespace {
 
 namespace fs = std::filesystem;
-
-constexpr const char* kChanged = "kTVXBehaviorBundleChangedNotification";
-constexpr const char* kSystemBundle = "/System/Library/TavrixBundles/Tablet/Default.bundle";
-constexpr const char* kUserBundle = "/var/mobile/Library/TavrixBundles/Default.bundle";
-constexpr const char* kOverlayDirectory = "/var/mobile/Library/TavrixBundles/Overlay";
-constexpr const char* kBundleLink = "/var/mobile/Library/Tavrix.bundle";
-constexpr const char* kPreferencesLink = "/var/mobile/Library/Preferences/com.zandor.tavrix.plist";
 
 std::string matchResult(const char* changeType) {
     return std::string("Carrier Bundle Match Result: ") + changeType;
@@ -49,55 +41,17 @@ plist::Dictionary baseCarrierFile(const std::string& name) {
 
 class BundleFlowTest : public BusFixture {
   protected:
-    BundleFlowTest() { busOptions.idleExitSeconds = 30; }
-
-    fs::path at(const char* absolutePath) { return device().path(absolutePath); }
-
-    // A bundle directory: Info.plist with the version, the base carrier file, and an
-    // "overrides_" file for the test device's hardware model when asked.
-    fs::path writeBundle(const fs::path& directory, const std::string& version,
-                         bool deviceOverlay = false) {
-        fs::create_directories(directory);
-        plist::Dictionary info = {{"QZBundleIdentifier", "com.zandor.tavrix.bundle.test"},
-                                  {"QZBundleVersion", version}};
-        EXPECT_TRUE(plist::writeFile((directory / "Info.plist").string(), plist::Value(info)));
-        EXPECT_TRUE(plist::writeFile((directory / "behavior.plist").string(),
-                                     plist::Value(baseCarrierFile("Bundle " + version))));
+    // The bundle packed as senders pack it, with an "overrides_" file for the test device's
+    // hardware model when asked.
+    std::vector<std::uint8_t> packBundle(const std::string& version, bool deviceOverlay = false) {
+        fs::path source = device().base() / ("src-" + version);
+        writeBundle(source, version, baseCarrierFile("Bundle " + version));
         if (deviceOverlay) {
             plist::Dictionary overlay = {{"Data", plist::Dictionary{{"MaxRate", 8}}}};
-            EXPECT_TRUE(plist::writeFile((directory / "overrides_T71AP_X1.plist").string(),
+            EXPECT_TRUE(plist::writeFile((source / "overrides_T71AP_X1.plist").string(),
                                          plist::Value(overlay)));
         }
-        return directory;
-    }
-
-    // The bundle packed by bsdtar in the given format ("tgz", "tar.Z", "cpio.gz", "cpio.Z").
-    std::vector<std::uint8_t> packBundle(const std::string& version, const std::string& format,
-                                         bool deviceOverlay = false) {
-        fs::path source = device().base() / ("src-" + version + "-" + format);
-        fs::remove_all(source);
-        writeBundle(source, version, deviceOverlay);
-        fs::path archive = device().base() / ("bundle-" + version + "." + format);
-        std::vector<std::string> argv = {"/usr/bin/bsdtar", "-c"};
-        argv.push_back(format.ends_with(".Z") ? "-Z" : "-z");
-        if (format.starts_with("cpio")) {
-            argv.insert(argv.end(), {"--format", "cpio"});
-        }
-        argv.insert(argv.end(), {"-f", archive.string(), "-C", source.string(), "."});
-        CommandResult packed = runCommand(argv);
-        EXPECT_EQ(packed.status, 0) << packed.output;
-        return readBytes(archive);
-    }
-
-    static std::vector<std::uint8_t> readBytes(const fs::path& path) {
-        std::ifstream in(path, std::fstream::binary);
-        return {std::istreambuf_iterator<char>(in), {}};
-    }
-
-    std::string linkTarget(const char* link) {
-        std::error_code error;
-        fs::path target = fs::read_symlink(at(link), error);
-        return error ? std::string() : target.string();
+        return pack(source);
     }
 
     std::optional<plist::Value> linkedCarrierFile() {
@@ -127,11 +81,9 @@ class BundleFlowTest : public BusFixture {
 // the same call again reports no change, posts nothing and leaves the links alone.
 TEST_F(BundleFlowTest, FirstSetLinksTheOverlaidCarrierFileAndRepeatingItChangesNothing) {
     device().writeDaemonPreferences({{"EnableSupport", true}});
-    auto payload = packBundle("10", "tgz");
+    auto payload = packBundle("10");
     fs::path payloadFile = device().base() / "payload.tgz";
-    std::ofstream(payloadFile, std::fstream::binary)
-        .write(reinterpret_cast<const char*>(payload.data()),
-               static_cast<std::streamsize>(payload.size()));
+    test::writeText(payloadFile, std::string(payload.begin(), payload.end()));
     const std::vector<std::string> setID = {
         TAVRIX_CTL_PATH, "--address", busAddress(),        "set-id",
         "AbC",           "--bundle",  payloadFile.string()};
@@ -223,7 +175,7 @@ TEST_F(BundleFlowTest, BehaviorOverlayTransitionsSwitchOrUpdate) {
          (overlays / "id+behavior+Default.bundle+listed-too+10.plist").string()},
         {"not-listed", "kBundleChangeTypeOverrideSwitch", baseFile},
     };
-    auto payload = packBundle("10", "tgz");
+    auto payload = packBundle("10");
     bool first = true;
     for (const Step& expected : steps) {
         ASSERT_TRUE(caller.setTavrixID(expected.id, first ? std::optional(payload) : std::nullopt));
@@ -239,7 +191,7 @@ TEST_F(BundleFlowTest, BehaviorOverlayTransitionsSwitchOrUpdate) {
 TEST_F(BundleFlowTest, DeviceOverlayKeepsTheSectionAndBehaviorOverlayBuildsOnIt) {
     auto caller = client();
     const fs::path overlays = at(kOverlayDirectory);
-    ASSERT_TRUE(caller.setTavrixID("not-listed", packBundle("10", "tgz", /*deviceOverlay=*/true)));
+    ASSERT_TRUE(caller.setTavrixID("not-listed", packBundle("10", /*deviceOverlay=*/true)));
     EXPECT_EQ(linkTarget(kPreferencesLink),
               (overlays / "device+behavior+Default.bundle+T71AP+10.plist").string());
     auto deviceOverlaid = linkedCarrierFile();
@@ -263,7 +215,7 @@ TEST_F(BundleFlowTest, DeviceOverlayKeepsTheSectionAndBehaviorOverlayBuildsOnIt)
 TEST_F(BundleFlowTest, DirectoryInPlaceOfTheBundleLinkIsReportedAndLeftAlone) {
     fs::create_directories(at(kBundleLink) / "keep");
     auto caller = client();
-    ASSERT_TRUE(caller.setTavrixID("abc", packBundle("10", "tgz")));
+    ASSERT_TRUE(caller.setTavrixID("abc", packBundle("10")));
     EXPECT_TRUE(waitForLogLine("Could not link bundle file!"));
     EXPECT_TRUE(fs::is_directory(at(kBundleLink) / "keep"));
     EXPECT_FALSE(fs::exists(fs::symlink_status(at(kPreferencesLink))));
@@ -275,23 +227,16 @@ TEST_F(BundleFlowTest, DirectoryInPlaceOfTheBundleLinkIsReportedAndLeftAlone) {
     EXPECT_EQ(linkTarget(kBundleLink), at(kUserBundle).string());
 }
 
-// Iterations of the crash loops: TAVRIX_CRASH_LOOP_ITERATIONS when set (scripts/crash-loop.sh),
-// else enough for the test to run well under a minute.
-int crashLoopIterations() {
-    const char* text = std::getenv("TAVRIX_CRASH_LOOP_ITERATIONS");
-    return text != nullptr && std::atoi(text) > 0 ? std::atoi(text) : 30;
-}
-
 // A client's SetTavrixID with a multi-megabyte payload, the daemon killed at a random instant of
 // it: every next launch finds (or makes) one whole state: both links resolve, the carrier file is
 // in the linked bundle or the generated files and parses, the daemon preferences parse. The call
 // made again ends with the payload's bundle linked. Nothing of the interrupted calls stays.
 TEST_F(BundleFlowTest, KilledAnywhereInSetTavrixIDTheNextLaunchFindsOneWholeState) {
-    writeBundle(at(kSystemBundle), "9");
+    writeBundle(at(kSystemBundle), "9", baseCarrierFile("Bundle 9"));
     // Two versions, each with a large file that does not compress and many small ones.
     auto packLarge = [&](const std::string& version) {
         const fs::path source = device().base() / ("large-" + version);
-        writeBundle(source, version);
+        writeBundle(source, version, baseCarrierFile("Bundle " + version));
         std::mt19937 bytes(static_cast<unsigned>(std::stoi(version)));
         std::string bulk(3 << 20, '\0');
         for (char& byte : bulk) {
@@ -302,36 +247,11 @@ TEST_F(BundleFlowTest, KilledAnywhereInSetTavrixIDTheNextLaunchFindsOneWholeStat
         for (int i = 0; i < 100; ++i) {
             std::ofstream(source / ("Resources/small/" + std::to_string(i) + ".txt")) << version;
         }
-        const fs::path archive = device().base() / ("large-" + version + ".tgz");
-        EXPECT_EQ(
-            runCommand({"/usr/bin/bsdtar", "-czf", archive.string(), "-C", source.string(), "."})
-                .status,
-            0);
-        return readBytes(archive);
+        return pack(source);
     };
     const std::vector<std::pair<std::string, std::vector<std::uint8_t>>> payloads = {
         {"10", packLarge("10")}, {"11", packLarge("11")}};
 
-    // Whether both links resolve and the carrier file lies in the linked bundle or among the
-    // generated files.
-    auto linkState = [&]() -> std::string {
-        std::error_code error;
-        const fs::path bundle = fs::canonical(at(kBundleLink), error);
-        const std::string carrierFile =
-            error ? std::string() : fs::canonical(at(kPreferencesLink), error).string();
-        if (error || !fs::is_directory(bundle) || !fs::is_regular_file(carrierFile)) {
-            return "links dangle";
-        }
-        return carrierFile.starts_with(bundle.string() + "/") ||
-                       carrierFile.starts_with(at(kOverlayDirectory).string() + "/")
-                   ? "links agree"
-                   : "links disagree";
-    };
-    auto linkedVersion = [&]() -> std::string {
-        auto info = plist::readFile((at(kBundleLink) / "Info.plist").string());
-        const plist::Value* version = info ? info->find("QZBundleVersion") : nullptr;
-        return version != nullptr && version->asString() != nullptr ? *version->asString() : "";
-    };
     const auto started = std::chrono::steady_clock::now();
     ASSERT_TRUE(client().setTavrixID("abc", payloads[0].second));
     const auto callTime = std::chrono::steady_clock::now() - started;
@@ -381,12 +301,10 @@ TEST_F(BundleFlowTest, KilledAnywhereInSetTavrixIDTheNextLaunchFindsOneWholeStat
     for (const auto& [state, count] : statesFound) {
         std::cout << " " << state << ": " << count << ";";
     }
-    int repairs = 0;
-    for (const std::string& line : daemonLogLines()) {
-        repairs += line.find("disagree, linking again") != std::string::npos ||
-                   line.find("left by an interrupted change") != std::string::npos;
-    }
-    std::cout << " repairs: " << repairs << "\n";
+    std::cout << " repairs: "
+              << countLogLinesContaining("disagree, linking again") +
+                     countLogLinesContaining("left by an interrupted change")
+              << "\n";
 }
 
 }  // namespace

@@ -1,63 +1,226 @@
 #include "BusFixture.h"
 
 #include <signal.h>
+#include <unistd.h>
 
+#include <algorithm>
 #include <iostream>
-#include <set>
 #include <sstream>
+#include <stdexcept>
 #include <thread>
+
+#include "plist/PropertyListFormat.h"
 
 namespace tavrix::integration {
 namespace {
 
+namespace fs = std::filesystem;
 using Clock = std::chrono::steady_clock;
 
-// The log and the launch records are files written by other processes: they are polled.
-constexpr auto kFilePollInterval = 20ms;
-constexpr auto kStopTimeout = 10s;
+constexpr std::string_view kDaemonPreferences =
+    "/var/mobile/Library/Preferences/com.zandor.tavrixservices.plist";
 
 }  // namespace
 
+DeviceRoot::DeviceRoot() {
+    test::writeText(path("/etc/passwd"),
+                    "root:x:0:0:root:/root:/bin/sh\nmobile:x:" + std::to_string(::getuid()) + ":" +
+                        std::to_string(::getgid()) +
+                        ":Mobile User:/var/mobile:/usr/sbin/nologin\n");
+    fs::create_directories(path("/var/mobile/Library/Preferences"));
+    fs::create_directories(runtimeDirectory());
+    setCellularRadio(false);
+}
+
+void DeviceRoot::setCellularRadio(bool present) {
+    // Everything the device information service is asked for, so that no answer comes from the
+    // machine running the tests.
+    writePropertyList("/etc/tavrix/DeviceInfo.plist", {
+                                                          {"contains-cellular-radio", present},
+                                                          {"wi-fi", true},
+                                                          {"DeviceClass", "Tablet"},
+                                                          {"ProductType", "Tablet7,1"},
+                                                          {"ProductVersion", "9.1"},
+                                                          {"BuildVersion", "13B100"},
+                                                          {"ReleaseType", "User"},
+                                                          {"HWModelStr", "T71AP"},
+                                                          {"SerialNumber", "TESTSERIAL01"},
+                                                      });
+}
+
+void DeviceRoot::writeDaemonPreferences(const plist::Dictionary& values) {
+    writePropertyList(kDaemonPreferences, values);
+}
+
+std::optional<plist::Value> DeviceRoot::readDaemonPreferences() const {
+    return plist::readFile(path(kDaemonPreferences).string());
+}
+
+void DeviceRoot::writeBehaviorSettings(const plist::Dictionary& values) {
+    writePropertyList("/var/mobile/Library/Preferences/com.zandor.tavrix.plist", values);
+}
+
+void DeviceRoot::writePropertyList(std::string_view absolutePath, const plist::Dictionary& values) {
+    fs::path target = path(absolutePath);
+    fs::create_directories(target.parent_path());
+    fs::path temporary = target;
+    temporary += ".new";
+    if (!plist::writeFile(temporary.string(), plist::Value(values))) {
+        throw std::runtime_error("cannot write " + temporary.string());
+    }
+    fs::rename(temporary, target);
+}
+
+BusWatcher::BusWatcher(const std::string& address) : bus_(test::connectToBus(address)) {
+    sd_bus_slot* slot = nullptr;
+    test::check(
+        sd_bus_add_match(bus_.get(), &slot,
+                         "type='signal',sender='org.freedesktop.DBus',interface='org.freedesktop."
+                         "DBus',member='NameOwnerChanged',arg0='com.zandor.tavrixservicesd'",
+                         &onNameOwnerChanged, this),
+        "sd_bus_add_match");
+    ownerSlot_.reset(slot);
+    test::check(
+        sd_bus_add_match(bus_.get(), &slot,
+                         "type='signal',interface='com.zandor.NotificationCenter',member='Posted'",
+                         &onPosted, this),
+        "sd_bus_add_match");
+    postedSlot_.reset(slot);
+    // The bus is new: nobody owns the name yet.
+}
+
+bool BusWatcher::waitUntil(const std::function<bool()>& done, std::chrono::milliseconds timeout) {
+    const auto deadline = Clock::now() + timeout;
+    for (;;) {
+        int processed = 0;
+        while ((processed = sd_bus_process(bus_.get(), nullptr)) > 0) {
+        }
+        if (done()) {
+            return true;
+        }
+        auto left = std::chrono::duration_cast<std::chrono::microseconds>(deadline - Clock::now());
+        if (processed < 0 || left.count() <= 0) {
+            return false;
+        }
+        sd_bus_wait(bus_.get(), static_cast<std::uint64_t>(left.count()));
+    }
+}
+
+int BusWatcher::onNameOwnerChanged(sd_bus_message* message, void* self, sd_bus_error*) {
+    auto* watcher = static_cast<BusWatcher*>(self);
+    const char* name = nullptr;
+    const char* oldOwner = nullptr;
+    const char* newOwner = nullptr;
+    if (sd_bus_message_read(message, "sss", &name, &oldOwner, &newOwner) >= 0) {
+        watcher->owner_ = newOwner;
+        watcher->releases_ += *oldOwner != '\0' && *newOwner == '\0' ? 1 : 0;
+    }
+    return 0;
+}
+
+int BusWatcher::onPosted(sd_bus_message* message, void* self, sd_bus_error*) {
+    const char* name = nullptr;
+    if (sd_bus_message_read(message, "s", &name) >= 0) {
+        ++static_cast<BusWatcher*>(self)->notifications_[name];
+    }
+    return 0;
+}
+
 void BusFixture::SetUp() {
-    bus_ = std::make_unique<PrivateBus>(device_, busOptions);
+    bus_ = std::make_unique<test::PrivateBus>(
+        test::ActivatedDaemon{TAVRIX_DAEMON_PATH, device_.root(), device_.runtimeDirectory(),
+                              idleExitSeconds},
+        policyFile);
     watcher_ = std::make_unique<BusWatcher>(bus_->address());
 }
 
 void BusFixture::TearDown() {
-    if (bus_ != nullptr) {
-        stopDaemons();
-        if (HasFailure()) {
-            std::cerr << "----- daemon log (" << bus_->logPath().string() << ") -----\n"
-                      << bus_->log() << "----- end of daemon log -----\n";
-        }
+    if (bus_ == nullptr) {
+        return;
     }
-    watcher_.reset();
-    bus_.reset();
-}
-
-void BusFixture::stopDaemons() {
+    // SIGTERM to every daemon still running; each must leave with status 0.
     std::set<pid_t> running;
-    for (const DaemonLaunch& launch : bus_->launches()) {
+    for (const test::DaemonLaunch& launch : bus_->launches()) {
         if (!launch.exitStatus) {
             running.insert(launch.pid);
+            ::kill(launch.pid, SIGTERM);
         }
     }
     for (pid_t pid : running) {
-        ::kill(pid, SIGTERM);
-    }
-    for (pid_t pid : running) {
-        if (!waitForDaemonExit(pid, kStopTimeout)) {
+        if (!waitForDaemonExit(pid)) {
             ADD_FAILURE() << "daemon " << pid << " did not leave after SIGTERM";
             ::kill(pid, SIGKILL);
         }
     }
-    for (const DaemonLaunch& launch : bus_->launches()) {
-        if (killed_.contains(launch.pid)) {
-            continue;
-        }
-        EXPECT_EQ(launch.exitStatus, std::optional<int>(0))
-            << "daemon " << launch.pid << " exited with an unexpected status";
+    for (const test::DaemonLaunch& launch : bus_->launches()) {
+        EXPECT_TRUE(killed_.contains(launch.pid) || launch.exitStatus == 0)
+            << "daemon " << launch.pid << " exited with " << launch.exitStatus.value_or(-1);
     }
+    if (HasFailure()) {
+        std::cerr << "----- daemon log -----\n" << bus_->log() << "----- end of daemon log -----\n";
+    }
+}
+
+std::optional<pid_t> BusFixture::daemonPid() {
+    sd_bus_message* reply = nullptr;
+    bus::BusError error;
+    if (sd_bus_call_method(watcher_->bus(), "org.freedesktop.DBus", "/org/freedesktop/DBus",
+                           "org.freedesktop.DBus", "GetConnectionUnixProcessID", error.get(),
+                           &reply, "s", kDaemonBusName) < 0) {
+        return std::nullopt;
+    }
+    bus::BusMessagePtr owned(reply);
+    std::uint32_t pid = 0;
+    return sd_bus_message_read(reply, "u", &pid) >= 0 ? std::optional<pid_t>(pid) : std::nullopt;
+}
+
+std::string BusFixture::linkTarget(std::string_view absolutePath) const {
+    std::error_code error;
+    fs::path target = fs::read_symlink(at(absolutePath), error);
+    return error ? std::string() : target.string();
+}
+
+std::string BusFixture::linkState() const {
+    std::error_code error;
+    const fs::path bundle = fs::canonical(at(kBundleLink), error);
+    const std::string carrierFile =
+        error ? std::string() : fs::canonical(at(kPreferencesLink), error).string();
+    if (error || !fs::is_directory(bundle) || !fs::is_regular_file(carrierFile)) {
+        return "links dangle";
+    }
+    return carrierFile.starts_with(bundle.string() + "/") ||
+                   carrierFile.starts_with(at(kOverlayDirectory).string() + "/")
+               ? "links agree"
+               : "links disagree";
+}
+
+std::string BusFixture::linkedVersion() const {
+    auto info = plist::readFile((at(kBundleLink) / "Info.plist").string());
+    const plist::Value* version = info ? info->find("QZBundleVersion") : nullptr;
+    return version != nullptr && version->asString() != nullptr ? *version->asString() : "";
+}
+
+void BusFixture::writeBundle(const fs::path& directory, const std::string& version,
+                             const plist::Dictionary& carrierFile) const {
+    fs::create_directories(directory);
+    EXPECT_TRUE(plist::writeFile(
+        (directory / "Info.plist").string(),
+        plist::Value(plist::Dictionary{{"QZBundleIdentifier", "com.zandor.tavrix.bundle.test"},
+                                       {"QZBundleVersion", version}})));
+    EXPECT_TRUE(
+        plist::writeFile((directory / "behavior.plist").string(), plist::Value(carrierFile)));
+}
+
+std::vector<std::uint8_t> BusFixture::pack(const fs::path& directory,
+                                           const std::vector<std::string>& options) const {
+    const fs::path archive = directory.string() + ".archive";
+    std::vector<std::string> argv = {"/usr/bin/bsdtar", "-c", "-f", archive.string()};
+    argv.insert(argv.end(), options.begin(), options.end());
+    argv.insert(argv.end(), {"-C", directory.string(), "."});
+    CommandResult packed = runCommand(argv);
+    EXPECT_EQ(packed.status, 0) << packed.output;
+    const std::string bytes = test::readText(archive);
+    return {bytes.begin(), bytes.end()};
 }
 
 bool BusFixture::killDaemon(pid_t pid) {
@@ -75,39 +238,34 @@ std::vector<std::string> BusFixture::daemonLogLines() const {
 }
 
 int BusFixture::countLogLines(const std::string& line) const {
-    int count = 0;
-    for (const std::string& candidate : daemonLogLines()) {
-        count += candidate == line ? 1 : 0;
-    }
-    return count;
+    const auto lines = daemonLogLines();
+    return static_cast<int>(std::count(lines.begin(), lines.end(), line));
+}
+
+int BusFixture::countLogLinesContaining(const std::string& text) const {
+    const auto lines = daemonLogLines();
+    return static_cast<int>(std::count_if(lines.begin(), lines.end(), [&](const std::string& line) {
+        return line.find(text) != std::string::npos;
+    }));
 }
 
 bool BusFixture::waitForLogLine(const std::string& line, std::chrono::milliseconds timeout,
                                 int count) const {
-    const auto deadline = Clock::now() + timeout;
-    while (countLogLines(line) < count) {
-        if (Clock::now() > deadline) {
-            return false;
-        }
-        std::this_thread::sleep_for(kFilePollInterval);
-    }
-    return true;
+    return pollUntil([&] { return countLogLines(line) >= count; }, timeout);
 }
 
 std::optional<int> BusFixture::waitForDaemonExit(pid_t pid,
                                                  std::chrono::milliseconds timeout) const {
-    const auto deadline = Clock::now() + timeout;
-    for (;;) {
-        for (const DaemonLaunch& launch : bus_->launches()) {
-            if (launch.pid == pid && launch.exitStatus) {
-                return launch.exitStatus;
+    std::optional<int> status;
+    pollUntil(
+        [&] {
+            for (const test::DaemonLaunch& launch : bus_->launches()) {
+                status = launch.pid == pid ? launch.exitStatus : status;
             }
-        }
-        if (Clock::now() > deadline) {
-            return std::nullopt;
-        }
-        std::this_thread::sleep_for(kFilePollInterval);
-    }
+            return status.has_value();
+        },
+        timeout);
+    return status;
 }
 
 }  // namespace tavrix::integration

@@ -1,31 +1,134 @@
 // The fixture of the integration tests: a device root in a temporary directory, a private bus
 // that starts the real daemon on demand, and the test's own connection watching the bus. When a
-// test fails, the daemon's log is printed; afterwards the daemon is stopped (it must exit with 0)
-// and everything is removed.
+// test fails, the log is printed; afterwards every daemon is stopped (each must exit with 0).
 #pragma once
 
 #include <gtest/gtest.h>
 #include <sys/types.h>
 
 #include <chrono>
+#include <cstdlib>
+#include <functional>
+#include <map>
 #include <memory>
 #include <optional>
 #include <set>
 #include <string>
+#include <string_view>
+#include <thread>
 #include <vector>
 
-#include "BusWatcher.h"
-#include "DeviceRoot.h"
 #include "PrivateBus.h"
-#include "bus/BusHandles.h"
 #include "client/TavrixClient.h"
+#include "plist/Value.h"
 
 namespace tavrix::integration {
 
 using namespace std::chrono_literals;
+using test::CommandResult;
+using test::runCommand;
 
+inline constexpr const char* kDaemonBusName = "com.zandor.tavrixservicesd";
 inline constexpr const char* kDaemonObjectPath = "/com/zandor/tavrixservicesd";
 inline constexpr const char* kDaemonInterface = "com.zandor.TXManagerServerInterface";
+inline constexpr const char* kChanged = "kTVXBehaviorBundleChangedNotification";
+// Paths of the device.
+inline constexpr const char* kSystemBundle = "/System/Library/TavrixBundles/Tablet/Default.bundle";
+inline constexpr const char* kUserBundle = "/var/mobile/Library/TavrixBundles/Default.bundle";
+inline constexpr const char* kOverlayDirectory = "/var/mobile/Library/TavrixBundles/Overlay";
+inline constexpr const char* kBundleLink = "/var/mobile/Library/Tavrix.bundle";
+inline constexpr const char* kPreferencesLink =
+    "/var/mobile/Library/Preferences/com.zandor.tavrix.plist";
+
+// Iterations of the crash loops: TAVRIX_CRASH_LOOP_ITERATIONS when set (scripts/crash-loop.sh),
+// else enough for the test to run well under a minute.
+inline int crashLoopIterations() {
+    const char* text = std::getenv("TAVRIX_CRASH_LOOP_ITERATIONS");
+    return text != nullptr && std::atoi(text) > 0 ? std::atoi(text) : 30;
+}
+
+// Asks done() every 20 ms until it holds (true) or the timeout passes (false): for what other
+// processes write to files.
+inline bool pollUntil(const std::function<bool()>& done, std::chrono::milliseconds timeout) {
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    while (!done()) {
+        if (std::chrono::steady_clock::now() > deadline) {
+            return false;
+        }
+        std::this_thread::sleep_for(20ms);
+    }
+    return true;
+}
+
+// A device image: the root the daemon runs under, its runtime directory, and the files the tests
+// prepare or inspect. "mobile" is the test's own user (home /var/mobile); no cellular radio.
+class DeviceRoot {
+  public:
+    DeviceRoot();
+
+    // The temporary directory holding the root, the run directory and the tests' own files.
+    const std::filesystem::path& base() const { return base_.path(); }
+    std::filesystem::path root() const { return base() / "root"; }
+    std::filesystem::path runtimeDirectory() const { return base() / "run"; }
+    // absolutePath of the device, under the root.
+    std::filesystem::path path(std::string_view absolutePath) const {
+        return root() / std::filesystem::path(absolutePath).relative_path();
+    }
+
+    void setCellularRadio(bool present);
+    // The daemon's own preferences and the behavior settings domain of the mobile user.
+    void writeDaemonPreferences(const plist::Dictionary& values);
+    std::optional<plist::Value> readDaemonPreferences() const;
+    // One key of the daemon's preferences, or nothing.
+    std::optional<plist::Value> daemonPreference(const std::string& key) const {
+        auto preferences = readDaemonPreferences();
+        const plist::Value* value = preferences ? preferences->find(key) : nullptr;
+        return value != nullptr ? std::optional(*value) : std::nullopt;
+    }
+    void writeBehaviorSettings(const plist::Dictionary& values);
+    // The keep-alive flag file's text, "" when there is none.
+    std::string keepAliveFlag() const { return test::readText(runtimeDirectory() / "keep-alive"); }
+
+  private:
+    // In one step, so that the daemon never reads half of the file and its cache sees a new one.
+    void writePropertyList(std::string_view absolutePath, const plist::Dictionary& values);
+
+    test::TempDir base_;
+};
+
+// The test's own connection: who owns the daemon's name and which notifications were posted.
+// Everything waits on the bus itself, never on the clock alone.
+class BusWatcher {
+  public:
+    explicit BusWatcher(const std::string& address);
+
+    // Handles what has arrived, then waits for more until done() holds or the timeout passes.
+    bool waitUntil(const std::function<bool()>& done, std::chrono::milliseconds timeout);
+    // The daemon's unique name, "" while the name has no owner.
+    const std::string& nameOwner() const { return owner_; }
+    // How often the name was released since the watcher started.
+    int nameReleaseCount() const { return releases_; }
+    int notificationCount(const std::string& name) const {
+        auto found = notifications_.find(name);
+        return found == notifications_.end() ? 0 : found->second;
+    }
+    bool waitForNotification(const std::string& name, int count,
+                             std::chrono::milliseconds timeout) {
+        return waitUntil([&] { return notificationCount(name) >= count; }, timeout);
+    }
+    sd_bus* bus() const { return bus_.get(); }
+
+  private:
+    static int onNameOwnerChanged(sd_bus_message* message, void* self, sd_bus_error*);
+    static int onPosted(sd_bus_message* message, void* self, sd_bus_error*);
+
+    bus::BusPtr bus_;
+    bus::BusSlotPtr ownerSlot_;
+    bus::BusSlotPtr postedSlot_;
+    std::string owner_;
+    int releases_ = 0;
+    std::map<std::string, int> notifications_;
+};
 
 class BusFixture : public ::testing::Test {
   protected:
@@ -33,50 +136,64 @@ class BusFixture : public ::testing::Test {
     void TearDown() override;
 
     DeviceRoot& device() { return device_; }
+    std::filesystem::path at(std::string_view absolutePath) const {
+        return device_.path(absolutePath);
+    }
+    // Where the device's link at absolutePath points, or "" when it is no link.
+    std::string linkTarget(std::string_view absolutePath) const;
+    // "links agree" when both links resolve and the carrier file lies in the linked bundle or
+    // among the generated files; else "links dangle" or "links disagree".
+    std::string linkState() const;
+    // The version of the bundle the bundle link points at, or "".
+    std::string linkedVersion() const;
+    // A bundle directory: Info.plist naming the version, and the base carrier file.
+    void writeBundle(const std::filesystem::path& directory, const std::string& version,
+                     const plist::Dictionary& carrierFile) const;
+    // The directory's content packed by bsdtar with these options, as a sender packs a bundle.
+    std::vector<std::uint8_t> pack(const std::filesystem::path& directory,
+                                   const std::vector<std::string>& options = {"-z"}) const;
     const std::string& busAddress() const { return bus_->address(); }
     BusWatcher& watcher() { return *watcher_; }
-
     // A new client of the daemon with a connection of its own.
     client::TavrixClient client() const {
         return client::TavrixClient::connectToAddress(busAddress());
     }
     // A plain bus connection, for calls the client library would not make.
-    bus::BusPtr rawConnection() { return connectToBus(busAddress()); }
+    bus::BusPtr rawConnection() const { return bus_->connect(); }
 
     bool waitForNameOwner(std::chrono::milliseconds timeout = 10s) {
-        return watcher_->waitForNameOwner(timeout);
+        return watcher_->waitUntil([this] { return !watcher_->nameOwner().empty(); }, timeout);
     }
     bool waitForNoNameOwner(std::chrono::milliseconds timeout = 10s) {
-        return watcher_->waitForNoNameOwner(timeout);
+        return watcher_->waitUntil([this] { return watcher_->nameOwner().empty(); }, timeout);
     }
-    std::optional<pid_t> daemonPid() { return watcher_->ownerPid(); }
+    // The process that owns the daemon's name now.
+    std::optional<pid_t> daemonPid();
 
-    std::string daemonLog() const { return bus_->log(); }
     // The log's lines, in order.
     std::vector<std::string> daemonLogLines() const;
-    // How often line appears in the log as a whole line.
+    // How often line appears in the log as a whole line, or contains text.
     int countLogLines(const std::string& line) const;
+    int countLogLinesContaining(const std::string& text) const;
     // Waits until line has appeared count times (the log is a file, so this polls it).
     bool waitForLogLine(const std::string& line, std::chrono::milliseconds timeout = 10s,
                         int count = 1) const;
 
     // The exit status of the daemon process pid once it has ended, or nothing at the timeout.
     std::optional<int> waitForDaemonExit(pid_t pid, std::chrono::milliseconds timeout = 10s) const;
-    std::vector<DaemonLaunch> daemonLaunches() const { return bus_->launches(); }
+    std::vector<test::DaemonLaunch> daemonLaunches() const { return bus_->launches(); }
     // Kills the daemon process pid with SIGKILL, as a power cut would end it, and waits for it to
     // end; that daemon is then not expected to exit with 0. False when it did not end.
     bool killDaemon(pid_t pid);
 
-    // Set by a derived fixture's constructor; read by SetUp.
-    BusOptions busOptions;
+    // Set by a derived fixture's constructor (or SetUp, before calling this one's).
+    int idleExitSeconds = 30;
+    std::optional<std::filesystem::path> policyFile;
 
   private:
-    // SIGTERM to every daemon still running; each must leave with status 0.
-    void stopDaemons();
-
     DeviceRoot device_;
     std::set<pid_t> killed_;
-    std::unique_ptr<PrivateBus> bus_;
+    std::unique_ptr<test::PrivateBus> bus_;
     std::unique_ptr<BusWatcher> watcher_;
 };
 

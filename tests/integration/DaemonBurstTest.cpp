@@ -13,7 +13,7 @@ namespace {
 
 class DaemonBurstTest : public BusFixture {
   protected:
-    DaemonBurstTest() { busOptions.idleExitSeconds = 1; }
+    DaemonBurstTest() { idleExitSeconds = 1; }
 };
 
 struct Tally {
@@ -29,23 +29,16 @@ struct Phase {
 
 // One call, the kind chosen by turn; a wrong answer or an error counts as lost.
 void callOnce(client::TavrixClient& caller, std::int32_t clientNumber, Tally& tally) {
+    const char* const wrong[] = {"IsTavrixBundleSupported answered true",
+                                 "SetClientType answered false",
+                                 "CopyTavrixValue answered a value"};
+    const int kind = tally.calls++ % 3;
     try {
-        switch (tally.calls++ % 3) {
-            case 0:
-                if (caller.isTavrixBundleSupported()) {
-                    tally.failures.push_back("IsTavrixBundleSupported answered true");
-                }
-                break;
-            case 1:
-                if (!caller.setClientType(clientNumber)) {
-                    tally.failures.push_back("SetClientType answered false");
-                }
-                break;
-            default:
-                if (caller.copyTavrixValue("CarrierName")) {
-                    tally.failures.push_back("CopyTavrixValue answered a value");
-                }
-                break;
+        const bool right = kind == 0   ? !caller.isTavrixBundleSupported()
+                           : kind == 1 ? caller.setClientType(clientNumber)
+                                       : !caller.copyTavrixValue("CarrierName");
+        if (!right) {
+            tally.failures.push_back(wrong[kind]);
         }
     } catch (const client::ClientError& error) {
         tally.failures.push_back(error.what());

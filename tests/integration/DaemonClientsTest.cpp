@@ -41,27 +41,16 @@ TEST_F(DaemonClientsTest, ClientsAreCountedInOnFirstCallAndOutWhenTheyLeave) {
 
 TEST_F(DaemonClientsTest, WrongSignatureGetsInvalidArgsAndTheDaemonCarriesOn) {
     auto bus = rawConnection();
-    struct BadCall {
-        const char* member;
-        const char* signature;
-    };
-    for (const BadCall& call : {BadCall{"SetTavrixID", "i"}, BadCall{"CopyTavrixValue", "i"},
-                                BadCall{"SetClientType", "s"}}) {
+    // No operation takes a double.
+    for (const char* member : {"SetTavrixID", "CopyTavrixValue", "SetClientType"}) {
         bus::BusError error;
         sd_bus_message* reply = nullptr;
-        int result = 0;
-        if (std::string_view(call.signature) == "i") {
-            result =
-                sd_bus_call_method(bus.get(), kDaemonBusName, kDaemonObjectPath, kDaemonInterface,
-                                   call.member, error.get(), &reply, "i", 42);
-        } else {
-            result =
-                sd_bus_call_method(bus.get(), kDaemonBusName, kDaemonObjectPath, kDaemonInterface,
-                                   call.member, error.get(), &reply, "s", "42");
-        }
+        EXPECT_LT(sd_bus_call_method(bus.get(), kDaemonBusName, kDaemonObjectPath, kDaemonInterface,
+                                     member, error.get(), &reply, "d", 4.2),
+                  0)
+            << member;
         bus::BusMessagePtr owned(reply);
-        EXPECT_LT(result, 0) << call.member;
-        EXPECT_STREQ(error.name(), SD_BUS_ERROR_INVALID_ARGS) << call.member;
+        EXPECT_STREQ(error.name(), SD_BUS_ERROR_INVALID_ARGS) << member;
     }
     const auto pid = daemonPid();
     ASSERT_TRUE(pid);
@@ -70,8 +59,8 @@ TEST_F(DaemonClientsTest, WrongSignatureGetsInvalidArgsAndTheDaemonCarriesOn) {
     EXPECT_FALSE(caller.isTavrixBundleSupported());
     EXPECT_TRUE(caller.setTavrixID("abc", std::nullopt));
     EXPECT_EQ(daemonPid(), pid);
+    // The good call after them was handled, once.
     EXPECT_EQ(countLogLines("Handling Set Tavrix ID with abc"), 1);
-    EXPECT_EQ(countLogLines("Handling Copy Tavrix Value for key 42"), 0);
 }
 
 }  // namespace

@@ -7,7 +7,6 @@
 #include <thread>
 
 #include "BusFixture.h"
-#include "CommandRunner.h"
 
 namespace tavrix::integration {
 namespace {
@@ -20,7 +19,7 @@ constexpr const char* kStartedNotification = "TXDaemonStartedNotification";
 
 class DaemonLifecycleTest : public BusFixture {
   protected:
-    DaemonLifecycleTest() { busOptions.idleExitSeconds = 1; }
+    DaemonLifecycleTest() { idleExitSeconds = 1; }
 
     // Position of the first whole line equal to text, or the line count when there is none.
     std::size_t lineIndex(const std::string& text) const {
@@ -42,14 +41,9 @@ TEST_F(DaemonLifecycleTest, StartsOnCallStaysForLaunchTransactionLeavesWhenIdleA
     ASSERT_TRUE(firstPid);
     EXPECT_TRUE(watcher().waitForNotification(kStartedNotification, 1, 5s));
 
-    const std::size_t starting = lineIndex("Starting the server: keepAlive = DISABLED");
-    const std::size_t begun = lineIndex(kLaunchBegun);
-    const std::size_t notifying = lineIndex("Notifying observers of start");
-    const std::size_t lineCount = daemonLogLines().size();
-    EXPECT_LT(starting, begun);
-    EXPECT_LT(begun, notifying);
-    EXPECT_LT(notifying, lineCount);
-    EXPECT_EQ(countLogLines("Starting the server."), 0);
+    // The launch transaction is open before the start is announced.
+    EXPECT_LT(lineIndex("Starting the server: keepAlive = DISABLED"), lineIndex(kLaunchBegun));
+    EXPECT_LT(lineIndex(kLaunchBegun), lineIndex("Notifying observers of start"));
 
     ASSERT_TRUE(waitForLogLine(kLaunchEnded, 20s));
     watcher().waitUntil([] { return false; }, 0ms);  // take in what the bus has reported so far
@@ -70,24 +64,23 @@ TEST_F(DaemonLifecycleTest, StartsOnCallStaysForLaunchTransactionLeavesWhenIdleA
 // A keep-alive flag left set by an earlier run is seen at start and cleared once started;
 // SIGTERM, even with the launch transaction open, ends the daemon with 0 and the flag clear.
 TEST_F(DaemonLifecycleTest, KeepAliveLeftByEarlierRunIsClearedAndSigtermExitsCleanly) {
-    device().setKeepAliveFlag("1");
+    test::writeText(device().runtimeDirectory() / "keep-alive", "1");
     auto caller = client();
     EXPECT_TRUE(caller.setClientType(0));
     const auto pid = daemonPid();
     ASSERT_TRUE(pid);
     EXPECT_TRUE(waitForLogLine("Starting the server: keepAlive = ENABLED"));
-    EXPECT_TRUE(waitForLogLine("Keep alive status: Disabled"));
-    EXPECT_EQ(device().keepAliveFlag(), std::optional<std::string>("0"));
+    EXPECT_EQ(device().keepAliveFlag(), "0\n");
 
     ASSERT_EQ(::kill(*pid, SIGTERM), 0);
     EXPECT_TRUE(waitForNoNameOwner());
     EXPECT_EQ(waitForDaemonExit(*pid), std::optional<int>(0));
-    EXPECT_EQ(device().keepAliveFlag(), std::optional<std::string>("0"));
+    EXPECT_EQ(device().keepAliveFlag(), "0\n");
 }
 
 class DaemonActivityTest : public DaemonLifecycleTest {
   protected:
-    DaemonActivityTest() { busOptions.idleExitSeconds = 2; }
+    DaemonActivityTest() { idleExitSeconds = 2; }
 };
 
 // A client calling once a second, from before the launch transaction ends until well past it,

@@ -9,7 +9,6 @@
 #include <algorithm>
 
 #include "BusFixture.h"
-#include "CommandRunner.h"
 #include "TestSupport.h"
 
 namespace tavrix::integration {
@@ -41,7 +40,7 @@ class DaemonPolicyTest : public BusFixture {
             GTEST_SKIP() << "no group \"" << kStandInGroup << "\" to stand in for \"tavrix\"";
         }
         standInGid_ = standIn->gr_gid;
-        busOptions.policyFile = adaptedPolicy();
+        policyFile = adaptedPolicy();
         BusFixture::SetUp();
     }
 

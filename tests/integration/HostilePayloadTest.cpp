@@ -12,7 +12,6 @@
 #include <set>
 
 #include "BusFixture.h"
-#include "CommandRunner.h"
 #include "TestSupport.h"
 #include "plist/PropertyListFormat.h"
 
@@ -21,9 +20,6 @@ namespace {
 
 namespace fs = std::filesystem;
 
-constexpr const char* kSystemBundle = "/System/Library/TavrixBundles/Tablet/Default.bundle";
-constexpr const char* kBundleLink = "/var/mobile/Library/Tavrix.bundle";
-constexpr const char* kPreferencesLink = "/var/mobile/Library/Preferences/com.zandor.tavrix.plist";
 // An idle daemon holds about 12 MB; a payload may cost working memory, never its expansion. Under
 // a sanitizer memory is shadowed (and freed memory held back in quarantine), so the bound there
 // only catches an expansion.
@@ -154,28 +150,16 @@ const HostileCase kCases[] = {
 
 class HostilePayloadTest : public BusFixture, public testing::WithParamInterface<HostileCase> {
   protected:
-    HostilePayloadTest() { busOptions.idleExitSeconds = 30; }
-
-    fs::path at(const char* absolutePath) { return device().path(absolutePath); }
-
-    void writeBundle(const fs::path& directory, const std::string& version) {
-        fs::create_directories(directory);
-        plist::Dictionary info = {{"QZBundleIdentifier", "com.zandor.tavrix.bundle.test"},
-                                  {"QZBundleVersion", version}};
-        ASSERT_TRUE(plist::writeFile((directory / "Info.plist").string(), plist::Value(info)));
-        ASSERT_TRUE(plist::writeFile((directory / "behavior.plist").string(),
-                                     plist::Value(plist::Dictionary{{"CarrierName", version}})));
-    }
-
     std::vector<std::uint8_t> hostilePayload(const HostileCase& hostile) {
         fs::path source = device().base() / "hostile";
-        writeBundle(source, "10");
+        writeBundle(source, "10", {{"CarrierName", "10"}});
         hostile.spoil(source);
+        if (hostile.zeroFileBytes == 0) {
+            return pack(source);
+        }
         fs::path archive = device().base() / "hostile.tgz";
-        CommandResult packed;
-        if (hostile.zeroFileBytes != 0) {
-            // One entry of zeros as repeated gzip members: a few MB that expand to gigabytes.
-            packed = runCommand({"/usr/bin/python3", "-c", R"(
+        // One entry of zeros as repeated gzip members: a few MB that expand to gigabytes.
+        CommandResult packed = runCommand({"/usr/bin/python3", "-c", R"(
 import gzip, sys, tarfile
 archive, info, size = sys.argv[1], sys.argv[2], int(sys.argv[3])
 chunk = 64 << 20
@@ -192,53 +176,32 @@ with open(archive, "wb") as out:
         out.write(zeros)
     out.write(gzip.compress(bytes(1024)))
 )",
-                                 archive.string(), (source / "Info.plist").string(),
-                                 std::to_string(hostile.zeroFileBytes)});
-        } else {
-            packed = runCommand({"/usr/bin/bsdtar", "-c", "-z", "-f", archive.string(), "-C",
-                                 source.string(), "."});
-        }
+                                           archive.string(), (source / "Info.plist").string(),
+                                           std::to_string(hostile.zeroFileBytes)});
         EXPECT_EQ(packed.status, 0) << packed.output;
         std::ifstream in(archive, std::fstream::binary);
         return {std::istreambuf_iterator<char>(in), {}};
     }
 
-    long peakResidentKiB(pid_t pid) {
-        std::ifstream status("/proc/" + std::to_string(pid) + "/status");
-        std::string line;
-        while (std::getline(status, line)) {
-            if (line.starts_with("VmHWM:")) {
-                return std::stol(line.substr(6));
-            }
-        }
-        return -1;
-    }
-
-    // Every call a client can make is answered.
-    void expectEveryCallAnswered(const char* when) {
+    // Every call a client can make is answered, the daemon stays small, and both links lead to
+    // files that exist or are not there at all.
+    void expectServing(const char* when) {
         auto caller = client();
         EXPECT_TRUE(caller.isTavrixBundleSupported()) << when;
         // Either bundle's settings, or none when no carrier file could be read: answered.
         (void)caller.copyTavrixValue("CarrierName");
-        EXPECT_TRUE(waitForNameOwner()) << when;
-    }
-
-    // Both links lead to files that exist, or are not there at all.
-    void expectLinksResolveOrAreAbsent() {
+        const std::optional<pid_t> pid = daemonPid();
+        ASSERT_TRUE(pid) << when;
+        std::ifstream status("/proc/" + std::to_string(*pid) + "/status");
+        std::string line;
+        while (std::getline(status, line) && !line.starts_with("VmHWM:")) {
+        }
+        ASSERT_TRUE(line.starts_with("VmHWM:")) << when;
+        EXPECT_LT(std::stol(line.substr(6)), kMaxResidentKiB) << when;
         for (const char* link : {kBundleLink, kPreferencesLink}) {
             std::error_code error;
-            if (fs::is_symlink(at(link), error)) {
-                EXPECT_TRUE(fs::exists(at(link), error)) << link << " dangles";
-            }
-        }
-    }
-
-    // Nothing appeared in the test's base directory outside the device root and the payload
-    // sources the test made itself.
-    void expectNothingOutsideTheRoot(const std::set<std::string>& before) {
-        for (const auto& entry : fs::directory_iterator(device().base())) {
-            std::string name = entry.path().filename().string();
-            EXPECT_TRUE(before.contains(name) || name.starts_with("hostile")) << name;
+            EXPECT_TRUE(!fs::is_symlink(at(link), error) || fs::exists(at(link), error))
+                << link << " dangles " << when;
         }
     }
 };
@@ -246,30 +209,25 @@ with open(archive, "wb") as out:
 TEST_P(HostilePayloadTest, DaemonKeepsServingAndSoDoesItsNextLaunch) {
     const HostileCase& hostile = GetParam();
     device().writeDaemonPreferences({{"EnableSupport", true}});
-    writeBundle(at(kSystemBundle), "1");
+    writeBundle(at(kSystemBundle), "1", {{"CarrierName", "1"}});
     std::set<std::string> before;
     for (const auto& entry : fs::directory_iterator(device().base())) {
         before.insert(entry.path().filename().string());
     }
-    auto payload = hostilePayload(hostile);
-
-    auto caller = client();
-    ASSERT_TRUE(caller.setTavrixID("id-7", payload)) << hostile.name;
-    std::optional<pid_t> pid = daemonPid();
+    ASSERT_TRUE(client().setTavrixID("id-7", hostilePayload(hostile)));
+    const std::optional<pid_t> pid = daemonPid();
     ASSERT_TRUE(pid);
-    EXPECT_LT(peakResidentKiB(*pid), kMaxResidentKiB);
-    expectEveryCallAnswered("after the payload");
-    expectLinksResolveOrAreAbsent();
+    expectServing("after the payload");
 
     ASSERT_EQ(::kill(*pid, SIGTERM), 0);
     EXPECT_EQ(waitForDaemonExit(*pid), std::optional<int>(0));
-    expectEveryCallAnswered("at the next launch");
-    std::optional<pid_t> next = daemonPid();
-    ASSERT_TRUE(next);
-    EXPECT_NE(*next, *pid);
-    EXPECT_LT(peakResidentKiB(*next), kMaxResidentKiB);
-    expectLinksResolveOrAreAbsent();
-    expectNothingOutsideTheRoot(before);
+    expectServing("at the next launch");
+    EXPECT_NE(daemonPid(), pid);
+    // Nothing appeared beside the device root but the payload sources made here.
+    for (const auto& entry : fs::directory_iterator(device().base())) {
+        const std::string name = entry.path().filename().string();
+        EXPECT_TRUE(before.contains(name) || name.starts_with("hostile")) << name;
+    }
 }
 
 INSTANTIATE_TEST_SUITE_P(Payloads, HostilePayloadTest, testing::ValuesIn(kCases),

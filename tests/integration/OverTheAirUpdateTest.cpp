@@ -17,10 +17,10 @@
 #include <iostream>
 #include <map>
 #include <random>
+#include <sstream>
 #include <thread>
 
 #include "BusFixture.h"
-#include "CommandRunner.h"
 #include "LocalHttpServer.h"
 #include "TestSupport.h"
 #include "bus/BackgroundJobScheduler.h"
@@ -36,10 +36,6 @@ namespace fs = std::filesystem;
 using test::readText;
 using test::writeText;
 
-constexpr const char* kChanged = "kTVXBehaviorBundleChangedNotification";
-constexpr const char* kUserBundle = "/var/mobile/Library/TavrixBundles/Default.bundle";
-constexpr const char* kBundleLink = "/var/mobile/Library/Tavrix.bundle";
-constexpr const char* kPreferencesLink = "/var/mobile/Library/Preferences/com.zandor.tavrix.plist";
 constexpr const char* kAssetCache = "/var/cache/tavrixservicesd/com.zandor.Grellas.TavrixBundles";
 constexpr const char* kBehaviorID = "acme.default";
 constexpr const char* kPendingInstall = "/var/lib/tavrixservicesd/pending-install.plist";
@@ -49,8 +45,6 @@ constexpr double kFifteenDays = 1296000.0;
 
 class OverTheAirUpdateTest : public BusFixture {
   protected:
-    OverTheAirUpdateTest() { busOptions.idleExitSeconds = 30; }
-
     void SetUp() override {
         BusFixture::SetUp();
         fs::create_directories(keys_);
@@ -77,26 +71,7 @@ class OverTheAirUpdateTest : public BusFixture {
                  plist::Dictionary{{"com.zandor.Grellas.TavrixBundles", std::move(type)}}}})));
     }
 
-    // Edits the published catalog and signs it again with the publisher's key, as a publisher
-    // with the key could.
-    void editAndResign(const std::function<void(plist::Dictionary&)>& edit) {
-        auto catalog = plist::readFile((site() / "catalog.plist").string());
-        ASSERT_TRUE(catalog && catalog->isDictionary());
-        edit(*catalog->asDictionary());
-        ASSERT_TRUE(plist::writeFile((site() / "catalog.plist").string(), *catalog));
-        const std::string bytes = readText(site() / "catalog.plist");
-        const std::string secret = readText(secretKey());
-        ASSERT_EQ(secret.size(), crypto_sign_SECRETKEYBYTES);
-        std::string signature(crypto_sign_BYTES, '\0');
-        ASSERT_GE(sodium_init(), 0);
-        crypto_sign_detached(reinterpret_cast<unsigned char*>(signature.data()), nullptr,
-                             reinterpret_cast<const unsigned char*>(bytes.data()), bytes.size(),
-                             reinterpret_cast<const unsigned char*>(secret.data()));
-        writeText(site() / "catalog.plist.sig", signature);
-    }
-
     static double now() { return Clock::absoluteTimeNow(); }
-    fs::path at(const char* absolutePath) { return device().path(absolutePath); }
     fs::path site() { return device().base() / "site"; }
     fs::path secretKey() { return keys_ / "secret"; }
 
@@ -104,14 +79,7 @@ class OverTheAirUpdateTest : public BusFixture {
     // when asked, a large file of bulkBytes that does not compress.
     fs::path writeBundle(const std::string& version, std::size_t bulkBytes = 0) {
         const fs::path directory = device().base() / ("bundles/" + version + "/Default.bundle");
-        fs::create_directories(directory);
-        EXPECT_TRUE(plist::writeFile(
-            (directory / "Info.plist").string(),
-            plist::Value(plist::Dictionary{{"QZBundleIdentifier", "com.zandor.tavrix.bundle.ota"},
-                                           {"QZBundleVersion", version}})));
-        EXPECT_TRUE(plist::writeFile(
-            (directory / "behavior.plist").string(),
-            plist::Value(plist::Dictionary{{"CarrierName", "Bundle " + version}})));
+        BusFixture::writeBundle(directory, version, {{"CarrierName", "Bundle " + version}});
         writeText(directory / ("Resources/only-in-" + version + ".txt"), version);
         if (bulkBytes > 0) {
             std::string bulk(bulkBytes, '\0');
@@ -123,13 +91,7 @@ class OverTheAirUpdateTest : public BusFixture {
 
     // Sets the behavior ID with the bundle of this version, packed as senders pack it.
     void setIDWithBundle(const std::string& version) {
-        const fs::path archive = device().base() / ("payload-" + version + ".tgz");
-        CommandResult packed = runCommand({"/usr/bin/bsdtar", "-czf", archive.string(), "-C",
-                                           writeBundle(version).string(), "."});
-        ASSERT_EQ(packed.status, 0) << packed.output;
-        const std::string bytes = readText(archive);
-        ASSERT_TRUE(client().setTavrixID(kBehaviorID,
-                                         std::vector<std::uint8_t>(bytes.begin(), bytes.end())));
+        ASSERT_TRUE(client().setTavrixID(kBehaviorID, pack(writeBundle(version))));
     }
 
     // Publishes the bundle of this version, signed, as the only asset of the catalog; answers
@@ -153,139 +115,88 @@ class OverTheAirUpdateTest : public BusFixture {
         return site() / urlPath.substr(std::string("/updates/").size());
     }
 
-    // Every file of the user bundle with its content.
-    std::map<std::string, std::string> userBundleFiles() {
-        std::map<std::string, std::string> files;
-        std::error_code error;
-        for (auto it = fs::recursive_directory_iterator(at(kUserBundle), error);
-             !error && it != fs::recursive_directory_iterator(); it.increment(error)) {
-            if (it->is_regular_file()) {
-                files[fs::relative(it->path(), at(kUserBundle)).string()] = readText(it->path());
-            }
-        }
-        return files;
-    }
-
-    std::string linkTarget(const char* link) {
-        std::error_code error;
-        fs::path target = fs::read_symlink(at(link), error);
-        return error ? std::string() : target.string();
-    }
+    // Every entry of the user bundle: directories, and files with their content.
+    test::Tree userBundleFiles() { return test::snapshotTree(at(kUserBundle)); }
 
     // What the cache holds besides the kept catalog: downloads, staging and installed assets.
     std::vector<std::string> cachedAssets() {
         std::vector<std::string> names;
-        std::error_code error;
-        for (const auto& entry : fs::directory_iterator(at(kAssetCache), error)) {
-            if (!entry.path().filename().string().starts_with("catalog.plist")) {
-                names.push_back(entry.path().filename().string());
+        for (const auto& [name, content] : test::snapshotTree(at(kAssetCache))) {
+            if (!name.starts_with("catalog.plist")) {
+                names.push_back(name);
             }
         }
         return names;
     }
 
     std::optional<double> nextUpdate() {
-        auto preferences = device().readDaemonPreferences();
-        const plist::Value* value = preferences ? preferences->find("NextUpdate") : nullptr;
-        return value != nullptr && value->asDate() != nullptr
-                   ? std::optional(value->asDate()->secondsSinceReferenceDate)
-                   : std::nullopt;
+        auto next = device().daemonPreference("NextUpdate");
+        return next && next->asDate() ? std::optional(next->asDate()->secondsSinceReferenceDate)
+                                      : std::nullopt;
     }
 
     // Waits until "NextUpdate" is within a minute of now + seconds.
     bool waitForNextUpdateIn(double seconds, std::chrono::milliseconds timeout = 10s) {
-        const auto deadline = std::chrono::steady_clock::now() + timeout;
-        for (;;) {
-            auto next = nextUpdate();
-            if (next && std::fabs(*next - (now() + seconds)) < 60.0) {
-                return true;
-            }
-            if (std::chrono::steady_clock::now() > deadline) {
-                return false;
-            }
-            std::this_thread::sleep_for(20ms);
-        }
+        return pollUntil(
+            [&] {
+                auto next = nextUpdate();
+                return next && std::fabs(*next - (now() + seconds)) < 60.0;
+            },
+            timeout);
     }
 
     void setNextUpdate(double when) {
-        auto preferences = device().readDaemonPreferences();
-        ASSERT_TRUE(preferences && preferences->isDictionary());
-        plist::Dictionary values = *preferences->asDictionary();
-        values.insert_or_assign("NextUpdate", plist::Date{when});
-        device().writeDaemonPreferences(values);
-    }
-
-    int countLogLinesContaining(const std::string& text) const {
-        int count = 0;
-        for (const std::string& line : daemonLogLines()) {
-            count += line.find(text) != std::string::npos ? 1 : 0;
-        }
-        return count;
-    }
-
-    // The version of the bundle the bundle link points at, or empty.
-    std::string linkedVersion() {
-        auto info = plist::readFile((at(kBundleLink) / "Info.plist").string());
-        const plist::Value* version = info ? info->find("QZBundleVersion") : nullptr;
-        return version != nullptr && version->asString() != nullptr ? *version->asString() : "";
+        device().writeDaemonPreferences({{"EnableSupport", true},
+                                         {"TavrixID", kBehaviorID},
+                                         {"NextUpdate", plist::Date{when}}});
     }
 
     // The installed bundle of this version is linked and read as the behavior settings.
-    void expectInstalled(const std::string& version, std::size_t files = 3) {
+    void expectInstalled(const std::string& version, std::size_t entries = 4) {
         auto installed = userBundleFiles();
         EXPECT_EQ(installed.count("Resources/only-in-" + version + ".txt"), 1u) << version;
-        EXPECT_EQ(installed.size(), files) << "entries of the previous bundle are gone";
+        EXPECT_EQ(installed.size(), entries) << "entries of the previous bundle are gone";
         EXPECT_EQ(linkTarget(kBundleLink), at(kUserBundle).string());
         EXPECT_EQ(linkTarget(kPreferencesLink), (at(kUserBundle) / "behavior.plist").string());
         EXPECT_EQ(client().copyTavrixValue("CarrierName"),
                   std::optional<plist::Value>("Bundle " + version));
         // The record goes with the purge, which follows the announcement.
-        const auto deadline = std::chrono::steady_clock::now() + 10s;
-        while (fs::exists(device().path(kPendingInstall)) &&
-               std::chrono::steady_clock::now() < deadline) {
-            std::this_thread::sleep_for(20ms);
-        }
-        EXPECT_FALSE(fs::exists(device().path(kPendingInstall)));
+        EXPECT_TRUE(pollUntil([&] { return !fs::exists(at(kPendingInstall)); }, 10s));
     }
 
     // tavrixctl with --json at the end of the line, where global options may also go; its
-    // answer read back.
-    plist::Dictionary tavrixctlJson(std::vector<std::string> arguments, int expectedStatus = 0) {
+    // answer parsed by Python's strict parser (malformed output or trailing text fails) and
+    // flattened: "LinkedBundle.Version" to "2", a dictionary to "{}", booleans as true or false.
+    std::map<std::string, std::string> tavrixctlJson(std::vector<std::string> arguments,
+                                                     int expectedStatus = 0) {
         arguments.insert(arguments.begin(), {TAVRIX_CTL_PATH, "--address", busAddress()});
         arguments.push_back("--json");
         CommandResult run = runCommand(arguments);
         EXPECT_EQ(run.status, expectedStatus) << run.output;
-        // Python's strict parser: malformed output or trailing text fails.
         const fs::path answerFile = device().base() / "answer.json";
         writeText(answerFile, run.output);
-        CommandResult converted =
-            runCommand({"/usr/bin/python3", "-c",
-                        "import json,plistlib,sys; "
-                        "sys.stdout.write(plistlib.dumps(json.load(open(sys.argv[1]))).decode())",
-                        answerFile.string()});
-        std::optional<plist::Value> answer =
-            converted.status == 0 ? plist::parse(converted.output) : std::nullopt;
-        EXPECT_TRUE(answer && answer->asDictionary() != nullptr) << run.output;
-        return answer && answer->asDictionary() ? *answer->asDictionary() : plist::Dictionary();
+        CommandResult flat = runCommand({"/usr/bin/python3", "-c", R"(import json, sys
+def walk(prefix, value):
+    for key, item in value.items():
+        text = "{}" if isinstance(item, dict) else item if isinstance(item, str) else json.dumps(item)
+        print(prefix + key + "=" + text)
+        if isinstance(item, dict):
+            walk(prefix + key + ".", item)
+walk("", json.load(open(sys.argv[1]))))",
+                                         answerFile.string()});
+        EXPECT_EQ(flat.status, 0) << run.output << flat.output;
+        std::map<std::string, std::string> answer;
+        std::istringstream lines(flat.output);
+        for (std::string line; std::getline(lines, line);) {
+            answer[line.substr(0, line.find('='))] = line.substr(line.find('=') + 1);
+        }
+        return answer;
     }
 
-    // The text at a path of keys in a JSON answer, or "(absent)".
-    static std::string textAt(const plist::Dictionary& answer,
-                              std::initializer_list<const char*> keys) {
-        const plist::Value* value = nullptr;
-        const plist::Dictionary* in = &answer;
-        for (const char* key : keys) {
-            auto found = in != nullptr ? in->find(key) : plist::Dictionary::const_iterator();
-            if (in == nullptr || found == in->end()) {
-                return "(absent)";
-            }
-            value = &found->second;
-            in = value->asDictionary();
-        }
-        if (const bool* flag = value->asBoolean()) {
-            return *flag ? "true" : "false";
-        }
-        return value->asString() != nullptr ? *value->asString() : value->description();
+    static std::string textAt(const std::map<std::string, std::string>& answer,
+                              const std::string& key) {
+        auto found = answer.find(key);
+        return found == answer.end() ? "(absent)" : found->second;
     }
 
     test::LocalHttpServer server;
@@ -294,105 +205,83 @@ class OverTheAirUpdateTest : public BusFixture {
     fs::path keys_ = device().base() / "keys";
 };
 
-// Version 2 published over an installed version 1: downloaded, copied over the user bundle,
-// matched, linked and announced once; the download is purged and the next check is 15 days on.
-// The check after that finds nothing newer than what is installed now.
-TEST_F(OverTheAirUpdateTest, NewerPublishedBundleIsInstalledLinkedAndAnnounced) {
+// The operator's view after each step, as scripts read it: a payload; version 2 published and
+// installed (a second check while that one downloads starts nothing), linked, announced once, the
+// download purged and the next check 15 days on; a check that finds nothing newer; a refused
+// catalog (kept across the daemon's exit); no catalog at all; a broken payload.
+TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
     setIDWithBundle("1");
+    auto status = tavrixctlJson({"status"});
+    EXPECT_EQ(textAt(status, "BehaviorID"), kBehaviorID);
+    EXPECT_EQ(textAt(status, "Supported"), "true");
+    EXPECT_EQ(textAt(status, "WhyNotSupported"), "(absent)");
+    EXPECT_EQ(textAt(status, "LinkedBundle.Identifier"), "com.zandor.tavrix.bundle.test");
+    EXPECT_EQ(textAt(status, "LinkedBundle.Version"), "1");
+    EXPECT_EQ(textAt(status, "LinkedBundle.OverlayType"), "kNoOverlay");
+    EXPECT_EQ(textAt(status, "UserBundleVersion"), "1");
+    EXPECT_EQ(textAt(status, "LastPayload.Extracted"), "true");
+    EXPECT_EQ(textAt(status, "LastCheck"), "(absent)");
+    EXPECT_NE(textAt(status, "NextUpdateCheck"), "(absent)");
+    EXPECT_NE(textAt(status, "DaemonVersion"), "(absent)");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
-    expectInstalled("1");
 
     const std::string archive = publish("2");
     test::LocalHttpServer::Response held;
     held.body = readText(published(archive));
     held.holdAfterBodyBytes = held.body.size() / 2;
     server.serve(archive, held);
-    // As an operator asks for it: tavrixctl waits for the installed bundle's announcement. A
-    // second check while that one downloads starts nothing and answers at once.
-    CommandResult check;
-    std::thread operatorCheck([&] {
-        check = runCommand(
-            {TAVRIX_CTL_PATH, "--address", busAddress(), "check-update", "--wait", "30"});
-    });
+    std::map<std::string, std::string> check;
+    std::thread operatorCheck([&] { check = tavrixctlJson({"check-update", "--wait", "30"}); });
     ASSERT_TRUE(server.waitForHeldResponse(30s));
     EXPECT_FALSE(client().checkForTavrixBundleUpdate());
-    EXPECT_EQ(countLogLines("An update check is already running, not starting another"), 1);
     server.releaseHeldResponses();
     operatorCheck.join();
-    EXPECT_EQ(check.status, 0);
-    EXPECT_EQ(check.output, "yes\ninstalled version 2\n");
+    EXPECT_EQ(textAt(check, "started"), "true");
+    EXPECT_EQ(textAt(check, "outcome"), "installed");
+    EXPECT_EQ(textAt(check, "reason"), "installed version 2");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 2, 30s));
     expectInstalled("2");
-    EXPECT_TRUE(waitForLogLine("Behavior ID acme.default is already sent, redoing bundle match"));
-    // Logged by the installing thread, possibly after the announcement arrived here.
-    EXPECT_TRUE(waitForLogLine("Carrier Bundle Match Result: kBundleChangeTypeUpdate", 10s, 2));
-    EXPECT_TRUE(waitForLogLine("Best candidate asset has been purged"));
     EXPECT_EQ(cachedAssets(), std::vector<std::string>{});
     EXPECT_TRUE(waitForNextUpdateIn(kFifteenDays));
-
-    check =
-        runCommand({TAVRIX_CTL_PATH, "--address", busAddress(), "check-update", "--wait", "30"});
-    EXPECT_EQ(check.status, 0);
-    EXPECT_EQ(check.output, "no\nup to date (version 2 installed)\n")
-        << "nothing started, nothing to wait for";
-    EXPECT_TRUE(waitForLogLine("Current version: 2"));
-    EXPECT_TRUE(waitForLogLine("No higher update available"));
-    EXPECT_FALSE(watcher().waitForNotification(kChanged, 3, 500ms));
-}
-
-// The status view after each step an operator takes, as scripts read it: a payload, an installed
-// update, a refused catalog (kept across the daemon's exit), no catalog at all, a broken payload.
-TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
-    setIDWithBundle("1");
-    plist::Dictionary status = tavrixctlJson({"status"});
-    EXPECT_EQ(textAt(status, {"BehaviorID"}), kBehaviorID);
-    EXPECT_EQ(textAt(status, {"Supported"}), "true");
-    EXPECT_EQ(textAt(status, {"WhyNotSupported"}), "(absent)");
-    EXPECT_EQ(textAt(status, {"LinkedBundle", "Identifier"}), "com.zandor.tavrix.bundle.ota");
-    EXPECT_EQ(textAt(status, {"LinkedBundle", "Version"}), "1");
-    EXPECT_EQ(textAt(status, {"LinkedBundle", "OverlayType"}), "kNoOverlay");
-    EXPECT_EQ(textAt(status, {"UserBundleVersion"}), "1");
-    EXPECT_EQ(textAt(status, {"LastPayload", "Extracted"}), "true");
-    EXPECT_EQ(textAt(status, {"LastCheck"}), "(absent)");
-    EXPECT_NE(textAt(status, {"NextUpdateCheck"}), "(absent)");
-    EXPECT_NE(textAt(status, {"DaemonVersion"}), "(absent)");
-
-    publish("2");
-    plist::Dictionary check = tavrixctlJson({"check-update", "--wait", "30"});
-    EXPECT_EQ(textAt(check, {"started"}), "true");
-    EXPECT_EQ(textAt(check, {"outcome"}), "installed");
-    EXPECT_EQ(textAt(check, {"reason"}), "installed version 2");
     status = tavrixctlJson({"status"});
-    EXPECT_EQ(textAt(status, {"LinkedBundle", "Version"}), "2");
-    EXPECT_EQ(textAt(status, {"LastCheck", "Outcome"}), "installed");
+    EXPECT_EQ(textAt(status, "LinkedBundle.Version"), "2");
+    EXPECT_EQ(textAt(status, "LastCheck.Outcome"), "installed");
+
+    // Plain output this time.
+    CommandResult upToDate =
+        runCommand({TAVRIX_CTL_PATH, "--address", busAddress(), "check-update", "--wait", "30"});
+    EXPECT_EQ(upToDate.status, 0);
+    EXPECT_EQ(upToDate.output, "no\nup to date (version 2 installed)\n")
+        << "nothing started, nothing to wait for";
+    EXPECT_FALSE(watcher().waitForNotification(kChanged, 3, 500ms));
 
     publish("3");
     std::string signature = readText(site() / "catalog.plist.sig");
     signature[0] = static_cast<char>(signature[0] ^ 1);
     writeText(site() / "catalog.plist.sig", signature);
     check = tavrixctlJson({"check-update"}, 1);
-    EXPECT_EQ(textAt(check, {"outcome"}), "catalog-refused");
-    EXPECT_TRUE(textAt(check, {"reason"}).starts_with("catalog refused: bad signature: "))
-        << textAt(check, {"reason"});
+    EXPECT_EQ(textAt(check, "outcome"), "catalog-refused");
+    EXPECT_TRUE(textAt(check, "reason").starts_with("catalog refused: bad signature: "))
+        << textAt(check, "reason");
     // What the daemon recorded is still there after it left and was started again.
     const auto pid = daemonPid();
     ASSERT_TRUE(pid);
     ::kill(*pid, SIGTERM);
     EXPECT_EQ(waitForDaemonExit(*pid, 90s), std::optional<int>(0));
     status = tavrixctlJson({"status"});
-    EXPECT_EQ(textAt(status, {"LastCheck", "Outcome"}), "catalog-refused");
-    EXPECT_EQ(textAt(status, {"LinkedBundle", "Version"}), "2");
+    EXPECT_EQ(textAt(status, "LastCheck.Outcome"), "catalog-refused");
+    EXPECT_EQ(textAt(status, "LinkedBundle.Version"), "2");
 
     fs::remove(at("/etc/tavrix/AssetCatalog.plist"));
     check = tavrixctlJson({"check-update"}, 1);
-    EXPECT_EQ(textAt(check, {"started"}), "false");
-    EXPECT_EQ(textAt(check, {"reason"}), "no catalog configured");
+    EXPECT_EQ(textAt(check, "started"), "false");
+    EXPECT_EQ(textAt(check, "reason"), "no catalog configured");
 
     ASSERT_TRUE(client().setTavrixID(kBehaviorID, std::vector<std::uint8_t>{'n', 'o', 't'}));
     status = tavrixctlJson({"status"});
-    EXPECT_EQ(textAt(status, {"LastPayload", "Extracted"}), "false");
-    EXPECT_NE(textAt(status, {"LastPayload", "Reason"}), "");
-    EXPECT_EQ(textAt(status, {"LastCheck", "Outcome"}), "no-catalog");
+    EXPECT_EQ(textAt(status, "LastPayload.Extracted"), "false");
+    EXPECT_NE(textAt(status, "LastPayload.Reason"), "");
+    EXPECT_EQ(textAt(status, "LastCheck.Outcome"), "no-catalog");
 }
 
 // Each way an update can go wrong leaves the linked bundle and its files as they were, posts
@@ -421,14 +310,14 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheDaemonKeepsServing)
              writeText(archive, bytes);
          },
          true, "the archive's SHA-256 is"},
-        {"expired catalog",
+        {"catalog with a bad signature",
          [&] {
              publish("2");
-             editAndResign([](plist::Dictionary& catalog) {
-                 catalog.insert_or_assign("Expires", plist::Date{now() - 60});
-             });
+             std::string signature = readText(site() / "catalog.plist.sig");
+             signature[0] = static_cast<char>(signature[0] ^ 1);
+             writeText(site() / "catalog.plist.sig", signature);
          },
-         false, ": expired: "},
+         false, ": bad signature: "},
         {"outside a rollout at 0%",
          [&] {
              publish("2", 0, {"--rollout", "0"});
@@ -529,7 +418,6 @@ TEST_F(OverTheAirUpdateTest, AnUpdateThatDoesNotFitLeavesTheOldBundleLinked) {
     EXPECT_TRUE(client().checkForTavrixBundleUpdate());
     EXPECT_TRUE(waitForLogLine("Best candidate asset has been purged", 30s));
     EXPECT_EQ(countLogLinesContaining("Not enough free space to install"), 1);
-    EXPECT_EQ(countLogLines("Removing the directory " + at(kUserBundle).string()), 0);
     EXPECT_TRUE(waitForNextUpdateIn(kOneDay));
     EXPECT_EQ(userBundleFiles(), installedFiles);
     EXPECT_EQ(linkTarget(kBundleLink), at(kUserBundle).string());
@@ -553,9 +441,7 @@ TEST_F(OverTheAirUpdateTest, KilledAnywhereInAnUpdateTheNextLaunchCompletesOrRed
     ASSERT_TRUE(waitForLogLine(kPurged, 30s));
     const auto updateTime = std::chrono::steady_clock::now() - started;
 
-    const char* iterationsText = std::getenv("TAVRIX_CRASH_LOOP_ITERATIONS");
-    const int iterations =
-        iterationsText != nullptr && std::atoi(iterationsText) > 0 ? std::atoi(iterationsText) : 30;
+    const int iterations = crashLoopIterations();
     const unsigned seed = static_cast<unsigned>(std::random_device{}());
     SCOPED_TRACE("seed " + std::to_string(seed));
     std::mt19937 random(seed);
@@ -579,13 +465,8 @@ TEST_F(OverTheAirUpdateTest, KilledAnywhereInAnUpdateTheNextLaunchCompletesOrRed
                                                  : "not installed"];
 
         client().isTavrixBundleSupported();  // a fresh launch
-        std::error_code error;
-        const fs::path bundle = fs::canonical(at(kBundleLink), error);
-        ASSERT_FALSE(error) << "the bundle link does not resolve";
-        const std::string carrierFile = fs::canonical(at(kPreferencesLink), error).string();
-        ASSERT_FALSE(error) << "the carrier file link does not resolve";
-        EXPECT_TRUE(carrierFile.starts_with(bundle.string() + "/")) << carrierFile;
-        EXPECT_TRUE(plist::readFile(carrierFile).has_value());
+        ASSERT_EQ(linkState(), "links agree");
+        EXPECT_TRUE(plist::readFile(at(kPreferencesLink).string()).has_value());
         EXPECT_TRUE(device().readDaemonPreferences().has_value());
         EXPECT_FALSE(fs::exists(device().path(kPendingInstall)));
         if (linkedVersion() != version) {
@@ -594,7 +475,7 @@ TEST_F(OverTheAirUpdateTest, KilledAnywhereInAnUpdateTheNextLaunchCompletesOrRed
             // The check has ended once its download is purged.
             EXPECT_TRUE(waitForLogLine(kPurged, 30s, purged + 1));
         }
-        expectInstalled(version, 4);
+        expectInstalled(version, 5);
         EXPECT_EQ(cachedAssets(), std::vector<std::string>{});
     }
     EXPECT_EQ(cachedAssets(), std::vector<std::string>{});
@@ -610,7 +491,7 @@ TEST_F(OverTheAirUpdateTest, KilledAnywhereInAnUpdateTheNextLaunchCompletesOrRed
 
 class OverTheAirKeepAliveTest : public OverTheAirUpdateTest {
   protected:
-    OverTheAirKeepAliveTest() { busOptions.idleExitSeconds = 1; }
+    OverTheAirKeepAliveTest() { idleExitSeconds = 1; }
 };
 
 // The scheduled check of a daemon that was started for it: its keep-alive transaction ends with
@@ -665,7 +546,7 @@ TEST_F(OverTheAirKeepAliveTest, ScheduledCheckKeepsTheDaemonUntilTheDownloadIsIn
     expectInstalled("2");
     EXPECT_TRUE(waitForNextUpdateIn(kFifteenDays));
     EXPECT_EQ(waitForDaemonExit(*second), std::optional<int>(0));
-    EXPECT_EQ(device().keepAliveFlag(), std::optional<std::string>("0"));
+    EXPECT_EQ(device().keepAliveFlag(), "0\n");
     // Start-up also found "NextUpdate" past and re-armed the job; the check still ran once.
     EXPECT_EQ(countLogLines("*********** Beginning Corvex transaction : Update Check ***********"),
               1);

@@ -78,13 +78,8 @@ class LocalHttpServer {
     void acceptLoop();
     void handleConnection(int fd);
     Response responseFor(const Request& request) const;
-    void sendTrickling(int fd, const std::string& head, std::string_view body,
-                       std::size_t bytesPerSecond);
 
     io::UniqueFd listenFd_;
-    // Written to on destruction, to wake the accept loop.
-    io::UniqueFd wakeReadFd_;
-    io::UniqueFd wakeWriteFd_;
     std::uint16_t port_ = 0;
     mutable std::mutex mutex_;
     std::map<std::string, Response> responses_;

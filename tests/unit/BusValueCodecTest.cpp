@@ -6,7 +6,7 @@
 #include <cstdint>
 #include <functional>
 
-#include "PrivateBusDaemon.h"
+#include "PrivateBus.h"
 #include "bus/BusHandles.h"
 #include "bus/BusValueCodec.h"
 
@@ -28,9 +28,7 @@ class BusValueCodec : public testing::Test {
   protected:
     BusValueCodec() : sender_(daemon_.connect()), receiver_(daemon_.connect()) {
         const char* name = nullptr;
-        if (sd_bus_get_unique_name(receiver_.get(), &name) < 0) {
-            throw std::runtime_error("the receiver has no name");
-        }
+        test::check(sd_bus_get_unique_name(receiver_.get(), &name), "sd_bus_get_unique_name");
         receiverName_ = name;
     }
 
@@ -72,68 +70,19 @@ class BusValueCodec : public testing::Test {
         throw std::runtime_error("the message did not arrive");
     }
 
-    int roundTrip(const Value& value, std::optional<Value>& back) {
-        return roundTrip([&](sd_bus_message* m) { return appendValue(m, value); },
-                         [&](sd_bus_message* m) { return readValue(m, back); });
-    }
-
     // A message another program might send, read as a value.
     int readForeign(const Writer& write, std::optional<Value>& back) {
         return roundTrip(write, [&](sd_bus_message* m) { return readValue(m, back); });
     }
 
-    test::PrivateBusDaemon daemon_;
+    test::PrivateBus daemon_;
     BusPtr sender_;
     BusPtr receiver_;
     std::string receiverName_;
 };
 
-Value nestedArrays(std::size_t depth) {
-    Value value("leaf");
-    for (std::size_t level = 1; level < depth; ++level) {
-        value = Value(Array{value});
-    }
-    return value;
-}
-
-Value nestedDictionaries(std::size_t depth) {
-    Value value(Data{1, 2, 3});
-    for (std::size_t level = 1; level < depth; ++level) {
-        value = Value(Dictionary{{"level", value}});
-    }
-    return value;
-}
-
-TEST_F(BusValueCodec, RoundTripKeepsEveryTypeAndEdgeValue) {
-    const Value tree = Dictionary{
-        {"negative", Value(-42)},
-        {"minimum", Value(Integer(INT64_MIN))},
-        {"maximum signed", Value(Integer(INT64_MAX))},
-        {"maximum unsigned", Value(Integer::fromUnsigned(UINT64_MAX))},
-        {"real", Value(-0.1)},
-        {"whole real", Value(3.0)},
-        {"true", Value(true)},
-        {"false", Value(false)},
-        {"date", Value(Date{-86400.125})},
-        {"date at the reference", Value(Date{0})},
-        {"data", Value(Data{0x00, 0xff, 0x10, 0x80})},
-        {"empty data", Value(Data{})},
-        {"empty string", Value("")},
-        {"", Value("empty key")},
-        {"non-ASCII \xc3\xa9t\xc3\xa9", Value("\xe6\x97\xa5\xe6\x9c\xac \xf0\x9f\x93\xb1")},
-        {"empty dictionary", Value(Dictionary{})},
-        {"array", Value(Array{Value(1), Value("two"), Value(Array{}), Value(Dictionary{}),
-                              Value(Date{1.5}), Value(1.5)})},
-    };
-    std::optional<Value> back;
-    ASSERT_GE(roundTrip(tree, back), 0);
-    ASSERT_TRUE(back.has_value());
-    // Equality includes the type, so a date that came back as a real, data as an array or
-    // a large unsigned integer as a negative one would all fail here.
-    EXPECT_EQ(*back, tree) << back->description();
-}
-
-// Other programs (busctl, scripts) rely on the documented signatures, scalars at the top too.
+// Other programs (busctl, scripts) rely on the documented signatures, scalars at the top too; a
+// value comes back as the same type (a date is no real, a large unsigned integer not negative).
 TEST_F(BusValueCodec, ScalarsTravelWithTheDocumentedSignatures) {
     const std::pair<Value, const char*> cases[] = {
         {Value("text"), "s"},
@@ -142,7 +91,7 @@ TEST_F(BusValueCodec, ScalarsTravelWithTheDocumentedSignatures) {
         {Value(Integer::fromUnsigned(static_cast<std::uint64_t>(INT64_MAX) + 1)), "t"},
         {Value(12.5), "d"},
         {Value(false), "b"},
-        {Value(Data{}), "ay"},
+        {Value(Data{0x00, 0xff, 0x80}), "ay"},
         {Value(Date{12.5}), "(d)"},
         {Value(Array{}), "av"},
         {Value(Dictionary{}), "a{sv}"},
@@ -165,16 +114,9 @@ TEST_F(BusValueCodec, ScalarsTravelWithTheDocumentedSignatures) {
     }
 }
 
-TEST_F(BusValueCodec, OptionalsKeepAbsentApartFromEmpty) {
-    for (const std::optional<Value>& value :
-         {std::optional<Value>(), std::optional<Value>(Dictionary{}), std::optional<Value>(Data{}),
-          std::optional<Value>("")}) {
-        std::optional<Value> back = Value("sentinel");
-        ASSERT_GE(roundTrip([&](sd_bus_message* m) { return appendOptionalValue(m, value); },
-                            [&](sd_bus_message* m) { return readOptionalValue(m, back); }),
-                  0);
-        EXPECT_EQ(back, value);
-    }
+// A bundle that is absent stays apart from an empty one; two are no optional. (Optional values
+// travel in replies that the daemon tests read back through the real daemon.)
+TEST_F(BusValueCodec, OptionalBytesKeepAbsentApartFromEmpty) {
     using Bytes = std::optional<std::vector<std::uint8_t>>;
     for (const Bytes& bytes : {Bytes(), Bytes(std::vector<std::uint8_t>{}),
                                Bytes(std::vector<std::uint8_t>{0x1f, 0x8b, 0x00})}) {
@@ -185,13 +127,6 @@ TEST_F(BusValueCodec, OptionalsKeepAbsentApartFromEmpty) {
         EXPECT_EQ(back, bytes);
     }
     // Two elements are not an optional.
-    std::optional<Value> value;
-    EXPECT_EQ(roundTrip(
-                  [](sd_bus_message* m) {
-                      return sd_bus_message_append(m, "av", 2, "s", "one", "s", "two");
-                  },
-                  [&](sd_bus_message* m) { return readOptionalValue(m, value); }),
-              -EINVAL);
     Bytes bytes;
     EXPECT_EQ(
         roundTrip([](sd_bus_message* m) { return sd_bus_message_append(m, "aay", 2, 1, 0x01, 0); },
@@ -199,8 +134,10 @@ TEST_F(BusValueCodec, OptionalsKeepAbsentApartFromEmpty) {
         -EINVAL);
 }
 
-TEST_F(BusValueCodec, ReadsTheNarrowerIntegerTypes) {
-    const std::pair<Writer, Integer> cases[] = {
+// What other programs may send: the narrower integer types are read as integers; everything
+// else that is no property list (or holds one deep inside) is refused and leaves the value alone.
+TEST_F(BusValueCodec, ForeignMessagesAreReadOrRefusedWhole) {
+    const std::pair<Writer, Integer> narrower[] = {
         {[](sd_bus_message* m) { return sd_bus_message_append(m, "v", "y", 255); }, 255},
         {[](sd_bus_message* m) { return sd_bus_message_append(m, "v", "n", -32768); }, -32768},
         {[](sd_bus_message* m) { return sd_bus_message_append(m, "v", "q", 65535); }, 65535},
@@ -209,14 +146,11 @@ TEST_F(BusValueCodec, ReadsTheNarrowerIntegerTypes) {
         {[](sd_bus_message* m) { return sd_bus_message_append(m, "v", "u", UINT32_MAX); },
          Integer(UINT32_MAX)},
     };
-    for (const auto& [write, expected] : cases) {
+    for (const auto& [write, expected] : narrower) {
         std::optional<Value> value;
         ASSERT_GE(readForeign(write, value), 0);
         EXPECT_EQ(value, Value(expected));
     }
-}
-
-TEST_F(BusValueCodec, RefusesWhatIsNoPropertyList) {
     const Writer unsupported[] = {
         [](sd_bus_message* m) { return sd_bus_message_append(m, "v", "o", "/some/object"); },
         [](sd_bus_message* m) { return sd_bus_message_append(m, "v", "g", "a{sv}"); },
@@ -228,7 +162,6 @@ TEST_F(BusValueCodec, RefusesWhatIsNoPropertyList) {
         [](sd_bus_message* m) {
             return sd_bus_message_append(m, "v", "a{sv}", 2, "k", "i", 1, "k", "i", 2);
         },
-        // Something refused deep inside refuses the whole.
         [](sd_bus_message* m) {
             return sd_bus_message_append(m, "v", "av", 2, "s", "fine", "o", "/no");
         },
@@ -253,6 +186,22 @@ TEST_F(BusValueCodec, RefusesStringsTheBusCannotCarry) {
         BusMessagePtr message = newMessage();
         EXPECT_EQ(appendValue(message.get(), value), -EINVAL);
     }
+}
+
+Value nestedArrays(std::size_t depth) {
+    Value value("leaf");
+    for (std::size_t level = 1; level < depth; ++level) {
+        value = Value(Array{value});
+    }
+    return value;
+}
+
+Value nestedDictionaries(std::size_t depth) {
+    Value value(Data{1, 2, 3});
+    for (std::size_t level = 1; level < depth; ++level) {
+        value = Value(Dictionary{{"level", value}});
+    }
+    return value;
 }
 
 // The deepest values this side sends, in the optional shape that replies use, pass the bus
