@@ -55,6 +55,15 @@ LocalHttpServer::Response statusResponse(int status, std::string reason) {
     return response;
 }
 
+// Polls until done answers true, for up to kPatience: the answer.
+bool eventually(const std::function<bool()>& done) {
+    const auto deadline = std::chrono::steady_clock::now() + kPatience;
+    while (!done() && std::chrono::steady_clock::now() < deadline) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(10));
+    }
+    return done();
+}
+
 // The reports a download handler receives: each operation, and the bytes of each "Downloading".
 class ProgressLog {
   public:
@@ -468,10 +477,7 @@ TEST_F(AssetCatalogTest, DownloadReportsStepsInOrderInstallsIdenticalFilesAndPur
 
     // Reports made before a handler exists wait for it.
     asset->beginDownload();
-    auto deadline = std::chrono::steady_clock::now() + kPatience;
-    while (!asset->localURL() && std::chrono::steady_clock::now() < deadline) {
-        std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    }
+    eventually([&] { return asset->localURL().has_value(); });
     auto progress = std::make_shared<ProgressLog>();
     asset->setProgressHandler(ProgressLog::handler(progress, asset));
     std::vector<std::string> operations = progress->waitForLast();
@@ -509,11 +515,7 @@ TEST_F(AssetCatalogTest, DownloadReportsStepsInOrderInstallsIdenticalFilesAndPur
     // The handler captured the asset; once the last report is delivered nothing keeps it.
     std::weak_ptr<Asset> weak = asset;
     asset.reset();
-    deadline = std::chrono::steady_clock::now() + kPatience;
-    while (!weak.expired() && std::chrono::steady_clock::now() < deadline) {
-        std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    }
-    EXPECT_TRUE(weak.expired());
+    EXPECT_TRUE(eventually([&] { return weak.expired(); }));
 }
 
 // Every way a download can go wrong ends in one failure report with one line saying why, no
