@@ -158,8 +158,8 @@ TEST_F(PayloadExtraction, AsArchivedWritesEscapingEntriesWhereTheyPoint) {
 }
 
 // Network archives hold only files, directories and links that stay inside. The first entry that
-// could reach outside (or is no such thing) stops the extraction with one line: nothing after it
-// is written, and nothing outside changes.
+// could reach outside (or is no such thing) stops the extraction: nothing after it is written, and
+// nothing outside changes.
 TEST_F(PayloadExtraction, PathSafeStopsAtTheFirstEntryThatCouldLeave) {
     const std::string outside = dir / "outside";
     writeText(outside + "/secret", "secret");
@@ -183,7 +183,6 @@ TEST_F(PayloadExtraction, PathSafeStopsAtTheFirstEntryThatCouldLeave) {
     for (const Case& c : cases) {
         SCOPED_TRACE(c.name);
         fs::remove_all(destination);
-        log.clear();
         std::vector<ArchiveItem> items{test::fileItem("first.txt", "first")};
         items.insert(items.end(), c.hostile.begin(), c.hostile.end());
         items.push_back(test::fileItem("last.txt", "last"));
@@ -194,8 +193,6 @@ TEST_F(PayloadExtraction, PathSafeStopsAtTheFirstEntryThatCouldLeave) {
         EXPECT_EQ(snapshotTree(dir.path()).count("up.txt"), 0u);
         EXPECT_EQ(readText(dir / "dest/first.txt"), "first");
         EXPECT_FALSE(fs::exists(fs::symlink_status(dir / "dest/last.txt")));
-        EXPECT_EQ(log.messages().size(), 1u);
-        EXPECT_TRUE(log.messages().front().starts_with("Refusing the archive entry"));
     }
     // Links that stay inside, however they are spelled, are taken as they are, and a destination
     // reached through a link of the caller's is fine.
