@@ -2,9 +2,6 @@
 // archives from the network and with small limits, into a fresh directory that is removed
 // afterwards. Whatever the bytes, nothing may be written outside that directory, no symbolic link
 // left in it may lead outside, and what it holds stays within the limits.
-#include <fcntl.h>
-#include <linux/fs.h>
-#include <sys/ioctl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -48,26 +45,17 @@ class WorkDirectory {
     fs::path path_;
 };
 
-// Undoes what an entry may have set that would stop its removal: file flags such as immutable
-// or append-only, and directories without search or write permission.
+// Undoes what an entry may have set that would stop its removal: directories without search or
+// write permission. (Path-safe extraction restores no file flags.)
 void makeRemovable(const fs::path& path) {
     struct stat info {};
-    if (::lstat(path.c_str(), &info) != 0 || !(S_ISREG(info.st_mode) || S_ISDIR(info.st_mode))) {
+    if (::lstat(path.c_str(), &info) != 0 || !S_ISDIR(info.st_mode)) {
         return;
     }
-    int fd = ::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC);
-    if (fd >= 0) {
-        int flags = 0;
-        ::ioctl(fd, FS_IOC_SETFLAGS, &flags);
-        ::close(fd);
-    }
-    if (S_ISDIR(info.st_mode)) {
-        ::chmod(path.c_str(), 0700);
-        std::error_code error;
-        for (fs::directory_iterator it(path, error), end; !error && it != end;
-             it.increment(error)) {
-            makeRemovable(it->path());
-        }
+    ::chmod(path.c_str(), 0700);
+    std::error_code error;
+    for (fs::directory_iterator it(path, error), end; !error && it != end; it.increment(error)) {
+        makeRemovable(it->path());
     }
 }
 

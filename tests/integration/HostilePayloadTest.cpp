@@ -29,11 +29,11 @@ constexpr long kMaxResidentKiB = 640 * 1024;
 constexpr long kMaxResidentKiB = 160 * 1024;
 #endif
 
-// A binary property list of string and array objects, laid out by hand because no writer
-// produces the shapes below: each array lists the indexes of the objects it holds.
-std::string binaryPropertyList(const std::vector<std::vector<std::uint32_t>>& arrays,
-                               const std::string& leaf) {
-    const std::size_t count = arrays.size() + 1;
+// A binary property list laid out by hand, because no writer produces these shapes: depth arrays,
+// each holding the next one copies times (fewer than 15), and a string at the bottom. One copy
+// nests as deep as there are arrays; with two, 40 arrays in 364 bytes expand to 2^40 nodes.
+std::string nestedBinaryList(std::uint32_t depth, std::uint32_t copies) {
+    const std::size_t count = depth + 1;
     const int refSize = count > 0xFF ? 2 : 1;
     std::string bytes = "bplist00";
     std::vector<std::uint64_t> offsets;
@@ -42,16 +42,15 @@ std::string binaryPropertyList(const std::vector<std::vector<std::uint32_t>>& ar
             bytes += static_cast<char>((value >> shift) & 0xFF);
         }
     };
-    for (const auto& members : arrays) {
+    for (std::uint32_t i = 0; i < depth; ++i) {
         offsets.push_back(bytes.size());
-        bytes += static_cast<char>(0xA0 | members.size());  // fewer than 15 members
-        for (std::uint32_t member : members) {
-            putBigEndian(member, refSize);
+        bytes += static_cast<char>(0xA0 | copies);
+        for (std::uint32_t copy = 0; copy < copies; ++copy) {
+            putBigEndian(i + 1, refSize);
         }
     }
     offsets.push_back(bytes.size());
-    bytes += static_cast<char>(0x50 | leaf.size());  // a short ASCII string
-    bytes += leaf;
+    bytes += "\x51x";  // the one-letter ASCII string "x"
     const std::uint64_t tableOffset = bytes.size();
     for (std::uint64_t offset : offsets) {
         putBigEndian(offset, 4);
@@ -63,24 +62,6 @@ std::string binaryPropertyList(const std::vector<std::vector<std::uint32_t>>& ar
     putBigEndian(0, 8);
     putBigEndian(tableOffset, 8);
     return bytes;
-}
-
-// Each array holds the next one: nesting as deep as there are arrays.
-std::string deepBinaryList(std::uint32_t depth) {
-    std::vector<std::vector<std::uint32_t>> arrays;
-    for (std::uint32_t i = 0; i < depth; ++i) {
-        arrays.push_back({i + 1});
-    }
-    return binaryPropertyList(arrays, "x");
-}
-
-// Each array holds the next one twice: 364 bytes that expand to 2^40 nodes.
-std::string selfSharingBinaryList() {
-    std::vector<std::vector<std::uint32_t>> arrays;
-    for (std::uint32_t i = 0; i < 40; ++i) {
-        arrays.push_back({i + 1, i + 1});
-    }
-    return binaryPropertyList(arrays, "x");
 }
 
 std::string deepXmlList(std::size_t depth) {
@@ -133,11 +114,11 @@ const HostileCase kCases[] = {
     {"DeepXmlCarrierFile",
      [](const fs::path& b) { test::writeText(b / "behavior.plist", deepXmlList(200000)); }},
     {"DeepBinaryCarrierFile",
-     [](const fs::path& b) { test::writeText(b / "behavior.plist", deepBinaryList(30000)); }},
+     [](const fs::path& b) { test::writeText(b / "behavior.plist", nestedBinaryList(30000, 1)); }},
     {"DeepBinaryInfo",
-     [](const fs::path& b) { test::writeText(b / "Info.plist", deepBinaryList(30000)); }},
+     [](const fs::path& b) { test::writeText(b / "Info.plist", nestedBinaryList(30000, 1)); }},
     {"SelfSharingBinaryCarrierFile",
-     [](const fs::path& b) { test::writeText(b / "behavior.plist", selfSharingBinaryList()); }},
+     [](const fs::path& b) { test::writeText(b / "behavior.plist", nestedBinaryList(40, 2)); }},
     {"SparseHugeCarrierFile",
      [](const fs::path& b) { fs::resize_file(b / "behavior.plist", std::uintmax_t{100} << 30); }},
     {"ManyIDsForOneConfiguration",

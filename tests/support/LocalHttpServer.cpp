@@ -64,15 +64,11 @@ LocalHttpServer::Request parseRequest(const std::string& head) {
 }
 
 std::string responseHead(const LocalHttpServer::Response& response) {
-    std::string head = "HTTP/1.0 " + std::to_string(response.status) + " " + response.reason +
-                       "\r\nConnection: close\r\n";
-    bool hasLength = false;
+    std::string head =
+        "HTTP/1.0 " + std::to_string(response.status) + " " + response.reason +
+        "\r\nConnection: close\r\nContent-Length: " + std::to_string(response.body.size()) + "\r\n";
     for (const auto& [name, value] : response.headers) {
-        hasLength = hasLength || ::strcasecmp(name.c_str(), "Content-Length") == 0;
         head += name + ": " + value + "\r\n";
-    }
-    if (!hasLength) {
-        head += "Content-Length: " + std::to_string(response.body.size()) + "\r\n";
     }
     return head + "\r\n";
 }

@@ -27,7 +27,7 @@ class LocalHttpServer {
     struct Response {
         int status = 200;
         std::string reason = "OK";
-        // Sent in order. A "Content-Length" is added unless one is given here.
+        // Sent in order, after "Content-Length".
         std::vector<std::pair<std::string, std::string>> headers;
         std::string body;
         // When set, only this many body bytes are sent (after the full Content-Length was

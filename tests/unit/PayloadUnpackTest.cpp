@@ -3,7 +3,6 @@
 #include <unistd.h>
 
 #include <filesystem>
-#include <map>
 
 #include "ArchiveFixtures.h"
 #include "TestSupport.h"
@@ -103,49 +102,46 @@ INSTANTIATE_TEST_SUITE_P(
                     FormatCase{"CpioCompress", Container::Cpio, Compression::Compress}),
     [](const testing::TestParamInfo<FormatCase>& info) { return std::string(info.param.name); });
 
-// Bytes that are no readable archive answer false and leave an empty destination behind, and the
-// working directory where it was.
-TEST_F(PayloadExtraction, UnreadablePayloadsAnswerFalseWithAnEmptyDestination) {
+// Bytes that are no readable archive answer false with an empty destination; damage part way
+// keeps the entries before it (false); an entry that cannot be created is skipped (true). The
+// working directory stays where it was.
+TEST_F(PayloadExtraction, DamagedPayloadsKeepWhatCameBeforeTheDamage) {
     const std::string before = currentDirectory();
-    const std::map<std::string, std::string> payloads = {
-        {"empty", ""},
-        {"not an archive", "this is plainly not an archive\n" + randomBytes(3000, 1)},
-        {"gzip of no archive",
-         "\x1f\x8b\x08\x00\x00\x00\x00\x00\x00\x03\x03\x00\x00\x00\x00\x00"
-         "\x00\x00\x00\x00"},
+    std::string truncated = buildArchive(
+        Container::Tar, Compression::Gzip,
+        {test::fileItem("first.txt", "first"), test::fileItem("large.bin", randomBytes(300000, 3)),
+         test::fileItem("last.txt", "last")});
+    truncated.resize(truncated.size() / 2);
+    struct Case {
+        const char* name;
+        std::string bytes;
+        bool extracted;
+        Tree tree;  // leaving out the entry the damage cut short
     };
-    for (const auto& [name, bytes] : payloads) {
-        SCOPED_TRACE(name);
+    const std::vector<Case> cases{
+        {"empty", "", false, {}},
+        {"not an archive", "this is plainly not an archive\n" + randomBytes(3000, 1), false, {}},
+        {"gzip header alone", "\x1f\x8b\x08", false, {}},
+        {"truncated", truncated, false, {{"first.txt", "first"}}},
+        {"entry that cannot be created",
+         buildArchive(Container::Tar, Compression::Gzip,
+                      {test::fileItem("before.txt", "before"),
+                       test::hardlinkItem("orphan", "no-such-target"),
+                       test::fileItem("after.txt", "after")}),
+         true,
+         {{"before.txt", "before"}, {"after.txt", "after"}}},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
         fs::remove_all(destination);
-        EXPECT_FALSE(extract(bytes));
+        EXPECT_EQ(extract(c.bytes), c.extracted);
         EXPECT_TRUE(fs::is_directory(destination));
-        EXPECT_TRUE(fs::is_empty(destination));
+        Tree tree = snapshotTree(destination);
+        tree.erase("large.bin");
+        EXPECT_EQ(tree, c.tree);
     }
     EXPECT_FALSE(extractArchive(dir / "missing.tgz", destination));
     EXPECT_EQ(currentDirectory(), before);
-}
-
-// Damage part way keeps what came before it; the answer is false.
-TEST_F(PayloadExtraction, TruncatedArchiveKeepsTheEntriesBeforeTheDamage) {
-    const std::string large = randomBytes(300000, 3);
-    std::string bytes =
-        buildArchive(Container::Tar, Compression::Gzip,
-                     {test::fileItem("first.txt", "first"), test::fileItem("large.bin", large),
-                      test::fileItem("last.txt", "last")});
-    bytes.resize(bytes.size() / 2);
-
-    EXPECT_FALSE(extract(bytes));
-    EXPECT_EQ(readText(dir / "dest/first.txt"), "first");
-    EXPECT_FALSE(fs::exists(dir / "dest/last.txt"));
-}
-
-// An entry that cannot be created is skipped; the others are still extracted.
-TEST_F(PayloadExtraction, EntryThatCannotBeCreatedIsSkipped) {
-    EXPECT_TRUE(extract(buildArchive(
-        Container::Tar, Compression::Gzip,
-        {test::fileItem("before.txt", "before"), test::hardlinkItem("orphan", "no-such-target"),
-         test::fileItem("after.txt", "after")})));
-    EXPECT_EQ(snapshotTree(destination), (Tree{{"before.txt", "before"}, {"after.txt", "after"}}));
 }
 
 // The client's own payload is written where its entries point, outside the destination too.
@@ -162,8 +158,8 @@ TEST_F(PayloadExtraction, AsArchivedWritesEscapingEntriesWhereTheyPoint) {
 }
 
 // Network archives hold only files, directories and links that stay inside. The first entry that
-// could reach outside (or is no such thing) stops the extraction with one line: nothing after it
-// is written, and nothing outside changes.
+// could reach outside (or is no such thing) stops the extraction: nothing after it is written, and
+// nothing outside changes.
 TEST_F(PayloadExtraction, PathSafeStopsAtTheFirstEntryThatCouldLeave) {
     const std::string outside = dir / "outside";
     writeText(outside + "/secret", "secret");
@@ -187,7 +183,6 @@ TEST_F(PayloadExtraction, PathSafeStopsAtTheFirstEntryThatCouldLeave) {
     for (const Case& c : cases) {
         SCOPED_TRACE(c.name);
         fs::remove_all(destination);
-        log.clear();
         std::vector<ArchiveItem> items{test::fileItem("first.txt", "first")};
         items.insert(items.end(), c.hostile.begin(), c.hostile.end());
         items.push_back(test::fileItem("last.txt", "last"));
@@ -198,8 +193,6 @@ TEST_F(PayloadExtraction, PathSafeStopsAtTheFirstEntryThatCouldLeave) {
         EXPECT_EQ(snapshotTree(dir.path()).count("up.txt"), 0u);
         EXPECT_EQ(readText(dir / "dest/first.txt"), "first");
         EXPECT_FALSE(fs::exists(fs::symlink_status(dir / "dest/last.txt")));
-        EXPECT_EQ(log.messages().size(), 1u);
-        EXPECT_TRUE(log.messages().front().starts_with("Refusing the archive entry"));
     }
     // Links that stay inside, however they are spelled, are taken as they are, and a destination
     // reached through a link of the caller's is fine.
