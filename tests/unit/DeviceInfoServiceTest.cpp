@@ -25,10 +25,6 @@ void writeTableBytes(const std::string& bytes) {
     std::filesystem::rename(staging, tablePath());
 }
 
-void writeTable(const Value& table) {
-    writeTableBytes(plist::serialize(table));
-}
-
 class DeviceInfoTable : public testing::Test {
   protected:
     CapturingLogSink sink;
@@ -36,10 +32,10 @@ class DeviceInfoTable : public testing::Test {
 };
 
 TEST_F(DeviceInfoTable, AnswersEachTypeFromTheTableAsItIsNow) {
-    writeTable(plist::Dictionary{{"DeviceClass", Value("Tablet")},
-                                 {"wi-fi", Value(true)},
-                                 {"contains-cellular-radio", Value(false)},
-                                 {"ReleaseType", Value(3)}});
+    test::writeDeviceTable(plist::Dictionary{{"DeviceClass", Value("Tablet")},
+                                             {"wi-fi", Value(true)},
+                                             {"contains-cellular-radio", Value(false)},
+                                             {"ReleaseType", Value(3)}});
     EXPECT_EQ(copyDeviceStringAnswer("DeviceClass"), "Tablet");
     EXPECT_TRUE(deviceBooleanAnswer("wi-fi"));
     EXPECT_FALSE(deviceBooleanAnswer("contains-cellular-radio"));
@@ -56,7 +52,7 @@ TEST_F(DeviceInfoTable, AnswersEachTypeFromTheTableAsItIsNow) {
     EXPECT_TRUE(sink.messages().empty());
 
     // Changes to the file are followed.
-    writeTable(plist::Dictionary{{"DeviceClass", Value("Phone")}});
+    test::writeDeviceTable(plist::Dictionary{{"DeviceClass", Value("Phone")}});
     EXPECT_EQ(copyDeviceStringAnswer("DeviceClass"), "Phone");
     std::filesystem::remove(tablePath());
     EXPECT_EQ(copyDeviceStringAnswer("DeviceClass"), std::nullopt);
@@ -71,14 +67,14 @@ TEST_F(DeviceInfoTable, UnusableTableIsLoggedOncePerVersionAndAnswersNothing) {
     EXPECT_EQ(sink.messages(), std::vector<std::string>{damaged});
 
     sink.clear();
-    writeTable(plist::Array{Value("DeviceClass")});
+    writeTableBytes(plist::serialize(plist::Array{Value("DeviceClass")}));
     EXPECT_EQ(copyDeviceStringAnswer("DeviceClass"), std::nullopt);
     EXPECT_EQ(copyDeviceStringAnswer("DeviceClass"), std::nullopt);
     EXPECT_EQ(sink.messages(), std::vector<std::string>{"Device information table " + tablePath() +
                                                         " is not a dictionary; ignoring it"});
 
     sink.clear();
-    writeTable(plist::Dictionary{{"DeviceClass", Value("Phone")}});
+    test::writeDeviceTable(plist::Dictionary{{"DeviceClass", Value("Phone")}});
     EXPECT_EQ(copyDeviceStringAnswer("DeviceClass"), "Phone");
     EXPECT_TRUE(sink.messages().empty());
 }
@@ -86,7 +82,7 @@ TEST_F(DeviceInfoTable, UnusableTableIsLoggedOncePerVersionAndAnswersNothing) {
 TEST_F(DeviceInfoTable, MissingKeysComeFromTheRunningSystemAndTheTableWins) {
     test::writeText((test::unitTestRoot() / "etc/os-release").string(),
                     "NAME=\"Test OS\"\nVERSION_ID=\"4.2\"\nBUILD_ID=21A100\n");
-    writeTable(plist::Dictionary{{"BuildVersion", Value("TableBuild")}});
+    test::writeDeviceTable(plist::Dictionary{{"BuildVersion", Value("TableBuild")}});
     EXPECT_EQ(copyDeviceStringAnswer("ProductVersion"), "4.2");
     EXPECT_EQ(copyDeviceStringAnswer("BuildVersion"), "TableBuild");
     // A damaged table still leaves the running system's answers.

@@ -10,8 +10,8 @@
 
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
-#include "plist/PropertyListFormat.h"
 #include "device/TXUtility.h"
+#include "plist/PropertyListFormat.h"
 
 namespace tavrix {
 namespace {
@@ -88,28 +88,17 @@ TEST(TXUtilityFiles, URLIfFileExistsAnswersExistingPathsOnly) {
     EXPECT_EQ(TXUtility::URLIfFileExists(dir / "dangling"), std::nullopt);
 }
 
-// Runs in the given zone and puts the previous one back afterwards.
+// Runs in the zone a test asks for (skipped when its data is not installed) and puts the previous
+// one back afterwards.
 class CalendarInZone : public testing::Test {
   protected:
-    // False (and the test marked skipped) when the zone's data is not installed.
     bool useZone(const char* zone) {
-        if (!std::filesystem::exists(std::string("/usr/share/zoneinfo/") + zone)) {
-            skipWithout(zone);
-            return false;
-        }
         ::setenv("TZ", zone, 1);
         ::tzset();
-        return true;
-    }
-    static void skipWithout(const char* zone) {
-        GTEST_SKIP() << "time zone data for " << zone << " is not installed (tzdata)";
+        return std::filesystem::exists(std::string("/usr/share/zoneinfo/") + zone);
     }
     void TearDown() override {
-        if (saved_) {
-            ::setenv("TZ", saved_->c_str(), 1);
-        } else {
-            ::unsetenv("TZ");
-        }
+        saved_ ? ::setenv("TZ", saved_->c_str(), 1) : ::unsetenv("TZ");
         ::tzset();
     }
 
@@ -124,18 +113,14 @@ class CalendarInZone : public testing::Test {
         return plist::Date::fromUnixTime(static_cast<double>(std::mktime(&fields)));
     }
 
-    // Keeps the test's output quiet.
-
   private:
-    std::optional<std::string> saved_ = [] {
-        const char* tz = std::getenv("TZ");
-        return tz == nullptr ? std::nullopt : std::optional<std::string>(tz);
-    }();
+    const char* tz_ = std::getenv("TZ");
+    std::optional<std::string> saved_ = tz_ ? std::optional<std::string>(tz_) : std::nullopt;
 };
 
 TEST_F(CalendarInZone, DaysFollowTheWallClockAcrossDaylightSaving) {
     if (!useZone("America/New_York")) {
-        return;
+        GTEST_SKIP() << "no time zone data (tzdata)";
     }
     plist::Date before = localDate(2026, 3, 7, 12, 0);
     auto after = TXUtility::addToDate(before, 1);
@@ -163,7 +148,7 @@ TEST_F(CalendarInZone, DaysFollowTheWallClockAcrossDaylightSaving) {
 // none.
 TEST_F(CalendarInZone, MovesBackAndAcrossMonthsKeepingFractions) {
     if (!useZone("UTC")) {
-        return;
+        GTEST_SKIP() << "no time zone data (tzdata)";
     }
     plist::Date start{800000000.25};  // 2026-05-09 06:13:20.25 UTC
     auto earlier = TXUtility::addToDate(start, -40);
