@@ -17,9 +17,6 @@ namespace {
 namespace fs = std::filesystem;
 using Clock = std::chrono::steady_clock;
 
-constexpr std::string_view kDaemonPreferences =
-    "/var/mobile/Library/Preferences/com.zandor.tavrixservices.plist";
-
 }  // namespace
 
 DeviceRoot::DeviceRoot() {
@@ -48,16 +45,8 @@ void DeviceRoot::setCellularRadio(bool present) {
                                                       });
 }
 
-void DeviceRoot::writeDaemonPreferences(const plist::Dictionary& values) {
-    writePropertyList(kDaemonPreferences, values);
-}
-
 std::optional<plist::Value> DeviceRoot::readDaemonPreferences() const {
     return plist::readFile(path(kDaemonPreferences).string());
-}
-
-void DeviceRoot::writeBehaviorSettings(const plist::Dictionary& values) {
-    writePropertyList("/var/mobile/Library/Preferences/com.zandor.tavrix.plist", values);
 }
 
 void DeviceRoot::writePropertyList(std::string_view absolutePath, const plist::Dictionary& values) {
@@ -237,15 +226,10 @@ std::vector<std::string> BusFixture::daemonLogLines() const {
     return lines;
 }
 
-int BusFixture::countLogLines(const std::string& line) const {
-    const auto lines = daemonLogLines();
-    return static_cast<int>(std::count(lines.begin(), lines.end(), line));
-}
-
-int BusFixture::countLogLinesContaining(const std::string& text) const {
+int BusFixture::countLogLines(const std::string& text, bool whole) const {
     const auto lines = daemonLogLines();
     return static_cast<int>(std::count_if(lines.begin(), lines.end(), [&](const std::string& line) {
-        return line.find(text) != std::string::npos;
+        return whole ? line == text : line.find(text) != std::string::npos;
     }));
 }
 
