@@ -70,15 +70,16 @@ class BundleFlowTest : public BusFixture {
         return {};
     }
 
-    struct stat linkStat(const char* link) {
+    struct stat linkStat(const fs::path& path) {
         struct stat info {};
-        EXPECT_EQ(::lstat(at(link).c_str(), &info), 0) << link;
+        EXPECT_EQ(::lstat(path.c_str(), &info), 0) << path;
         return info;
     }
 };
 
 // The main flow through tavrixctl: the first set installs, overlays, links and notifies once;
-// the same call again reports no change, posts nothing and leaves the links alone.
+// the same call again reports no change, posts nothing and leaves the links and the generated
+// file alone.
 TEST_F(BundleFlowTest, FirstSetLinksTheOverlaidCarrierFileAndRepeatingItChangesNothing) {
     device().writeDaemonPreferences({{"EnableSupport", true}});
     auto payload = packBundle("10");
@@ -144,16 +145,18 @@ TEST_F(BundleFlowTest, FirstSetLinksTheOverlaidCarrierFileAndRepeatingItChangesN
     EXPECT_EQ(client().copyTavrixValue("CarrierName"),
               std::optional<plist::Value>("Bundle 10 Economy"));
 
-    const struct stat bundleLinkBefore = linkStat(kBundleLink);
-    const struct stat preferencesLinkBefore = linkStat(kPreferencesLink);
+    // The generated file stays as written, in a directory others may read.
+    EXPECT_EQ(fs::status(at(kOverlayDirectory)).permissions(), fs::perms(0755));
+    const struct stat bundleLinkBefore = linkStat(at(kBundleLink));
+    const struct stat preferencesLinkBefore = linkStat(at(kPreferencesLink));
+    const struct stat overlayBefore = linkStat(overlayFile);
     CommandResult second = runCommand(setID);
     ASSERT_EQ(second.status, 0) << second.output;
     EXPECT_TRUE(waitForLogLine(matchResult("kBundleChangeTypeNoChange")));
-    EXPECT_TRUE(waitForLogLine("Overridden file " + overlayFile.string() +
-                               " already exists, not generating again"));
     EXPECT_FALSE(watcher().waitForNotification(kChanged, 2, 1s));
-    EXPECT_EQ(linkStat(kBundleLink).st_ino, bundleLinkBefore.st_ino);
-    EXPECT_EQ(linkStat(kPreferencesLink).st_ino, preferencesLinkBefore.st_ino);
+    EXPECT_EQ(linkStat(at(kBundleLink)).st_ino, bundleLinkBefore.st_ino);
+    EXPECT_EQ(linkStat(at(kPreferencesLink)).st_ino, preferencesLinkBefore.st_ino);
+    EXPECT_EQ(linkStat(overlayFile).st_ino, overlayBefore.st_ino);
 }
 
 // Only the behavior bit differs between an unlisted ID (the base carrier file) and a listed one:

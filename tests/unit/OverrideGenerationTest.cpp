@@ -79,27 +79,6 @@ class OverrideGenerationTest : public testing::Test {
     }
 };
 
-// A behavior overlay is written once, in a directory of mode 0755: a changed base later brings no
-// new file. (Its name and content, without the section, show on the real daemon.)
-TEST_F(OverrideGenerationTest, BehaviorOverlayIsWrittenOnce) {
-    writeDevice("T12AP");
-    writeBundle(Value(baseCarrier()));
-    CarrierBundle record = baseBundle();
-    const std::string written = overlayFile("id+behavior+Default.bundle+abc+1.0.plist");
-    EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kOverrideBundleSuccess);
-    EXPECT_EQ(record.carrierFilePath, written);
-    EXPECT_EQ(record.overlayType, kBehaviorOverlay);
-    EXPECT_EQ(fs::status(fs::path(written).parent_path()).permissions(), fs::perms(0755));
-
-    Dictionary changed = baseCarrier();
-    changed.insert_or_assign("Model", "changed");
-    writeBundle(Value(changed));
-    CarrierBundle again = baseBundle();
-    EXPECT_EQ(applyMultimodeOverlay(again, std::string("abc")), kOverrideBundleSuccess);
-    EXPECT_EQ(again.carrierFilePath, written);
-    EXPECT_EQ(plist::readFile(written), Value(Dictionary{{"Name", "Abc"}, {"Model", "generic"}}));
-}
-
 // Without a device file for the model, the device decision leaves the base bundle in the record;
 // without a listed ID, so does the behavior overlay.
 TEST_F(OverrideGenerationTest, WithoutAMatchTheRecordKeepsTheBaseFile) {
