@@ -9,7 +9,6 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
-#include <map>
 #include <memory>
 #include <sstream>
 #include <stdexcept>
@@ -210,17 +209,15 @@ void PrivateBus::stop() {
 
 std::vector<DaemonLaunch> PrivateBus::launches() const {
     std::vector<DaemonLaunch> result;
-    std::map<pid_t, std::size_t> indexOfPid;
     std::istringstream lines(readText(directory_ / "launches"));
     std::string what;
     pid_t pid = -1;
     while (lines >> what >> pid) {
         if (what == "started") {
-            indexOfPid[pid] = result.size();
             result.push_back({pid, std::nullopt});
         } else if (int status = 0; what == "exited" && lines >> status) {
-            if (auto found = indexOfPid.find(pid); found != indexOfPid.end()) {
-                result[found->second].exitStatus = status;
+            for (DaemonLaunch& launch : result) {
+                launch.exitStatus = launch.pid == pid ? std::optional(status) : launch.exitStatus;
             }
         }
     }

@@ -42,12 +42,10 @@ using plist::Value;
 // the release type is read only when the build is not internal already.
 TEST(BuildCapabilities, DecisionFollowsTheAnswers) {
     const std::tuple<const char*, plist::Dictionary, bool, bool, bool> cases[] = {
-        {"nothing answered", {}, false, false, false},
         {"Desense", {{"ReleaseType", Value("Desense")}}, true, false, false},
         {"Vendor", {{"ReleaseType", Value("Vendor")}}, false, false, true},
         {"case matters", {{"ReleaseType", Value("vendor")}}, false, false, false},
         {"internal wins", {{"InternalBuild", true}, {"ReleaseType", "Vendor"}}, true, false, false},
-        {"not internal", {{"InternalBuild", false}, {"ReleaseType", "Vendor"}}, false, false, true},
         {"carrier install", {{"CarrierInstallCapability", true}}, false, true, false},
         {"other types ignored",
          {{"InternalBuild", 1},

@@ -88,7 +88,6 @@ TEST_F(OverlayConfigurationTest, TheBehaviorIDIsLookedUpAsGiven) {
     const std::tuple<std::string, Value, std::string, std::optional<Dictionary>> cases[] = {
         {"abc", base, "abc", configuration},
         {"ABC", base, "ABC", std::nullopt},
-        {"xyz", base, "xyz", std::nullopt},
         {"", base, "", std::nullopt},
         {"abc", baseWith({}), "abc", std::nullopt},
         {"abc", Value(Dictionary{{"CarrierName", "Base"}}), "", std::nullopt},

@@ -65,15 +65,8 @@ TEST(TXUtilityDiskSpace, NeedsStrictlyMoreFreeBytesThanAskedOnTheHomeFileSystem)
     // The home's own file system is asked; a home that cannot be asked answers NO.
     EXPECT_TRUE(TXUtility::hasEnoughDiskSpace(0));
     EXPECT_FALSE(TXUtility::hasEnoughDiskSpace(UINT64_MAX));
-    const char* saved = std::getenv("HOME");
-    std::string previous = saved == nullptr ? "" : saved;
-    ::setenv("HOME", "/nonexistent/tavrix-home", 1);
+    ::setenv("HOME", "/nonexistent/tavrix-home", 1);  // the test has a process of its own
     EXPECT_FALSE(TXUtility::hasEnoughDiskSpace(0));
-    if (saved != nullptr) {
-        ::setenv("HOME", previous.c_str(), 1);
-    } else {
-        ::unsetenv("HOME");
-    }
 }
 
 TEST(TXUtilityFiles, URLIfFileExistsAnswersExistingPathsOnly) {
