@@ -8,6 +8,7 @@
 #include <sstream>
 #include <stdexcept>
 #include <thread>
+#include <tuple>
 
 #include "plist/PropertyListFormat.h"
 
@@ -61,21 +62,19 @@ void DeviceRoot::writePropertyList(std::string_view absolutePath, const plist::D
 }
 
 BusWatcher::BusWatcher(const std::string& address) : bus_(test::connectToBus(address)) {
-    sd_bus_slot* slot = nullptr;
-    test::check(
-        sd_bus_add_match(bus_.get(), &slot,
-                         "type='signal',sender='org.freedesktop.DBus',interface='org.freedesktop."
-                         "DBus',member='NameOwnerChanged',arg0='com.zandor.tavrixservicesd'",
-                         &onNameOwnerChanged, this),
-        "sd_bus_add_match");
-    ownerSlot_.reset(slot);
-    test::check(
-        sd_bus_add_match(bus_.get(), &slot,
-                         "type='signal',interface='com.zandor.NotificationCenter',member='Posted'",
-                         &onPosted, this),
-        "sd_bus_add_match");
-    postedSlot_.reset(slot);
     // The bus is new: nobody owns the name yet.
+    for (auto [slot, match, handler] :
+         {std::tuple{&ownerSlot_,
+                     "type='signal',sender='org.freedesktop.DBus',interface='org.freedesktop.DBus',"
+                     "member='NameOwnerChanged',arg0='com.zandor.tavrixservicesd'",
+                     &onNameOwnerChanged},
+          std::tuple{&postedSlot_,
+                     "type='signal',interface='com.zandor.NotificationCenter',member='Posted'",
+                     &onPosted}}) {
+        sd_bus_slot* made = nullptr;
+        test::check(sd_bus_add_match(bus_.get(), &made, match, handler, this), "sd_bus_add_match");
+        slot->reset(made);
+    }
 }
 
 bool BusWatcher::waitUntil(const std::function<bool()>& done, std::chrono::milliseconds timeout) {

@@ -1,7 +1,7 @@
 // Peers of the daemon: accepted on their first call, removed when they leave the bus. (Calls of
 // the wrong signature never reach the daemon's code: the bus library refuses them by the table.)
+#include <cerrno>
 #include <cstdint>
-#include <fstream>
 
 #include "BusFixture.h"
 
@@ -10,16 +10,9 @@ namespace {
 
 using DaemonClientsTest = BusFixture;
 
-// The daemon names a client by its command name, which the kernel truncates to 15 bytes.
-std::string ownCommandName() {
-    std::ifstream in("/proc/self/comm");
-    std::string name;
-    std::getline(in, name);
-    return name;
-}
-
 TEST_F(DaemonClientsTest, ClientsAreCountedInOnFirstCallAndOutWhenTheyLeave) {
-    const std::string name = ownCommandName();
+    // The daemon names a client by its command name, which the kernel cuts to 15 bytes.
+    const std::string name = std::string(program_invocation_short_name).substr(0, 15);
     std::optional<client::TavrixClient> first(client());
     EXPECT_TRUE(first->setClientType(0));
     EXPECT_TRUE(waitForLogLine("Added client: " + name + ", count: 1"));
