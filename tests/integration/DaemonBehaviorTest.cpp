@@ -12,13 +12,11 @@ using DaemonBehaviorTest = BusFixture;
 TEST_F(DaemonBehaviorTest, CellularDeviceRefusesTheIdAndSupportsNothing) {
     device().setCellularRadio(true);
     device().writeDaemonPreferences({{"TavrixID", "abc"}, {"EnableSupport", true}});
-    device().writeBehaviorSettings({{"CarrierName", "Zed"}});
     auto caller = client();
 
     EXPECT_FALSE(caller.setTavrixID("xyz", std::nullopt));
     EXPECT_EQ(device().daemonPreference("TavrixID"), std::optional<plist::Value>("abc"));
     EXPECT_FALSE(caller.isTavrixBundleSupported());
-    EXPECT_EQ(caller.copyTavrixValue("CarrierName"), std::nullopt);
     EXPECT_FALSE(caller.checkForTavrixBundleUpdate());
 }
 

