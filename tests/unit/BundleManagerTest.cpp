@@ -214,9 +214,7 @@ TEST_F(BundleManagerStartUp, LinksThatDisagreeAreLinkedAgainAndLeftoversRemoved)
     EXPECT_EQ(manager.resetBehaviorBundle("ab12"), kBundleChangeTypeNoChange);
 }
 
-using BundleReset = BundleDevice;
-
-TEST_F(BundleReset, WithoutAnIDNothingRuns) {
+TEST_F(BundleManagerStartUp, WithoutAnIDTheResetRunsNothing) {
     BundleManager& manager = BundleManager::sharedInstance();
     EXPECT_EQ(manager.resetBehaviorBundle(std::nullopt), kBundleChangeTypeNoChange);
     EXPECT_FALSE(fs::exists(fs::symlink_status(bundleLink())));

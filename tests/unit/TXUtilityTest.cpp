@@ -18,16 +18,14 @@ namespace {
 
 using plist::Value;
 
-using test::writeDeviceTable;
-
 TEST(TXUtilityFacts, StringFactsComeFromTheTableAndAreKeptForTheProcess) {
-    writeDeviceTable({{"SerialNumber", Value("C02XYZ")},
-                      {"DeviceClass", Value("Tablet")},
-                      {"ProductType", Value("Tab1,2")},
-                      {"ProductVersion", Value("3.1")},
-                      {"BuildVersion", Value("3B12")},
-                      {"ReleaseType", Value(7)},
-                      {"HWModelStr", Value("T12AP")}});
+    test::writeDeviceTable({{"SerialNumber", Value("C02XYZ")},
+                            {"DeviceClass", Value("Tablet")},
+                            {"ProductType", Value("Tab1,2")},
+                            {"ProductVersion", Value("3.1")},
+                            {"BuildVersion", Value("3B12")},
+                            {"ReleaseType", Value(7)},
+                            {"HWModelStr", Value("T12AP")}});
     EXPECT_EQ(TXUtility::serialNumber(), "C02XYZ");
     EXPECT_EQ(TXUtility::currentProductCategory(), "Tablet");
     EXPECT_EQ(TXUtility::currentProductType(), "Tab1,2");
@@ -36,7 +34,7 @@ TEST(TXUtilityFacts, StringFactsComeFromTheTableAndAreKeptForTheProcess) {
     EXPECT_EQ(TXUtility::currentReleaseType(), std::nullopt);
     EXPECT_EQ(TXUtility::currentHardwareModel(), "T12AP");
 
-    writeDeviceTable({{"DeviceClass", Value("Phone")}, {"ReleaseType", Value("Beta")}});
+    test::writeDeviceTable({{"DeviceClass", Value("Phone")}, {"ReleaseType", Value("Beta")}});
     EXPECT_EQ(TXUtility::currentProductCategory(), "Tablet");
     EXPECT_EQ(TXUtility::currentReleaseType(), std::nullopt);
     EXPECT_EQ(TXUtility::serialNumber(), "C02XYZ");
@@ -44,10 +42,10 @@ TEST(TXUtilityFacts, StringFactsComeFromTheTableAndAreKeptForTheProcess) {
 
 // Radio capabilities follow the table as it is now; only booleans count.
 TEST(TXUtilityFacts, RadioCapabilitiesFollowTheTable) {
-    writeDeviceTable({{"contains-cellular-radio", Value(true)}, {"wi-fi", Value(true)}});
+    test::writeDeviceTable({{"contains-cellular-radio", Value(true)}, {"wi-fi", Value(true)}});
     EXPECT_TRUE(TXUtility::hasCellularRadio());
     EXPECT_TRUE(TXUtility::isWiFiCapable());
-    writeDeviceTable({{"contains-cellular-radio", Value("yes")}, {"wi-fi", Value(false)}});
+    test::writeDeviceTable({{"contains-cellular-radio", Value("yes")}, {"wi-fi", Value(false)}});
     EXPECT_FALSE(TXUtility::hasCellularRadio());
     EXPECT_FALSE(TXUtility::isWiFiCapable());
 }
