@@ -8,6 +8,7 @@
 #include <sstream>
 #include <stdexcept>
 #include <thread>
+#include <tuple>
 
 #include "plist/PropertyListFormat.h"
 
@@ -16,9 +17,6 @@ namespace {
 
 namespace fs = std::filesystem;
 using Clock = std::chrono::steady_clock;
-
-constexpr std::string_view kDaemonPreferences =
-    "/var/mobile/Library/Preferences/com.zandor.tavrixservices.plist";
 
 }  // namespace
 
@@ -48,16 +46,8 @@ void DeviceRoot::setCellularRadio(bool present) {
                                                       });
 }
 
-void DeviceRoot::writeDaemonPreferences(const plist::Dictionary& values) {
-    writePropertyList(kDaemonPreferences, values);
-}
-
 std::optional<plist::Value> DeviceRoot::readDaemonPreferences() const {
     return plist::readFile(path(kDaemonPreferences).string());
-}
-
-void DeviceRoot::writeBehaviorSettings(const plist::Dictionary& values) {
-    writePropertyList("/var/mobile/Library/Preferences/com.zandor.tavrix.plist", values);
 }
 
 void DeviceRoot::writePropertyList(std::string_view absolutePath, const plist::Dictionary& values) {
@@ -72,21 +62,19 @@ void DeviceRoot::writePropertyList(std::string_view absolutePath, const plist::D
 }
 
 BusWatcher::BusWatcher(const std::string& address) : bus_(test::connectToBus(address)) {
-    sd_bus_slot* slot = nullptr;
-    test::check(
-        sd_bus_add_match(bus_.get(), &slot,
-                         "type='signal',sender='org.freedesktop.DBus',interface='org.freedesktop."
-                         "DBus',member='NameOwnerChanged',arg0='com.zandor.tavrixservicesd'",
-                         &onNameOwnerChanged, this),
-        "sd_bus_add_match");
-    ownerSlot_.reset(slot);
-    test::check(
-        sd_bus_add_match(bus_.get(), &slot,
-                         "type='signal',interface='com.zandor.NotificationCenter',member='Posted'",
-                         &onPosted, this),
-        "sd_bus_add_match");
-    postedSlot_.reset(slot);
     // The bus is new: nobody owns the name yet.
+    for (auto [slot, match, handler] :
+         {std::tuple{&ownerSlot_,
+                     "type='signal',sender='org.freedesktop.DBus',interface='org.freedesktop.DBus',"
+                     "member='NameOwnerChanged',arg0='com.zandor.tavrixservicesd'",
+                     &onNameOwnerChanged},
+          std::tuple{&postedSlot_,
+                     "type='signal',interface='com.zandor.NotificationCenter',member='Posted'",
+                     &onPosted}}) {
+        sd_bus_slot* made = nullptr;
+        test::check(sd_bus_add_match(bus_.get(), &made, match, handler, this), "sd_bus_add_match");
+        slot->reset(made);
+    }
 }
 
 bool BusWatcher::waitUntil(const std::function<bool()>& done, std::chrono::milliseconds timeout) {
@@ -237,15 +225,10 @@ std::vector<std::string> BusFixture::daemonLogLines() const {
     return lines;
 }
 
-int BusFixture::countLogLines(const std::string& line) const {
-    const auto lines = daemonLogLines();
-    return static_cast<int>(std::count(lines.begin(), lines.end(), line));
-}
-
-int BusFixture::countLogLinesContaining(const std::string& text) const {
+int BusFixture::countLogLines(const std::string& text, bool whole) const {
     const auto lines = daemonLogLines();
     return static_cast<int>(std::count_if(lines.begin(), lines.end(), [&](const std::string& line) {
-        return line.find(text) != std::string::npos;
+        return whole ? line == text : line.find(text) != std::string::npos;
     }));
 }
 

@@ -77,7 +77,9 @@ class DeviceRoot {
 
     void setCellularRadio(bool present);
     // The daemon's own preferences and the behavior settings domain of the mobile user.
-    void writeDaemonPreferences(const plist::Dictionary& values);
+    void writeDaemonPreferences(const plist::Dictionary& values) {
+        writePropertyList(kDaemonPreferences, values);
+    }
     std::optional<plist::Value> readDaemonPreferences() const;
     // One key of the daemon's preferences, or nothing.
     std::optional<plist::Value> daemonPreference(const std::string& key) const {
@@ -85,11 +87,15 @@ class DeviceRoot {
         const plist::Value* value = preferences ? preferences->find(key) : nullptr;
         return value != nullptr ? std::optional(*value) : std::nullopt;
     }
-    void writeBehaviorSettings(const plist::Dictionary& values);
+    void writeBehaviorSettings(const plist::Dictionary& values) {
+        writePropertyList(kPreferencesLink, values);
+    }
     // The keep-alive flag file's text, "" when there is none.
     std::string keepAliveFlag() const { return test::readText(runtimeDirectory() / "keep-alive"); }
 
   private:
+    static constexpr const char* kDaemonPreferences =
+        "/var/mobile/Library/Preferences/com.zandor.tavrixservices.plist";
     // In one step, so that the daemon never reads half of the file and its cache sees a new one.
     void writePropertyList(std::string_view absolutePath, const plist::Dictionary& values);
 
@@ -173,8 +179,10 @@ class BusFixture : public ::testing::Test {
     // The log's lines, in order.
     std::vector<std::string> daemonLogLines() const;
     // How often line appears in the log as a whole line, or contains text.
-    int countLogLines(const std::string& line) const;
-    int countLogLinesContaining(const std::string& text) const;
+    int countLogLines(const std::string& line) const { return countLogLines(line, true); }
+    int countLogLinesContaining(const std::string& text) const {
+        return countLogLines(text, false);
+    }
     // Waits until line has appeared count times (the log is a file, so this polls it).
     bool waitForLogLine(const std::string& line, std::chrono::milliseconds timeout = 10s,
                         int count = 1) const;
@@ -191,6 +199,8 @@ class BusFixture : public ::testing::Test {
     std::optional<std::filesystem::path> policyFile;
 
   private:
+    int countLogLines(const std::string& text, bool whole) const;
+
     DeviceRoot device_;
     std::set<pid_t> killed_;
     std::unique_ptr<test::PrivateBus> bus_;

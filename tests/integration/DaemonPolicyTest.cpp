@@ -7,6 +7,8 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <iterator>
+#include <sstream>
 
 #include "BusFixture.h"
 #include "TestSupport.h"
@@ -106,37 +108,31 @@ TEST_F(DaemonPolicyTest, AnyoneMayAskButOnlyPrivilegedCallersMayChange) {
 }
 
 TEST_F(DaemonPolicyTest, OnlyTheDaemonsUserMayOwnTheNameOrPost) {
-    const std::vector<std::string> requestName = {"call",
-                                                  "org.freedesktop.DBus",
-                                                  "/org/freedesktop/DBus",
-                                                  "org.freedesktop.DBus",
-                                                  "RequestName",
-                                                  "su",
-                                                  kDaemonBusName,
-                                                  "0"};
-    std::vector<std::string> busctl = {"/usr/bin/busctl", "--address=" + busAddress()};
-    busctl.insert(busctl.end(), requestName.begin(), requestName.end());
+    // busctl on the test's bus with the words of arguments.
+    auto busctl = [&](const std::string& arguments) {
+        std::istringstream words(arguments);
+        std::vector<std::string> argv = {"/usr/bin/busctl", "--address=" + busAddress()};
+        argv.insert(argv.end(), std::istream_iterator<std::string>(words), {});
+        return argv;
+    };
+    const auto requestName = busctl(
+        "call org.freedesktop.DBus /org/freedesktop/DBus org.freedesktop.DBus RequestName su " +
+        std::string(kDaemonBusName) + " 0");
 
-    auto refused = asNobody(kNobody, busctl);
+    auto refused = asNobody(kNobody, requestName);
     EXPECT_NE(refused.status, 0) << refused.output;
     EXPECT_THAT(refused.output, HasSubstr("Access denied"));
 
     // The daemon's user (here the test's own) gets it: busctl becomes the primary owner (1).
-    auto owned = runCommand(busctl);
+    auto owned = runCommand(requestName);
     EXPECT_EQ(owned.status, 0) << owned.output;
     EXPECT_EQ(owned.output, "u 1\n");
 
     // A look-alike notification from anyone else never reaches a listener, even one that does
     // not check the sender; the daemon's user, posting after it, gets through.
     auto post = [&](const std::string& name) {
-        return std::vector<std::string>{"/usr/bin/busctl",
-                                        "--address=" + busAddress(),
-                                        "emit",
-                                        "/com/zandor/tavrixservicesd",
-                                        "com.zandor.NotificationCenter",
-                                        "Posted",
-                                        "s",
-                                        name};
+        return busctl("emit /com/zandor/tavrixservicesd com.zandor.NotificationCenter Posted s " +
+                      name);
     };
     asNobody(kNobody, post("kTVXBehaviorBundleChangedNotification"));
     EXPECT_EQ(runCommand(post("PolicyTestMarker")).status, 0);

@@ -6,16 +6,12 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <cerrno>
-#include <chrono>
 #include <cstdio>
 #include <cstring>
-#include <map>
 #include <memory>
 #include <sstream>
 #include <stdexcept>
-#include <thread>
 
 #include "io/UniqueFd.h"
 
@@ -25,7 +21,6 @@ namespace tavrix::test {
 namespace {
 
 namespace fs = std::filesystem;
-using namespace std::chrono_literals;
 
 constexpr const char* kOpenPolicy = R"(  <policy context="default">
     <allow send_destination="*" eavesdrop="true"/>
@@ -55,18 +50,6 @@ constexpr const char* kSystemDefaultPolicy = R"(  <policy context="default">
 
 std::string quoted(const fs::path& path) {
     return "'" + path.string() + "'";
-}
-
-std::vector<std::string> busEnvironment() {
-    std::vector<std::string> result;
-    for (char** entry = environ; *entry != nullptr; ++entry) {
-        std::string_view text(*entry);
-        if (!text.starts_with("DBUS_") && !text.starts_with("TAVRIX_") &&
-            !text.starts_with("RUNTIME_DIRECTORY=")) {
-            result.emplace_back(text);
-        }
-    }
-    return result;
 }
 
 // Starts argv[0] (a path, or a name looked up in PATH) with stdin from /dev/null, stdout and
@@ -101,60 +84,6 @@ int waitForExit(pid_t pid) {
 }
 
 }  // namespace
-
-DbusDaemonProcess::DbusDaemonProcess(const fs::path& configFile, const fs::path& logFile) {
-    io::UniqueFd log(::open(logFile.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644));
-    int ends[2];
-    if (!log || ::pipe2(ends, O_CLOEXEC) != 0) {
-        throw std::runtime_error("cannot prepare the bus's log or address pipe");
-    }
-    io::UniqueFd addressRead(ends[0]);
-    // Above the descriptors the child is given, so that no dup2 overwrites it.
-    io::UniqueFd addressWrite(::fcntl(ends[1], F_DUPFD_CLOEXEC, 10));
-    ::close(ends[1]);
-
-    std::vector<std::string> environment = busEnvironment();
-    std::vector<char*> pointers;
-    for (std::string& entry : environment) {
-        pointers.push_back(entry.data());
-    }
-    pointers.push_back(nullptr);
-    pid_ = spawn(
-        {"dbus-daemon", "--config-file=" + configFile.string(), "--nofork", "--print-address=3"},
-        log.get(), addressWrite.get(), pointers.data());
-    if (pid_ < 0) {
-        throw std::runtime_error("cannot start dbus-daemon");
-    }
-    addressWrite.reset();
-    // The first line it prints, or nothing when it ends first.
-    std::unique_ptr<FILE, int (*)(FILE*)> in(::fdopen(addressRead.release(), "r"), &std::fclose);
-    char line[512] = "";
-    if (in && std::fgets(line, sizeof line, in.get()) != nullptr && std::strchr(line, '\n')) {
-        address_.assign(line, std::strcspn(line, "\n"));
-    }
-    if (address_.empty()) {
-        stop();
-        throw std::runtime_error("dbus-daemon did not report its address:\n" +
-                                 readText(logFile.string()));
-    }
-}
-
-void DbusDaemonProcess::stop() {
-    if (pid_ <= 0) {
-        return;
-    }
-    ::kill(pid_, SIGTERM);
-    const auto deadline = std::chrono::steady_clock::now() + 5s;
-    while (::waitpid(pid_, nullptr, WNOHANG) == 0) {
-        if (std::chrono::steady_clock::now() > deadline) {
-            ::kill(pid_, SIGKILL);
-            ::waitpid(pid_, nullptr, 0);
-            break;
-        }
-        std::this_thread::sleep_for(10ms);
-    }
-    pid_ = -1;
-}
 
 CommandResult runCommand(const std::vector<std::string>& argv) {
     int ends[2];
@@ -233,22 +162,62 @@ PrivateBus::PrivateBus(const std::optional<ActivatedDaemon>& daemon,
               "<busconfig>\n  <type>session</type>\n  <listen>unix:path=" +
                   (directory / "socket").string() + "</listen>\n  <auth>EXTERNAL</auth>\n" + extra +
                   "</busconfig>\n");
-    process_.emplace(directory / "bus.conf", directory / "bus.log");
+
+    io::UniqueFd logFile(
+        ::open((directory / "bus.log").c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0644));
+    int ends[2];
+    if (!logFile || ::pipe2(ends, O_CLOEXEC) != 0) {
+        throw std::runtime_error("cannot prepare the bus's log or address pipe");
+    }
+    io::UniqueFd addressRead(ends[0]);
+    // Above the descriptors the child is given, so that no dup2 overwrites it.
+    io::UniqueFd addressWrite(::fcntl(ends[1], F_DUPFD_CLOEXEC, 10));
+    ::close(ends[1]);
+    std::vector<char*> environment;
+    for (char** entry = environ; *entry != nullptr; ++entry) {
+        std::string_view text(*entry);
+        if (!text.starts_with("DBUS_") && !text.starts_with("TAVRIX_") &&
+            !text.starts_with("RUNTIME_DIRECTORY=")) {
+            environment.push_back(*entry);
+        }
+    }
+    environment.push_back(nullptr);
+    pid_ = spawn({"dbus-daemon", "--config-file=" + (directory / "bus.conf").string(), "--nofork",
+                  "--print-address=3"},
+                 logFile.get(), addressWrite.get(), environment.data());
+    addressWrite.reset();
+    // The first line it prints, or nothing when it ends (or never started) first.
+    std::unique_ptr<FILE, int (*)(FILE*)> in(::fdopen(addressRead.release(), "r"), &std::fclose);
+    char line[512] = "";
+    if (pid_ > 0 && in && std::fgets(line, sizeof line, in.get()) != nullptr &&
+        std::strchr(line, '\n')) {
+        address_.assign(line, std::strcspn(line, "\n"));
+    }
+    if (address_.empty()) {
+        stop();
+        throw std::runtime_error("dbus-daemon did not report its address:\n" + log());
+    }
+}
+
+void PrivateBus::stop() {
+    if (pid_ > 0) {
+        ::kill(pid_, SIGTERM);  // dbus-daemon leaves on it at once
+        waitForExit(pid_);
+        pid_ = -1;
+    }
 }
 
 std::vector<DaemonLaunch> PrivateBus::launches() const {
     std::vector<DaemonLaunch> result;
-    std::map<pid_t, std::size_t> indexOfPid;
     std::istringstream lines(readText(directory_ / "launches"));
     std::string what;
     pid_t pid = -1;
     while (lines >> what >> pid) {
         if (what == "started") {
-            indexOfPid[pid] = result.size();
             result.push_back({pid, std::nullopt});
         } else if (int status = 0; what == "exited" && lines >> status) {
-            if (auto found = indexOfPid.find(pid); found != indexOfPid.end()) {
-                result[found->second].exitStatus = status;
+            for (DaemonLaunch& launch : result) {
+                launch.exitStatus = launch.pid == pid ? std::optional(status) : launch.exitStatus;
             }
         }
     }

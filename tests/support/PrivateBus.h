@@ -1,7 +1,8 @@
 // A private dbus-daemon for one test, in a temporary directory of its own: it allows everything,
 // or denies by default as the system bus does and includes a policy file; given a daemon, it
-// starts that on demand by bus activation. The bus's output and the daemon's go to one log.
-// Stopped, and its directory removed, when the object goes.
+// starts that on demand by bus activation. The bus's output and the daemon's go to one log; its
+// environment has nothing that could point what it starts at another bus or root. Stopped, and
+// its directory removed, when the object goes.
 #pragma once
 
 #include <sys/types.h>
@@ -15,27 +16,6 @@
 #include "bus/BusHandles.h"
 
 namespace tavrix::test {
-
-// A dbus-daemon child process on a configuration file, its output appended to a log, its
-// address read from the descriptor it prints it on. SIGTERM, then SIGKILL, when it goes.
-class DbusDaemonProcess {
-  public:
-    // Its environment is the test's without anything that could point the services it starts at
-    // another bus or root. Throws std::runtime_error, with the log, when the bus ends before it
-    // reports its address.
-    DbusDaemonProcess(const std::filesystem::path& configFile,
-                      const std::filesystem::path& logFile);
-    ~DbusDaemonProcess() { stop(); }
-    DbusDaemonProcess(const DbusDaemonProcess&) = delete;
-    DbusDaemonProcess& operator=(const DbusDaemonProcess&) = delete;
-
-    const std::string& address() const { return address_; }
-    void stop();
-
-  private:
-    pid_t pid_ = -1;
-    std::string address_;
-};
 
 struct CommandResult {
     // The exit status, 128 + the signal number when killed, -1 when it could not be started.
@@ -69,23 +49,26 @@ struct DaemonLaunch {
 
 class PrivateBus {
   public:
+    // Throws std::runtime_error, with the log, when the bus ends before it reports its address.
     explicit PrivateBus(const std::optional<ActivatedDaemon>& daemon = std::nullopt,
                         const std::optional<std::filesystem::path>& policyFile = std::nullopt);
+    ~PrivateBus() { stop(); }
     PrivateBus(const PrivateBus&) = delete;
     PrivateBus& operator=(const PrivateBus&) = delete;
 
-    const std::string& address() const { return process_->address(); }
+    const std::string& address() const { return address_; }
     bus::BusPtr connect() const { return connectToBus(address()); }
     // An address beside the bus where nothing listens.
     std::string deadAddress() const { return "unix:path=" + (directory_ / "nothing-here"); }
     std::string log() const { return readText(directory_ / "bus.log"); }
     // Every daemon start so far, oldest first.
     std::vector<DaemonLaunch> launches() const;
-    void stop() { process_.reset(); }
+    void stop();
 
   private:
     TempDir directory_;
-    std::optional<DbusDaemonProcess> process_;
+    pid_t pid_ = -1;
+    std::string address_;
 };
 
 }  // namespace tavrix::test

@@ -23,48 +23,39 @@ using plist::Value;
 using Writer = std::function<int(sd_bus_message*)>;
 
 // Every message goes through a real bus daemon, which checks it against the protocol (and drops
-// a sender that breaks it), and is parsed again on the receiving connection.
+// a sender that breaks it), back to the connection that sent it, which parses it again.
 class BusValueCodec : public testing::Test {
   protected:
-    BusValueCodec() : sender_(daemon_.connect()), receiver_(daemon_.connect()) {
-        const char* name = nullptr;
-        test::check(sd_bus_get_unique_name(receiver_.get(), &name), "sd_bus_get_unique_name");
-        receiverName_ = name;
-    }
-
     BusMessagePtr newMessage() {
+        const char* self = nullptr;
         sd_bus_message* raw = nullptr;
-        if (sd_bus_message_new_method_call(sender_.get(), &raw, receiverName_.c_str(), "/test",
-                                           "test.Codec", "Carry") < 0) {
-            throw std::runtime_error("cannot create a message");
-        }
+        test::check(sd_bus_get_unique_name(bus_.get(), &self), "sd_bus_get_unique_name");
+        test::check(
+            sd_bus_message_new_method_call(bus_.get(), &raw, self, "/test", "test.Codec", "Carry"),
+            "sd_bus_message_new_method_call");
         return BusMessagePtr(raw);
     }
 
-    // Writes a message with write, sends it and answers what read makes of it on the other side.
+    // Writes a message with write, sends it and answers what read makes of it on arrival.
     int roundTrip(const Writer& write, const std::function<int(sd_bus_message*)>& read) {
         BusMessagePtr message = newMessage();
         int r = write(message.get());
         if (r < 0) {
             return r;
         }
-        if (sd_bus_send(sender_.get(), message.get(), nullptr) < 0) {
-            throw std::runtime_error("cannot send");
-        }
+        test::check(sd_bus_send(bus_.get(), message.get(), nullptr), "sd_bus_send");
         const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
         while (std::chrono::steady_clock::now() < deadline) {
-            if (sd_bus_process(sender_.get(), nullptr) < 0) {
-                throw std::runtime_error("the bus dropped the sender");
-            }
             sd_bus_message* raw = nullptr;
-            r = sd_bus_process(receiver_.get(), &raw);
+            r = sd_bus_process(bus_.get(), &raw);
+            test::check(r, "sd_bus_process (did the bus drop the connection?)");
             BusMessagePtr received(raw);
             // Skips what the bus itself says to a new connection.
             if (received && sd_bus_message_is_method_call(received.get(), "test.Codec", "Carry")) {
                 return read(received.get());
             }
             if (r == 0) {
-                sd_bus_wait(receiver_.get(), 10'000);
+                sd_bus_wait(bus_.get(), 10'000);
             }
         }
         throw std::runtime_error("the message did not arrive");
@@ -76,9 +67,7 @@ class BusValueCodec : public testing::Test {
     }
 
     test::PrivateBus daemon_;
-    BusPtr sender_;
-    BusPtr receiver_;
-    std::string receiverName_;
+    BusPtr bus_ = daemon_.connect();
 };
 
 // Other programs (busctl, scripts) rely on the documented signatures, scalars at the top too; a
@@ -153,7 +142,6 @@ TEST_F(BusValueCodec, ForeignMessagesAreReadOrRefusedWhole) {
     }
     const Writer unsupported[] = {
         [](sd_bus_message* m) { return sd_bus_message_append(m, "v", "o", "/some/object"); },
-        [](sd_bus_message* m) { return sd_bus_message_append(m, "v", "g", "a{sv}"); },
         [](sd_bus_message* m) { return sd_bus_message_append(m, "v", "as", 1, "x"); },
         [](sd_bus_message* m) { return sd_bus_message_append(m, "v", "a{ss}", 1, "k", "v"); },
         [](sd_bus_message* m) { return sd_bus_message_append(m, "v", "(dd)", 1.0, 2.0); },
