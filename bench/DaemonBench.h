@@ -55,22 +55,12 @@ inline int runProgram(const std::vector<std::string>& argv) {
     return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
-// A private bus in work/ whose service directory starts the daemon under root, logging to
-// work/bus.log; the daemon stays up for the whole benchmark.
-inline std::unique_ptr<test::DbusDaemonProcess> startDaemonBus(const std::filesystem::path& work,
-                                                               const std::filesystem::path& root) {
-    writeBytes(work / "services/com.zandor.tavrixservicesd.service",
-               "[D-BUS Service]\nName=com.zandor.tavrixservicesd\nExec=/usr/bin/env TAVRIX_ROOT=" +
-                   root.string() +
-                   " TAVRIX_LOG_STDERR=1 TAVRIX_IDLE_EXIT_SEC=300 RUNTIME_DIRECTORY=" +
-                   (work / "run").string() + " " + TAVRIX_DAEMON_PATH + "\n");
-    writeBytes(work / "bus.conf",
-               "<busconfig><type>session</type><listen>unix:path=" + (work / "socket").string() +
-                   "</listen><servicedir>" + (work / "services").string() +
-                   "</servicedir><auth>EXTERNAL</auth><policy context=\"default\">"
-                   "<allow send_destination=\"*\" eavesdrop=\"true\"/><allow eavesdrop=\"true\"/>"
-                   "<allow own=\"*\"/></policy></busconfig>\n");
-    return std::make_unique<test::DbusDaemonProcess>(work / "bus.conf", work / "bus.log");
+// A private bus that starts the daemon under root on demand; the daemon stays up for the whole
+// benchmark.
+inline std::unique_ptr<test::PrivateBus> startDaemonBus(const std::filesystem::path& work,
+                                                        const std::filesystem::path& root) {
+    return std::make_unique<test::PrivateBus>(
+        test::ActivatedDaemon{TAVRIX_DAEMON_PATH, root, work / "run", 300});
 }
 
 // Runs the benchmark in a fresh directory under /dev/shm, removed afterwards unless it failed

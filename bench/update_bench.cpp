@@ -238,8 +238,7 @@ void benchUpdate(const fs::path& work) {
         if (!client.checkForTavrixBundleUpdate() ||
             !client.runUntil([&] { return announced > before; }, std::chrono::seconds(60))) {
             throw std::runtime_error("the update of version " + std::to_string(version) +
-                                     " was not installed; see the daemon's log in " +
-                                     (work / "bus.log").string());
+                                     " was not installed; the daemon's log:\n" + bus->log());
         }
         ours.push_back(millisSince(start));
 
