@@ -26,9 +26,9 @@
 #include "BenchSupport.h"
 #include "DaemonBench.h"
 #include "client/TavrixClient.h"
+#include "io/UniqueFd.h"
 #include "payload/Archive.h"
 #include "plist/PropertyListFormat.h"
-#include "io/UniqueFd.h"
 
 using namespace tavrix;
 using bench::readBytes;

@@ -25,10 +25,11 @@
 #include <vector>
 
 #include "TavrixctlOutput.h"
-#include "publishing/BundleCheck.h"
 #include "client/TavrixClient.h"
-#include "payload/Archive.h"
+#include "io/FileIO.h"
 #include "io/UniqueFd.h"
+#include "payload/Archive.h"
+#include "publishing/BundleCheck.h"
 
 namespace {
 
@@ -190,20 +191,13 @@ std::vector<std::uint8_t> readWholeFile(const std::string& path) {
         throw Failure{"cannot read " + path + ": " + std::strerror(errno)};
     }
     std::vector<std::uint8_t> bytes;
-    std::uint8_t buffer[65536];
-    for (;;) {
-        ssize_t got = ::read(fd.get(), buffer, sizeof buffer);
-        if (got == 0) {
-            return bytes;
-        }
-        if (got < 0) {
-            if (errno == EINTR) {
-                continue;
-            }
-            throw Failure{"cannot read " + path + ": " + std::strerror(errno)};
-        }
-        bytes.insert(bytes.end(), buffer, buffer + got);
+    if (int error = tavrix::io::readChunks(fd.get(), [&bytes](std::string_view chunk) {
+            bytes.insert(bytes.end(), chunk.begin(), chunk.end());
+            return 0;
+        })) {
+        throw Failure{"cannot read " + path + ": " + std::strerror(error)};
     }
+    return bytes;
 }
 
 // The arguments of one command, with the command's own options taken out.

@@ -3,10 +3,10 @@
 #include "bundle/BundleInfo.h"
 #include "bundle/BundleLocations.h"
 #include "bundle/BundleManager.h"
-#include "device/BehaviorPreferences.h"
 #include "daemon/TXManager.h"
-#include "update/ActivityRecord.h"
 #include "daemon/UpdateCheckScheduler.h"
+#include "device/BehaviorPreferences.h"
+#include "update/ActivityRecord.h"
 
 namespace tavrix {
 namespace {

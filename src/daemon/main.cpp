@@ -7,8 +7,8 @@
 #include <cstdlib>
 
 #include "daemon/TXManagerServer.h"
-#include "util/ContainExceptions.h"
 #include "device/TXUtility.h"
+#include "util/ContainExceptions.h"
 
 int main() {
     // The run loop takes these signals through its own sources; block them before any thread

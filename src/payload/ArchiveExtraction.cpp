@@ -12,8 +12,8 @@
 #include "payload/ArchiveEntryPolicy.h"
 #include "payload/ArchiveHandles.h"
 #include "payload/ExtractionBudget.h"
-#include "util/FileSystemHelper.h"
 #include "payload/PayloadUnpack.h"
+#include "util/FileSystemHelper.h"
 #include "util/Log.h"
 
 namespace tavrix::payload {

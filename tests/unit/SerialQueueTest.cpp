@@ -9,8 +9,8 @@
 #include <thread>
 #include <vector>
 
-#include "util/SystemLog.h"
 #include "util/SerialQueue.h"
+#include "util/SystemLog.h"
 
 namespace tavrix {
 namespace {

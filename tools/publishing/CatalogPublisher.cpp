@@ -1,6 +1,5 @@
 #include "CatalogPublisher.h"
 
-#include <fcntl.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -14,7 +13,6 @@
 #include "catalog/AssetCatalogFormat.h"
 #include "catalog/CatalogTrust.h"
 #include "io/AtomicFile.h"
-#include "io/UniqueFd.h"
 #include "payload/Archive.h"
 #include "plist/PropertyListFormat.h"
 #include "publishing/BundleCheck.h"
@@ -328,16 +326,13 @@ std::optional<std::string> generateKeyPair(const std::string& secretKeyPath,
     catalog::CatalogSecretKey secretKey{};
     crypto_sign_keypair(publicKey.data(), secretKey.data());
     std::string publicText = catalog::base64Encode(publicKey.data(), publicKey.size());
-    io::UniqueFd fd(::open(secretKeyPath.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0600));
-    bool written = fd && ::write(fd.get(), secretKey.data(), secretKey.size()) ==
-                             static_cast<ssize_t>(secretKey.size());
-    int writeError = errno;
+    // Never over a key that is already there; complete under its name or not at all.
+    const int writeError = io::createFileAtomically(
+        secretKeyPath,
+        std::string_view(reinterpret_cast<const char*>(secretKey.data()), secretKey.size()), 0600);
     sodium_memzero(secretKey.data(), secretKey.size());
-    if (!written) {
+    if (writeError != 0) {
         error = systemError("cannot create", secretKeyPath, writeError);
-        if (fd) {
-            ::unlink(secretKeyPath.c_str());
-        }
         return std::nullopt;
     }
     if (!writeFile(publicKeyPath, publicText + "\n", 0644)) {
