@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <cstdint>
 #include <memory>
 
 namespace tavrix::io {
@@ -55,7 +56,8 @@ int readAll(int fd, std::string& bytes, std::size_t limit) {
     if (::fstat(fd, &info) == 0 && S_ISREG(info.st_mode) && info.st_size > 0) {
         capacity = static_cast<std::size_t>(info.st_size) + 1;
     }
-    const std::size_t ceiling = limit + 1;
+    // One byte past the limit tells "more than limit" from "exactly limit".
+    const std::size_t ceiling = limit < SIZE_MAX ? limit + 1 : limit;
     bytes.assign(std::min(capacity, ceiling), '\0');
     std::size_t filled = 0;
     for (;;) {
