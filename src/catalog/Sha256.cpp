@@ -5,7 +5,6 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <vector>
 
 #include "io/FileIO.h"
 #include "io/UniqueFd.h"

@@ -9,7 +9,6 @@
 #include <climits>
 #include <cstdlib>
 #include <system_error>
-#include <vector>
 
 #include "device/UserDatabase.h"
 #include "io/AtomicFile.h"

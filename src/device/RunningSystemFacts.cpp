@@ -7,7 +7,6 @@
 #include <cerrno>
 #include <filesystem>
 #include <initializer_list>
-#include <vector>
 
 #include "device/PlatformRoot.h"
 #include "io/FileIO.h"
