@@ -1,6 +1,5 @@
 #include "bundle/BundleLinks.h"
 
-#include <fcntl.h>
 #include <libgen.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -12,8 +11,9 @@
 #include <memory>
 
 #include "bundle/BundleInfo.h"
+#include "device/HomeDirectories.h"
+#include "io/Directory.h"
 #include "io/Paths.h"
-#include "io/UniqueFd.h"
 #include "util/Log.h"
 
 namespace tavrix {
@@ -33,38 +33,21 @@ void copyCut(const std::string& path, char (&buffer)[kPathBufferSize]) {
     buffer[length] = '\0';
 }
 
-// Flushes the directory entry of a new link, so that after a power cut the links come back in the
-// order they were written.
-void flushDirectoryOf(const std::string& path) {
-    io::UniqueFd directory(::open(dirNameOfPath(path).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (directory) {
-        ::fsync(directory.get());
-    }
-}
-
 // The new link is made under a temporary name beside linkPath and renamed over whatever is there,
-// so that a reader (or a crash) finds the old link or the new one, never none. An empty directory
-// in the way goes, as a plain remove would take it; one that holds something stays and fails.
+// so that a reader (or a crash) finds the old link or the new one, never none; the directory is
+// flushed, so that after a power cut the links come back in the order they were written. An
+// empty directory in the way goes, as a plain remove would take it; one that holds something
+// stays and fails.
 bool linkPathTo(const std::string& linkPath, const std::string& target) {
     bool linked = false;
     if (!linkPath.empty()) {
-        const std::string temporary =
-            dirNameOfPath(linkPath) + "/" + kLinkTemporaryPrefix + baseNameOfPath(linkPath);
-        ::unlink(temporary.c_str());
-        if (::symlink(target.c_str(), temporary.c_str()) == 0) {
-            linked = ::rename(temporary.c_str(), linkPath.c_str()) == 0 ||
-                     (::rmdir(linkPath.c_str()) == 0 &&
-                      ::rename(temporary.c_str(), linkPath.c_str()) == 0);
-            if (!linked) {
-                ::unlink(temporary.c_str());
-            }
-        }
+        auto directory = device::openMobileHomeDirectory(dirNameOfPath(linkPath), true);
+        linked = directory && directory->replaceSymlink(baseNameOfPath(linkPath), target) == 0;
     }
     if (!linked) {
         logCFormat("Failed to establish link from %s to %s\n", linkPath.c_str(), target.c_str());
         return false;
     }
-    flushDirectoryOf(linkPath);
     return true;
 }
 
@@ -103,6 +86,29 @@ bool establishBundleLinks(CarrierBundle& bundle, const std::string& bundleLink,
     bool linked = linkBundle(bundle);
     logCFormat("Dump state of the bundle being linked\n");
     return linked;
+}
+
+bool isDaemonLink(const std::string& linkPath) {
+    if (linkPath.empty()) {
+        return false;
+    }
+    auto directory = device::openMobileHomeDirectory(dirNameOfPath(linkPath), false);
+    if (!directory) {
+        return false;
+    }
+    auto entry = directory->entryStatus(baseNameOfPath(linkPath));
+    if (!entry) {
+        return false;
+    }
+    if (!S_ISLNK(entry->st_mode)) {
+        device::logDistrustOnce(linkPath, "it is not a symbolic link");
+        return false;
+    }
+    if (!io::isTrustedOwner(entry->st_uid)) {
+        device::logDistrustOnce(linkPath, "it belongs to user " + std::to_string(entry->st_uid));
+        return false;
+    }
+    return true;
 }
 
 bool linksAgree(const CarrierBundle& linked, const std::string& overlayDirectory) {

@@ -9,8 +9,9 @@
 namespace tavrix {
 
 // Points bundleLink at bundle.bundlePath and preferencesLink at bundle.carrierFilePath (each
-// replacing what was there), verifies both and re-reads the bundle version. The record takes the
-// two link paths. True when both links are in place.
+// replacing what was there, by rename inside the link's protected directory), verifies both and
+// re-reads the bundle version. The record takes the two link paths. True when both links are in
+// place.
 bool establishBundleLinks(CarrierBundle& bundle, const std::string& bundleLink,
                           const std::string& preferencesLink);
 
@@ -19,9 +20,10 @@ bool establishBundleLinks(CarrierBundle& bundle, const std::string& bundleLink,
 // crash between the two link changes leaves a pair that does not.
 bool linksAgree(const CarrierBundle& linked, const std::string& overlayDirectory);
 
-// What the temporary name of a link being replaced starts with, so that start-up can find one
-// left by an interrupted change.
-inline constexpr const char* kLinkTemporaryPrefix = ".tavrix-link-";
+// Whether the link at linkPath is one the daemon made: a symbolic link of root or the daemon's
+// user in a protected directory of the mobile home. Anything else there (logged once) is treated
+// as no link, and replaced at the next linking.
+bool isDaemonLink(const std::string& linkPath);
 
 // POSIX basename / dirname of the path (cut at 1023 bytes); "." for an empty path.
 std::string baseNameOfPath(const std::string& path);

@@ -15,6 +15,7 @@
 #include "bundle/OverrideGeneration.h"
 #include "bundle/VersionCompare.h"
 #include "bus/NotificationCenter.h"
+#include "device/HomeDirectories.h"
 #include "device/MobileUser.h"
 #include "device/PreferencesStore.h"
 #include "util/Log.h"
@@ -64,12 +65,13 @@ BundleManager::BundleManager() {
     removeLeftoversOfInterruptedChanges(bundleLinkPath_, preferencesLinkPath_);
 
     // The link itself, not its target: a dangling link still describes the last linked state.
-    struct stat linkInfo {};
-    if (bundleLinkPath_.empty() || ::lstat(bundleLinkPath_.c_str(), &linkInfo) != 0) {
+    // Only links the daemon made describe it; another user's are replaced at the next reset.
+    if (!isDaemonLink(bundleLinkPath_)) {
         return;
     }
     currentBundle_.initFromLinks(bundleLinkPath_, preferencesLinkPath_);
-    currentBundle_.carrierFilePath = readLinkTarget(preferencesLinkPath_);
+    currentBundle_.carrierFilePath =
+        isDaemonLink(preferencesLinkPath_) ? readLinkTarget(preferencesLinkPath_) : std::string();
     currentBundle_.overlayType |=
         overlayTypeOfCarrierFileName(baseNameOfPath(currentBundle_.carrierFilePath));
     logCFormat("Is carrier bundle's plist file overridden: %s\n",
@@ -111,7 +113,11 @@ bool BundleManager::findBundle(CarrierBundle& out) const {
             chosen = &systemLocation;
         }
     } else {
-        std::optional<plist::Value> userVersion = copyBundleVersionAtURL(userLocation);
+        // Only a bundle the daemon installed counts: one in directories nobody else can change.
+        std::optional<plist::Value> userVersion;
+        if (device::openMobileHomeDirectory(userLocation, false)) {
+            userVersion = copyBundleVersionAtURL(userLocation);
+        }
         const bool systemHasBase = systemVersion && hasBaseCarrierFile(systemLocation);
         const bool userHasBase = userVersion && hasBaseCarrierFile(userLocation);
         if (systemVersion && userVersion && systemHasBase != userHasBase) {

@@ -1,6 +1,9 @@
 #include "bundle/InterruptedChanges.h"
 
+#include <unistd.h>
+
 #include <algorithm>
+#include <optional>
 #include <vector>
 
 #include "bundle/BundleInfo.h"
@@ -8,8 +11,9 @@
 #include "bundle/BundleLocations.h"
 #include "bundle/BundleTypes.h"
 #include "bundle/OverriddenCarrierFile.h"
+#include "device/HomeDirectories.h"
 #include "device/PlatformRoot.h"
-#include "io/AtomicFile.h"
+#include "io/Directory.h"
 #include "payload/PayloadUnpack.h"
 #include "util/FileSystemUtilities.h"
 #include "util/Log.h"
@@ -25,17 +29,26 @@ void removeLeftover(const std::string& path) {
     }
 }
 
-// Removes the entries of directory whose names start with prefix.
-void removeEntriesStartingWith(const std::string& directory, std::string_view prefix) {
+// Removes the daemon's own entries of directory whose names start with prefix (or are name):
+// only what the daemon wrote, in a directory others may write in too.
+void removeOwnLeftovers(const std::optional<io::Directory>& directory, std::string_view prefix) {
     std::vector<std::string> names;
-    if (directory.empty() || readDirectoryNames(directory, names) != 0) {
+    if (!directory || readDirectoryNames(directory->path(), names) != 0) {
         return;
     }
     for (const std::string& name : names) {
-        if (name.starts_with(prefix)) {
-            removeLeftover(directory + "/" + name);
+        auto entry = directory->entryStatus(name);
+        if (name.starts_with(prefix) && entry && entry->st_uid == ::geteuid() &&
+            directory->removeEntry(name) == 0) {
+            logCFormat("Removed %s, left by an interrupted change\n",
+                       directory->pathOf(name).c_str());
         }
     }
+}
+
+std::optional<io::Directory> openDirectory(const std::string& path) {
+    int error = 0;
+    return io::Directory::open(path, io::Directory::LastLink::Follow, &error);
 }
 
 // The bundle version a generated file's name ends with ("...+<version>.plist"), or empty.
@@ -54,26 +67,33 @@ void removeLeftoversOfInterruptedChanges(const std::string& bundleLink,
                                          const std::string& preferencesLink) {
     for (const std::string& link : {bundleLink, preferencesLink}) {
         if (!link.empty()) {
-            removeEntriesStartingWith(dirNameOfPath(link), kLinkTemporaryPrefix);
+            removeOwnLeftovers(device::openMobileHomeDirectory(dirNameOfPath(link), false),
+                               io::kAtomicWritePrefix);
         }
     }
     std::string overlays = overriddenFilesDirectory();
     if (!overlays.empty()) {
         overlays.pop_back();
-        removeEntriesStartingWith(overlays, io::kAtomicWritePrefix);
+        removeOwnLeftovers(device::openMobileHomeDirectory(overlays, false),
+                           io::kAtomicWritePrefix);
     }
     const std::string staged = device::resolvePath(payload::kBundleArchiveTempPath);
-    removeLeftover(staged);
-    removeEntriesStartingWith(dirNameOfPath(staged), io::kAtomicWritePrefix);
+    const auto temporary = openDirectory(dirNameOfPath(staged));
+    removeOwnLeftovers(temporary, baseNameOfPath(staged));
+    removeOwnLeftovers(temporary, io::kAtomicWritePrefix);
     if (const std::string& userBundle = userBundleLocation(); !userBundle.empty()) {
-        removeLeftover(payload::extractionStagingPathFor(userBundle));
+        if (device::openMobileHomeDirectory(dirNameOfPath(userBundle), false)) {
+            removeLeftover(payload::extractionStagingPathFor(userBundle));
+        }
     }
 }
 
 void pruneOverriddenFilesOfRemovedBundles(const std::string& keep) {
     std::string overlays = overriddenFilesDirectory();
     std::vector<std::string> names;
-    if (overlays.empty() || readDirectoryNames(overlays, names) != 0) {
+    if (overlays.empty() ||
+        !device::openMobileHomeDirectory(overlays.substr(0, overlays.size() - 1), false) ||
+        readDirectoryNames(overlays, names) != 0) {
         return;
     }
     std::vector<std::string> installed;

@@ -3,15 +3,17 @@
 #include <limits.h>
 
 #include <algorithm>
+#include <cerrno>
+#include <cstring>
 #include <iterator>
 #include <vector>
 
 #include "bundle/BundleLinks.h"
 #include "bundle/BundleLocations.h"
+#include "device/HomeDirectories.h"
 #include "device/MobileUser.h"
-#include "io/AtomicFile.h"
+#include "io/Directory.h"
 #include "plist/PropertyListFormat.h"
-#include "util/FileSystemHelper.h"
 #include "util/FileURL.h"
 #include "util/Log.h"
 
@@ -20,7 +22,6 @@ namespace {
 
 constexpr char kFieldSeparator = '+';
 constexpr const char* kPropertyListExtension = ".plist";
-constexpr mode_t kOverlayDirectoryMode = 0755;
 constexpr mode_t kOverriddenFileMode = 0644;
 
 std::vector<std::string> sortedFields(const std::string& name) {
@@ -119,23 +120,44 @@ bool writeOverriddenCarrierFile(const plist::Value& dictionary,
         logCFormat("Failed to serialize the overridden dictionary\n");
         return false;
     }
-    FileSystemHelper fileSystem;
+    std::optional<io::Directory> directory;
     if (path) {
-        std::string directory = dirNameOfPath(*path);
-        if (!fileSystem.fileExists(directory)) {
-            fileSystem.createDirectory(directory, kOverlayDirectoryMode, true);
-        }
+        directory = device::openMobileHomeDirectory(dirNameOfPath(*path), true);
     }
     if (!path || !fileURLFromPath(*path)) {
         logCFormat("Failed to create the file URL\n");
         return false;
     }
-    if (int error = io::createFileAtomically(*path, xml, kOverriddenFileMode); error != 0) {
+    const int error = directory ? directory->writeFile(baseNameOfPath(*path), kOverriddenFileMode,
+                                                       /*replace=*/false, xml)
+                                : EACCES;
+    if (error != 0) {
         logCFormat("Failed to write the overridden carrier bundle with error code: %d\n", error);
         return false;
     }
     logCFormat("The overridden file was successfully written to %s\n", path->c_str());
     return true;
+}
+
+bool isGeneratedCarrierFile(const std::string& path) {
+    auto directory = device::openMobileHomeDirectory(dirNameOfPath(path), false);
+    if (!directory) {
+        return false;
+    }
+    const std::string name = baseNameOfPath(path);
+    int error = 0;
+    if (directory->openOwnFile(name, &error)) {
+        return true;
+    }
+    if (error != ENOENT) {
+        // Not written by the daemon: it goes, and the daemon writes its own.
+        device::logDistrustOnce(path, error == ELOOP    ? "it is a symbolic link"
+                                      : error == EINVAL ? "it is not a regular file"
+                                      : error == EPERM  ? "it belongs to another user"
+                                                        : std::strerror(error));
+        directory->removeEntry(name);
+    }
+    return false;
 }
 
 }  // namespace tavrix

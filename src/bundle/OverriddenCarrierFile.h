@@ -22,8 +22,13 @@ std::string overriddenFilesDirectory();
 // or fields that would make the name leave the Overlay directory (a '/' in the key or version).
 std::optional<std::string> overriddenFilePath(OverlayContext& context);
 
-// Writes dictionary as an XML property list at path, creating the directory (0755, with its
-// parents) when missing; logs the outcome. False when path is absent or writing fails.
+// Whether a generated carrier file the daemon wrote is at path: a regular file of root or the
+// daemon's user, in the protected overlay directory. Anything else there is logged once and
+// removed, so that the daemon writes its own.
+bool isGeneratedCarrierFile(const std::string& path);
+
+// Writes dictionary as an XML property list at path, whole and only where nothing is, creating
+// the directory (0755) when missing; logs the outcome. False when path is absent or writing fails.
 bool writeOverriddenCarrierFile(const plist::Value& dictionary,
                                 const std::optional<std::string>& path);
 

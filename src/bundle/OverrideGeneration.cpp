@@ -9,7 +9,6 @@
 #include "bundle/OverlayContext.h"
 #include "bundle/OverriddenCarrierFile.h"
 #include "device/TXUtility.h"
-#include "util/FileSystemHelper.h"
 #include "util/Log.h"
 
 namespace tavrix {
@@ -104,7 +103,7 @@ OverrideResult determineOverlay(OverlayContext& context, OverlaySource& source) 
     }
 
     std::optional<std::string> path = overriddenFilePath(context);
-    if (path && FileSystemHelper().fileExists(*path)) {
+    if (path && isGeneratedCarrierFile(*path)) {
         logCFormat("Overridden file %s already exists, not generating again\n", path->c_str());
         pointAtOverriddenFile(context, *path);
         return kOverrideBundleSuccess;

@@ -235,4 +235,14 @@ void AssetQuery::removeAbandonedDownloads() const {
     }
 }
 
+bool AssetQuery::isInDownloadCache(const std::string& directory) const {
+    std::optional<AssetTypeSettings> settings =
+        AssetCatalogService::shared().settingsFor(assetType_);
+    if (!settings || settings->cacheDirectory.empty() ||
+        !directory.starts_with(settings->cacheDirectory + "/")) {
+        return false;
+    }
+    return directory.find("/../") == std::string::npos && !directory.ends_with("/..");
+}
+
 }  // namespace tavrix::catalog

@@ -122,6 +122,9 @@ class AssetQuery {
     // removeAbandonedDownloads); for the launch, before any download can start.
     void removeAbandonedDownloads() const;
 
+    // Whether directory lies in this type's download cache, where only the daemon writes.
+    bool isInDownloadCache(const std::string& directory) const;
+
   private:
     std::string assetType_;
     bool localOnly_ = false;

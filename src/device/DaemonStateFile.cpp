@@ -2,6 +2,7 @@
 
 #include "device/PlatformRoot.h"
 #include "io/AtomicFile.h"
+#include "io/Directory.h"
 #include "util/FileSystemUtilities.h"
 
 namespace tavrix::device {
@@ -16,7 +17,19 @@ std::string daemonStateFilePath(std::string_view fileName) {
 }
 
 plist::Dictionary readDaemonStateFile(std::string_view fileName) {
-    std::optional<plist::Value> stored = plist::readFile(daemonStateFilePath(fileName));
+    // Only the daemon's own files in its own directory: nothing another user made or linked
+    // there may pass for the daemon's state.
+    int error = 0;
+    auto directory = io::Directory::open(resolvePath(kDaemonStateDirectory),
+                                         io::Directory::LastLink::Refuse, &error);
+    if (!directory || io::whyNotProtected(directory->status())) {
+        return {};
+    }
+    io::UniqueFd file = directory->openOwnFile(fileName, &error);
+    if (!file) {
+        return {};
+    }
+    std::optional<plist::Value> stored = plist::readOpenFile(file.get());
     const plist::Dictionary* values = stored ? stored->asDictionary() : nullptr;
     return values != nullptr ? *values : plist::Dictionary();
 }

@@ -14,8 +14,9 @@ namespace tavrix::device {
 // "<root>/var/lib/tavrixservicesd/<fileName>".
 std::string daemonStateFilePath(std::string_view fileName);
 
-// The dictionary stored as fileName; empty when the file is missing, unreadable or no dictionary
-// (the state is then as if never recorded).
+// The dictionary stored as fileName; empty when the file is missing, unreadable or no dictionary,
+// or is not a regular file of the daemon's user (or root) in the state directory, itself one
+// nobody else can write in (the state is then as if never recorded).
 plist::Dictionary readDaemonStateFile(std::string_view fileName);
 
 // Writes value as fileName in the state directory, creating the directory when missing. 0, or

@@ -10,9 +10,9 @@
 #include <cstdlib>
 #include <system_error>
 
+#include "device/HomeDirectories.h"
 #include "device/UserDatabase.h"
-#include "io/AtomicFile.h"
-#include "io/Paths.h"
+#include "io/Directory.h"
 #include "io/UniqueFd.h"
 #include "plist/CachedPropertyListFile.h"
 #include "plist/PropertyListFormat.h"
@@ -26,10 +26,10 @@ const plist::Refusal kNotADictionary{0, "it is not a dictionary"};
 
 constexpr std::string_view kPreferencesDirectory = "/Library/Preferences";
 constexpr std::string_view kExtension = ".plist";
-constexpr mode_t kDirectoryMode = 0755;
+constexpr std::string_view kLockExtension = ".lock";
 constexpr mode_t kFileMode = 0644;
-// The kernel's own limit on links followed in one lookup.
-constexpr int kMaxLinkHops = 40;
+// Only the daemon and root take the lock: nobody else can hold a write back for ever.
+constexpr mode_t kLockFileMode = 0600;
 
 std::string errorText(int error) {
     return std::generic_category().message(error);
@@ -67,105 +67,95 @@ std::optional<FileVersion> versionOf(const std::string& path) {
     return FileVersion{info.st_dev, info.st_ino, info.st_size, info.st_mtim};
 }
 
-// Creates path and its missing parents with mode 0755.
-bool makeDirectories(const std::string& path) {
-    struct stat info {};
-    if (::stat(path.c_str(), &info) == 0 && S_ISDIR(info.st_mode)) {
-        return true;
-    }
-    for (std::size_t end = path.find('/', 1);; end = path.find('/', end + 1)) {
-        std::string prefix = path.substr(0, end);
-        if (::mkdir(prefix.c_str(), kDirectoryMode) == 0) {
-            // The umask must not narrow what other readers of the preferences need.
-            ::chmod(prefix.c_str(), kDirectoryMode);
-        } else if (errno != EEXIST) {
-            logFailure("create directory", prefix, errno);
-            return false;
-        }
-        if (end == std::string::npos) {
-            break;
-        }
-    }
-    return true;
+std::string ownerText(uid_t owner) {
+    return "it belongs to user " + std::to_string(owner);
 }
 
-std::optional<std::string> readLink(const std::string& path) {
-    auto target = io::readLinkTarget(path);
-    if (!target) {
-        logFailure("read symbolic link", path, errno);
-    }
-    return target;
-}
-
-// The file that writing to path must replace: path itself, or the file at the end of its chain of
-// symbolic links, so that a domain linked to another file keeps its link.
-std::optional<std::string> writeTarget(const std::string& path) {
-    std::string current = path;
-    for (int hop = 0; hop < kMaxLinkHops; ++hop) {
-        struct stat info {};
-        if (::lstat(current.c_str(), &info) != 0) {
-            if (errno == ENOENT) {
-                return current;
-            }
-            logFailure("examine", current, errno);
-            return std::nullopt;
-        }
-        if (!S_ISLNK(info.st_mode)) {
-            return current;
-        }
-        auto target = readLink(current);
-        if (!target) {
-            return std::nullopt;
-        }
-        current = !target->empty() && target->front() == '/'
-                      ? *target
-                      : io::parentDirectory(current) + "/" + *target;
-    }
-    logFailure("follow the symbolic links at", path, ELOOP);
-    return std::nullopt;
-}
-
-// Replaces the file at target with bytes so that readers see either the old or the new file whole.
-bool replaceFile(const std::string& target, std::string_view bytes) {
-    if (int error = io::replaceFileAtomically(target, bytes, kFileMode); error != 0) {
-        logFailure("replace", target, error);
-        return false;
-    }
-    return true;
-}
-
-// Holds an exclusive flock on a descriptor for its lifetime.
-class ExclusiveLock {
+// Holds an exclusive flock on the domain's lock file for its lifetime. The file is the daemon's
+// own (a look-alike of another owner is removed first), since a lock anyone could open is a lock
+// anyone could hold for ever.
+class DomainLock {
   public:
-    explicit ExclusiveLock(int fd) : fd_(fd) {
+    DomainLock(const io::Directory& directory, const std::string& name) {
+        for (int attempt = 0; attempt < 2 && !fd_; ++attempt) {
+            const int exclusive = attempt == 0 ? 0 : O_EXCL;
+            fd_.reset(::openat(directory.fd(), name.c_str(),
+                               O_RDWR | O_CREAT | O_NOFOLLOW | O_CLOEXEC | exclusive,
+                               kLockFileMode));
+            struct stat info {};
+            if (fd_ && ::fstat(fd_.get(), &info) == 0 && S_ISREG(info.st_mode) &&
+                io::isTrustedOwner(info.st_uid)) {
+                break;
+            }
+            fd_.reset();
+            directory.removeEntry(name);
+        }
+        if (!fd_) {
+            return;
+        }
         int result = 0;
         do {
-            result = ::flock(fd_, LOCK_EX);
+            result = ::flock(fd_.get(), LOCK_EX);
         } while (result != 0 && errno == EINTR);
         locked_ = result == 0;
     }
-    ~ExclusiveLock() {
-        if (locked_) {
-            ::flock(fd_, LOCK_UN);
-        }
-    }
-    ExclusiveLock(const ExclusiveLock&) = delete;
-    ExclusiveLock& operator=(const ExclusiveLock&) = delete;
+    DomainLock(const DomainLock&) = delete;
+    DomainLock& operator=(const DomainLock&) = delete;
 
     bool locked() const { return locked_; }
 
   private:
-    int fd_;
+    io::UniqueFd fd_;
     bool locked_ = false;
 };
 
 }  // namespace
 
 struct PreferencesStore::Domain {
-    Domain(std::string directory, std::string path)
-        : directory(std::move(directory)), path(std::move(path)), file(this->path) {}
+    Domain(std::string home, std::string directory, std::string fileName)
+        : home(std::move(home)),
+          directory(std::move(directory)),
+          fileName(std::move(fileName)),
+          path(this->directory + "/" + this->fileName),
+          file(path, [this] { return openForReading(); }) {}
 
+    // The domain's file: the daemon's own (or root's), in the protected Preferences directory.
+    // A symbolic link of the daemon's is followed (the behavior settings are read through one);
+    // anything another user put there reads as no file.
+    io::UniqueFd openForReading() const {
+        auto preferences = openDirectoryInHome(home, directory, false);
+        if (!preferences) {
+            return {};
+        }
+        auto entry = preferences->entryStatus(fileName);
+        if (!entry) {
+            return {};
+        }
+        if (!io::isTrustedOwner(entry->st_uid)) {
+            logDistrustOnce(path, ownerText(entry->st_uid));
+            return {};
+        }
+        const int follow = S_ISLNK(entry->st_mode) ? 0 : O_NOFOLLOW;
+        io::UniqueFd fd(::openat(preferences->fd(), fileName.c_str(),
+                                 O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC | follow));
+        struct stat opened {};
+        if (!fd || ::fstat(fd.get(), &opened) != 0) {
+            return {};
+        }
+        // What was opened must still be what was checked: the daemon's link, or its file.
+        auto now = preferences->entryStatus(fileName);
+        const bool same = now && io::isTrustedOwner(now->st_uid) &&
+                          (follow == 0 ? now->st_ino == entry->st_ino && S_ISLNK(now->st_mode)
+                                       : now->st_ino == opened.st_ino);
+        if (!same || !io::isTrustedOwner(opened.st_uid)) {
+            return {};
+        }
+        return fd;
+    }
+
+    std::string home;
     std::string directory;
+    std::string fileName;
     std::string path;
     plist::CachedPropertyListFile file;
     // Values set and not yet synchronized; nothing means the key is removed.
@@ -254,53 +244,48 @@ PreferencesStore::Domain* PreferencesStore::domainFor(std::string_view domain,
         return nullptr;
     }
     std::string directory = record->homeDirectory + std::string(kPreferencesDirectory);
-    std::string path = directory + "/" + std::string(domain) + std::string(kExtension);
     auto& slot = users_[std::string(user)][std::string(domain)];
-    slot = std::make_unique<Domain>(std::move(directory), std::move(path));
+    slot = std::make_unique<Domain>(record->homeDirectory, std::move(directory),
+                                    std::string(domain) + std::string(kExtension));
     return slot.get();
 }
 
 bool PreferencesStore::writePending(Domain& domain) {
-    if (!makeDirectories(domain.directory)) {
+    auto preferences = openDirectoryInHome(domain.home, domain.directory, true);
+    if (!preferences) {
+        logCFormat("Preferences: cannot use the directory %s", domain.directory.c_str());
         return false;
     }
-    // The domain file is replaced by rename, so the lock is on the directory that holds it.
-    io::UniqueFd directoryFd(::open(domain.directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (!directoryFd) {
-        logFailure("open directory", domain.directory, errno);
-        return false;
-    }
-    ExclusiveLock lock(directoryFd.get());
+    DomainLock lock(*preferences, "." + domain.fileName + std::string(kLockExtension));
     if (!lock.locked()) {
-        logFailure("lock directory", domain.directory, errno);
-        return false;
-    }
-    auto target = writeTarget(domain.path);
-    if (!target) {
+        logFailure("lock", domain.path, errno);
         return false;
     }
 
-    // Read afresh under the lock: another process may have written other keys since.
+    // Read afresh under the lock: another process may have written other keys since. Only the
+    // daemon's own file is merged; whatever else is there is replaced.
     plist::Dictionary contents;
-    struct stat info {};
-    if (::stat(target->c_str(), &info) == 0) {
-        if (!S_ISREG(info.st_mode)) {
-            logCFormat("Preferences: %s is not a regular file", target->c_str());
-            return false;
-        }
+    int error = 0;
+    io::UniqueFd current = preferences->openOwnFile(domain.fileName, &error);
+    if (current) {
         plist::Refusal refusal;
-        auto current = plist::readFile(*target, &refusal);
-        if (!current && refusal.error != 0) {
-            logFailure("read", *target, refusal.error);
+        auto stored = plist::readOpenFile(current.get(), &refusal);
+        if (!stored && refusal.error != 0) {
+            logFailure("read", domain.path, refusal.error);
             return false;
         }
-        if (current && current->isDictionary()) {
-            contents = std::move(*current->asDictionary());
+        if (stored && stored->isDictionary()) {
+            contents = std::move(*stored->asDictionary());
         } else {
-            logDamage(domain, current ? kNotADictionary : refusal);
+            logDamage(domain, stored ? kNotADictionary : refusal);
         }
-    } else if (errno != ENOENT) {
-        logFailure("examine", *target, errno);
+    } else if (error == EPERM || error == ELOOP || error == EINVAL) {
+        auto entry = preferences->entryStatus(domain.fileName);
+        logDistrustOnce(domain.path, error == ELOOP    ? "it is a symbolic link"
+                                     : error == EINVAL ? "it is not a regular file"
+                                                       : ownerText(entry ? entry->st_uid : 0));
+    } else if (error != ENOENT) {
+        logFailure("read", domain.path, error);
         return false;
     }
 
@@ -316,7 +301,12 @@ bool PreferencesStore::writePending(Domain& domain) {
         logCFormat("Preferences: cannot encode the values for %s", domain.path.c_str());
         return false;
     }
-    return replaceFile(*target, bytes);
+    if (int failure = preferences->writeFile(domain.fileName, kFileMode, true, bytes);
+        failure != 0) {
+        logFailure("replace", domain.path, failure);
+        return false;
+    }
+    return true;
 }
 
 void PreferencesStore::logDamage(Domain& domain, const plist::Refusal& refusal) {

@@ -4,6 +4,7 @@
 #include <cstdint>
 #include <cstdlib>
 #include <cstring>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -105,10 +106,10 @@ std::optional<std::string> copyEntryData(archive* reader, archive* writer,
     }
 }
 
-}  // namespace
-
-bool extractArchive(const std::string& archivePath, const std::string& destinationDirectory,
-                    ExtractionSafety safety, const ExtractionLimits& limits, std::string* whyNot) {
+// The extraction itself; open attaches the reader to the archive named archivePath.
+bool extract(const std::string& archivePath, const std::function<int(archive*)>& open,
+             const std::string& destinationDirectory, ExtractionSafety safety,
+             const ExtractionLimits& limits, std::string* whyNot) {
     auto fail = [&](const std::string& why) {
         if (whyNot != nullptr) {
             *whyNot = why;
@@ -155,8 +156,7 @@ bool extractArchive(const std::string& archivePath, const std::string& destinati
     libarchive().archive_read_support_format_cpio(reader.get());
     libarchive().archive_write_disk_set_standard_lookup(writer.get());
 
-    if (libarchive().archive_read_open_filename(reader.get(), archivePath.c_str(),
-                                                kReadBlockSize) != ARCHIVE_OK) {
+    if (open(reader.get()) != ARCHIVE_OK) {
         return fail("Cannot open the archive " + archivePath + ": " + errorText(reader.get()));
     }
     ExtractionBudget budget(limits, destination);
@@ -203,6 +203,30 @@ bool extractArchive(const std::string& archivePath, const std::string& destinati
             return stop(*exceeded);
         }
     }
+}
+
+}  // namespace
+
+bool extractArchive(const std::string& archivePath, const std::string& destinationDirectory,
+                    ExtractionSafety safety, const ExtractionLimits& limits, std::string* whyNot) {
+    return extract(
+        archivePath,
+        [&archivePath](archive* reader) {
+            return libarchive().archive_read_open_filename(reader, archivePath.c_str(),
+                                                           kReadBlockSize);
+        },
+        destinationDirectory, safety, limits, whyNot);
+}
+
+bool extractArchive(int archiveFd, const std::string& archivePath,
+                    const std::string& destinationDirectory, ExtractionSafety safety,
+                    const ExtractionLimits& limits, std::string* whyNot) {
+    return extract(
+        archivePath,
+        [archiveFd](archive* reader) {
+            return libarchive().archive_read_open_fd(reader, archiveFd, kReadBlockSize);
+        },
+        destinationDirectory, safety, limits, whyNot);
 }
 
 }  // namespace tavrix::payload

@@ -18,6 +18,7 @@
     X(archive_read_support_format_tar)         \
     X(archive_read_support_format_cpio)        \
     X(archive_read_open_filename)              \
+    X(archive_read_open_fd)                    \
     X(archive_read_next_header)                \
     X(archive_read_data_block)                 \
     X(archive_write_new)                       \

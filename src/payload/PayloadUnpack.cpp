@@ -1,18 +1,71 @@
 #include "payload/PayloadUnpack.h"
 
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include <cerrno>
-#include <cstdio>
 #include <cstring>
 
-#include "device/PlatformRoot.h"
-#include "io/AtomicFile.h"
+#include "io/Paths.h"
 #include "util/Log.h"
 
 namespace tavrix {
 namespace payload {
+namespace {
 
 // Only the daemon reads the staged payload.
 constexpr mode_t kStagedFileMode = 0600;
+// A device root made for tests or the demo may lack /tmp; it gets the usual one.
+constexpr mode_t kTemporaryDirectoryMode = 01777;
+
+std::optional<io::Directory> openStagingDirectory(const std::string& path, std::string* whyNot) {
+    int error = 0;
+    auto directory = io::Directory::open(path, io::Directory::LastLink::Follow, &error);
+    if (!directory && error == ENOENT && ::mkdir(path.c_str(), kTemporaryDirectoryMode) == 0) {
+        ::chmod(path.c_str(), kTemporaryDirectoryMode);
+        directory = io::Directory::open(path, io::Directory::LastLink::Follow, &error);
+    }
+    if (!directory) {
+        *whyNot = path + " cannot be opened: " + std::strerror(error);
+        return std::nullopt;
+    }
+    // In a directory where others may rename what the daemon writes, nothing written is safe.
+    if (std::optional<std::string> why = io::whyNotProtected(directory->status())) {
+        *whyNot = path + " is unsafe: " + *why;
+        return std::nullopt;
+    }
+    return directory;
+}
+
+std::optional<StagedPayload> stageIn(io::Directory directory, const std::string& name,
+                                     const plist::Data& data, std::string* whyNot) {
+    if (auto existing = directory.entryStatus(name)) {
+        if (existing->st_uid != ::geteuid()) {
+            *whyNot = "a file of user " + std::to_string(existing->st_uid) + " is in the way";
+            return std::nullopt;
+        }
+        if (int error = directory.removeEntry(name); error != 0 && error != ENOENT) {
+            *whyNot = std::string("the previous one cannot be removed: ") + std::strerror(error);
+            return std::nullopt;
+        }
+    }
+    const std::string_view bytes(reinterpret_cast<const char*>(data.data()), data.size());
+    if (int error = directory.writeFile(name, kStagedFileMode, /*replace=*/false, bytes);
+        error != 0) {
+        *whyNot = error == EEXIST ? std::string("something else appeared there")
+                                  : std::string(std::strerror(error));
+        return std::nullopt;
+    }
+    int error = 0;
+    io::UniqueFd file = directory.openOwnFile(name, &error);
+    if (!file) {
+        *whyNot = std::string("it cannot be opened again: ") + std::strerror(error);
+        return std::nullopt;
+    }
+    return StagedPayload(std::move(directory), name, std::move(file));
+}
+
+}  // namespace
 
 std::string extractionStagingPathFor(const std::string& bundleDirectory) {
     std::size_t slash = bundleDirectory.rfind('/');
@@ -20,13 +73,33 @@ std::string extractionStagingPathFor(const std::string& bundleDirectory) {
            ".incoming";
 }
 
-bool writeDataToFile(const plist::Data& data, const std::string& path) {
-    if (io::replaceFileAtomically(path, data, kStagedFileMode) == 0) {
-        logCFormat("Successfully wrote the KW Data to file: %s\n", path.c_str());
-    } else {
-        logCFormat("Failed to write the zipped file: %s\n", path.c_str());
+StagedPayload::StagedPayload(io::Directory directory, std::string name, io::UniqueFd file)
+    : directory_(std::move(directory)), name_(std::move(name)), file_(std::move(file)) {}
+
+StagedPayload::~StagedPayload() {
+    struct stat mine {};
+    if (!file_ || ::fstat(file_.get(), &mine) != 0) {
+        return;
     }
-    return true;
+    auto there = directory_.entryStatus(name_);
+    if (there && there->st_dev == mine.st_dev && there->st_ino == mine.st_ino) {
+        directory_.removeEntry(name_);
+    }
+}
+
+std::optional<StagedPayload> stagePayload(const plist::Data& data, const std::string& path,
+                                          std::string* whyNot) {
+    std::string reason;
+    if (auto directory = openStagingDirectory(io::parentDirectory(path), &reason)) {
+        if (auto staged =
+                stageIn(std::move(*directory), io::lastPathComponent(path), data, &reason)) {
+            logCFormat("Successfully wrote the KW Data to file: %s\n", path.c_str());
+            return staged;
+        }
+    }
+    logCFormat("Failed to write the zipped file: %s\n", path.c_str());
+    *whyNot = "the payload could not be staged at " + path + ": " + reason;
+    return std::nullopt;
 }
 
 }  // namespace payload

@@ -3,8 +3,11 @@
 #pragma once
 
 #include <cstdint>
+#include <optional>
 #include <string>
 
+#include "io/Directory.h"
+#include "io/UniqueFd.h"
 #include "plist/Value.h"
 
 namespace tavrix::payload {
@@ -16,8 +19,30 @@ inline constexpr const char* kBundleArchiveTempPath = "/tmp/behaviorbundle_zippe
 // bundle directory's place: beside it, so that the final rename stays on one file system.
 std::string extractionStagingPathFor(const std::string& bundleDirectory);
 
-// Writes the bytes to path atomically and logs the outcome. Always true: callers do not look.
-bool writeDataToFile(const plist::Data& data, const std::string& path);
+// A payload staged at its fixed path by this process: the file it wrote, held open for reading,
+// so that what is unpacked is what was written whatever appears at the path meanwhile. Removed
+// when the object goes, if the path still names it.
+class StagedPayload {
+  public:
+    StagedPayload(io::Directory directory, std::string name, io::UniqueFd file);
+    ~StagedPayload();
+    StagedPayload(StagedPayload&&) = default;
+    StagedPayload& operator=(StagedPayload&&) = delete;
+
+    int fd() const { return file_.get(); }
+
+  private:
+    io::Directory directory_;
+    std::string name_;
+    io::UniqueFd file_;
+};
+
+// Writes the bytes to path (whose directory others may write in, like /tmp) whole, as a file
+// created where nothing is: what is at path already is removed first only when it is this
+// process's own, and anything else there refuses the payload. Logs the outcome. Nothing, with the
+// reason in whyNot, when the payload could not be staged.
+std::optional<StagedPayload> stagePayload(const plist::Data& data, const std::string& path,
+                                          std::string* whyNot);
 
 // How entry paths are trusted. A client's own bundle payload is written where its entries point;
 // archives from the network hold only what stays inside the destination.
@@ -58,5 +83,10 @@ bool extractArchive(const std::string& archivePath, const std::string& destinati
                     ExtractionSafety safety = ExtractionSafety::AsArchived,
                     const ExtractionLimits& limits = kClientPayloadLimits,
                     std::string* whyNot = nullptr);
+// The same for the archive open at archiveFd (read from its current offset); archivePath names it
+// in messages.
+bool extractArchive(int archiveFd, const std::string& archivePath,
+                    const std::string& destinationDirectory, ExtractionSafety safety,
+                    const ExtractionLimits& limits, std::string* whyNot);
 
 }  // namespace tavrix::payload

@@ -1,5 +1,6 @@
 #include "plist/CachedPropertyListFile.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
 
 #include "plist/PropertyListFormat.h"
@@ -11,12 +12,22 @@ bool CachedPropertyListFile::Identity::operator==(const Identity& other) const {
            modified.tv_sec == other.modified.tv_sec && modified.tv_nsec == other.modified.tv_nsec;
 }
 
-CachedPropertyListFile::CachedPropertyListFile(std::string path) : path_(std::move(path)) {}
+CachedPropertyListFile::CachedPropertyListFile(std::string path, Opener opener)
+    : path_(std::move(path)), opener_(std::move(opener)) {
+    if (!opener_) {
+        opener_ = [this] {
+            // Without O_NONBLOCK, opening a FIFO would wait for a writer for ever.
+            return io::UniqueFd(
+                ::open(path_.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
+        };
+    }
+}
 
 CachedPropertyListFile::Snapshot CachedPropertyListFile::read() {
+    io::UniqueFd file = opener_();
     struct stat info {};
     Identity current;
-    if (::stat(path_.c_str(), &info) == 0) {
+    if (file && ::fstat(file.get(), &info) == 0) {
         current = {info.st_dev, info.st_ino, info.st_size, info.st_mtim};
     }
     std::lock_guard lock(mutex_);
@@ -31,7 +42,7 @@ CachedPropertyListFile::Snapshot CachedPropertyListFile::read() {
         state_ = State::Missing;
         return {state_, nullptr, true, refusal_};
     }
-    auto parsed = readFile(path_, &refusal_);
+    auto parsed = readOpenFile(file.get(), &refusal_);
     state_ = parsed ? State::Valid : State::Damaged;
     if (parsed) {
         value_ = std::make_shared<const Value>(std::move(*parsed));

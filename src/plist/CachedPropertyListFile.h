@@ -1,15 +1,18 @@
-// A property-list file whose parsed value is kept until the file changes. Reading checks the
-// file's identity and modification time (following symbolic links) and parses only when they
-// differ from the cached ones. Safe to use from several threads.
+// A property-list file whose parsed value is kept until the file changes. Reading opens the file
+// (following symbolic links, unless the owner gives an opener of its own), checks the identity
+// and modification time of what it opened and parses only when they differ from the cached
+// ones. Safe to use from several threads.
 #pragma once
 
 #include <sys/types.h>
 
 #include <ctime>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <string>
 
+#include "io/UniqueFd.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix::plist {
@@ -28,7 +31,10 @@ class CachedPropertyListFile {
         plist::Refusal refusal;
     };
 
-    explicit CachedPropertyListFile(std::string path);
+    // Opens the file for reading; an empty descriptor means there is none.
+    using Opener = std::function<io::UniqueFd()>;
+
+    explicit CachedPropertyListFile(std::string path, Opener opener = {});
 
     const std::string& path() const { return path_; }
 
@@ -48,6 +54,7 @@ class CachedPropertyListFile {
     };
 
     std::string path_;
+    Opener opener_;
     std::mutex mutex_;
     bool cached_ = false;
     Identity identity_;

@@ -344,40 +344,58 @@ std::optional<Value> parse(std::string_view bytes, Refusal* refusal) {
     return value;
 }
 
+namespace {
+
+std::optional<std::string> refuseRead(Refusal* refusal, int error, std::string reason) {
+    if (refusal != nullptr) {
+        *refusal = Refusal{error, std::move(reason)};
+    }
+    return std::nullopt;
+}
+
+}  // namespace
+
 std::optional<std::string> readFileBytes(const std::string& path, Refusal* refusal) {
-    auto refuse = [refusal](int error, std::string reason) -> std::optional<std::string> {
-        if (refusal != nullptr) {
-            *refusal = Refusal{error, std::move(reason)};
-        }
-        return std::nullopt;
-    };
     // Without O_NONBLOCK, opening a FIFO would wait for a writer for ever.
     io::UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
     if (!fd) {
         int error = errno;
-        return refuse(error, std::strerror(error));
+        return refuseRead(refusal, error, std::strerror(error));
     }
+    return readOpenFileBytes(fd.get(), refusal);
+}
+
+std::optional<std::string> readOpenFileBytes(int fd, Refusal* refusal) {
     struct stat info {};
-    if (::fstat(fd.get(), &info) != 0) {
+    if (::fstat(fd, &info) != 0) {
         int error = errno;
-        return refuse(error, std::strerror(error));
+        return refuseRead(refusal, error, std::strerror(error));
     }
     if (!S_ISREG(info.st_mode)) {
-        return refuse(0, "it is not a regular file");
+        return refuseRead(refusal, 0, "it is not a regular file");
     }
     if (info.st_size < 0 || static_cast<std::uint64_t>(info.st_size) > kMaxPropertyListBytes) {
-        return refuse(0, tooLarge());
+        return refuseRead(refusal, 0, tooLarge());
     }
     // A file that grew since fstat is still held to the cap.
     std::string bytes;
-    if (int error = io::readAll(fd.get(), bytes, kMaxPropertyListBytes); error != 0) {
-        return error == EFBIG ? refuse(0, tooLarge()) : refuse(error, std::strerror(error));
+    if (int error = io::readAll(fd, bytes, kMaxPropertyListBytes); error != 0) {
+        return error == EFBIG ? refuseRead(refusal, 0, tooLarge())
+                              : refuseRead(refusal, error, std::strerror(error));
     }
     return bytes;
 }
 
 std::optional<Value> readFile(const std::string& path, Refusal* refusal) {
     auto bytes = readFileBytes(path, refusal);
+    if (!bytes) {
+        return std::nullopt;
+    }
+    return parse(*bytes, refusal);
+}
+
+std::optional<Value> readOpenFile(int fd, Refusal* refusal) {
+    auto bytes = readOpenFileBytes(fd, refusal);
     if (!bytes) {
         return std::nullopt;
     }

@@ -43,4 +43,8 @@ bool writeFile(const std::string& path, const Value& value, Format format = Form
 // Opening never blocks (a FIFO or device is refused, not waited on).
 std::optional<std::string> readFileBytes(const std::string& path, Refusal* refusal = nullptr);
 
+// The same for a file the caller opened (read from its current offset).
+std::optional<std::string> readOpenFileBytes(int fd, Refusal* refusal = nullptr);
+std::optional<Value> readOpenFile(int fd, Refusal* refusal = nullptr);
+
 }  // namespace tavrix::plist

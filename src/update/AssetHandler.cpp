@@ -11,6 +11,7 @@
 
 #include "bundle/BundleLocations.h"
 #include "bundle/BundleManager.h"
+#include "bundle/UserBundleReplacement.h"
 #include "bundle/VersionCompare.h"
 #include "device/BehaviorPreferences.h"
 #include "device/MobileUser.h"
@@ -292,40 +293,39 @@ bool AssetHandler::installDownloadedBundle(const std::string& source) {
 }
 
 bool AssetHandler::copyDownloadedBundle(const std::string& source, const std::string& destination) {
-    FileSystemHelper files;
     // Copied beside the user bundle and put in its place only when whole: a copy that fails (a
     // disk that fills) leaves the old bundle as it was, and every file in the copy appears whole
     // or not at all.
-    const std::string staging = payload::extractionStagingPathFor(destination);
-    files.removeItem(staging);
-    logCFormat("Copying the directory %s to %s\n", source.c_str(), destination.c_str());
-    files.createDirectory(staging, 0755, true);
-    std::vector<std::string> names;
-    int error = files.listDirectory(source, names, false);
-    if (error == 0) {
-        logCFormat("There are %ld files in directory %s\n", static_cast<long>(names.size()),
-                   source.c_str());
-    }
-    for (std::size_t index = 0; error == 0 && index < names.size(); ++index) {
-        const std::string entry = source + "/" + names[index];
-        logCFormat("Copying %s\n", entry.c_str());
-        error = copyItemTree(entry, staging + "/" + names[index]);
-    }
-    if (error == 0) {
-        logCFormat("Removing the directory %s\n", destination.c_str());
-        error = files.removeItem(destination);
-        error = error == ENOENT ? 0 : error;
-    }
-    if (error == 0 && ::rename(staging.c_str(), destination.c_str()) != 0) {
-        error = errno;
-    }
-    if (error != 0) {
+    std::string whyNot;
+    const bool copied = replaceUserBundle(
+        [&](const std::string& staging, std::string* failure) {
+            FileSystemHelper files;
+            logCFormat("Copying the directory %s to %s\n", source.c_str(), destination.c_str());
+            files.createDirectory(staging, 0755, true);
+            std::vector<std::string> names;
+            int error = files.listDirectory(source, names, false);
+            if (error == 0) {
+                logCFormat("There are %ld files in directory %s\n", static_cast<long>(names.size()),
+                           source.c_str());
+            }
+            for (std::size_t index = 0; error == 0 && index < names.size(); ++index) {
+                const std::string entry = source + "/" + names[index];
+                logCFormat("Copying %s\n", entry.c_str());
+                error = copyItemTree(entry, staging + "/" + names[index]);
+            }
+            if (error != 0) {
+                *failure = std::strerror(error);
+                return false;
+            }
+            logCFormat("Removing the directory %s\n", destination.c_str());
+            return true;
+        },
+        IncompleteBundle::Discard, &whyNot);
+    if (!copied) {
         logCFormat("Failed to install %s into %s: %s\n", source.c_str(), destination.c_str(),
-                   std::strerror(error));
-        files.removeItem(staging);
-        return false;
+                   whyNot.c_str());
     }
-    return true;
+    return copied;
 }
 
 void AssetHandler::resumeInterruptedInstall() {
@@ -340,6 +340,12 @@ void AssetHandler::resumeInterruptedInstall() {
 void AssetHandler::resumePendingInstall(const PendingInstall& pendingInstall) {
     const PendingInstall* pending = &pendingInstall;
     const std::string& asset = pending->assetDirectory;
+    if (!catalog::AssetQuery(kAssetTypeTavrixBundles).isInDownloadCache(asset)) {
+        // The record names something the catalog never downloaded: nothing to install or purge.
+        logCFormat("Ignoring the install record: %s is not a download\n", asset.c_str());
+        removePendingInstall();
+        return;
+    }
     if (!pending->installed && itemKind(asset) == ItemKind::Directory) {
         logCFormat("Completing the interrupted install of %s\n", asset.c_str());
         installDownloadedBundle(asset);

@@ -195,13 +195,13 @@ TEST_F(BundleManagerStartUp, LinksThatDisagreeAreLinkedAgainAndLeftoversRemoved)
     test::writeText(overlays + "id+behavior+Default.bundle+ab12+7.plist", "<plist/>");
     test::writeText(overlays + "id+behavior+Default.bundle+ab12+9.plist", "<plist/>");
     test::writeText(overlays + ".tavrix-write-Ab12Cd", "half");
-    fs::create_symlink(userBundle(), home() + "/Library/.tavrix-link-Tavrix.bundle");
+    fs::create_symlink(userBundle(), home() + "/Library/.tavrix-write-Xy12Ab");
     test::writeText(root() + "/tmp/behaviorbundle_zipped.tgz", "staged");
     test::writeText(home() + "/Library/TavrixBundles/.Default.bundle.incoming/Info.plist", "x");
 
     BundleManager& manager = BundleManager::sharedInstance();
     for (const std::string& leftover :
-         {overlays + ".tavrix-write-Ab12Cd", home() + "/Library/.tavrix-link-Tavrix.bundle",
+         {overlays + ".tavrix-write-Ab12Cd", home() + "/Library/.tavrix-write-Xy12Ab",
           root() + "/tmp/behaviorbundle_zipped.tgz",
           home() + "/Library/TavrixBundles/.Default.bundle.incoming"}) {
         EXPECT_FALSE(fs::exists(fs::symlink_status(leftover))) << leftover;

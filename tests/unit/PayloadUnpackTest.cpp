@@ -1,3 +1,4 @@
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -295,19 +296,26 @@ TEST_F(BundleInstall, EachPayloadReplacesTheUserBundle) {
     EXPECT_FALSE(fs::exists(staged));
 }
 
-// The staged file is replaced whole; a file that cannot be written still answers YES.
-TEST(WriteDataToFile, ReplacesTheFile) {
+// The daemon's own earlier file is replaced, what is unpacked is what was written, and the file
+// goes with the staging; a directory where others could rename the file refuses the payload.
+TEST(StagePayload, WritesItsOwnFileAndRefusesAnUnsafeDirectory) {
     TempDir dir;
     const std::string path = dir / "staged.tgz";
     writeText(path, "older and longer content");
-    EXPECT_TRUE(writeDataToFile(plist::Data{'n', 'e', 'w'}, path));
-    EXPECT_EQ(readText(path), "new");
-    // Nothing but the file itself is left in the directory.
-    EXPECT_EQ(snapshotTree(dir.path()), (Tree{{"staged.tgz", "new"}}));
+    std::string whyNot;
+    {
+        auto staged = stagePayload(plist::Data{'n', 'e', 'w'}, path, &whyNot);
+        ASSERT_TRUE(staged) << whyNot;
+        EXPECT_EQ(snapshotTree(dir.path()), (Tree{{"staged.tgz", "new"}}));
+        char bytes[8] = {};
+        EXPECT_EQ(::read(staged->fd(), bytes, sizeof bytes), 3);
+    }
+    EXPECT_TRUE(fs::is_empty(dir.path()));
 
-    const std::string unwritable = dir / "missing/staged.tgz";
-    EXPECT_TRUE(writeDataToFile(plist::Data{'x'}, unwritable));
-    EXPECT_FALSE(fs::exists(unwritable));
+    fs::permissions(dir.path(), fs::perms::all);
+    EXPECT_FALSE(stagePayload(plist::Data{'x'}, path, &whyNot));
+    EXPECT_THAT(whyNot, ::testing::HasSubstr("others may write in it and it is not sticky"));
+    EXPECT_FALSE(fs::exists(path));
 }
 
 }  // namespace

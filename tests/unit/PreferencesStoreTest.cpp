@@ -107,8 +107,8 @@ TEST_F(PreferencesStoreTest, DamagedFileReadsEmptyIsLoggedOncePerVersionAndIsRep
         EXPECT_EQ(plist::readFile(path), Value(plist::Dictionary{{"new", Value("repaired")}}));
         EXPECT_EQ(sink.messages(), std::vector<std::string>{logLine});
     }
-    // No temporary file is left behind.
-    EXPECT_EQ(std::distance(fs::directory_iterator(preferencesDirectory()), {}), 1);
+    // No temporary file is left behind: the domain and its lock file only.
+    EXPECT_EQ(std::distance(fs::directory_iterator(preferencesDirectory()), {}), 2);
 }
 
 TEST_F(PreferencesStoreTest, SymbolicLinkDomainIsReadThroughAndRepointed) {
@@ -160,11 +160,15 @@ TEST_F(PreferencesStoreTest, FailedWritesKeepThePendingValues) {
     const std::vector<std::pair<std::function<void()>, std::function<void()>>> cases = {
         {[&] { test::writeText(directory, "a file, not a directory"); },
          [&] { fs::remove(directory); }},
+        // Anyone could rename the file the daemon writes in a directory like this one.
         {[&] {
              fs::create_directories(directory);
-             fs::create_symlink(domain + ".plist", path);  // a loop
+             fs::permissions(directory, fs::perms::all);
          },
-         [&] { fs::remove(path); }},
+         [&] {
+             fs::permissions(directory, fs::perms::group_write | fs::perms::others_write,
+                             fs::perm_options::remove);
+         }},
     };
     for (std::size_t i = 0; i < cases.size(); ++i) {
         SCOPED_TRACE(i);
@@ -172,7 +176,8 @@ TEST_F(PreferencesStoreTest, FailedWritesKeepThePendingValues) {
         cases[i].first();
         store.setValue(key, Value("kept"), domain, kUser);
         EXPECT_FALSE(store.synchronize(domain, kUser));
-        EXPECT_EQ(sink.messages().size(), 1u);
+        // Why the directory is refused, and that the write failed.
+        EXPECT_EQ(sink.messages().size(), 2u);
         EXPECT_EQ(store.copyValue(key, domain, kUser), Value("kept"));
         sink.clear();
 

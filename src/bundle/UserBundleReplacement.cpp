@@ -1,0 +1,64 @@
+#include "bundle/UserBundleReplacement.h"
+
+#include <stdio.h>
+
+#include <cerrno>
+#include <cstring>
+
+#include "bundle/BundleLocations.h"
+#include "device/HomeDirectories.h"
+#include "io/Paths.h"
+#include "payload/PayloadUnpack.h"
+#include "util/FileSystemUtilities.h"
+#include "util/Log.h"
+
+namespace tavrix {
+
+bool replaceUserBundle(const UserBundleFill& fill, IncompleteBundle incomplete,
+                       std::string* whyNot) {
+    const std::string& bundle = userBundleLocation();
+    if (bundle.empty()) {
+        // Removing or extracting relative to an unknown home could touch anything.
+        logCFormat(
+            "Not installing the behavior bundle: the home directory of the mobile user is "
+            "unknown\n");
+        *whyNot = "the mobile user's home directory is unknown";
+        return false;
+    }
+    // Everything below happens by path inside this directory, which nobody else can rearrange.
+    const auto bundles = device::openMobileHomeDirectory(io::parentDirectory(bundle), true);
+    if (!bundles) {
+        *whyNot =
+            "the bundle directory " + io::parentDirectory(bundle) + " is not the daemon's own";
+        logCFormat("Not installing the behavior bundle: %s\n", whyNot->c_str());
+        return false;
+    }
+    const std::string staging = payload::extractionStagingPathFor(bundle);
+    removeItemTree(staging);
+    const bool filled = fill(staging, whyNot);
+    if (!filled && incomplete == IncompleteBundle::Discard) {
+        removeItemTree(staging);
+        return false;
+    }
+    // A bundle that cannot be removed whole (and would mix with the new one) stays as it is.
+    if (int removed = removeItemTree(bundle); removed != 0 && removed != ENOENT) {
+        logCFormat("Could not remove the bundle %s (error %d), keeping it\n", bundle.c_str(),
+                   removed);
+        removeItemTree(staging);
+        *whyNot = std::string("the old bundle could not be removed: ") + std::strerror(removed);
+        return false;
+    }
+    if (::renameat(bundles->fd(), io::lastPathComponent(staging).c_str(), bundles->fd(),
+                   io::lastPathComponent(bundle).c_str()) != 0) {
+        const int error = errno;
+        logCFormat("Could not move the extracted bundle into %s (error %d)\n", bundle.c_str(),
+                   error);
+        removeItemTree(staging);
+        *whyNot = std::string("the extracted bundle could not be moved into place: ") +
+                  std::strerror(error);
+        return false;
+    }
+    return filled;
+}
+
+}  // namespace tavrix

@@ -1,0 +1,272 @@
+#include "io/Directory.h"
+
+#include <fcntl.h>
+#include <stdio.h>
+#include <sys/random.h>
+#include <unistd.h>
+
+#include <cerrno>
+
+#include "io/FileIO.h"
+
+namespace tavrix::io {
+namespace {
+
+constexpr int kOpenFlags = O_RDONLY | O_DIRECTORY | O_CLOEXEC;
+// Enough tries that a directory crowded with other users' look-alike names cannot stop a write.
+constexpr int kTemporaryNameAttempts = 100;
+
+// A temporary name nobody can predict, so that nobody can plant something there first.
+std::string temporaryName() {
+    static constexpr char kAlphabet[] =
+        "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789";
+    unsigned char random[12] = {};
+    std::size_t filled = 0;
+    while (filled < sizeof random) {
+        ssize_t got = ::getrandom(random + filled, sizeof random - filled, 0);
+        if (got > 0) {
+            filled += static_cast<std::size_t>(got);
+        } else if (errno != EINTR) {
+            break;
+        }
+    }
+    std::string name = kAtomicWritePrefix;
+    for (unsigned char byte : random) {
+        name += kAlphabet[byte % (sizeof kAlphabet - 1)];
+    }
+    return name;
+}
+
+// Removes the temporary entry unless it was renamed into place.
+class TemporaryEntry {
+  public:
+    TemporaryEntry(int directory, std::string name)
+        : directory_(directory), name_(std::move(name)) {}
+    ~TemporaryEntry() {
+        if (!name_.empty()) {
+            ::unlinkat(directory_, name_.c_str(), 0);
+        }
+    }
+    TemporaryEntry(const TemporaryEntry&) = delete;
+    TemporaryEntry& operator=(const TemporaryEntry&) = delete;
+
+    const char* name() const { return name_.c_str(); }
+    void keep() { name_.clear(); }
+
+  private:
+    int directory_;
+    std::string name_;
+};
+
+// A rename that fails with EEXIST instead of replacing; file systems without that flag get a
+// plain rename after checking that nothing is there.
+int renameWithoutReplacing(int directory, const char* from, const char* to) {
+    if (::renameat2(directory, from, directory, to, RENAME_NOREPLACE) == 0) {
+        return 0;
+    }
+    if (errno != EINVAL && errno != ENOSYS) {
+        return errno;
+    }
+    struct stat existing {};
+    if (::fstatat(directory, to, &existing, AT_SYMLINK_NOFOLLOW) == 0) {
+        return EEXIST;
+    }
+    return ::renameat(directory, from, directory, to) == 0 ? 0 : errno;
+}
+
+bool isValidName(std::string_view name) {
+    return !name.empty() && name != "." && name != ".." &&
+           name.find_first_of(std::string_view("/\0", 2)) == std::string_view::npos;
+}
+
+}  // namespace
+
+bool isTrustedOwner(uid_t owner) {
+    return owner == 0 || owner == ::geteuid();
+}
+
+std::optional<std::string> whyNotProtected(const struct stat& directory) {
+    if (!S_ISDIR(directory.st_mode)) {
+        return "it is not a directory";
+    }
+    if (!isTrustedOwner(directory.st_uid)) {
+        return "it belongs to user " + std::to_string(directory.st_uid);
+    }
+    if ((directory.st_mode & (S_IWGRP | S_IWOTH)) != 0 && (directory.st_mode & S_ISVTX) == 0) {
+        return "others may write in it and it is not sticky";
+    }
+    return std::nullopt;
+}
+
+Directory::Directory(UniqueFd fd, std::string path, const struct stat& status)
+    : fd_(std::move(fd)), path_(std::move(path)), status_(status) {}
+
+std::optional<Directory> Directory::open(const std::string& path, LastLink lastLink, int* error) {
+    UniqueFd fd(::open(path.empty() ? "." : path.c_str(),
+                       kOpenFlags | (lastLink == LastLink::Refuse ? O_NOFOLLOW : 0)));
+    struct stat status {};
+    if (!fd || ::fstat(fd.get(), &status) != 0) {
+        // O_NOFOLLOW with O_DIRECTORY reports a link as "not a directory".
+        *error = errno == ENOTDIR && lastLink == LastLink::Refuse ? ELOOP : errno;
+        return std::nullopt;
+    }
+    return Directory(std::move(fd), path, status);
+}
+
+std::optional<Directory> Directory::openChild(std::string_view name, int* error) const {
+    if (!isValidName(name)) {
+        *error = EINVAL;
+        return std::nullopt;
+    }
+    const std::string child(name);
+    UniqueFd fd(::openat(fd_.get(), child.c_str(), kOpenFlags | O_NOFOLLOW));
+    struct stat status {};
+    if (!fd || ::fstat(fd.get(), &status) != 0) {
+        int failure = errno;
+        struct stat entry {};
+        if (failure == ENOTDIR &&
+            ::fstatat(fd_.get(), child.c_str(), &entry, AT_SYMLINK_NOFOLLOW) == 0 &&
+            S_ISLNK(entry.st_mode)) {
+            failure = ELOOP;
+        }
+        *error = failure;
+        return std::nullopt;
+    }
+    return Directory(std::move(fd), pathOf(name), status);
+}
+
+std::string Directory::pathOf(std::string_view name) const {
+    if (path_.empty() || path_.back() == '/') {
+        return path_ + std::string(name);
+    }
+    return path_ + "/" + std::string(name);
+}
+
+int Directory::writeFile(std::string_view name, mode_t mode, bool replace,
+                         const std::function<int(int fd)>& fill) const {
+    if (!isValidName(name)) {
+        return EISDIR;
+    }
+    UniqueFd file;
+    std::string temporary;
+    for (int attempt = 0; !file && attempt < kTemporaryNameAttempts; ++attempt) {
+        temporary = temporaryName();
+        file.reset(::openat(fd_.get(), temporary.c_str(),
+                            O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
+        if (!file && errno != EEXIST) {
+            return errno;
+        }
+    }
+    if (!file) {
+        return EEXIST;
+    }
+    TemporaryEntry entry(fd_.get(), temporary);
+    if (int error = fill(file.get()); error != 0) {
+        return error;
+    }
+    if (::fchmod(file.get(), mode) != 0 || ::fsync(file.get()) != 0) {
+        return errno;
+    }
+    if (::close(file.release()) != 0) {
+        return errno;
+    }
+    const std::string target(name);
+    if (replace) {
+        if (::renameat(fd_.get(), entry.name(), fd_.get(), target.c_str()) != 0) {
+            return errno;
+        }
+    } else if (int error = renameWithoutReplacing(fd_.get(), entry.name(), target.c_str());
+               error != 0) {
+        return error;
+    }
+    entry.keep();
+    // The rename is durable only once the directory is flushed; a failure there leaves the new
+    // file in place, so it does not count against the write.
+    ::fsync(fd_.get());
+    return 0;
+}
+
+int Directory::writeFile(std::string_view name, mode_t mode, bool replace,
+                         std::string_view bytes) const {
+    return writeFile(name, mode, replace, [bytes](int fd) { return writeAll(fd, bytes); });
+}
+
+int Directory::replaceSymlink(std::string_view name, const std::string& target) const {
+    if (!isValidName(name)) {
+        return EINVAL;
+    }
+    std::string temporary;
+    int error = EEXIST;
+    for (int attempt = 0; error == EEXIST && attempt < kTemporaryNameAttempts; ++attempt) {
+        temporary = temporaryName();
+        error = ::symlinkat(target.c_str(), fd_.get(), temporary.c_str()) == 0 ? 0 : errno;
+    }
+    if (error != 0) {
+        return error;
+    }
+    TemporaryEntry entry(fd_.get(), temporary);
+    const std::string link(name);
+    if (::renameat(fd_.get(), entry.name(), fd_.get(), link.c_str()) != 0) {
+        // A plain remove would take an empty directory; one that holds something stays.
+        if ((errno != EISDIR && errno != ENOTEMPTY && errno != EEXIST) ||
+            ::unlinkat(fd_.get(), link.c_str(), AT_REMOVEDIR) != 0 ||
+            ::renameat(fd_.get(), entry.name(), fd_.get(), link.c_str()) != 0) {
+            return errno;
+        }
+    }
+    entry.keep();
+    ::fsync(fd_.get());
+    return 0;
+}
+
+UniqueFd Directory::openOwnFile(std::string_view name, int* error) const {
+    if (!isValidName(name)) {
+        *error = EINVAL;
+        return UniqueFd();
+    }
+    // Without O_NONBLOCK, opening a FIFO would wait for a writer for ever.
+    UniqueFd file(::openat(fd_.get(), std::string(name).c_str(),
+                           O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+    struct stat status {};
+    if (!file || ::fstat(file.get(), &status) != 0) {
+        *error = errno;
+        return UniqueFd();
+    }
+    if (!S_ISREG(status.st_mode)) {
+        *error = EINVAL;
+        return UniqueFd();
+    }
+    if (!isTrustedOwner(status.st_uid)) {
+        *error = EPERM;
+        return UniqueFd();
+    }
+    return file;
+}
+
+std::optional<struct stat> Directory::entryStatus(std::string_view name) const {
+    struct stat status {};
+    if (!isValidName(name)) {
+        errno = EINVAL;
+        return std::nullopt;
+    }
+    if (::fstatat(fd_.get(), std::string(name).c_str(), &status, AT_SYMLINK_NOFOLLOW) != 0) {
+        return std::nullopt;
+    }
+    return status;
+}
+
+int Directory::removeEntry(std::string_view name) const {
+    if (!isValidName(name)) {
+        return EINVAL;
+    }
+    const std::string entry(name);
+    if (::unlinkat(fd_.get(), entry.c_str(), 0) == 0) {
+        return 0;
+    }
+    if (errno != EISDIR) {
+        return errno;
+    }
+    return ::unlinkat(fd_.get(), entry.c_str(), AT_REMOVEDIR) == 0 ? 0 : errno;
+}
+
+}  // namespace tavrix::io
