@@ -60,7 +60,7 @@ inline int runProgram(const std::vector<std::string>& argv) {
 inline std::unique_ptr<test::PrivateBus> startDaemonBus(const std::filesystem::path& work,
                                                         const std::filesystem::path& root) {
     return std::make_unique<test::PrivateBus>(
-        test::ActivatedDaemon{TAVRIX_DAEMON_PATH, root, work / "run", 300});
+        test::ActivatedDaemon{TAVRIX_DAEMON_PATH, root, work / "run", 300, {}});
 }
 
 // Runs the benchmark in a fresh directory under /dev/shm, removed afterwards unless it failed

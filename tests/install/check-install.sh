@@ -51,7 +51,7 @@ grep -qx "User=tavrixservicesd" "$activation" || fail "the bus does not start ta
 ! grep -rq '@[A-Z_]*@' "$unit" "$activation" || fail "a placeholder was left unreplaced"
 
 # The snippets make the daemon's and the mobile user, the tavrix group and every directory the
-# unit writes, the mobile ones reachable through the daemon's group.
+# unit writes, the mobile ones owned so that the mobile user cannot rearrange them.
 if command -v systemd-sysusers >/dev/null && command -v systemd-tmpfiles >/dev/null; then
     root="$stage/root"
     mkdir -p "$root/etc"
@@ -64,10 +64,13 @@ if command -v systemd-sysusers >/dev/null && command -v systemd-tmpfiles >/dev/n
         var/lib/tavrixservicesd var/cache/tavrixservicesd; do
         [ -d "$root/$directory" ] || fail "tmpfiles.d does not make /$directory"
     done
-    daemon_gid=$(sed -n 's/^tavrixservicesd:x:[0-9]*:\([0-9]*\):.*/\1/p' "$root/etc/passwd")
+    daemon_uid=$(sed -n 's/^tavrixservicesd:x:\([0-9]*\):.*/\1/p' "$root/etc/passwd")
+    mobile_gid=$(sed -n 's/^mobile:x:[0-9]*:\([0-9]*\):.*/\1/p' "$root/etc/passwd")
+    [ "$(stat -c %a:%u:%g "$root/var/mobile")" = "1775:0:$mobile_gid" ] ||
+        fail "/var/mobile is not root's, sticky and open to the mobile group"
     for directory in var/mobile/Library var/mobile/Library/Preferences; do
-        [ "$(stat -c %a:%g "$root/$directory")" = "2775:$daemon_gid" ] ||
-            fail "/$directory is not group-writable and setgid for the daemon's group"
+        [ "$(stat -c %a:%u:%g "$root/$directory")" = "1775:$daemon_uid:$mobile_gid" ] ||
+            fail "/$directory is not the daemon's, sticky and open to the mobile group"
     done
 else
     echo "systemd-sysusers or systemd-tmpfiles missing: snippets not checked"

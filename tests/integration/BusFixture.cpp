@@ -117,7 +117,7 @@ int BusWatcher::onPosted(sd_bus_message* message, void* self, sd_bus_error*) {
 void BusFixture::SetUp() {
     bus_ = std::make_unique<test::PrivateBus>(
         test::ActivatedDaemon{TAVRIX_DAEMON_PATH, device_.root(), device_.runtimeDirectory(),
-                              idleExitSeconds},
+                              idleExitSeconds, daemonLaunchPrefix},
         policyFile);
     watcher_ = std::make_unique<BusWatcher>(bus_->address());
 }

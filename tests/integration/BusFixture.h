@@ -197,6 +197,7 @@ class BusFixture : public ::testing::Test {
     // Set by a derived fixture's constructor (or SetUp, before calling this one's).
     int idleExitSeconds = 30;
     std::optional<std::filesystem::path> policyFile;
+    std::vector<std::string> daemonLaunchPrefix;
 
   private:
     int countLogLines(const std::string& text, bool whole) const;

@@ -23,6 +23,7 @@ namespace {
 namespace fs = std::filesystem;
 
 constexpr const char* kOpenPolicy = R"(  <policy context="default">
+    <allow user="*"/>
     <allow send_destination="*" eavesdrop="true"/>
     <allow eavesdrop="true"/>
     <allow own="*"/>
@@ -142,12 +143,16 @@ PrivateBus::PrivateBus(const std::optional<ActivatedDaemon>& daemon,
         // The daemon runs as a child of this script rather than in its place, so that its exit
         // status is recorded: the bus only ever sees the script's.
         const fs::path launcher = directory / "launch-daemon";
+        std::string prefix;
+        for (const std::string& word : daemon->launchPrefix) {
+            prefix += quoted(fs::path(word)) + " ";
+        }
         const std::string launches = quoted(directory / "launches");
         writeText(launcher, "#!/bin/sh\n/usr/bin/env TAVRIX_ROOT=" + quoted(daemon->root) +
                                 " TAVRIX_LOG_STDERR=1 TAVRIX_IDLE_EXIT_SEC=" +
                                 std::to_string(daemon->idleExitSeconds) +
                                 " RUNTIME_DIRECTORY=" + quoted(daemon->runtimeDirectory) + " " +
-                                quoted(daemon->binary) + " >>" + quoted(directory / "bus.log") +
+                                prefix + quoted(daemon->binary) + " >>" + quoted(directory / "bus.log") +
                                 " 2>&1 &\ndaemon=$!\necho \"started $daemon\" >>" + launches +
                                 "\nwait \"$daemon\"\necho \"exited $daemon $?\" >>" + launches +
                                 "\n");

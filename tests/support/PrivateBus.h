@@ -38,6 +38,8 @@ struct ActivatedDaemon {
     std::filesystem::path root;              // TAVRIX_ROOT
     std::filesystem::path runtimeDirectory;  // RUNTIME_DIRECTORY
     int idleExitSeconds = 30;                // TAVRIX_IDLE_EXIT_SEC
+    // Runs the daemon through this command (setpriv, to start it as another user).
+    std::vector<std::string> launchPrefix;
 };
 
 // One start of the daemon by the bus, as its launcher recorded it.

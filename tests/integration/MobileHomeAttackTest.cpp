@@ -1,0 +1,333 @@
+// The mobile home is hostile ground: every application runs as the mobile user. On a device root
+// laid out by the packaged users and directories snippets, with the daemon running as its own
+// user, a process of the mobile user attacks what the daemon installs, links and stores, once
+// before anything is installed and then over and over while a privileged client sets the
+// behavior ID with a bundle, the daemon relaunches and a signed update installs. Whatever it
+// does: the linked bundle is one the daemon installed, nothing the attacker supplied is written
+// by the daemon anywhere, the daemon's preferences hold what the client set, and the update
+// installs. Starting processes as other users needs root.
+#include <gmock/gmock.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+
+#include "BusFixture.h"
+#include "LocalHttpServer.h"
+#include "TestSupport.h"
+#include "plist/PropertyListFormat.h"
+
+namespace tavrix::integration {
+namespace {
+
+namespace fs = std::filesystem;
+using ::testing::HasSubstr;
+
+constexpr const char* kSetpriv = "/usr/bin/setpriv";
+constexpr const char* kBehaviorID = "acme.default";
+constexpr const char* kDaemonPreferences =
+    "/var/mobile/Library/Preferences/com.zandor.tavrixservices.plist";
+
+struct Attack {
+    const char* name;
+    // Run by /bin/sh as the mobile user, with $H the mobile home, $STATE the daemon's state
+    // directory, $T the device's /tmp and $EVIL the attacker's own files; failures are expected.
+    const char* script;
+    // Whether the client's payloads cannot be installed while it runs (the daemon refuses them).
+    bool blocksPayloads = false;
+};
+
+std::ostream& operator<<(std::ostream& out, const Attack& attack) {
+    return out << attack.name;
+}
+
+// The uid and gid of name in the device's user database.
+std::pair<uid_t, gid_t> userIn(const fs::path& passwd, const std::string& name) {
+    std::ifstream in(passwd);
+    for (std::string line; std::getline(in, line);) {
+        std::istringstream fields(line);
+        std::string user, password, uid, gid;
+        std::getline(fields, user, ':');
+        std::getline(fields, password, ':');
+        std::getline(fields, uid, ':');
+        std::getline(fields, gid, ':');
+        if (user == name) {
+            return {static_cast<uid_t>(std::stoul(uid)), static_cast<gid_t>(std::stoul(gid))};
+        }
+    }
+    throw std::runtime_error("no user " + name + " in " + passwd.string());
+}
+
+std::vector<std::string> asUser(std::pair<uid_t, gid_t> user, std::vector<std::string> command) {
+    std::vector<std::string> argv = {kSetpriv, "--reuid=" + std::to_string(user.first),
+                                     "--regid=" + std::to_string(user.second), "--clear-groups"};
+    argv.insert(argv.end(), command.begin(), command.end());
+    return argv;
+}
+
+// The attack repeated in a loop of its own until the object goes.
+class RepeatedAttack {
+  public:
+    explicit RepeatedAttack(const std::vector<std::string>& argv) {
+        pid_ = ::fork();
+        if (pid_ == 0) {
+            ::setpgid(0, 0);
+            std::vector<char*> words;
+            for (const std::string& word : argv) {
+                words.push_back(const_cast<char*>(word.c_str()));
+            }
+            words.push_back(nullptr);
+            ::execv(words[0], words.data());
+            ::_exit(127);
+        }
+    }
+    ~RepeatedAttack() {
+        if (pid_ > 0) {
+            ::kill(pid_, SIGKILL);
+            ::waitpid(pid_, nullptr, 0);
+        }
+    }
+    RepeatedAttack(const RepeatedAttack&) = delete;
+    RepeatedAttack& operator=(const RepeatedAttack&) = delete;
+
+  private:
+    pid_t pid_ = -1;
+};
+
+class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInterface<Attack> {
+  protected:
+    void SetUp() override {
+        if (::geteuid() != 0) {
+            GTEST_SKIP() << "running the daemon and the attacker as other users needs root";
+        }
+        for (const char* tool :
+             {kSetpriv, "/usr/bin/systemd-sysusers", "/usr/bin/systemd-tmpfiles"}) {
+            if (::access(tool, X_OK) != 0) {
+                GTEST_SKIP() << tool << " is missing";
+            }
+        }
+        layOutAsPackaged();
+        daemon_ = userIn(at("/etc/passwd"), "tavrixservicesd");
+        mobile_ = userIn(at("/etc/passwd"), "mobile");
+        if (runCommand(asUser(daemon_, {"/usr/bin/test", "-x", TAVRIX_DAEMON_PATH})).status != 0) {
+            GTEST_SKIP() << "the daemon's user cannot reach " << TAVRIX_DAEMON_PATH;
+        }
+        fs::permissions(device().base(), fs::perms::others_read | fs::perms::others_exec,
+                        fs::perm_options::add);
+        ASSERT_EQ(::chown(device().runtimeDirectory().c_str(), daemon_.first, daemon_.second), 0);
+        daemonLaunchPrefix = asUser(daemon_, {});
+        prepareAttackerFiles();
+        BusFixture::SetUp();
+    }
+
+    // The device root as the package lays it out: its users and directories made by the
+    // packaged snippets, a system bundle of version 10 and a shared /tmp.
+    void layOutAsPackaged() {
+        fs::remove(at("/etc/passwd"));
+        fs::remove_all(at("/var/mobile"));
+        const std::string root = device().root().string();
+        for (const std::vector<std::string>& command :
+             {std::vector<std::string>{"/usr/bin/systemd-sysusers", "--root=" + root,
+                                       TAVRIX_SYSUSERS_PATH},
+              {"/usr/bin/systemd-tmpfiles", "--root=" + root, "--create", TAVRIX_TMPFILES_PATH}}) {
+            CommandResult run = runCommand(command);
+            ASSERT_EQ(run.status, 0) << run.output;
+        }
+        fs::create_directories(at("/tmp"));
+        fs::permissions(at("/tmp"), fs::perms::all | fs::perms::sticky_bit);
+        writeBundle(at(kSystemBundle), "10", {{"CarrierName", "System"}});
+    }
+
+    // A bundle of version 99 and a packed one whose entries reach for the daemon's state
+    // directory, plus preferences the attacker would like the daemon to take.
+    void prepareAttackerFiles() {
+        const fs::path evil = device().base() / "evil";
+        writeBundle(evil / "Default.bundle", "99", {{"CarrierName", "PWNED"}});
+        test::writeText(evil / "Default.bundle/PWNED", "x");
+        const fs::path escape = device().base() / "escape";
+        test::writeText(escape / "PWNED-inside", "x");
+        CommandResult packed =
+            runCommand({"/usr/bin/bsdtar", "-czPf", (evil / "payload.tgz").string(), "-s",
+                        "|^|" + at("/var/lib/tavrixservicesd").string() + "/|", "-C",
+                        escape.string(), "PWNED-inside"});
+        ASSERT_EQ(packed.status, 0) << packed.output;
+        ASSERT_TRUE(plist::writeFile(
+            (evil / "preferences.plist").string(),
+            plist::Value(plist::Dictionary{{"TavrixID", "pwned"},
+                                           {"EnableSupport", true},
+                                           {"NextUpdate", plist::Date{2'000'000'000.0}}})));
+        CommandResult opened = runCommand({"/bin/chmod", "-R", "a+rX", evil.string()});
+        ASSERT_EQ(opened.status, 0) << opened.output;
+    }
+
+    std::vector<std::string> attackCommand(bool repeat) {
+        std::string script =
+            std::string("H='") + at("/var/mobile").string() + "' STATE='" +
+            at("/var/lib/tavrixservicesd").string() + "' T='" + at("/tmp").string() + "' EVIL='" +
+            (device().base() / "evil").string() + "'; " + (repeat ? "while :; do " : "") +
+            GetParam().script + (repeat ? "; sleep 0.05; done" : "");
+        return asUser(mobile_, {"/bin/sh", "-c", "exec 2>/dev/null; " + script});
+    }
+
+    void setIDWithBundle(const std::string& version) {
+        const fs::path bundle = device().base() / ("bundles/" + version + "/Default.bundle");
+        writeBundle(bundle, version, {{"CarrierName", "Bundle " + version}});
+        ASSERT_TRUE(client().setTavrixID("ACME.default", pack(bundle)));
+    }
+
+    void relaunch() {
+        std::optional<pid_t> pid = daemonPid();
+        ASSERT_TRUE(pid);
+        ::kill(*pid, SIGTERM);
+        ASSERT_TRUE(waitForDaemonExit(*pid));
+        client().isTavrixBundleSupported();
+    }
+
+    // The device's configuration turns bundle support on, as root, keeping what is stored.
+    void enableSupport() {
+        auto stored = device().readDaemonPreferences();
+        plist::Dictionary values =
+            stored && stored->asDictionary() ? *stored->asDictionary() : plist::Dictionary();
+        values.insert_or_assign("EnableSupport", true);
+        device().writeDaemonPreferences(values);
+    }
+
+    // Version 13 published in a signed catalog on 127.0.0.1 that the device trusts.
+    void publishSignedUpdate() {
+        const fs::path keys = device().base() / "keys";
+        const fs::path site = device().base() / "site";
+        fs::create_directories(keys);
+        CommandResult run = runCommand({TAVRIX_CATALOG_TOOL, "keygen", (keys / "secret").string(),
+                                        (keys / "public").string()});
+        ASSERT_EQ(run.status, 0) << run.output;
+        const fs::path bundle = device().base() / "bundles/13/Default.bundle";
+        writeBundle(bundle, "13", {{"CarrierName", "Bundle 13"}});
+        run = runCommand({TAVRIX_CATALOG_TOOL, "publish", site.string(), "--key",
+                          (keys / "secret").string(), "--fresh", bundle.string()});
+        ASSERT_EQ(run.status, 0) << run.output;
+        server_.serveDirectory("/updates/", site);
+        std::string publicKey = test::readText(keys / "public");
+        publicKey.pop_back();
+        ASSERT_TRUE(plist::writeFile(
+            at("/etc/tavrix/AssetCatalog.plist").string(),
+            plist::Value(plist::Dictionary{
+                {"AssetTypes",
+                 plist::Dictionary{
+                     {"com.zandor.Grellas.TavrixBundles",
+                      plist::Dictionary{{"CatalogURL", server_.url("/updates/catalog.plist")},
+                                        {"PublicKey", publicKey}}}}}})));
+    }
+
+    // Both links are the daemon's own and lead into the user bundle of this version.
+    void expectLinked(const std::string& version) {
+        EXPECT_EQ(linkedVersion(), version);
+        EXPECT_EQ(linkState(), "links agree");
+        for (const char* link : {kBundleLink, kPreferencesLink}) {
+            struct stat info {};
+            ASSERT_EQ(::lstat(at(link).c_str(), &info), 0) << link;
+            EXPECT_TRUE(S_ISLNK(info.st_mode)) << link;
+            EXPECT_EQ(info.st_uid, daemon_.first) << link;
+        }
+    }
+
+    // Nothing the daemon owns carries the attacker's marks, and its state directory holds only
+    // its own regular files.
+    void expectNothingWrittenForTheAttacker() {
+        for (const auto& entry : fs::recursive_directory_iterator(device().root())) {
+            struct stat info {};
+            ASSERT_EQ(::lstat(entry.path().c_str(), &info), 0);
+            if (entry.path().string().find("PWNED") != std::string::npos) {
+                EXPECT_EQ(info.st_uid, mobile_.first) << entry.path();
+            }
+        }
+        for (const auto& entry : fs::directory_iterator(at("/var/lib/tavrixservicesd"))) {
+            struct stat info {};
+            ASSERT_EQ(::lstat(entry.path().c_str(), &info), 0);
+            EXPECT_TRUE(S_ISREG(info.st_mode)) << entry.path();
+            EXPECT_EQ(info.st_uid, daemon_.first) << entry.path();
+        }
+    }
+
+    void expectPreferencesOfTheClient() {
+        struct stat info {};
+        ASSERT_EQ(::lstat(at(kDaemonPreferences).c_str(), &info), 0);
+        EXPECT_TRUE(S_ISREG(info.st_mode));
+        EXPECT_TRUE(info.st_uid == daemon_.first || info.st_uid == 0);
+        EXPECT_EQ(device().daemonPreference("TavrixID"), std::optional<plist::Value>(kBehaviorID));
+        auto next = device().daemonPreference("NextUpdate");
+        ASSERT_TRUE(next && next->asDate());
+        EXPECT_LT(next->asDate()->secondsSinceReferenceDate, 2'000'000'000.0);
+    }
+
+    std::pair<uid_t, gid_t> daemon_;
+    std::pair<uid_t, gid_t> mobile_;
+    test::LocalHttpServer server_;
+};
+
+TEST_P(MobileHomeAttackTest, TheDaemonInstallsAndTrustsOnlyItsOwn) {
+    CommandResult first = runCommand(attackCommand(false));
+    (void)first;  // each attack is expected to fail in part
+    RepeatedAttack repeated(attackCommand(true));
+
+    setIDWithBundle("11");
+    setIDWithBundle("12");
+    const std::string payloadVersion = GetParam().blocksPayloads ? "10" : "12";
+    expectLinked(payloadVersion);
+    if (GetParam().blocksPayloads) {
+        const plist::Value status(client().status());
+        const plist::Value* payload = status.find("LastPayload");
+        ASSERT_TRUE(payload != nullptr && payload->find("Reason") != nullptr);
+        EXPECT_THAT(*payload->find("Reason")->asString(), HasSubstr("could not be staged"));
+    }
+
+    relaunch();
+    expectLinked(payloadVersion);
+
+    enableSupport();
+    publishSignedUpdate();
+    client().checkForTavrixBundleUpdate();
+    EXPECT_TRUE(pollUntil([&] { return linkedVersion() == "13"; }, 30s));
+    expectLinked("13");
+    expectPreferencesOfTheClient();
+    expectNothingWrittenForTheAttacker();
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Attacks, MobileHomeAttackTest,
+    ::testing::Values(
+        // Swap the bundle directory for one of the attacker's, or add one beside it.
+        Attack{"BundleSwap",
+               "cd \"$H/Library\"; mv TavrixBundles x; mkdir -p TavrixBundles/Default.bundle; "
+               "cp -r \"$EVIL/Default.bundle/.\" TavrixBundles/Default.bundle/; "
+               "cp -r \"$EVIL/Default.bundle\" TavrixBundles/; "
+               "ln -sfn \"$STATE\" TavrixBundles/Overlay"},
+        // Replace, edit or link the daemon's preferences (before the first write too).
+        Attack{"PreferencesEdit",
+               "cd \"$H/Library/Preferences\"; cp \"$EVIL/preferences.plist\" mine.plist; "
+               "mv -f mine.plist com.zandor.tavrixservices.plist; "
+               "cp \"$EVIL/preferences.plist\" com.zandor.tavrixservices.plist; "
+               "ln -sn \"$STATE/pending-install.plist\" com.zandor.tavrixservices.plist"},
+        // Plant links where the writers put their temporary files and their lock.
+        Attack{"WriterRace",
+               "for d in \"$H/Library\" \"$H/Library/Preferences\"; do for n in a b c; do "
+               "ln -sfn \"$STATE/pending-install.plist\" \"$d/.tavrix-write-$n\"; done; done; "
+               "ln -sfn \"$STATE/x\" "
+               "\"$H/Library/Preferences/.com.zandor.tavrixservices.plist.lock\"; "
+               "ln -sfn \"$STATE\" \"$H/Library/.tavrix-link-Tavrix.bundle\""},
+        // Take the link names before the daemon, pointing them at the attacker's bundle.
+        Attack{"LinkSquat",
+               "ln -sn \"$EVIL/Default.bundle\" \"$H/Library/Tavrix.bundle\"; "
+               "ln -sn \"$EVIL/Default.bundle/behavior.plist\" "
+               "\"$H/Library/Preferences/com.zandor.tavrix.plist\""},
+        // Plant an archive, or a link, at the payload's fixed staging path.
+        Attack{"StagingFile", "cp \"$EVIL/payload.tgz\" \"$T/behaviorbundle_zipped.tgz\"", true},
+        Attack{"StagingLink", "ln -sn \"$STATE/PWNED-link\" \"$T/behaviorbundle_zipped.tgz\"",
+               true}),
+    [](const ::testing::TestParamInfo<Attack>& info) { return std::string(info.param.name); });
+
+}  // namespace
+}  // namespace tavrix::integration
