@@ -1,7 +1,5 @@
 #include "bundle/UserBundleReplacement.h"
 
-#include <stdio.h>
-
 #include <cerrno>
 #include <cstring>
 
@@ -48,9 +46,9 @@ bool replaceUserBundle(const UserBundleFill& fill, IncompleteBundle incomplete,
         *whyNot = std::string("the old bundle could not be removed: ") + std::strerror(removed);
         return false;
     }
-    if (::renameat(bundles->fd(), io::lastPathComponent(staging).c_str(), bundles->fd(),
-                   io::lastPathComponent(bundle).c_str()) != 0) {
-        const int error = errno;
+    if (int error =
+            bundles->renameEntry(io::lastPathComponent(staging), io::lastPathComponent(bundle));
+        error != 0) {
         logCFormat("Could not move the extracted bundle into %s (error %d)\n", bundle.c_str(),
                    error);
         removeItemTree(staging);

@@ -269,4 +269,15 @@ int Directory::removeEntry(std::string_view name) const {
     return ::unlinkat(fd_.get(), entry.c_str(), AT_REMOVEDIR) == 0 ? 0 : errno;
 }
 
+int Directory::renameEntry(std::string_view from, std::string_view to) const {
+    if (!isValidName(from) || !isValidName(to)) {
+        return EINVAL;
+    }
+    if (::renameat(fd_.get(), std::string(from).c_str(), fd_.get(), std::string(to).c_str()) != 0) {
+        return errno;
+    }
+    ::fsync(fd_.get());
+    return 0;
+}
+
 }  // namespace tavrix::io

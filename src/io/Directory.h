@@ -66,6 +66,9 @@ class Directory {
     // Removes name: a file or link, or an empty directory. 0 or an errno.
     int removeEntry(std::string_view name) const;
 
+    // Renames from over to, both in this directory, and flushes it. 0 or an errno.
+    int renameEntry(std::string_view from, std::string_view to) const;
+
   private:
     Directory(UniqueFd fd, std::string path, const struct stat& status);
 
