@@ -234,8 +234,17 @@ class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInter
         }
     }
 
+    // The daemon's preferences hold nothing of the attacker's: no support it did not get from the
+    // device's configuration, no update date of its choosing.
+    void expectNoPreferenceOfTheAttacker() {
+        EXPECT_EQ(device().daemonPreference("EnableSupport"), std::nullopt);
+        auto next = device().daemonPreference("NextUpdate");
+        EXPECT_TRUE(!next || (next->asDate() &&
+                              next->asDate()->secondsSinceReferenceDate < 2'000'000'000.0));
+    }
+
     // Nothing the daemon owns carries the attacker's marks, and its state directory holds only
-    // its own regular files.
+    // its own regular files, none of them its preferences written through a link.
     void expectNothingWrittenForTheAttacker() {
         for (const auto& entry : fs::recursive_directory_iterator(device().root())) {
             struct stat info {};
@@ -249,6 +258,8 @@ class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInter
             ASSERT_EQ(::lstat(entry.path().c_str(), &info), 0);
             EXPECT_TRUE(S_ISREG(info.st_mode)) << entry.path();
             EXPECT_EQ(info.st_uid, daemon_.first) << entry.path();
+            auto stored = plist::readFile(entry.path().string());
+            EXPECT_FALSE(stored && stored->find("TavrixID") != nullptr) << entry.path();
         }
     }
 
@@ -277,6 +288,7 @@ TEST_P(MobileHomeAttackTest, TheDaemonInstallsAndTrustsOnlyItsOwn) {
     setIDWithBundle("12");
     const std::string payloadVersion = GetParam().blocksPayloads ? "10" : "12";
     expectLinked(payloadVersion);
+    expectNoPreferenceOfTheAttacker();
     if (GetParam().blocksPayloads) {
         const plist::Value status(client().status());
         const plist::Value* payload = status.find("LastPayload");
@@ -311,6 +323,10 @@ INSTANTIATE_TEST_SUITE_P(
                "mv -f mine.plist com.zandor.tavrixservices.plist; "
                "cp \"$EVIL/preferences.plist\" com.zandor.tavrixservices.plist; "
                "ln -sn \"$STATE/pending-install.plist\" com.zandor.tavrixservices.plist"},
+        // Link the daemon's preferences into its state directory before they are first written.
+        Attack{"PreferencesLink",
+               "ln -sn \"$STATE/PWNED.plist\" "
+               "\"$H/Library/Preferences/com.zandor.tavrixservices.plist\""},
         // Plant links where the writers put their temporary files and their lock.
         Attack{"WriterRace",
                "for d in \"$H/Library\" \"$H/Library/Preferences\"; do for n in a b c; do "
