@@ -192,8 +192,8 @@ std::optional<std::vector<std::shared_ptr<Asset>>> AssetQuery::runQuery() const 
         logCFormat("Asset catalog: refusing the catalog %s: %s", settings->catalogURL.c_str(),
                    refusal.what().c_str());
         const bool fetchFailed = refusal.kind() == CatalogRefusalKind::FetchFailed;
-        lastResult_ = {fetchFailed ? QueryOutcome::FetchFailed : QueryOutcome::Refused,
-                       refusal.what(), {}};
+        lastResult_ = {
+            fetchFailed ? QueryOutcome::FetchFailed : QueryOutcome::Refused, refusal.what(), {}};
         return std::nullopt;
     }
     lastResult_ = {QueryOutcome::Answered, {}, {}};
