@@ -601,6 +601,7 @@ TEST_F(ReleaseTrainTest, TheDocumentedReleaseTrainRunsAgainstADevice) {
     EXPECT_EQ(textAt(check, "outcome"), "held-back");
     EXPECT_EQ(textAt(check, "reason"),
               "held back by a staged rollout (5 %): version 2 is not offered to this device yet");
+    EXPECT_EQ(textAt(tavrixctlJson({"status"}), "LastCheck.Outcome"), "held-back");
 
     const test::Tree archives = test::snapshotTree(site() / "archives");
     runStep("widen");
@@ -666,6 +667,12 @@ TEST_F(ReleaseTrainTest, TheDocumentedReleaseTrainRunsAgainstADevice) {
     trustKeys({{"release-2027", base / "release-2027.pub"}});
     check = tavrixctlJson({"check-update"});
     EXPECT_EQ(textAt(check, "reason"), "up to date (version 2 installed)");
+    // The old key is revoked with its removal.
+    writeText(site() / "catalog.plist.sig", refreshedSignature);
+    writeText(site() / "catalog.plist", refreshed);
+    check = tavrixctlJson({"check-update"}, 1);
+    EXPECT_TRUE(textAt(check, "reason").starts_with("catalog refused: unknown key: "))
+        << textAt(check, "reason");
     EXPECT_EQ(linkedVersion(), "2");
 }
 
