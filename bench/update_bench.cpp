@@ -230,7 +230,11 @@ void benchUpdate(const fs::path& work) {
         writeBundle(bundle, version, resource);
         mustRun({TAVRIX_CATALOG_TOOL, "publish", site.string(), "--key",
                  (work / "keys/secret").string(), "--fresh", bundle.string()});
-        const std::string archive = "/archives/Default-" + std::to_string(version) + ".tgz";
+        // The only asset of a fresh catalog; its archive is named after its digest.
+        const std::optional<plist::Value> catalog =
+            plist::readFile((site / "catalog.plist").string());
+        const std::string archive =
+            "/" + *catalog->find("Assets")->asArray()->front().find("ArchiveURL")->asString();
         archiveBytes = fs::file_size(site / archive.substr(1));
 
         const int before = announced;

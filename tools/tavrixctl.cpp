@@ -368,7 +368,7 @@ constexpr const char* kAccessDenied = "org.freedesktop.DBus.Error.AccessDenied";
 
 // The outcomes of a check that count as success.
 bool checkSucceeded(const std::string& outcome, bool waited) {
-    return outcome == "up-to-date" || outcome == "installed" ||
+    return outcome == "up-to-date" || outcome == "held-back" || outcome == "installed" ||
            (!waited && outcome == "downloading");
 }
 

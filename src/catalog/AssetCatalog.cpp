@@ -182,7 +182,7 @@ std::optional<std::vector<std::shared_ptr<Asset>>> AssetQuery::runQuery() const 
     std::optional<AssetTypeSettings> settings =
         AssetCatalogService::shared().settingsFor(assetType_);
     if (!settings) {
-        lastResult_ = {QueryOutcome::NoCatalogConfigured, "no catalog configured"};
+        lastResult_ = {QueryOutcome::NoCatalogConfigured, "no catalog configured", {}};
         return assets;
     }
     CatalogRefusal refusal;
@@ -192,11 +192,11 @@ std::optional<std::vector<std::shared_ptr<Asset>>> AssetQuery::runQuery() const 
         logCFormat("Asset catalog: refusing the catalog %s: %s", settings->catalogURL.c_str(),
                    refusal.what().c_str());
         const bool fetchFailed = refusal.kind() == CatalogRefusalKind::FetchFailed;
-        lastResult_ = {fetchFailed ? QueryOutcome::FetchFailed : QueryOutcome::Refused,
-                       refusal.what()};
+        lastResult_ = {
+            fetchFailed ? QueryOutcome::FetchFailed : QueryOutcome::Refused, refusal.what(), {}};
         return std::nullopt;
     }
-    lastResult_ = {QueryOutcome::Answered, {}};
+    lastResult_ = {QueryOutcome::Answered, {}, {}};
     std::string heldBack;
     std::string serialNumber;
     bool serialNumberRead = false;
@@ -215,6 +215,7 @@ std::optional<std::vector<std::shared_ptr<Asset>>> AssetQuery::runQuery() const 
             if (!takesPartInRollout(serialNumber, versionText, entry.rolloutPercent)) {
                 heldBack += (heldBack.empty() ? "" : ", ") + versionText + " (" +
                             std::to_string(entry.rolloutPercent) + "%)";
+                lastResult_.heldBack.push_back({std::move(entry.attributes), entry.rolloutPercent});
                 continue;
             }
         }

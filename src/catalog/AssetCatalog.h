@@ -95,10 +95,18 @@ class Asset : public std::enable_shared_from_this<Asset> {
 // How the last runQuery() went, for a caller that tells "nothing newer" from "could not ask".
 enum class QueryOutcome { NotRun, Answered, NoCatalogConfigured, FetchFailed, Refused };
 
+// An asset the catalog lists that a staged rollout keeps from this device for now.
+struct HeldBackAsset {
+    plist::Dictionary attributes;
+    int rolloutPercent = 0;
+};
+
 struct QueryResult {
     QueryOutcome outcome = QueryOutcome::NotRun;
     // One line: why the catalog gave no assets (empty when it answered).
     std::string reason;
+    // What the answer left out for the rollout, so a check can tell "held back" from "current".
+    std::vector<HeldBackAsset> heldBack;
 };
 
 // A query for the assets of one type. Without settings for the type it answers no assets and logs

@@ -11,6 +11,8 @@ namespace tavrix {
 
 // The outcome words of an update check; the reason says the rest in words.
 inline constexpr const char* kCheckUpToDate = "up-to-date";
+// Nothing newer yet: a newer version is in a staged rollout that leaves this device out so far.
+inline constexpr const char* kCheckHeldBack = "held-back";
 inline constexpr const char* kCheckInstalled = "installed";
 inline constexpr const char* kCheckDownloading = "downloading";
 inline constexpr const char* kCheckNoCatalog = "no-catalog";

@@ -48,25 +48,32 @@ bool listsProductType(const plist::Value& supported, const std::optional<std::st
 }
 
 // Whether the asset fits this device: its OS version within the bounds (inclusive) and its
-// product type listed, when the asset says so. Logs why not.
+// product type listed, when the asset says so. Logs why not, unless quiet.
 bool fitsThisDevice(const plist::Dictionary& attributes, const plist::Value& productVersion,
-                    const std::optional<std::string>& productType) {
+                    const std::optional<std::string>& productType, bool quiet = false) {
     const std::string current = versionText(productVersion);
     if (auto minimum = attributes.find(kAssetAttributeMinimumOSVersion);
         minimum != attributes.end() &&
         compareVersionStrings(versionText(minimum->second), current) == 1) {
-        logObjectFormat("Current product version %@ is lower than min %@", &productVersion,
-                        &minimum->second);
+        if (!quiet) {
+            logObjectFormat("Current product version %@ is lower than min %@", &productVersion,
+                            &minimum->second);
+        }
         return false;
     }
     if (auto maximum = attributes.find(kAssetAttributeMaximumOSVersion);
         maximum != attributes.end() &&
         compareVersionStrings(versionText(maximum->second), current) == -1) {
-        logObjectFormat("Current product version %@ is higher than max %@", &productVersion,
-                        &maximum->second);
+        if (!quiet) {
+            logObjectFormat("Current product version %@ is higher than max %@", &productVersion,
+                            &maximum->second);
+        }
         return false;
     }
     auto supported = attributes.find(kAssetAttributeSupportedProductTypes);
+    if (quiet) {
+        return supported == attributes.end() || listsProductType(supported->second, productType);
+    }
     if (supported == attributes.end()) {
         logCFormat(
             "Supported device classes attribute is not present, assuming all are supported\n");
@@ -82,6 +89,26 @@ bool fitsThisDevice(const plist::Dictionary& attributes, const plist::Value& pro
 std::string assetVersionText(const catalog::Asset& asset) {
     auto version = asset.attributes().find(kAssetAttributeVersion);
     return version != asset.attributes().end() ? versionText(version->second) : "(unknown)";
+}
+
+// The highest version above the installed one that fits this device and that the rollout kept
+// from it, or null.
+const catalog::HeldBackAsset* newestHeldBack(const catalog::QueryResult& query,
+                                             const std::optional<std::string>& installed) {
+    const catalog::HeldBackAsset* newest = nullptr;
+    std::string newestVersion = installed.value_or("0.0");
+    const plist::Value productVersion(TXUtility::currentProductVersion().value_or(""));
+    for (const catalog::HeldBackAsset& held : query.heldBack) {
+        auto version = held.attributes.find(kAssetAttributeVersion);
+        if (version != held.attributes.end() &&
+            compareVersionStrings(versionText(version->second), newestVersion) == 1 &&
+            fitsThisDevice(held.attributes, productVersion, TXUtility::currentProductType(),
+                           true)) {
+            newest = &held;
+            newestVersion = versionText(version->second);
+        }
+    }
+    return newest;
 }
 
 // Why a check found nothing to download, in the words the status view shows.
@@ -101,6 +128,14 @@ void recordQueryWithoutCandidate(const catalog::QueryResult& query) {
             break;
     }
     std::optional<std::string> installed = BundleManager::sharedInstance().copyBundleVersion();
+    if (const catalog::HeldBackAsset* held = newestHeldBack(query, installed)) {
+        recordUpdateCheck(kCheckHeldBack,
+                          "held back by a staged rollout (" + std::to_string(held->rolloutPercent) +
+                              " %): version " +
+                              versionText(held->attributes.at(kAssetAttributeVersion)) +
+                              " is not offered to this device yet");
+        return;
+    }
     recordUpdateCheck(kCheckUpToDate, installed
                                           ? "up to date (version " + *installed + " installed)"
                                           : "up to date (no newer bundle for this device)");

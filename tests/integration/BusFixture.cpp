@@ -30,7 +30,13 @@ DeviceRoot::DeviceRoot() {
     setCellularRadio(false);
 }
 
+void DeviceRoot::setSerialNumber(const std::string& serialNumber) {
+    serialNumber_ = serialNumber;
+    setCellularRadio(cellularRadio_);
+}
+
 void DeviceRoot::setCellularRadio(bool present) {
+    cellularRadio_ = present;
     // Everything the device information service is asked for, so that no answer comes from the
     // machine running the tests.
     writePropertyList("/etc/tavrix/DeviceInfo.plist", {
@@ -42,7 +48,7 @@ void DeviceRoot::setCellularRadio(bool present) {
                                                           {"BuildVersion", "13B100"},
                                                           {"ReleaseType", "User"},
                                                           {"HWModelStr", "T71AP"},
-                                                          {"SerialNumber", "TESTSERIAL01"},
+                                                          {"SerialNumber", serialNumber_},
                                                       });
 }
 

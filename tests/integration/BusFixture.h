@@ -76,6 +76,7 @@ class DeviceRoot {
     }
 
     void setCellularRadio(bool present);
+    void setSerialNumber(const std::string& serialNumber);
     // The daemon's own preferences and the behavior settings domain of the mobile user.
     void writeDaemonPreferences(const plist::Dictionary& values) {
         writePropertyList(kDaemonPreferences, values);
@@ -100,6 +101,8 @@ class DeviceRoot {
     void writePropertyList(std::string_view absolutePath, const plist::Dictionary& values);
 
     test::TempDir base_;
+    bool cellularRadio_ = false;
+    std::string serialNumber_ = "TESTSERIAL01";
 };
 
 // The test's own connection: who owns the daemon's name and which notifications were posted.

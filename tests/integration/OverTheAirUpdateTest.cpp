@@ -96,7 +96,36 @@ class OverTheAirUpdateTest : public BusFixture {
             runCommand({TAVRIX_CATALOG_TOOL, "publish", site().string(), "--key",
                         secretKey().string(), "--fresh", writeBundle(version, bulkBytes).string()});
         EXPECT_EQ(run.status, 0) << run.output;
-        return "/updates/archives/Default-" + version + ".tgz";
+        return "/updates/" + archiveListedFor(version);
+    }
+
+    // The archive URL the published catalog lists for this version, relative to the site.
+    std::string archiveListedFor(const std::string& version) {
+        std::optional<plist::Value> catalog = plist::readFile((site() / "catalog.plist").string());
+        const plist::Value* assets = catalog ? catalog->find("Assets") : nullptr;
+        for (const plist::Value& asset : assets ? *assets->asArray() : plist::Array()) {
+            if (*asset.find("Attributes")->find("Version") == plist::Value(version)) {
+                return *asset.find("ArchiveURL")->asString();
+            }
+        }
+        return "(not listed)";
+    }
+
+    // The device trusts these keys (identifier to the public key file keygen wrote).
+    void trustKeys(const std::map<std::string, fs::path>& keys) {
+        plist::Dictionary trusted;
+        for (const auto& [identifier, file] : keys) {
+            std::string publicKey = readText(file);
+            publicKey.pop_back();  // the line break
+            trusted.emplace(identifier, publicKey);
+        }
+        plist::Dictionary type{{"CatalogURL", server.url("/updates/catalog.plist")},
+                               {"TrustedKeys", std::move(trusted)}};
+        ASSERT_TRUE(plist::writeFile(
+            at("/etc/tavrix/AssetCatalog.plist").string(),
+            plist::Value(plist::Dictionary{
+                {"AssetTypes",
+                 plist::Dictionary{{"com.zandor.Grellas.TavrixBundles", std::move(type)}}}})));
     }
 
     fs::path published(const std::string& urlPath) {
@@ -489,6 +518,162 @@ TEST_F(OverTheAirKeepAliveTest, ScheduledCheckKeepsTheDaemonUntilTheDownloadIsIn
     // Start-up also found "NextUpdate" past and re-armed the job; the check still ran once.
     EXPECT_EQ(countLogLines("*********** Beginning Corvex transaction : Update Check ***********"),
               1);
+}
+
+// The release train of docs/asset-catalog.md, run block by block as the document gives them, in
+// the operator's directory, against one device (bucket 37 for version 2 under the doc's serial):
+// held back at 5 %, installed once widened (without repacking); a refreshed catalog accepted and
+// the one it replaced refused; a device that fetched the catalog naming the next version just
+// before its withdrawal still installs it whole, while one asking afterwards never sees it; the
+// key rotated through a staged catalog and an external signer.
+class ReleaseTrainTest : public OverTheAirUpdateTest {
+  protected:
+    // The "# step:" blocks of the document's release train, by name, in order.
+    static std::vector<std::pair<std::string, std::string>> documentedSteps() {
+        const std::string doc = readText(TAVRIX_ASSET_CATALOG_DOC);
+        const std::size_t start = doc.find("\n## A release train");
+        const std::size_t end = doc.find("\n## ", start + 1);
+        std::istringstream section(doc.substr(start, end - start));
+        std::vector<std::pair<std::string, std::string>> steps;
+        bool inBlock = false;
+        for (std::string line; std::getline(section, line);) {
+            if (line.starts_with("```")) {
+                inBlock = line == "```sh";
+            } else if (inBlock && line.starts_with("# step: ")) {
+                steps.emplace_back(line.substr(8), "");
+            } else if (inBlock && !steps.empty()) {
+                steps.back().second += line + "\n";
+            }
+        }
+        return steps;
+    }
+
+    // Runs the step's block with sh -e where the operator works; its output.
+    std::string runStep(const std::string& name) {
+        for (const auto& [step, block] : steps_) {
+            if (step == name) {
+                const std::string tools = fs::path(TAVRIX_CATALOG_TOOL).parent_path().string();
+                CommandResult run =
+                    runCommand({"/bin/sh", "-e", "-c", "cd \"$0\" && PATH=\"$1:$PATH\" && " + block,
+                                device().base().string(), tools});
+                EXPECT_EQ(run.status, 0) << name << ":\n" << block << run.output;
+                return run.output;
+            }
+        }
+        ADD_FAILURE() << "the release train has no step " << name;
+        return "";
+    }
+
+    std::vector<std::pair<std::string, std::string>> steps_ = documentedSteps();
+};
+
+TEST_F(ReleaseTrainTest, TheDocumentedReleaseTrainRunsAgainstADevice) {
+    std::vector<std::string> names;
+    for (const auto& step : steps_) {
+        names.push_back(step.first);
+    }
+    ASSERT_EQ(names,
+              (std::vector<std::string>{"keygen", "publish", "bucket", "widen", "refresh",
+                                        "publish-next", "withdraw", "rotate-keygen", "rotate"}));
+    const fs::path base = device().base();
+    setIDWithBundle("1");
+    ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
+    writeBundle("2");
+    writeBundle("3");
+
+    runStep("keygen");
+    trustKeys({{"release-2026", base / "release-2026.pub"}});
+    runStep("publish");
+    // The device of the bucket step, whose bucket the documented formula gives.
+    const std::string bucketBlock = steps_[2].second;
+    const std::string serialNumber =
+        bucketBlock.substr(bucketBlock.find("bucket ") + 7,
+                           bucketBlock.find(" 2\n") - bucketBlock.find("bucket ") - 7);
+    device().setSerialNumber(serialNumber);
+    CommandResult formula = runCommand(
+        {"/usr/bin/python3", "-c",
+         "import hashlib, sys; d = hashlib.sha256((sys.argv[1] + '\\n2').encode()).digest(); "
+         "print(int.from_bytes(d[:8], 'big') % 100)",
+         serialNumber});
+    EXPECT_EQ(runStep("bucket"), formula.output);
+    EXPECT_EQ(formula.output, "37\n") << "the train needs a device between 5 and 50 %";
+    auto check = tavrixctlJson({"check-update"});
+    EXPECT_EQ(textAt(check, "outcome"), "held-back");
+    EXPECT_EQ(textAt(check, "reason"),
+              "held back by a staged rollout (5 %): version 2 is not offered to this device yet");
+    EXPECT_EQ(textAt(tavrixctlJson({"status"}), "LastCheck.Outcome"), "held-back");
+
+    const test::Tree archives = test::snapshotTree(site() / "archives");
+    runStep("widen");
+    EXPECT_EQ(test::snapshotTree(site() / "archives"), archives) << "nothing was packed again";
+    check = tavrixctlJson({"check-update", "--wait", "30"});
+    EXPECT_EQ(textAt(check, "reason"), "installed version 2");
+    ASSERT_TRUE(watcher().waitForNotification(kChanged, 2, 30s));
+    expectInstalled("2");
+
+    const std::string widened = readText(site() / "catalog.plist");
+    const std::string widenedSignature = readText(site() / "catalog.plist.sig");
+    EXPECT_NE(runStep("refresh").find("catalog is good"), std::string::npos);
+    check = tavrixctlJson({"check-update"});
+    EXPECT_EQ(textAt(check, "reason"), "up to date (version 2 installed)");
+    const std::string refreshed = readText(site() / "catalog.plist");
+    const std::string refreshedSignature = readText(site() / "catalog.plist.sig");
+    writeText(site() / "catalog.plist.sig", widenedSignature);
+    writeText(site() / "catalog.plist", widened);
+    check = tavrixctlJson({"check-update"}, 1);
+    EXPECT_TRUE(textAt(check, "reason").starts_with("catalog refused: rollback: "))
+        << textAt(check, "reason");
+    writeText(site() / "catalog.plist.sig", refreshedSignature);
+    writeText(site() / "catalog.plist", refreshed);
+
+    // This device fetches the catalog naming version 3 just before it is withdrawn.
+    runStep("publish-next");
+    const std::string archive3 = archiveListedFor("3");
+    test::LocalHttpServer::Response heldCatalog;
+    heldCatalog.body = readText(site() / "catalog.plist");
+    heldCatalog.holdAfterBodyBytes = heldCatalog.body.size() / 2;
+    test::LocalHttpServer::Response signature;
+    signature.body = readText(site() / "catalog.plist.sig");
+    server.serve("/updates/catalog.plist", heldCatalog);
+    server.serve("/updates/catalog.plist.sig", signature);
+    auto answer =
+        std::async(std::launch::async, [this] { return client().checkForTavrixBundleUpdate(); });
+    ASSERT_TRUE(server.waitForHeldResponse(30s));
+    runStep("withdraw");
+    server.releaseHeldResponses();
+    EXPECT_TRUE(answer.get());
+    server.stopServing("/updates/catalog.plist");
+    server.stopServing("/updates/catalog.plist.sig");
+    ASSERT_TRUE(watcher().waitForNotification(kChanged, 3, 30s));
+    expectInstalled("3");
+    // A device still on version 2 asks after the withdrawal and never sees version 3.
+    // (The payload keeps the bundle's path, so the running daemon keeps its linked version; a
+    // fresh one reads version 2 from the link.)
+    setIDWithBundle("2");
+    ASSERT_EQ(linkedVersion(), "2");
+    const auto pid = daemonPid();
+    ASSERT_TRUE(pid);
+    ::kill(*pid, SIGTERM);
+    ASSERT_EQ(waitForDaemonExit(*pid, 90s), std::optional<int>(0));
+    check = tavrixctlJson({"check-update"});
+    EXPECT_EQ(textAt(check, "reason"), "up to date (version 2 installed)");
+    EXPECT_TRUE(fs::exists(site() / archive3)) << "the previous catalog still names it";
+
+    runStep("rotate-keygen");
+    trustKeys(
+        {{"release-2026", base / "release-2026.pub"}, {"release-2027", base / "release-2027.pub"}});
+    runStep("rotate");
+    EXPECT_FALSE(fs::exists(site() / archive3)) << "no catalog being served names it any more";
+    trustKeys({{"release-2027", base / "release-2027.pub"}});
+    check = tavrixctlJson({"check-update"});
+    EXPECT_EQ(textAt(check, "reason"), "up to date (version 2 installed)");
+    // The old key is revoked with its removal.
+    writeText(site() / "catalog.plist.sig", refreshedSignature);
+    writeText(site() / "catalog.plist", refreshed);
+    check = tavrixctlJson({"check-update"}, 1);
+    EXPECT_TRUE(textAt(check, "reason").starts_with("catalog refused: unknown key: "))
+        << textAt(check, "reason");
+    EXPECT_EQ(linkedVersion(), "2");
 }
 
 }  // namespace

@@ -124,6 +124,11 @@ void LocalHttpServer::serve(const std::string& path, Response response) {
     responses_.insert_or_assign(path, std::move(response));
 }
 
+void LocalHttpServer::stopServing(const std::string& path) {
+    std::lock_guard lock(mutex_);
+    responses_.erase(path);
+}
+
 void LocalHttpServer::serveDirectory(const std::string& urlPrefix,
                                      const std::filesystem::path& directory) {
     std::lock_guard lock(mutex_);

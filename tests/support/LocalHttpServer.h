@@ -63,6 +63,8 @@ class LocalHttpServer {
 
     // Answers requests for exactly this path (query included) with response.
     void serve(const std::string& path, Response response);
+    // Answers requests for this path as before serve() was called for it.
+    void stopServing(const std::string& path);
     // Answers requests for urlPrefix + name with the file directory/name (200, or 404 when it
     // cannot be read; names holding ".." are refused).
     void serveDirectory(const std::string& urlPrefix, const std::filesystem::path& directory);

@@ -15,6 +15,7 @@ struct ToolRun {
     // The exit status (128 + the signal's number when the tool was killed).
     int status = -1;
     std::string errors;
+    std::string output;
 };
 
 inline ToolRun runTool(const char* tool, const std::vector<std::string>& arguments) {
@@ -31,8 +32,10 @@ inline ToolRun runTool(const char* tool, const std::vector<std::string>& argumen
     for (const std::string& argument : arguments) {
         command += " " + quoted(argument);
     }
-    const int wait = std::system((command + " >/dev/null 2>" + quoted(outputs / "stderr")).c_str());
-    return {wait != -1 && WIFEXITED(wait) ? WEXITSTATUS(wait) : -1, readText(outputs / "stderr")};
+    const int wait = std::system(
+        (command + " >" + quoted(outputs / "stdout") + " 2>" + quoted(outputs / "stderr")).c_str());
+    return {wait != -1 && WIFEXITED(wait) ? WEXITSTATUS(wait) : -1, readText(outputs / "stderr"),
+            readText(outputs / "stdout")};
 }
 
 inline ToolRun runCatalogTool(const std::vector<std::string>& arguments) {

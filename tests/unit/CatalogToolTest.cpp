@@ -48,6 +48,18 @@ class CatalogToolTest : public testing::Test {
         return runCatalogTool(arguments);
     }
 
+    // The archive the catalog lists for version, relative to the output directory.
+    std::string archiveOf(const std::string& version) {
+        std::optional<plist::Value> catalog = plist::readFile(work / "out/catalog.plist");
+        const plist::Value* assets = catalog ? catalog->find("Assets") : nullptr;
+        for (const plist::Value& asset : assets ? *assets->asArray() : plist::Array()) {
+            if (*asset.find("Attributes")->find("Version")->asString() == version) {
+                return *asset.find("ArchiveURL")->asString();
+            }
+        }
+        return "(none)";
+    }
+
     std::int64_t serial() {
         std::optional<plist::Value> catalog = plist::readFile(work / "out/catalog.plist");
         const plist::Value* value = catalog ? catalog->find("Serial") : nullptr;
@@ -57,43 +69,17 @@ class CatalogToolTest : public testing::Test {
     TempDir work;
 };
 
-TEST_F(CatalogToolTest, PublishingAddsReplacesAndStartsFreshWithAValidSignatureEachTime) {
-    struct stat info {};
-    ASSERT_EQ(::stat((work / "secret.key").c_str(), &info), 0);
-    EXPECT_EQ(info.st_mode & 0777, 0600u);
-
+// A version published again with other files gets an archive of its own, and the bytes under the
+// old name stay as the previous catalog lists them until no catalog being served names them. The
+// same files make the same archive whenever and wherever they are packed.
+TEST_F(CatalogToolTest, PublishedArchivesNeverChangeAndGoOnlyWhenNoServedCatalogListsThem) {
     ASSERT_EQ(publish({"--key", work / "secret.key", work / "a/Default.bundle"}), 0);
     ASSERT_EQ(publish({"--key", work / "secret.key", work / "b/Default.bundle"}), 0);
     EXPECT_EQ(listedVersions(), (std::vector<std::string>{"1.0", "2.0"}));
-    EXPECT_EQ(verify().status, 0);
     EXPECT_EQ(serial(), 2);
+    const std::string first = archiveOf("2.0");
+    const std::string firstBytes = readText(work / ("out/" + first));
 
-    // The same archive name replaces its entry in place.
-    ASSERT_EQ(publish({"--key", work / "secret.key", work / "b/Default.bundle", "--product-type",
-                       "Handset9,1"}),
-              0);
-    std::optional<plist::Value> catalog = plist::readFile(work / "out/catalog.plist");
-    ASSERT_TRUE(catalog);
-    const plist::Value& replaced = catalog->find("Assets")->asArray()->at(1);
-    EXPECT_EQ(*replaced.find("Attributes")->find("SupportedProductTypes"),
-              plist::Value(plist::Array{plist::Value("Handset9,1")}));
-    EXPECT_EQ(listedVersions().size(), 2u);
-    EXPECT_EQ(verify({"--min-serial", "3"}).status, 0);
-    EXPECT_EQ(verify({"--min-serial", "4"}).status, 1) << "a device holding serial 4";
-
-    // A fresh catalog still continues the serial: devices would refuse a lower one.
-    ASSERT_EQ(publish({"--unsigned", "--fresh", work / "a/Default.bundle", "--version", "1.0"}), 0);
-    EXPECT_EQ(listedVersions(), (std::vector<std::string>{"1.0"}));
-    EXPECT_EQ(serial(), 4);
-    EXPECT_FALSE(fs::exists(work / "out/catalog.plist.sig")) << "a stale signature is removed";
-    EXPECT_EQ(verify().status, 1) << "unsigned, with a key to check";
-}
-
-// The same files make the same archive whenever and wherever they are packed, and verify finds
-// an archive that no longer matches its listing.
-TEST_F(CatalogToolTest, ArchivesAreReproducibleAndVerifyFindsTamperedOnes) {
-    ASSERT_EQ(publish({"--key", work / "secret.key", work / "b/Default.bundle"}), 0);
-    std::string first = readText(work / "out/archives/Default-2.0.tgz");
     fs::copy(work / "b", work / "copy", fs::copy_options::recursive);
     fs::last_write_time(work / "copy/Default.bundle/sub/b.plist",
                         fs::file_time_type::clock::now() - std::chrono::hours(100));
@@ -101,20 +87,97 @@ TEST_F(CatalogToolTest, ArchivesAreReproducibleAndVerifyFindsTamperedOnes) {
         runCatalogTool({"publish", work / "other", "--unsigned", work / "copy/Default.bundle"})
             .status,
         0);
-    EXPECT_EQ(readText(work / "other/archives/Default-2.0.tgz"), first);
+    EXPECT_EQ(readText(work / ("other/" + first)), firstBytes) << "reproducible";
 
-    ToolRun good = verify();
-    EXPECT_EQ(good.status, 0) << good.errors;
-    std::string tampered = first;
-    tampered[tampered.size() / 2] ^= 0x20;
-    writeText(work / "out/archives/Default-2.0.tgz", tampered);
-    EXPECT_EQ(verify().status, 1);
-    writeText(work / "out/archives/Default-2.0.tgz", first + "x");
-    EXPECT_EQ(verify().status, 1);
+    writeText(work / "b/Default.bundle/sub/b.plist", "b, fixed");
+    ASSERT_EQ(publish({"--key", work / "secret.key", work / "b/Default.bundle", "--product-type",
+                       "Handset9,1"}),
+              0);
+    EXPECT_EQ(listedVersions(), (std::vector<std::string>{"1.0", "2.0"})) << "replaced in place";
+    EXPECT_NE(archiveOf("2.0"), first);
+    EXPECT_EQ(readText(work / ("out/" + first)), firstBytes) << "the previous catalog names it";
+    EXPECT_EQ(verify().status, 0);
+    ASSERT_EQ(runCatalogTool({"refresh", work / "out", "--key", work / "secret.key"}).status, 0);
+    EXPECT_FALSE(fs::exists(work / ("out/" + first)));
+    EXPECT_TRUE(fs::exists(work / ("out/" + archiveOf("2.0"))));
+    EXPECT_TRUE(fs::exists(work / ("out/" + archiveOf("1.0"))));
+
+    // A fresh catalog still continues the serial: devices would refuse a lower one.
+    ASSERT_EQ(publish({"--unsigned", "--fresh", work / "a/Default.bundle", "--version", "1.0"}), 0);
+    EXPECT_EQ(listedVersions(), (std::vector<std::string>{"1.0"}));
+    EXPECT_EQ(serial(), 5);
+    EXPECT_FALSE(fs::exists(work / "out/catalog.plist.sig")) << "a stale signature is removed";
 }
 
-TEST_F(CatalogToolTest, MistakesFailClearlyAndChangeNothing) {
-    ASSERT_EQ(publish({"--key", work / "secret.key", work / "a/Default.bundle"}), 0);
+// Scripts tell the verdicts apart by exit status; problems and warnings go to stderr, the report
+// (as JSON when asked) to stdout.
+TEST_F(CatalogToolTest, VerifyTellsGoodWarningAndBadApart) {
+    ASSERT_EQ(
+        publish({"--key", work / "secret.key", "--expires-in", "10", work / "b/Default.bundle"}),
+        0);
+    ToolRun good = verify({"--json"});
+    EXPECT_EQ(good.status, 0) << good.errors;
+    EXPECT_EQ(good.errors, "");
+    EXPECT_NE(good.output.find("\"verdict\": \"good\""), std::string::npos) << good.output;
+    ToolRun soon = verify({"--warn-days", "11"});
+    EXPECT_EQ(soon.status, 3);
+    EXPECT_TRUE(soon.errors.starts_with("tavrix-catalog: warning: expires within 11 days"))
+        << soon.errors;
+    EXPECT_EQ(verify({"--min-serial", "2"}).status, 1) << "a device holding serial 2";
+
+    std::string tampered = readText(work / ("out/" + archiveOf("2.0")));
+    tampered[tampered.size() / 2] ^= 0x20;
+    writeText(work / ("out/" + archiveOf("2.0")), tampered);
+    ToolRun bad = verify({"--json"});
+    EXPECT_EQ(bad.status, 1);
+    EXPECT_NE(bad.errors.find("tavrix-catalog: problem: archives/Default-2.0-"), std::string::npos)
+        << bad.errors;
+    EXPECT_NE(bad.output.find("\"verdict\": \"bad\""), std::string::npos) << bad.output;
+}
+
+// A staged catalog changes nothing devices see, holds off other changes, and goes live only with
+// a signature that verifies with the key it is meant for.
+TEST_F(CatalogToolTest, StagedCatalogsGoLiveOnlyWithAVerifiedSignature) {
+    ASSERT_EQ(publish({"--key", work / "secret.key", work / "a/Default.bundle", "--rollout", "5"}),
+              0);
+    const std::string served = readText(work / "out/catalog.plist");
+    ASSERT_EQ(runCatalogTool({"refresh", work / "out", "--stage", "--key-id", "next"}).status, 0);
+    EXPECT_EQ(readText(work / "out/catalog.plist"), served);
+    EXPECT_EQ(
+        runCatalogTool({"withdraw", work / "out", "1.0", "--key", work / "secret.key"}).status, 1);
+    ToolRun shown = runCatalogTool({"show", work / "out"});
+    EXPECT_NE(shown.output.find("version 1.0: rollout 5 %"), std::string::npos) << shown.output;
+    EXPECT_NE(shown.output.find("waiting for its signature"), std::string::npos) << shown.output;
+
+    ASSERT_EQ(runCatalogTool({"keygen", work / "other.key", work / "other.pub"}).status, 0);
+    const std::string otherSigner =
+        std::string(TAVRIX_CATALOG_TOOL) + " sign-stdin --key " + (work / "other.key");
+    for (const std::string& signer : {std::string("head -c 64 /dev/zero"), otherSigner,
+                                      std::string("cat >/dev/null; exit 4")}) {
+        SCOPED_TRACE(signer);
+        ToolRun run = runCatalogTool(
+            {"sign", work / "out", "--signer", signer, "--public-key", work / "public.key"});
+        EXPECT_EQ(run.status, 1);
+        EXPECT_EQ(readText(work / "out/catalog.plist"), served);
+    }
+    ASSERT_EQ(runCatalogTool({"sign", work / "out", "--key=" + (work / "secret.key")}).status, 0);
+    EXPECT_EQ(serial(), 2);
+    EXPECT_FALSE(fs::exists(work / "out/catalog.plist.unsigned"));
+    EXPECT_EQ(
+        runCatalogTool({"verify", work / "out", "--key", "next=" + (work / "public.key")}).status,
+        0);
+}
+
+// Options read the same as "--opt value", "--opt=value" and with operands after "--"; mistakes
+// are one usage line (2) or one failure line (1) and change nothing; keygen leaves no lone key.
+TEST_F(CatalogToolTest, OptionsParseAlikeAndMistakesChangeNothing) {
+    ASSERT_EQ(publish({"--serial", "50", "--key", work / "secret.key", work / "a/Default.bundle"}),
+              0);
+    EXPECT_EQ(serial(), 50);
+    ASSERT_EQ(
+        publish({"--serial=60", "--key=" + (work / "secret.key"), "--", work / "a/Default.bundle"}),
+        0);
+    EXPECT_EQ(serial(), 60);
     std::string catalog = readText(work / "out/catalog.plist");
     std::string secret = readText(work / "secret.key");
 
@@ -123,35 +186,37 @@ TEST_F(CatalogToolTest, MistakesFailClearlyAndChangeNothing) {
         std::vector<std::string> arguments;
         int status;
     };
+    const std::string out = work / "out";
+    const std::string bundle = work / "a/Default.bundle";
     std::vector<Case> cases{
         {"keygen over a secret key", {"keygen", work / "secret.key", work / "other.pub"}, 1},
+        {"keygen that cannot write the public key",
+         {"keygen", work / "lone.key", work / "nowhere/lone.pub"},
+         1},
         {"version other than the bundle's",
-         {"publish", work / "out", "--unsigned", work / "a/Default.bundle", "--version", "1.1"},
+         {"publish", out, "--unsigned", bundle, "--version", "1.1"},
          1},
-        {"public key given as secret",
-         {"publish", work / "out", "--key", work / "public.key", work / "a/Default.bundle"},
-         1},
-        {"catalog of another type",
-         {"publish", work / "out", "--unsigned", "--asset-type", "other",
-          work / "a/Default.bundle"},
-         1},
-        {"missing bundle", {"publish", work / "out", "--unsigned", work / "nowhere"}, 1},
-        {"neither key nor unsigned", {"publish", work / "out", work / "a/Default.bundle"}, 2},
-        {"option before its bundle",
-         {"publish", work / "out", "--unsigned", "--version", "1", work / "a/Default.bundle"},
-         2},
-        {"rollout over 100",
-         {"publish", work / "out", "--unsigned", work / "a/Default.bundle", "--rollout", "101"},
-         2},
+        {"public key given as secret", {"publish", out, "--key", work / "public.key", bundle}, 1},
+        {"catalog of another type", {"publish", out, "--unsigned", "--asset-type=x", bundle}, 1},
+        {"missing bundle", {"publish", out, "--unsigned", work / "nowhere"}, 1},
+        {"withdrawing what is not listed", {"withdraw", out, "9", "--key", work / "secret.key"}, 1},
+        {"neither key nor unsigned", {"publish", out, bundle}, 2},
+        {"stage without the key's name", {"refresh", out, "--stage"}, 2},
+        {"option before its bundle", {"publish", out, "--unsigned", "--version", "1", bundle}, 2},
+        {"rollout over 100", {"publish", out, "--unsigned", bundle, "--rollout=101"}, 2},
+        {"unknown option", {"publish", out, "--unsigned", "--sereal", "3", bundle}, 2},
+        {"value missing", {"publish", out, bundle, "--key"}, 2},
     };
     for (const Case& c : cases) {
         SCOPED_TRACE(c.name);
         ToolRun run = runCatalogTool(c.arguments);
         EXPECT_EQ(run.status, c.status);
-        EXPECT_FALSE(run.errors.empty());
+        EXPECT_EQ(std::count(run.errors.begin(), run.errors.end(), '\n'), c.status == 2 ? 2 : 1)
+            << run.errors;
     }
     EXPECT_EQ(readText(work / "out/catalog.plist"), catalog);
     EXPECT_EQ(readText(work / "secret.key"), secret);
+    EXPECT_FALSE(fs::exists(work / "lone.key")) << "a retry must not find a lone secret key";
     EXPECT_EQ(verify().status, 0);
 }
 

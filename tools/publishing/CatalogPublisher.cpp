@@ -1,12 +1,9 @@
 #include "CatalogPublisher.h"
 
-#include <unistd.h>
-
 #include <algorithm>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
-#include <ctime>
 #include <filesystem>
 #include <system_error>
 
@@ -29,7 +26,6 @@ constexpr const char* kBundleExtension = ".bundle";
 constexpr std::uint32_t kMaxBundleBytes = 1u << 30;
 // Every entry's modification time (2001-01-01), so that archives depend on file contents only.
 constexpr std::int64_t kEntryModificationTime = 978307200;
-constexpr double kSecondsPerDay = 86400.0;
 
 using Failure = std::optional<std::string>;
 
@@ -42,9 +38,11 @@ bool isSafeFileNameCharacter(char c) {
            c == '-' || c == '_';
 }
 
-// "Default.bundle" at version 1.2 becomes "Default-1.2.tgz"; anything unusual in either part
-// becomes "_", so the name is always one plain path component.
-std::string archiveNameFor(const std::string& directory, const std::string& version) {
+// "Default.bundle" at version 1.2 becomes "Default-1.2-<sha256>.tgz": the digest in the name means
+// a file once published is never replaced by other bytes under its name. Anything unusual in the
+// first two parts becomes "_", so the name is always one plain path component.
+std::string archiveNameFor(const std::string& directory, const std::string& version,
+                           const std::string& digest) {
     std::string stem = fs::path(directory).lexically_normal().filename().string();
     if (stem.empty()) {
         stem = fs::path(directory).lexically_normal().parent_path().filename().string();
@@ -58,7 +56,7 @@ std::string archiveNameFor(const std::string& directory, const std::string& vers
     if (name.front() == '.') {
         name.front() = '_';
     }
-    return name + ".tgz";
+    return name + "-" + digest + ".tgz";
 }
 
 // The version is always the bundle's own: a catalog that names another one makes every device
@@ -108,25 +106,43 @@ std::optional<std::vector<std::string>> bundleFiles(const std::string& directory
     return files;
 }
 
-Failure packBundle(const std::string& directory, const std::vector<std::string>& files,
-                   const std::string& archivePath) {
+// The archive of the files, or nothing with error set.
+std::optional<std::string> packBundle(const std::string& directory,
+                                      const std::vector<std::string>& files, std::string& error) {
     std::unique_ptr<payload::Archive> archive =
-        payload::Archive::initWithMaxUncompressedSize(kMaxBundleBytes, archivePath);
+        payload::Archive::initWithMaxUncompressedSize(kMaxBundleBytes, directory);
     if (!archive) {
-        return "cannot set up an archive for " + directory;
+        error = "cannot set up an archive for " + directory;
+        return std::nullopt;
     }
     archive->setEntryModificationTime(kEntryModificationTime);
     for (const std::string& file : files) {
         std::string path = (fs::path(directory) / file).string();
         if (!archive->addFile(path, file)) {
-            return "cannot add " + path + " (unreadable, or the bundle is over " +
-                   std::to_string(kMaxBundleBytes) + " bytes)";
+            error = "cannot add " + path + " (unreadable, or the bundle is over " +
+                    std::to_string(kMaxBundleBytes) + " bytes)";
+            return std::nullopt;
         }
     }
-    if (!archive->close() || !archive->writeToFile(archivePath)) {
-        return "cannot write " + archivePath;
+    if (!archive->close()) {
+        error = "cannot finish the archive of " + directory;
+        return std::nullopt;
     }
-    return std::nullopt;
+    const plist::Data& data = archive->archiveData();
+    return std::string(reinterpret_cast<const char*>(data.data()), data.size());
+}
+
+// Writes the archive under its content-addressed name. A file already there with that name holds
+// the same bytes and is left alone; one that does not is damaged, and is refused.
+Failure storeArchive(const std::string& path, const std::string& bytes, const std::string& digest) {
+    int error = io::createFileAtomically(path, bytes, 0644);
+    if (error == EEXIST) {
+        std::optional<std::string> existing = catalog::sha256HexOfFile(path);
+        return existing == digest
+                   ? Failure()
+                   : Failure(path + " does not hold the bytes its name says; remove it");
+    }
+    return error == 0 ? Failure() : systemError("cannot write", path, error);
 }
 
 plist::Value attributesFor(const BundleToPublish& bundle, const std::string& version) {
@@ -155,31 +171,36 @@ std::optional<plist::Value> publishBundle(const PublishRequest& request,
     if (!files) {
         return std::nullopt;
     }
-    std::string name = archiveNameFor(bundle.directory, *version);
-    std::string relativeURL = std::string(kArchivesDirectoryName) + "/" + name;
-    std::string archivePath = (fs::path(request.outputDirectory) / relativeURL).string();
-    if (Failure failure = packBundle(bundle.directory, *files, archivePath)) {
+    std::optional<std::string> bytes = packBundle(bundle.directory, *files, error);
+    if (!bytes) {
+        return std::nullopt;
+    }
+    const std::size_t size = bytes->size();
+    if (size > catalog::kMaxArchiveBytes) {
+        error = bundle.directory + " packs larger than devices accept";
+        return std::nullopt;
+    }
+    catalog::Sha256Digest hasher;
+    hasher.update(*bytes);
+    const std::string digest = hasher.finishHex();
+    if (digest.empty()) {
+        error = "cannot take the SHA-256 of the archive of " + bundle.directory;
+        return std::nullopt;
+    }
+    std::string relativeURL = std::string(kArchivesDirectoryName) + "/" +
+                              archiveNameFor(bundle.directory, *version, digest);
+    if (Failure failure = storeArchive((fs::path(request.outputDirectory) / relativeURL).string(),
+                                       *bytes, digest)) {
         error = *failure;
         return std::nullopt;
     }
-    std::error_code code;
-    std::uintmax_t size = fs::file_size(archivePath, code);
-    std::optional<std::string> digest = catalog::sha256HexOfFile(archivePath);
-    if (code || !digest) {
-        error = "cannot read back " + archivePath;
-        return std::nullopt;
-    }
-    if (size > catalog::kMaxArchiveBytes) {
-        error = archivePath + " is larger than devices accept";
-        return std::nullopt;
-    }
-    std::printf("packed %s: %zu files, %ju bytes, Version %s\n", relativeURL.c_str(), files->size(),
+    std::printf("packed %s: %zu files, %zu bytes, Version %s\n", relativeURL.c_str(), files->size(),
                 size, version->c_str());
     plist::Dictionary entry{
         {catalog::kCatalogAttributesKey, attributesFor(bundle, *version)},
         {catalog::kCatalogArchiveURLKey, plist::Value(relativeURL)},
         {catalog::kCatalogArchiveSizeKey, plist::Value(static_cast<long long>(size))},
-        {catalog::kCatalogArchiveSHA256Key, plist::Value(*digest)},
+        {catalog::kCatalogArchiveSHA256Key, plist::Value(digest)},
     };
     if (bundle.rolloutPercent) {
         entry.emplace(catalog::kCatalogRolloutPercentKey, plist::Value(*bundle.rolloutPercent));
@@ -187,49 +208,46 @@ std::optional<plist::Value> publishBundle(const PublishRequest& request,
     return plist::Value(std::move(entry));
 }
 
-// The serial of the catalog already in the output directory, 0 when there is none: devices refuse
-// to go back, so even a fresh catalog continues from it.
-std::int64_t previousSerial(const PublishRequest& request) {
-    std::string path = (fs::path(request.outputDirectory) / kCatalogFileName).string();
-    std::optional<plist::Value> catalog = plist::readFile(path);
-    const plist::Value* serial = catalog ? catalog->find(catalog::kCatalogSerialKey) : nullptr;
-    const plist::Integer* number = serial != nullptr ? serial->asInteger() : nullptr;
-    return number != nullptr && !number->isLargeUnsigned() && number->signedValue() > 0
-               ? number->signedValue()
-               : 0;
-}
-
-// The entries of the catalog already in the output directory (none when there is none yet).
-std::optional<plist::Array> existingEntries(const PublishRequest& request, std::string& error) {
+// The catalog already in the output directory, or a new one when there is none yet or with fresh.
+std::optional<plist::Dictionary> startingCatalog(const PublishRequest& request,
+                                                 std::string& error) {
+    plist::Dictionary fresh{{catalog::kCatalogAssetTypeKey, plist::Value(request.assetType)},
+                            {catalog::kCatalogAssetsKey, plist::Value(plist::Array())}};
     std::string path = (fs::path(request.outputDirectory) / kCatalogFileName).string();
     std::error_code code;
     if (request.fresh || !fs::exists(path, code)) {
-        return plist::Array();
+        return fresh;
     }
-    plist::Refusal refusal;
-    std::optional<plist::Value> catalog = plist::readFile(path, &refusal);
+    std::optional<plist::Dictionary> catalog = readServedCatalog(request.outputDirectory, error);
     if (!catalog) {
-        error = path + ": " + refusal.reason + "; use --fresh to replace it";
+        error += "; use --fresh to replace it";
         return std::nullopt;
     }
-    const plist::Value* type = catalog ? catalog->find(catalog::kCatalogAssetTypeKey) : nullptr;
-    const plist::Value* assets = catalog ? catalog->find(catalog::kCatalogAssetsKey) : nullptr;
-    if (assets == nullptr || assets->asArray() == nullptr) {
+    auto type = catalog->find(catalog::kCatalogAssetTypeKey);
+    auto assets = catalog->find(catalog::kCatalogAssetsKey);
+    if (assets == catalog->end() || assets->second.asArray() == nullptr) {
         error = path + " is not a catalog; use --fresh to replace it";
         return std::nullopt;
     }
-    if (type == nullptr || type->asString() == nullptr || *type->asString() != request.assetType) {
+    if (type == catalog->end() || type->second.asString() == nullptr ||
+        *type->second.asString() != request.assetType) {
         error = path + " lists another asset type; use --fresh to replace it";
         return std::nullopt;
     }
-    return *assets->asArray();
+    return catalog;
 }
 
+const plist::Value* versionOf(const plist::Value& entry) {
+    const plist::Value* attributes = entry.find(catalog::kCatalogAttributesKey);
+    return attributes != nullptr ? attributes->find("Version") : nullptr;
+}
+
+// Devices install by version, so a version published again replaces its entry.
 void addOrReplace(plist::Array& entries, plist::Value entry) {
-    const plist::Value* url = entry.find(catalog::kCatalogArchiveURLKey);
+    const plist::Value* version = versionOf(entry);
     for (plist::Value& existing : entries) {
-        const plist::Value* existingURL = existing.find(catalog::kCatalogArchiveURLKey);
-        if (existingURL != nullptr && url != nullptr && *existingURL == *url) {
+        const plist::Value* existingVersion = versionOf(existing);
+        if (existingVersion != nullptr && version != nullptr && *existingVersion == *version) {
             existing = std::move(entry);
             return;
         }
@@ -237,54 +255,11 @@ void addOrReplace(plist::Array& entries, plist::Value entry) {
     entries.push_back(std::move(entry));
 }
 
-bool writeFile(const std::string& path, const std::string& bytes, mode_t mode) {
-    return io::replaceFileAtomically(path, bytes, mode) == 0;
-}
-
-// Writes the catalog and, with a key, its detached signature of exactly those bytes. The
-// signature goes first, each file replaced whole: a device that fetches between the two sees a
-// pair that does not verify and fetches again, never an old catalog taken as new.
-Failure writeCatalog(const PublishRequest& request, std::int64_t serial, plist::Array entries) {
-    std::string path = (fs::path(request.outputDirectory) / kCatalogFileName).string();
-    std::string signaturePath = path + catalog::kCatalogSignatureSuffix;
-    double now = static_cast<double>(std::time(nullptr));
-    plist::Dictionary catalog{
-        {catalog::kCatalogAssetTypeKey, plist::Value(request.assetType)},
-        {catalog::kCatalogSerialKey, plist::Value(static_cast<long long>(serial))},
-        {catalog::kCatalogExpiresKey,
-         plist::Value(plist::Date::fromUnixTime(now + request.expiresInDays * kSecondsPerDay))},
-        {catalog::kCatalogAssetsKey, plist::Value(std::move(entries))},
-    };
-    if (request.secretKey) {
-        catalog.emplace(
-            catalog::kCatalogKeyIDKey,
-            plist::Value(request.keyIdentifier.empty() ? keyIdentifierOf(*request.secretKey)
-                                                       : request.keyIdentifier));
-    }
-    std::string bytes = plist::serialize(plist::Value(std::move(catalog)));
-    if (!request.secretKey) {
-        std::error_code ignored;
-        fs::remove(signaturePath, ignored);  // a stale signature would make devices refuse it
-    } else {
-        std::string signature(catalog::kCatalogSignatureBytes, '\0');
-        crypto_sign_detached(reinterpret_cast<unsigned char*>(signature.data()), nullptr,
-                             reinterpret_cast<const unsigned char*>(bytes.data()), bytes.size(),
-                             request.secretKey->data());
-        if (!writeFile(signaturePath, signature, 0644)) {
-            return systemError("cannot write", signaturePath, errno);
-        }
-    }
-    if (!writeFile(path, bytes, 0644)) {
-        return systemError("cannot write", path, errno);
-    }
-    return std::nullopt;
-}
-
 }  // namespace
 
 std::optional<std::string> publishCatalog(const PublishRequest& request) {
-    if (!catalog::sodiumReady()) {
-        return "libsodium cannot be initialised";
+    if (Failure staged = refuseWhileStaged(request.outputDirectory)) {
+        return staged;
     }
     std::string archives = (fs::path(request.outputDirectory) / kArchivesDirectoryName).string();
     std::error_code code;
@@ -293,72 +268,20 @@ std::optional<std::string> publishCatalog(const PublishRequest& request) {
         return systemError("cannot create", archives, code.value());
     }
     std::string error;
-    std::int64_t serial = request.serial.value_or(previousSerial(request) + 1);
-    std::optional<plist::Array> entries = existingEntries(request, error);
-    if (!entries) {
+    std::optional<plist::Dictionary> catalog = startingCatalog(request, error);
+    if (!catalog) {
         return error;
     }
+    plist::Array entries = *catalog->at(catalog::kCatalogAssetsKey).asArray();
     for (const BundleToPublish& bundle : request.bundles) {
         std::optional<plist::Value> entry = publishBundle(request, bundle, error);
         if (!entry) {
             return error;
         }
-        addOrReplace(*entries, std::move(*entry));
+        addOrReplace(entries, std::move(*entry));
     }
-    std::size_t count = entries->size();
-    if (Failure failure = writeCatalog(request, serial, std::move(*entries))) {
-        return failure;
-    }
-    std::printf("wrote %s/%s: %zu asset(s), serial %lld, expires in %d days, %s\n",
-                request.outputDirectory.c_str(), kCatalogFileName, count,
-                static_cast<long long>(serial), request.expiresInDays,
-                request.secretKey ? "signed" : "unsigned");
-    return std::nullopt;
-}
-
-std::optional<std::string> generateKeyPair(const std::string& secretKeyPath,
-                                           const std::string& publicKeyPath, std::string& error) {
-    if (!catalog::sodiumReady()) {
-        error = "libsodium cannot be initialised";
-        return std::nullopt;
-    }
-    catalog::CatalogPublicKey publicKey{};
-    catalog::CatalogSecretKey secretKey{};
-    crypto_sign_keypair(publicKey.data(), secretKey.data());
-    std::string publicText = catalog::base64Encode(publicKey.data(), publicKey.size());
-    // Never over a key that is already there; complete under its name or not at all.
-    const int writeError = io::createFileAtomically(
-        secretKeyPath,
-        std::string_view(reinterpret_cast<const char*>(secretKey.data()), secretKey.size()), 0600);
-    sodium_memzero(secretKey.data(), secretKey.size());
-    if (writeError != 0) {
-        error = systemError("cannot create", secretKeyPath, writeError);
-        return std::nullopt;
-    }
-    if (!writeFile(publicKeyPath, publicText + "\n", 0644)) {
-        error = systemError("cannot write", publicKeyPath, errno);
-        return std::nullopt;
-    }
-    return publicText;
-}
-
-std::string keyIdentifierOf(const catalog::CatalogSecretKey& secretKey) {
-    catalog::CatalogPublicKey publicKey{};
-    crypto_sign_ed25519_sk_to_pk(publicKey.data(), secretKey.data());
-    return catalog::defaultKeyIdentifier(publicKey);
-}
-
-std::optional<catalog::CatalogSecretKey> readSecretKey(const std::string& path,
-                                                       std::string& error) {
-    std::optional<std::string> bytes = plist::readFileBytes(path);
-    catalog::CatalogSecretKey key{};
-    if (!bytes || bytes->size() != key.size()) {
-        error = path + " is not a secret key made by 'tavrix-catalog keygen'";
-        return std::nullopt;
-    }
-    std::memcpy(key.data(), bytes->data(), key.size());
-    sodium_memzero(bytes->data(), bytes->size());
-    return key;
+    catalog->insert_or_assign(catalog::kCatalogAssetsKey, plist::Value(std::move(entries)));
+    return completeCatalog(request.outputDirectory, std::move(*catalog), request.completion);
 }
 
 }  // namespace tavrix::tools

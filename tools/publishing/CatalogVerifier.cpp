@@ -4,11 +4,12 @@
 #include <cstring>
 #include <ctime>
 #include <filesystem>
+#include <nlohmann/json.hpp>
 
-#include "CatalogPublisher.h"
 #include "catalog/AssetCatalogFormat.h"
 #include "http/HttpTransfer.h"
 #include "plist/PropertyListFormat.h"
+#include "publishing/CatalogSite.h"
 
 namespace tavrix::tools {
 namespace {
@@ -23,18 +24,6 @@ const http::HttpTransferLimits kTransferLimits{15, 1024, 30, 0};
 
 bool isURL(const std::string& source) {
     return source.starts_with("http://") || source.starts_with("https://");
-}
-
-std::optional<std::string> readSource(const std::string& location, std::size_t maxBytes,
-                                      std::string& error) {
-    if (isURL(location)) {
-        return http::fetchHttpBody(location, maxBytes, kTransferLimits, error);
-    }
-    std::optional<std::string> bytes = plist::readFileBytes(location);
-    if (!bytes) {
-        error = "cannot read " + location;
-    }
-    return bytes;
 }
 
 // The size and SHA-256 of an archive, or nothing with error set. Reading stops past the size
@@ -74,100 +63,189 @@ std::optional<std::pair<std::uint64_t, std::string>> measureArchive(
     return std::make_pair(size, digest.finishHex());
 }
 
-bool problem(const std::string& text) {
-    std::printf("PROBLEM: %s\n", text.c_str());
-    return false;
+constexpr double kSecondsPerDay = 86400.0;
+
+const char* verdictName(Verdict verdict) {
+    switch (verdict) {
+        case Verdict::Good:
+            return "good";
+        case Verdict::Warning:
+            return "warning";
+        case Verdict::Bad:
+            return "bad";
+    }
+    return "bad";
 }
 
-}  // namespace
-
-bool verifyPublishedCatalog(const VerifyRequest& request) {
-    bool remote = isURL(request.source);
-    std::string catalogLocation =
-        remote ? request.source : (fs::path(request.source) / kCatalogFileName).string();
+// The checks that run once the catalog's bytes are in hand; each finding goes into report.
+void checkCatalog(const VerifyRequest& request, const std::string& location,
+                  const std::string& bytes, VerifyReport& report) {
     std::string error;
-    std::optional<std::string> bytes =
-        readSource(catalogLocation, catalog::kMaxCatalogBytes, error);
-    if (!bytes) {
-        return problem("fetch failed: " + error);
-    }
-    std::optional<plist::Value> catalog = catalog::parseCatalog(*bytes, error);
+    std::optional<plist::Value> catalog = catalog::parseCatalog(bytes, error);
     if (!catalog) {
-        return problem("malformed: " + error);
+        report.problems.push_back("malformed: " + error);
+        return;
     }
+    report.keyID = catalog::catalogKeyID(*catalog);
     catalog::CatalogRefusal refusal;
-    bool good = true;
-    if (!request.keys.empty()) {
-        std::string signature = readSource(catalogLocation + catalog::kCatalogSignatureSuffix,
-                                           kMaxSignatureBytes, error)
-                                    .value_or(std::string());
-        std::optional<std::string> keyID = catalog::catalogKeyID(*catalog);
-        if (catalog::verifyWithTrustedKey(*bytes, signature, keyID, request.keys, refusal)) {
-            std::printf("signature: verified with the key %s\n", keyID->c_str());
-        } else {
-            good = problem(refusal.what());
-        }
+    if (request.keys.empty()) {
+        report.signature = "not checked";
     } else {
-        std::printf("signature: not checked (--allow-unsigned)\n");
+        std::string signature =
+            readPublished(location + catalog::kCatalogSignatureSuffix, kMaxSignatureBytes, error)
+                .value_or(std::string());
+        if (catalog::verifyWithTrustedKey(bytes, signature, report.keyID, request.keys, refusal)) {
+            report.signature = "verified";
+        } else {
+            report.signature = "refused";
+            report.problems.push_back(refusal.what());
+        }
     }
     std::optional<catalog::CatalogMetadata> metadata =
         catalog::readCatalogMetadata(*catalog, refusal);
     if (!metadata) {
-        return problem(refusal.what());
+        report.problems.push_back(refusal.what());
+        return;
     }
-    std::printf("serial: %lld\nexpires: %s\n", static_cast<long long>(metadata->serial),
-                catalog::catalogDateText(metadata->expires).c_str());
-    plist::Date now = plist::Date::fromUnixTime(static_cast<double>(std::time(nullptr)));
-    if (!catalog::checkFreshness(*metadata, now, request.minimumSerial, refusal)) {
-        good = problem(refusal.what());
+    report.serial = metadata->serial;
+    report.expiresUnixTime = metadata->expires.unixTime();
+    const double now = static_cast<double>(std::time(nullptr));
+    if (!catalog::checkFreshness(*metadata, plist::Date::fromUnixTime(now), request.minimumSerial,
+                                 refusal)) {
+        report.problems.push_back(refusal.what());
+    } else if (metadata->expires.unixTime() - now < request.warningDays * kSecondsPerDay) {
+        report.warnings.push_back("expires within " + std::to_string(request.warningDays) +
+                                  " days, at " + catalog::catalogDateText(metadata->expires) +
+                                  ": refresh it");
     }
+    bool remote = isURL(request.source);
     std::string base = remote ? request.source : std::string(kDirectoryBase) + kCatalogFileName;
     std::optional<std::vector<catalog::CatalogEntry>> entries =
         catalog::readCatalogEntries(*catalog, base, request.assetType, error);
     if (!entries) {
-        return problem("malformed: " + error);
+        report.problems.push_back("malformed: " + error);
+        return;
     }
     // Devices skip malformed entries; a publisher wants to hear of them.
     std::size_t listed = catalog->find(catalog::kCatalogAssetsKey)->asArray()->size();
     if (entries->size() != listed) {
-        good = problem(std::to_string(listed - entries->size()) + " of " + std::to_string(listed) +
-                       " entries are malformed and skipped by devices");
+        report.problems.push_back(std::to_string(listed - entries->size()) + " of " +
+                                  std::to_string(listed) +
+                                  " entries are malformed and skipped by devices");
     }
     for (const catalog::CatalogEntry& entry : *entries) {
-        std::string name = entry.archiveURL.starts_with(kDirectoryBase)
-                               ? entry.archiveURL.substr(kDirectoryBase.size())
-                               : entry.archiveURL;
+        ArchiveCheck check;
+        auto version = entry.attributes.find("Version");
+        check.version = version != entry.attributes.end() && version->second.asString() != nullptr
+                            ? *version->second.asString()
+                            : "";
+        check.archive = entry.archiveURL.starts_with(kDirectoryBase)
+                            ? entry.archiveURL.substr(kDirectoryBase.size())
+                            : entry.archiveURL;
+        check.size = entry.archiveSize;
+        check.sha256 = entry.archiveSHA256;
+        check.rolloutPercent = entry.rolloutPercent;
         auto measured = measureArchive(request.source, entry, error);
         if (!measured) {
-            good = problem(name + ": " + error);
+            report.problems.push_back(check.archive + ": " + error);
         } else if (measured->first != entry.archiveSize) {
-            good = problem(name + ": " + std::to_string(measured->first) + " bytes, listed as " +
-                           std::to_string(entry.archiveSize));
+            report.problems.push_back(check.archive + ": " + std::to_string(measured->first) +
+                                      " bytes, listed as " + std::to_string(entry.archiveSize));
         } else if (measured->second != entry.archiveSHA256) {
-            good = problem(name + ": SHA-256 " + measured->second + ", listed as " +
-                           entry.archiveSHA256);
+            report.problems.push_back(check.archive + ": SHA-256 " + measured->second +
+                                      ", listed as " + entry.archiveSHA256);
         } else {
-            std::printf("archive: %s: %llu bytes, SHA-256 matches, rollout %d%%\n", name.c_str(),
-                        static_cast<unsigned long long>(entry.archiveSize), entry.rolloutPercent);
+            check.matches = true;
         }
+        report.archives.push_back(std::move(check));
     }
-    std::printf("%s\n", good ? "catalog is good" : "catalog has problems");
-    return good;
 }
 
-std::optional<catalog::TrustedCatalogKey> readPublicKey(const std::string& path,
-                                                        const std::string& identifier,
-                                                        std::string& error) {
-    std::optional<std::string> text = plist::readFileBytes(path);
-    std::optional<std::string> bytes = text ? catalog::base64Decode(*text) : std::nullopt;
-    catalog::TrustedCatalogKey key;
-    if (!bytes || bytes->size() != key.publicKey.size()) {
-        error = path + " is not a public key made by 'tavrix-catalog keygen'";
-        return std::nullopt;
+}  // namespace
+
+std::string catalogLocation(const std::string& source) {
+    return isURL(source) ? source : (fs::path(source) / kCatalogFileName).string();
+}
+
+std::optional<std::string> readPublished(const std::string& location, std::size_t maxBytes,
+                                         std::string& error) {
+    if (isURL(location)) {
+        return http::fetchHttpBody(location, maxBytes, kTransferLimits, error);
     }
-    std::memcpy(key.publicKey.data(), bytes->data(), key.publicKey.size());
-    key.identifier = identifier.empty() ? catalog::defaultKeyIdentifier(key.publicKey) : identifier;
-    return key;
+    plist::Refusal refusal;
+    std::optional<std::string> bytes = plist::readFileBytes(location, &refusal);
+    if (!bytes) {
+        error = "cannot read " + location + (refusal.reason.empty() ? "" : ": " + refusal.reason);
+    }
+    return bytes;
+}
+
+VerifyReport verifyPublishedCatalog(const VerifyRequest& request) {
+    VerifyReport report;
+    const std::string location = catalogLocation(request.source);
+    std::string error;
+    std::optional<std::string> bytes = readPublished(location, catalog::kMaxCatalogBytes, error);
+    if (!bytes) {
+        report.problems.push_back("fetch failed: " + error);
+    } else {
+        checkCatalog(request, location, *bytes, report);
+    }
+    report.verdict = !report.problems.empty()   ? Verdict::Bad
+                     : !report.warnings.empty() ? Verdict::Warning
+                                                : Verdict::Good;
+    return report;
+}
+
+void printVerifyReport(const VerifyReport& report, bool json) {
+    for (const std::string& problem : report.problems) {
+        std::fprintf(stderr, "tavrix-catalog: problem: %s\n", problem.c_str());
+    }
+    for (const std::string& warning : report.warnings) {
+        std::fprintf(stderr, "tavrix-catalog: warning: %s\n", warning.c_str());
+    }
+    if (json) {
+        nlohmann::json archives = nlohmann::json::array();
+        for (const ArchiveCheck& check : report.archives) {
+            archives.push_back({{"version", check.version},
+                                {"archive", check.archive},
+                                {"size", check.size},
+                                {"sha256", check.sha256},
+                                {"rolloutPercent", check.rolloutPercent},
+                                {"matches", check.matches}});
+        }
+        nlohmann::json out{{"verdict", verdictName(report.verdict)},
+                           {"signature", report.signature},
+                           {"archives", std::move(archives)},
+                           {"problems", report.problems},
+                           {"warnings", report.warnings}};
+        out["serial"] = report.serial ? nlohmann::json(*report.serial) : nlohmann::json();
+        out["keyID"] = report.keyID ? nlohmann::json(*report.keyID) : nlohmann::json();
+        out["expires"] = report.expiresUnixTime
+                             ? nlohmann::json(catalog::catalogDateText(
+                                   plist::Date::fromUnixTime(*report.expiresUnixTime)))
+                             : nlohmann::json();
+        std::printf("%s\n", out.dump(2).c_str());
+        return;
+    }
+    if (!report.signature.empty()) {
+        std::printf("signature: %s%s\n", report.signature.c_str(),
+                    report.keyID ? (" (key " + *report.keyID + ")").c_str() : "");
+    }
+    if (report.serial) {
+        std::printf("serial: %lld\n", static_cast<long long>(*report.serial));
+    }
+    if (report.expiresUnixTime) {
+        std::printf(
+            "expires: %s\n",
+            catalog::catalogDateText(plist::Date::fromUnixTime(*report.expiresUnixTime)).c_str());
+    }
+    for (const ArchiveCheck& check : report.archives) {
+        std::printf("archive: %s: version %s, %llu bytes, rollout %d %%, %s\n",
+                    check.archive.c_str(), check.version.c_str(),
+                    static_cast<unsigned long long>(check.size), check.rolloutPercent,
+                    check.matches ? "matches" : "DOES NOT MATCH");
+    }
+    std::printf("catalog is %s\n", verdictName(report.verdict));
 }
 
 }  // namespace tavrix::tools

@@ -20,15 +20,45 @@ struct VerifyRequest {
     bool allowUnsigned = false;
     // The serial a device already holds: a lower one is a rollback.
     std::optional<std::int64_t> minimumSerial;
+    // A catalog that expires within this many days is good for now but needs a refresh.
+    int warningDays = 7;
 };
 
-// Prints what it finds to stdout, each problem on a line of its own. True when there is none.
-bool verifyPublishedCatalog(const VerifyRequest& request);
+enum class Verdict { Good, Warning, Bad };
 
-// The public key in the file keygen wrote, named identifier (its default identifier when empty),
-// or nothing with error set.
-std::optional<catalog::TrustedCatalogKey> readPublicKey(const std::string& path,
-                                                        const std::string& identifier,
-                                                        std::string& error);
+struct ArchiveCheck {
+    std::string version;
+    // As the catalog lists it, relative to the catalog when it is.
+    std::string archive;
+    std::uint64_t size = 0;
+    std::string sha256;
+    int rolloutPercent = 100;
+    bool matches = false;
+};
+
+struct VerifyReport {
+    Verdict verdict = Verdict::Good;
+    std::optional<std::int64_t> serial;
+    std::optional<double> expiresUnixTime;
+    std::optional<std::string> keyID;
+    // "verified", "not checked" or "refused".
+    std::string signature;
+    std::vector<ArchiveCheck> archives;
+    // Each makes the catalog bad, or only calls for attention.
+    std::vector<std::string> problems;
+    std::vector<std::string> warnings;
+};
+
+VerifyReport verifyPublishedCatalog(const VerifyRequest& request);
+
+// The report on stdout, as text or as one JSON object, and every problem and warning on stderr,
+// one line each.
+void printVerifyReport(const VerifyReport& report, bool json);
+
+// Where the catalog of a source (URL or directory) is.
+std::string catalogLocation(const std::string& source);
+// The bytes at an http(s) URL or a file path, at most maxBytes; nothing with error set.
+std::optional<std::string> readPublished(const std::string& location, std::size_t maxBytes,
+                                         std::string& error);
 
 }  // namespace tavrix::tools

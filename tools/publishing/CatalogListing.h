@@ -1,0 +1,14 @@
+// What a published catalog holds, for the operator: serial, expiry, key and each asset with its
+// rollout, as the catalog says it (nothing is verified here; that is `verify`).
+#pragma once
+
+#include <optional>
+#include <string>
+
+namespace tavrix::tools {
+
+// Prints the catalog at source (a URL or a site directory) on stdout; for a directory, also a
+// catalog waiting for its signature. Nothing on success, else the error.
+std::optional<std::string> showCatalog(const std::string& source);
+
+}  // namespace tavrix::tools
