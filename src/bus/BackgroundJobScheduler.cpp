@@ -14,6 +14,7 @@
 
 #include "device/PlatformRoot.h"
 #include "io/AtomicFile.h"
+#include "io/Directory.h"
 #include "plist/PropertyListFormat.h"
 #include "util/ContainExceptions.h"
 #include "util/Log.h"
@@ -162,16 +163,18 @@ void BackgroundJobScheduler::load() {
     if (filePath_.empty()) {
         return;
     }
-    struct stat info {};
-    if (::stat(filePath_.c_str(), &info) != 0) {
-        if (errno != ENOENT) {
-            logCFormat("Background jobs: cannot examine %s: %s; starting with no jobs",
-                       filePath_.c_str(), errorText(errno).c_str());
+    // The daemon's own store only: nothing another user made or linked there is a job.
+    int error = 0;
+    io::UniqueFd file = io::openOwnFile(filePath_, &error);
+    if (!file) {
+        if (error != ENOENT) {
+            logCFormat("Background jobs: cannot use %s: %s; starting with no jobs",
+                       filePath_.c_str(), errorText(error).c_str());
         }
         return;
     }
     plist::Refusal refusal;
-    auto contents = plist::readFile(filePath_, &refusal);
+    auto contents = plist::readOpenFile(file.get(), &refusal);
     if (!contents) {
         logPropertyListRefusal(filePath_, refusal, "starting with no jobs");
         return;

@@ -20,12 +20,7 @@ plist::Dictionary readDaemonStateFile(std::string_view fileName) {
     // Only the daemon's own files in its own directory: nothing another user made or linked
     // there may pass for the daemon's state.
     int error = 0;
-    auto directory = io::Directory::open(resolvePath(kDaemonStateDirectory),
-                                         io::Directory::LastLink::Refuse, &error);
-    if (!directory || io::whyNotProtected(directory->status())) {
-        return {};
-    }
-    io::UniqueFd file = directory->openOwnFile(fileName, &error);
+    io::UniqueFd file = io::openOwnFile(daemonStateFilePath(fileName), &error);
     if (!file) {
         return {};
     }

@@ -8,6 +8,7 @@
 #include <cerrno>
 
 #include "io/FileIO.h"
+#include "io/Paths.h"
 
 namespace tavrix::io {
 namespace {
@@ -278,6 +279,18 @@ int Directory::renameEntry(std::string_view from, std::string_view to) const {
     }
     ::fsync(fd_.get());
     return 0;
+}
+
+UniqueFd openOwnFile(const std::string& path, int* error) {
+    auto directory = Directory::open(parentDirectory(path), Directory::LastLink::Refuse, error);
+    if (!directory) {
+        return UniqueFd();
+    }
+    if (whyNotProtected(directory->status())) {
+        *error = EPERM;
+        return UniqueFd();
+    }
+    return directory->openOwnFile(lastPathComponent(path), error);
 }
 
 }  // namespace tavrix::io

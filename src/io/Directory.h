@@ -77,4 +77,8 @@ class Directory {
     struct stat status_ {};
 };
 
+// The daemon's own file at path: Directory::openOwnFile in path's directory, which must be no
+// link and protected (EPERM otherwise).
+UniqueFd openOwnFile(const std::string& path, int* error);
+
 }  // namespace tavrix::io
