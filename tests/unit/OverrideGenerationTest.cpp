@@ -176,6 +176,25 @@ TEST_F(OverrideGenerationTest, EveryBehaviorIDGetsItsOwnFileInsideTheOverlayDire
     EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kOverrideBundleFailure);
     EXPECT_EQ(record.carrierFilePath, baseFile());
     EXPECT_EQ(record.overlayType, kNoOverlay);
+
+    // A link where the Overlay directory or a generated file belongs is not the daemon's: it is
+    // replaced by the daemon's own, and nothing is read or written where it points.
+    const std::string overlay = home() + "/Library/TavrixBundles/Overlay";
+    const std::string elsewhere = test::unitTestRoot().string() + "/elsewhere";
+    fs::remove(overlay);
+    fs::create_directories(elsewhere);
+    fs::create_symlink(elsewhere, overlay);
+    record = baseBundle();
+    ASSERT_EQ(applyMultimodeOverlay(record, std::string("abc")), kOverrideBundleSuccess);
+    EXPECT_FALSE(fs::is_symlink(overlay));
+    EXPECT_TRUE(fs::is_empty(elsewhere));
+    test::writeText(elsewhere + "/planted.plist", "<plist/>");
+    fs::remove(record.carrierFilePath);
+    fs::create_symlink(elsewhere + "/planted.plist", record.carrierFilePath);
+    CarrierBundle again = baseBundle();
+    ASSERT_EQ(applyMultimodeOverlay(again, std::string("abc")), kOverrideBundleSuccess);
+    EXPECT_FALSE(fs::is_symlink(again.carrierFilePath));
+    EXPECT_EQ(test::readText(elsewhere + "/planted.plist"), "<plist/>");
 }
 
 }  // namespace
