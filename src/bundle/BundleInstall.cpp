@@ -18,23 +18,26 @@ bool BundleManager::installBehaviorBundleData(const plist::Data& data, std::stri
     std::optional<payload::StagedPayload> staged = payload::stagePayload(data, stagedPath, &reason);
     bool installed = false;
     if (staged) {
-        // Bounded, so that a payload that unpacks to far more than it weighs stops before the
-        // disk fills; what was extracted until then is placed, like any other incomplete
-        // payload: the old bundle is gone even when the new one fails.
+        // Extracted beside the old bundle, which goes only once the new one is there. A damaged
+        // payload still replaces it with whatever was extracted; one stopped at a limit (its size,
+        // its entries, the free space it would leave) keeps the old bundle: nothing was wrong
+        // with it, only there is no room for the new one.
         installed = replaceUserBundle(
             [&](const std::string& staging, std::string* failure) {
-                if (payload::extractArchive(staged->fd(), stagedPath, staging,
-                                            payload::ExtractionSafety::AsArchived,
-                                            payload::kClientPayloadLimits, failure)) {
-                    return true;
+                const payload::ExtractionOutcome outcome = payload::extractArchive(
+                    staged->fd(), stagedPath, staging, payload::ExtractionSafety::AsArchived,
+                    payload::kClientPayloadLimits, failure);
+                if (outcome == payload::ExtractionOutcome::Complete) {
+                    return BundleFill::Whole;
                 }
                 if (failure->empty()) {
                     *failure = "the archive could not be extracted";
                 }
                 logCFormat("%s\n", failure->c_str());
-                return false;
+                return outcome == payload::ExtractionOutcome::OverLimit ? BundleFill::Refused
+                                                                        : BundleFill::Incomplete;
             },
-            IncompleteBundle::Place, &reason);
+            &reason);
     }
     if (!installed && whyNot != nullptr) {
         *whyNot = reason;

@@ -12,8 +12,7 @@
 
 namespace tavrix {
 
-bool replaceUserBundle(const UserBundleFill& fill, IncompleteBundle incomplete,
-                       std::string* whyNot) {
+bool replaceUserBundle(const UserBundleFill& fill, std::string* whyNot) {
     const std::string& bundle = userBundleLocation();
     if (bundle.empty()) {
         // Removing or extracting relative to an unknown home could touch anything.
@@ -33,8 +32,8 @@ bool replaceUserBundle(const UserBundleFill& fill, IncompleteBundle incomplete,
     }
     const std::string staging = payload::extractionStagingPathFor(bundle);
     removeItemTree(staging);
-    const bool filled = fill(staging, whyNot);
-    if (!filled && incomplete == IncompleteBundle::Discard) {
+    const BundleFill filled = fill(staging, whyNot);
+    if (filled == BundleFill::Refused) {
         removeItemTree(staging);
         return false;
     }
@@ -56,7 +55,7 @@ bool replaceUserBundle(const UserBundleFill& fill, IncompleteBundle incomplete,
                   std::strerror(error);
         return false;
     }
-    return filled;
+    return filled == BundleFill::Whole;
 }
 
 }  // namespace tavrix

@@ -8,17 +8,17 @@
 
 namespace tavrix {
 
-// Fills the empty directory at staging with the new bundle's files; false, with the reason in
-// whyNot, when it could not be filled whole.
-using UserBundleFill = std::function<bool(const std::string& staging, std::string* whyNot)>;
+// How filling the new bundle went: whole; cut short, yet to be used in place of the old one (a
+// client's damaged payload: the old bundle is gone even then, and what was extracted is used); or
+// refused, the old bundle staying.
+enum class BundleFill { Whole, Incomplete, Refused };
 
-// Whether a bundle that could not be filled whole still replaces the old one (a client's payload
-// does: the old bundle is gone even when the new one fails, and what was extracted is used).
-enum class IncompleteBundle { Place, Discard };
+// Fills the empty directory at staging with the new bundle's files; anything but Whole comes with
+// the reason in whyNot.
+using UserBundleFill = std::function<BundleFill(const std::string& staging, std::string* whyNot)>;
 
 // Replaces the user bundle with what fill makes. True when it was filled whole and put in place;
 // otherwise false with the reason in whyNot (the old bundle stays unless the new one was placed).
-bool replaceUserBundle(const UserBundleFill& fill, IncompleteBundle incomplete,
-                       std::string* whyNot);
+bool replaceUserBundle(const UserBundleFill& fill, std::string* whyNot);
 
 }  // namespace tavrix

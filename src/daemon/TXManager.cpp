@@ -45,8 +45,18 @@ bool TXManager::setTavrixID(const std::string& tavrixID, const std::optional<pli
         logObjectFormat("Device has cellular radio, not accepting tavrix ID");
         return false;
     }
+    if (tavrixID.size() > kMaxBehaviorIDBytes) {
+        logCFormat("Behavior ID of %zu bytes is longer than the %zu allowed, not accepting it\n",
+                   tavrixID.size(), kMaxBehaviorIDBytes);
+        return false;
+    }
     std::string lowered = lowercaseText(tavrixID);
-    setBehaviorPreference(kTavrixIDKey, plist::Value(lowered));
+    // An ID that is not on disk would be lost at the next launch: the client is told, and
+    // nothing is installed for it.
+    if (!setBehaviorPreference(kTavrixIDKey, plist::Value(lowered))) {
+        logCFormat("Could not store the behavior ID, not accepting it\n");
+        return false;
+    }
     BundleManager& bundles = BundleManager::sharedInstance();
     {
         std::lock_guard lock(bundles.operationLock());

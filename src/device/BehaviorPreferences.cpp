@@ -11,10 +11,8 @@ std::optional<plist::Value> copyBehaviorPreference(std::string_view key) {
 }
 
 bool setBehaviorPreference(std::string_view key, const std::optional<plist::Value>& value) {
-    auto& store = device::PreferencesStore::shared();
-    const std::string& user = device::MobileUser::name();
-    store.setValue(key, value, kBehaviorPreferencesDomain, user);
-    return store.synchronize(kBehaviorPreferencesDomain, user);
+    return device::PreferencesStore::shared().storeValue(key, value, kBehaviorPreferencesDomain,
+                                                         device::MobileUser::name());
 }
 
 }  // namespace tavrix

@@ -7,6 +7,7 @@
 
 #include <cerrno>
 #include <climits>
+#include <cstdint>
 #include <cstdlib>
 #include <system_error>
 
@@ -30,6 +31,7 @@ constexpr std::string_view kLockExtension = ".lock";
 constexpr mode_t kFileMode = 0644;
 // Only the daemon and root take the lock: nobody else can hold a write back for ever.
 constexpr mode_t kLockFileMode = 0600;
+constexpr int kLockAttempts = 4;
 
 std::string errorText(int error) {
     return std::generic_category().message(error);
@@ -72,23 +74,23 @@ std::string ownerText(uid_t owner) {
 }
 
 // Holds an exclusive flock on the domain's lock file for its lifetime. The file is the daemon's
-// own (a look-alike of another owner is removed first), since a lock anyone could open is a lock
-// anyone could hold for ever.
+// own, mode 0600 (anything else at its name is replaced), since a lock anyone could open is a
+// lock anyone could hold for ever.
 class DomainLock {
   public:
     DomainLock(const io::Directory& directory, const std::string& name) {
-        for (int attempt = 0; attempt < 2 && !fd_; ++attempt) {
-            const int exclusive = attempt == 0 ? 0 : O_EXCL;
-            fd_.reset(::openat(directory.fd(), name.c_str(),
-                               O_RDWR | O_CREAT | O_NOFOLLOW | O_CLOEXEC | exclusive,
-                               kLockFileMode));
+        // Made whole under a temporary name and renamed into place, so that whatever else sits
+        // at the name (a link planted there first) is replaced in one step, never raced.
+        for (int attempt = 0; attempt < kLockAttempts && !fd_; ++attempt) {
+            fd_.reset(::openat(directory.fd(), name.c_str(), O_RDWR | O_NOFOLLOW | O_CLOEXEC));
             struct stat info {};
             if (fd_ && ::fstat(fd_.get(), &info) == 0 && S_ISREG(info.st_mode) &&
                 io::isTrustedOwner(info.st_uid)) {
                 break;
             }
+            const bool missing = !fd_ && errno == ENOENT;
             fd_.reset();
-            directory.removeEntry(name);
+            directory.writeFile(name, kLockFileMode, /*replace=*/!missing, std::string_view());
         }
         if (!fd_) {
             return;
@@ -222,6 +224,23 @@ bool PreferencesStore::synchronize(std::string_view domain, std::string_view use
     return true;
 }
 
+bool PreferencesStore::storeValue(std::string_view key, const std::optional<plist::Value>& value,
+                                  std::string_view domain, std::string_view user) {
+    std::lock_guard lock(mutex_);
+    Domain* state = domainFor(domain, user);
+    if (state == nullptr) {
+        return false;
+    }
+    auto [change, inserted] = state->pending.insert_or_assign(std::string(key), value);
+    if (!writePending(*state)) {
+        state->pending.erase(change);
+        return false;
+    }
+    state->pending.clear();
+    state->file.invalidate();
+    return true;
+}
+
 PreferencesStore::Domain* PreferencesStore::domainFor(std::string_view domain,
                                                       std::string_view user) {
     if (!isValidComponent(domain) || domain.size() + kExtension.size() > NAME_MAX) {
@@ -268,6 +287,14 @@ bool PreferencesStore::writePending(Domain& domain) {
     int error = 0;
     io::UniqueFd current = preferences->openOwnFile(domain.fileName, &error);
     if (current) {
+        // A file too large to read is not a damaged one: its values are unknown, not absent, and
+        // writing would drop them all.
+        struct stat info {};
+        if (::fstat(current.get(), &info) != 0 ||
+            static_cast<std::uint64_t>(info.st_size) > plist::kMaxPropertyListBytes) {
+            logFailure("read", domain.path, EFBIG);
+            return false;
+        }
         plist::Refusal refusal;
         auto stored = plist::readOpenFile(current.get(), &refusal);
         if (!stored && refusal.error != 0) {
@@ -299,6 +326,12 @@ bool PreferencesStore::writePending(Domain& domain) {
     std::string bytes = plist::serialize(plist::Value(std::move(contents)));
     if (bytes.empty()) {
         logCFormat("Preferences: cannot encode the values for %s", domain.path.c_str());
+        return false;
+    }
+    // Never a file its own reader would refuse, and then read as empty.
+    if (bytes.size() > plist::kMaxPropertyListBytes) {
+        logCFormat("Preferences: not writing %s: %zu bytes, more than the %zu a reader accepts",
+                   domain.path.c_str(), bytes.size(), plist::kMaxPropertyListBytes);
         return false;
     }
     if (int failure = preferences->writeFile(domain.fileName, kFileMode, true, bytes);

@@ -3,6 +3,7 @@
 // dictionary.
 //
 // Reads follow symbolic links and are cached until the file changes or the domain is synchronized.
+// A file is never written larger than its reader accepts (plist::kMaxPropertyListBytes).
 // Values set are pending until the domain is synchronized, which merges them into the file on disk
 // under a lock on the Preferences directory (other processes may write other keys of the same
 // domain) and replaces it atomically. A damaged file reads as an empty domain and is logged.
@@ -44,6 +45,11 @@ class PreferencesStore {
     // Writes the pending values of the domain to disk and forgets cached reads, so changes made by
     // others are seen. False when the domain could not be written; its pending values are kept.
     bool synchronize(std::string_view domain, std::string_view user);
+
+    // setValue and synchronize in one step; when the domain cannot be written, the value is not
+    // kept pending, so that reads answer what is stored.
+    bool storeValue(std::string_view key, const std::optional<plist::Value>& value,
+                    std::string_view domain, std::string_view user);
 
   private:
     struct Domain;

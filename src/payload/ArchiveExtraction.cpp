@@ -107,16 +107,17 @@ std::optional<std::string> copyEntryData(archive* reader, archive* writer,
 }
 
 // The extraction itself; open attaches the reader to the archive named archivePath.
-bool extract(const std::string& archivePath, const std::function<int(archive*)>& open,
-             const std::string& destinationDirectory, ExtractionSafety safety,
-             const ExtractionLimits& limits, std::string* whyNot) {
-    auto fail = [&](const std::string& why) {
+ExtractionOutcome extract(const std::string& archivePath, const std::function<int(archive*)>& open,
+                          const std::string& destinationDirectory, ExtractionSafety safety,
+                          const ExtractionLimits& limits, std::string* whyNot) {
+    auto fail = [&](const std::string& why,
+                    ExtractionOutcome outcome = ExtractionOutcome::Damaged) {
         if (whyNot != nullptr) {
             *whyNot = why;
         } else {
             logCFormat("%s\n", why.c_str());
         }
-        return false;
+        return outcome;
     };
     // Empty names would mean standard input and the file-system root to libarchive.
     if (archivePath.empty() || destinationDirectory.empty()) {
@@ -161,7 +162,8 @@ bool extract(const std::string& archivePath, const std::function<int(archive*)>&
     }
     ExtractionBudget budget(limits, destination);
     auto stop = [&](const std::string& why) {
-        return fail("Extraction of " + archivePath + " into " + destination + " stopped: " + why);
+        return fail("Extraction of " + archivePath + " into " + destination + " stopped: " + why,
+                    ExtractionOutcome::OverLimit);
     };
     for (;;) {
         archive_entry* entry = nullptr;
@@ -171,7 +173,7 @@ bool extract(const std::string& archivePath, const std::function<int(archive*)>&
             if (std::optional<std::string> exceeded = budget.checkFinalRoom()) {
                 return stop(*exceeded);
             }
-            return true;
+            return ExtractionOutcome::Complete;
         }
         if (status != ARCHIVE_OK) {
             return fail("Cannot read the archive " + archivePath + ": " + errorText(reader.get()));
@@ -209,18 +211,18 @@ bool extract(const std::string& archivePath, const std::function<int(archive*)>&
 
 bool extractArchive(const std::string& archivePath, const std::string& destinationDirectory,
                     ExtractionSafety safety, const ExtractionLimits& limits, std::string* whyNot) {
-    return extract(
-        archivePath,
-        [&archivePath](archive* reader) {
-            return libarchive().archive_read_open_filename(reader, archivePath.c_str(),
-                                                           kReadBlockSize);
-        },
-        destinationDirectory, safety, limits, whyNot);
+    return ExtractionOutcome::Complete == extract(
+                                              archivePath,
+                                              [&archivePath](archive* reader) {
+                                                  return libarchive().archive_read_open_filename(
+                                                      reader, archivePath.c_str(), kReadBlockSize);
+                                              },
+                                              destinationDirectory, safety, limits, whyNot);
 }
 
-bool extractArchive(int archiveFd, const std::string& archivePath,
-                    const std::string& destinationDirectory, ExtractionSafety safety,
-                    const ExtractionLimits& limits, std::string* whyNot) {
+ExtractionOutcome extractArchive(int archiveFd, const std::string& archivePath,
+                                 const std::string& destinationDirectory, ExtractionSafety safety,
+                                 const ExtractionLimits& limits, std::string* whyNot) {
     return extract(
         archivePath,
         [archiveFd](archive* reader) {

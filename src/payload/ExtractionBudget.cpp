@@ -1,5 +1,7 @@
 #include "payload/ExtractionBudget.h"
 
+#include <algorithm>
+
 #include "util/FileSystemUtilities.h"
 
 namespace tavrix::payload {
@@ -64,12 +66,22 @@ std::optional<std::string> ExtractionBudget::noteExtent(std::uint64_t extent) {
     return checkFreeSpace(0);
 }
 
+std::uint64_t ExtractionBudget::reserve() {
+    if (!reserve_) {
+        std::optional<std::uint64_t> capacity =
+            limits_.reserveShare != 0 ? capacityBytesAt(destination_) : std::nullopt;
+        reserve_ = capacity ? std::min(limits_.freeSpaceReserve, *capacity / limits_.reserveShare)
+                            : limits_.freeSpaceReserve;
+    }
+    return *reserve_;
+}
+
 std::optional<std::string> ExtractionBudget::checkFinalRoom() {
     return checkFreeSpace(0);
 }
 
 std::optional<std::string> ExtractionBudget::checkFreeSpace(std::uint64_t stillToWrite) {
-    std::uint64_t needed = saturatingAdd(limits_.freeSpaceReserve, stillToWrite);
+    std::uint64_t needed = saturatingAdd(reserve(), stillToWrite);
     if (limits_.keepRoomForCopy) {
         std::uint64_t expanded = saturatingAdd(finishedBytes_, entryExtent_);
         needed = saturatingAdd(needed, saturatingAdd(expanded, stillToWrite));

@@ -28,7 +28,11 @@ class ExtractionBudget {
   private:
     std::optional<std::string> checkFreeSpace(std::uint64_t stillToWrite);
 
+    // The free space kept: the limits' reserve, less on a small file system.
+    std::uint64_t reserve();
+
     const ExtractionLimits limits_;
+    std::optional<std::uint64_t> reserve_;
     const std::string destination_;
     std::uint64_t entries_ = 0;
     // Hashes of the parent directories implied so far; a collision only undercounts by one.

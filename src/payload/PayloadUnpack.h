@@ -57,6 +57,9 @@ struct ExtractionLimits {
     std::uint64_t freeSpaceReserve = 0;
     // The extracted tree is copied elsewhere afterwards: keep room for that copy as well.
     bool keepRoomForCopy = false;
+    // When not 0, the reserve is at most this fraction (1/share) of the file system, so that a
+    // small one is not refused everything by a reserve it cannot even hold.
+    std::uint64_t reserveShare = 0;
 };
 
 // A real bundle is a few hundred files and a few megabytes; these leave ample headroom while a
@@ -64,8 +67,10 @@ struct ExtractionLimits {
 inline constexpr std::uint64_t kPayloadMaxExpandedBytes = 256ull << 20;
 inline constexpr std::uint64_t kPayloadMaxEntries = 20000;
 inline constexpr std::uint64_t kPayloadFreeSpaceReserve = 64ull << 20;
+inline constexpr std::uint64_t kPayloadReserveShare = 16;
 inline constexpr ExtractionLimits kClientPayloadLimits{kPayloadMaxExpandedBytes, kPayloadMaxEntries,
-                                                       kPayloadFreeSpaceReserve, false};
+                                                       kPayloadFreeSpaceReserve, false,
+                                                       kPayloadReserveShare};
 
 // Extracts a gzip- or compress-compressed tar or cpio archive file into destinationDirectory
 // (created when missing), restoring permissions, times, ACLs and file flags but not owners.
@@ -83,10 +88,14 @@ bool extractArchive(const std::string& archivePath, const std::string& destinati
                     ExtractionSafety safety = ExtractionSafety::AsArchived,
                     const ExtractionLimits& limits = kClientPayloadLimits,
                     std::string* whyNot = nullptr);
-// The same for the archive open at archiveFd (read from its current offset); archivePath names it
-// in messages.
-bool extractArchive(int archiveFd, const std::string& archivePath,
-                    const std::string& destinationDirectory, ExtractionSafety safety,
-                    const ExtractionLimits& limits, std::string* whyNot);
+// How an extraction ended: read to its end, stopped by a damaged or refused archive, or stopped
+// at a limit (size, entries, free space) before it filled the disk.
+enum class ExtractionOutcome { Complete, Damaged, OverLimit };
+
+// The same for the archive open at archiveFd (read from its current offset), answering how it
+// ended; archivePath names it in messages.
+ExtractionOutcome extractArchive(int archiveFd, const std::string& archivePath,
+                                 const std::string& destinationDirectory, ExtractionSafety safety,
+                                 const ExtractionLimits& limits, std::string* whyNot);
 
 }  // namespace tavrix::payload

@@ -350,12 +350,12 @@ bool AssetHandler::copyDownloadedBundle(const std::string& source, const std::st
             }
             if (error != 0) {
                 *failure = std::strerror(error);
-                return false;
+                return BundleFill::Refused;
             }
             logCFormat("Removing the directory %s\n", destination.c_str());
-            return true;
+            return BundleFill::Whole;
         },
-        IncompleteBundle::Discard, &whyNot);
+        &whyNot);
     if (!copied) {
         logCFormat("Failed to install %s into %s: %s\n", source.c_str(), destination.c_str(),
                    whyNot.c_str());

@@ -280,7 +280,11 @@ int removeItemTree(const std::string& path) {
     return error.value();
 }
 
-std::optional<std::uint64_t> availableBytesAt(const std::string& path) {
+namespace {
+
+// count blocks of the file system holding path, in bytes.
+template <typename Count>
+std::optional<std::uint64_t> fileSystemBytesAt(const std::string& path, Count count) {
     struct statvfs info {};
     if (::statvfs(path.c_str(), &info) != 0) {
         return std::nullopt;
@@ -288,10 +292,20 @@ std::optional<std::uint64_t> availableBytesAt(const std::string& path) {
     // Block counts are in fragment-size units; older kernels leave that zero.
     auto unit = static_cast<std::uint64_t>(info.f_frsize > 0 ? info.f_frsize : info.f_bsize);
     std::uint64_t bytes = 0;
-    if (__builtin_mul_overflow(unit, static_cast<std::uint64_t>(info.f_bavail), &bytes)) {
+    if (__builtin_mul_overflow(unit, static_cast<std::uint64_t>(count(info)), &bytes)) {
         return UINT64_MAX;
     }
     return bytes;
+}
+
+}  // namespace
+
+std::optional<std::uint64_t> availableBytesAt(const std::string& path) {
+    return fileSystemBytesAt(path, [](const struct statvfs& info) { return info.f_bavail; });
+}
+
+std::optional<std::uint64_t> capacityBytesAt(const std::string& path) {
+    return fileSystemBytesAt(path, [](const struct statvfs& info) { return info.f_blocks; });
 }
 
 void makeDirectoriesWritable(const std::string& path) {

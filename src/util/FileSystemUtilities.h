@@ -61,6 +61,8 @@ int moveItemTree(const std::string& source, const std::string& destination);
 // The bytes an unprivileged writer may still use on the file system holding path, or nothing
 // when it cannot be examined.
 std::optional<std::uint64_t> availableBytesAt(const std::string& path);
+// The size of the file system holding path, in bytes, or nothing when it cannot be read.
+std::optional<std::uint64_t> capacityBytesAt(const std::string& path);
 
 // ---- Merging and attributes ----
 

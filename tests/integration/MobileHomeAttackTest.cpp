@@ -302,7 +302,9 @@ TEST_P(MobileHomeAttackTest, TheDaemonInstallsAndTrustsOnlyItsOwn) {
     enableSupport();
     publishSignedUpdate();
     client().checkForTavrixBundleUpdate();
-    EXPECT_TRUE(pollUntil([&] { return linkedVersion() == "13"; }, 30s));
+    // The carrier file link follows the bundle link: both must have moved.
+    EXPECT_TRUE(
+        pollUntil([&] { return linkedVersion() == "13" && linkState() == "links agree"; }, 30s));
     expectLinked("13");
     expectPreferencesOfTheClient();
     expectNothingWrittenForTheAttacker();
