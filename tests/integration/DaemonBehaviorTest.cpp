@@ -1,6 +1,7 @@
 // The behavior façade as clients see it through the bus: who may set an ID, how it is stored,
 // what decides support, and where behavior settings come from.
 #include "BusFixture.h"
+#include "TestSupport.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix::integration {
@@ -33,6 +34,29 @@ TEST_F(DaemonBehaviorTest, IdIsStoredLowerCasedWhetherOrNotSupportIsEnabled) {
                                                                                  "cole-\xC3\xA4"
                                                                                  "bc"));
     EXPECT_TRUE(caller.setTavrixID(id, std::vector<std::uint8_t>{}));
+}
+
+// An ID longer than the stored limit, or one that cannot be written (here a directory sits where
+// the preferences' lock file goes, as a full disk would fail it), is refused: the client hears NO,
+// and the stored ID is what the status view, the next call and the next launch see.
+TEST_F(DaemonBehaviorTest, IdsThatCannotBeStoredAreRefusedAndTheStoredOneStays) {
+    device().writeDaemonPreferences({{"TavrixID", "abc"}, {"EnableSupport", true}});
+    auto caller = client();
+    EXPECT_FALSE(caller.setTavrixID(std::string(1025, 'x'), std::nullopt));
+    EXPECT_EQ(device().daemonPreference("TavrixID"), std::optional<plist::Value>("abc"));
+
+    const auto lock = at("/var/mobile/Library/Preferences/.com.zandor.tavrixservices.plist.lock");
+    std::filesystem::remove(lock);
+    test::writeText(lock / "in-the-way", "");
+    EXPECT_FALSE(caller.setTavrixID("new", std::nullopt));
+    const plist::Value status(caller.status());
+    EXPECT_EQ(*status.find("BehaviorID"), plist::Value("abc"));
+    EXPECT_TRUE(caller.isTavrixBundleSupported());
+
+    std::filesystem::remove_all(lock);
+    EXPECT_TRUE(caller.setTavrixID(std::string(1024, 'y'), std::nullopt));
+    EXPECT_EQ(device().daemonPreference("TavrixID"),
+              std::optional<plist::Value>(std::string(1024, 'y')));
 }
 
 // Behavior settings (any value, as it is in the file) are read exactly while supported.

@@ -195,10 +195,17 @@ TEST_P(HostilePayloadTest, DaemonKeepsServingAndSoDoesItsNextLaunch) {
     for (const auto& entry : fs::directory_iterator(device().base())) {
         before.insert(entry.path().filename().string());
     }
+    const fs::path previous = device().base() / "hostile-previous";
+    writeBundle(previous, "5", {{"CarrierName", "5"}});
+    ASSERT_TRUE(client().setTavrixID("id-7", pack(previous)));
     ASSERT_TRUE(client().setTavrixID("id-7", hostilePayload(hostile)));
     const std::optional<pid_t> pid = daemonPid();
     ASSERT_TRUE(pid);
     expectServing("after the payload");
+    if (hostile.zeroFileBytes != 0) {
+        // Stopped at a limit before it filled the disk: the bundle before it stays linked.
+        EXPECT_EQ(linkedVersion(), "5");
+    }
 
     ASSERT_EQ(::kill(*pid, SIGTERM), 0);
     EXPECT_EQ(waitForDaemonExit(*pid), std::optional<int>(0));

@@ -188,6 +188,22 @@ TEST_F(PreferencesStoreTest, FailedWritesKeepThePendingValues) {
     }
 }
 
+// The store never writes a file its reader would refuse, nor rewrites one it could not read: the
+// values it holds would be lost to the next reader.
+TEST_F(PreferencesStoreTest, NeverWritesWhatItsReaderRefusesNorOverWhatItCouldNotRead) {
+    const std::string domain = "test.limits";
+    const std::string huge(plist::kMaxPropertyListBytes + 1, 'x');
+    store.setValue("k", Value("small"), domain, kUser);
+    ASSERT_TRUE(store.synchronize(domain, kUser));
+    EXPECT_FALSE(store.storeValue("big", Value(huge), domain, kUser));
+    EXPECT_EQ(readFresh("k", domain), Value("small"));
+    EXPECT_EQ(store.copyValue("big", domain, kUser), std::nullopt);
+
+    test::writeText(domainPath(domain), huge);
+    EXPECT_FALSE(store.storeValue("k", Value("other"), domain, kUser));
+    EXPECT_EQ(fs::file_size(domainPath(domain)), huge.size());
+}
+
 // Writers in two processes, each with two threads sharing one store, add keys of their own to one
 // domain; none may be lost.
 TEST_F(PreferencesStoreTest, ConcurrentWritersLoseNoUpdate) {
