@@ -65,6 +65,12 @@ void UpdateCheckScheduler::startTimer() {
         // A missed check is not run now but pushed a whole interval ahead.
         logObjectFormat("Previous update time present is past, resetting it");
         setUpNewTimer(kUpdateCheckIntervalSeconds);
+    } else if (nextUpdate->secondsSinceReferenceDate >
+               Clock::absoluteTimeNow() + kUpdateCheckIntervalSeconds) {
+        // No check is ever armed further ahead: a date like that was set by a clock that was
+        // wrong, and would hold every check back until then.
+        logObjectFormat("Previous update time is more than an interval ahead, resetting it");
+        setUpNewTimer(kUpdateCheckIntervalSeconds);
     } else {
         scheduleJob();
     }

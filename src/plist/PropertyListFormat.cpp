@@ -5,6 +5,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <bit>
 #include <cctype>
 #include <cerrno>
 #include <cmath>
@@ -18,6 +19,7 @@
 #include "io/AtomicFile.h"
 #include "io/FileIO.h"
 #include "io/UniqueFd.h"
+#include "plist/DateText.h"
 #include "plist/PropertyListWriter.h"
 
 namespace tavrix::plist {
@@ -38,38 +40,119 @@ static_assert(kMaxPropertyListBytes <= std::numeric_limits<std::uint32_t>::max()
               "libplist takes 32-bit lengths");
 constexpr std::int64_t kMicrosPerSecond = 1000000;
 
-// libplist 2.2 keeps whole seconds of XML dates only; the fractions are taken from the date texts,
-// which appear in the document in the same order as libplist's tree holds them.
-std::vector<std::string_view> xmlDateTexts(std::string_view xml) {
+// libplist 2.2 holds dates in 32-bit seconds and keeps whole seconds of XML dates only, so every
+// date is read here instead, in the order libplist's tree holds them: XML ones from their texts,
+// binary ones from their 64-bit values. Nothing when a date cannot be read that way (libplist's
+// own reading is used then).
+std::optional<std::vector<double>> xmlDates(std::string_view xml) {
     static constexpr std::string_view kOpen = "<date>";
     static constexpr std::string_view kClose = "</date>";
-    std::vector<std::string_view> texts;
+    std::vector<double> dates;
     for (std::size_t at = xml.find(kOpen); at != std::string_view::npos; at = xml.find(kOpen, at)) {
         at += kOpen.size();
         std::size_t end = xml.find(kClose, at);
         if (end == std::string_view::npos) {
-            break;
+            return std::nullopt;
         }
-        texts.push_back(xml.substr(at, end - at));
+        std::optional<double> date = parseXmlDateText(xml.substr(at, end - at));
+        if (!date) {
+            return std::nullopt;
+        }
+        dates.push_back(*date);
         at = end + kClose.size();
     }
-    return texts;
+    return dates;
 }
 
-// Microseconds in the fraction of an XML date text such as "2001-01-01T00:00:00.25Z".
-std::int64_t fractionMicros(std::string_view text) {
-    std::size_t dot = text.find('.');
-    if (dot == std::string_view::npos) {
-        return 0;
+// A binary list's dates, depth first from its top object (array items and dictionary values in
+// order), as libplist builds its tree. The bounds check has walked the same structure already;
+// this walk still stops at anything out of place.
+class BinaryDates {
+  public:
+    explicit BinaryDates(std::string_view bytes) : bytes_(bytes) {}
+
+    std::optional<std::vector<double>> read() {
+        if (bytes_.size() < 40) {
+            return std::nullopt;
+        }
+        const std::size_t trailer = bytes_.size() - 32;
+        offsetSize_ = static_cast<unsigned char>(bytes_[trailer + 6]);
+        refSize_ = static_cast<unsigned char>(bytes_[trailer + 7]);
+        objects_ = number(trailer + 8, 8);
+        table_ = number(trailer + 24, 8);
+        if (!visit(number(trailer + 16, 8), 0)) {
+            return std::nullopt;
+        }
+        return std::move(dates_);
     }
-    std::int64_t micros = 0;
-    std::int64_t scale = kMicrosPerSecond / 10;
-    for (std::size_t i = dot + 1; i < text.size() && text[i] >= '0' && text[i] <= '9'; ++i) {
-        micros += (text[i] - '0') * scale;
-        scale /= 10;
+
+  private:
+    std::uint64_t number(std::size_t at, std::size_t size) const {
+        std::uint64_t value = 0;
+        for (std::size_t i = 0; i < size && at + i < bytes_.size(); ++i) {
+            value = (value << 8) | static_cast<unsigned char>(bytes_[at + i]);
+        }
+        return value;
     }
-    return micros;
-}
+
+    bool fits(std::uint64_t at, std::uint64_t size) const {
+        return at <= bytes_.size() && size <= bytes_.size() - at;
+    }
+
+    bool visit(std::uint64_t object, int depth) {
+        if (depth > kMaxDepth || object >= objects_ || offsetSize_ == 0 || refSize_ == 0 ||
+            !fits(table_ + object * offsetSize_, offsetSize_)) {
+            return false;
+        }
+        const std::uint64_t at = number(table_ + object * offsetSize_, offsetSize_);
+        if (!fits(at, 1)) {
+            return false;
+        }
+        const auto marker = static_cast<unsigned char>(bytes_[at]);
+        const unsigned kind = marker >> 4;
+        if (kind == 0x3) {
+            if (!fits(at + 1, 8)) {
+                return false;
+            }
+            dates_.push_back(std::bit_cast<double>(number(at + 1, 8)));
+            return true;
+        }
+        if (kind < 0xA || kind > 0xD) {
+            return true;
+        }
+        std::uint64_t count = marker & 0x0F;
+        std::uint64_t contents = at + 1;
+        if (count == 0x0F) {
+            if (!fits(contents, 1)) {
+                return false;
+            }
+            const std::size_t size = std::size_t{1} << (bytes_[contents] & 0x0F);
+            if (size > 8 || !fits(contents + 1, size)) {
+                return false;
+            }
+            count = number(contents + 1, size);
+            contents += 1 + size;
+        }
+        // A dictionary's keys come first; only its values can be dates.
+        const std::uint64_t first = kind == 0xD ? count : 0;
+        if (count > objects_ || !fits(contents, (first + count) * refSize_)) {
+            return false;
+        }
+        for (std::uint64_t i = 0; i < count; ++i) {
+            if (!visit(number(contents + (first + i) * refSize_, refSize_), depth + 1)) {
+                return false;
+            }
+        }
+        return true;
+    }
+
+    std::string_view bytes_;
+    unsigned offsetSize_ = 0;
+    unsigned refSize_ = 0;
+    std::uint64_t objects_ = 0;
+    std::uint64_t table_ = 0;
+    std::vector<double> dates_;
+};
 
 // Strings are UTF-8 text; bytes that are not cannot be written back as XML, so such a string makes
 // the document damaged.
@@ -175,8 +258,7 @@ std::size_t countDates(plist_t node, int depth) {
 
 class NodeReader {
   public:
-    explicit NodeReader(std::vector<std::string_view> dateTexts)
-        : dateTexts_(std::move(dateTexts)) {}
+    explicit NodeReader(std::vector<double> exactDates) : exactDates_(std::move(exactDates)) {}
 
     std::optional<Value> read(plist_t node, int depth) {
         if (depth > kMaxDepth || node == nullptr) {
@@ -228,8 +310,8 @@ class NodeReader {
                 if (seconds < 0) {
                     micros = -micros;
                 }
-                if (nextDate_ < dateTexts_.size()) {
-                    micros += static_cast<int32_t>(fractionMicros(dateTexts_[nextDate_++]));
+                if (nextDate_ < exactDates_.size()) {
+                    return Value(Date{exactDates_[nextDate_++]});
                 }
                 return Value(dateFromParts(seconds, micros));
             }
@@ -285,7 +367,7 @@ class NodeReader {
         return Value(std::move(dictionary));
     }
 
-    std::vector<std::string_view> dateTexts_;
+    std::vector<double> exactDates_;
     std::size_t nextDate_ = 0;
 };
 
@@ -330,14 +412,11 @@ std::optional<Value> parse(std::string_view bytes, Refusal* refusal) {
     if (!root) {
         return refuse("it is not a property list");
     }
-    std::vector<std::string_view> dateTexts;
-    if (!binary) {
-        dateTexts = xmlDateTexts(bytes);
-        if (!dateTexts.empty() && dateTexts.size() != countDates(root.get(), 0)) {
-            dateTexts.clear();
-        }
+    std::optional<std::vector<double>> dates = binary ? BinaryDates(bytes).read() : xmlDates(bytes);
+    if (!dates || dates->size() != countDates(root.get(), 0)) {
+        dates.emplace();
     }
-    auto value = NodeReader(std::move(dateTexts)).read(root.get(), 0);
+    auto value = NodeReader(std::move(*dates)).read(root.get(), 0);
     if (!value) {
         return refuse("it holds text that is not UTF-8 or a damaged dictionary");
     }

@@ -10,23 +10,14 @@
 #include <unordered_map>
 #include <vector>
 
+#include "plist/DateText.h"
+
 namespace tavrix::plist {
 namespace {
 
 // Strings and keys end at a NUL character: neither format's readers can hold one.
 std::string_view textOf(const std::string& text) {
     return std::string_view(text.data(), ::strnlen(text.data(), text.size()));
-}
-
-// Date seconds as both formats' readers hold them (32-bit seconds in libplist); later or earlier
-// dates are clamped to that range.
-double clampedSeconds(double seconds) {
-    constexpr double kMin = static_cast<double>(INT32_MIN);
-    constexpr double kMax = static_cast<double>(INT32_MAX);
-    if (!(seconds >= kMin)) {
-        return kMin;
-    }
-    return seconds > kMax ? kMax : seconds;
 }
 
 constexpr char kBase64[] = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
@@ -128,7 +119,7 @@ class XmlWriter {
                 out_.append(*value.asBoolean() ? "<true/>\n" : "<false/>\n");
                 return;
             case Type::Date:
-                element(depth, "date", dateText(*value.asDate()));
+                element(depth, "date", xmlDateText(value.asDate()->secondsSinceReferenceDate));
                 return;
             case Type::Data:
                 data(*value.asData(), depth);
@@ -146,16 +137,6 @@ class XmlWriter {
         // The shortest text that reads back as the same double.
         auto end = std::to_chars(number_, number_ + sizeof number_, real).ptr;
         return std::string_view(number_, end - number_);
-    }
-
-    std::string_view dateText(const Date& date) {
-        auto seconds =
-            static_cast<std::time_t>(std::floor(clampedSeconds(date.secondsSinceReferenceDate))) +
-            static_cast<std::time_t>(Date::kUnixEpochOffset);
-        std::tm parts{};
-        ::gmtime_r(&seconds, &parts);
-        std::size_t length = std::strftime(number_, sizeof number_, "%Y-%m-%dT%H:%M:%SZ", &parts);
-        return std::string_view(number_, length);
     }
 
     void data(const Data& bytes, int depth) {
@@ -408,7 +389,7 @@ class BinaryWriter {
             case Type::Date:
                 out_.push_back(0x33);
                 bigEndian(std::bit_cast<std::uint64_t>(
-                              clampedSeconds(value.asDate()->secondsSinceReferenceDate)),
+                              clampedDateSeconds(value.asDate()->secondsSinceReferenceDate)),
                           8);
                 return;
             case Type::Data: {

@@ -74,15 +74,21 @@ TEST(PropertyListXml, ReadsValuesWrittenByOthers) {
     EXPECT_EQ(xml.rfind("<?xml", 0), 0u);
 }
 
+// Dates far from the reference date (past 2038, before 1901) keep their value on every machine;
+// beyond year 9999, which the XML form cannot spell, they are clamped.
 TEST(PropertyListDates, XmlHoldsWholeSecondsAndBinaryKeepsFractions) {
     for (auto [seconds, text] : {std::pair{123456.75, "2001-01-02T10:17:36Z"},
-                                 std::pair{-86400.25, "2000-12-30T23:59:59Z"}}) {
+                                 std::pair{-86400.25, "2000-12-30T23:59:59Z"},
+                                 std::pair{3124137600.5, "2100-01-01T00:00:00Z"},
+                                 std::pair{-6328670400.0, "1800-06-15T12:00:00Z"}}) {
         Value date(Date{seconds});
         std::string xml = serialize(date, Format::Xml);
         EXPECT_NE(xml.find(std::string("<date>") + text + "</date>"), std::string::npos) << xml;
         EXPECT_EQ(parse(xml), Value(Date{std::floor(seconds)}));
         EXPECT_EQ(parse(serialize(date, Format::Binary)), date);
     }
+    EXPECT_NE(serialize(Value(Date{1e15})).find("<date>9999-12-31T23:59:59Z</date>"),
+              std::string::npos);
 }
 
 // Other programs read what this one writes: Python's plistlib and libplist's own converter each

@@ -69,8 +69,8 @@ class UpdateCheckSchedulerTest : public testing::Test {
     std::string runtime_;
 };
 
-// A stored time still ahead is kept; none, a mistyped one or a past one is replaced by one 15 days
-// ahead, and a missed check does not run now. Exactly one job exists throughout.
+// A stored time still ahead (by at most 15 days) is kept; none, a mistyped one, a past one or one
+// further ahead is replaced by one 15 days ahead, and a missed check does not run now. Exactly one job exists throughout.
 TEST_F(UpdateCheckSchedulerTest, ArmsFifteenDaysAheadUnlessAFutureTimeIsStored) {
     enableSupport(true);
     UpdateCheckScheduler& scheduler = UpdateCheckScheduler::sharedInstance();
@@ -87,6 +87,11 @@ TEST_F(UpdateCheckSchedulerTest, ArmsFifteenDaysAheadUnlessAFutureTimeIsStored) 
     expectArmedFifteenDaysAhead();
 
     setNextUpdate(Clock::absoluteTimeNow() - 600.0);
+    scheduler.startTimer();
+    expectArmedFifteenDaysAhead();
+
+    // Years ahead (a clock that was once wrong) would hold every check back until then.
+    setNextUpdate(Clock::absoluteTimeNow() + 20 * 365 * 86400.0);
     scheduler.startTimer();
     expectArmedFifteenDaysAhead();
 }
