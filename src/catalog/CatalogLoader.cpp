@@ -29,8 +29,8 @@ bool isSigned(const AssetTypeSettings& settings) {
     return !settings.trustedKeys.empty();
 }
 
-// The catalog and its signature share one time budget: the whole fetch is what a waiting update
-// check feels.
+// The catalog and its signature, and a second fetch of both, share one time budget: the whole
+// load is what a waiting update check feels.
 class FetchDeadline {
   public:
     explicit FetchDeadline(long seconds)
@@ -46,11 +46,11 @@ class FetchDeadline {
 };
 
 std::optional<SignedCatalog> fetchFromServer(const AssetTypeSettings& settings,
+                                             const FetchDeadline& deadline,
                                              CatalogRefusal& refusal) {
     std::string error;
     SignedCatalog catalog;
     const AssetLimits& limits = settings.limits;
-    FetchDeadline deadline(limits.catalogTimeoutSeconds);
     std::optional<std::string> bytes =
         http::fetchHttpBody(settings.catalogURL, kMaxCatalogBytes,
                             limits.catalogTransfer(deadline.remainingMilliseconds()), error);
@@ -109,6 +109,7 @@ void recordSerial(const AssetTypeSettings& settings, std::int64_t serial,
 }
 
 std::optional<std::vector<CatalogEntry>> loadOnce(const AssetTypeSettings& settings, bool localOnly,
+                                                  const FetchDeadline& deadline,
                                                   CatalogRefusal& refusal) {
     if (!isSigned(settings) && !settings.allowUnsigned) {
         refusal = {CatalogRefusalKind::UnsignedNotAllowed, "no trusted key is configured for " +
@@ -129,7 +130,7 @@ std::optional<std::vector<CatalogEntry>> loadOnce(const AssetTypeSettings& setti
                 plist::readFileBytes(path + kCatalogSignatureSuffix).value_or(std::string());
         }
     } else {
-        catalog = fetchFromServer(settings, refusal);
+        catalog = fetchFromServer(settings, deadline, refusal);
         if (!catalog) {
             return std::nullopt;
         }
@@ -178,11 +179,15 @@ std::optional<std::vector<CatalogEntry>> loadOnce(const AssetTypeSettings& setti
 std::optional<std::vector<CatalogEntry>> loadCatalogEntries(const AssetTypeSettings& settings,
                                                             bool localOnly,
                                                             CatalogRefusal& refusal) {
-    std::optional<std::vector<CatalogEntry>> entries = loadOnce(settings, localOnly, refusal);
+    const FetchDeadline deadline(settings.limits.catalogTimeoutSeconds);
+    std::optional<std::vector<CatalogEntry>> entries =
+        loadOnce(settings, localOnly, deadline, refusal);
     // A publisher replaces the signature just before the catalog, so a fetch that falls between
-    // the two sees a pair that does not match; fetching again settles it.
-    if (!entries && !localOnly && refusal.kind() == CatalogRefusalKind::BadSignature) {
-        entries = loadOnce(settings, localOnly, refusal);
+    // the two sees a pair that does not match; fetching again settles it, within what is left of
+    // the same budget.
+    if (!entries && !localOnly && refusal.kind() == CatalogRefusalKind::BadSignature &&
+        deadline.remainingMilliseconds() > 0) {
+        entries = loadOnce(settings, localOnly, deadline, refusal);
     }
     return entries;
 }

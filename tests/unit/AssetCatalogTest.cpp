@@ -382,6 +382,19 @@ TEST_F(AssetCatalogTest, FetchCaughtBetweenSignatureAndCatalogReplacementTriesAg
               (plist::Dictionary{{"Version", plist::Value("2.0")}}));
 }
 
+// The second try has only what the first one left of the time budget: a slow catalog whose
+// signature fails holds a waiting check for one budget, not two.
+TEST_F(AssetCatalogTest, ASecondTryGetsOnlyWhatIsLeftOfTheTimeBudget) {
+    test::makeBundle(work / "b/Default.bundle", "1.0", {{"a.plist", "one"}});
+    tool({"publish", work / "out", "--key", work / "secret.key", work / "b/Default.bundle"});
+    writeSettings(publicKey, {{kSettingsCatalogTimeoutKey, plist::Value(3)}});
+    LocalHttpServer::Response slow = bodyResponse(readText(out("catalog.plist")) + "\n");
+    slow.trickleBytesPerSecond = slow.body.size() / 3 + 1;  // about two seconds
+    server.serve("/catalog/catalog.plist", slow);
+    EXPECT_FALSE(query().has_value());
+    EXPECT_EQ(logLinesContaining("cannot fetch it"), 1u);
+}
+
 // A staged rollout shows an asset to the devices under its percentage, the same ones each time,
 // and a higher percentage keeps every device a lower one had.
 TEST_F(AssetCatalogTest, RolloutsAreStablePerDevice) {

@@ -70,7 +70,8 @@ class UpdateCheckSchedulerTest : public testing::Test {
 };
 
 // A stored time still ahead (by at most 15 days) is kept; none, a mistyped one, a past one or one
-// further ahead is replaced by one 15 days ahead, and a missed check does not run now. Exactly one job exists throughout.
+// further ahead is replaced by one 15 days ahead, and a missed check does not run now. Exactly one
+// job exists throughout.
 TEST_F(UpdateCheckSchedulerTest, ArmsFifteenDaysAheadUnlessAFutureTimeIsStored) {
     enableSupport(true);
     UpdateCheckScheduler& scheduler = UpdateCheckScheduler::sharedInstance();
