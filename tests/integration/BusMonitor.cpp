@@ -1,12 +1,14 @@
 #include "BusMonitor.h"
 
 #include <fcntl.h>
+#include <gtest/gtest.h>
 #include <poll.h>
 #include <signal.h>
 #include <spawn.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <stdexcept>
 
@@ -111,6 +113,39 @@ std::optional<nlohmann::json> BusMonitor::next(
             return std::nullopt;
         }
     }
+}
+
+std::optional<nlohmann::json> BusMonitor::waitForStatus(const nlohmann::json& expected,
+                                                        std::chrono::milliseconds timeout) {
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    nlohmann::json announced = nlohmann::json::object();
+    auto complete = [&] {
+        for (const auto& [name, value] : expected.items()) {
+            if (!announced.contains(name) || announced[name] != value) {
+                return false;
+            }
+        }
+        return true;
+    };
+    while (!complete()) {
+        const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+            deadline - std::chrono::steady_clock::now());
+        auto message = next([](const nlohmann::json& m) { return changedStatus(m).has_value(); },
+                            std::max(left, 0ms));
+        if (!message) {
+            ADD_FAILURE() << "announced " << announced.dump() << ", expected " << expected.dump();
+            return std::nullopt;
+        }
+        announced.update(*changedStatus(*message));
+    }
+    return announced;
+}
+
+std::optional<nlohmann::json> BusMonitor::nextCheckFinished(std::chrono::milliseconds timeout) {
+    auto message = next(
+        [](const nlohmann::json& m) { return statusSignal(m, "UpdateCheckFinished").has_value(); },
+        timeout);
+    return message ? statusSignal(*message, "UpdateCheckFinished") : std::nullopt;
 }
 
 std::optional<nlohmann::json> BusMonitor::changedStatus(const nlohmann::json& message) {

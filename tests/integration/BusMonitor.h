@@ -34,6 +34,15 @@ class BusMonitor {
     // A PropertiesChanged of the daemon's status interface: its changed values as busctl's JSON
     // ("BehaviorID" to "acme.default", "Supported" to true), or nothing for other messages.
     static std::optional<nlohmann::json> changedStatus(const nlohmann::json& message);
+    // Follows PropertiesChanged of the status until each expected value has been announced
+    // (changes may come in more than one signal): what was announced since the call, or nothing
+    // (a test failure) when the wait ran out.
+    std::optional<nlohmann::json> waitForStatus(
+        const nlohmann::json& expected,
+        std::chrono::milliseconds timeout = std::chrono::seconds(30));
+    // The arguments of the next UpdateCheckFinished, or nothing when none came within timeout.
+    std::optional<nlohmann::json> nextCheckFinished(std::chrono::milliseconds timeout);
+
     // The arguments of a signal of the status interface named member, or nothing.
     static std::optional<nlohmann::json> statusSignal(const nlohmann::json& message,
                                                       const std::string& member);

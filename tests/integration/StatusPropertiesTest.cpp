@@ -67,31 +67,6 @@ print(json.dumps([bool(answer[0]), bool(answer[1]), str(answer[2])])))",
         EXPECT_EQ(all.status, 0) << all.output;
         return json::parse(all.output)["data"][0];
     }
-
-    // Follows PropertiesChanged until every expected value has been announced (changes may come
-    // in more than one signal); what was announced, or nothing when the wait ran out.
-    std::optional<json> waitForAnnounced(BusMonitor& monitor, const json& expected) {
-        json announced = json::object();
-        auto complete = [&] {
-            for (const auto& [name, value] : expected.items()) {
-                if (!announced.contains(name) || announced[name] != value) {
-                    return false;
-                }
-            }
-            return true;
-        };
-        while (!complete()) {
-            auto message = monitor.next(
-                [](const json& m) { return BusMonitor::changedStatus(m).has_value(); }, 30s);
-            if (!message) {
-                ADD_FAILURE() << "announced " << announced.dump() << ", expected "
-                              << expected.dump();
-                return std::nullopt;
-            }
-            announced.update(*BusMonitor::changedStatus(*message));
-        }
-        return announced;
-    }
 };
 
 // Read before any set (which starts the daemon), then a bundle by descriptor: the properties and
@@ -119,12 +94,12 @@ TEST_F(StatusPropertiesTest, PropertiesAnnounceEachChangeAndTakeABundleByDescrip
     EXPECT_EQ(json::parse(set.output),
               json({true, true,
                     "extracted " + std::to_string(packed.size()) + " bytes into the user bundle"}));
-    auto announced = waitForAnnounced(monitor, {{"BehaviorID", "acme.default"},
-                                                {"Supported", true},
-                                                {"WhyNotSupported", ""},
-                                                {"LinkedBundleVersion", "1"},
-                                                {"UserBundleVersion", "1"},
-                                                {"LastPayloadExtracted", true}});
+    auto announced = monitor.waitForStatus({{"BehaviorID", "acme.default"},
+                                            {"Supported", true},
+                                            {"WhyNotSupported", ""},
+                                            {"LinkedBundleVersion", "1"},
+                                            {"UserBundleVersion", "1"},
+                                            {"LastPayloadExtracted", true}});
     ASSERT_TRUE(announced);
     EXPECT_GT((*announced)["LastPayloadUSec"].get<std::uint64_t>(), 0u);
     EXPECT_EQ((*announced)["LinkedBundlePath"], at(kUserBundle).string());
@@ -144,7 +119,7 @@ TEST_F(StatusPropertiesTest, PropertiesAnnounceEachChangeAndTakeABundleByDescrip
     CommandResult broken = sendBundle("acme.default", "pipe", garbage);
     EXPECT_EQ(broken.status, 0) << broken.output;
     EXPECT_EQ(json::parse(broken.output)[1], false) << broken.output;
-    announced = waitForAnnounced(monitor, {{"LastPayloadExtracted", false}});
+    announced = monitor.waitForStatus({{"LastPayloadExtracted", false}});
     ASSERT_TRUE(announced);
     EXPECT_NE((*announced)["LastPayloadReason"], "");
 
@@ -161,14 +136,8 @@ TEST_F(StatusPropertiesTest, PropertiesAnnounceEachChangeAndTakeABundleByDescrip
     CommandResult check = busctl("call " + std::string(kDaemonBusName) + " " + kDaemonObjectPath +
                                  " " + kDaemonInterface + " CheckForTavrixBundleUpdate");
     EXPECT_EQ(check.output, "b false\n");
-    ASSERT_TRUE(waitForAnnounced(monitor, {{"LastCheckOutcome", "no-catalog"}}));
-    auto finished = monitor.next(
-        [](const json& m) {
-            return BusMonitor::statusSignal(m, "UpdateCheckFinished").has_value();
-        },
-        10s);
-    ASSERT_TRUE(finished);
-    EXPECT_EQ(finished->at("payload").at("data"), json({"no-catalog", "no catalog configured"}));
+    ASSERT_TRUE(monitor.waitForStatus({{"LastCheckOutcome", "no-catalog"}}));
+    EXPECT_EQ(monitor.nextCheckFinished(10s), json({"no-catalog", "no catalog configured"}));
 }
 
 }  // namespace
