@@ -4,6 +4,8 @@
 // mistake exit status 2.
 #include <fcntl.h>
 #include <signal.h>
+#include <sys/mman.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -18,10 +20,12 @@
 #include <functional>
 #include <initializer_list>
 #include <limits>
+#include <memory>
 #include <optional>
 #include <string>
 #include <string_view>
-#include <thread>
+#include <tuple>
+#include <utility>
 #include <vector>
 
 #include "TavrixctlOutput.h"
@@ -39,9 +43,6 @@ namespace plist = tavrix::plist;
 
 constexpr int kFailure = 1;
 constexpr int kUsage = 2;
-
-// How often check-update --wait asks how the check is going.
-constexpr std::chrono::milliseconds kStatusPollInterval{100};
 
 constexpr const char* kOverallHelp =
     "usage: tavrixctl [--address ADDRESS] [--json] COMMAND [ARGUMENTS]\n"
@@ -83,9 +84,12 @@ constexpr Command kCommands[] = {
     {"set-id",
      "usage: tavrixctl set-id ID [--bundle FILE]\n"
      "\n"
-     "Sets the behavior ID (the daemon stores it lower-cased). With --bundle, FILE is a\n"
-     "gzip- or compress-compressed tar or cpio archive sent as the behavior bundle.\n"
-     "Prints \"yes\" when the daemon accepted the ID, \"no\" when it refused it.\n"},
+     "Sets the behavior ID (the daemon stores it lower-cased). With --bundle, FILE (\"-\" for\n"
+     "standard input, a file or a finished pipe) is a gzip- or compress-compressed tar or\n"
+     "cpio archive the daemon reads as the behavior bundle.\n"
+     "Prints \"yes\" when the daemon accepted the ID, \"no\" when it refused it; with a\n"
+     "bundle, then what became of it (\"extracted N bytes into the user bundle\", or why not),\n"
+     "and exits 1 when it was not extracted.\n"},
     {"supported",
      "usage: tavrixctl supported\n"
      "\n"
@@ -185,19 +189,29 @@ std::optional<double> parseSeconds(const std::string& text) {
     return value;
 }
 
-std::vector<std::uint8_t> readWholeFile(const std::string& path) {
-    tavrix::io::UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
-    if (!fd) {
+// The bundle as a descriptor the daemon takes: a regular file as it is; anything else (a pipe
+// still being written, a terminal) copied whole into a memory file first, since the daemon never
+// waits for a writer.
+tavrix::io::UniqueFd openBundle(const std::string& path) {
+    tavrix::io::UniqueFd fd(path == "-" ? ::fcntl(STDIN_FILENO, F_DUPFD_CLOEXEC, 0)
+                                        : ::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    struct stat info {};
+    if (!fd || ::fstat(fd.get(), &info) != 0) {
         throw Failure{"cannot read " + path + ": " + std::strerror(errno)};
     }
-    std::vector<std::uint8_t> bytes;
-    if (int error = tavrix::io::readChunks(fd.get(), [&bytes](std::string_view chunk) {
-            bytes.insert(bytes.end(), chunk.begin(), chunk.end());
-            return 0;
+    if (S_ISREG(info.st_mode)) {
+        return fd;
+    }
+    tavrix::io::UniqueFd copy(::memfd_create("bundle", MFD_CLOEXEC));
+    if (!copy) {
+        throw Failure{std::string("cannot make a memory file: ") + std::strerror(errno)};
+    }
+    if (int error = tavrix::io::readChunks(fd.get(), [&copy](std::string_view chunk) {
+            return tavrix::io::writeAll(copy.get(), chunk);
         })) {
         throw Failure{"cannot read " + path + ": " + std::strerror(error)};
     }
-    return bytes;
+    return copy;
 }
 
 // The arguments of one command, with the command's own options taken out.
@@ -415,46 +429,47 @@ int watch(TavrixClient& client, std::optional<long long> count,
     return 0;
 }
 
-// The update is installed after the answer, on the daemon's own time; the status view's last
-// check says how it went, and waiting watches it until it is no longer downloading.
+// The update is installed after the answer, on the daemon's own time. A check that did not start
+// a download has ended: the status view's last check says how. Waiting for one that did follows
+// the daemon's UpdateCheckFinished, subscribed before asking so that a quick end is not missed.
 int checkUpdate(TavrixClient& client, std::optional<std::chrono::milliseconds> wait) {
+    std::optional<std::pair<std::string, std::string>> finished;
+    auto subscription =
+        client.subscribeCheckFinished([&](const std::string& outcome, const std::string& reason) {
+            finished.emplace(outcome, reason);
+        });
     const bool started = client.checkForTavrixBundleUpdate();
-    auto lastCheck = [&client] {
-        plist::Dictionary status = client.status();
-        auto check = status.find("LastCheck");
-        return check != status.end() && check->second.asDictionary() != nullptr
-                   ? *check->second.asDictionary()
-                   : plist::Dictionary();
-    };
-    auto textOf = [](const plist::Dictionary& check, const char* key) {
-        auto found = check.find(key);
-        return found != check.end() && found->second.asString() != nullptr
-                   ? *found->second.asString()
-                   : std::string();
-    };
-    plist::Dictionary check = lastCheck();
+    std::string outcome;
+    std::string reason;
     if (started && wait) {
         if (!jsonOutput) {
             printBoolean(started, "started");
             std::fflush(stdout);
         }
-        const auto deadline = std::chrono::steady_clock::now() + *wait;
-        while (textOf(check, "Outcome") == "downloading") {
-            if (std::chrono::steady_clock::now() >= deadline) {
-                char seconds[32];
-                std::snprintf(seconds, sizeof seconds, "%g",
-                              static_cast<double>(wait->count()) / 1000);
-                throw Failure{std::string("check-update: still downloading after ") + seconds +
-                              " seconds"};
-            }
-            std::this_thread::sleep_for(kStatusPollInterval);
-            check = lastCheck();
+        if (!client.runUntil([&] { return finished.has_value(); }, *wait)) {
+            char seconds[32];
+            std::snprintf(seconds, sizeof seconds, "%g", static_cast<double>(wait->count()) / 1000);
+            throw Failure{std::string("check-update: still downloading after ") + seconds +
+                          " seconds"};
         }
-    } else if (!jsonOutput) {
-        printBoolean(started, "started");
+        std::tie(outcome, reason) = *finished;
+    } else {
+        if (!jsonOutput) {
+            printBoolean(started, "started");
+        }
+        plist::Dictionary status = client.status();
+        auto check = status.find("LastCheck");
+        const plist::Dictionary* last =
+            check != status.end() ? check->second.asDictionary() : nullptr;
+        auto textOf = [last](const char* key) {
+            auto found = last != nullptr ? last->find(key) : plist::Dictionary::const_iterator();
+            return last != nullptr && found != last->end() && found->second.asString() != nullptr
+                       ? *found->second.asString()
+                       : std::string();
+        };
+        outcome = textOf("Outcome");
+        reason = outcome.empty() ? "no check recorded" : textOf("Reason");
     }
-    const std::string outcome = textOf(check, "Outcome");
-    const std::string reason = outcome.empty() ? "no check recorded" : textOf(check, "Reason");
     if (jsonOutput) {
         plist::Dictionary answer{{"started", plist::Value(started)},
                                  {"outcome", plist::Value(outcome)},
@@ -464,6 +479,21 @@ int checkUpdate(TavrixClient& client, std::optional<std::chrono::milliseconds> w
         std::printf("%s\n", reason.c_str());
     }
     return checkSucceeded(outcome, started && wait.has_value()) ? 0 : kFailure;
+}
+
+// The ID is accepted whatever becomes of the payload; the payload's outcome decides the exit.
+int setIDWithBundle(TavrixClient& client, const std::string& id, int fd) {
+    const tavrix::client::PayloadResult result = client.setTavrixIDWithBundleFile(id, fd);
+    if (jsonOutput) {
+        plist::Dictionary answer{{"accepted", plist::Value(result.accepted)},
+                                 {"extracted", plist::Value(result.extracted)},
+                                 {"reason", plist::Value(result.reason)}};
+        std::printf("%s\n", tavrix::tools::toJson(plist::Value(std::move(answer))).c_str());
+    } else {
+        printBoolean(result.accepted, "accepted");
+        std::printf("%s\n", result.reason.c_str());
+    }
+    return result.extracted ? 0 : kFailure;
 }
 
 Action parseWatch(Arguments& arguments) {
@@ -492,13 +522,16 @@ Action parseCommand(const Command& command, Arguments& arguments) {
     if (name == "set-id") {
         auto file = arguments.takeOption("--bundle");
         auto id = arguments.operands({"ID"})[0];
-        std::optional<std::vector<std::uint8_t>> bundle;
-        if (file) {
-            bundle = readWholeFile(*file);
+        if (!file) {
+            return [id](TavrixClient& client) {
+                printBoolean(client.setTavrixID(id, std::nullopt), "accepted");
+                return 0;
+            };
         }
-        return [id, bundle = std::move(bundle)](TavrixClient& client) {
-            printBoolean(client.setTavrixID(id, bundle), "accepted");
-            return 0;
+        // The daemon reads the file itself; "-" is standard input.
+        auto bundle = std::make_shared<tavrix::io::UniqueFd>(openBundle(*file));
+        return [id, bundle](TavrixClient& client) {
+            return setIDWithBundle(client, id, bundle->get());
         };
     }
     if (name == "supported") {

@@ -52,6 +52,7 @@ struct Deliveries {
 
 struct NotificationSubscription::Target {
     NotificationHandler handler;
+    CheckFinishedHandler checkHandler;
     std::shared_ptr<Deliveries> deliveries;
     // Last, so that it is released before what it points to.
     bus::BusSlotPtr slot;
@@ -93,6 +94,24 @@ int onPosted(sd_bus_message* message, void* userdata, sd_bus_error* /*error*/) {
     try {
         ++target->deliveries->count;
         target->handler(name);
+    } catch (...) {
+        if (!target->deliveries->failure) {
+            target->deliveries->failure = std::current_exception();
+        }
+    }
+    return 0;
+}
+
+int onCheckFinished(sd_bus_message* message, void* userdata, sd_bus_error* /*error*/) {
+    auto* target = static_cast<NotificationSubscription::Target*>(userdata);
+    const char* outcome = nullptr;
+    const char* reason = nullptr;
+    if (sd_bus_message_read(message, "ss", &outcome, &reason) <= 0) {
+        return 0;
+    }
+    try {
+        ++target->deliveries->count;
+        target->checkHandler(outcome, reason);
     } catch (...) {
         if (!target->deliveries->failure) {
             target->deliveries->failure = std::current_exception();
@@ -238,6 +257,21 @@ bool TavrixClient::setTavrixID(const std::string& tavrixID,
     return call.sendForBoolean(state_->bus.get());
 }
 
+PayloadResult TavrixClient::setTavrixIDWithBundleFile(const std::string& tavrixID, int fd) {
+    Call call(state_->bus.get(), "SetTavrixIDWithBundleFD");
+    call.appendString(tavrixID, "behavior ID");
+    call.check(sd_bus_message_append_basic(call.message(), 'h', &fd), "cannot pass the bundle");
+    BusMessagePtr reply = call.send(state_->bus.get(), "bbs");
+    int accepted = 0;
+    int extracted = 0;
+    const char* reason = nullptr;
+    int r = sd_bus_message_read(reply.get(), "bbs", &accepted, &extracted, &reason);
+    if (r < 0) {
+        call.fail("malformed reply: " + errnoText(r));
+    }
+    return {accepted != 0, extracted != 0, reason != nullptr ? reason : ""};
+}
+
 bool TavrixClient::isTavrixBundleSupported() {
     return Call(state_->bus.get(), "IsTavrixBundleSupported").sendForBoolean(state_->bus.get());
 }
@@ -280,6 +314,24 @@ NotificationSubscription TavrixClient::subscribe(NotificationHandler handler) {
     target->slot.reset(raw);
     if (r < 0) {
         throw ClientError("cannot subscribe to notifications: " + errnoText(r));
+    }
+    NotificationSubscription subscription;
+    subscription.target_ = std::move(target);
+    return subscription;
+}
+
+NotificationSubscription TavrixClient::subscribeCheckFinished(CheckFinishedHandler handler) {
+    auto target = std::make_unique<NotificationSubscription::Target>();
+    target->checkHandler = std::move(handler);
+    target->deliveries = state_->deliveries;
+    const std::string rule = std::string("type='signal',sender='") + kServiceName + "',path='" +
+                             kObjectPath + "',interface='" + kStatusInterface +
+                             "',member='UpdateCheckFinished'";
+    sd_bus_slot* raw = nullptr;
+    int r = sd_bus_add_match(state_->bus.get(), &raw, rule.c_str(), onCheckFinished, target.get());
+    target->slot.reset(raw);
+    if (r < 0) {
+        throw ClientError("cannot subscribe to update checks: " + errnoText(r));
     }
     NotificationSubscription subscription;
     subscription.target_ = std::move(target);

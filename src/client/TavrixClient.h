@@ -36,6 +36,17 @@ class ClientError : public std::runtime_error {
 };
 
 using NotificationHandler = std::function<void(const std::string& name)>;
+// The end of an update check: its outcome ("installed", "up-to-date", "catalog-refused", ...) and
+// one-line reason.
+using CheckFinishedHandler =
+    std::function<void(const std::string& outcome, const std::string& reason)>;
+
+// What became of a behavior ID set with a bundle.
+struct PayloadResult {
+    bool accepted = false;   // false only on a device with a cellular radio
+    bool extracted = false;  // the bundle was unpacked into the user bundle
+    std::string reason;      // "extracted N bytes into the user bundle", or why not
+};
 
 // Keeps a notification handler registered; destroying (or resetting) it unsubscribes.
 class NotificationSubscription {
@@ -75,6 +86,10 @@ class TavrixClient {
     // Sets the behavior ID with an optional packed bundle; false when the daemon refused.
     bool setTavrixID(const std::string& tavrixID,
                      const std::optional<std::vector<std::uint8_t>>& bundle);
+    // Sets the behavior ID with the packed bundle the daemon reads from fd: a regular file (read
+    // whole from its start) or a pipe whose writer has written everything and closed it. The
+    // descriptor stays the caller's. A descriptor the daemon refuses throws, and nothing is set.
+    PayloadResult setTavrixIDWithBundleFile(const std::string& tavrixID, int fd);
     bool isTavrixBundleSupported();
     // The behavior setting for key, or nothing when there is none.
     std::optional<plist::Value> copyTavrixValue(const std::string& key);
@@ -88,6 +103,9 @@ class TavrixClient {
     // Handlers run inside processFor and runUntil; an exception a handler throws comes out of
     // those.
     NotificationSubscription subscribe(NotificationHandler handler);
+    // Calls handler at the end of every update check from now on (the daemon's
+    // UpdateCheckFinished), while the subscription lives; delivered as notifications are.
+    NotificationSubscription subscribeCheckFinished(CheckFinishedHandler handler);
 
     // Handles incoming messages for the given time; true when a notification was delivered.
     bool processFor(std::chrono::milliseconds duration);
