@@ -36,6 +36,27 @@ std::string describeFailure(const BusError& error, int r) {
     return text;
 }
 
+ErrorCategory categoryOfError(const std::string& name, int r) {
+    if (name.empty()) {
+        return r == -ETIMEDOUT ? ErrorCategory::Timeout : ErrorCategory::Connection;
+    }
+    if (name == SD_BUS_ERROR_ACCESS_DENIED) {
+        return ErrorCategory::AccessDenied;
+    }
+    if (name == SD_BUS_ERROR_INVALID_ARGS) {
+        return ErrorCategory::InvalidArguments;
+    }
+    if (name == SD_BUS_ERROR_NO_REPLY || name == SD_BUS_ERROR_TIMEOUT ||
+        name == "org.freedesktop.DBus.Error.TimedOut") {
+        return ErrorCategory::Timeout;
+    }
+    if (name == SD_BUS_ERROR_SERVICE_UNKNOWN || name == SD_BUS_ERROR_NAME_HAS_NO_OWNER ||
+        name.starts_with("org.freedesktop.DBus.Error.Spawn.")) {
+        return ErrorCategory::ServiceUnavailable;
+    }
+    return ErrorCategory::Failed;
+}
+
 uint64_t toMicroseconds(std::chrono::steady_clock::duration duration) {
     auto micros = std::chrono::duration_cast<std::chrono::microseconds>(duration).count();
     return micros > 0 ? static_cast<uint64_t>(micros) : 0;
@@ -49,6 +70,12 @@ struct Deliveries {
 };
 
 }  // namespace
+
+ClientError::ClientError(const std::string& what, ErrorCategory category,
+                         const std::string& errorName)
+    : std::runtime_error(what),
+      category_(category),
+      errorName_(std::make_shared<const std::string>(errorName)) {}
 
 struct NotificationSubscription::Target {
     NotificationHandler handler;
@@ -126,7 +153,8 @@ void finishConnecting(const BusPtr& bus, const std::string& where) {
     const char* name = nullptr;
     int r = sd_bus_get_unique_name(bus.get(), &name);
     if (r < 0) {
-        throw ClientError("cannot connect to " + where + ": " + errnoText(r));
+        throw ClientError("cannot connect to " + where + ": " + errnoText(r),
+                          ErrorCategory::Connection);
     }
 }
 
@@ -142,7 +170,8 @@ TavrixClient TavrixClient::connectToSystemBus() {
     int r = sd_bus_open_system(&raw);
     BusPtr bus(raw);
     if (r < 0) {
-        throw ClientError("cannot connect to the system bus: " + errnoText(r));
+        throw ClientError("cannot connect to the system bus: " + errnoText(r),
+                          ErrorCategory::Connection);
     }
     finishConnecting(bus, "the system bus");
     auto state = std::make_unique<State>();
@@ -170,7 +199,8 @@ TavrixClient TavrixClient::connectToAddress(const std::string& address) {
         r = sd_bus_start(bus.get());
     }
     if (r < 0) {
-        throw ClientError("cannot connect to " + address + ": " + errnoText(r));
+        throw ClientError("cannot connect to " + address + ": " + errnoText(r),
+                          ErrorCategory::Connection);
     }
     finishConnecting(bus, address);
     auto state = std::make_unique<State>();
@@ -217,13 +247,14 @@ class Call {
         int r = sd_bus_call(bus, message_.get(), toMicroseconds(kCallTimeout), error.get(), &raw);
         BusMessagePtr reply(raw);
         if (r < 0) {
-            fail(describeFailure(error, r));
+            fail(describeFailure(error, r), categoryOfError(error.name(), r), error.name());
         }
         if (sd_bus_message_has_signature(reply.get(), replySignature) <= 0) {
             const char* signature = sd_bus_message_get_signature(reply.get(), 1);
             fail(std::string("malformed reply: signature \"") +
-                 (signature != nullptr ? signature : "") + "\", expected \"" + replySignature +
-                 "\"");
+                     (signature != nullptr ? signature : "") + "\", expected \"" + replySignature +
+                     "\"",
+                 ErrorCategory::MalformedReply);
         }
         return reply;
     }
@@ -233,13 +264,15 @@ class Call {
         int flag = 0;
         int r = sd_bus_message_read_basic(reply.get(), 'b', &flag);
         if (r < 0) {
-            fail("malformed reply: " + errnoText(r));
+            fail("malformed reply: " + errnoText(r), ErrorCategory::MalformedReply);
         }
         return flag != 0;
     }
 
-    [[noreturn]] void fail(const std::string& reason) const {
-        throw ClientError(std::string(member_) + " failed: " + reason);
+    [[noreturn]] void fail(const std::string& reason,
+                           ErrorCategory category = ErrorCategory::Failed,
+                           const std::string& errorName = {}) const {
+        throw ClientError(std::string(member_) + " failed: " + reason, category, errorName);
     }
 
   private:
@@ -345,7 +378,7 @@ bool TavrixClient::processOnce(std::chrono::steady_clock::duration timeout) {
         std::rethrow_exception(failure);
     }
     if (r < 0) {
-        throw ClientError("connection to the bus lost: " + errnoText(r));
+        throw ClientError("connection to the bus lost: " + errnoText(r), ErrorCategory::Connection);
     }
     if (r > 0) {
         return true;
@@ -353,7 +386,7 @@ bool TavrixClient::processOnce(std::chrono::steady_clock::duration timeout) {
     r = sd_bus_wait(bus, toMicroseconds(timeout));
     // A signal interrupting the wait is the caller's business, seen in its next check.
     if (r < 0 && r != -EINTR) {
-        throw ClientError("connection to the bus lost: " + errnoText(r));
+        throw ClientError("connection to the bus lost: " + errnoText(r), ErrorCategory::Connection);
     }
     return false;
 }
@@ -404,6 +437,18 @@ plist::Dictionary TavrixClient::status() {
         call.fail("malformed reply: " + errnoText(r));
     }
     return status;
+}
+
+plist::Dictionary TavrixClient::properties() {
+    Call call(state_->bus.get(), "GetAll", "org.freedesktop.DBus.Properties");
+    call.appendString(kStatusInterface, "interface");
+    BusMessagePtr reply = call.send(state_->bus.get(), "a{sv}");
+    plist::Dictionary properties;
+    int r = bus::readDictionary(reply.get(), properties);
+    if (r < 0) {
+        call.fail("malformed reply: " + errnoText(r));
+    }
+    return properties;
 }
 
 }  // namespace tavrix::client

@@ -30,9 +30,31 @@ inline constexpr const char* kNotificationMember = "Posted";
 // Long enough for the bus to activate the daemon and for it to install a bundle.
 inline constexpr std::chrono::seconds kCallTimeout{60};
 
+// What kind of failure a ClientError is, for a program to act on.
+enum class ErrorCategory {
+    Failed,              // the daemon answered with an error of its own, or anything else
+    Connection,          // no bus, or the connection to it was lost
+    AccessDenied,        // the bus policy refused the call (setting the ID, starting a check)
+    ServiceUnavailable,  // the daemon could not be started or reached
+    InvalidArguments,    // the daemon refused an argument (a bundle descriptor it cannot take)
+    Timeout,             // no answer in time
+    MalformedReply,      // an answer of the wrong shape
+};
+
 class ClientError : public std::runtime_error {
   public:
-    using std::runtime_error::runtime_error;
+    explicit ClientError(const std::string& what, ErrorCategory category = ErrorCategory::Failed,
+                         const std::string& errorName = {});
+
+    ErrorCategory category() const noexcept { return category_; }
+    // The D-Bus error name ("org.freedesktop.DBus.Error.AccessDenied"), or "" when the failure
+    // happened here.
+    const std::string& errorName() const noexcept { return *errorName_; }
+
+  private:
+    ErrorCategory category_;
+    // Shared, so that copying the exception cannot throw.
+    std::shared_ptr<const std::string> errorName_;
 };
 
 using NotificationHandler = std::function<void(const std::string& name)>;
@@ -129,6 +151,9 @@ class TavrixClient {
   public:
     // The daemon's status view (see docs/dbus-api.md for its keys).
     plist::Dictionary status();
+    // The status properties by name, as the bus carries them: text, booleans, and times as
+    // unsigned integers of microseconds since 1970 (0 for none).
+    plist::Dictionary properties();
 };
 
 }  // namespace tavrix::client

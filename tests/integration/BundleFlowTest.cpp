@@ -166,8 +166,8 @@ TEST_F(BundleFlowTest, FirstSetLinksTheOverlaidCarrierFileAndRepeatingItChangesN
          "set -o pipefail; echo garbage | '" + std::string(TAVRIX_CTL_PATH) + "' --address '" +
              busAddress() +
              "' set-id AbC --bundle - --json | /usr/bin/python3 -c 'import json, sys; answer = "
-             "json.load(sys.stdin); print(answer[\"accepted\"], answer[\"extracted\"], "
-             "len(answer[\"reason\"]) > 0)'"});
+             "json.load(sys.stdin); print(answer[\"Accepted\"], answer[\"Extracted\"], "
+             "len(answer[\"Reason\"]) > 0)'"});
     EXPECT_EQ(broken.status, 1) << broken.output;
     EXPECT_EQ(broken.output, "True False True\n");
 }
