@@ -130,6 +130,10 @@ bool StatusPublisher::attach(sd_event* event, sd_bus* bus, const char* path) {
     sd_event_source* raw = nullptr;
     int r = wakeFd ? sd_event_add_io(event, &raw, wakeFd.get(), EPOLLIN, onWake, this) : -errno;
     source_.reset(raw);
+    // Before the next call is handled, so that announcements keep the order of what caused them.
+    if (r >= 0) {
+        r = sd_event_source_set_priority(raw, SD_EVENT_PRIORITY_NORMAL - 1);
+    }
     if (r < 0) {
         logCFormat("Cannot announce status changes: %s\n", std::strerror(-r));
         return false;
@@ -154,6 +158,7 @@ void StatusPublisher::detach() {
 }
 
 void StatusPublisher::wake() {
+    stale_ = true;
     std::lock_guard lock(pendingLock_);
     const std::uint64_t one = 1;
     if (wakeFd_ && ::write(wakeFd_.get(), &one, sizeof one) < 0) {
@@ -189,6 +194,7 @@ void StatusPublisher::publish() {
         std::lock_guard lock(pendingLock_);
         finished.swap(finishedChecks_);
     }
+    stale_ = false;
     if (bus_ == nullptr) {
         return;
     }
@@ -231,7 +237,7 @@ const plist::Dictionary& StatusPublisher::statusForCall(sd_bus_message* reply) {
     if (cookie == 0 || call != readFor_) {
         readForCall_ = copyDaemonStatus();
         readFor_ = std::move(call);
-        if (!announced_) {
+        if (!announced_ && !stale_) {
             announced_ = readForCall_;  // what this client now knows needs no announcement
         } else {
             for (const StatusProperty& property : kChangingProperties) {

@@ -11,6 +11,7 @@
 #include <systemd/sd-bus.h>
 #include <systemd/sd-event.h>
 
+#include <atomic>
 #include <cstdint>
 #include <mutex>
 #include <optional>
@@ -69,6 +70,9 @@ class StatusPublisher {
     std::pair<std::string, std::uint64_t> readFor_;
     plist::Dictionary readForCall_;
 
+    // Set by every wake-up until publish() runs: a read then must not be taken for what was
+    // announced, or the announcement on its way would find nothing changed.
+    std::atomic<bool> stale_{false};
     // Guards what other threads hand over, and the eventfd they write.
     std::mutex pendingLock_;
     io::UniqueFd wakeFd_;

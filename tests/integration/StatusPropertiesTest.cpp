@@ -140,5 +140,36 @@ TEST_F(StatusPropertiesTest, PropertiesAnnounceEachChangeAndTakeABundleByDescrip
     EXPECT_EQ(monitor.nextCheckFinished(10s), json({"no-catalog", "no catalog configured"}));
 }
 
+// The interface XML kept in docs/ is what the daemon introspects as: the same methods with the
+// same arguments, properties and signals, compared by Python's XML parser.
+TEST_F(StatusPropertiesTest, IntrospectionMatchesTheDocumentedInterface) {
+    CommandResult compared = runCommand(
+        {"/bin/bash", "-c",
+         "set -o pipefail; /usr/bin/busctl --address='" + busAddress() +
+             "' introspect --xml-interface com.zandor.tavrixservicesd /com/zandor/tavrixservicesd "
+             "| /usr/bin/python3 -c '" +
+             R"(import sys, xml.etree.ElementTree as tree
+def members(root):
+    found = {}
+    for interface in root.iter("interface"):
+        if not interface.get("name").startswith("com.zandor."):
+            continue
+        def types(element, direction):
+            return "".join(a.get("type") for a in element if a.tag == "arg" and
+                           a.get("direction", direction) == direction)
+        found[interface.get("name")] = sorted(
+            (e.tag, e.get("name"), types(e, "in"), types(e, "out")) if e.tag == "method" else
+            (e.tag, e.get("name"), types(e, "out"), "") if e.tag == "signal" else
+            (e.tag, e.get("name"), e.get("type"), e.get("access"))
+            for e in interface if e.tag in ("method", "signal", "property"))
+    return found
+documented = members(tree.parse(sys.argv[1]).getroot())
+live = members(tree.fromstring(sys.stdin.read()))
+print("same" if documented == live else "documented %s\nlive %s" % (documented, live)))" +
+             "' '" + TAVRIX_INTERFACE_XML + "'"});
+    EXPECT_EQ(compared.status, 0) << compared.output;
+    EXPECT_EQ(compared.output, "same\n");
+}
+
 }  // namespace
 }  // namespace tavrix::integration
