@@ -430,19 +430,45 @@ bool TavrixClient::setTavrixID(const std::string& tavrixID,
     return call.sendForBoolean(state_->bus.get());
 }
 
+namespace {
+
+PayloadResult readPayloadResult(const char* member, sd_bus_message* reply) {
+    int accepted = 0;
+    int extracted = 0;
+    const char* reason = nullptr;
+    int r = sd_bus_message_read(reply, "bbs", &accepted, &extracted, &reason);
+    if (r < 0) {
+        failCall(member, "malformed reply: " + errnoText(r), ErrorCategory::MalformedReply);
+    }
+    return {accepted != 0, extracted != 0, reason != nullptr ? reason : ""};
+}
+
+}  // namespace
+
 PayloadResult TavrixClient::setTavrixIDWithBundleFile(const std::string& tavrixID, int fd) {
     Call call(state_->bus.get(), "SetTavrixIDWithBundleFD");
     call.appendString(tavrixID, "behavior ID");
     call.check(sd_bus_message_append_basic(call.message(), 'h', &fd), "cannot pass the bundle");
-    BusMessagePtr reply = call.send(state_->bus.get(), "bbs");
-    int accepted = 0;
-    int extracted = 0;
-    const char* reason = nullptr;
-    int r = sd_bus_message_read(reply.get(), "bbs", &accepted, &extracted, &reason);
-    if (r < 0) {
-        call.fail("malformed reply: " + errnoText(r));
-    }
-    return {accepted != 0, extracted != 0, reason != nullptr ? reason : ""};
+    return readPayloadResult(call.member(), call.send(state_->bus.get(), "bbs").get());
+}
+
+PendingCall TavrixClient::setTavrixIDWithBundleFileAsync(const std::string& tavrixID, int fd,
+                                                         AsyncHandler<PayloadResult> handler) {
+    Call call(state_->bus.get(), "SetTavrixIDWithBundleFD");
+    call.appendString(tavrixID, "behavior ID");
+    call.check(sd_bus_message_append_basic(call.message(), 'h', &fd), "cannot pass the bundle");
+    PendingCall pending;
+    pending.slot_ = startAsync<PayloadResult>(state_->bus.get(), state_->deliveries, call, "bbs",
+                                              readPayloadResult, std::move(handler));
+    return pending;
+}
+
+PendingCall TavrixClient::statusAsync(AsyncHandler<plist::Dictionary> handler) {
+    Call call(state_->bus.get(), "GetStatus", kStatusInterface);
+    PendingCall pending;
+    pending.slot_ = startAsync<plist::Dictionary>(state_->bus.get(), state_->deliveries, call,
+                                                  "a{sv}", readDictionaryReply, std::move(handler));
+    return pending;
 }
 
 bool TavrixClient::isTavrixBundleSupported() {

@@ -195,6 +195,9 @@ class TavrixClient {
                                      AsyncHandler<std::optional<plist::Value>> handler);
     PendingCall checkForTavrixBundleUpdateAsync(AsyncHandler<bool> handler);
     PendingCall setClientTypeAsync(std::int32_t type, AsyncHandler<bool> handler);
+    PendingCall setTavrixIDWithBundleFileAsync(const std::string& tavrixID, int fd,
+                                               AsyncHandler<PayloadResult> handler);
+    PendingCall statusAsync(AsyncHandler<plist::Dictionary> handler);
     PendingCall propertiesAsync(AsyncHandler<plist::Dictionary> handler);
 
     // For an application's own loop: the connection's descriptor, the poll events to wait for

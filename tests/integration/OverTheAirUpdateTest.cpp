@@ -254,6 +254,8 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
         << textAt(check, "Reason");
     EXPECT_EQ(monitor.nextCheckFinished(30s),
               nlohmann::json({"up-to-date", "up to date (version 2 installed)"}));
+    EXPECT_TRUE(monitor.waitForStatus(
+        {{"LastCheckOutcome", "catalog-refused"}, {"LastCheckReason", textAt(check, "Reason")}}));
     EXPECT_EQ(monitor.nextCheckFinished(30s),
               nlohmann::json({"catalog-refused", textAt(check, "Reason")}));
     EXPECT_TRUE(waitForNextUpdateIn(kFifteenDays, 1s)) << "a refused catalog re-arms nothing";

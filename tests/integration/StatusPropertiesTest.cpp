@@ -1,6 +1,7 @@
 // The status as programs the project did not write see it: busctl reads the properties and
 // follows PropertiesChanged and the check signal (its JSON read by a JSON library), and hands the
 // daemon a bundle by file descriptor.
+#include <fcntl.h>
 #include <gmock/gmock.h>
 
 #include <nlohmann/json.hpp>
@@ -8,6 +9,7 @@
 #include "BusFixture.h"
 #include "BusMonitor.h"
 #include "TestSupport.h"
+#include "io/UniqueFd.h"
 
 namespace tavrix::integration {
 namespace {
@@ -129,6 +131,15 @@ TEST_F(StatusPropertiesTest, PropertiesAnnounceEachChangeAndTakeABundleByDescrip
         EXPECT_THAT(refused.output, StartsWith("org.freedesktop.DBus.Error.InvalidArgs Bundle "
                                                "refused: "))
             << how;
+    }
+    // The client library tells the refusal by its name and category.
+    io::UniqueFd devNull(::open("/dev/null", O_RDONLY | O_CLOEXEC));
+    try {
+        client().setTavrixIDWithBundleFile("other", devNull.get());
+        ADD_FAILURE() << "a device was taken as a bundle";
+    } catch (const client::ClientError& error) {
+        EXPECT_EQ(error.category(), client::ErrorCategory::InvalidArguments);
+        EXPECT_EQ(error.errorName(), "org.freedesktop.DBus.Error.InvalidArgs");
     }
     EXPECT_EQ(getProperties("BehaviorID").output, "s \"acme.default\"\n") << "nothing was stored";
 
