@@ -22,51 +22,6 @@ std::string formatDate(const plist::Date& date, const char* format) {
     return text;
 }
 
-std::string jsonString(const std::string& text) {
-    std::string out = "\"";
-    for (unsigned char c : text) {
-        switch (c) {
-            case '"':
-                out += "\\\"";
-                break;
-            case '\\':
-                out += "\\\\";
-                break;
-            case '\n':
-                out += "\\n";
-                break;
-            case '\t':
-                out += "\\t";
-                break;
-            default:
-                if (c < 0x20) {
-                    char escaped[8];
-                    std::snprintf(escaped, sizeof escaped, "\\u%04x", c);
-                    out += escaped;
-                } else {
-                    out += static_cast<char>(c);
-                }
-        }
-    }
-    return out + "\"";
-}
-
-std::string base64(const plist::Data& data) {
-    static constexpr char kAlphabet[] =
-        "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
-    std::string out;
-    for (std::size_t i = 0; i < data.size(); i += 3) {
-        const std::uint32_t chunk = (std::uint32_t{data[i]} << 16) |
-                                    (i + 1 < data.size() ? std::uint32_t{data[i + 1]} << 8 : 0) |
-                                    (i + 2 < data.size() ? std::uint32_t{data[i + 2]} : 0);
-        out += kAlphabet[(chunk >> 18) & 63];
-        out += kAlphabet[(chunk >> 12) & 63];
-        out += i + 1 < data.size() ? kAlphabet[(chunk >> 6) & 63] : '=';
-        out += i + 2 < data.size() ? kAlphabet[chunk & 63] : '=';
-    }
-    return out;
-}
-
 const std::string* textAt(const plist::Dictionary& dictionary, const char* key) {
     auto found = dictionary.find(key);
     return found != dictionary.end() ? found->second.asString() : nullptr;
@@ -98,48 +53,6 @@ void line(std::string& out, const char* label, const std::string& text) {
 
 std::string readableDate(const plist::Date& date) {
     return formatDate(date, "%Y-%m-%d %H:%M:%S UTC");
-}
-
-std::string toJson(const plist::Value& value) {
-    switch (value.type()) {
-        case plist::Type::Dictionary: {
-            std::string out = "{";
-            for (const auto& [key, child] : *value.asDictionary()) {
-                out += (out.size() > 1 ? "," : "") + jsonString(key) + ":" + toJson(child);
-            }
-            return out + "}";
-        }
-        case plist::Type::Array: {
-            std::string out = "[";
-            for (const plist::Value& child : *value.asArray()) {
-                out += (out.size() > 1 ? "," : "") + toJson(child);
-            }
-            return out + "]";
-        }
-        case plist::Type::String:
-            return jsonString(*value.asString());
-        case plist::Type::Integer: {
-            const plist::Integer& integer = *value.asInteger();
-            return integer.isLargeUnsigned() ? std::to_string(integer.unsignedValue())
-                                             : std::to_string(integer.signedValue());
-        }
-        case plist::Type::Real: {
-            const double real = *value.asReal();
-            if (!std::isfinite(real)) {
-                return "null";
-            }
-            char text[32];
-            std::snprintf(text, sizeof text, "%.17g", real);
-            return text;
-        }
-        case plist::Type::Boolean:
-            return *value.asBoolean() ? "true" : "false";
-        case plist::Type::Date:
-            return jsonString(formatDate(*value.asDate(), "%Y-%m-%dT%H:%M:%SZ"));
-        case plist::Type::Data:
-            return jsonString(base64(*value.asData()));
-    }
-    return "null";
 }
 
 std::string readableStatus(const plist::Dictionary& status) {

@@ -1,12 +1,12 @@
 // A first program against the client library: connect, ask whether behavior bundles are
 // supported, read one behavior setting, and wait for one notification from the daemon.
 // Build: c++ -std=c++20 client-example.cpp $(pkg-config --cflags --libs tavrixclient)
+#include <tavrix/client/TavrixClient.h>
+
 #include <chrono>
 #include <cstdio>
 #include <optional>
 #include <string>
-
-#include "client/TavrixClient.h"
 
 int main(int argc, char** argv) {
     std::string address;

@@ -1,5 +1,6 @@
 #include "daemon/TXManager.h"
 
+#include <atomic>
 #include <mutex>
 
 #include "bundle/BundleManager.h"
@@ -17,6 +18,8 @@ namespace tavrix {
 namespace {
 
 constexpr const char* kBehaviorSettingsDomain = "com.zandor.tavrix";
+
+std::atomic<bool> managerCreated{false};
 
 }  // namespace
 
@@ -37,12 +40,21 @@ TXManager& TXManager::sharedInstance() {
         }
         return created;
     }();
+    managerCreated.store(true);
     return *manager;
 }
 
-bool TXManager::setTavrixID(const std::string& tavrixID, const std::optional<plist::Data>& bundle) {
+bool TXManager::exists() {
+    return managerCreated.load();
+}
+
+bool TXManager::setTavrixID(const std::string& tavrixID, const std::optional<plist::Data>& bundle,
+                            PayloadOutcome* payload) {
     if (TXUtility::hasCellularRadio()) {
         logObjectFormat("Device has cellular radio, not accepting tavrix ID");
+        if (payload != nullptr) {
+            *payload = {false, "not accepted: the device has a cellular radio"};
+        }
         return false;
     }
     if (tavrixID.size() > kMaxBehaviorIDBytes) {
@@ -63,9 +75,13 @@ bool TXManager::setTavrixID(const std::string& tavrixID, const std::optional<pli
         if (bundle) {
             std::string whyNot;
             const bool extracted = bundles.installBehaviorBundleData(*bundle, &whyNot);
-            recordPayload(extracted, extracted ? "extracted " + std::to_string(bundle->size()) +
-                                                     " bytes into the user bundle"
-                                               : whyNot);
+            std::string reason = extracted ? "extracted " + std::to_string(bundle->size()) +
+                                                 " bytes into the user bundle"
+                                           : whyNot;
+            recordPayload(extracted, reason);
+            if (payload != nullptr) {
+                *payload = {extracted, std::move(reason)};
+            }
         } else {
             logObjectFormat("No bundle data given");
         }

@@ -16,14 +16,24 @@ enum class BundleSupport { Supported, CellularRadio, NotEnabled, Disabled, NoBeh
 // One line for an operator: why bundles are not supported ("" when they are).
 const char* bundleSupportReason(BundleSupport support);
 
+// What became of a bundle payload: extracted into the user bundle, or why not, in one line.
+struct PayloadOutcome {
+    bool extracted = false;
+    std::string reason;
+};
+
 class TXManager {
   public:
     // The process's façade; its first creation redoes the bundle match for a stored behavior ID.
     static TXManager& sharedInstance();
+    // Whether sharedInstance has been created, from any thread.
+    static bool exists();
 
     // Stores the lower-cased ID, unpacks the bundle when there is one and redoes the bundle match.
-    // False only on a device with a cellular radio.
-    bool setTavrixID(const std::string& tavrixID, const std::optional<plist::Data>& bundle);
+    // False only on a device with a cellular radio. With a bundle and a payload, says what became
+    // of it.
+    bool setTavrixID(const std::string& tavrixID, const std::optional<plist::Data>& bundle,
+                     PayloadOutcome* payload = nullptr);
     bool isTavrixBundleSupported();
     // What isTavrixBundleSupported answers from, without logging.
     BundleSupport bundleSupport() const;

@@ -13,6 +13,7 @@
 #include "bus/ServiceManager.h"
 #include "bus/TXTransactionManager.h"
 #include "catalog/AssetCatalogService.h"
+#include "daemon/StatusProperties.h"
 #include "daemon/TXManager.h"
 #include "daemon/TXManagerStatus.h"
 #include "daemon/UpdateCheckScheduler.h"
@@ -107,6 +108,7 @@ int TXManagerServer::runUntilIdleExit() {
     serviceManager.notifyReady(transactionStatus(transactions.openTransactions()));
     _run();
     _stopWorkers();
+    StatusPublisher::shared().detach();
 
     transactions.clearKeepAliveIfNecessary(true);
     bus::setNotificationBus(nullptr);
@@ -128,8 +130,10 @@ bool TXManagerServer::_startServing() {
         return 0;
     };
     // Transactions closed on other threads wake the loop, so that it looks at idleness again.
+    // A transaction that closed ended some work, which may have changed the status.
     auto onWake = [](sd_event_source*, int, uint32_t, void*) -> int {
         bus::ServiceManager::shared().consumeWake();
+        StatusPublisher::shared().markStale();
         return 0;
     };
     sd_event_source* terminate = nullptr;
@@ -158,6 +162,8 @@ bool TXManagerServer::_startServing() {
                           this)) {
         return false;
     }
+    // Without announcements the properties still answer; that is no reason not to serve.
+    StatusPublisher::shared().attach(event, _listener.bus(), kTXServiceObjectPath);
 
     TXTransactionManager::sharedInstance().beginTransaction(kMinimumLaunchTransaction);
     auto endLaunchTransaction = [](sd_event_source*, uint64_t, void*) -> int {
@@ -239,6 +245,8 @@ void TXManagerServer::_finish() {
     // does not wait for it.
     _launchTimer.reset();
     TXTransactionManager::sharedInstance().endTransaction(kMinimumLaunchTransaction);
+    // While the name is still ours: subscribers match on it.
+    StatusPublisher::shared().publish();
     _listener.releaseNameAndDrain();
 }
 
@@ -329,6 +337,16 @@ void TXManagerServer::setTavrixID(const std::string& tavrixID,
     plist::Value id(tavrixID);
     logObjectFormat("Handling Set Tavrix ID with %@", &id);
     reply(replyHandler, manager().setTavrixID(tavrixID, bundle));
+}
+
+void TXManagerServer::setTavrixIDWithBundle(
+    const std::string& tavrixID, const plist::Data& bundle,
+    const std::function<void(bool, const PayloadOutcome&)>& replyHandler) {
+    plist::Value id(tavrixID);
+    logObjectFormat("Handling Set Tavrix ID with %@", &id);
+    PayloadOutcome payload;
+    const bool accepted = manager().setTavrixID(tavrixID, bundle, &payload);
+    reply(replyHandler, accepted, payload);
 }
 
 void TXManagerServer::isTavrixBundleSupported(const std::function<void(bool)>& replyHandler) {

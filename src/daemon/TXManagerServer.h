@@ -20,12 +20,11 @@
 
 #include "bus/BusHandles.h"
 #include "bus/ServiceListener.h"
+#include "daemon/TXManager.h"
 #include "daemon/TXManagerServerClient.h"
 #include "plist/Value.h"
 
 namespace tavrix {
-
-class TXManager;
 
 inline constexpr const char* kTXServiceName = "com.zandor.tavrixservicesd";
 inline constexpr const char* kTXServiceObjectPath = "/com/zandor/tavrixservicesd";
@@ -61,6 +60,10 @@ class TXManagerServer : private bus::ServiceListener::Delegate {
     // the first four accept an empty handler.
     void setTavrixID(const std::string& tavrixID, const std::optional<plist::Data>& bundle,
                      const std::function<void(bool)>& replyHandler);
+    // setTavrixID with a bundle, also answering what became of the payload.
+    void setTavrixIDWithBundle(
+        const std::string& tavrixID, const plist::Data& bundle,
+        const std::function<void(bool, const PayloadOutcome&)>& replyHandler);
     void isTavrixBundleSupported(const std::function<void(bool)>& replyHandler);
     void copyTavrixValue(const std::string& key,
                          const std::function<void(std::optional<plist::Value>)>& replyHandler);
@@ -115,7 +118,7 @@ class TXManagerServer : private bus::ServiceListener::Delegate {
 const sd_bus_vtable* managerServerVTable();
 // The notification interface's table: its one signal, so that introspection shows it.
 const sd_bus_vtable* notificationCenterVTable();
-// The status interface's table.
+// The status interface's table: GetStatus, the properties and the check signal.
 const sd_bus_vtable* statusVTable();
 
 }  // namespace tavrix

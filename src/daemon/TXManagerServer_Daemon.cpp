@@ -8,11 +8,14 @@
 #include <cstring>
 
 #include "bus/BusValueCodec.h"
+#include "bus/HandedPayload.h"
 #include "bus/NotificationCenter.h"
 #include "bus/ServiceManager.h"
+#include "daemon/StatusProperties.h"
 #include "daemon/TXManagerServer.h"
 #include "util/ContainExceptions.h"
 #include "util/Log.h"
+#include "util/Utf8.h"
 
 namespace tavrix {
 namespace {
@@ -76,7 +79,43 @@ int handleSetTavrixID(sd_bus_message* message, void* userdata, sd_bus_error* err
     bool answer = answerOf("Set Tavrix ID", server, message, false, [&](bool& result) {
         server.setTavrixID(tavrixID, bundle, [&](bool accepted) { result = accepted; });
     });
+    StatusPublisher::shared().markStale();
     return replyBoolean(message, answer);
+}
+
+// The bundle as a descriptor: read here into the bytes SetTavrixID would carry, so that both go
+// the same way from there. A descriptor that cannot be read that way is refused before anything
+// is stored.
+int handleSetTavrixIDWithBundleFD(sd_bus_message* message, void* userdata, sd_bus_error* error) {
+    auto& server = *static_cast<TXManagerServer*>(userdata);
+    const char* tavrixID = nullptr;
+    int fd = -1;
+    int r = sd_bus_message_read(message, "sh", &tavrixID, &fd);
+    if (r < 0) {
+        return invalidArguments(error, r);
+    }
+    plist::Data bundle;
+    std::string whyNot;
+    if (bus::readHandedPayload(fd, bus::kMaxHandedPayloadBytes, bundle, whyNot) != 0) {
+        return sd_bus_error_setf(error, SD_BUS_ERROR_INVALID_ARGS, "Bundle refused: %s",
+                                 whyNot.c_str());
+    }
+    struct Answer {
+        bool accepted = false;
+        PayloadOutcome payload{false, "the request failed"};
+    };
+    Answer answer = answerOf("Set Tavrix ID", server, message, Answer(), [&](Answer& result) {
+        server.setTavrixIDWithBundle(tavrixID, bundle,
+                                     [&](bool accepted, const PayloadOutcome& payload) {
+                                         result = {accepted, payload};
+                                     });
+    });
+    StatusPublisher::shared().markStale();
+    // An archive's error may quote a member's name, which may be any bytes.
+    const char* reason =
+        isValidUtf8(answer.payload.reason) ? answer.payload.reason.c_str() : "(not UTF-8)";
+    return sd_bus_reply_method_return(message, "bbs", answer.accepted ? 1 : 0,
+                                      answer.payload.extracted ? 1 : 0, reason);
 }
 
 int handleIsTavrixBundleSupported(sd_bus_message* message, void* userdata, sd_bus_error*) {
@@ -134,6 +173,7 @@ int handleCheckForTavrixBundleUpdate(sd_bus_message* message, void* userdata, sd
         answerOf("Check For Tavrix Bundle Update", server, message, false, [&](bool& result) {
             server.checkForTavrixBundleUpdate([&](bool started) { result = started; });
         });
+    StatusPublisher::shared().markStale();
     return replyBoolean(message, answer);
 }
 
@@ -192,6 +232,10 @@ const sd_bus_vtable kManagerServerVTable[] = {
     SD_BUS_METHOD_WITH_NAMES("SetTavrixID", "saay", SD_BUS_PARAM(tavrixID) SD_BUS_PARAM(bundle),
                              "b", SD_BUS_PARAM(accepted), contained<handleSetTavrixID>,
                              SD_BUS_VTABLE_UNPRIVILEGED),
+    SD_BUS_METHOD_WITH_NAMES("SetTavrixIDWithBundleFD", "sh",
+                             SD_BUS_PARAM(tavrixID) SD_BUS_PARAM(bundle), "bbs",
+                             SD_BUS_PARAM(accepted) SD_BUS_PARAM(extracted) SD_BUS_PARAM(reason),
+                             contained<handleSetTavrixIDWithBundleFD>, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_METHOD_WITH_NAMES("IsTavrixBundleSupported", "", , "b", SD_BUS_PARAM(supported),
                              contained<handleIsTavrixBundleSupported>, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_METHOD_WITH_NAMES("CopyTavrixValue", "s", SD_BUS_PARAM(key), "av", SD_BUS_PARAM(value),
@@ -201,14 +245,6 @@ const sd_bus_vtable kManagerServerVTable[] = {
                              SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_METHOD_WITH_NAMES("SetClientType", "i", SD_BUS_PARAM(type), "b", SD_BUS_PARAM(known),
                              contained<handleSetClientType>, SD_BUS_VTABLE_UNPRIVILEGED),
-    SD_BUS_VTABLE_END,
-};
-
-// Anyone may read the status (the bus policy says so); it changes nothing.
-const sd_bus_vtable kStatusVTable[] = {
-    SD_BUS_VTABLE_START(0),
-    SD_BUS_METHOD_WITH_NAMES("GetStatus", "", , "a{sv}", SD_BUS_PARAM(status),
-                             contained<handleGetStatus>, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_VTABLE_END,
 };
 
@@ -227,7 +263,7 @@ const sd_bus_vtable* notificationCenterVTable() {
     return kNotificationCenterVTable;
 }
 const sd_bus_vtable* statusVTable() {
-    return kStatusVTable;
+    return StatusPublisher::vtable(contained<handleGetStatus>);
 }
 
 }  // namespace tavrix

@@ -1,5 +1,6 @@
 #include "update/ActivityRecord.h"
 
+#include <atomic>
 #include <cstring>
 #include <mutex>
 
@@ -24,6 +25,8 @@ plist::Dictionary readRecordLocked() {
     return device::readDaemonStateFile(kRecordFileName);
 }
 
+std::atomic<ActivityObserver> observer{nullptr};
+
 void replaceEntry(const char* key, plist::Dictionary entry) {
     entry.insert_or_assign(kActivityTimeKey, plist::Value(plist::Date{Clock::absoluteTimeNow()}));
     std::lock_guard lock(recordLock());
@@ -47,11 +50,21 @@ std::string activityRecordPath() {
 void recordUpdateCheck(const std::string& outcome, const std::string& reason) {
     replaceEntry(kLastCheckKey, {{kActivityOutcomeKey, plist::Value(outcome)},
                                  {kActivityReasonKey, plist::Value(reason)}});
+    if (ActivityObserver told = observer.load()) {
+        told(kLastCheckKey, outcome, reason);
+    }
 }
 
 void recordPayload(bool extracted, const std::string& reason) {
     replaceEntry(kLastPayloadKey, {{kActivityExtractedKey, plist::Value(extracted)},
                                    {kActivityReasonKey, plist::Value(reason)}});
+    if (ActivityObserver told = observer.load()) {
+        told(kLastPayloadKey, "", reason);
+    }
+}
+
+void setActivityObserver(ActivityObserver newObserver) {
+    observer.store(newObserver);
 }
 
 plist::Dictionary copyActivityRecord() {

@@ -41,4 +41,10 @@ void recordPayload(bool extracted, const std::string& reason);
 // The record as kept: LastCheck and LastPayload dictionaries, each present once written.
 plist::Dictionary copyActivityRecord();
 
+// Told of every entry once it is recorded (key, outcome or "" for a payload, reason), on the
+// recording thread; the daemon announces them from its main loop. One observer; null for none.
+using ActivityObserver = void (*)(const char* key, const std::string& outcome,
+                                  const std::string& reason);
+void setActivityObserver(ActivityObserver observer);
+
 }  // namespace tavrix

@@ -87,6 +87,16 @@ c++ -std=c++20 -Wall -Wextra -Werror -o "$stage/client-example" \
     fail "the example does not build"
 grep -q "libtavrixclient.so.1 => $image" <<<"$(ldd "$stage/client-example")" ||
     fail "the example does not use the installed library"
+# The sd-event example, which also needs libsystemd's own flags.
+# shellcheck disable=SC2086 # the flags are words
+c++ -std=c++20 -Wall -Wextra -Werror -o "$stage/follow-status" \
+    "$source_dir/examples/client/follow-status.cpp" $flags $(pkg-config --cflags --libs libsystemd) \
+    ${TAVRIX_EXAMPLE_FLAGS:-} || fail "the sd-event example does not build"
+# Under an older standard the header says what it needs, in one line.
+errors=$(c++ -std=c++17 -fsyntax-only "$source_dir/examples/client/client-example.cpp" $flags 2>&1 ||
+    true)
+grep -q '#error "<tavrix/client/TavrixClient.h> needs C++20' <<<"$errors" ||
+    fail "the header does not say it needs C++20: $errors"
 if grep -rqE '#include "(platform|util|payload|daemon|bundle|update)/' "$image$prefix/include/tavrix"; then
     fail "an installed header includes an internal one"
 fi
@@ -103,6 +113,26 @@ if command -v dbus-daemon >/dev/null; then
     grep -qE "^supported: (yes|no)$" <<<"$output" || fail "the example was not answered: $output"
     grep -qx "notification: TXDaemonStartedNotification" <<<"$output" ||
         fail "the example heard no notification: $output"
+    # The sd-event example reads the properties, then hears the change a set makes.
+    coproc FOLLOW { "$stage/follow-status" --address "$DBUS_SYSTEM_BUS_ADDRESS" --count 1 2>&1; }
+    # Copies: bash forgets the coprocess's variables once it has ended.
+    exec {follow_out}<&"${FOLLOW[0]}"
+    follow_pid=$FOLLOW_PID
+    seen=""
+    while read -r -t 30 line <&"$follow_out"; do
+        seen+="$line"$'\n'
+        [ "$line" = following ] && break
+    done
+    grep -qx "DaemonVersion=[0-9.]*" <<<"$seen" || fail "follow-status read no properties: $seen"
+    "$image$prefix/bin/tavrixctl" --address "$DBUS_SYSTEM_BUS_ADDRESS" set-id follow-demo \
+        >/dev/null || fail "tavrixctl set-id"
+    changed=""
+    while read -r -t 30 line <&"$follow_out"; do
+        changed+="$line"$'\n'
+    done
+    wait "$follow_pid" || fail "follow-status failed: $changed"
+    grep -qx "changed: BehaviorID=follow-demo" <<<"$changed" ||
+        fail "follow-status heard no change: $changed"
 else
     grep -q '^usage: client-example' <<<"$("$stage/client-example" --help)" ||
         fail "client-example --help"

@@ -91,7 +91,8 @@ TEST_F(BundleFlowTest, FirstSetLinksTheOverlaidCarrierFileAndRepeatingItChangesN
 
     CommandResult first = runCommand(setID);
     ASSERT_EQ(first.status, 0) << first.output;
-    EXPECT_EQ(first.output, "yes\n");
+    EXPECT_EQ(first.output,
+              "yes\nextracted " + std::to_string(payload.size()) + " bytes into the user bundle\n");
     EXPECT_TRUE(waitForLogLine(matchResult("kBundleChangeTypeUpdate")));
     EXPECT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
 
@@ -157,6 +158,18 @@ TEST_F(BundleFlowTest, FirstSetLinksTheOverlaidCarrierFileAndRepeatingItChangesN
     EXPECT_EQ(linkStat(at(kBundleLink)).st_ino, bundleLinkBefore.st_ino);
     EXPECT_EQ(linkStat(at(kPreferencesLink)).st_ino, preferencesLinkBefore.st_ino);
     EXPECT_EQ(linkStat(overlayFile).st_ino, overlayBefore.st_ino);
+
+    // A payload that is no archive, piped in: the ID is accepted, the payload reported as not
+    // extracted and the exit status says so (Python reads the JSON).
+    CommandResult broken = runCommand(
+        {"/bin/bash", "-c",
+         "set -o pipefail; echo garbage | '" + std::string(TAVRIX_CTL_PATH) + "' --address '" +
+             busAddress() +
+             "' set-id AbC --bundle - --json | /usr/bin/python3 -c 'import json, sys; answer = "
+             "json.load(sys.stdin); print(answer[\"Accepted\"], answer[\"Extracted\"], "
+             "len(answer[\"Reason\"]) > 0)'"});
+    EXPECT_EQ(broken.status, 1) << broken.output;
+    EXPECT_EQ(broken.output, "True False True\n");
 }
 
 // Only the behavior bit differs between an unlisted ID (the base carrier file) and a listed one:

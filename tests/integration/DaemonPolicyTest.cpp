@@ -79,9 +79,12 @@ class DaemonPolicyTest : public BusFixture {
 
 TEST_F(DaemonPolicyTest, AnyoneMayAskButOnlyPrivilegedCallersMayChange) {
     const gid_t nogroup = kNobody;
-    auto setID = tavrixctlAs(nogroup, {"set-id", "x"});
-    EXPECT_NE(setID.status, 0) << setID.output;
-    EXPECT_THAT(setID.output, HasSubstr("AccessDenied"));
+    for (const std::vector<std::string>& change :
+         {std::vector<std::string>{"set-id", "x"}, {"set-id", "x", "--bundle", "-"}}) {
+        auto setID = tavrixctlAs(nogroup, change);
+        EXPECT_NE(setID.status, 0) << setID.output;
+        EXPECT_THAT(setID.output, HasSubstr("AccessDenied"));
+    }
     auto update = tavrixctlAs(nogroup, {"check-update"});
     EXPECT_NE(update.status, 0) << update.output;
     // One line that says who may.
@@ -89,12 +92,15 @@ TEST_F(DaemonPolicyTest, AnyoneMayAskButOnlyPrivilegedCallersMayChange) {
     EXPECT_THAT(update.output, HasSubstr("root and members of the \"tavrix\" group"));
     EXPECT_EQ(std::count(update.output.begin(), update.output.end(), '\n'), 1) << update.output;
 
+    // Answered (value: there is none, hence 1), not refused.
     for (const std::vector<std::string>& question : {std::vector<std::string>{"supported"},
                                                      {"value", "CarrierName"},
                                                      {"client-type", "1"},
-                                                     {"status"}}) {
+                                                     {"status"},
+                                                     {"show", "-p", "BehaviorID"}}) {
         auto answer = tavrixctlAs(nogroup, question);
-        EXPECT_EQ(answer.status, 0) << question.front() << ": " << answer.output;
+        EXPECT_EQ(answer.status, question.front() == "value" ? 1 : 0)
+            << question.front() << ": " << answer.output;
         EXPECT_THAT(answer.output, Not(HasSubstr("AccessDenied"))) << question.front();
     }
     // Refused calls never reached the daemon.
@@ -103,6 +109,11 @@ TEST_F(DaemonPolicyTest, AnyoneMayAskButOnlyPrivilegedCallersMayChange) {
     auto asGroup = tavrixctlAs(standInGid_, {"set-id", "y"});
     EXPECT_EQ(asGroup.status, 0) << asGroup.output;
     EXPECT_TRUE(waitForLogLine("Handling Set Tavrix ID with y"));
+    // By descriptor too (an empty payload: accepted, not extracted).
+    auto withBundle = tavrixctlAs(standInGid_, {"set-id", "w", "--bundle", "-"});
+    EXPECT_EQ(withBundle.status, 1) << withBundle.output;
+    EXPECT_THAT(withBundle.output, testing::StartsWith("yes\n"));
+    EXPECT_TRUE(waitForLogLine("Handling Set Tavrix ID with w"));
 
     EXPECT_TRUE(client().setTavrixID("z", std::nullopt));
 }

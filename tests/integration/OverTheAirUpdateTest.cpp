@@ -20,6 +20,7 @@
 #include <thread>
 
 #include "BusFixture.h"
+#include "BusMonitor.h"
 #include "LocalHttpServer.h"
 #include "TestSupport.h"
 #include "bus/BackgroundJobScheduler.h"
@@ -221,6 +222,8 @@ walk("", json.load(open(sys.argv[1]))))",
 // download purged and the next check 15 days on; a check that finds nothing newer; a refused
 // catalog (kept across the daemon's exit); no catalog at all; a broken payload.
 TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
+    // What busctl sees: each check's end after the properties that describe it.
+    BusMonitor monitor(busAddress(), {"type='signal',path='/com/zandor/tavrixservicesd'"});
     setIDWithBundle("1");
     auto status = tavrixctlJson({"status"});
     EXPECT_EQ(textAt(status, "BehaviorID"), kBehaviorID);
@@ -247,9 +250,13 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
     EXPECT_FALSE(client().checkForTavrixBundleUpdate());
     server.releaseHeldResponses();
     operatorCheck.join();
-    EXPECT_EQ(textAt(check, "started"), "true");
-    EXPECT_EQ(textAt(check, "outcome"), "installed");
-    EXPECT_EQ(textAt(check, "reason"), "installed version 2");
+    EXPECT_EQ(textAt(check, "Started"), "true");
+    EXPECT_EQ(textAt(check, "Outcome"), "installed");
+    EXPECT_EQ(textAt(check, "Reason"), "installed version 2");
+    EXPECT_TRUE(monitor.waitForStatus({{"LinkedBundleVersion", "2"},
+                                       {"UserBundleVersion", "2"},
+                                       {"LastCheckOutcome", "installed"}}));
+    EXPECT_EQ(monitor.nextCheckFinished(30s), nlohmann::json({"installed", "installed version 2"}));
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 2, 30s));
     expectInstalled("2");
     EXPECT_EQ(cachedAssets(), std::vector<std::string>{});
@@ -271,9 +278,15 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
     signature[0] = static_cast<char>(signature[0] ^ 1);
     writeText(site() / "catalog.plist.sig", signature);
     check = tavrixctlJson({"check-update"}, 1);
-    EXPECT_EQ(textAt(check, "outcome"), "catalog-refused");
-    EXPECT_TRUE(textAt(check, "reason").starts_with("catalog refused: bad signature: "))
-        << textAt(check, "reason");
+    EXPECT_EQ(textAt(check, "Outcome"), "catalog-refused");
+    EXPECT_TRUE(textAt(check, "Reason").starts_with("catalog refused: bad signature: "))
+        << textAt(check, "Reason");
+    EXPECT_EQ(monitor.nextCheckFinished(30s),
+              nlohmann::json({"up-to-date", "up to date (version 2 installed)"}));
+    EXPECT_TRUE(monitor.waitForStatus(
+        {{"LastCheckOutcome", "catalog-refused"}, {"LastCheckReason", textAt(check, "Reason")}}));
+    EXPECT_EQ(monitor.nextCheckFinished(30s),
+              nlohmann::json({"catalog-refused", textAt(check, "Reason")}));
     EXPECT_TRUE(waitForNextUpdateIn(kFifteenDays, 1s)) << "a refused catalog re-arms nothing";
     // What the daemon recorded is still there after it left and was started again.
     const auto pid = daemonPid();
@@ -286,8 +299,8 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
 
     fs::remove(at("/etc/tavrix/AssetCatalog.plist"));
     check = tavrixctlJson({"check-update"}, 1);
-    EXPECT_EQ(textAt(check, "started"), "false");
-    EXPECT_EQ(textAt(check, "reason"), "no catalog configured");
+    EXPECT_EQ(textAt(check, "Started"), "false");
+    EXPECT_EQ(textAt(check, "Reason"), "no catalog configured");
 
     ASSERT_TRUE(client().setTavrixID(kBehaviorID, std::vector<std::uint8_t>{'n', 'o', 't'}));
     status = tavrixctlJson({"status"});

@@ -1,5 +1,6 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <poll.h>
 
 #include <atomic>
 #include <cstdlib>
@@ -97,6 +98,16 @@ std::string failureOf(const std::function<void()>& operation) {
     return "(no error)";
 }
 
+// The category and D-Bus name of the error operation throws.
+std::pair<ErrorCategory, std::string> kindOf(const std::function<void()>& operation) {
+    try {
+        operation();
+    } catch (const ClientError& error) {
+        return {error.category(), error.errorName()};
+    }
+    return {ErrorCategory::Failed, "(no error)"};
+}
+
 TEST(TavrixClient, ConnectingWhereNothingListensNamesTheProblem) {
     test::PrivateBus bus;
     EXPECT_THAT(failureOf([&] { TavrixClient::connectToAddress(bus.deadAddress()); }),
@@ -129,8 +140,46 @@ TEST(TavrixClient, DecodesRepliesAndRefusesMalformedOnes) {
     // Refused before sending: the bus would carry the text only up to the NUL.
     EXPECT_EQ(failureOf([&] { client.copyTavrixValue(std::string("k\0ey", 4)); }),
               "CopyTavrixValue failed: key contains a NUL character");
+    // A program switches on the category, not the text.
+    EXPECT_EQ(kindOf([&] { client.isTavrixBundleSupported(); }),
+              std::make_pair(ErrorCategory::AccessDenied,
+                             std::string("org.freedesktop.DBus.Error.AccessDenied")));
+    EXPECT_EQ(kindOf([&] { client.checkForTavrixBundleUpdate(); }),
+              std::make_pair(ErrorCategory::MalformedReply, std::string()));
     // The connection is still good after all of that.
     EXPECT_TRUE(client.setClientType(7));
+}
+
+// The asynchronous forms give the same answers and errors, delivered from an application's own
+// poll loop over fd(), events() and timeout(); a call dropped before its reply never calls back.
+TEST(TavrixClient, AsyncCallsAnswerThroughTheApplicationsOwnLoop) {
+    test::PrivateBus bus;
+    StubService stub(bus);
+    TavrixClient client = TavrixClient::connectToAddress(bus.address());
+
+    std::optional<AsyncResult<bool>> known;
+    std::optional<AsyncResult<bool>> refused;
+    bool droppedRan = false;
+    PendingCall first = client.setClientTypeAsync(7, [&](AsyncResult<bool> r) { known = r; });
+    PendingCall second =
+        client.isTavrixBundleSupportedAsync([&](AsyncResult<bool> r) { refused = r; });
+    client.setClientTypeAsync(7, [&](AsyncResult<bool>) { droppedRan = true; });
+    const auto deadline = std::chrono::steady_clock::now() + 30s;
+    while (!known || !refused) {
+        ASSERT_LT(std::chrono::steady_clock::now(), deadline);
+        pollfd ready{client.fd(), client.events(), 0};
+        const auto timeout = client.timeout();
+        ::poll(&ready, 1, timeout ? static_cast<int>(timeout->count() / 1000) + 1 : 1000);
+        client.process();
+    }
+    EXPECT_EQ(known->value, std::optional<bool>(true));
+    ASSERT_TRUE(refused->error);
+    EXPECT_FALSE(refused->value);
+    EXPECT_EQ(refused->error->category(), ErrorCategory::AccessDenied);
+    EXPECT_EQ(refused->error->errorName(), "org.freedesktop.DBus.Error.AccessDenied");
+    EXPECT_TRUE(client.setClientType(7));  // answered after the dropped call's reply, if any
+    client.process();
+    EXPECT_FALSE(droppedRan);
 }
 
 TEST(TavrixClient, DeliversNotificationsWhileSubscribedAndHandlerExceptions) {

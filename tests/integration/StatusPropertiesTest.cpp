@@ -1,0 +1,186 @@
+// The status as programs the project did not write see it: busctl reads the properties and
+// follows PropertiesChanged and the check signal (its JSON read by a JSON library), and hands the
+// daemon a bundle by file descriptor.
+#include <fcntl.h>
+#include <gmock/gmock.h>
+
+#include <nlohmann/json.hpp>
+
+#include "BusFixture.h"
+#include "BusMonitor.h"
+#include "TestSupport.h"
+#include "io/UniqueFd.h"
+
+namespace tavrix::integration {
+namespace {
+
+namespace fs = std::filesystem;
+using nlohmann::json;
+using ::testing::HasSubstr;
+using ::testing::StartsWith;
+
+constexpr const char* kStatusInterface = "com.zandor.TXManagerStatusInterface";
+
+class StatusPropertiesTest : public BusFixture {
+  protected:
+    void SetUp() override {
+        BusFixture::SetUp();
+        device().writeDaemonPreferences({{"EnableSupport", true}});
+    }
+
+    // busctl on the test's bus; through the shell, so that arguments may redirect descriptors.
+    CommandResult busctl(const std::string& arguments) {
+        return runCommand({"/bin/sh", "-c",
+                           "exec /usr/bin/busctl --address='" + busAddress() + "' " + arguments});
+    }
+    CommandResult getProperties(const std::string& names) {
+        return busctl("get-property " + std::string(kDaemonBusName) + " " + kDaemonObjectPath +
+                      " " + kStatusInterface + " " + names);
+    }
+    // SetTavrixIDWithBundleFD through Python's dbus module; how is "file" (the file opened),
+    // "pipe" (its content written to a pipe that is then closed), "open-pipe" (the writer still
+    // open) or "device" (/dev/null). Prints the answer as JSON, or the error's name and message.
+    CommandResult sendBundle(const std::string& id, const std::string& how,
+                             const fs::path& file = "/dev/null") {
+        return runCommand({"/usr/bin/python3", "-c", R"(import dbus, json, os, sys
+address, id, how, path = sys.argv[1:]
+bus = dbus.bus.BusConnection(address)
+daemon = bus.get_object("com.zandor.tavrixservicesd", "/com/zandor/tavrixservicesd")
+if how == "file" or how == "device":
+    fd = os.open(path, os.O_RDONLY)
+else:
+    fd, writer = os.pipe()
+    if how == "pipe":
+        os.write(writer, open(path, "rb").read())
+        os.close(writer)
+try:
+    answer = daemon.SetTavrixIDWithBundleFD(id, dbus.types.UnixFd(fd),
+                                            dbus_interface="com.zandor.TXManagerServerInterface")
+except dbus.exceptions.DBusException as error:
+    print(error.get_dbus_name(), error.get_dbus_message())
+    sys.exit(1)
+print(json.dumps([bool(answer[0]), bool(answer[1]), str(answer[2])])))",
+                           busAddress(), id, how, file.string()});
+    }
+    json getAll() {
+        CommandResult all =
+            busctl("--json=short call " + std::string(kDaemonBusName) + " " + kDaemonObjectPath +
+                   " org.freedesktop.DBus.Properties GetAll s " + kStatusInterface);
+        EXPECT_EQ(all.status, 0) << all.output;
+        return json::parse(all.output)["data"][0];
+    }
+};
+
+// Read before any set (which starts the daemon), then a bundle by descriptor: the properties and
+// GetAll agree with what PropertiesChanged announced; a broken payload is announced as such; a
+// descriptor that is neither a file nor a pipe is refused with one error; a check ends with its
+// signal after its properties.
+TEST_F(StatusPropertiesTest, PropertiesAnnounceEachChangeAndTakeABundleByDescriptor) {
+    BusMonitor monitor(busAddress(), {"type='signal',path='/com/zandor/tavrixservicesd'"});
+    CommandResult before = getProperties("BehaviorID Supported WhyNotSupported LastPayloadUSec");
+    EXPECT_EQ(before.status, 0) << before.output;
+    EXPECT_EQ(before.output, "s \"\"\nb false\ns \"no behavior ID has been set\"\nt 0\n");
+    CommandResult unknown = getProperties("NoSuchProperty");
+    EXPECT_NE(unknown.status, 0);
+    EXPECT_THAT(unknown.output, HasSubstr("NoSuchProperty"));
+
+    const fs::path bundle = device().base() / "bundle.tgz";
+    const auto packed = pack([&] {
+        const fs::path source = device().base() / "src";
+        writeBundle(source, "1", {{"CarrierName", "Bundle 1"}});
+        return source;
+    }());
+    test::writeText(bundle, std::string(packed.begin(), packed.end()));
+    CommandResult set = sendBundle("ACME.Default", "file", bundle);
+    EXPECT_EQ(set.status, 0) << set.output;
+    EXPECT_EQ(json::parse(set.output),
+              json({true, true,
+                    "extracted " + std::to_string(packed.size()) + " bytes into the user bundle"}));
+    auto announced = monitor.waitForStatus({{"BehaviorID", "acme.default"},
+                                            {"Supported", true},
+                                            {"WhyNotSupported", ""},
+                                            {"LinkedBundleVersion", "1"},
+                                            {"UserBundleVersion", "1"},
+                                            {"LastPayloadExtracted", true}});
+    ASSERT_TRUE(announced);
+    EXPECT_GT((*announced)["LastPayloadUSec"].get<std::uint64_t>(), 0u);
+    EXPECT_EQ((*announced)["LinkedBundlePath"], at(kUserBundle).string());
+
+    json all = getAll();
+    EXPECT_EQ(all.size(), 18u) << all.dump();
+    for (const auto& [name, value] : announced->items()) {
+        EXPECT_EQ(all[name]["data"], value) << name;
+    }
+    EXPECT_EQ(all["NextUpdateCheckUSec"]["type"], "t");
+    EXPECT_EQ(all["DaemonVersion"]["type"], "s");
+    EXPECT_EQ(all["LastCheckOutcome"]["data"], "");
+
+    const fs::path garbage = device().base() / "garbage.tgz";
+    test::writeText(garbage, "not an archive");
+    // Through a pipe: read without waiting for a writer, so only a finished one is taken.
+    CommandResult broken = sendBundle("acme.default", "pipe", garbage);
+    EXPECT_EQ(broken.status, 0) << broken.output;
+    EXPECT_EQ(json::parse(broken.output)[1], false) << broken.output;
+    announced = monitor.waitForStatus({{"LastPayloadExtracted", false}});
+    ASSERT_TRUE(announced);
+    EXPECT_NE((*announced)["LastPayloadReason"], "");
+
+    for (const char* how : {"open-pipe", "device"}) {
+        CommandResult refused = sendBundle("other", how);
+        EXPECT_EQ(refused.status, 1) << how;
+        EXPECT_THAT(refused.output, StartsWith("org.freedesktop.DBus.Error.InvalidArgs Bundle "
+                                               "refused: "))
+            << how;
+    }
+    // The client library tells the refusal by its name and category.
+    io::UniqueFd devNull(::open("/dev/null", O_RDONLY | O_CLOEXEC));
+    try {
+        client().setTavrixIDWithBundleFile("other", devNull.get());
+        ADD_FAILURE() << "a device was taken as a bundle";
+    } catch (const client::ClientError& error) {
+        EXPECT_EQ(error.category(), client::ErrorCategory::InvalidArguments);
+        EXPECT_EQ(error.errorName(), "org.freedesktop.DBus.Error.InvalidArgs");
+    }
+    EXPECT_EQ(getProperties("BehaviorID").output, "s \"acme.default\"\n") << "nothing was stored";
+
+    // No catalog configured: the check ends at once.
+    CommandResult check = busctl("call " + std::string(kDaemonBusName) + " " + kDaemonObjectPath +
+                                 " " + kDaemonInterface + " CheckForTavrixBundleUpdate");
+    EXPECT_EQ(check.output, "b false\n");
+    ASSERT_TRUE(monitor.waitForStatus({{"LastCheckOutcome", "no-catalog"}}));
+    EXPECT_EQ(monitor.nextCheckFinished(10s), json({"no-catalog", "no catalog configured"}));
+}
+
+// The interface XML kept in docs/ is what the daemon introspects as: the same methods with the
+// same arguments, properties and signals, compared by Python's XML parser.
+TEST_F(StatusPropertiesTest, IntrospectionMatchesTheDocumentedInterface) {
+    CommandResult compared = runCommand(
+        {"/bin/bash", "-c",
+         "set -o pipefail; /usr/bin/busctl --address='" + busAddress() +
+             "' introspect --xml-interface com.zandor.tavrixservicesd /com/zandor/tavrixservicesd "
+             "| /usr/bin/python3 -c '" +
+             R"(import sys, xml.etree.ElementTree as tree
+def members(root):
+    found = {}
+    for interface in root.iter("interface"):
+        if not interface.get("name").startswith("com.zandor."):
+            continue
+        def types(element, direction):
+            return "".join(a.get("type") for a in element if a.tag == "arg" and
+                           a.get("direction", direction) == direction)
+        found[interface.get("name")] = sorted(
+            (e.tag, e.get("name"), types(e, "in"), types(e, "out")) if e.tag == "method" else
+            (e.tag, e.get("name"), types(e, "out"), "") if e.tag == "signal" else
+            (e.tag, e.get("name"), e.get("type"), e.get("access"))
+            for e in interface if e.tag in ("method", "signal", "property"))
+    return found
+documented = members(tree.parse(sys.argv[1]).getroot())
+live = members(tree.fromstring(sys.stdin.read()))
+print("same" if documented == live else "documented %s\nlive %s" % (documented, live)))" +
+             "' '" + TAVRIX_INTERFACE_XML + "'"});
+    EXPECT_EQ(compared.status, 0) << compared.output;
+    EXPECT_EQ(compared.output, "same\n");
+}
+
+}  // namespace
+}  // namespace tavrix::integration
