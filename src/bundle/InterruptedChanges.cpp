@@ -29,17 +29,20 @@ void removeLeftover(const std::string& path) {
     }
 }
 
-// Removes the daemon's own entries of directory whose names start with prefix (or are name):
-// only what the daemon wrote, in a directory others may write in too.
-void removeOwnLeftovers(const std::optional<io::Directory>& directory, std::string_view prefix) {
+// Removes the abandoned temporaries of the daemon's user in directory, and the entry named
+// staged when it is the daemon's user's: only what the daemon wrote, in a directory others may
+// write in too.
+void removeOwnLeftovers(const std::optional<io::Directory>& directory,
+                        std::string_view staged = {}) {
     std::vector<std::string> names;
     if (!directory || readDirectoryNames(directory->path(), names) != 0) {
         return;
     }
     for (const std::string& name : names) {
         auto entry = directory->entryStatus(name);
-        if (name.starts_with(prefix) && entry && entry->st_uid == ::geteuid() &&
-            directory->removeEntry(name) == 0) {
+        const bool leftover = name == staged ? entry && entry->st_uid == ::geteuid()
+                                             : io::isAbandonedTemporary(*directory, name);
+        if (leftover && directory->removeEntry(name) == 0) {
             logCFormat("Removed %s, left by an interrupted change\n",
                        directory->pathOf(name).c_str());
         }
@@ -67,20 +70,17 @@ void removeLeftoversOfInterruptedChanges(const std::string& bundleLink,
                                          const std::string& preferencesLink) {
     for (const std::string& link : {bundleLink, preferencesLink}) {
         if (!link.empty()) {
-            removeOwnLeftovers(device::openMobileHomeDirectory(dirNameOfPath(link), false),
-                               io::kAtomicWritePrefix);
+            removeOwnLeftovers(device::openMobileHomeDirectory(dirNameOfPath(link), false));
         }
     }
     std::string overlays = overriddenFilesDirectory();
     if (!overlays.empty()) {
         overlays.pop_back();
-        removeOwnLeftovers(device::openMobileHomeDirectory(overlays, false),
-                           io::kAtomicWritePrefix);
+        removeOwnLeftovers(device::openMobileHomeDirectory(overlays, false));
     }
     const std::string staged = device::resolvePath(payload::kBundleArchiveTempPath);
     const auto temporary = openDirectory(dirNameOfPath(staged));
     removeOwnLeftovers(temporary, baseNameOfPath(staged));
-    removeOwnLeftovers(temporary, io::kAtomicWritePrefix);
     if (const std::string& userBundle = userBundleLocation(); !userBundle.empty()) {
         if (device::openMobileHomeDirectory(dirNameOfPath(userBundle), false)) {
             removeLeftover(payload::extractionStagingPathFor(userBundle));

@@ -2,7 +2,9 @@
 
 #include <fcntl.h>
 #include <stdio.h>
+#include <sys/file.h>
 #include <sys/random.h>
+#include <time.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -14,6 +16,8 @@ namespace tavrix::io {
 namespace {
 
 constexpr int kOpenFlags = O_RDONLY | O_DIRECTORY | O_CLOEXEC;
+// A temporary younger than this may be one another writer has just made.
+constexpr long kTemporaryGraceSeconds = 5;
 // Enough tries that a directory crowded with other users' look-alike names cannot stop a write.
 constexpr int kTemporaryNameAttempts = 100;
 
@@ -162,6 +166,9 @@ int Directory::writeFile(std::string_view name, mode_t mode, bool replace,
         return EEXIST;
     }
     TemporaryEntry entry(fd_.get(), temporary);
+    // Held while the file is written, so that a clean-up of abandoned temporaries (by another
+    // process with the same prefix) can tell this one is in use.
+    ::flock(file.get(), LOCK_EX | LOCK_NB);
     if (int error = fill(file.get()); error != 0) {
         return error;
     }
@@ -291,6 +298,28 @@ UniqueFd openOwnFile(const std::string& path, int* error) {
         return UniqueFd();
     }
     return directory->openOwnFile(lastPathComponent(path), error);
+}
+
+bool isAbandonedTemporary(const Directory& directory, std::string_view name) {
+    if (!std::string_view(name).starts_with(kAtomicWritePrefix)) {
+        return false;
+    }
+    auto entry = directory.entryStatus(name);
+    if (!entry || entry->st_uid != ::geteuid()) {
+        return false;
+    }
+    if (S_ISREG(entry->st_mode)) {
+        UniqueFd file(::openat(directory.fd(), std::string(name).c_str(),
+                               O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+        // A writer still holds it.
+        if (file && ::flock(file.get(), LOCK_EX | LOCK_NB) != 0) {
+            return false;
+        }
+    }
+    // A link, or a file made a moment ago and not yet locked by its writer, stays a while.
+    timespec now{};
+    ::clock_gettime(CLOCK_REALTIME, &now);
+    return now.tv_sec - entry->st_mtim.tv_sec > kTemporaryGraceSeconds;
 }
 
 }  // namespace tavrix::io

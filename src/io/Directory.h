@@ -77,6 +77,10 @@ class Directory {
     struct stat status_ {};
 };
 
+// Whether name in directory is a temporary of this process's user that no writer uses any more
+// (its writer died): named with kAtomicWritePrefix, not locked by a writer, and not brand new.
+bool isAbandonedTemporary(const Directory& directory, std::string_view name);
+
 // The daemon's own file at path: Directory::openOwnFile in path's directory, which must be no
 // link and protected (EPERM otherwise).
 UniqueFd openOwnFile(const std::string& path, int* error);

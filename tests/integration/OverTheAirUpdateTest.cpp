@@ -611,8 +611,8 @@ TEST_F(ReleaseTrainTest, TheDocumentedReleaseTrainRunsAgainstADevice) {
     EXPECT_EQ(runStep("bucket"), formula.output);
     EXPECT_EQ(formula.output, "37\n") << "the train needs a device between 5 and 50 %";
     auto check = tavrixctlJson({"check-update"});
-    EXPECT_EQ(textAt(check, "outcome"), "held-back");
-    EXPECT_EQ(textAt(check, "reason"),
+    EXPECT_EQ(textAt(check, "Outcome"), "held-back");
+    EXPECT_EQ(textAt(check, "Reason"),
               "held back by a staged rollout (5 %): version 2 is not offered to this device yet");
     EXPECT_EQ(textAt(tavrixctlJson({"status"}), "LastCheck.Outcome"), "held-back");
 
@@ -620,7 +620,7 @@ TEST_F(ReleaseTrainTest, TheDocumentedReleaseTrainRunsAgainstADevice) {
     runStep("widen");
     EXPECT_EQ(test::snapshotTree(site() / "archives"), archives) << "nothing was packed again";
     check = tavrixctlJson({"check-update", "--wait", "30"});
-    EXPECT_EQ(textAt(check, "reason"), "installed version 2");
+    EXPECT_EQ(textAt(check, "Reason"), "installed version 2");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 2, 30s));
     expectInstalled("2");
 
@@ -628,14 +628,14 @@ TEST_F(ReleaseTrainTest, TheDocumentedReleaseTrainRunsAgainstADevice) {
     const std::string widenedSignature = readText(site() / "catalog.plist.sig");
     EXPECT_NE(runStep("refresh").find("catalog is good"), std::string::npos);
     check = tavrixctlJson({"check-update"});
-    EXPECT_EQ(textAt(check, "reason"), "up to date (version 2 installed)");
+    EXPECT_EQ(textAt(check, "Reason"), "up to date (version 2 installed)");
     const std::string refreshed = readText(site() / "catalog.plist");
     const std::string refreshedSignature = readText(site() / "catalog.plist.sig");
     writeText(site() / "catalog.plist.sig", widenedSignature);
     writeText(site() / "catalog.plist", widened);
     check = tavrixctlJson({"check-update"}, 1);
-    EXPECT_TRUE(textAt(check, "reason").starts_with("catalog refused: rollback: "))
-        << textAt(check, "reason");
+    EXPECT_TRUE(textAt(check, "Reason").starts_with("catalog refused: rollback: "))
+        << textAt(check, "Reason");
     writeText(site() / "catalog.plist.sig", refreshedSignature);
     writeText(site() / "catalog.plist", refreshed);
 
@@ -669,7 +669,7 @@ TEST_F(ReleaseTrainTest, TheDocumentedReleaseTrainRunsAgainstADevice) {
     ::kill(*pid, SIGTERM);
     ASSERT_EQ(waitForDaemonExit(*pid, 90s), std::optional<int>(0));
     check = tavrixctlJson({"check-update"});
-    EXPECT_EQ(textAt(check, "reason"), "up to date (version 2 installed)");
+    EXPECT_EQ(textAt(check, "Reason"), "up to date (version 2 installed)");
     EXPECT_TRUE(fs::exists(site() / archive3)) << "the previous catalog still names it";
 
     runStep("rotate-keygen");
@@ -679,13 +679,13 @@ TEST_F(ReleaseTrainTest, TheDocumentedReleaseTrainRunsAgainstADevice) {
     EXPECT_FALSE(fs::exists(site() / archive3)) << "no catalog being served names it any more";
     trustKeys({{"release-2027", base / "release-2027.pub"}});
     check = tavrixctlJson({"check-update"});
-    EXPECT_EQ(textAt(check, "reason"), "up to date (version 2 installed)");
+    EXPECT_EQ(textAt(check, "Reason"), "up to date (version 2 installed)");
     // The old key is revoked with its removal.
     writeText(site() / "catalog.plist.sig", refreshedSignature);
     writeText(site() / "catalog.plist", refreshed);
     check = tavrixctlJson({"check-update"}, 1);
-    EXPECT_TRUE(textAt(check, "reason").starts_with("catalog refused: unknown key: "))
-        << textAt(check, "reason");
+    EXPECT_TRUE(textAt(check, "Reason").starts_with("catalog refused: unknown key: "))
+        << textAt(check, "Reason");
     EXPECT_EQ(linkedVersion(), "2");
 }
 

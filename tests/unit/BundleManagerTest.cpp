@@ -1,4 +1,6 @@
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include <cstdlib>
 #include <filesystem>
@@ -198,6 +200,12 @@ TEST_F(BundleManagerStartUp, LinksThatDisagreeAreLinkedAgainAndLeftoversRemoved)
     fs::create_symlink(userBundle(), home() + "/Library/.tavrix-write-Xy12Ab");
     test::writeText(root() + "/tmp/behaviorbundle_zipped.tgz", "staged");
     test::writeText(home() + "/Library/TavrixBundles/.Default.bundle.incoming/Info.plist", "x");
+    // Temporaries are left alone while they may still be being written.
+    const timespec aMinuteAgo[2] = {{::time(nullptr) - 60, 0}, {::time(nullptr) - 60, 0}};
+    for (const std::string& temporary :
+         {overlays + ".tavrix-write-Ab12Cd", home() + "/Library/.tavrix-write-Xy12Ab"}) {
+        ASSERT_EQ(::utimensat(AT_FDCWD, temporary.c_str(), aMinuteAgo, AT_SYMLINK_NOFOLLOW), 0);
+    }
 
     BundleManager& manager = BundleManager::sharedInstance();
     for (const std::string& leftover :
