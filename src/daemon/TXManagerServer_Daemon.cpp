@@ -68,11 +68,10 @@ int handleSetTavrixID(sd_bus_message* message, void* userdata, sd_bus_error* err
     auto& server = *static_cast<TXManagerServer*>(userdata);
     const char* tavrixID = nullptr;
     std::optional<std::vector<std::uint8_t>> bundle;
-    int r = sd_bus_message_read(message, "s", &tavrixID);
-    if (r >= 0) {
-        r = bus::readOptionalBytes(message, bundle);
+    if (int r = sd_bus_message_read(message, "s", &tavrixID); r < 0) {
+        return invalidArguments(error, r);
     }
-    if (r < 0) {
+    if (bus::readOptionalBytes(message, bundle) < 0) {
         return sd_bus_error_set(error, SD_BUS_ERROR_INVALID_ARGS,
                                 "The bundle must be an array of at most one byte array");
     }
