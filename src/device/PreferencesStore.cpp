@@ -144,15 +144,15 @@ struct PreferencesStore::Domain {
         if (!fd || ::fstat(fd.get(), &opened) != 0) {
             return {};
         }
-        // What was opened must still be what was checked: the daemon's link, or its file.
-        auto now = preferences->entryStatus(fileName);
-        const bool same = now && io::isTrustedOwner(now->st_uid) &&
-                          (follow == 0 ? now->st_ino == entry->st_ino && S_ISLNK(now->st_mode)
-                                       : now->st_ino == opened.st_ino);
-        if (!same || !io::isTrustedOwner(opened.st_uid)) {
-            return {};
+        // A file is judged by what was opened; a link that was followed must still be the
+        // daemon's (another user may have put one there only after the first look).
+        if (follow == 0) {
+            auto now = preferences->entryStatus(fileName);
+            if (!now || !S_ISLNK(now->st_mode) || !io::isTrustedOwner(now->st_uid)) {
+                return {};
+            }
         }
-        return fd;
+        return io::isTrustedOwner(opened.st_uid) ? std::move(fd) : io::UniqueFd();
     }
 
     std::string home;
