@@ -7,7 +7,7 @@ packages=(
     build-essential cmake ninja-build pkg-config clang libclang-rt-14-dev clang-format
     libsystemd-dev libplist-dev libarchive-dev libcurl4-openssl-dev libssl-dev libsodium-dev zlib1g-dev nlohmann-json3-dev
     libgtest-dev libgmock-dev libbenchmark-dev
-    dbus libarchive-tools curl python3 tzdata libplist-utils
+    dbus libarchive-tools curl python3 tzdata libplist-utils strace
 )
 
 # `--deb`: also what building and checking the Debian package needs.
