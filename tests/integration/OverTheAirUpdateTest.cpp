@@ -458,10 +458,10 @@ TEST_F(OverTheAirUpdateTest, KilledAnywhereInAnUpdateTheNextLaunchCompletesOrRed
 }
 
 // A daemon that is leaving while it still installs an update, and a new one activated meanwhile by
-// a payload, repeated: the new daemon answers the payload only once the old one has ended, so
-// every round ends with the payload linked, whole, and a status view that says what the disk
-// holds. Prints what each round left (run at the starting commit, it found empty and mixed
-// bundles).
+// a payload, repeated: the old daemon installs the update before it ends (its last check says so),
+// the new one answers the payload only once the old one has ended, so every round ends with the
+// payload linked, whole, and a status view that says what the disk holds. Prints what each round
+// left (before the instance lock, some rounds left an empty bundle or the update over the payload).
 TEST_F(OverTheAirUpdateTest, DaemonStartedWhileTheLastOneDrainsActsAfterIt) {
     constexpr std::size_t kBulk = 1 << 20;
     setIDWithBundle("1");
@@ -502,6 +502,12 @@ TEST_F(OverTheAirUpdateTest, DaemonStartedWhileTheLastOneDrainsActsAfterIt) {
                 test::snapshotTree(device().base() / ("bundles/" + linked + "/Default.bundle"));
         const plist::Dictionary status = client().status();
         const auto linkedInStatus = status.find("LinkedBundle");
+        // The check the old daemon answered while leaving was installed before it ended.
+        const auto lastCheck = status.find("LastCheck");
+        EXPECT_TRUE(lastCheck != status.end() && lastCheck->second.find("Reason") &&
+                    *lastCheck->second.find("Reason") ==
+                        plist::Value("installed version " + update))
+            << (lastCheck != status.end() ? lastCheck->second.description() : "no LastCheck");
         const bool statusMatches =
             linkedInStatus != status.end() && linkedInStatus->second.find("Version") &&
             *linkedInStatus->second.find("Version") == plist::Value(linked) &&
