@@ -180,7 +180,11 @@ ServiceManager::InstanceLock ServiceManager::tryLockInstance() {
     if (errno == EWOULDBLOCK || errno == EINTR) {
         return InstanceLock::HeldByAnother;
     }
-    logCFormat("Cannot lock %s: %s\n", path.c_str(), std::strerror(errno));
+    // Retried while waiting: said once.
+    if (!instanceLockFailureLogged_) {
+        logCFormat("Cannot lock %s: %s\n", path.c_str(), std::strerror(errno));
+        instanceLockFailureLogged_ = true;
+    }
     return InstanceLock::Unusable;
 }
 

@@ -62,7 +62,7 @@ class ServiceManager {
     enum class InstanceLock { Held, HeldByAnother, Unusable };
     // Takes the instance lock without waiting; once Held, every later call answers Held.
     // Unusable (logged) when the lock file cannot be opened or is not a regular file of the
-    // daemon's own user: that is never waited out.
+    // daemon's own user: that is never waited out. Main thread only.
     InstanceLock tryLockInstance();
 
   private:
@@ -78,6 +78,7 @@ class ServiceManager {
     io::UniqueFd wakeFd_;
     io::UniqueFd instanceLockFd_;  // kept open, and so locked, until the process ends
     bool instanceLockHeld_ = false;
+    bool instanceLockFailureLogged_ = false;
 };
 
 // One service-manager transaction, open while the object lives: work the process must finish

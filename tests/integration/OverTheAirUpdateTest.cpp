@@ -489,6 +489,11 @@ TEST_F(OverTheAirUpdateTest, DaemonStartedWhileTheLastOneDrainsActsAfterIt) {
         auto answer = std::async(std::launch::async,
                                  [&] { return client().setTavrixID(kBehaviorID, packed); });
         ASSERT_TRUE(waitForNameOwner());
+        // Meanwhile the new daemon answers what only reads, and says that it waits.
+        EXPECT_TRUE(client().isTavrixBundleSupported());
+        const plist::Dictionary waiting = client().status();
+        EXPECT_TRUE(waiting.contains("WaitingForPreviousDaemon"));
+        EXPECT_FALSE(waiting.contains("LinkedBundle"));
         server.releaseHeldResponses();
         EXPECT_TRUE(answer.get());
         ASSERT_EQ(waitForDaemonExit(*pid, 70s), std::optional<int>(0));
