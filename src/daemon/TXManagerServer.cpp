@@ -442,14 +442,18 @@ void TXManagerServer::setTavrixID(const std::string& tavrixID,
 }
 
 void TXManagerServer::isTavrixBundleSupported(const std::function<void(bool)>& replyHandler) {
-    reply(replyHandler, TXManager::isTavrixBundleSupported());
+    // The first call of a daemon that holds the lock does the start-up work (TXManager's creation);
+    // one that waits for the lock answers from the preferences alone.
+    reply(replyHandler, _holdsInstanceLock ? manager().isTavrixBundleSupported()
+                                           : TXManager::isTavrixBundleSupported());
 }
 
 void TXManagerServer::copyTavrixValue(
     const std::string& key, const std::function<void(std::optional<plist::Value>)>& replyHandler) {
     plist::Value keyValue(key);
     logObjectFormat("Handling Copy Tavrix Value for key %@", &keyValue);
-    reply(replyHandler, TXManager::copyTavrixValue(key));
+    reply(replyHandler,
+          _holdsInstanceLock ? manager().copyTavrixValue(key) : TXManager::copyTavrixValue(key));
 }
 
 void TXManagerServer::checkForTavrixBundleUpdate(const std::function<void(bool)>& replyHandler) {

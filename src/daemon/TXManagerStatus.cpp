@@ -37,7 +37,9 @@ plist::Dictionary copyDaemonStatus(bool holdsInstanceLock) {
     if (behaviorID && behaviorID->isString()) {
         status.insert_or_assign(kStatusBehaviorIDKey, *behaviorID);
     }
-    const BundleSupport support = TXManager::bundleSupport();
+    // Holding the lock, the first look does the start-up work, as any first call does.
+    const BundleSupport support = holdsInstanceLock ? TXManager::sharedInstance().bundleSupport()
+                                                    : TXManager::bundleSupport();
     status.insert_or_assign(kStatusSupportedKey, plist::Value(support == BundleSupport::Supported));
     setText(status, kStatusWhyNotSupportedKey, bundleSupportReason(support));
 
