@@ -8,7 +8,7 @@ packages=(
     libsystemd-dev libplist-dev libarchive-dev libcurl4-openssl-dev libssl-dev libsodium-dev zlib1g-dev
     nlohmann-json3-dev
     libgtest-dev libgmock-dev libbenchmark-dev
-    dbus libarchive-tools curl python3 python3-dbus tzdata libplist-utils
+    dbus libarchive-tools curl python3 python3-dbus tzdata libplist-utils strace
 )
 
 # `--deb`: also what building and checking the Debian package needs.

@@ -37,6 +37,16 @@ bool replaceUserBundle(const UserBundleFill& fill, std::string* whyNot) {
         removeItemTree(staging);
         return false;
     }
+    // The extractor and the copy write without flushing: on the disk before the old bundle goes,
+    // so that a power cut after the rename cannot leave empty files under the bundle's name.
+    if (int error = bundles->flushTree(io::lastPathComponent(staging));
+        error != 0 && error != ENOENT) {
+        logCFormat("Could not flush the new bundle in %s (error %d), keeping the old one\n",
+                   staging.c_str(), error);
+        removeItemTree(staging);
+        *whyNot = std::string("the new bundle could not be flushed: ") + std::strerror(error);
+        return false;
+    }
     // A bundle that cannot be removed whole (and would mix with the new one) stays as it is.
     if (int removed = removeItemTree(bundle); removed != 0 && removed != ENOENT) {
         logCFormat("Could not remove the bundle %s (error %d), keeping it\n", bundle.c_str(),

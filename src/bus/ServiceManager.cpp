@@ -2,12 +2,14 @@
 
 #include <fcntl.h>
 #include <sys/eventfd.h>
+#include <sys/file.h>
 #include <sys/stat.h>
 #include <systemd/sd-daemon.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <cstdlib>
+#include <cstring>
 #include <filesystem>
 #include <string_view>
 
@@ -15,6 +17,7 @@
 #include "io/AtomicFile.h"
 #include "io/FileIO.h"
 #include "io/UniqueFd.h"
+#include "util/Log.h"
 
 namespace tavrix::bus {
 namespace {
@@ -144,6 +147,45 @@ void ServiceManager::consumeWake() {
         std::uint64_t count = 0;
         [[maybe_unused]] ssize_t got = ::read(wakeFd_.get(), &count, sizeof count);
     }
+}
+
+ServiceManager::InstanceLock ServiceManager::tryLockInstance() {
+    if (instanceLockHeld_) {
+        return InstanceLock::Held;
+    }
+    const std::string path = runtimeDirectory_ + "/instance.lock";
+    if (!instanceLockFd_) {
+        std::error_code error;
+        std::filesystem::create_directories(runtimeDirectory_, error);
+        // No link is followed and the file is checked once open, so that nobody else's file can
+        // stand in for the lock (and be truncated, or be held by its owner forever).
+        io::UniqueFd fd(
+            ::open(path.c_str(), O_RDWR | O_CREAT | O_NOFOLLOW | O_CLOEXEC | O_NOCTTY, 0600));
+        if (!fd) {
+            logCFormat("Cannot open the instance lock %s: %s\n", path.c_str(),
+                       std::strerror(errno));
+            return InstanceLock::Unusable;
+        }
+        struct stat info {};
+        if (::fstat(fd.get(), &info) != 0 || !S_ISREG(info.st_mode) || info.st_uid != ::geteuid()) {
+            logCFormat("The instance lock %s is not a file of this daemon's user\n", path.c_str());
+            return InstanceLock::Unusable;
+        }
+        instanceLockFd_ = std::move(fd);
+    }
+    if (::flock(instanceLockFd_.get(), LOCK_EX | LOCK_NB) == 0) {
+        instanceLockHeld_ = true;
+        return InstanceLock::Held;
+    }
+    if (errno == EWOULDBLOCK || errno == EINTR) {
+        return InstanceLock::HeldByAnother;
+    }
+    // Retried while waiting: said once.
+    if (!instanceLockFailureLogged_) {
+        logCFormat("Cannot lock %s: %s\n", path.c_str(), std::strerror(errno));
+        instanceLockFailureLogged_ = true;
+    }
+    return InstanceLock::Unusable;
 }
 
 void ServiceManager::notifyReady(const std::string& status) {

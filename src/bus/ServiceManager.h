@@ -4,6 +4,10 @@
 // The keep-alive flag is kept in "<runtime directory>/keep-alive" ("1" or "0"), the runtime
 // directory being $RUNTIME_DIRECTORY or /run/tavrixservicesd under the platform root, so that it
 // survives a restart of the daemon.
+//
+// The instance lock, "<runtime directory>/instance.lock", is held (flock) by one daemon process at
+// a time for the rest of its life, draining included; only its holder touches bundles, staging or
+// leftovers. The process's end releases it, whatever way it ends.
 #pragma once
 
 #include <atomic>
@@ -55,6 +59,12 @@ class ServiceManager {
 
     const std::string& keepAlivePath() const { return keepAlivePath_; }
 
+    enum class InstanceLock { Held, HeldByAnother, Unusable };
+    // Takes the instance lock without waiting; once Held, every later call answers Held.
+    // Unusable (logged) when the lock file cannot be opened or is not a regular file of the
+    // daemon's own user: that is never waited out. Main thread only.
+    InstanceLock tryLockInstance();
+
   private:
     ServiceManager();
     void wake();
@@ -66,6 +76,9 @@ class ServiceManager {
     std::atomic<std::int64_t> lastActivityTicks_;
     mutable std::mutex keepAliveMutex_;
     io::UniqueFd wakeFd_;
+    io::UniqueFd instanceLockFd_;  // kept open, and so locked, until the process ends
+    bool instanceLockHeld_ = false;
+    bool instanceLockFailureLogged_ = false;
 };
 
 // One service-manager transaction, open while the object lives: work the process must finish

@@ -15,6 +15,7 @@
 #include "catalog/AssetCatalog.h"
 #include "catalog/CatalogCrypto.h"
 #include "http/HttpTransfer.h"
+#include "io/Directory.h"
 #include "io/FileIO.h"
 #include "io/Paths.h"
 #include "io/UniqueFd.h"
@@ -189,8 +190,18 @@ std::optional<std::string> downloadAndInstallAsset(const CatalogEntry& entry,
                                  &whyNot)) {
         return whyNot;
     }
-    if (::rename(extraction.path().c_str(), location.directory.c_str()) != 0) {
-        return errnoText("install into", location.directory, errno);
+    // A resumed install copies from here, so the tree is on the disk before it takes its name.
+    int error = 0;
+    auto cache = io::Directory::open(cacheDirectory, io::Directory::LastLink::Follow, &error);
+    if (!cache) {
+        return errnoText("open", cacheDirectory, error);
+    }
+    if ((error = cache->flushTree(io::lastPathComponent(extraction.path()))) != 0) {
+        return errnoText("flush", extraction.path(), error);
+    }
+    if ((error = cache->renameEntry(io::lastPathComponent(extraction.path()),
+                                    io::lastPathComponent(location.directory))) != 0) {
+        return errnoText("install into", location.directory, error);
     }
     return std::nullopt;
 }

@@ -107,7 +107,7 @@ const char* bundleSupportReason(BundleSupport support) {
     return "";
 }
 
-BundleSupport TXManager::bundleSupport() const {
+BundleSupport TXManager::bundleSupport() {
     if (TXUtility::hasCellularRadio()) {
         return BundleSupport::CellularRadio;
     }

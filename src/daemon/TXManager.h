@@ -30,15 +30,17 @@ class TXManager {
     static bool exists();
 
     // Stores the lower-cased ID, unpacks the bundle when there is one and redoes the bundle match.
-    // False only on a device with a cellular radio. With a bundle and a payload, says what became
-    // of it.
+    // False on a device with a cellular radio, for an ID that is too long, and when the ID could
+    // not be stored. With a bundle and a payload, says what became of it.
     bool setTavrixID(const std::string& tavrixID, const std::optional<plist::Data>& bundle,
                      PayloadOutcome* payload = nullptr);
-    bool isTavrixBundleSupported();
+    // These three only read the preferences: they need no instance, so that a daemon still
+    // waiting for the instance lock answers them without the start-up work.
+    static bool isTavrixBundleSupported();
     // What isTavrixBundleSupported answers from, without logging.
-    BundleSupport bundleSupport() const;
+    static BundleSupport bundleSupport();
     // The behavior setting for key from "com.zandor.tavrix", or nothing.
-    std::optional<plist::Value> copyTavrixValue(const std::string& key);
+    static std::optional<plist::Value> copyTavrixValue(const std::string& key);
     bool checkForTavrixBundleUpdate();
 
   private:

@@ -7,6 +7,7 @@
 #include <algorithm>
 #include <cstdlib>
 #include <cstring>
+#include <iterator>
 #include <thread>
 
 #include "bus/NotificationCenter.h"
@@ -89,6 +90,11 @@ int TXManagerServer::runUntilIdleExit() {
         logObjectFormat("Starting the server.");
     }
 
+    // Before the name: a daemon that could never hold the lock must not serve at all.
+    const auto lock = serviceManager.tryLockInstance();
+    if (lock == bus::ServiceManager::InstanceLock::Unusable) {
+        return 1;
+    }
     // A daemon that cannot serve leaves with a failure, so that the service manager's restart
     // policy and the caller see it.
     if (!_startServing()) {
@@ -96,6 +102,34 @@ int TXManagerServer::runUntilIdleExit() {
         return 1;
     }
     bus::setNotificationBus(_listener.bus());
+
+    if (lock == bus::ServiceManager::InstanceLock::Held) {
+        _startActing();
+        serviceManager.notifyReady(transactionStatus(transactions.openTransactions()));
+    } else {
+        // The previous daemon is still finishing its work: serve, and act once it has ended.
+        logCFormat("Another daemon is still finishing its work; waiting for it to end\n");
+        if (!_armLockRetry()) {
+            _stopWorkers();
+            return 1;
+        }
+        serviceManager.notifyReady("Waiting for the previous daemon to end");
+    }
+    _run();
+    _stopWorkers();
+    StatusPublisher::shared().detach();
+
+    if (_holdsInstanceLock) {
+        transactions.clearKeepAliveIfNecessary(true);
+    }
+    bus::setNotificationBus(nullptr);
+    return 0;
+}
+
+void TXManagerServer::_startActing() {
+    _holdsInstanceLock = true;
+    _lockRetryTimer.reset();
+    auto& transactions = TXTransactionManager::sharedInstance();
 
     logObjectFormat("Notifying observers of start");
     _notifyServerStart();
@@ -105,14 +139,86 @@ int TXManagerServer::runUntilIdleExit() {
 
     UpdateCheckScheduler::sharedInstance();
 
-    serviceManager.notifyReady(transactionStatus(transactions.openTransactions()));
-    _run();
-    _stopWorkers();
-    StatusPublisher::shared().detach();
+    // In arrival order, as if they had just come.
+    std::vector<DeferredCall> deferred = std::move(_deferredCalls);
+    _deferredCalls.clear();
+    for (DeferredCall& call : deferred) {
+        containExceptions("A kept call", [&] {
+            sd_bus_message* message = call.message.get();
+            sd_bus_error error = SD_BUS_ERROR_NULL;
+            int r = sd_bus_message_rewind(message, 1);
+            if (r >= 0) {
+                r = call.handler(message, this, &error);
+            }
+            if (r < 0 || sd_bus_error_is_set(&error)) {
+                if (sd_bus_error_is_set(&error)) {
+                    sd_bus_reply_method_error(message, &error);
+                } else {
+                    sd_bus_reply_method_errno(message, r, nullptr);
+                }
+            }
+            sd_bus_error_free(&error);
+        });
+    }
+}
 
-    transactions.clearKeepAliveIfNecessary(true);
-    bus::setNotificationBus(nullptr);
+bool TXManagerServer::_armLockRetry() {
+    sd_event_source* timer = nullptr;
+    const int r = sd_event_add_time_relative(
+        _event.get(), &timer, CLOCK_MONOTONIC,
+        std::chrono::duration_cast<std::chrono::microseconds>(kLockRetryInterval).count(), 0,
+        &TXManagerServer::_onLockRetry, this);
+    _lockRetryTimer.reset(timer);
+    if (r < 0) {
+        logCFormat("Cannot set up the instance lock timer: %s\n", std::strerror(-r));
+        return false;
+    }
+    return true;
+}
+
+int TXManagerServer::_onLockRetry(sd_event_source* source, uint64_t, void* userdata) {
+    auto& server = *static_cast<TXManagerServer*>(userdata);
+    containExceptions("Waiting for the instance lock", [&] {
+        if (bus::ServiceManager::shared().tryLockInstance() ==
+            bus::ServiceManager::InstanceLock::Held) {
+            logCFormat("The previous daemon has ended; acting\n");
+            server._startActing();
+            bus::ServiceManager::shared().notifyStatus("Serving");
+            return;
+        }
+        server._refuseDeferredCalls(std::chrono::steady_clock::now() - kLockPatience);
+        uint64_t now = 0;
+        sd_event_now(sd_event_source_get_event(source), CLOCK_MONOTONIC, &now);
+        sd_event_source_set_time(
+            source,
+            now +
+                std::chrono::duration_cast<std::chrono::microseconds>(kLockRetryInterval).count());
+        sd_event_source_set_enabled(source, SD_EVENT_ONESHOT);
+    });
     return 0;
+}
+
+int TXManagerServer::deferUntilLocked(sd_bus_message* message, sd_bus_message_handler_t handler,
+                                      void (*refuse)(sd_bus_message*)) {
+    if (_finishing) {
+        refuse(message);
+        return 1;
+    }
+    _deferredCalls.push_back(DeferredCall{bus::BusMessagePtr(sd_bus_message_ref(message)), handler,
+                                          refuse, std::chrono::steady_clock::now()});
+    return 1;
+}
+
+void TXManagerServer::_refuseDeferredCalls(std::chrono::steady_clock::time_point cutoff) {
+    auto firstKept = std::partition(_deferredCalls.begin(), _deferredCalls.end(),
+                                    [&](const DeferredCall& call) { return call.since < cutoff; });
+    std::vector<DeferredCall> refused(std::make_move_iterator(_deferredCalls.begin()),
+                                      std::make_move_iterator(firstKept));
+    _deferredCalls.erase(_deferredCalls.begin(), firstKept);
+    for (DeferredCall& call : refused) {
+        logCFormat("A call waited too long for the previous daemon to end; answering no\n");
+        call.refuse(call.message.get());
+    }
 }
 
 bool TXManagerServer::_startServing() {
@@ -205,7 +311,8 @@ void TXManagerServer::_run() {
             }
             timeout = std::min(
                 slice, duration_cast<microseconds>(_drainDeadline - now) + microseconds(1000));
-        } else if (serviceManager.isIdle()) {
+        } else if (_holdsInstanceLock && serviceManager.isIdle()) {
+            // (A daemon waiting for the lock stays: the previous one is about to end.)
             // Nothing open, keep-alive clear, and no activity (a call included) for the grace.
             const auto deadline = serviceManager.lastActivity() + serviceManager.idleGrace();
             if (now >= deadline) {
@@ -248,6 +355,9 @@ void TXManagerServer::_finish() {
     // While the name is still ours: subscribers match on it.
     StatusPublisher::shared().publish();
     _listener.releaseNameAndDrain();
+    // Leaving without ever holding the lock: the kept calls get their "no" now.
+    _lockRetryTimer.reset();
+    _refuseDeferredCalls(std::chrono::steady_clock::time_point::max());
 }
 
 void TXManagerServer::_stopWorkers() {
@@ -350,14 +460,18 @@ void TXManagerServer::setTavrixIDWithBundle(
 }
 
 void TXManagerServer::isTavrixBundleSupported(const std::function<void(bool)>& replyHandler) {
-    reply(replyHandler, manager().isTavrixBundleSupported());
+    // The first call of a daemon that holds the lock does the start-up work (TXManager's creation);
+    // one that waits for the lock answers from the preferences alone.
+    reply(replyHandler, _holdsInstanceLock ? manager().isTavrixBundleSupported()
+                                           : TXManager::isTavrixBundleSupported());
 }
 
 void TXManagerServer::copyTavrixValue(
     const std::string& key, const std::function<void(std::optional<plist::Value>)>& replyHandler) {
     plist::Value keyValue(key);
     logObjectFormat("Handling Copy Tavrix Value for key %@", &keyValue);
-    reply(replyHandler, manager().copyTavrixValue(key));
+    reply(replyHandler,
+          _holdsInstanceLock ? manager().copyTavrixValue(key) : TXManager::copyTavrixValue(key));
 }
 
 void TXManagerServer::checkForTavrixBundleUpdate(const std::function<void(bool)>& replyHandler) {
@@ -370,7 +484,7 @@ void TXManagerServer::setClientType(std::int32_t /*type: deliberately not kept*/
 }
 
 void TXManagerServer::getStatus(const std::function<void(plist::Dictionary)>& replyHandler) {
-    reply(replyHandler, copyDaemonStatus());
+    reply(replyHandler, copyDaemonStatus(_holdsInstanceLock));
 }
 
 }  // namespace tavrix

@@ -6,6 +6,12 @@
 // answered, then the loop keeps running until the work those calls started (every open
 // transaction) has ended, within kDrainLimit; only then are the worker threads stopped and
 // joined, before anything they use goes away.
+//
+// Only the holder of the instance lock (ServiceManager) acts. A daemon started while the previous
+// one still drains owns the name and answers the read-only calls at once, but keeps the calls that
+// change something until the lock is its own (the previous daemon has ended), within
+// kLockPatience; its start-up work (the bundle manager's clean-up, the resume of an interrupted
+// install, the bundle match, the update check timer) comes after the lock as well.
 #pragma once
 
 #include <sys/types.h>
@@ -41,6 +47,11 @@ class TXManagerServer : private bus::ServiceListener::Delegate {
     // How long a leaving daemon waits for open transactions; below systemd's stop timeout, so
     // that it leaves on its own terms.
     static constexpr std::chrono::seconds kDrainLimit{60};
+    // How long a call that changes something waits for the instance lock before it is answered
+    // "no": below the bus's default call timeout, so that the client gets an answer.
+    static constexpr std::chrono::seconds kLockPatience{20};
+    // How often a daemon waiting for the instance lock tries it again.
+    static constexpr std::chrono::milliseconds kLockRetryInterval{50};
     // How long each worker thread may take to finish its queue once the daemon is leaving.
     static constexpr std::chrono::seconds kWorkerStopPatience{10};
 
@@ -80,6 +91,14 @@ class TXManagerServer : private bus::ServiceListener::Delegate {
 
     bus::ServiceListener& listener() { return _listener; }
 
+    // True once this process holds the instance lock and may act on bundles.
+    bool holdsInstanceLock() const { return _holdsInstanceLock; }
+    // Keeps a call that changes something until the instance lock is held, then runs handler on
+    // it again; answers it with refuse (its "no" reply) when the lock has not come within
+    // kLockPatience or the daemon leaves first. Returns what a method handler returns.
+    int deferUntilLocked(sd_bus_message* message, sd_bus_message_handler_t handler,
+                         void (*refuse)(sd_bus_message*));
+
   private:
     TXManagerServer();
 
@@ -96,6 +115,14 @@ class TXManagerServer : private bus::ServiceListener::Delegate {
     bool _startServing();
     void _run();
     void _notifyServerStart();
+    // Tries the instance lock again every kLockRetryInterval; answers kept calls whose patience
+    // ran out.
+    bool _armLockRetry();
+    static int _onLockRetry(sd_event_source* source, uint64_t usec, void* userdata);
+    // What a daemon does once it holds the instance lock, then the calls kept until then.
+    void _startActing();
+    // Answers kept calls "no": those kept since before cutoff.
+    void _refuseDeferredCalls(std::chrono::steady_clock::time_point cutoff);
     // Releases the name and answers what is queued; _run then waits for open transactions.
     void _finish();
     // Stops and joins every worker thread, in the order they feed each other.
@@ -109,6 +136,15 @@ class TXManagerServer : private bus::ServiceListener::Delegate {
     bus::EventSourcePtr _terminateSource;
     bus::EventSourcePtr _interruptSource;
     bus::EventSourcePtr _wakeSource;
+    bus::EventSourcePtr _lockRetryTimer;
+    struct DeferredCall {
+        bus::BusMessagePtr message;
+        sd_bus_message_handler_t handler;
+        void (*refuse)(sd_bus_message*);
+        std::chrono::steady_clock::time_point since;
+    };
+    std::vector<DeferredCall> _deferredCalls;
+    bool _holdsInstanceLock = false;
     bool _finishing = false;
     std::chrono::steady_clock::time_point _drainDeadline;
     bool _workersStopped = true;

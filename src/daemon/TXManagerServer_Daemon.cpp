@@ -64,8 +64,15 @@ Answer answerOf(const char* request, TXManagerServer& server, sd_bus_message* me
     return completed ? answer : fallback;
 }
 
+void refuseBoolean(sd_bus_message* message) {
+    replyBoolean(message, false);
+}
+
 int handleSetTavrixID(sd_bus_message* message, void* userdata, sd_bus_error* error) {
     auto& server = *static_cast<TXManagerServer*>(userdata);
+    if (!server.holdsInstanceLock()) {
+        return server.deferUntilLocked(message, handleSetTavrixID, refuseBoolean);
+    }
     const char* tavrixID = nullptr;
     std::optional<std::vector<std::uint8_t>> bundle;
     if (int r = sd_bus_message_read(message, "s", &tavrixID); r < 0) {
@@ -168,6 +175,9 @@ int handleCopyTavrixValue(sd_bus_message* message, void* userdata, sd_bus_error*
 
 int handleCheckForTavrixBundleUpdate(sd_bus_message* message, void* userdata, sd_bus_error*) {
     auto& server = *static_cast<TXManagerServer*>(userdata);
+    if (!server.holdsInstanceLock()) {
+        return server.deferUntilLocked(message, handleCheckForTavrixBundleUpdate, refuseBoolean);
+    }
     bool answer =
         answerOf("Check For Tavrix Bundle Update", server, message, false, [&](bool& result) {
             server.checkForTavrixBundleUpdate([&](bool started) { result = started; });

@@ -29,7 +29,7 @@ plist::Dictionary describeLinkedBundle(const CarrierBundle& bundle) {
 
 }  // namespace
 
-plist::Dictionary copyDaemonStatus() {
+plist::Dictionary copyDaemonStatus(bool holdsInstanceLock) {
     plist::Dictionary status = copyActivityRecord();
     status.insert_or_assign(kStatusDaemonVersionKey, plist::Value(TAVRIX_VERSION));
 
@@ -37,19 +37,25 @@ plist::Dictionary copyDaemonStatus() {
     if (behaviorID && behaviorID->isString()) {
         status.insert_or_assign(kStatusBehaviorIDKey, *behaviorID);
     }
-    const BundleSupport support = TXManager::sharedInstance().bundleSupport();
+    // Holding the lock, the first look does the start-up work, as any first call does.
+    const BundleSupport support = holdsInstanceLock ? TXManager::sharedInstance().bundleSupport()
+                                                    : TXManager::bundleSupport();
     status.insert_or_assign(kStatusSupportedKey, plist::Value(support == BundleSupport::Supported));
     setText(status, kStatusWhyNotSupportedKey, bundleSupportReason(support));
 
-    const CarrierBundle linked = BundleManager::sharedInstance().currentBundle();
-    if (!linked.bundlePath.empty()) {
-        status.insert_or_assign(kStatusLinkedBundleKey, plist::Value(describeLinkedBundle(linked)));
-    }
     setText(status, kStatusSystemBundleVersionKey,
             bundleInfoValueText(copyBundleVersionAtPath(systemBundleLocation())));
     setText(status, kStatusUserBundleVersionKey,
             bundleInfoValueText(copyBundleVersionAtPath(userBundleLocation())));
 
+    if (!holdsInstanceLock) {
+        status.insert_or_assign(kStatusWaitingForPreviousDaemonKey, plist::Value(true));
+        return status;
+    }
+    const CarrierBundle linked = BundleManager::sharedInstance().currentBundle();
+    if (!linked.bundlePath.empty()) {
+        status.insert_or_assign(kStatusLinkedBundleKey, plist::Value(describeLinkedBundle(linked)));
+    }
     if (auto next = UpdateCheckScheduler::sharedInstance().nextCheckTime()) {
         status.insert_or_assign(kStatusNextUpdateCheckKey, plist::Value(plist::Date{*next}));
     }

@@ -15,9 +15,13 @@ inline constexpr const char* kStatusSystemBundleVersionKey = "SystemBundleVersio
 inline constexpr const char* kStatusUserBundleVersionKey = "UserBundleVersion";
 inline constexpr const char* kStatusNextUpdateCheckKey = "NextUpdateCheck";
 inline constexpr const char* kStatusDaemonVersionKey = "DaemonVersion";
+// True while this daemon waits for the previous one to finish its work.
+inline constexpr const char* kStatusWaitingForPreviousDaemonKey = "WaitingForPreviousDaemon";
 // LastCheck and LastPayload come from the activity record under its own keys.
 
-// The status dictionary; a key is absent when its answer is unknown or none.
-plist::Dictionary copyDaemonStatus();
+// The status dictionary; a key is absent when its answer is unknown or none. A daemon that does not
+// hold the instance lock yet leaves out the linked bundle and the next check (reading them would
+// start the bundle manager's clean-up and the check timer) and says it is waiting.
+plist::Dictionary copyDaemonStatus(bool holdsInstanceLock = true);
 
 }  // namespace tavrix

@@ -1,5 +1,6 @@
 #include "io/Directory.h"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <stdio.h>
 #include <sys/file.h>
@@ -8,6 +9,8 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <memory>
+#include <vector>
 
 #include "io/FileIO.h"
 #include "io/Paths.h"
@@ -275,6 +278,52 @@ int Directory::removeEntry(std::string_view name) const {
         return errno;
     }
     return ::unlinkat(fd_.get(), entry.c_str(), AT_REMOVEDIR) == 0 ? 0 : errno;
+}
+
+int Directory::flushTree(std::string_view name) const {
+    if (!isValidName(name)) {
+        return EINVAL;
+    }
+    const std::string entry(name);
+    UniqueFd fd(::openat(fd_.get(), entry.c_str(),
+                         O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+    if (!fd) {
+        // A link is flushed with the directory that holds it.
+        return errno == ELOOP ? 0 : errno;
+    }
+    struct stat status {};
+    if (::fstat(fd.get(), &status) != 0) {
+        return errno;
+    }
+    if (S_ISDIR(status.st_mode)) {
+        // The listing reads from its own descriptor, so that fd stays for the flush below.
+        UniqueFd listingFd(::openat(fd.get(), ".", kOpenFlags));
+        std::unique_ptr<DIR, int (*)(DIR*)> listing(
+            listingFd ? ::fdopendir(listingFd.get()) : nullptr, &::closedir);
+        if (!listing) {
+            return errno;
+        }
+        listingFd.release();  // the listing owns it now
+        const Directory directory(std::move(fd), pathOf(name), status);
+        std::vector<std::string> names;
+        errno = 0;
+        while (const dirent* child = ::readdir(listing.get())) {
+            const std::string_view childName(child->d_name);
+            if (childName != "." && childName != "..") {
+                names.emplace_back(childName);
+            }
+        }
+        if (errno != 0) {
+            return errno;
+        }
+        for (const std::string& child : names) {
+            if (int error = directory.flushTree(child); error != 0) {
+                return error;
+            }
+        }
+        return ::fsync(directory.fd()) == 0 ? 0 : errno;
+    }
+    return ::fsync(fd.get()) == 0 ? 0 : errno;
 }
 
 int Directory::renameEntry(std::string_view from, std::string_view to) const {

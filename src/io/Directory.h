@@ -66,6 +66,11 @@ class Directory {
     // Removes name: a file or link, or an empty directory. 0 or an errno.
     int removeEntry(std::string_view name) const;
 
+    // Flushes every file and directory of the tree at name, deepest first, without following a
+    // link: what a writer that does not flush (the archive extractor, a copy) left there is on
+    // the disk before the tree is renamed into place. 0 or an errno.
+    int flushTree(std::string_view name) const;
+
     // Renames from over to, both in this directory, and flushes it. 0 or an errno.
     int renameEntry(std::string_view from, std::string_view to) const;
 

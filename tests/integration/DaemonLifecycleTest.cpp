@@ -1,6 +1,7 @@
 // The daemon's life on the bus: started by the first call, held by its launch transaction and by
 // calls, gone when idle; a daemon that cannot serve says why and fails.
 #include <signal.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <thread>
@@ -86,8 +87,9 @@ TEST_F(DaemonActivityTest, CallsOnceASecondKeepOneDaemonAlivePastTheGrace) {
     EXPECT_EQ(waitForDaemonExit(*pid), std::optional<int>(0));
 }
 
-// A daemon that cannot serve (no bus to reach, or its name already owned on the bus) logs why and
-// exits with a failure, so that the service manager's restart policy acts.
+// A daemon that cannot serve (no bus to reach, an instance lock that is a link or someone else's
+// file, or its name already owned on the bus) logs why and exits with a failure, so that the
+// service manager's restart policy acts.
 TEST_F(DaemonLifecycleTest, DaemonThatCannotServeExitsWithAFailure) {
     auto runDaemon = [&](const std::string& busAddress) {
         return runCommand({"/usr/bin/env", "-i", "TAVRIX_ROOT=" + device().root().string(),
@@ -102,6 +104,29 @@ TEST_F(DaemonLifecycleTest, DaemonThatCannotServeExitsWithAFailure) {
     EXPECT_NE(unreachable.output.find("Cannot connect to the bus for com.zandor.tavrixservicesd"),
               std::string::npos)
         << unreachable.output;
+
+    // A planted lock is never followed, opened or waited for.
+    const auto lock = device().runtimeDirectory() / "instance.lock";
+    const auto elsewhere = device().base() / "not-the-lock";
+    std::filesystem::create_directories(device().runtimeDirectory());
+    test::writeText(elsewhere, "kept");
+    std::filesystem::remove(lock);
+    std::filesystem::create_symlink(elsewhere, lock);
+    CommandResult linked = runDaemon(busAddress());
+    EXPECT_EQ(linked.status, 1);
+    EXPECT_NE(linked.output.find("Cannot open the instance lock"), std::string::npos)
+        << linked.output;
+    EXPECT_EQ(test::readText(elsewhere), "kept");
+    std::filesystem::remove(lock);
+    if (::geteuid() == 0) {
+        test::writeText(lock, "");
+        ASSERT_EQ(::chown(lock.c_str(), 65534, 65534), 0);
+        CommandResult foreign = runDaemon(busAddress());
+        EXPECT_EQ(foreign.status, 1);
+        EXPECT_NE(foreign.output.find("is not a file of this daemon's user"), std::string::npos)
+            << foreign.output;
+        std::filesystem::remove(lock);
+    }
 
     auto squatter = rawConnection();
     ASSERT_GE(sd_bus_request_name(squatter.get(), kDaemonBusName, 0), 0);

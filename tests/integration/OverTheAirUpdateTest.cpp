@@ -21,6 +21,7 @@
 
 #include "BusFixture.h"
 #include "BusMonitor.h"
+#include "FileSystemTrace.h"
 #include "LocalHttpServer.h"
 #include "TestSupport.h"
 #include "bus/BackgroundJobScheduler.h"
@@ -467,6 +468,161 @@ TEST_F(OverTheAirUpdateTest, KilledAnywhereInAnUpdateTheNextLaunchCompletesOrRed
               << countLogLinesContaining("Completing the interrupted install") +
                      countLogLinesContaining("disagree, linking again")
               << "\n";
+}
+
+// A daemon that is leaving while it still installs an update, and a new one activated meanwhile by
+// a payload, repeated: the old daemon installs the update before it ends (its last check says so),
+// the new one answers the payload only once the old one has ended, so every round ends with the
+// payload linked, whole, and a status view that says what the disk holds. Prints what each round
+// left (before the instance lock, some rounds left an empty bundle or the update over the payload).
+TEST_F(OverTheAirUpdateTest, DaemonStartedWhileTheLastOneDrainsActsAfterIt) {
+    constexpr std::size_t kBulk = 1 << 20;
+    setIDWithBundle("1");
+    ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
+    const int rounds = std::max(1, crashLoopIterations() * 2 / 3);
+    std::map<std::string, int> outcomes;
+    for (int round = 0; round < rounds; ++round) {
+        const std::string update = std::to_string(2 * round + 2);
+        const std::string payload = std::to_string(2 * round + 3);
+        SCOPED_TRACE("round " + std::to_string(round));
+        const auto pid = daemonPid();
+        ASSERT_TRUE(pid);
+        const std::string archive = publish(update, kBulk);
+        test::LocalHttpServer::Response held;
+        held.body = readText(published(archive));
+        held.holdAfterBodyBytes = held.body.size() / 2;
+        server.holdAgain();
+        server.serve(archive, held);
+        ASSERT_TRUE(client().checkForTavrixBundleUpdate());
+        ASSERT_TRUE(server.waitForHeldResponse(10s));
+        ASSERT_EQ(::kill(*pid, SIGTERM), 0);
+        ASSERT_TRUE(waitForNoNameOwner());
+
+        const std::vector<std::uint8_t> packed = pack(writeBundle(payload, kBulk));
+        auto answer = std::async(std::launch::async,
+                                 [&] { return client().setTavrixID(kBehaviorID, packed); });
+        ASSERT_TRUE(waitForNameOwner());
+        // Meanwhile the new daemon answers what only reads, and says that it waits.
+        EXPECT_TRUE(client().isTavrixBundleSupported());
+        const plist::Dictionary waiting = client().status();
+        EXPECT_TRUE(waiting.contains("WaitingForPreviousDaemon"));
+        EXPECT_FALSE(waiting.contains("LinkedBundle"));
+        server.releaseHeldResponses();
+        EXPECT_TRUE(answer.get());
+        ASSERT_EQ(waitForDaemonExit(*pid, 70s), std::optional<int>(0));
+        server.stopServing(archive);
+
+        // The disk first, then what the new daemon says about it.
+        const std::string linked = linkedVersion();
+        const bool whole =
+            linkState() == "links agree" && linkTarget(kBundleLink) == at(kUserBundle).string() &&
+            userBundleFiles() ==
+                test::snapshotTree(device().base() / ("bundles/" + linked + "/Default.bundle"));
+        const plist::Dictionary status = client().status();
+        const auto linkedInStatus = status.find("LinkedBundle");
+        // The check the old daemon answered while leaving was installed before it ended.
+        const auto lastCheck = status.find("LastCheck");
+        EXPECT_TRUE(lastCheck != status.end() && lastCheck->second.find("Reason") &&
+                    *lastCheck->second.find("Reason") ==
+                        plist::Value("installed version " + update))
+            << (lastCheck != status.end() ? lastCheck->second.description() : "no LastCheck");
+        const bool statusMatches =
+            linkedInStatus != status.end() && linkedInStatus->second.find("Version") &&
+            *linkedInStatus->second.find("Version") == plist::Value(linked) &&
+            status.find("UserBundleVersion") != status.end() &&
+            status.at("UserBundleVersion") == plist::Value(linked);
+        ++outcomes[!whole              ? "empty, partial or unlinked"
+                   : linked == payload ? "payload linked"
+                   : linked == update  ? "update linked over the later payload"
+                                       : "older bundle linked"];
+        if (!statusMatches) {
+            ++outcomes["status view differs from the disk"];
+        }
+        EXPECT_TRUE(whole) << "linked " << linked;
+        EXPECT_EQ(linked, payload);
+        EXPECT_TRUE(statusMatches);
+    }
+    // Every new daemon did find the old one still at work.
+    EXPECT_EQ(countLogLines("Another daemon is still finishing its work; waiting for it to end"),
+              rounds);
+    std::cout << "[ race ] " << rounds << " rounds;";
+    for (const auto& [outcome, count] : outcomes) {
+        std::cout << " " << outcome << ": " << count << ";";
+    }
+    std::cout << "\n";
+}
+
+// The daemon run under strace, so that the order of its file-system calls can be checked: a power
+// cut that keeps the page cache from the disk keeps "old or new" only when that order holds.
+class DurabilityProtocolTest : public OverTheAirUpdateTest {
+  protected:
+    void SetUp() override {
+        CommandResult strace = runCommand({"/bin/sh", "-c", "command -v strace"});
+        if (strace.status != 0) {
+            GTEST_SKIP() << "strace is not installed (scripts/install-deps.sh installs it): the "
+                            "order of the daemon's file-system calls is not checked";
+        }
+        strace.output.pop_back();  // the line break
+        // Appending: a daemon launched again must not overwrite the first one's calls.
+        daemonLaunchPrefix = {strace.output,
+                              "-f",
+                              "-y",
+                              "-qq",
+                              "-A",
+                              "-s",
+                              "4096",
+                              "-e",
+                              kTracedFileSystemCalls,
+                              "-o",
+                              trace().string()};
+        OverTheAirUpdateTest::SetUp();
+    }
+
+    fs::path trace() { return device().base() / "daemon.strace"; }
+};
+
+// A payload, an over-the-air update and a reset to a newer system bundle: every file renamed into
+// place was flushed first and its directory after, the links were replaced by rename, and nothing
+// final was written in place.
+TEST_F(DurabilityProtocolTest, PayloadUpdateAndResetWriteInTheDurableOrder) {
+    setIDWithBundle("1");
+    ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 10s));
+    publish("2");
+    ASSERT_TRUE(client().checkForTavrixBundleUpdate());
+    ASSERT_TRUE(waitForLogLine("Best candidate asset has been purged", 30s));
+    EXPECT_EQ(linkedVersion(), "2");
+    BusFixture::writeBundle(at(kSystemBundle), "9", {{"CarrierName", "System"}});
+    ASSERT_TRUE(client().setTavrixID("acme.other", std::nullopt));
+    EXPECT_EQ(linkedVersion(), "9");
+
+    // The trace is whole once the daemon and its tracer have ended (the tracer is what the bus
+    // launched, and it exits with the daemon's status).
+    const auto pid = daemonPid();
+    ASSERT_TRUE(pid);
+    ASSERT_EQ(::kill(*pid, SIGTERM), 0);
+    ASSERT_TRUE(pollUntil(
+        [&] {
+            for (const test::DaemonLaunch& launch : daemonLaunches()) {
+                if (!launch.exitStatus) {
+                    return false;
+                }
+            }
+            return true;
+        },
+        30s));
+
+    DurabilityCounts counts;
+    const std::vector<std::string> violations =
+        durabilityViolations(readText(trace()), ".tavrix-write-", {}, &counts);
+    for (const std::string& violation : violations) {
+        ADD_FAILURE() << violation;
+    }
+    // Enough was seen for the rules to mean something: both bundles, the preferences, the links.
+    EXPECT_GE(counts.renamesIntoPlace, 8);
+    EXPECT_GE(counts.linksReplaced, 4);
+    std::cout << "[ durability ] renames into place: " << counts.renamesIntoPlace
+              << "; links replaced: " << counts.linksReplaced << "; flushes: " << counts.flushes
+              << "; violations: " << violations.size() << "\n";
 }
 
 class OverTheAirKeepAliveTest : public OverTheAirUpdateTest {

@@ -151,6 +151,11 @@ void LocalHttpServer::releaseHeldResponses() {
     holdChanged_.notify_all();
 }
 
+void LocalHttpServer::holdAgain() {
+    std::lock_guard lock(mutex_);
+    released_ = false;
+}
+
 void LocalHttpServer::acceptLoop() {
     for (;;) {
         int fd = ::accept4(listenFd_.get(), nullptr, nullptr, SOCK_CLOEXEC);

@@ -75,6 +75,8 @@ class LocalHttpServer {
     bool waitForHeldResponse(std::chrono::milliseconds timeout);
     // Lets every held response finish; responses asked for later are not held.
     void releaseHeldResponses();
+    // Holds the responses asked for from now on again, as before the first release.
+    void holdAgain();
 
   private:
     void acceptLoop();
