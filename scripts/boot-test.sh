@@ -43,6 +43,10 @@ for package in tavrixservicesd libtavrixclient1 libtavrixclient-dev; do
     cp "$(ls "$top"/dist/"$package"_*.deb | tail -n 1)" "$image/root/test/"
 done
 cp -a "$top/examples/bundles/Default.bundle" "$top/examples/demo-root" "$image/root/test/"
+# The system test and the autopkgtest run from a copy of the sources with the packages in dist/.
+mkdir -p "$image/root/test/src/dist"
+cp -a "$top/scripts" "$top/examples" "$top/debian" "$image/root/test/src/"
+cp "$image"/root/test/*.deb "$image/root/test/src/dist/"
 
 passed=0
 failed=0
@@ -86,9 +90,13 @@ step "boot the container with systemd as PID 1" \
      test "$(cat /proc/1/comm)" = systemd && timeout 120 systemctl is-system-running --wait |
      grep -Ex "running|degraded"'
 
-# 2. The packages, installed with apt as an integrator would.
+# 2. The system test installs, tries and purges the packages; then they are installed with apt
+#    as an integrator would, and the autopkgtest runs on them.
+step "the system test passes (install, the bus policy, a payload, purge)" \
+    'cd /root/test/src && scripts/system-test.sh'
 step "install the packages with apt" \
     'apt-get install -y --no-install-recommends /root/test/*.deb'
+step "the autopkgtest passes" 'cd /root/test/src && debian/tests/system-test'
 step "the update timer is enabled and waiting" \
     'systemctl is-enabled tavrixservicesd-update.timer && systemctl is-active tavrixservicesd-update.timer'
 # A tablet like the demo's, with its system bundle and bundle support enabled.
