@@ -45,13 +45,21 @@ for package in "${packages[@]}"; do
 done
 
 if [ ${#missing[@]} -gt 0 ]; then
+    # An architecture added here goes again when its packages cannot be had: its broken index
+    # would fail every later apt-get update on the machine.
+    added=()
+    trap 'for arch in "${added[@]}"; do $sudo dpkg --remove-architecture "$arch"; done' EXIT
     for arch in "${cross[@]}"; do
-        dpkg --print-foreign-architectures | grep -qx "$arch" || $sudo dpkg --add-architecture "$arch"
+        if ! dpkg --print-foreign-architectures | grep -qx "$arch"; then
+            $sudo dpkg --add-architecture "$arch"
+            added+=("$arch")
+        fi
     done
     echo "Installing: ${missing[*]}"
     export DEBIAN_FRONTEND=noninteractive
     $sudo apt-get update -qq
     $sudo apt-get install -y -qq --no-install-recommends "${missing[@]}"
+    trap - EXIT
 fi
 
 # Programs built for ARCH run through qemu when the kernel knows it: tests start the daemon and
