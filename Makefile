@@ -6,7 +6,7 @@ FUZZ_BUILD ?= build-fuzz
 JOBS       ?= 2
 FUZZ_SECONDS ?= 60
 
-.PHONY: all deps build test test-asan test-tsan fuzz bench demo deb format clean
+.PHONY: all deps build test test-asan test-tsan fuzz bench demo deb boot-test cross-arm64 cross-armhf format clean
 
 all: build
 
@@ -62,8 +62,19 @@ deb:
 	    mv ../tavrixservicesd*_$${version}_*.* ../libtavrixclient*_$${version}_*.* dist/
 	lintian --fail-on error,warning dist/*.deb
 
+# The packages just built, booted in a Debian 12 container with systemd as PID 1 (root only).
+boot-test: deb
+	scripts/boot-test.sh
+
+# Cross builds with Debian's cross toolchains into build-<arch>/, the unit tests run under qemu.
+cross-arm64:
+	JOBS=$(JOBS) scripts/cross-build.sh arm64
+
+cross-armhf:
+	JOBS=$(JOBS) scripts/cross-build.sh armhf
+
 format:
 	git ls-files '*.cpp' '*.h' | xargs clang-format -i
 
 clean:
-	rm -rf $(BUILD) $(ASAN_BUILD) $(TSAN_BUILD) $(FUZZ_BUILD) dist obj-*
+	rm -rf $(BUILD) $(ASAN_BUILD) $(TSAN_BUILD) $(FUZZ_BUILD) build-arm64 build-armhf dist obj-*

@@ -1,6 +1,10 @@
 #!/usr/bin/env bash
 # Installs the Debian packages the project builds, tests and runs with; does nothing when all
 # are present. Runs apt-get as root, through sudo otherwise.
+#   --deb    also what building and checking the Debian packages needs
+#   --boot   also what the boot test needs (a container image booted with systemd)
+#   --cross=ARCH  also Debian's cross toolchain and the libraries for ARCH (arm64, armhf), and
+#            qemu to run what is built, registered with the kernel
 set -euo pipefail
 
 packages=(
@@ -11,9 +15,27 @@ packages=(
     dbus libarchive-tools curl python3 python3-dbus tzdata libplist-utils strace
 )
 
-# `--deb`: also what building and checking the Debian package needs.
-if [ "${1:-}" = "--deb" ]; then
-    packages+=(debhelper dpkg-dev fakeroot lintian systemd)
+cross=()
+for flag in "$@"; do
+    case "$flag" in
+        --deb) packages+=(debhelper dpkg-dev fakeroot lintian systemd) ;;
+        --boot) packages+=(systemd-container debootstrap) ;;
+        --cross=arm64 | --cross=armhf)
+            arch=${flag#--cross=}
+            cross+=("$arch")
+            packages+=(crossbuild-essential-"$arch" qemu-user-static dpkg-dev pkgconf:"$arch")
+            for library in libsystemd-dev libplist-dev libarchive-dev libcurl4-openssl-dev libssl-dev \
+                libsodium-dev zlib1g-dev libgtest-dev libgmock-dev; do
+                packages+=("$library:$arch")
+            done
+            ;;
+        *) echo "install-deps: unknown flag $flag (known: --deb --boot --cross=arm64 --cross=armhf)" >&2; exit 2 ;;
+    esac
+done
+
+sudo=""
+if [ "$(id -u)" -ne 0 ]; then
+    sudo="sudo"
 fi
 
 missing=()
@@ -22,13 +44,31 @@ for package in "${packages[@]}"; do
         missing+=("$package")
     fi
 done
-[ ${#missing[@]} -eq 0 ] && exit 0
 
-sudo=""
-if [ "$(id -u)" -ne 0 ]; then
-    sudo="sudo"
+if [ ${#missing[@]} -gt 0 ]; then
+    # An architecture added here goes again when its packages cannot be had: its broken index
+    # would fail every later apt-get update on the machine.
+    added=()
+    trap 'for arch in "${added[@]}"; do $sudo dpkg --remove-architecture "$arch"; done' EXIT
+    for arch in "${cross[@]}"; do
+        if ! dpkg --print-foreign-architectures | grep -qx "$arch"; then
+            $sudo dpkg --add-architecture "$arch"
+            added+=("$arch")
+        fi
+    done
+    echo "Installing: ${missing[*]}"
+    export DEBIAN_FRONTEND=noninteractive
+    $sudo apt-get update -qq
+    $sudo apt-get install -y -qq --no-install-recommends "${missing[@]}"
+    trap - EXIT
 fi
-echo "Installing: ${missing[*]}"
-export DEBIAN_FRONTEND=noninteractive
-$sudo apt-get update -qq
-$sudo apt-get install -y -qq --no-install-recommends "${missing[@]}"
+
+# Programs built for ARCH run through qemu when the kernel knows it: tests start the daemon and
+# the tools as any program would. Without a service manager nobody registers it at install.
+for arch in "${cross[@]}"; do
+    case "$arch" in arm64) emulator=qemu-aarch64 ;; armhf) emulator=qemu-arm ;; esac
+    binfmt=/proc/sys/fs/binfmt_misc
+    [ -e "$binfmt/register" ] || $sudo mount -t binfmt_misc binfmt_misc "$binfmt"
+    [ -e "$binfmt/$emulator" ] ||
+        $sudo sh -c "grep -v '^#' /usr/lib/binfmt.d/$emulator.conf >$binfmt/register"
+done

@@ -4,12 +4,20 @@
 # set and its notification heard, and a look-alike notification from another user goes nowhere.
 # Then the packages are purged and whatever this script created is removed again.
 # Run as root on a machine without the packages: scripts/system-test.sh  (not part of make test)
+# With --installed (the autopkgtest), the packages installed already are tested and kept.
 set -uo pipefail
 top=$(cd "$(dirname "$0")/.." && pwd)
 name=com.zandor.tavrixservicesd
 packages=(tavrixservicesd libtavrixclient1 libtavrixclient-dev)
+installed=no
+[ "${1:-}" = --installed ] && installed=yes
 
 [ "$(id -u)" = 0 ] || { echo "system-test: run as root" >&2; exit 2; }
+if [ "$installed" = yes ]; then
+    dpkg-query -W -f='${Status}' tavrixservicesd 2>/dev/null | grep -q 'ok installed' ||
+        { echo "system-test: --installed, but tavrixservicesd is not installed" >&2; exit 2; }
+    packages=()
+fi
 for package in "${packages[@]}"; do
     if dpkg-query -W -f='${Status}' "$package" 2>/dev/null | grep -q 'ok installed'; then
         echo "system-test: $package is installed already; this test installs and purges it" >&2
@@ -54,14 +62,16 @@ had_group_tavrix=$(getent group tavrix >/dev/null && echo yes || echo no)
 dpkg-query -W -f='${Package}\n' | sort >"$work/packages.before"
 
 # 1. The packages, built when dist/ has none.
-if ! ls "$top"/dist/tavrixservicesd_*.deb >/dev/null 2>&1; then
-    step "build the packages (make deb)" make -C "$top" deb
+if [ "$installed" = no ]; then
+    if ! ls "$top"/dist/tavrixservicesd_*.deb >/dev/null 2>&1; then
+        step "build the packages (make deb)" make -C "$top" deb
+    fi
+    debs=()
+    for package in "${packages[@]}"; do
+        debs+=("$(ls "$top"/dist/"${package}"_*.deb | tail -n 1)")
+    done
+    step "install ${packages[*]}" apt-get install -y --no-install-recommends "${debs[@]}"
 fi
-debs=()
-for package in "${packages[@]}"; do
-    debs+=("$(ls "$top"/dist/"${package}"_*.deb | tail -n 1)")
-done
-step "install ${packages[*]}" apt-get install -y --no-install-recommends "${debs[@]}"
 step "the daemon's user and the mobile user exist" getent passwd tavrixservicesd mobile
 
 # 2. The system bus: the running one, or one started here (no service manager starts it here).
@@ -152,14 +162,18 @@ fi
 ! bus_call GetNameOwner s "$name" >"$work/step.log" 2>&1
 report $? "the daemon leaves on SIGTERM and releases its name"
 
-# 8. Purge, and put back what was here before.
-step "purge ${packages[*]}" apt-get purge -y "${packages[@]}"
-[ "$had_user_daemon" = yes ] || userdel tavrixservicesd 2>/dev/null
-[ "$had_user_mobile" = yes ] || userdel mobile 2>/dev/null
-[ "$had_group_tavrix" = yes ] || groupdel tavrix 2>/dev/null
-for path in "${!had[@]}"; do
-    [ "${had[$path]}" = yes ] || [ "$path" = /run/dbus ] || rm -rf "$path"
-done
+# 8. Purge, and put back what was here before (the autopkgtest's testbed keeps its packages).
+if [ "$installed" = no ]; then
+    step "purge ${packages[*]}" apt-get purge -y "${packages[@]}"
+    gone() { ! ls -d /var/lib/tavrixservicesd /var/cache/tavrixservicesd 2>&1; }
+    step "the purge removed the daemon's state and cache" gone
+    [ "$had_user_daemon" = yes ] || userdel tavrixservicesd 2>/dev/null
+    [ "$had_user_mobile" = yes ] || userdel mobile 2>/dev/null
+    [ "$had_group_tavrix" = yes ] || groupdel tavrix 2>/dev/null
+    for path in "${!had[@]}"; do
+        [ "${had[$path]}" = yes ] || [ "$path" = /run/dbus ] || rm -rf "$path"
+    done
+fi
 if [ -n "$bus_pid" ]; then
     kill "$bus_pid" 2>/dev/null
     for _ in $(seq 50); do
@@ -169,9 +183,11 @@ if [ -n "$bus_pid" ]; then
     rm -f /run/dbus/pid /run/dbus/system_bus_socket
     [ "${had[/run/dbus]}" = yes ] || rmdir /run/dbus 2>/dev/null
 fi
-dpkg-query -W -f='${Package}\n' | sort >"$work/packages.after"
-diff "$work/packages.before" "$work/packages.after" >"$work/step.log"
-report $? "the machine's package set is as it was"
+if [ "$installed" = no ]; then
+    dpkg-query -W -f='${Package}\n' | sort >"$work/packages.after"
+    diff "$work/packages.before" "$work/packages.after" >"$work/step.log"
+    report $? "the machine's package set is as it was"
+fi
 rm -rf "$work"
 
 echo "system test: $passed passed, $failed failed"

@@ -57,7 +57,9 @@ std::optional<io::Directory> openProtectedChild(const io::Directory& parent,
         } else if (error == ENOENT && createMissing) {
             if (::mkdirat(parent.fd(), name.c_str(), kDirectoryMode) == 0) {
                 // The umask must not narrow what the mobile user's applications need to read.
-                ::fchmodat(parent.fd(), name.c_str(), kDirectoryMode, 0);
+                // Should this fail, the directory is only less readable: the daemon goes on.
+                if (::fchmodat(parent.fd(), name.c_str(), kDirectoryMode, 0) != 0) {
+                }
             } else if (errno != EEXIST) {
                 logCFormat("Cannot create the directory %s: %s\n", parent.pathOf(name).c_str(),
                            errorText(errno).c_str());

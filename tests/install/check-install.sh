@@ -39,6 +39,10 @@ unit=$(find_one systemd/system/tavrixservicesd.service)
 find_one systemd/system/tavrixservicesd-update.timer >/dev/null
 activation=$(find_one dbus-1/system-services/com.zandor.tavrixservicesd.service)
 find_one dbus-1/system.d/com.zandor.tavrixservicesd.conf >/dev/null
+find_one dbus-1/interfaces/com.zandor.TXManagerServerInterface.xml >/dev/null
+for doc in asset-catalog.md dbus-api.md AssetCatalog.plist; do
+    find_one "doc/tavrixservicesd/$doc" >/dev/null
+done
 completion=$(find_one bash-completion/completions/tavrixctl)
 bash -n "$completion" || fail "the bash completion does not parse"
 sysusers=$(find_one sysusers.d/tavrixservicesd.conf)

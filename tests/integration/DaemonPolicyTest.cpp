@@ -1,6 +1,7 @@
 // The packaged bus policy, loaded by a bus that denies by default as the system bus does: anyone
 // may ask, only root and the policy's group may change the ID or start an update, and only the
-// daemon's user may own the name. Clients run as other users, so this needs root.
+// daemon's user may own the name. Clients run as other users, so this needs root; they run
+// copies of tavrixctl and its library, since a private checkout is closed to other users.
 #include <gmock/gmock.h>
 #include <grp.h>
 #include <pwd.h>
@@ -42,6 +43,10 @@ class DaemonPolicyTest : public BusFixture {
             GTEST_SKIP() << "no group \"" << kStandInGroup << "\" to stand in for \"tavrix\"";
         }
         standInGid_ = standIn->gr_gid;
+        copyClientForOthers();
+        if (asNobody(kNobody, {"/usr/bin/test", "-x", ctl_.string()}).status != 0) {
+            GTEST_SKIP() << "nobody cannot reach " << ctl_ << " (is $TMPDIR private?)";
+        }
         policyFile = adaptedPolicy();
         BusFixture::SetUp();
     }
@@ -60,6 +65,18 @@ class DaemonPolicyTest : public BusFixture {
         return path;
     }
 
+    // tavrixctl and the client library in a directory anyone may enter; the library path
+    // comes first, so the copy never reaches back into the build tree.
+    void copyClientForOthers() {
+        namespace fs = std::filesystem;
+        const fs::path directory = clientCopy_.path();
+        fs::permissions(directory, fs::perms::others_read | fs::perms::others_exec,
+                        fs::perm_options::add);
+        ctl_ = directory / "tavrixctl";
+        fs::copy_file(TAVRIX_CTL_PATH, ctl_);
+        fs::copy_file(TAVRIX_CLIENT_LIBRARY_PATH, directory / TAVRIX_CLIENT_LIBRARY_NAME);
+    }
+
     // command run as the user nobody with the given primary group and no other groups.
     static CommandResult asNobody(gid_t gid, const std::vector<std::string>& command) {
         std::vector<std::string> argv = {"/usr/bin/setpriv", "--reuid=" + std::to_string(kNobody),
@@ -69,12 +86,16 @@ class DaemonPolicyTest : public BusFixture {
     }
 
     CommandResult tavrixctlAs(gid_t gid, const std::vector<std::string>& arguments) {
-        std::vector<std::string> command = {TAVRIX_CTL_PATH, "--address", busAddress()};
+        std::vector<std::string> command = {"/usr/bin/env",
+                                            "LD_LIBRARY_PATH=" + ctl_.parent_path().string(),
+                                            ctl_.string(), "--address", busAddress()};
         command.insert(command.end(), arguments.begin(), arguments.end());
         return asNobody(gid, command);
     }
 
     gid_t standInGid_ = 0;
+    test::TempDir clientCopy_;
+    std::filesystem::path ctl_;
 };
 
 TEST_F(DaemonPolicyTest, AnyoneMayAskButOnlyPrivilegedCallersMayChange) {

@@ -744,5 +744,32 @@ TEST_F(AssetSelectionTest, HeldBackOnlyWhenARolloutKeepsANewerFittingVersion) {
     }
 }
 
+// The commented sample shipped for integrators reads as the daemon reads it, with the defaults it
+// claims: a renamed key or a wrong number there would mislead every device set up from it.
+TEST(SampleAssetCatalogTest, ReadsAsDocumentedWithTheDefaultLimits) {
+    plist::Refusal refusal;
+    std::optional<plist::Value> sample = plist::readFile(TAVRIX_SAMPLE_ASSET_CATALOG, &refusal);
+    ASSERT_TRUE(sample.has_value()) << refusal.reason;
+    std::string whyNot;
+    auto settings = parseAssetTypeSettings(*sample, kAssetTypeTavrixBundles, whyNot);
+    ASSERT_TRUE(settings.has_value()) << whyNot;
+    EXPECT_EQ(settings->catalogURL, "https://updates.example.net/tavrix/catalog.plist");
+    ASSERT_EQ(settings->trustedKeys.size(), 1u);
+    EXPECT_EQ(settings->trustedKeys.front().identifier, "release-2026");
+    EXPECT_FALSE(settings->allowUnsigned);
+    const AssetLimits defaults;
+    const AssetLimits& limits = settings->limits;
+    EXPECT_EQ(std::tie(limits.maxExpandedBytes, limits.maxArchiveEntries,
+                       limits.freeSpaceReserveBytes),
+              std::tie(defaults.maxExpandedBytes, defaults.maxArchiveEntries,
+                       defaults.freeSpaceReserveBytes));
+    EXPECT_EQ(std::tie(limits.connectTimeoutSeconds, limits.lowSpeedBytesPerSecond,
+                       limits.lowSpeedSeconds, limits.catalogTimeoutSeconds,
+                       limits.archiveTimeoutSeconds),
+              std::tie(defaults.connectTimeoutSeconds, defaults.lowSpeedBytesPerSecond,
+                       defaults.lowSpeedSeconds, defaults.catalogTimeoutSeconds,
+                       defaults.archiveTimeoutSeconds));
+}
+
 }  // namespace
 }  // namespace tavrix::catalog
