@@ -244,18 +244,25 @@ class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInter
     }
 
     // Nothing the daemon owns carries the attacker's marks, and its state directory holds only
-    // its own regular files, none of them its preferences written through a link.
+    // its own regular files, none of them its preferences written through a link. (The daemon
+    // may still be purging its download: what is gone by the time it is looked at is passed.)
     void expectNothingWrittenForTheAttacker() {
-        for (const auto& entry : fs::recursive_directory_iterator(device().root())) {
+        std::error_code error;
+        for (fs::recursive_directory_iterator entry(device().root(), error), end;
+             !error && entry != end; entry.increment(error)) {
             struct stat info {};
-            ASSERT_EQ(::lstat(entry.path().c_str(), &info), 0);
-            if (entry.path().string().find("PWNED") != std::string::npos) {
-                EXPECT_EQ(info.st_uid, mobile_.first) << entry.path();
+            if (::lstat(entry->path().c_str(), &info) != 0) {
+                continue;
+            }
+            if (entry->path().string().find("PWNED") != std::string::npos) {
+                EXPECT_EQ(info.st_uid, mobile_.first) << entry->path();
             }
         }
         for (const auto& entry : fs::directory_iterator(at("/var/lib/tavrixservicesd"))) {
             struct stat info {};
-            ASSERT_EQ(::lstat(entry.path().c_str(), &info), 0);
+            if (::lstat(entry.path().c_str(), &info) != 0) {
+                continue;
+            }
             EXPECT_TRUE(S_ISREG(info.st_mode)) << entry.path();
             EXPECT_EQ(info.st_uid, daemon_.first) << entry.path();
             auto stored = plist::readFile(entry.path().string());
