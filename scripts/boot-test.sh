@@ -48,18 +48,7 @@ mkdir -p "$image/root/test/src/dist"
 cp -a "$top/scripts" "$top/examples" "$top/debian" "$image/root/test/src/"
 cp "$image"/root/test/*.deb "$image/root/test/src/dist/"
 
-passed=0
-failed=0
-report() {
-    if [ "$1" = 0 ]; then
-        printf 'PASS  %s\n' "$2"
-        passed=$((passed + 1))
-    else
-        printf 'FAIL  %s\n' "$2"
-        sed 's/^/      | /' "$work/step.log" | tail -n 15
-        failed=$((failed + 1))
-    fi
-}
+. "$top/scripts/step-report.sh"
 # inside COMMAND...: runs it in the booted container, as a login would.
 inside() {
     nsenter --target "$leader" --all -- /usr/bin/env -i PATH=/usr/sbin:/usr/bin:/sbin:/bin HOME=/root \

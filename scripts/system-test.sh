@@ -27,18 +27,7 @@ done
 
 work=$(mktemp -d)
 chmod 755 "$work"
-passed=0
-failed=0
-report() {
-    if [ "$1" = 0 ]; then
-        printf 'PASS  %s\n' "$2"
-        passed=$((passed + 1))
-    else
-        printf 'FAIL  %s\n' "$2"
-        sed 's/^/      | /' "$work/step.log" | tail -n 15
-        failed=$((failed + 1))
-    fi
-}
+. "$top/scripts/step-report.sh"
 # step DESCRIPTION COMMAND...: runs the command, output kept for the report.
 step() {
     local description=$1
