@@ -211,17 +211,7 @@ void PreferencesStore::setValue(std::string_view key, const std::optional<plist:
 bool PreferencesStore::synchronize(std::string_view domain, std::string_view user) {
     std::lock_guard lock(mutex_);
     Domain* state = domainFor(domain, user);
-    if (state == nullptr) {
-        return false;
-    }
-    if (!state->pending.empty()) {
-        if (!writePending(*state)) {
-            return false;
-        }
-        state->pending.clear();
-    }
-    state->file.invalidate();
-    return true;
+    return state != nullptr && synchronizeLocked(*state);
 }
 
 bool PreferencesStore::storeValue(std::string_view key, const std::optional<plist::Value>& value,
@@ -232,12 +222,21 @@ bool PreferencesStore::storeValue(std::string_view key, const std::optional<plis
         return false;
     }
     auto [change, inserted] = state->pending.insert_or_assign(std::string(key), value);
-    if (!writePending(*state)) {
+    if (!synchronizeLocked(*state)) {
         state->pending.erase(change);
         return false;
     }
-    state->pending.clear();
-    state->file.invalidate();
+    return true;
+}
+
+bool PreferencesStore::synchronizeLocked(Domain& domain) {
+    if (!domain.pending.empty()) {
+        if (!writePending(domain)) {
+            return false;
+        }
+        domain.pending.clear();
+    }
+    domain.file.invalidate();
     return true;
 }
 

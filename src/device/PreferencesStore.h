@@ -57,6 +57,8 @@ class PreferencesStore {
 
     // The domain's state, created on first use; null (logged) for an invalid name or unknown user.
     Domain* domainFor(std::string_view domain, std::string_view user);
+    // Writes the pending values and forgets cached reads; mutex_ held.
+    bool synchronizeLocked(Domain& domain);
     bool writePending(Domain& domain);
     // Logs that the domain's file is damaged, once per version of the file.
     void logDamage(Domain& domain, const plist::Refusal& refusal);
