@@ -1,5 +1,6 @@
 // A client's payload becomes the user bundle: staged, extracted beside the bundle directory and
 // renamed into its place.
+#include "bundle/BundleLocations.h"
 #include "bundle/BundleManager.h"
 #include "bundle/UserBundleReplacement.h"
 #include "device/PlatformRoot.h"
@@ -24,9 +25,10 @@ bool BundleManager::installBehaviorBundleData(const plist::Data& data, std::stri
         // with it, only there is no room for the new one.
         installed = replaceUserBundle(
             [&](const std::string& staging, std::string* failure) {
+                // Entries reaching into the bundle directory itself belong to the new bundle.
                 const payload::ExtractionOutcome outcome = payload::extractArchive(
                     staged->fd(), stagedPath, staging, payload::ExtractionSafety::AsArchived,
-                    payload::kClientPayloadLimits, failure);
+                    payload::kClientPayloadLimits, failure, userBundleLocation());
                 if (outcome == payload::ExtractionOutcome::Complete) {
                     return BundleFill::Whole;
                 }

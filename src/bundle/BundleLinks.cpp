@@ -111,7 +111,7 @@ bool isDaemonLink(const std::string& linkPath) {
     return true;
 }
 
-bool linksAgree(const CarrierBundle& linked, const std::string& overlayDirectory) {
+bool linksDisagree(const CarrierBundle& linked, const std::string& overlayDirectory) {
     struct stat info {};
     const std::string bundle = realPathOf(linked.bundleLinkPath);
     if (bundle.empty() || ::stat(bundle.c_str(), &info) != 0 || !S_ISDIR(info.st_mode)) {
@@ -124,7 +124,8 @@ bool linksAgree(const CarrierBundle& linked, const std::string& overlayDirectory
     auto inside = [&carrierFile](const std::string& directory) {
         return !directory.empty() && carrierFile.starts_with(directory + "/");
     };
-    return inside(bundle) || (!overlayDirectory.empty() && inside(realPathOf(overlayDirectory)));
+    return !inside(bundle) &&
+           (overlayDirectory.empty() || !inside(realPathOf(overlayDirectory)));
 }
 
 std::string baseNameOfPath(const std::string& path) {

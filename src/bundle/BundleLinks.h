@@ -15,10 +15,11 @@ namespace tavrix {
 bool establishBundleLinks(CarrierBundle& bundle, const std::string& bundleLink,
                           const std::string& preferencesLink);
 
-// Whether the two links read at start-up describe one linked state: both resolve, and the
-// carrier file lies inside the linked bundle or inside overlayDirectory (the generated files). A
-// crash between the two link changes leaves a pair that does not.
-bool linksAgree(const CarrierBundle& linked, const std::string& overlayDirectory);
+// Whether the two links read at start-up both resolve but describe two linked states: the
+// carrier file lies neither inside the linked bundle nor inside overlayDirectory (the generated
+// files). A crash between the two link changes leaves such a pair. Links that do not resolve are
+// the comparison's to judge.
+bool linksDisagree(const CarrierBundle& linked, const std::string& overlayDirectory);
 
 // Whether the link at linkPath is one the daemon made: a symbolic link of root or the daemon's
 // user in a protected directory of the mobile home. Anything else there (logged once) is treated

@@ -77,7 +77,7 @@ BundleManager::BundleManager() {
     logCFormat("Is carrier bundle's plist file overridden: %s\n",
                overlayTypeName(currentBundle_.overlayType));
     logCFormat("Carrier bundle state on BundleManager initialization\n");
-    if (!linksAgree(currentBundle_, overriddenFilesDirectory())) {
+    if (linksDisagree(currentBundle_, overriddenFilesDirectory())) {
         // A crash between the two link changes (or a link lost since) leaves a pair that the
         // comparison, which looks at file names only, could take for the intended one.
         logCFormat(
@@ -199,11 +199,10 @@ BundleChangeType BundleManager::runBundleReset() {
         versionField.emplace("TAVRIX_BUNDLE_VERSION", matched.bundleVersion);
     }
 
-    if (linksDisagree_) {
-        logCFormat("Original Bundle Links Do Not Exist. Treat as Carrier Change\n");
+    result = compareBundles(currentBundle_, matched);
+    if (linksDisagree_ && result == kBundleChangeTypeNoChange) {
+        // The comparison looks at file names only; the pair on disk is not the one it names.
         result = kBundleChangeTypeUpdate;
-    } else {
-        result = compareBundles(currentBundle_, matched);
     }
     if (result != kBundleChangeTypeNoChange) {
         logCFormat("Bundle Compare decision %s\n", changeTypeName(result));

@@ -3,6 +3,7 @@
 #include <cstddef>
 #include <utility>
 
+#include "plist/PropertyListBounds.h"
 #include "util/Log.h"
 #include "util/TextCase.h"
 
@@ -11,7 +12,7 @@ namespace {
 
 // Property lists read from files nest at most this deep; a deeper merge (only possible with
 // values built in memory) takes the overlay's value whole instead of recursing further.
-constexpr std::size_t kMaxMergeDepth = 512;
+constexpr std::size_t kMaxMergeDepth = plist::kMaxPropertyListDepth;
 
 // Carrier files list IDs as strings; any other value is rendered as text.
 std::string behaviorIDText(const plist::Value& id) {

@@ -61,14 +61,10 @@ PeerConnection ServiceListener::peerOf(sd_bus_message* message) const {
     peer.uniqueName = sender == nullptr ? "" : sender;
     sd_bus_creds* raw = nullptr;
     if (sd_bus_query_sender_creds(
-            message, SD_BUS_CREDS_PID | SD_BUS_CREDS_COMM | SD_BUS_CREDS_AUGMENT, &raw) >= 0) {
+            message, SD_BUS_CREDS_PID | SD_BUS_CREDS_AUGMENT, &raw) >= 0) {
         pid_t pid = 0;
-        const char* comm = nullptr;
         if (sd_bus_creds_get_pid(raw, &pid) >= 0) {
             peer.pid = pid;
-        }
-        if (sd_bus_creds_get_comm(raw, &comm) >= 0 && comm != nullptr) {
-            peer.commandName = comm;
         }
         sd_bus_creds_unref(raw);
     }

@@ -27,7 +27,6 @@ struct ExportedInterface {
 struct PeerConnection {
     std::string uniqueName;
     pid_t pid = 0;
-    std::optional<std::string> commandName;
 };
 
 class ServiceListener {

@@ -229,8 +229,9 @@ std::optional<std::vector<std::shared_ptr<Asset>>> AssetQuery::runQuery() const 
 }
 
 void AssetQuery::removeAbandonedDownloads() const {
-    std::optional<AssetTypeSettings> settings =
-        AssetCatalogService::shared().settingsFor(assetType_);
+    // Tidying up says nothing: a device without catalog settings has no cache to tidy.
+    std::optional<AssetTypeSettings> settings = AssetCatalogService::shared().settingsFor(
+        assetType_, AssetCatalogService::Problems::Unsaid);
     if (settings) {
         catalog::removeAbandonedDownloads(settings->cacheDirectory, /*completedToo=*/true);
     }

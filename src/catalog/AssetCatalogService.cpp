@@ -38,7 +38,8 @@ AssetCatalogService::AssetCatalogService()
       worker_("com.zandor.tavrixservicesd.AssetDownloads"),
       delivery_("com.zandor.tavrixservicesd.AssetProgress") {}
 
-std::optional<AssetTypeSettings> AssetCatalogService::settingsFor(std::string_view assetType) {
+std::optional<AssetTypeSettings> AssetCatalogService::settingsFor(std::string_view assetType,
+                                                                  Problems problems) {
     plist::CachedPropertyListFile::Snapshot snapshot = settingsFile_.read();
     std::string reason;
     std::optional<AssetTypeSettings> settings;
@@ -52,7 +53,9 @@ std::optional<AssetTypeSettings> AssetCatalogService::settingsFor(std::string_vi
     if (settings) {
         reason.clear();
     }
-    noteSettingsProblem(assetType, reason);
+    if (problems == Problems::Logged) {
+        noteSettingsProblem(assetType, reason);
+    }
     return settings;
 }
 

@@ -29,9 +29,11 @@ class AssetCatalogService {
     // Progress handlers run here, so a slow handler never holds up a download.
     SerialQueue& deliveryQueue() { return delivery_; }
 
+    enum class Problems { Logged, Unsaid };
     // The current settings for assetType, or nothing. Why there are none is logged once, and again
-    // only when the reason changes.
-    std::optional<AssetTypeSettings> settingsFor(std::string_view assetType);
+    // only when the reason changes, unless the caller is only tidying up (Unsaid).
+    std::optional<AssetTypeSettings> settingsFor(std::string_view assetType,
+                                                 Problems problems = Problems::Logged);
 
   private:
     AssetCatalogService();

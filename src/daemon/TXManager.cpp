@@ -69,6 +69,10 @@ bool TXManager::setTavrixID(const std::string& tavrixID, const std::optional<pli
         logCFormat("Could not store the behavior ID, not accepting it\n");
         return false;
     }
+    if (!bundle) {
+        // Before the bundle manager is first taken: its start-up lines follow this one.
+        logObjectFormat("No bundle data given");
+    }
     BundleManager& bundles = BundleManager::sharedInstance();
     {
         std::lock_guard lock(bundles.operationLock());
@@ -82,8 +86,6 @@ bool TXManager::setTavrixID(const std::string& tavrixID, const std::optional<pli
             if (payload != nullptr) {
                 *payload = {extracted, std::move(reason)};
             }
-        } else {
-            logObjectFormat("No bundle data given");
         }
         bundles.resetBehaviorBundle(lowered);
     }

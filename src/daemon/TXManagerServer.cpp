@@ -295,9 +295,12 @@ void TXManagerServer::_run() {
     auto& transactions = TXTransactionManager::sharedInstance();
     const auto slice = duration_cast<microseconds>(duration<double>(kRunLoopSliceSeconds));
     std::string lastStatus;
+    // A pass lasts its whole slice whatever it handles; each event only wakes the loop within it.
+    auto passEnd = steady_clock::now() + slice;
     for (;;) {
-        microseconds timeout = slice;
         const auto now = steady_clock::now();
+        microseconds timeout =
+            std::max(microseconds(0), duration_cast<microseconds>(passEnd - now));
         if (_finishing) {
             // Work started by an answered call (a download, an install) ends before the process.
             const int open = serviceManager.openTransactionCount();
@@ -310,7 +313,7 @@ void TXManagerServer::_run() {
                 break;
             }
             timeout = std::min(
-                slice, duration_cast<microseconds>(_drainDeadline - now) + microseconds(1000));
+                timeout, duration_cast<microseconds>(_drainDeadline - now) + microseconds(1000));
         } else if (_holdsInstanceLock && serviceManager.isIdle()) {
             // (A daemon waiting for the lock stays: the previous one is about to end.)
             // Nothing open, keep-alive clear, and no activity (a call included) for the grace.
@@ -320,7 +323,7 @@ void TXManagerServer::_run() {
                 continue;  // look again: the calls answered while leaving may have started work
             }
             timeout =
-                std::min(slice, duration_cast<microseconds>(deadline - now) + microseconds(1000));
+                std::min(timeout, duration_cast<microseconds>(deadline - now) + microseconds(1000));
         }
         int r = sd_event_run(_event.get(), static_cast<uint64_t>(timeout.count()));
         if (r < 0) {
@@ -328,10 +331,13 @@ void TXManagerServer::_run() {
             break;
         }
         std::set<std::string> open = transactions.openTransactions();
-        if (r == 0 && !open.empty()) {
-            plist::Array names(open.begin(), open.end());
-            plist::Value set(std::move(names));
-            logObjectFormat("Tavrix daemon continuing to run - transactions: %@", &set);
+        if (steady_clock::now() >= passEnd) {
+            passEnd = steady_clock::now() + slice;
+            if (!open.empty()) {
+                plist::Array names(open.begin(), open.end());
+                plist::Value set(std::move(names));
+                logObjectFormat("Tavrix daemon continuing to run - transactions: %@", &set);
+            }
         }
         std::string status = transactionStatus(open);
         if (status != lastStatus) {
@@ -378,7 +384,7 @@ bool TXManagerServer::shouldAcceptNewConnection(bus::ServiceListener& listener,
     auto& transactions = TXTransactionManager::sharedInstance();
     transactions.beginTransaction(kAddClientTransaction);
     addClient(std::make_shared<TXManagerServerClient>(
-        connection.uniqueName, connection.pid, connection.commandName,
+        connection.uniqueName, connection.pid,
         listener.watchConnection(connection.uniqueName)));
     transactions.endTransaction(kAddClientTransaction);
     return true;

@@ -7,10 +7,8 @@
 namespace tavrix {
 
 TXManagerServerClient::TXManagerServerClient(std::string connection, pid_t pid,
-                                             std::optional<std::string> identifier,
                                              bus::BusSlotPtr invalidationWatch)
     : _connection(std::move(connection)),
-      _identifier(std::move(identifier)),
       _pid(pid),
       _invalidationWatch(std::move(invalidationWatch)) {}
 

@@ -8,15 +8,16 @@
 #include <string>
 
 #include "bus/BusHandles.h"
+#include "daemon/TXManagerClientInterface.h"
 
 namespace tavrix {
 
 class TXManagerServerClient {
   public:
-    // connection: the peer's unique bus name; pid and identifier (its command name) come from the
-    // peer's credentials and may be unknown. invalidationWatch is what reports the peer leaving
-    // the bus; it is dropped with the connection.
-    TXManagerServerClient(std::string connection, pid_t pid, std::optional<std::string> identifier,
+    // connection: the peer's unique bus name; pid comes from the peer's credentials and may be
+    // unknown. invalidationWatch is what reports the peer leaving the bus; it is dropped with the
+    // connection.
+    TXManagerServerClient(std::string connection, pid_t pid,
                           bus::BusSlotPtr invalidationWatch = nullptr);
     ~TXManagerServerClient();
     TXManagerServerClient(const TXManagerServerClient&) = delete;
@@ -26,6 +27,7 @@ class TXManagerServerClient {
     const std::string& connection() const { return _connection; }
     const std::optional<std::string>& identifier() const { return _identifier; }
     pid_t pid() const { return _pid; }
+    TXManagerClientInterface proxy() const { return TXManagerClientInterface(_connection); }
 
     // Forgets the connection and stops watching it. Safe to call twice.
     void invalidate();
@@ -34,6 +36,8 @@ class TXManagerServerClient {
 
   private:
     std::string _connection;
+    // A bundle identifier vouched for by the platform; the bus has none to give, and anything the
+    // peer could name itself (its command name) would let it choose text for the log. Stays empty.
     std::optional<std::string> _identifier;
     pid_t _pid;
     bus::BusSlotPtr _invalidationWatch;

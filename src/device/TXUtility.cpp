@@ -1,5 +1,7 @@
 #include "device/TXUtility.h"
 
+#include <langinfo.h>
+#include <locale.h>
 #include <pwd.h>
 #include <sys/stat.h>
 #include <sys/statfs.h>
@@ -9,7 +11,10 @@
 #include <cerrno>
 #include <cmath>
 #include <cstdlib>
+#include <cstring>
 #include <ctime>
+#include <memory>
+#include <type_traits>
 #include <vector>
 
 #include "device/DeviceInfoService.h"
@@ -19,6 +24,29 @@ namespace tavrix {
 namespace {
 
 bool gIsDaemon = false;
+
+struct LocaleFree {
+    void operator()(locale_t locale) const { ::freelocale(locale); }
+};
+using LocaleHandle = std::unique_ptr<std::remove_pointer_t<locale_t>, LocaleFree>;
+
+// The locale's time of day without its seconds: the short time style. Its time format may name
+// the 12-hour or the 24-hour form by a conversion of its own.
+std::string shortTimeFormat(locale_t locale) {
+    std::string format = ::nl_langinfo_l(T_FMT, locale);
+    if (format == "%r") {
+        format = ::nl_langinfo_l(T_FMT_AMPM, locale);
+    } else if (format == "%T") {
+        format = "%H:%M:%S";
+    }
+    for (const char* seconds : {":%S", ".%S", "%S"}) {
+        if (auto at = format.find(seconds); at != std::string::npos) {
+            format.erase(at, std::strlen(seconds));
+            break;
+        }
+    }
+    return format;
+}
 
 std::optional<std::string> homeDirectory() {
     const char* home = std::getenv("HOME");
@@ -169,9 +197,15 @@ std::string TXUtility::prettyPrintDate(plist::Date date) {
     bool representable = std::isfinite(whole) && whole >= -9.2e18 && whole <= 9.2e18;
     std::time_t seconds = representable ? static_cast<std::time_t>(whole) : 0;
     ::tzset();
-    char text[128];
-    if (!representable || ::localtime_r(&seconds, &local) == nullptr ||
-        std::strftime(text, sizeof text, "%x %H:%M", &local) == 0) {
+    // The environment's time locale (LC_ALL, LC_TIME, LANG), whatever the process's own is.
+    LocaleHandle locale(::newlocale(LC_TIME_MASK, "", locale_t{}));
+    if (!locale) {
+        locale.reset(::newlocale(LC_TIME_MASK, "C", locale_t{}));
+    }
+    char text[256];
+    const std::string format = std::string("%x ") + shortTimeFormat(locale.get());
+    if (!representable || !locale || ::localtime_r(&seconds, &local) == nullptr ||
+        ::strftime_l(text, sizeof text, format.c_str(), &local, locale.get()) == 0) {
         // Still something readable for a log line.
         return std::to_string(date.secondsSinceReferenceDate);
     }

@@ -4,6 +4,7 @@
 #include <cstdint>
 #include <cstdlib>
 #include <cstring>
+#include <filesystem>
 #include <functional>
 #include <memory>
 #include <optional>
@@ -54,20 +55,46 @@ const char* errorText(archive* handle) {
     return text != nullptr ? text : "unknown error";
 }
 
-// Points the entry's path and its hard-link target (when relative) below destination, as if the
-// archive were extracted inside it. False, logged, when the entry must not be written.
-bool placeEntry(archive_entry* entry, const std::string& destination) {
+// Where the destination stands: the directory written to, and the one the extracted tree will
+// become (the same unless the tree is assembled elsewhere and renamed into place afterwards).
+struct Placement {
+    std::string destination;
+    std::string placedAs;
+};
+
+// The path an entry name reaches from the placed directory, kept where the placed tree will be:
+// a path that lands inside it (an absolute one, or "../Default.bundle/x") is redirected below
+// the destination, so that it is part of the tree that takes the directory's place instead of
+// being written into the directory about to be replaced.
+std::string placedPath(const Placement& placement, const char* name) {
+    if (placement.placedAs == placement.destination) {
+        return name[0] == '/' ? std::string(name) : placement.destination + "/" + name;
+    }
+    const std::string reached =
+        std::filesystem::path(name[0] == '/' ? std::string(name)
+                                             : placement.placedAs + "/" + name)
+            .lexically_normal()
+            .string();
+    if (reached == placement.placedAs || reached.starts_with(placement.placedAs + "/")) {
+        return placement.destination + reached.substr(placement.placedAs.size());
+    }
+    return reached;
+}
+
+// Points the entry's path and its hard-link target where the archive, extracted in the placed
+// directory, would put them. False when the entry has no name to write (the line logged is
+// empty, as for an entry that cannot be created).
+bool placeEntry(archive_entry* entry, const Placement& placement) {
     const char* name = libarchive().archive_entry_pathname(entry);
     if (name == nullptr || name[0] == '\0') {
-        logCFormat("Skipping an archive entry without a usable name\n");
+        logCFormat("%s", "");
         return false;
     }
+    libarchive().archive_entry_copy_pathname(entry, placedPath(placement, name).c_str());
     const char* linkTarget = libarchive().archive_entry_hardlink(entry);
-    if (name[0] != '/') {
-        libarchive().archive_entry_copy_pathname(entry, (destination + "/" + name).c_str());
-    }
-    if (linkTarget != nullptr && linkTarget[0] != '\0' && linkTarget[0] != '/') {
-        libarchive().archive_entry_copy_hardlink(entry, (destination + "/" + linkTarget).c_str());
+    if (linkTarget != nullptr && linkTarget[0] != '\0') {
+        libarchive().archive_entry_copy_hardlink(entry,
+                                                 placedPath(placement, linkTarget).c_str());
     }
     return true;
 }
@@ -109,7 +136,8 @@ std::optional<std::string> copyEntryData(archive* reader, archive* writer,
 // The extraction itself; open attaches the reader to the archive named archivePath.
 ExtractionOutcome extract(const std::string& archivePath, const std::function<int(archive*)>& open,
                           const std::string& destinationDirectory, ExtractionSafety safety,
-                          const ExtractionLimits& limits, std::string* whyNot) {
+                          const ExtractionLimits& limits, std::string* whyNot,
+                          const std::string& placedAs) {
     auto fail = [&](const std::string& why,
                     ExtractionOutcome outcome = ExtractionOutcome::Damaged) {
         if (whyNot != nullptr) {
@@ -161,6 +189,7 @@ ExtractionOutcome extract(const std::string& archivePath, const std::function<in
         return fail("Cannot open the archive " + archivePath + ": " + errorText(reader.get()));
     }
     ExtractionBudget budget(limits, destination);
+    const Placement placement{destination, placedAs.empty() ? destination : placedAs};
     auto stop = [&](const std::string& why) {
         return fail("Extraction of " + archivePath + " into " + destination + " stopped: " + why,
                     ExtractionOutcome::OverLimit);
@@ -192,7 +221,7 @@ ExtractionOutcome extract(const std::string& archivePath, const std::function<in
                                   declaredSize(entry))) {
             return stop(*exceeded);
         }
-        if (!placeEntry(entry, destination)) {
+        if (!placeEntry(entry, placement)) {
             continue;
         }
         if (libarchive().archive_write_header(writer.get(), entry) < ARCHIVE_WARN) {
@@ -217,18 +246,20 @@ bool extractArchive(const std::string& archivePath, const std::string& destinati
                                                   return libarchive().archive_read_open_filename(
                                                       reader, archivePath.c_str(), kReadBlockSize);
                                               },
-                                              destinationDirectory, safety, limits, whyNot);
+                                              destinationDirectory, safety, limits, whyNot,
+                                              std::string());
 }
 
 ExtractionOutcome extractArchive(int archiveFd, const std::string& archivePath,
                                  const std::string& destinationDirectory, ExtractionSafety safety,
-                                 const ExtractionLimits& limits, std::string* whyNot) {
+                                 const ExtractionLimits& limits, std::string* whyNot,
+                                 const std::string& placedAs) {
     return extract(
         archivePath,
         [archiveFd](archive* reader) {
             return libarchive().archive_read_open_fd(reader, archiveFd, kReadBlockSize);
         },
-        destinationDirectory, safety, limits, whyNot);
+        destinationDirectory, safety, limits, whyNot, placedAs);
 }
 
 }  // namespace tavrix::payload

@@ -93,9 +93,12 @@ bool extractArchive(const std::string& archivePath, const std::string& destinati
 enum class ExtractionOutcome { Complete, Damaged, OverLimit };
 
 // The same for the archive open at archiveFd (read from its current offset), answering how it
-// ended; archivePath names it in messages.
+// ended; archivePath names it in messages. placedAs, when given, is the directory the extracted
+// tree becomes once renamed: entries land as if extracted there, and those that would land inside
+// it land at the same place below destinationDirectory.
 ExtractionOutcome extractArchive(int archiveFd, const std::string& archivePath,
                                  const std::string& destinationDirectory, ExtractionSafety safety,
-                                 const ExtractionLimits& limits, std::string* whyNot);
+                                 const ExtractionLimits& limits, std::string* whyNot,
+                                 const std::string& placedAs = std::string());
 
 }  // namespace tavrix::payload

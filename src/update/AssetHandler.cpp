@@ -49,14 +49,16 @@ bool listsProductType(const plist::Value& supported, const std::optional<std::st
 
 // Whether the asset fits this device: its OS version within the bounds (inclusive) and its
 // product type listed, when the asset says so. Logs why not, unless quiet.
-bool fitsThisDevice(const plist::Dictionary& attributes, const plist::Value& productVersion,
+bool fitsThisDevice(const plist::Dictionary& attributes, const plist::Value* productVersion,
                     const std::optional<std::string>& productType, bool quiet = false) {
-    const std::string current = versionText(productVersion);
+    // An unknown OS version compares as the empty text (any minimum is above it) and is logged
+    // as no value.
+    const std::string current = productVersion != nullptr ? versionText(*productVersion) : "";
     if (auto minimum = attributes.find(kAssetAttributeMinimumOSVersion);
         minimum != attributes.end() &&
         compareVersionStrings(versionText(minimum->second), current) == 1) {
         if (!quiet) {
-            logObjectFormat("Current product version %@ is lower than min %@", &productVersion,
+            logObjectFormat("Current product version %@ is lower than min %@", productVersion,
                             &minimum->second);
         }
         return false;
@@ -65,7 +67,7 @@ bool fitsThisDevice(const plist::Dictionary& attributes, const plist::Value& pro
         maximum != attributes.end() &&
         compareVersionStrings(versionText(maximum->second), current) == -1) {
         if (!quiet) {
-            logObjectFormat("Current product version %@ is higher than max %@", &productVersion,
+            logObjectFormat("Current product version %@ is higher than max %@", productVersion,
                             &maximum->second);
         }
         return false;
@@ -97,12 +99,13 @@ const catalog::HeldBackAsset* newestHeldBack(const catalog::QueryResult& query,
                                              const std::optional<std::string>& installed) {
     const catalog::HeldBackAsset* newest = nullptr;
     std::string newestVersion = installed.value_or("0.0");
-    const plist::Value productVersion(TXUtility::currentProductVersion().value_or(""));
+    const std::optional<plist::Value> productVersion = optionalText(TXUtility::currentProductVersion());
     for (const catalog::HeldBackAsset& held : query.heldBack) {
         auto version = held.attributes.find(kAssetAttributeVersion);
         if (version != held.attributes.end() &&
             compareVersionStrings(versionText(version->second), newestVersion) == 1 &&
-            fitsThisDevice(held.attributes, productVersion, TXUtility::currentProductType(),
+            fitsThisDevice(held.attributes, productVersion ? &*productVersion : nullptr,
+                           TXUtility::currentProductType(),
                            true)) {
             newest = &held;
             newestVersion = versionText(version->second);
@@ -163,11 +166,10 @@ AssetHandler::AssetPtr AssetHandler::findTheBestAsset(catalog::QueryResult* resu
         logObjectFormat("No bundle version available, initializing with 0.0");
     }
     plist::Value bestVersion(installed.value_or("0.0"));
-    // An unknown OS version is the empty text: any minimum is then above it.
-    const plist::Value productVersion(TXUtility::currentProductVersion().value_or(""));
+    const std::optional<plist::Value> productVersion = optionalText(TXUtility::currentProductVersion());
     const auto productType = optionalText(TXUtility::currentProductType());
     logObjectFormat("Current version: %@\n", &bestVersion);
-    logObjectFormat("Current Product version: %@\n", &productVersion);
+    logObjectFormat("Current Product version: %@\n", productVersion ? &*productVersion : nullptr);
     logObjectFormat("Product Type: %@\n", productType ? &*productType : nullptr);
 
     AssetPtr best;
@@ -188,7 +190,8 @@ AssetHandler::AssetPtr AssetHandler::findTheBestAsset(catalog::QueryResult* resu
             logObjectFormat("No asset version available");
             continue;
         }
-        if (!fitsThisDevice(attributes, productVersion, TXUtility::currentProductType())) {
+        if (!fitsThisDevice(attributes, productVersion ? &*productVersion : nullptr,
+                            TXUtility::currentProductType())) {
             continue;
         }
         if (compareVersionStrings(versionText(version->second), versionText(bestVersion)) == 1) {
@@ -288,7 +291,9 @@ void AssetHandler::handleDownloadProgress(const AssetPtr& asset, const plist::Di
         logObjectFormat("Best candidate asset has been purged");
         running->finish();
     });
-    endCheck(installed ? kInstallDoneDelaySeconds : kInstallRetryDelaySeconds);
+    // Fifteen days after any attempt, one that failed included: a failed install keeps the old
+    // bundle, and a device out of room would otherwise fetch the bundle again every day.
+    endCheck(kInstallDoneDelaySeconds);
 }
 
 bool AssetHandler::installDownloadedBundle(const std::string& source) {

@@ -129,10 +129,6 @@ void mergeEntries(const std::string& sourceRoot, const std::string& destinationR
         if (isRealDirectory(s)) {
             mergeEntries(sourceRoot, destinationRoot, sub.empty() ? name : joinPath(sub, name),
                          copy, firstError);
-            if (!copy) {
-                // Emptied by the merge; one that still holds something stays.
-                ::rmdir(s.c_str());
-            }
         }
     }
 }
@@ -525,7 +521,8 @@ char* copyCStringFromString(const CStringAllocator& allocator, std::string_view 
 }
 
 std::optional<plist::Value> loadDictionaryAtPath(const std::string& path) {
-    auto value = readPropertyListFile(path);
+    // Says nothing about a file it cannot read, as none of these utilities logs.
+    auto value = plist::readFile(path);
     if (!value || !value->isDictionary()) {
         return std::nullopt;
     }

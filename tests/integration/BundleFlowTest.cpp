@@ -82,13 +82,25 @@ class BundleFlowTest : public BusFixture {
 // file alone.
 TEST_F(BundleFlowTest, FirstSetLinksTheOverlaidCarrierFileAndRepeatingItChangesNothing) {
     device().writeDaemonPreferences({{"EnableSupport", true}});
-    auto payload = packBundle("10");
+    // Entries that name the bundle directory from outside (by "..", by an absolute path) are
+    // part of the bundle, as if the archive were extracted in place.
+    const fs::path source = device().base() / "src-10";
+    writeBundle(source, "10", baseCarrierFile("Bundle 10"));
+    test::writeText(source / "Climbs.plist", "climbs");
+    test::writeText(source / "Absolute.plist", "absolute");
+    const std::string userBundle = at(kUserBundle).string();
+    auto payload = pack(source, {"-P", "-s", ",^\\./Climbs,../Default.bundle/Climbs,", "-s",
+                                 ",^\\./Absolute," + userBundle + "/Absolute,"});
     fs::path payloadFile = device().base() / "payload.tgz";
     test::writeText(payloadFile, std::string(payload.begin(), payload.end()));
     const std::vector<std::string> setID = {
         TAVRIX_CTL_PATH, "--address", busAddress(),        "set-id",
         "AbC",           "--bundle",  payloadFile.string()};
 
+    // First without a payload: said before the bundle manager starts.
+    CommandResult withoutPayload = runCommand(
+        {TAVRIX_CTL_PATH, "--address", busAddress(), "set-id", "AbC"});
+    ASSERT_EQ(withoutPayload.status, 0) << withoutPayload.output;
     CommandResult first = runCommand(setID);
     ASSERT_EQ(first.status, 0) << first.output;
     EXPECT_EQ(first.output,
@@ -99,8 +111,8 @@ TEST_F(BundleFlowTest, FirstSetLinksTheOverlaidCarrierFileAndRepeatingItChangesN
     const fs::path overlayFile = at(kOverlayDirectory) / "id+behavior+Default.bundle+abc+10.plist";
     // The log lines are part of the design: each flow's lines once, in order, others between.
     const std::string staged = at("/tmp/behaviorbundle_zipped.tgz").string();
-    const std::string userBundle = at(kUserBundle).string();
     const std::pair<const char*, std::vector<std::string>> flows[] = {
+        {"first use", {"No bundle data given", "Initializing Carrier Bundle Locations"}},
         {"locations",
          {"Initializing Carrier Bundle Locations", "Using " + at(kSystemBundle).string() + " and " +
                                                        userBundle + " for respective locations"}},
@@ -135,6 +147,11 @@ TEST_F(BundleFlowTest, FirstSetLinksTheOverlaidCarrierFileAndRepeatingItChangesN
             ++position;
         }
     }
+    // Nothing on the catalog: a launch without its settings does not look for them.
+    EXPECT_EQ(countLogLinesContaining("there is no settings file"), 0);
+    EXPECT_EQ(test::readText(at(kUserBundle) / "Climbs.plist"), "climbs");
+    EXPECT_EQ(test::readText(at(kUserBundle) / "Absolute.plist"), "absolute");
+    EXPECT_TRUE(fs::exists(at(kUserBundle) / "behavior.plist"));
     EXPECT_EQ(linkTarget(kBundleLink), at(kUserBundle).string());
     EXPECT_EQ(linkTarget(kPreferencesLink), overlayFile.string());
     auto linked = linkedCarrierFile();

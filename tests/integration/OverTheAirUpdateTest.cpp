@@ -312,8 +312,9 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
 
 // A download that fails (the archive changed on the server) and a bundle larger than the free
 // space of the mobile home (refused before the old bundle is touched) leave the linked bundle and
-// its files as they were, post nothing, leave no download behind and re-arm the check a day ahead;
-// a good update afterwards still installs.
+// its files as they were, post nothing and leave no download behind; the failed download re-arms
+// the check a day ahead, the failed install, like any install, fifteen days ahead. A good update
+// afterwards still installs.
 TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheNextOneInstalls) {
     const fs::path home = at("/var/mobile");
     struct Unmount {
@@ -337,10 +338,10 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheNextOneInstalls) {
     const auto installedFiles = userBundleFiles();
     const std::string carrierFile = linkTarget(kPreferencesLink);
     constexpr const char* kPurged = "Best candidate asset has been purged";
-    auto expectNothingChanged = [&](const std::string& waitedLine, int seen) {
+    auto expectNothingChanged = [&](const std::string& waitedLine, int seen, double rearmedIn) {
         EXPECT_TRUE(client().checkForTavrixBundleUpdate());
         EXPECT_TRUE(waitForLogLine(waitedLine, 30s, seen + 1));
-        EXPECT_TRUE(waitForNextUpdateIn(kOneDay));
+        EXPECT_TRUE(waitForNextUpdateIn(rearmedIn));
         EXPECT_EQ(userBundleFiles(), installedFiles);
         EXPECT_EQ(linkTarget(kBundleLink), at(kUserBundle).string());
         EXPECT_EQ(linkTarget(kPreferencesLink), carrierFile);
@@ -353,7 +354,7 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheNextOneInstalls) {
     std::string bytes = readText(archive);
     bytes[bytes.size() / 2] = static_cast<char>(bytes[bytes.size() / 2] ^ 0x55);
     writeText(archive, bytes);
-    expectNothingChanged("Current operation: Failed", 0);
+    expectNothingChanged("Current operation: Failed", 0, kOneDay);
 
     if (smallHome.mounted) {
         // Room for the payload's extraction reserve was needed above; now leave 2 MB free.
@@ -365,7 +366,7 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheNextOneInstalls) {
         ASSERT_EQ(::posix_fallocate(fd.get(), 0, filler), 0);
         armInThreeDays();
         publish("3", 3 << 20);
-        expectNothingChanged(kPurged, countLogLines(kPurged));
+        expectNothingChanged(kPurged, countLogLines(kPurged), kFifteenDays);
         EXPECT_EQ(countLogLinesContaining("Not enough free space to install"), 1);
         fs::remove(home / "filler");
     } else {
@@ -628,10 +629,12 @@ class OverTheAirKeepAliveTest : public OverTheAirUpdateTest {
     OverTheAirKeepAliveTest() { idleExitSeconds = 1; }
 };
 
-// The scheduled check of a daemon that was started for it: its keep-alive transaction ends with
-// the download's first report, but the daemon stays while the download runs, however long the
-// server takes, installs the bundle, and leaves when idle afterwards: the install ending on
-// another thread wakes the run loop, rather than the end of its 15-second pass.
+// The scheduled check of a daemon that was started for it: while the catalog is slow to come,
+// its keep-alive transaction is open and each 15-second pass of the run loop says so, calls
+// coming meanwhile or not. The transaction ends with the download's first report, but the daemon
+// stays while the download runs, however long the server takes, installs the bundle, and leaves
+// when idle afterwards: the install ending on another thread wakes the run loop, rather than the
+// end of its pass.
 TEST_F(OverTheAirKeepAliveTest, ScheduledCheckKeepsTheDaemonUntilTheDownloadIsInstalled) {
     setIDWithBundle("1");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
@@ -645,6 +648,18 @@ TEST_F(OverTheAirKeepAliveTest, ScheduledCheckKeepsTheDaemonUntilTheDownloadIsIn
     held.body = readText(published(archive));
     held.holdAfterBodyBytes = held.body.size() / 3;
     server.serve(archive, held);
+    test::LocalHttpServer::Response slowCatalog;
+    slowCatalog.body = readText(site() / "catalog.plist");
+    // About 18 s: past the first pass of the run loop.
+    slowCatalog.trickleBytesPerSecond = slowCatalog.body.size() / 18 + 1;
+    server.serve("/updates/catalog.plist", slowCatalog);
+    std::optional<plist::Value> settings =
+        plist::readFile(at("/etc/tavrix/AssetCatalog.plist").string());
+    ASSERT_TRUE(settings);
+    plist::Dictionary patient = *settings->asDictionary();
+    patient.insert_or_assign("CatalogTimeoutSeconds", plist::Value(60));
+    ASSERT_TRUE(
+        plist::writeFile(at("/etc/tavrix/AssetCatalog.plist").string(), plist::Value(patient)));
 
     // The job's window came while the daemon was away: it fires when the daemon starts.
     const double due = now() - 60.0;
@@ -668,6 +683,14 @@ TEST_F(OverTheAirKeepAliveTest, ScheduledCheckKeepsTheDaemonUntilTheDownloadIsIn
     ASSERT_TRUE(second);
     EXPECT_TRUE(
         waitForLogLine("*********** Beginning Corvex transaction : Update Check ***********"));
+    constexpr const char* kContinuing = "Tavrix daemon continuing to run - transactions:";
+    const auto launched = std::chrono::steady_clock::now();
+    while (countLogLinesContaining(kContinuing) == 0 &&
+           std::chrono::steady_clock::now() - launched < 20s) {
+        EXPECT_TRUE(client().isTavrixBundleSupported());
+        std::this_thread::sleep_for(4s);
+    }
+    EXPECT_EQ(countLogLinesContaining(kContinuing), 1);
     ASSERT_TRUE(server.waitForHeldResponse(30s));
     EXPECT_TRUE(
         waitForLogLine("*********** Ended Corvex transaction : Update Check ***********", 10s));

@@ -130,9 +130,13 @@ TEST_F(CalendarInZone, DaysFollowTheWallClockAcrossDaylightSaving) {
     EXPECT_DOUBLE_EQ(autumn->secondsSinceReferenceDate -
                          localDate(2026, 10, 31, 12, 0).secondsSinceReferenceDate,
                      25 * 3600.0);
-    // Short date and time, in local time.
-    std::setlocale(LC_TIME, "C");
+    // Short date and time (no seconds), in local time and the environment's time locale.
+    const char* locale = std::getenv("LC_ALL");
+    const std::optional<std::string> saved =
+        locale ? std::optional<std::string>(locale) : std::nullopt;
+    ::setenv("LC_ALL", "C", 1);
     EXPECT_EQ(TXUtility::prettyPrintDate(localDate(2026, 3, 7, 9, 5)), "03/07/26 09:05");
+    saved ? ::setenv("LC_ALL", saved->c_str(), 1) : ::unsetenv("LC_ALL");
 }
 
 // Days move back and across months keeping fractions; results that cannot be represented are
