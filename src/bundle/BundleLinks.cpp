@@ -124,8 +124,7 @@ bool linksDisagree(const CarrierBundle& linked, const std::string& overlayDirect
     auto inside = [&carrierFile](const std::string& directory) {
         return !directory.empty() && carrierFile.starts_with(directory + "/");
     };
-    return !inside(bundle) &&
-           (overlayDirectory.empty() || !inside(realPathOf(overlayDirectory)));
+    return !inside(bundle) && (overlayDirectory.empty() || !inside(realPathOf(overlayDirectory)));
 }
 
 std::string baseNameOfPath(const std::string& path) {

@@ -248,9 +248,12 @@ void BackgroundJobScheduler::saveLocked() {
     for (const auto& [name, job] : jobs_) {
         contents.emplace(name, job.criteria);
     }
-    std::string bytes = plist::serialize(plist::Value(std::move(contents)));
+    std::string whyNot;
+    std::string bytes =
+        plist::serialize(plist::Value(std::move(contents)), plist::Format::Xml, &whyNot);
     if (bytes.empty()) {
-        logCFormat("Background jobs: cannot encode the jobs of %s", clientName_.c_str());
+        logCFormat("Background jobs: not saving the jobs of %s: %s", clientName_.c_str(),
+                   whyNot.c_str());
         return;
     }
     if (int failure = io::replaceFileAtomically(filePath_, bytes, kJobsFileMode); failure != 0) {

@@ -60,8 +60,7 @@ PeerConnection ServiceListener::peerOf(sd_bus_message* message) const {
     const char* sender = sd_bus_message_get_sender(message);
     peer.uniqueName = sender == nullptr ? "" : sender;
     sd_bus_creds* raw = nullptr;
-    if (sd_bus_query_sender_creds(
-            message, SD_BUS_CREDS_PID | SD_BUS_CREDS_AUGMENT, &raw) >= 0) {
+    if (sd_bus_query_sender_creds(message, SD_BUS_CREDS_PID | SD_BUS_CREDS_AUGMENT, &raw) >= 0) {
         pid_t pid = 0;
         if (sd_bus_creds_get_pid(raw, &pid) >= 0) {
             peer.pid = pid;

@@ -384,8 +384,7 @@ bool TXManagerServer::shouldAcceptNewConnection(bus::ServiceListener& listener,
     auto& transactions = TXTransactionManager::sharedInstance();
     transactions.beginTransaction(kAddClientTransaction);
     addClient(std::make_shared<TXManagerServerClient>(
-        connection.uniqueName, connection.pid,
-        listener.watchConnection(connection.uniqueName)));
+        connection.uniqueName, connection.pid, listener.watchConnection(connection.uniqueName)));
     transactions.endTransaction(kAddClientTransaction);
     return true;
 }

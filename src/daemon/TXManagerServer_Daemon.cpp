@@ -5,6 +5,7 @@
 // value), and the daemon goes on serving.
 #include <systemd/sd-bus.h>
 
+#include <cerrno>
 #include <cstring>
 
 #include "bus/BusValueCodec.h"
@@ -44,7 +45,15 @@ class MessageScope {
     bus::ServiceListener& listener_;
 };
 
-int invalidArguments(sd_bus_error* error, int r) {
+// An argument the bus library could not read. For text that is invalid UTF-8 or holds a Unicode
+// noncharacter (which D-Bus allows but the library refuses to read): the caller learns which.
+int invalidArgument(sd_bus_error* error, int r, const char* argument) {
+    if (r == -EBADMSG) {
+        return sd_bus_error_setf(error, SD_BUS_ERROR_INVALID_ARGS,
+                                 "The %s is not text this service can read: invalid UTF-8 or a "
+                                 "Unicode noncharacter",
+                                 argument);
+    }
     return sd_bus_error_set_errnof(error, r < 0 ? -r : EINVAL, "Malformed arguments");
 }
 
@@ -76,7 +85,7 @@ int handleSetTavrixID(sd_bus_message* message, void* userdata, sd_bus_error* err
     const char* tavrixID = nullptr;
     std::optional<std::vector<std::uint8_t>> bundle;
     if (int r = sd_bus_message_read(message, "s", &tavrixID); r < 0) {
-        return invalidArguments(error, r);
+        return invalidArgument(error, r, "behavior ID");
     }
     if (bus::readOptionalBytes(message, bundle) < 0) {
         return sd_bus_error_set(error, SD_BUS_ERROR_INVALID_ARGS,
@@ -98,7 +107,7 @@ int handleSetTavrixIDWithBundleFD(sd_bus_message* message, void* userdata, sd_bu
     int fd = -1;
     int r = sd_bus_message_read(message, "sh", &tavrixID, &fd);
     if (r < 0) {
-        return invalidArguments(error, r);
+        return invalidArgument(error, r, "behavior ID");
     }
     plist::Data bundle;
     std::string whyNot;
@@ -146,7 +155,7 @@ int handleCopyTavrixValue(sd_bus_message* message, void* userdata, sd_bus_error*
     const char* key = nullptr;
     int r = sd_bus_message_read(message, "s", &key);
     if (r < 0) {
-        return invalidArguments(error, r);
+        return invalidArgument(error, r, "key");
     }
     bus::BusMessagePtr replyMessage;
     containExceptions("Copy Tavrix Value", [&] {
@@ -191,7 +200,7 @@ int handleSetClientType(sd_bus_message* message, void* userdata, sd_bus_error* e
     std::int32_t type = 0;
     int r = sd_bus_message_read(message, "i", &type);
     if (r < 0) {
-        return invalidArguments(error, r);
+        return invalidArgument(error, r, "client type");
     }
     bool answer = answerOf("Set Client Type", server, message, false, [&](bool& result) {
         server.setClientType(type, [&](bool known) { result = known; });

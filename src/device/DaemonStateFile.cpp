@@ -1,5 +1,7 @@
 #include "device/DaemonStateFile.h"
 
+#include <cerrno>
+
 #include "device/PlatformRoot.h"
 #include "io/AtomicFile.h"
 #include "io/Directory.h"
@@ -35,8 +37,11 @@ int writeDaemonStateFile(std::string_view fileName, const plist::Value& value, p
     if (error != 0) {
         return error;
     }
-    return io::replaceFileAtomically(daemonStateFilePath(fileName), plist::serialize(value, format),
-                                     mode);
+    const std::string bytes = plist::serialize(value, format);
+    if (bytes.empty()) {
+        return EFBIG;  // nothing its reader would take
+    }
+    return io::replaceFileAtomically(daemonStateFilePath(fileName), bytes, mode);
 }
 
 }  // namespace tavrix::device

@@ -20,7 +20,8 @@ std::string daemonStateFilePath(std::string_view fileName);
 plist::Dictionary readDaemonStateFile(std::string_view fileName);
 
 // Writes value as fileName in the state directory, creating the directory when missing. 0, or
-// the errno that stopped it; the file is then as it was.
+// the errno that stopped it (EFBIG for a value its reader would refuse); the file is then as it
+// was.
 int writeDaemonStateFile(std::string_view fileName, const plist::Value& value, plist::Format format,
                          mode_t mode);
 

@@ -322,15 +322,12 @@ bool PreferencesStore::writePending(Domain& domain) {
             contents.erase(existing);
         }
     }
-    std::string bytes = plist::serialize(plist::Value(std::move(contents)));
-    if (bytes.empty()) {
-        logCFormat("Preferences: cannot encode the values for %s", domain.path.c_str());
-        return false;
-    }
     // Never a file its own reader would refuse, and then read as empty.
-    if (bytes.size() > plist::kMaxPropertyListBytes) {
-        logCFormat("Preferences: not writing %s: %zu bytes, more than the %zu a reader accepts",
-                   domain.path.c_str(), bytes.size(), plist::kMaxPropertyListBytes);
+    std::string whyNot;
+    std::string bytes =
+        plist::serialize(plist::Value(std::move(contents)), plist::Format::Xml, &whyNot);
+    if (bytes.empty()) {
+        logCFormat("Preferences: not writing %s: %s", domain.path.c_str(), whyNot.c_str());
         return false;
     }
     if (int failure = preferences->writeFile(domain.fileName, kFileMode, true, bytes);

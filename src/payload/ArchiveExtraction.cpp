@@ -71,8 +71,7 @@ std::string placedPath(const Placement& placement, const char* name) {
         return name[0] == '/' ? std::string(name) : placement.destination + "/" + name;
     }
     const std::string reached =
-        std::filesystem::path(name[0] == '/' ? std::string(name)
-                                             : placement.placedAs + "/" + name)
+        std::filesystem::path(name[0] == '/' ? std::string(name) : placement.placedAs + "/" + name)
             .lexically_normal()
             .string();
     if (reached == placement.placedAs || reached.starts_with(placement.placedAs + "/")) {
@@ -93,8 +92,7 @@ bool placeEntry(archive_entry* entry, const Placement& placement) {
     libarchive().archive_entry_copy_pathname(entry, placedPath(placement, name).c_str());
     const char* linkTarget = libarchive().archive_entry_hardlink(entry);
     if (linkTarget != nullptr && linkTarget[0] != '\0') {
-        libarchive().archive_entry_copy_hardlink(entry,
-                                                 placedPath(placement, linkTarget).c_str());
+        libarchive().archive_entry_copy_hardlink(entry, placedPath(placement, linkTarget).c_str());
     }
     return true;
 }

@@ -383,6 +383,27 @@ bool endsWithClosingTag(std::string_view xml) {
     return xml.ends_with("</plist>");
 }
 
+// Why bytes are refused before libplist sees them, or nothing. The one table of what the reader
+// takes: the writer checks its own output against it.
+std::optional<std::string> whyRefused(std::string_view bytes, bool binary) {
+    if (bytes.empty()) {
+        return "it is empty";
+    }
+    if (bytes.size() > kMaxPropertyListBytes) {
+        return tooLarge();
+    }
+    // libplist accepts a document cut off before its closing tag; a truncated file is no value.
+    if (!binary && !endsWithClosingTag(bytes)) {
+        return "it is not a complete XML property list";
+    }
+    return binary ? checkBinaryBounds(bytes) : checkXmlBounds(bytes);
+}
+
+bool isBinary(std::string_view bytes) {
+    return bytes.size() <= kMaxPropertyListBytes &&
+           plist_is_binary(bytes.data(), static_cast<uint32_t>(bytes.size())) != 0;
+}
+
 }  // namespace
 
 std::optional<Value> parse(std::string_view bytes, Refusal* refusal) {
@@ -392,18 +413,8 @@ std::optional<Value> parse(std::string_view bytes, Refusal* refusal) {
         }
         return std::nullopt;
     };
-    if (bytes.empty()) {
-        return refuse("it is empty");
-    }
-    if (bytes.size() > kMaxPropertyListBytes) {
-        return refuse(tooLarge());
-    }
-    bool binary = plist_is_binary(bytes.data(), static_cast<uint32_t>(bytes.size())) != 0;
-    // libplist accepts a document cut off before its closing tag; a truncated file is no value.
-    if (!binary && !endsWithClosingTag(bytes)) {
-        return refuse("it is not a complete XML property list");
-    }
-    if (auto why = binary ? checkBinaryBounds(bytes) : checkXmlBounds(bytes)) {
+    const bool binary = isBinary(bytes);
+    if (auto why = whyRefused(bytes, binary)) {
         return refuse(std::move(*why));
     }
     plist_t raw = nullptr;
@@ -481,8 +492,22 @@ std::optional<Value> readOpenFile(int fd, Refusal* refusal) {
     return parse(*bytes, refusal);
 }
 
-std::string serialize(const Value& value, Format format) {
-    return format == Format::Binary ? writeBinary(value) : writeXml(value);
+std::string serialize(const Value& value, Format format, std::string* whyNot) {
+    std::string bytes = format == Format::Binary ? writeBinary(value) : writeXml(value);
+    if (bytes.empty()) {
+        if (whyNot != nullptr) {
+            *whyNot = "the value cannot be encoded";
+        }
+        return bytes;
+    }
+    // Never bytes the reader would refuse: a file written so would read back as no value.
+    if (auto why = whyRefused(bytes, format == Format::Binary)) {
+        if (whyNot != nullptr) {
+            *whyNot = "a reader would refuse it: " + *why;
+        }
+        return {};
+    }
+    return bytes;
 }
 
 bool writeFile(const std::string& path, const Value& value, Format format) {

@@ -32,8 +32,11 @@ std::optional<Value> parse(std::string_view bytes, Refusal* refusal = nullptr);
 std::optional<Value> readFile(const std::string& path, Refusal* refusal = nullptr);
 
 // The value encoded in the given format. XML dates are whole seconds, as every reader of the
-// format expects; binary dates keep their fractions.
-std::string serialize(const Value& value, Format format = Format::Xml);
+// format expects; binary dates keep their fractions. Empty, with the reason in whyNot when given,
+// when the value cannot be encoded or parse() would refuse the encoding (the bounds of
+// PropertyListBounds.h), so that nothing is written that its reader refuses.
+std::string serialize(const Value& value, Format format = Format::Xml,
+                      std::string* whyNot = nullptr);
 
 // Writes the serialized value over the file at path (not atomically). False when the file
 // cannot be written.

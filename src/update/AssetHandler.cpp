@@ -99,14 +99,14 @@ const catalog::HeldBackAsset* newestHeldBack(const catalog::QueryResult& query,
                                              const std::optional<std::string>& installed) {
     const catalog::HeldBackAsset* newest = nullptr;
     std::string newestVersion = installed.value_or("0.0");
-    const std::optional<plist::Value> productVersion = optionalText(TXUtility::currentProductVersion());
+    const std::optional<plist::Value> productVersion =
+        optionalText(TXUtility::currentProductVersion());
     for (const catalog::HeldBackAsset& held : query.heldBack) {
         auto version = held.attributes.find(kAssetAttributeVersion);
         if (version != held.attributes.end() &&
             compareVersionStrings(versionText(version->second), newestVersion) == 1 &&
             fitsThisDevice(held.attributes, productVersion ? &*productVersion : nullptr,
-                           TXUtility::currentProductType(),
-                           true)) {
+                           TXUtility::currentProductType(), true)) {
             newest = &held;
             newestVersion = versionText(version->second);
         }
@@ -166,7 +166,8 @@ AssetHandler::AssetPtr AssetHandler::findTheBestAsset(catalog::QueryResult* resu
         logObjectFormat("No bundle version available, initializing with 0.0");
     }
     plist::Value bestVersion(installed.value_or("0.0"));
-    const std::optional<plist::Value> productVersion = optionalText(TXUtility::currentProductVersion());
+    const std::optional<plist::Value> productVersion =
+        optionalText(TXUtility::currentProductVersion());
     const auto productType = optionalText(TXUtility::currentProductType());
     logObjectFormat("Current version: %@\n", &bestVersion);
     logObjectFormat("Current Product version: %@\n", productVersion ? &*productVersion : nullptr);

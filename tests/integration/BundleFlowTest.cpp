@@ -98,8 +98,8 @@ TEST_F(BundleFlowTest, FirstSetLinksTheOverlaidCarrierFileAndRepeatingItChangesN
         "AbC",           "--bundle",  payloadFile.string()};
 
     // First without a payload: said before the bundle manager starts.
-    CommandResult withoutPayload = runCommand(
-        {TAVRIX_CTL_PATH, "--address", busAddress(), "set-id", "AbC"});
+    CommandResult withoutPayload =
+        runCommand({TAVRIX_CTL_PATH, "--address", busAddress(), "set-id", "AbC"});
     ASSERT_EQ(withoutPayload.status, 0) << withoutPayload.output;
     CommandResult first = runCommand(setID);
     ASSERT_EQ(first.status, 0) << first.output;

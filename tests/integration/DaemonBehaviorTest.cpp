@@ -44,6 +44,21 @@ TEST_F(DaemonBehaviorTest, IdsThatCannotBeStoredAreRefusedAndTheStoredOneStays) 
     auto caller = client();
     EXPECT_FALSE(caller.setTavrixID(std::string(1025, 'x'), std::nullopt));
     EXPECT_EQ(device().daemonPreference("TavrixID"), std::optional<plist::Value>("abc"));
+    // A noncharacter, which the bus allows and its library cannot read: the caller is told why.
+    CommandResult noncharacter = runCommand({"/usr/bin/python3", "-c", R"(import dbus, sys
+bus = dbus.bus.BusConnection(sys.argv[1])
+daemon = bus.get_object("com.zandor.tavrixservicesd", "/com/zandor/tavrixservicesd")
+try:
+    daemon.SetTavrixID("a\ufffe", dbus.Array([], signature="ay"),
+                       dbus_interface="com.zandor.TXManagerServerInterface")
+except dbus.DBusException as error:
+    print(error.get_dbus_name(), error.get_dbus_message())
+)",
+                                             busAddress()});
+    EXPECT_EQ(noncharacter.output,
+              "org.freedesktop.DBus.Error.InvalidArgs The behavior ID is not text this service "
+              "can read: invalid UTF-8 or a Unicode noncharacter\n");
+    EXPECT_EQ(device().daemonPreference("TavrixID"), std::optional<plist::Value>("abc"));
 
     const auto lock = at("/var/mobile/Library/Preferences/.com.zandor.tavrixservices.plist.lock");
     std::filesystem::remove(lock);

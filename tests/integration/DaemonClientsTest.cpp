@@ -11,7 +11,8 @@ namespace {
 using DaemonClientsTest = BusFixture;
 
 TEST_F(DaemonClientsTest, ClientsAreCountedInOnFirstCallAndOutWhenTheyLeave) {
-    // Clients have no identifier the platform vouches for: nothing a caller chooses reaches the log.
+    // Clients have no identifier the platform vouches for: nothing a caller chooses reaches the
+    // log.
     const std::string name = "(null)";
     std::optional<client::TavrixClient> first(client());
     EXPECT_TRUE(first->setClientType(0));

@@ -148,14 +148,14 @@ PrivateBus::PrivateBus(const std::optional<ActivatedDaemon>& daemon,
             prefix += quoted(fs::path(word)) + " ";
         }
         const std::string launches = quoted(directory / "launches");
-        writeText(launcher, "#!/bin/sh\n/usr/bin/env TAVRIX_ROOT=" + quoted(daemon->root) +
-                                " TAVRIX_LOG_STDERR=1 TAVRIX_IDLE_EXIT_SEC=" +
-                                std::to_string(daemon->idleExitSeconds) +
-                                " RUNTIME_DIRECTORY=" + quoted(daemon->runtimeDirectory) + " " +
-                                prefix + quoted(daemon->binary) + " >>" + quoted(directory / "bus.log") +
-                                " 2>&1 &\ndaemon=$!\necho \"started $daemon\" >>" + launches +
-                                "\nwait \"$daemon\"\necho \"exited $daemon $?\" >>" + launches +
-                                "\n");
+        writeText(launcher,
+                  "#!/bin/sh\n/usr/bin/env TAVRIX_ROOT=" + quoted(daemon->root) +
+                      " TAVRIX_LOG_STDERR=1 TAVRIX_IDLE_EXIT_SEC=" +
+                      std::to_string(daemon->idleExitSeconds) +
+                      " RUNTIME_DIRECTORY=" + quoted(daemon->runtimeDirectory) + " " + prefix +
+                      quoted(daemon->binary) + " >>" + quoted(directory / "bus.log") +
+                      " 2>&1 &\ndaemon=$!\necho \"started $daemon\" >>" + launches +
+                      "\nwait \"$daemon\"\necho \"exited $daemon $?\" >>" + launches + "\n");
         writeText(directory / "services/com.zandor.tavrixservicesd.service",
                   "[D-BUS Service]\nName=com.zandor.tavrixservicesd\nExec=/bin/sh " +
                       launcher.string() + "\n");

@@ -759,10 +759,10 @@ TEST(SampleAssetCatalogTest, ReadsAsDocumentedWithTheDefaultLimits) {
     EXPECT_FALSE(settings->allowUnsigned);
     const AssetLimits defaults;
     const AssetLimits& limits = settings->limits;
-    EXPECT_EQ(std::tie(limits.maxExpandedBytes, limits.maxArchiveEntries,
-                       limits.freeSpaceReserveBytes),
-              std::tie(defaults.maxExpandedBytes, defaults.maxArchiveEntries,
-                       defaults.freeSpaceReserveBytes));
+    EXPECT_EQ(
+        std::tie(limits.maxExpandedBytes, limits.maxArchiveEntries, limits.freeSpaceReserveBytes),
+        std::tie(defaults.maxExpandedBytes, defaults.maxArchiveEntries,
+                 defaults.freeSpaceReserveBytes));
     EXPECT_EQ(std::tie(limits.connectTimeoutSeconds, limits.lowSpeedBytesPerSecond,
                        limits.lowSpeedSeconds, limits.catalogTimeoutSeconds,
                        limits.archiveTimeoutSeconds),

@@ -169,6 +169,16 @@ TEST_F(OverrideGenerationTest, EveryBehaviorIDGetsItsOwnFileInsideTheOverlayDire
     CarrierBundle record = baseBundle();
     EXPECT_EQ(applyMultimodeOverlay(record, tooLong), kOverrideBundleFailure);
     EXPECT_EQ(record.carrierFilePath, baseFile());
+    // Neither a version that names directories nor an empty bundle name (one file for every ID)
+    // makes a path.
+    record = baseBundle();
+    record.bundleVersion = "1/../../../escape";
+    EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kOverrideBundleFailure);
+    record = baseBundle();
+    record.bundlePath.clear();
+    EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kOverrideBundleFailure);
+    EXPECT_EQ(record.carrierFilePath, baseFile());
+    EXPECT_FALSE(fs::exists(home() + "/Library/escape.plist"));
 
     // A file where the Overlay directory belongs.
     fs::remove_all(home() + "/Library/TavrixBundles/Overlay");

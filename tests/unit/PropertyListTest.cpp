@@ -8,6 +8,7 @@
 #include <functional>
 
 #include "TestSupport.h"
+#include "plist/PropertyListBounds.h"
 #include "plist/PropertyListFormat.h"
 #include "plist/Value.h"
 #include "util/PropertyListFile.h"
@@ -54,6 +55,15 @@ TEST_P(EitherFormat, RoundTripKeepsEveryTypeAndEdgeValue) {
          {std::size_t{0}, std::size_t{1}, bytes.size() / 3, bytes.size() / 2, bytes.size() - 9}) {
         EXPECT_FALSE(parse(std::string_view(bytes).substr(0, cut)).has_value()) << cut;
     }
+    // Nothing is encoded that the reader would refuse: one node too many, one level too deep.
+    std::string whyNot;
+    EXPECT_EQ(serialize(Value(Array(kMaxPropertyListNodes, Value(1))), GetParam(), &whyNot), "");
+    EXPECT_NE(whyNot, "");
+    Value deep(1);
+    for (std::size_t depth = 1; depth <= kMaxPropertyListDepth; ++depth) {
+        deep = Value(Array{std::move(deep)});
+    }
+    EXPECT_EQ(serialize(deep, GetParam()), "");
 }
 
 // (Other programs' XML of every type is read in the external readers' test.)

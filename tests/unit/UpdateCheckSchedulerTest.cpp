@@ -83,7 +83,11 @@ TEST_F(UpdateCheckSchedulerTest, ArmsFifteenDaysAheadUnlessAFutureTimeIsStored) 
     EXPECT_EQ(nextUpdate(), std::optional<double>(ahead));
     EXPECT_EQ(registeredJobs().size(), 1u);
 
+    // Without a date the job is left as it is, never registered for time 0 (at once).
+    const auto registered = registeredJobs();
     setBehaviorPreference(kNextUpdateKey, plist::Value("tomorrow"));
+    scheduler.scheduleJob();
+    EXPECT_EQ(registeredJobs(), registered);
     scheduler.startTimer();
     expectArmedFifteenDaysAhead();
 
