@@ -19,6 +19,7 @@
 #include "device/MobileUser.h"
 #include "device/PreferencesStore.h"
 #include "util/Log.h"
+#include "util/SharedInstance.h"
 #include "util/SystemLog.h"
 
 namespace tavrix {
@@ -90,9 +91,8 @@ BundleManager::BundleManager() {
 
 BundleManager& BundleManager::sharedInstance() {
     initializeBundleLocations();
-    // Never destroyed: the update queue may still use it while the process exits.
-    static BundleManager* manager = new BundleManager();
-    return *manager;
+    return SharedInstance<BundleManager>::current().instance(
+        [] { return std::unique_ptr<BundleManager>(new BundleManager()); });
 }
 
 bool BundleManager::findBundle(CarrierBundle& out) const {

@@ -18,6 +18,7 @@
 #include "io/FileIO.h"
 #include "io/UniqueFd.h"
 #include "util/Log.h"
+#include "util/SharedInstance.h"
 
 namespace tavrix::bus {
 namespace {
@@ -54,8 +55,8 @@ std::int64_t ticksNow() {
 }  // namespace
 
 ServiceManager& ServiceManager::shared() {
-    static ServiceManager* manager = new ServiceManager();  // lives as long as the process
-    return *manager;
+    return SharedInstance<ServiceManager>::current().instance(
+        [] { return std::unique_ptr<ServiceManager>(new ServiceManager()); });
 }
 
 ServiceManager::ServiceManager()

@@ -3,12 +3,13 @@
 #include "bus/ServiceManager.h"
 #include "plist/Value.h"
 #include "util/Log.h"
+#include "util/SharedInstance.h"
 
 namespace tavrix {
 
 TXTransactionManager& TXTransactionManager::sharedInstance() {
-    static TXTransactionManager* manager = new TXTransactionManager();
-    return *manager;
+    return SharedInstance<TXTransactionManager>::current().instance(
+        [] { return std::make_unique<TXTransactionManager>(); });
 }
 
 TXTransactionManager::TXTransactionManager() = default;

@@ -1,36 +1,25 @@
 #include "catalog/AssetCatalogService.h"
 
-#include <atomic>
-
 #include "device/PlatformRoot.h"
 #include "util/Log.h"
+#include "util/SharedInstance.h"
 
 namespace tavrix::catalog {
 
-namespace {
-
-// Set once the service exists, so that shutting down never creates it.
-std::atomic<AssetCatalogService*> created{nullptr};
-
-}  // namespace
-
 AssetCatalogService& AssetCatalogService::shared() {
-    static AssetCatalogService* service = [] {
-        auto* made = new AssetCatalogService();
-        created.store(made);
-        return made;
-    }();
-    return *service;
+    return SharedInstance<AssetCatalogService>::current().instance(
+        [] { return std::unique_ptr<AssetCatalogService>(new AssetCatalogService()); });
 }
 
-bool AssetCatalogService::shutdownIfStarted(std::chrono::milliseconds patience) {
-    AssetCatalogService* service = created.load();
-    if (service == nullptr) {
-        return true;
-    }
+void AssetCatalogService::stop() {
+    stopping_.store(true);
     // Downloads first: they queue the reports that the delivery thread hands out.
-    bool stopped = service->worker_.shutdown(patience);
-    return service->delivery_.shutdown(patience) && stopped;
+    worker_.shutdown(std::nullopt);
+    delivery_.shutdown(std::nullopt);
+}
+
+AssetCatalogService::~AssetCatalogService() {
+    stop();
 }
 
 AssetCatalogService::AssetCatalogService()

@@ -2,6 +2,7 @@
 // file, the worker that downloads, and the thread that delivers progress reports.
 #pragma once
 
+#include <atomic>
 #include <chrono>
 #include <map>
 #include <mutex>
@@ -17,12 +18,16 @@ namespace tavrix::catalog {
 
 class AssetCatalogService {
   public:
-    // Created on first use and never destroyed.
+    // Created on first use.
     static AssetCatalogService& shared();
 
-    // Stops the download and delivery threads, if the service was ever created, letting what is
-    // queued run. False when either was still busy after patience.
-    static bool shutdownIfStarted(std::chrono::milliseconds patience);
+    // Stops the download and delivery threads, letting what is queued run; a download under way
+    // ends at its next piece of data (or its low-speed limit), as a failed one.
+    void stop();
+    bool stopping() const { return stopping_.load(); }
+    ~AssetCatalogService();
+    AssetCatalogService(const AssetCatalogService&) = delete;
+    AssetCatalogService& operator=(const AssetCatalogService&) = delete;
 
     // Downloads and purges, one at a time.
     SerialQueue& workerQueue() { return worker_; }
@@ -42,6 +47,7 @@ class AssetCatalogService {
     plist::CachedPropertyListFile settingsFile_;
     std::mutex mutex_;
     std::map<std::string, std::string, std::less<>> loggedProblems_;
+    std::atomic<bool> stopping_{false};
     SerialQueue worker_;
     SerialQueue delivery_;
 };

@@ -13,6 +13,7 @@
 #include <vector>
 
 #include "catalog/AssetCatalog.h"
+#include "catalog/AssetCatalogService.h"
 #include "catalog/CatalogCrypto.h"
 #include "http/HttpTransfer.h"
 #include "io/Directory.h"
@@ -70,6 +71,12 @@ std::optional<std::string> downloadArchive(const CatalogEntry& entry, int fd,
     const std::uint64_t step = std::max<std::uint64_t>(entry.archiveSize / kDownloadReportSteps, 1);
     std::uint64_t nextReport = step;
     http::HttpBodyReceiver receiver = [&](std::string_view bytes, std::string& refusal) {
+        // The daemon ends after the transactions it waits for: a download still running then
+        // fails, and the next launch checks again.
+        if (AssetCatalogService::shared().stopping()) {
+            refusal = "the daemon is stopping";
+            return false;
+        }
         if (bytes.size() > entry.archiveSize - received) {
             refusal = "the server sent more than the catalog's " +
                       std::to_string(entry.archiveSize) + " bytes";

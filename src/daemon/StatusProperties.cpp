@@ -12,6 +12,7 @@
 #include "update/ActivityRecord.h"
 #include "util/ContainExceptions.h"
 #include "util/Log.h"
+#include "util/SharedInstance.h"
 #include "util/Utf8.h"
 
 namespace tavrix {
@@ -119,8 +120,8 @@ void onActivity(const char* key, const std::string& outcome, const std::string& 
 }  // namespace
 
 StatusPublisher& StatusPublisher::shared() {
-    static StatusPublisher* publisher = new StatusPublisher();
-    return *publisher;
+    return SharedInstance<StatusPublisher>::current().instance(
+        [] { return std::unique_ptr<StatusPublisher>(new StatusPublisher()); });
 }
 
 bool StatusPublisher::attach(sd_event* event, sd_bus* bus, const char* path) {

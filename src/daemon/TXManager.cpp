@@ -12,6 +12,7 @@
 #include "update/ActivityRecord.h"
 #include "update/AssetHandler.h"
 #include "util/Log.h"
+#include "util/SharedInstance.h"
 #include "util/TextCase.h"
 
 namespace tavrix {
@@ -19,13 +20,11 @@ namespace {
 
 constexpr const char* kBehaviorSettingsDomain = "com.zandor.tavrix";
 
-std::atomic<bool> managerCreated{false};
-
 }  // namespace
 
 TXManager& TXManager::sharedInstance() {
-    static TXManager* manager = [] {
-        auto* created = new TXManager();
+    return SharedInstance<TXManager>::current().instance([] {
+        std::unique_ptr<TXManager> created(new TXManager());
         // An install cut short by a crash first, so that the match below sees the bundle it was
         // installing.
         AssetHandler::resumeInterruptedInstall();
@@ -39,13 +38,11 @@ TXManager& TXManager::sharedInstance() {
             bundles.resetBehaviorBundle(*stored->asString());
         }
         return created;
-    }();
-    managerCreated.store(true);
-    return *manager;
+    });
 }
 
 bool TXManager::exists() {
-    return managerCreated.load();
+    return SharedInstance<TXManager>::current().ifMade() != nullptr;
 }
 
 bool TXManager::setTavrixID(const std::string& tavrixID, const std::optional<plist::Data>& bundle,

@@ -21,6 +21,7 @@
 #include "device/TXUtility.h"
 #include "util/ContainExceptions.h"
 #include "util/Log.h"
+#include "util/SharedInstance.h"
 
 namespace tavrix {
 namespace {
@@ -64,8 +65,8 @@ std::string transactionStatus(const std::set<std::string>& open) {
 }  // namespace
 
 TXManagerServer& TXManagerServer::sharedInstance() {
-    static TXManagerServer* server = new TXManagerServer();
-    return *server;
+    return SharedInstance<TXManagerServer>::current().instance(
+        [] { return std::unique_ptr<TXManagerServer>(new TXManagerServer()); });
 }
 
 TXManagerServer::TXManagerServer() : _listener(kTXServiceName, *this) {}
@@ -364,15 +365,6 @@ void TXManagerServer::_finish() {
     // Leaving without ever holding the lock: the kept calls get their "no" now.
     _lockRetryTimer.reset();
     _refuseDeferredCalls(std::chrono::steady_clock::time_point::max());
-}
-
-void TXManagerServer::_stopWorkers() {
-    // Producers before consumers: the job timer and its queue start downloads, downloads queue
-    // progress reports, reports install bundles.
-    const bool scheduler = UpdateCheckScheduler::shutdownIfStarted(kWorkerStopPatience);
-    const bool catalog = catalog::AssetCatalogService::shutdownIfStarted(kWorkerStopPatience);
-    const bool tasks = TXUtility::shutdownTaskQueue(kWorkerStopPatience);
-    _workersStopped = scheduler && catalog && tasks;
 }
 
 void TXManagerServer::_notifyServerStart() {

@@ -52,10 +52,8 @@ class TXManagerServer : private bus::ServiceListener::Delegate {
     static constexpr std::chrono::seconds kLockPatience{20};
     // How often a daemon waiting for the instance lock tries it again.
     static constexpr std::chrono::milliseconds kLockRetryInterval{50};
-    // How long each worker thread may take to finish its queue once the daemon is leaving.
-    static constexpr std::chrono::seconds kWorkerStopPatience{10};
 
-    // The process's server, created on first use and never destroyed.
+    // The process's server, created on first use.
     static TXManagerServer& sharedInstance();
 
     TXManager& manager();
@@ -63,9 +61,9 @@ class TXManagerServer : private bus::ServiceListener::Delegate {
     // The whole life of the daemon; returns the process's exit status when the run loop has
     // finished: 0, or 1 when the daemon could not start serving (logged).
     int runUntilIdleExit();
-    // False when a worker thread was still busy when the daemon left (logged): the process must
-    // then end without running static destructors under it.
-    bool workersStopped() const { return _workersStopped; }
+    // What ends the worker threads (the process's root owns them): run once the loop has
+    // finished, before the bus goes, since workers post notifications and status.
+    void whenLoopEnds(std::function<void()> stopWorkers) { _stopWorkers = std::move(stopWorkers); }
 
     // The service interface. A reply handler is called exactly once before the call returns;
     // the first four accept an empty handler.
@@ -126,7 +124,6 @@ class TXManagerServer : private bus::ServiceListener::Delegate {
     // Releases the name and answers what is queued; _run then waits for open transactions.
     void _finish();
     // Stops and joins every worker thread, in the order they feed each other.
-    void _stopWorkers();
 
     TXManager* _manager = nullptr;
     std::vector<std::shared_ptr<TXManagerServerClient>> _clients;
@@ -147,7 +144,7 @@ class TXManagerServer : private bus::ServiceListener::Delegate {
     bool _holdsInstanceLock = false;
     bool _finishing = false;
     std::chrono::steady_clock::time_point _drainDeadline;
-    bool _workersStopped = true;
+    std::function<void()> _stopWorkers = [] {};
 };
 
 // The exported interface's method table (TXManagerServer_Daemon.cpp).

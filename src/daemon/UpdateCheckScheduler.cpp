@@ -1,40 +1,27 @@
 #include "daemon/UpdateCheckScheduler.h"
 
-#include <atomic>
-
 #include "bus/TXTransactionManager.h"
 #include "daemon/TXManager.h"
 #include "device/BehaviorPreferences.h"
 #include "util/Clock.h"
 #include "util/Log.h"
+#include "util/SharedInstance.h"
 
 namespace tavrix {
 
-namespace {
-
-// Set once the scheduler exists, so that shutting down never creates it.
-std::atomic<UpdateCheckScheduler*> created{nullptr};
-
-}  // namespace
-
 UpdateCheckScheduler& UpdateCheckScheduler::sharedInstance() {
-    // Never destroyed: the download path may call in until its thread has been joined.
-    static UpdateCheckScheduler* scheduler = [] {
-        auto* made = new UpdateCheckScheduler();
-        created.store(made);
-        return made;
-    }();
-    return *scheduler;
+    return SharedInstance<UpdateCheckScheduler>::current().instance(
+        [] { return std::unique_ptr<UpdateCheckScheduler>(new UpdateCheckScheduler()); });
 }
 
-bool UpdateCheckScheduler::shutdownIfStarted(std::chrono::milliseconds patience) {
-    UpdateCheckScheduler* scheduler = created.load();
-    if (scheduler == nullptr) {
-        return true;
-    }
+void UpdateCheckScheduler::stop() {
     // The timer first: it is what queues jobs on the scheduler queue.
-    scheduler->_jobScheduler->stopTimer();
-    return scheduler->_schedulerQueue.shutdown(patience);
+    _jobScheduler->stopTimer();
+    _schedulerQueue.shutdown(std::nullopt);
+}
+
+UpdateCheckScheduler::~UpdateCheckScheduler() {
+    stop();
 }
 
 UpdateCheckScheduler::UpdateCheckScheduler() : _schedulerQueue(kUpdateCheckQueueLabel) {

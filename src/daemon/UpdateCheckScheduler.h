@@ -30,10 +30,12 @@ class UpdateCheckScheduler {
     // The process's scheduler, created once from any thread; creating it arms its timer.
     static UpdateCheckScheduler& sharedInstance();
 
-    // Stops the job timer and the scheduler queue (letting a check already queued run), if the
-    // scheduler was ever created. False when the queue was still busy after patience. The
+    // Stops the job timer and the scheduler queue, letting a check already queued run. The
     // scheduler stays usable for re-arming (a download finishing later), but no job fires.
-    static bool shutdownIfStarted(std::chrono::milliseconds patience);
+    void stop();
+    ~UpdateCheckScheduler();
+    UpdateCheckScheduler(const UpdateCheckScheduler&) = delete;
+    UpdateCheckScheduler& operator=(const UpdateCheckScheduler&) = delete;
 
     // Arms the timer from the stored "NextUpdate" (pushed 15 days ahead when missing or past).
     void startTimer();

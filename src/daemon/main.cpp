@@ -3,10 +3,7 @@
 // could not start serving.
 #include <signal.h>
 
-#include <cstdio>
-#include <cstdlib>
-
-#include "daemon/TXManagerServer.h"
+#include "daemon/Daemon.h"
 #include "device/TXUtility.h"
 #include "util/ContainExceptions.h"
 
@@ -21,14 +18,12 @@ int main() {
     signal(SIGPIPE, SIG_IGN);
 
     tavrix::TXUtility::setIsDaemon(true);
-    auto& server = tavrix::TXManagerServer::sharedInstance();
     int status = 1;
-    const bool ran =
-        tavrix::containExceptions("The daemon", [&] { status = server.runUntilIdleExit(); });
-    if (!ran || !server.workersStopped()) {
-        // A worker thread may still be running: static destructors must not run under it.
-        std::fflush(nullptr);
-        std::_Exit(ran ? status : 1);
-    }
+    // The root ends within the call: every thread joined and every object gone before main
+    // returns.
+    tavrix::containExceptions("The daemon", [&] {
+        tavrix::Daemon daemon;
+        status = daemon.run();
+    });
     return status;
 }

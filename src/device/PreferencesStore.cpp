@@ -19,6 +19,7 @@
 #include "plist/PropertyListFormat.h"
 #include "util/Log.h"
 #include "util/PropertyListFile.h"
+#include "util/SharedInstance.h"
 
 namespace tavrix::device {
 namespace {
@@ -166,9 +167,8 @@ struct PreferencesStore::Domain {
 };
 
 PreferencesStore& PreferencesStore::shared() {
-    // Never destroyed: other threads may still read preferences while the process exits.
-    static PreferencesStore* store = new PreferencesStore();
-    return *store;
+    return SharedInstance<PreferencesStore>::current().instance(
+        [] { return std::make_unique<PreferencesStore>(); });
 }
 
 PreferencesStore::PreferencesStore() = default;

@@ -19,6 +19,7 @@
 
 #include "device/DeviceInfoService.h"
 #include "util/Log.h"
+#include "util/SharedInstance.h"
 
 namespace tavrix {
 namespace {
@@ -72,26 +73,9 @@ std::optional<std::string> homeDirectory() {
 
 }  // namespace
 
-namespace {
-
-// Set once the task queue exists, so that shutting down never creates it.
-std::atomic<SerialQueue*> createdTaskQueue{nullptr};
-
-}  // namespace
-
-SerialQueue& TXUtility::taskQueue() {
-    // Never destroyed: the daemon stops its worker (shutdownTaskQueue) before leaving instead.
-    static SerialQueue* queue = [] {
-        auto* made = new SerialQueue("com.zandor.tavrixservices.operationTaskQueue");
-        createdTaskQueue.store(made);
-        return made;
-    }();
-    return *queue;
-}
-
-bool TXUtility::shutdownTaskQueue(std::chrono::milliseconds patience) {
-    SerialQueue* queue = createdTaskQueue.load();
-    return queue == nullptr || queue->shutdown(patience);
+TXUtility::TaskQueue& TXUtility::taskQueue() {
+    return SharedInstance<TaskQueue>::current().instance(
+        [] { return std::make_unique<TaskQueue>(); });
 }
 
 void TXUtility::setIsDaemon(bool isDaemon) {

@@ -18,10 +18,11 @@ class TXUtility {
     TXUtility() = delete;
 
     // The serial queue for the daemon's operations, created on first use.
-    static SerialQueue& taskQueue();
-    // Lets the task queue finish what is queued and joins its worker, if it was ever created.
-    // False when it was still busy after patience.
-    static bool shutdownTaskQueue(std::chrono::milliseconds patience);
+    class TaskQueue : public SerialQueue {
+      public:
+        TaskQueue() : SerialQueue("com.zandor.tavrixservices.operationTaskQueue") {}
+    };
+    static TaskQueue& taskQueue();
 
     // Whether this process is the daemon; false until set. Set once at start-up, before any
     // other thread asks.
