@@ -7,6 +7,7 @@
 
 #include <cerrno>
 #include <cstring>
+#include <optional>
 
 #include "bus/BusValueCodec.h"
 #include "bus/HandedPayload.h"
@@ -208,30 +209,27 @@ int handleSetClientType(sd_bus_message* message, void* userdata, sd_bus_error* e
     return replyBoolean(message, answer);
 }
 
-int handleGetStatus(sd_bus_message* message, void* userdata, sd_bus_error*) {
+int handleGetStatus(sd_bus_message* message, void* userdata, sd_bus_error* error) {
     auto& server = *static_cast<TXManagerServer*>(userdata);
-    plist::Dictionary status = answerOf(
-        "Get Status", server, message, plist::Dictionary(), [&](plist::Dictionary& result) {
-            server.getStatus([&](plist::Dictionary answer) { result = std::move(answer); });
-        });
+    std::optional<plist::Dictionary> status;
+    containExceptions("Get Status", [&] {
+        MessageScope scope(server, message);
+        server.getStatus([&](plist::Dictionary answer) { status = std::move(answer); });
+    });
+    if (!status) {
+        return sd_bus_error_set(error, SD_BUS_ERROR_FAILED, "The status could not be read");
+    }
     sd_bus_message* raw = nullptr;
     int r = sd_bus_message_new_method_return(message, &raw);
     bus::BusMessagePtr replyMessage(raw);
     if (r >= 0) {
-        r = bus::appendDictionary(replyMessage.get(), status);
+        r = bus::appendDictionary(replyMessage.get(), *status);
     }
     if (r < 0) {
-        // A value the bus cannot carry (text that is not UTF-8 in a path): the empty view rather
-        // than no answer.
+        // A value the bus cannot carry (text that is not UTF-8 in a path).
         logCFormat("The status cannot be sent over the bus: %s\n", std::strerror(-r));
-        r = sd_bus_message_new_method_return(message, &raw);
-        replyMessage.reset(raw);
-        if (r >= 0) {
-            r = bus::appendDictionary(replyMessage.get(), {});
-        }
-        if (r < 0) {
-            return r;
-        }
+        return sd_bus_error_setf(error, SD_BUS_ERROR_FAILED,
+                                 "The status cannot be sent over the bus: %s", std::strerror(-r));
     }
     return sd_bus_send(nullptr, replyMessage.get(), nullptr);
 }
