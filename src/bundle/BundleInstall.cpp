@@ -2,7 +2,6 @@
 // renamed into its place.
 #include "bundle/BundleLocations.h"
 #include "bundle/BundleManager.h"
-#include "bundle/UserBundleReplacement.h"
 #include "device/PlatformRoot.h"
 #include "payload/PayloadUnpack.h"
 #include "util/Log.h"

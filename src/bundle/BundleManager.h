@@ -1,6 +1,6 @@
 // The bundle manager: knows which behavior bundle the device uses, installs received bundle
-// payloads and redoes the bundle match for a behavior ID. Callers that change the bundles hold
-// operationLock() so that they never overlap.
+// payloads and downloaded bundles, and redoes the bundle match for a behavior ID. Each of these
+// takes its lock, so that changes from the main thread and the download thread never overlap.
 #pragma once
 
 #include <mutex>
@@ -9,6 +9,7 @@
 
 #include "bundle/BundleTypes.h"
 #include "bundle/CarrierBundle.h"
+#include "bundle/UserBundleReplacement.h"
 #include "plist/Value.h"
 
 namespace tavrix {
@@ -26,6 +27,10 @@ class BundleManager {
     // cpio archive). Failures are logged; the old user bundle is gone even then. True when the
     // archive was extracted whole and put in place; otherwise whyNot, when given, says why.
     bool installBehaviorBundleData(const plist::Data& data, std::string* whyNot = nullptr);
+    // The one way the user bundle is replaced (a client's payload, a downloaded update): with what
+    // fill makes, under the lock. True when it was filled whole and put in place; otherwise false
+    // with the reason in whyNot (the old bundle stays unless the new one was placed).
+    bool replaceUserBundle(const UserBundleFill& fill, std::string* whyNot);
 
     // Keeps behaviorID and runs the reset flow for it.
     BundleChangeType resetBehaviorBundle(const std::optional<std::string>& behaviorID);
@@ -42,12 +47,7 @@ class BundleManager {
     BundleChangeType compareBundles(const CarrierBundle& current,
                                     const CarrierBundle& matched) const;
 
-    // Held by each caller across a change of the bundles (a client's payload and bundle match, an
-    // over-the-air install and its match), which may come from the main thread and the update
-    // download's thread at once.
-    std::recursive_mutex& operationLock() const { return operationLock_; }
-
-    // The bundle and carrier file linked now: a copy taken under operationLock().
+    // The bundle and carrier file linked now: a copy taken under the lock.
     CarrierBundle currentBundle() const;
     const std::string& bundleLinkPath() const { return bundleLinkPath_; }
     const std::string& preferencesLinkPath() const { return preferencesLinkPath_; }
@@ -62,7 +62,8 @@ class BundleManager {
     // The links found at start-up do not describe one state: the next reset links again whatever
     // the comparison says.
     bool linksDisagree_ = false;
-    // Also guards currentBundle_, which other threads read.
+    // Taken by every change of the bundles and every read of currentBundle_: the main thread and
+    // the download thread both come here. Recursive: a reset runs inside an install's call.
     mutable std::recursive_mutex operationLock_;
 };
 

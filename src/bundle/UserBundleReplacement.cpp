@@ -4,6 +4,7 @@
 #include <cstring>
 
 #include "bundle/BundleLocations.h"
+#include "bundle/BundleManager.h"
 #include "device/HomeDirectories.h"
 #include "io/Paths.h"
 #include "payload/PayloadUnpack.h"
@@ -12,7 +13,8 @@
 
 namespace tavrix {
 
-bool replaceUserBundle(const UserBundleFill& fill, std::string* whyNot) {
+bool BundleManager::replaceUserBundle(const UserBundleFill& fill, std::string* whyNot) {
+    std::lock_guard lock(operationLock_);
     const std::string& bundle = userBundleLocation();
     if (bundle.empty()) {
         // Removing or extracting relative to an unknown home could touch anything.

@@ -1,6 +1,6 @@
-// The one way the user bundle is replaced, for a client's payload and for a downloaded update:
-// the new bundle is assembled beside the old one, in the daemon's own protected directory, and
-// renamed into its place, so that a crash leaves the old bundle or the new one.
+// How the user bundle's replacement (BundleManager::replaceUserBundle) is filled: the new bundle
+// is assembled beside the old one, in the daemon's own protected directory, and renamed into its
+// place, so that a crash leaves the old bundle or the new one.
 #pragma once
 
 #include <functional>
@@ -16,9 +16,5 @@ enum class BundleFill { Whole, Incomplete, Refused };
 // Fills the empty directory at staging with the new bundle's files; anything but Whole comes with
 // the reason in whyNot.
 using UserBundleFill = std::function<BundleFill(const std::string& staging, std::string* whyNot)>;
-
-// Replaces the user bundle with what fill makes. True when it was filled whole and put in place;
-// otherwise false with the reason in whyNot (the old bundle stays unless the new one was placed).
-bool replaceUserBundle(const UserBundleFill& fill, std::string* whyNot);
 
 }  // namespace tavrix

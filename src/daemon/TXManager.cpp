@@ -1,8 +1,5 @@
 #include "daemon/TXManager.h"
 
-#include <atomic>
-#include <mutex>
-
 #include "bundle/BundleManager.h"
 #include "daemon/UpdateCheckScheduler.h"
 #include "device/BehaviorPreferences.h"
@@ -33,9 +30,7 @@ TXManager& TXManager::sharedInstance() {
         if (stored && stored->isString()) {
             logCFormat("Behavior ID %s is already sent, redoing bundle match\n",
                        stored->asString()->c_str());
-            BundleManager& bundles = BundleManager::sharedInstance();
-            std::lock_guard lock(bundles.operationLock());
-            bundles.resetBehaviorBundle(*stored->asString());
+            BundleManager::sharedInstance().resetBehaviorBundle(*stored->asString());
         }
         return created;
     });
@@ -70,22 +65,21 @@ bool TXManager::setTavrixID(const std::string& tavrixID, const std::optional<pli
         // Before the bundle manager is first taken: its start-up lines follow this one.
         logObjectFormat("No bundle data given");
     }
+    // An update installed between the two steps is matched by one of the two resets: each
+    // matches what is on disk then, for the ID stored above.
     BundleManager& bundles = BundleManager::sharedInstance();
-    {
-        std::lock_guard lock(bundles.operationLock());
-        if (bundle) {
-            std::string whyNot;
-            const bool extracted = bundles.installBehaviorBundleData(*bundle, &whyNot);
-            std::string reason = extracted ? "extracted " + std::to_string(bundle->size()) +
-                                                 " bytes into the user bundle"
-                                           : whyNot;
-            recordPayload(extracted, reason);
-            if (payload != nullptr) {
-                *payload = {extracted, std::move(reason)};
-            }
+    if (bundle) {
+        std::string whyNot;
+        const bool extracted = bundles.installBehaviorBundleData(*bundle, &whyNot);
+        std::string reason = extracted ? "extracted " + std::to_string(bundle->size()) +
+                                             " bytes into the user bundle"
+                                       : whyNot;
+        recordPayload(extracted, reason);
+        if (payload != nullptr) {
+            *payload = {extracted, std::move(reason)};
         }
-        bundles.resetBehaviorBundle(lowered);
     }
+    bundles.resetBehaviorBundle(lowered);
     UpdateCheckScheduler::sharedInstance().startTimer();
     return true;
 }

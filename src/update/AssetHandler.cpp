@@ -5,13 +5,11 @@
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
-#include <mutex>
 #include <optional>
 #include <string>
 
 #include "bundle/BundleLocations.h"
 #include "bundle/BundleManager.h"
-#include "bundle/UserBundleReplacement.h"
 #include "bundle/VersionCompare.h"
 #include "device/BehaviorPreferences.h"
 #include "device/MobileUser.h"
@@ -303,8 +301,6 @@ bool AssetHandler::installDownloadedBundle(const std::string& source) {
         logCFormat("The mobile user's home directory is unknown, not installing the bundle\n");
         return false;
     }
-    BundleManager& bundles = BundleManager::sharedInstance();
-    std::lock_guard lock(bundles.operationLock());
     // The new bundle is copied while the old one still stands, so both must fit.
     const std::uint64_t needed = diskBytesOfTree(source);
     const char* home = device::MobileUser::homeDirectory();
@@ -325,7 +321,7 @@ bool AssetHandler::installDownloadedBundle(const std::string& source) {
     } else {
         logCFormat("Behavior ID %s is already sent, redoing bundle match\n",
                    behaviorID->asString()->c_str());
-        bundles.resetBehaviorBundle(*behaviorID->asString());
+        BundleManager::sharedInstance().resetBehaviorBundle(*behaviorID->asString());
     }
     // From here on a crash leaves only the purge to do: a purge cut short leaves part of the
     // download, which must never be installed.
@@ -338,7 +334,7 @@ bool AssetHandler::copyDownloadedBundle(const std::string& source, const std::st
     // disk that fills) leaves the old bundle as it was, and every file in the copy appears whole
     // or not at all.
     std::string whyNot;
-    const bool copied = replaceUserBundle(
+    const bool copied = BundleManager::sharedInstance().replaceUserBundle(
         [&](const std::string& staging, std::string* failure) {
             FileSystemHelper files;
             logCFormat("Copying the directory %s to %s\n", source.c_str(), destination.c_str());
