@@ -39,7 +39,8 @@ std::string_view overlayPrefixOf(std::string_view fileName) {
 
 BundleChangeType changeTypeForOverlayTransition(OverlayType current, OverlayType matched) {
     if (current > kDeviceBehaviorOverlay || matched > kDeviceBehaviorOverlay) {
-        logCFormat("The overlay types provided are invalid: current %d, new one %d\n",
+        logCFormat(LogPriority::Warning,
+                   "The overlay types provided are invalid: current %d, new one %d\n",
                    static_cast<int>(current), static_cast<int>(matched));
         return kBundleChangeTypeUnknown;
     }
@@ -66,7 +67,7 @@ std::string behaviorIDFromCarrierFileName(const std::string& fileName) {
         splitAtDelimiter(std::string_view(fileName).substr(prefix.size()));
     // "", bundle name, overlay key, [extra identifier,] version + ".plist"
     if (tokens.size() != 4 && tokens.size() != 5) {
-        logCFormat("Not enough tokens to extract behavior ID\n");
+        logCFormat(LogPriority::Warning, "Not enough tokens to extract behavior ID\n");
         return {};
     }
     return std::string(tokens[2]);
@@ -95,7 +96,8 @@ std::string versionFromCarrierFileName(const std::string& fileName) {
         return {};
     }
     if (delimiter + 1 == pieces.size()) {
-        logCFormat("_ is the last character in the string, cannot get the version\n");
+        logCFormat(LogPriority::Warning,
+                   "_ is the last character in the string, cannot get the version\n");
         return {};
     }
     return std::string(pieces.substr(delimiter + 1));
@@ -145,6 +147,7 @@ bool isCandidateBundleNewer(const CarrierBundle& current, const CarrierBundle& m
         }
     } else {
         logCFormat(
+            LogPriority::Warning,
             "Both the versions are not non-empty, cannot compare, existing %s, candidate %s\n",
             current.bundleVersion.c_str(), matched.bundleVersion.c_str());
     }

@@ -45,7 +45,8 @@ bool linkPathTo(const std::string& linkPath, const std::string& target) {
         linked = directory && directory->replaceSymlink(baseNameOfPath(linkPath), target) == 0;
     }
     if (!linked) {
-        logCFormat("Failed to establish link from %s to %s\n", linkPath.c_str(), target.c_str());
+        logCFormat(LogPriority::Warning, "Failed to establish link from %s to %s\n",
+                   linkPath.c_str(), target.c_str());
         return false;
     }
     return true;
@@ -58,7 +59,8 @@ bool linkBundle(CarrierBundle& bundle) {
         return false;
     }
     if (readLinkTarget(bundle.bundleLinkPath) != bundle.bundlePath) {
-        logCFormat("Problem linking the bundle, %s does not link to %s, instead it links to %s\n",
+        logCFormat(LogPriority::Warning,
+                   "Problem linking the bundle, %s does not link to %s, instead it links to %s\n",
                    bundle.bundleLinkPath.c_str(), bundle.bundlePath.c_str(),
                    readLinkTarget(bundle.bundleLinkPath).c_str());
         return false;

@@ -101,14 +101,14 @@ bool BundleManager::findBundle(CarrierBundle& out) const {
 
     std::optional<plist::Value> systemVersion;
     if (systemLocation.empty()) {
-        logCFormat("Failed to create QZ URL for system bundle directory\n");
+        logCFormat(LogPriority::Warning, "Failed to create QZ URL for system bundle directory\n");
     } else {
         systemVersion = copyBundleVersionAtURL(systemLocation);
     }
 
     const std::string* chosen = nullptr;
     if (userLocation.empty()) {
-        logCFormat("Failed to create QZ URL for user bundle directory\n");
+        logCFormat(LogPriority::Warning, "Failed to create QZ URL for user bundle directory\n");
         if (systemVersion) {
             chosen = &systemLocation;
         }
@@ -138,7 +138,7 @@ bool BundleManager::findBundle(CarrierBundle& out) const {
     }
 
     if (chosen == nullptr) {
-        logCFormat("Could not find either of the bundle locations\n");
+        logCFormat(LogPriority::Warning, "Could not find either of the bundle locations\n");
         return false;
     }
     std::optional<std::string> path = fileSystemPathOf(*chosen);
@@ -211,7 +211,7 @@ BundleChangeType BundleManager::runBundleReset() {
         if (!establishBundleLinks(currentBundle_, bundleLinkPath_, preferencesLinkPath_)) {
             // The links on disk may now be half replaced: whatever the record says, link again.
             linksDisagree_ = true;
-            logCFormat("Could not link bundle file!\n");
+            logCFormat(LogPriority::Warning, "Could not link bundle file!\n");
             return kBundleChangeTypeNoChange;
         }
         device::PreferencesStore::shared().synchronize(kBehaviorPreferencesDomain,
@@ -227,7 +227,7 @@ void findBaseBundle(OverlayContext& context, OverlayType overlayType) {
     context = OverlayContext{};
     context.overlayType = overlayType;
     if (!BundleManager::sharedInstance().findBundle(context.bundle)) {
-        logCFormat("Failed to find a bundle\n");
+        logCFormat(LogPriority::Warning, "Failed to find a bundle\n");
         return;
     }
     logCFormat("Found the base bundle successfully with name %s\n",

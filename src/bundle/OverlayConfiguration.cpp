@@ -22,7 +22,8 @@ std::string behaviorIDText(const plist::Value& id) {
 
 void addGroup(BehaviorOverrideMap& map, const plist::Value& group) {
     if (!group.isDictionary()) {
-        logCFormat("Failed to get the config dictionary in Allowed Multimode SIMs section\n");
+        logCFormat(LogPriority::Warning,
+                   "Failed to get the config dictionary in Allowed Multimode SIMs section\n");
         return;
     }
     const plist::Value* ids = group.find(kSupportedBehaviorIDsKey);

@@ -117,7 +117,7 @@ bool writeOverriddenCarrierFile(const plist::Value& dictionary,
                                 const std::optional<std::string>& path) {
     std::string xml = plist::serialize(dictionary, plist::Format::Xml);
     if (xml.empty()) {
-        logCFormat("Failed to serialize the overridden dictionary\n");
+        logCFormat(LogPriority::Warning, "Failed to serialize the overridden dictionary\n");
         return false;
     }
     std::optional<io::Directory> directory;
@@ -125,14 +125,15 @@ bool writeOverriddenCarrierFile(const plist::Value& dictionary,
         directory = device::openMobileHomeDirectory(dirNameOfPath(*path), true);
     }
     if (!path || !fileURLFromPath(*path)) {
-        logCFormat("Failed to create the file URL\n");
+        logCFormat(LogPriority::Warning, "Failed to create the file URL\n");
         return false;
     }
     const int error = directory ? directory->writeFile(baseNameOfPath(*path), kOverriddenFileMode,
                                                        /*replace=*/false, xml)
                                 : EACCES;
     if (error != 0) {
-        logCFormat("Failed to write the overridden carrier bundle with error code: %d\n", error);
+        logCFormat(LogPriority::Warning,
+                   "Failed to write the overridden carrier bundle with error code: %d\n", error);
         return false;
     }
     logCFormat("The overridden file was successfully written to %s\n", path->c_str());

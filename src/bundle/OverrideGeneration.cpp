@@ -86,13 +86,15 @@ OverrideResult determineOverlay(OverlayContext& context, OverlaySource& source) 
     context.carrierDictionary = copyDictionaryFromFile(context.bundle.carrierFilePath);
     if (!context.carrierDictionary) {
         logCFormat(
+            LogPriority::Warning,
             "Failed to load the base bundle carrier file itself, carrier info not present\n");
         return kCarrierInfoNotPresent;
     }
 
     context.overlayKey = source.overlayKey(context);
     if (context.overlayKey.empty()) {
-        logCFormat("Failed to get overlay matching key, marking override not required\n");
+        logCFormat(LogPriority::Warning,
+                   "Failed to get overlay matching key, marking override not required\n");
         return kOverrideNotRequired;
     }
     logCFormat("Overlay key: '%s'\n", context.overlayKey.c_str());
@@ -113,7 +115,7 @@ OverrideResult determineOverlay(OverlayContext& context, OverlaySource& source) 
     plist::Dictionary merged =
         source.finishMerge(mergeDictionaries(*context.carrierDictionary->asDictionary(), *overlay));
     if (!writeOverriddenCarrierFile(plist::Value(std::move(merged)), path)) {
-        logCFormat("Failed to generate overridden carrier plist\n");
+        logCFormat(LogPriority::Warning, "Failed to generate overridden carrier plist\n");
         return kOverrideBundleFailure;
     }
     // The record is read afresh from disk before it takes the new carrier file. The path is

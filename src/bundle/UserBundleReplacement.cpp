@@ -43,7 +43,8 @@ bool BundleManager::replaceUserBundle(const UserBundleFill& fill, std::string* w
     // so that a power cut after the rename cannot leave empty files under the bundle's name.
     if (int error = bundles->flushTree(io::lastPathComponent(staging));
         error != 0 && error != ENOENT) {
-        logCFormat("Could not flush the new bundle in %s (error %d), keeping the old one\n",
+        logCFormat(LogPriority::Warning,
+                   "Could not flush the new bundle in %s (error %d), keeping the old one\n",
                    staging.c_str(), error);
         removeItemTree(staging);
         *whyNot = std::string("the new bundle could not be flushed: ") + std::strerror(error);
@@ -51,8 +52,8 @@ bool BundleManager::replaceUserBundle(const UserBundleFill& fill, std::string* w
     }
     // A bundle that cannot be removed whole (and would mix with the new one) stays as it is.
     if (int removed = removeItemTree(bundle); removed != 0 && removed != ENOENT) {
-        logCFormat("Could not remove the bundle %s (error %d), keeping it\n", bundle.c_str(),
-                   removed);
+        logCFormat(LogPriority::Warning, "Could not remove the bundle %s (error %d), keeping it\n",
+                   bundle.c_str(), removed);
         removeItemTree(staging);
         *whyNot = std::string("the old bundle could not be removed: ") + std::strerror(removed);
         return false;
@@ -60,8 +61,8 @@ bool BundleManager::replaceUserBundle(const UserBundleFill& fill, std::string* w
     if (int error =
             bundles->renameEntry(io::lastPathComponent(staging), io::lastPathComponent(bundle));
         error != 0) {
-        logCFormat("Could not move the extracted bundle into %s (error %d)\n", bundle.c_str(),
-                   error);
+        logCFormat(LogPriority::Warning, "Could not move the extracted bundle into %s (error %d)\n",
+                   bundle.c_str(), error);
         removeItemTree(staging);
         *whyNot = std::string("the extracted bundle could not be moved into place: ") +
                   std::strerror(error);

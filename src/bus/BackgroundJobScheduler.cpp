@@ -87,10 +87,10 @@ BackgroundJobScheduler::BackgroundJobScheduler(std::string clientName, SerialQue
     if (isValidClientName(clientName_)) {
         filePath_ = jobsFilePath(clientName_);
     } else {
-        logCFormat(
-            "Background jobs: the client name \"%s\" cannot name a file; its jobs are not "
-            "kept across launches",
-            clientName_.c_str());
+        logCFormat(LogPriority::Warning,
+                   "Background jobs: the client name \"%s\" cannot name a file; its jobs are not "
+                   "kept across launches",
+                   clientName_.c_str());
     }
     {
         std::lock_guard lock(mutex_);
@@ -124,7 +124,8 @@ void BackgroundJobScheduler::stopTimer() {
 bool BackgroundJobScheduler::addJob(const std::string& name, const plist::Dictionary& criteria) {
     auto window = windowOf(criteria);
     if (!window) {
-        logCFormat("Background jobs: refusing job \"%s\" of %s: its window is missing or invalid",
+        logCFormat(LogPriority::Warning,
+                   "Background jobs: refusing job \"%s\" of %s: its window is missing or invalid",
                    name.c_str(), clientName_.c_str());
         return false;
     }
@@ -168,7 +169,8 @@ void BackgroundJobScheduler::load() {
     io::UniqueFd file = io::openOwnFile(filePath_, &error);
     if (!file) {
         if (error != ENOENT) {
-            logCFormat("Background jobs: cannot use %s: %s; starting with no jobs",
+            logCFormat(LogPriority::Warning,
+                       "Background jobs: cannot use %s: %s; starting with no jobs",
                        filePath_.c_str(), errorText(error).c_str());
         }
         return;
@@ -180,7 +182,8 @@ void BackgroundJobScheduler::load() {
         return;
     }
     if (!contents->isDictionary()) {
-        logCFormat("Background jobs: %s is damaged or not a list of jobs; starting with no jobs",
+        logCFormat(LogPriority::Warning,
+                   "Background jobs: %s is damaged or not a list of jobs; starting with no jobs",
                    filePath_.c_str());
         return;
     }
@@ -188,10 +191,10 @@ void BackgroundJobScheduler::load() {
         const plist::Dictionary* criteria = value.asDictionary();
         auto window = criteria != nullptr ? windowOf(*criteria) : std::nullopt;
         if (!window) {
-            logCFormat(
-                "Background jobs: ignoring job \"%s\" in %s: its window is missing or "
-                "invalid",
-                name.c_str(), filePath_.c_str());
+            logCFormat(LogPriority::Warning,
+                       "Background jobs: ignoring job \"%s\" in %s: its window is missing or "
+                       "invalid",
+                       name.c_str(), filePath_.c_str());
             continue;
         }
         jobs_.insert_or_assign(name, Job{*criteria, window->start, window->end});
@@ -240,8 +243,8 @@ void BackgroundJobScheduler::saveLocked() {
     std::error_code error;
     std::filesystem::create_directories(std::filesystem::path(filePath_).parent_path(), error);
     if (error) {
-        logCFormat("Background jobs: cannot create the directory of %s: %s", filePath_.c_str(),
-                   error.message().c_str());
+        logCFormat(LogPriority::Warning, "Background jobs: cannot create the directory of %s: %s",
+                   filePath_.c_str(), error.message().c_str());
         return;
     }
     plist::Dictionary contents;
@@ -257,7 +260,7 @@ void BackgroundJobScheduler::saveLocked() {
         return;
     }
     if (int failure = io::replaceFileAtomically(filePath_, bytes, kJobsFileMode); failure != 0) {
-        logCFormat("Background jobs: cannot save %s: %s", filePath_.c_str(),
+        logCFormat(LogPriority::Warning, "Background jobs: cannot save %s: %s", filePath_.c_str(),
                    errorText(failure).c_str());
     }
 }

@@ -16,7 +16,8 @@ bool ServiceListener::resume(sd_event* event, const char* path,
                              std::initializer_list<ExportedInterface> interfaces, void* userdata) {
     bus_ = openDaemonBus();
     if (!bus_) {
-        logCFormat("Cannot connect to the bus for %s\n", serviceName_.c_str());
+        logCFormat(LogPriority::Warning, "Cannot connect to the bus for %s\n",
+                   serviceName_.c_str());
         return false;
     }
     int r = sd_bus_attach_event(bus_.get(), event, SD_EVENT_PRIORITY_NORMAL);
@@ -49,7 +50,8 @@ bool ServiceListener::resume(sd_event* event, const char* path,
         }
     }
     if (r < 0) {
-        logCFormat("Cannot serve %s on the bus: %s\n", serviceName_.c_str(), std::strerror(-r));
+        logCFormat(LogPriority::Warning, "Cannot serve %s on the bus: %s\n", serviceName_.c_str(),
+                   std::strerror(-r));
         return false;
     }
     return true;
@@ -89,8 +91,8 @@ BusSlotPtr ServiceListener::watchConnection(const std::string& uniqueName) {
     int r = sd_bus_add_match(bus_.get(), &raw, match.c_str(), onNameOwnerChanged, this);
     BusSlotPtr slot(raw);
     if (r < 0) {
-        logCFormat("Cannot watch the client %s on the bus: %s\n", uniqueName.c_str(),
-                   std::strerror(-r));
+        logCFormat(LogPriority::Warning, "Cannot watch the client %s on the bus: %s\n",
+                   uniqueName.c_str(), std::strerror(-r));
     }
     // A peer that left before the match was in place sends no signal any more.
     if (r < 0 || !hasOwner(uniqueName)) {

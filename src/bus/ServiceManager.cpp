@@ -163,7 +163,7 @@ ServiceManager::InstanceLock ServiceManager::tryLockInstance() {
         io::UniqueFd fd(
             ::open(path.c_str(), O_RDWR | O_CREAT | O_NOFOLLOW | O_CLOEXEC | O_NOCTTY, 0600));
         if (!fd) {
-            logCFormat("Cannot open the instance lock %s: %s\n", path.c_str(),
+            logCFormat(LogPriority::Warning, "Cannot open the instance lock %s: %s\n", path.c_str(),
                        std::strerror(errno));
             return InstanceLock::Unusable;
         }
@@ -183,7 +183,8 @@ ServiceManager::InstanceLock ServiceManager::tryLockInstance() {
     }
     // Retried while waiting: said once.
     if (!instanceLockFailureLogged_) {
-        logCFormat("Cannot lock %s: %s\n", path.c_str(), std::strerror(errno));
+        logCFormat(LogPriority::Warning, "Cannot lock %s: %s\n", path.c_str(),
+                   std::strerror(errno));
         instanceLockFailureLogged_ = true;
     }
     return InstanceLock::Unusable;

@@ -91,7 +91,8 @@ void TXTransactionManager::_setKeepAlive(bool enable) {
         return;
     }
     if (!bus::ServiceManager::shared().writeKeepAlive(enable ? 1 : 0)) {
-        logObjectFormat("pelgarind could not toggle keep alive status to stelmard.");
+        logObjectFormat(LogPriority::Warning,
+                        "pelgarind could not toggle keep alive status to stelmard.");
         return;
     }
     plist::Value status(enable ? "Enabled" : "Disabled");
@@ -101,7 +102,8 @@ void TXTransactionManager::_setKeepAlive(bool enable) {
 bool TXTransactionManager::_isKeepAliveEnabled(bool* /*error: accepted, never written*/) {
     std::int64_t value = 1;
     if (!bus::ServiceManager::shared().readKeepAlive(value)) {
-        logObjectFormat("pelgarind could not read keep alive status from stelmard.");
+        logObjectFormat(LogPriority::Warning,
+                        "pelgarind could not read keep alive status from stelmard.");
         return true;
     }
     return value != 0;

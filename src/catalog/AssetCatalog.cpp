@@ -66,8 +66,8 @@ void Asset::runDownload() {
         [this](plist::Dictionary progress) { report(std::move(progress)); });
     plist::Dictionary last;
     if (failure) {
-        logCFormat("Asset catalog: download of %s failed: %s", entry_.archiveURL.c_str(),
-                   failure->c_str());
+        logCFormat(LogPriority::Warning, "Asset catalog: download of %s failed: %s",
+                   entry_.archiveURL.c_str(), failure->c_str());
         last = {{kAssetProgressOperationKey, plist::Value(kAssetOperationFailed)},
                 {kAssetProgressErrorKey, plist::Value(*failure)}};
     } else {
@@ -165,8 +165,8 @@ void Asset::purge(PurgeCompletion completion) {
                 int error = removeItemTree(directory);
                 if (error != 0 && error != ENOENT) {
                     purged = false;
-                    logCFormat("Asset catalog: cannot purge %s: %s", directory.c_str(),
-                               std::strerror(error));
+                    logCFormat(LogPriority::Warning, "Asset catalog: cannot purge %s: %s",
+                               directory.c_str(), std::strerror(error));
                 }
             }
             if (completion) {
@@ -189,8 +189,8 @@ std::optional<std::vector<std::shared_ptr<Asset>>> AssetQuery::runQuery() const 
     std::optional<std::vector<CatalogEntry>> entries =
         loadCatalogEntries(*settings, localOnly_, refusal);
     if (!entries) {
-        logCFormat("Asset catalog: refusing the catalog %s: %s", settings->catalogURL.c_str(),
-                   refusal.what().c_str());
+        logCFormat(LogPriority::Warning, "Asset catalog: refusing the catalog %s: %s",
+                   settings->catalogURL.c_str(), refusal.what().c_str());
         const bool fetchFailed = refusal.kind() == CatalogRefusalKind::FetchFailed;
         lastResult_ = {
             fetchFailed ? QueryOutcome::FetchFailed : QueryOutcome::Refused, refusal.what(), {}};

@@ -89,7 +89,8 @@ void keepLocalCopy(const AssetTypeSettings& settings, const SignedCatalog& catal
         removeItemTree(signaturePath);  // a stale signature would only mislead
     }
     if (error != 0) {
-        logCFormat("Asset catalog: cannot keep a local copy of the catalog in %s: %s",
+        logCFormat(LogPriority::Warning,
+                   "Asset catalog: cannot keep a local copy of the catalog in %s: %s",
                    settings.cacheDirectory.c_str(), std::strerror(error));
     }
 }
@@ -102,7 +103,7 @@ void recordSerial(const AssetTypeSettings& settings, std::int64_t serial,
         return;
     }
     if (int error = recordAcceptedSerial(settings.assetType, serial); error != 0) {
-        logCFormat("Asset catalog: cannot record serial %lld of %s: %s",
+        logCFormat(LogPriority::Warning, "Asset catalog: cannot record serial %lld of %s: %s",
                    static_cast<long long>(serial), settings.assetType.c_str(),
                    std::strerror(error));
     }

@@ -136,7 +136,7 @@ bool StatusPublisher::attach(sd_event* event, sd_bus* bus, const char* path) {
         r = sd_event_source_set_priority(raw, SD_EVENT_PRIORITY_NORMAL - 1);
     }
     if (r < 0) {
-        logCFormat("Cannot announce status changes: %s\n", std::strerror(-r));
+        logCFormat(LogPriority::Warning, "Cannot announce status changes: %s\n", std::strerror(-r));
         return false;
     }
     {
@@ -214,7 +214,8 @@ void StatusPublisher::publish() {
             int r = sd_bus_emit_properties_changed_strv(bus_, path_, kTXStatusInterface,
                                                         const_cast<char**>(changed.data()));
             if (r < 0) {
-                logCFormat("Cannot announce the changed status: %s\n", std::strerror(-r));
+                logCFormat(LogPriority::Warning, "Cannot announce the changed status: %s\n",
+                           std::strerror(-r));
             }
         }
     }
@@ -224,7 +225,8 @@ void StatusPublisher::publish() {
         int r = sd_bus_emit_signal(bus_, path_, kTXStatusInterface, kUpdateCheckFinishedSignal,
                                    "ss", outcome.c_str(), sendable.c_str());
         if (r < 0) {
-            logCFormat("Cannot announce the end of an update check: %s\n", std::strerror(-r));
+            logCFormat(LogPriority::Warning, "Cannot announce the end of an update check: %s\n",
+                       std::strerror(-r));
         }
     }
 }

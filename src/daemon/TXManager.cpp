@@ -58,7 +58,7 @@ bool TXManager::setTavrixID(const std::string& tavrixID, const std::optional<pli
     // An ID that is not on disk would be lost at the next launch: the client is told, and
     // nothing is installed for it.
     if (!setBehaviorPreference(kTavrixIDKey, plist::Value(lowered))) {
-        logCFormat("Could not store the behavior ID, not accepting it\n");
+        logCFormat(LogPriority::Warning, "Could not store the behavior ID, not accepting it\n");
         return false;
     }
     if (!bundle) {

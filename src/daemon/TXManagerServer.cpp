@@ -41,8 +41,8 @@ std::thread::id mainThreadId;
 // Connection handlers must run where the client list lives.
 void assertMainThread(const char* method) {
     if (std::this_thread::get_id() != mainThreadId) {
-        logCFormat("Assertion failure in %s, %s:%d: %s\n", method, "daemon/TXManagerServer_Daemon",
-                   135, "Must be invoked on the main thread");
+        logCFormat(LogPriority::Warning, "Assertion failure in %s, %s:%d: %s\n", method,
+                   "daemon/TXManagerServer_Daemon", 135, "Must be invoked on the main thread");
         std::abort();
     }
 }
@@ -171,7 +171,8 @@ bool TXManagerServer::_armLockRetry() {
         &TXManagerServer::_onLockRetry, this);
     _lockRetryTimer.reset(timer);
     if (r < 0) {
-        logCFormat("Cannot set up the instance lock timer: %s\n", std::strerror(-r));
+        logCFormat(LogPriority::Warning, "Cannot set up the instance lock timer: %s\n",
+                   std::strerror(-r));
         return false;
     }
     return true;
@@ -225,7 +226,7 @@ void TXManagerServer::_refuseDeferredCalls(std::chrono::steady_clock::time_point
 bool TXManagerServer::_startServing() {
     sd_event* event = nullptr;
     if (sd_event_default(&event) < 0) {
-        logCFormat("Cannot create the main event loop\n");
+        logCFormat(LogPriority::Warning, "Cannot create the main event loop\n");
         return false;
     }
     _event.reset(event);
@@ -258,7 +259,8 @@ bool TXManagerServer::_startServing() {
         _wakeSource.reset(wake);
     }
     if (r < 0) {
-        logCFormat("Cannot set up the main event loop: %s\n", std::strerror(-r));
+        logCFormat(LogPriority::Warning, "Cannot set up the main event loop: %s\n",
+                   std::strerror(-r));
         return false;
     }
 
@@ -284,7 +286,7 @@ bool TXManagerServer::_startServing() {
                                    0, endLaunchTransaction, nullptr);
     _launchTimer.reset(launch);
     if (r < 0) {
-        logCFormat("Cannot set up the launch timer: %s\n", std::strerror(-r));
+        logCFormat(LogPriority::Warning, "Cannot set up the launch timer: %s\n", std::strerror(-r));
         return false;
     }
     return true;
@@ -328,7 +330,7 @@ void TXManagerServer::_run() {
         }
         int r = sd_event_run(_event.get(), static_cast<uint64_t>(timeout.count()));
         if (r < 0) {
-            logCFormat("The main event loop failed: %s\n", std::strerror(-r));
+            logCFormat(LogPriority::Warning, "The main event loop failed: %s\n", std::strerror(-r));
             break;
         }
         std::set<std::string> open = transactions.openTransactions();

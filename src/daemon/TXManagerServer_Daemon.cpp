@@ -170,7 +170,8 @@ int handleCopyTavrixValue(sd_bus_message* message, void* userdata, sd_bus_error*
         if (!replyMessage && answer) {
             // A setting the bus cannot carry (too deep, or text that is not UTF-8) is answered as
             // no value: every well-formed call gets a normal reply.
-            logCFormat("The value for key %s cannot be sent over the bus; answering no value\n",
+            logCFormat(LogPriority::Warning,
+                       "The value for key %s cannot be sent over the bus; answering no value\n",
                        key);
         }
     });
@@ -227,7 +228,8 @@ int handleGetStatus(sd_bus_message* message, void* userdata, sd_bus_error* error
     }
     if (r < 0) {
         // A value the bus cannot carry (text that is not UTF-8 in a path).
-        logCFormat("The status cannot be sent over the bus: %s\n", std::strerror(-r));
+        logCFormat(LogPriority::Warning, "The status cannot be sent over the bus: %s\n",
+                   std::strerror(-r));
         return sd_bus_error_setf(error, SD_BUS_ERROR_FAILED,
                                  "The status cannot be sent over the bus: %s", std::strerror(-r));
     }

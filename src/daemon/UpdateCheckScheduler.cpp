@@ -106,12 +106,13 @@ void UpdateCheckScheduler::onJobFired(const std::string& /*jobName*/,
     // Keep-alive, so that the daemon stays for the download that may follow.
     transactions.beginTransaction(TXUpdateCheckTransaction, true);
     if (job == nullptr) {
-        logObjectFormat("Invalid Corvex job object received in the call back");
+        logObjectFormat(LogPriority::Warning,
+                        "Invalid Corvex job object received in the call back");
     } else if (TXManager::sharedInstance().checkForTavrixBundleUpdate()) {
         // The download path ends the transaction through rescheduleAndEndCheck.
         return;
     }
-    logObjectFormat("Update check has failed, rescheduling the next update");
+    logObjectFormat(LogPriority::Warning, "Update check has failed, rescheduling the next update");
     setUpNewTimer(kUpdateCheckIntervalSeconds);
     // Ended twice, as this path always has; the second end finds the name closed and does nothing.
     transactions.endTransaction(TXUpdateCheckTransaction);

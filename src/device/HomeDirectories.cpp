@@ -61,8 +61,8 @@ std::optional<io::Directory> openProtectedChild(const io::Directory& parent,
                 if (::fchmodat(parent.fd(), name.c_str(), kDirectoryMode, 0) != 0) {
                 }
             } else if (errno != EEXIST) {
-                logCFormat("Cannot create the directory %s: %s\n", parent.pathOf(name).c_str(),
-                           errorText(errno).c_str());
+                logCFormat(LogPriority::Warning, "Cannot create the directory %s: %s\n",
+                           parent.pathOf(name).c_str(), errorText(errno).c_str());
                 return std::nullopt;
             }
             continue;

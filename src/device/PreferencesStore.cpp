@@ -39,7 +39,8 @@ std::string errorText(int error) {
 }
 
 void logFailure(const char* action, const std::string& path, int error) {
-    logCFormat("Preferences: cannot %s %s: %s", action, path.c_str(), errorText(error).c_str());
+    logCFormat(LogPriority::Warning, "Preferences: cannot %s %s: %s", action, path.c_str(),
+               errorText(error).c_str());
 }
 
 // A name used as one path component: a domain or a user.
@@ -243,11 +244,13 @@ bool PreferencesStore::synchronizeLocked(Domain& domain) {
 PreferencesStore::Domain* PreferencesStore::domainFor(std::string_view domain,
                                                       std::string_view user) {
     if (!isValidComponent(domain) || domain.size() + kExtension.size() > NAME_MAX) {
-        logCFormat("Preferences: invalid domain name \"%s\"", std::string(domain).c_str());
+        logCFormat(LogPriority::Warning, "Preferences: invalid domain name \"%s\"",
+                   std::string(domain).c_str());
         return nullptr;
     }
     if (!isValidComponent(user)) {
-        logCFormat("Preferences: invalid user name \"%s\"", std::string(user).c_str());
+        logCFormat(LogPriority::Warning, "Preferences: invalid user name \"%s\"",
+                   std::string(user).c_str());
         return nullptr;
     }
     auto userDomains = users_.find(user);
@@ -271,7 +274,8 @@ PreferencesStore::Domain* PreferencesStore::domainFor(std::string_view domain,
 bool PreferencesStore::writePending(Domain& domain) {
     auto preferences = openDirectoryInHome(domain.home, domain.directory, true);
     if (!preferences) {
-        logCFormat("Preferences: cannot use the directory %s", domain.directory.c_str());
+        logCFormat(LogPriority::Warning, "Preferences: cannot use the directory %s",
+                   domain.directory.c_str());
         return false;
     }
     DomainLock lock(*preferences, "." + domain.fileName + std::string(kLockExtension));

@@ -169,7 +169,8 @@ GregorianCalendar TXUtility::gregorianCalendar() {
 std::optional<plist::Date> TXUtility::addToDate(plist::Date date, long numberOfDays) {
     auto result = gregorianCalendar().addingDays(date, numberOfDays);
     if (!result) {
-        logCFormat("addToDate:numberOfDays: unable to add %ld days to date: %f", numberOfDays,
+        logCFormat(LogPriority::Warning,
+                   "addToDate:numberOfDays: unable to add %ld days to date: %f", numberOfDays,
                    date.secondsSinceReferenceDate);
     }
     return result;

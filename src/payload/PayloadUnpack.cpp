@@ -97,7 +97,7 @@ std::optional<StagedPayload> stagePayload(const plist::Data& data, const std::st
             return staged;
         }
     }
-    logCFormat("Failed to write the zipped file: %s\n", path.c_str());
+    logCFormat(LogPriority::Warning, "Failed to write the zipped file: %s\n", path.c_str());
     *whyNot = "the payload could not be staged at " + path + ": " + reason;
     return std::nullopt;
 }

@@ -36,8 +36,8 @@ void replaceEntry(const char* key, plist::Dictionary entry) {
     if (int error = device::writeDaemonStateFile(kRecordFileName, plist::Value(std::move(record)),
                                                  plist::Format::Binary, kRecordMode);
         error != 0) {
-        logCFormat("Could not record the %s in %s: %s\n", key, activityRecordPath().c_str(),
-                   std::strerror(error));
+        logCFormat(LogPriority::Warning, "Could not record the %s in %s: %s\n", key,
+                   activityRecordPath().c_str(), std::strerror(error));
     }
 }
 

@@ -305,7 +305,8 @@ bool AssetHandler::installDownloadedBundle(const std::string& source) {
     const std::uint64_t needed = diskBytesOfTree(source);
     const char* home = device::MobileUser::homeDirectory();
     if (home == nullptr || !TXUtility::hasEnoughDiskSpaceAt(home, needed)) {
-        logCFormat("Not enough free space to install %s (%llu bytes), keeping the bundle\n",
+        logCFormat(LogPriority::Warning,
+                   "Not enough free space to install %s (%llu bytes), keeping the bundle\n",
                    source.c_str(), static_cast<unsigned long long>(needed));
         return false;
     }
@@ -359,8 +360,8 @@ bool AssetHandler::copyDownloadedBundle(const std::string& source, const std::st
         },
         &whyNot);
     if (!copied) {
-        logCFormat("Failed to install %s into %s: %s\n", source.c_str(), destination.c_str(),
-                   whyNot.c_str());
+        logCFormat(LogPriority::Warning, "Failed to install %s into %s: %s\n", source.c_str(),
+                   destination.c_str(), whyNot.c_str());
     }
     return copied;
 }
@@ -387,7 +388,8 @@ void AssetHandler::resumePendingInstall(const PendingInstall& pendingInstall) {
         logCFormat("Completing the interrupted install of %s\n", asset.c_str());
         installDownloadedBundle(asset);
     } else if (!pending->installed) {
-        logCFormat("The interrupted install of %s cannot be completed: the download is gone\n",
+        logCFormat(LogPriority::Warning,
+                   "The interrupted install of %s cannot be completed: the download is gone\n",
                    asset.c_str());
     }
     removeItemTree(asset);

@@ -29,8 +29,8 @@ bool writePendingInstall(const PendingInstall& install) {
     if (int error =
             device::writeDaemonStateFile(kMarkerFileName, record, plist::Format::Xml, kMarkerMode);
         error != 0) {
-        logCFormat("Could not record the install of %s: %s\n", assetDirectory.c_str(),
-                   std::strerror(error));
+        logCFormat(LogPriority::Warning, "Could not record the install of %s: %s\n",
+                   assetDirectory.c_str(), std::strerror(error));
         return false;
     }
     return true;

@@ -7,9 +7,9 @@ namespace tavrix::detail {
 void logContainedException(const char* what, const char* reason) noexcept {
     try {
         if (reason != nullptr) {
-            logCFormat("%s failed with an exception: %s", what, reason);
+            logCFormat(LogPriority::Warning, "%s failed with an exception: %s", what, reason);
         } else {
-            logCFormat("%s failed with an unknown exception", what);
+            logCFormat(LogPriority::Warning, "%s failed with an unknown exception", what);
         }
     } catch (...) {
         // Out of memory even for the line: there is nothing left to report with.

@@ -13,24 +13,8 @@
 namespace tavrix {
 namespace {
 
-// A message whose format reports a failure is a warning, the rest a notice. Only the format's own
-// text counts, so no client value can change a message's priority.
-int priorityOf(const char* format) {
-    static constexpr std::string_view kFailureWords[] = {
-        "fail",    "cannot",  "could not",  "refus",   "error", "exception",
-        "invalid", "damaged", "not enough", "problem", "unable"};
-    std::string lowered(format);
-    for (char& c : lowered) {
-        if (c >= 'A' && c <= 'Z') {
-            c = static_cast<char>(c - 'A' + 'a');
-        }
-    }
-    for (std::string_view word : kFailureWords) {
-        if (lowered.find(word) != std::string::npos) {
-            return LOG_WARNING;
-        }
-    }
-    return LOG_NOTICE;
+int syslogPriority(LogPriority priority) {
+    return priority == LogPriority::Warning ? LOG_WARNING : LOG_NOTICE;
 }
 
 // Values (a "%s" text or a "%@" description) come from clients, carrier files and the network: a
@@ -286,22 +270,40 @@ std::string formatObjectMessage(const char* format, va_list arguments) {
     return out;
 }
 
+void logObjectFormatV(LogPriority priority, const char* format, va_list arguments) {
+    writeSystemLog(syslogPriority(priority), formatObjectMessage(format, arguments));
+}
+
 void logObjectFormatV(const char* format, va_list arguments) {
-    writeSystemLog(priorityOf(format), formatObjectMessage(format, arguments));
+    logObjectFormatV(LogPriority::Notice, format, arguments);
+}
+
+void logObjectFormat(LogPriority priority, const char* format, ...) {
+    va_list arguments;
+    va_start(arguments, format);
+    logObjectFormatV(priority, format, arguments);
+    va_end(arguments);
 }
 
 void logObjectFormat(const char* format, ...) {
     va_list arguments;
     va_start(arguments, format);
-    logObjectFormatV(format, arguments);
+    logObjectFormatV(LogPriority::Notice, format, arguments);
+    va_end(arguments);
+}
+
+// The same formatter as the object formats, so values are escaped and cut alike.
+void logCFormat(LogPriority priority, const char* format, ...) {
+    va_list arguments;
+    va_start(arguments, format);
+    logObjectFormatV(priority, format, arguments);
     va_end(arguments);
 }
 
 void logCFormat(const char* format, ...) {
-    // The same formatter as the object formats, so values are escaped and cut alike.
     va_list arguments;
     va_start(arguments, format);
-    logObjectFormatV(format, arguments);
+    logObjectFormatV(LogPriority::Notice, format, arguments);
     va_end(arguments);
 }
 

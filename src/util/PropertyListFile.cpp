@@ -8,8 +8,8 @@ namespace tavrix {
 
 void logPropertyListRefusal(const std::string& path, const plist::Refusal& refusal,
                             const char* consequence) {
-    logCFormat("Property list %s refused: %s; %s", path.c_str(), refusal.reason.c_str(),
-               consequence);
+    logCFormat(LogPriority::Warning, "Property list %s refused: %s; %s", path.c_str(),
+               refusal.reason.c_str(), consequence);
 }
 
 std::optional<plist::Value> readPropertyListFile(const std::string& path, const char* consequence) {

@@ -53,12 +53,14 @@ TEST_F(LogTest, ClientValuesAreEscapedAndCut) {
     EXPECT_EQ(sink.messages(), (std::vector<std::string>{cut + "!", cut + "?"}));
 }
 
-// An operator filters by priority and by the fields of the flow a message belongs to; a client's
-// value can raise neither.
+// An operator filters by priority (the caller's) and by the fields of the flow a message belongs
+// to; a client's value can raise neither.
 TEST_F(LogTest, JournalEntriesCarryPriorityAndScopedFields) {
-    logCFormat("Failed to establish link from %s to %s\n", "a", "b");
+    logCFormat(LogPriority::Warning, "Failed to establish link from %s to %s\n", "a", "b");
     logCFormat("Copying %s\n", "refused error failed");
-    EXPECT_EQ(sink.priorities(), (std::vector<int>{LOG_WARNING, LOG_NOTICE}));
+    const plist::Value failed("failed");
+    logObjectFormat(LogPriority::Warning, "%@", &failed);
+    EXPECT_EQ(sink.priorities(), (std::vector<int>{LOG_WARNING, LOG_NOTICE, LOG_WARNING}));
 
     ScopedLogField outer("TAVRIX_BEHAVIOR_ID", "outer");
     {
