@@ -3,12 +3,14 @@
 // next launch (which redoes the bundle match from the stored ID, so a payload that stopped one
 // process would stop every one after it).
 #include <signal.h>
+#include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/types.h>
 #include <unistd.h>
 
 #include <fstream>
 #include <functional>
+#include <random>
 #include <set>
 
 #include "BusFixture.h"
@@ -216,6 +218,59 @@ TEST_P(HostilePayloadTest, DaemonKeepsServingAndSoDoesItsNextLaunch) {
         const std::string name = entry.path().filename().string();
         EXPECT_TRUE(before.contains(name) || name.starts_with("hostile")) << name;
     }
+}
+
+using SmallFileSystemsTest = BusFixture;
+
+// A payload is checked against the room it needs before the bundle before it is touched: on a home
+// of 40 MiB a bundle still installs (the free-space reserve is a sixteenth of so small a file
+// system), one that would not fit is refused, and with /tmp full the payload cannot be staged;
+// either way the bundle before it stays linked. (Root only: the small file systems are mounted.)
+TEST_F(SmallFileSystemsTest, PayloadsThatDoNotFitKeepTheBundleBeforeThem) {
+    if (::geteuid() != 0) {
+        GTEST_SKIP() << "needs root to mount small file systems";
+    }
+    struct Mount {
+        fs::path path;
+        bool mounted;
+        Mount(fs::path at, const char* size)
+            : path(std::move(at)), mounted(::mount("tmpfs", path.c_str(), "tmpfs", 0, size) == 0) {}
+        ~Mount() {
+            if (mounted) {
+                ::umount2(path.c_str(), MNT_DETACH);
+            }
+        }
+    };
+    const Mount home(at("/var/mobile"), "size=40m");
+    ASSERT_TRUE(home.mounted);
+    device().writeDaemonPreferences({{"EnableSupport", true}});
+    // Random bytes weigh in the payload what they take on disk; zeros hardly at all.
+    auto bundleWith = [&](const std::string& version, std::size_t bytes, bool random) {
+        const fs::path source = device().base() / ("small-" + version);
+        writeBundle(source, version, {{"CarrierName", version}});
+        std::string bulk(bytes, '\0');
+        std::mt19937 generator(7);
+        for (char& byte : bulk) {
+            byte = random ? static_cast<char>(generator()) : '\0';
+        }
+        test::writeText(source / "bulk", bulk);
+        return pack(source, {"-z"});
+    };
+    ASSERT_TRUE(client().setTavrixID("id-7", bundleWith("5", 1 << 20, true)));
+    EXPECT_EQ(linkedVersion(), "5");
+
+    ASSERT_TRUE(client().setTavrixID("id-7", bundleWith("6", 40 << 20, false)));
+    EXPECT_EQ(countLogLinesContaining("stopped:"), 1);
+    EXPECT_EQ(linkedVersion(), "5");
+
+    const Mount tmp(at("/tmp"), "size=1m");
+    ASSERT_TRUE(tmp.mounted);
+    std::string filler(1 << 20, 'x');
+    std::ofstream(tmp.path / "filler", std::ios::binary).write(filler.data(), filler.size());
+    ASSERT_TRUE(client().setTavrixID("id-7", bundleWith("7", 2 << 20, true)));
+    EXPECT_EQ(countLogLinesContaining("Failed to write the zipped file"), 1);
+    EXPECT_EQ(linkedVersion(), "5");
+    EXPECT_EQ(client().copyTavrixValue("CarrierName"), std::optional<plist::Value>("5"));
 }
 
 INSTANTIATE_TEST_SUITE_P(Payloads, HostilePayloadTest, testing::ValuesIn(kCases),
