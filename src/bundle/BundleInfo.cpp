@@ -4,7 +4,11 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <map>
+#include <memory>
+#include <mutex>
 
+#include "plist/CachedPropertyListFile.h"
 #include "util/PropertyListFile.h"
 
 namespace tavrix {
@@ -13,13 +17,42 @@ std::string BundleDirectory::infoPath() const {
     return path_ + "/" + kBundleInfoFileName;
 }
 
+namespace {
+
+// One request asks a bundle's Info dictionary several times (the choice of bundle, its record, the
+// comparison, the pruning): each version of the file is parsed once, and asked again only when
+// it changed. Few bundles exist; the table is emptied should it ever grow.
+std::shared_ptr<plist::CachedPropertyListFile> cachedInfoFile(const std::string& path) {
+    constexpr std::size_t kMaxCachedFiles = 16;
+    static std::mutex mutex;
+    static std::map<std::string, std::shared_ptr<plist::CachedPropertyListFile>> files;
+    std::lock_guard lock(mutex);
+    auto& file = files[path];
+    if (!file) {
+        if (files.size() > kMaxCachedFiles) {
+            files.clear();
+            return cachedInfoFile(path);
+        }
+        file = std::make_shared<plist::CachedPropertyListFile>(path);
+    }
+    return file;
+}
+
+}  // namespace
+
 std::optional<plist::Value> BundleDirectory::copyInfoValue(std::string_view key,
                                                            plist::Refusal* refusal) const {
-    std::optional<plist::Value> info = plist::readFile(infoPath(), refusal);
-    if (!info) {
-        return std::nullopt;
+    const plist::CachedPropertyListFile::Snapshot info = cachedInfoFile(infoPath())->read();
+    std::optional<plist::Value> unopened;
+    const plist::Value* dictionary = info.value.get();
+    if (info.state == plist::CachedPropertyListFile::State::Missing) {
+        // Not opened: read directly for the reason (missing, or not readable).
+        unopened = plist::readFile(infoPath(), refusal);
+        dictionary = unopened ? &*unopened : nullptr;
+    } else if (info.state == plist::CachedPropertyListFile::State::Damaged && refusal != nullptr) {
+        *refusal = info.refusal;
     }
-    const plist::Value* value = info->find(key);
+    const plist::Value* value = dictionary != nullptr ? dictionary->find(key) : nullptr;
     return value == nullptr ? std::nullopt : std::optional<plist::Value>(*value);
 }
 

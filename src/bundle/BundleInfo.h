@@ -21,7 +21,8 @@ inline constexpr const char* kBundleIdentifierKey = "QZBundleIdentifier";
 inline constexpr int kBundleInfoRetryCount = 5;
 inline constexpr unsigned kBundleInfoRetryDelayMicroseconds = 100;
 
-// One bundle directory. The Info dictionary is read from disk on every request.
+// One bundle directory. The Info dictionary is looked at on every request and parsed again only
+// when the file changed.
 class BundleDirectory {
   public:
     explicit BundleDirectory(std::string path) : path_(std::move(path)) {}
