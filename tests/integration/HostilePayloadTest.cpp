@@ -266,7 +266,7 @@ TEST_F(SmallFileSystemsTest, PayloadsThatDoNotFitKeepTheBundleBeforeThem) {
     const Mount tmp(at("/tmp"), "size=1m");
     ASSERT_TRUE(tmp.mounted);
     std::string filler(1 << 20, 'x');
-    std::ofstream(tmp.path / "filler", std::ios::binary).write(filler.data(), filler.size());
+    std::ofstream(tmp.path / "filler", std::ofstream::binary).write(filler.data(), filler.size());
     ASSERT_TRUE(client().setTavrixID("id-7", bundleWith("7", 2 << 20, true)));
     EXPECT_EQ(countLogLinesContaining("Failed to write the zipped file"), 1);
     EXPECT_EQ(linkedVersion(), "5");
