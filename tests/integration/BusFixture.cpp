@@ -13,12 +13,8 @@
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix::integration {
-namespace {
 
 namespace fs = std::filesystem;
-using Clock = std::chrono::steady_clock;
-
-}  // namespace
 
 DeviceRoot::DeviceRoot() {
     test::writeText(path("/etc/passwd"),
@@ -84,20 +80,17 @@ BusWatcher::BusWatcher(const std::string& address) : bus_(test::connectToBus(add
 }
 
 bool BusWatcher::waitUntil(const std::function<bool()>& done, std::chrono::milliseconds timeout) {
-    const auto deadline = Clock::now() + timeout;
-    for (;;) {
-        int processed = 0;
-        while ((processed = sd_bus_process(bus_.get(), nullptr)) > 0) {
-        }
-        if (done()) {
-            return true;
-        }
-        auto left = std::chrono::duration_cast<std::chrono::microseconds>(deadline - Clock::now());
-        if (processed < 0 || left.count() <= 0) {
-            return false;
-        }
-        sd_bus_wait(bus_.get(), static_cast<std::uint64_t>(left.count()));
-    }
+    int processed = 0;
+    return pollUntil(
+        [&] {
+            while ((processed = sd_bus_process(bus_.get(), nullptr)) > 0) {
+            }
+            return done();
+        },
+        timeout,
+        [&](std::chrono::microseconds left) {
+            return processed >= 0 && sd_bus_wait(bus_.get(), left.count()) >= 0;
+        });
 }
 
 int BusWatcher::onNameOwnerChanged(sd_bus_message* message, void* self, sd_bus_error*) {

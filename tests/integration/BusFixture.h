@@ -15,7 +15,6 @@
 #include <set>
 #include <string>
 #include <string_view>
-#include <thread>
 #include <vector>
 
 #include "PrivateBus.h"
@@ -26,6 +25,7 @@ namespace tavrix::integration {
 
 using namespace std::chrono_literals;
 using test::CommandResult;
+using test::pollUntil;
 using test::runCommand;
 
 inline constexpr const char* kDaemonBusName = "com.zandor.tavrixservicesd";
@@ -45,19 +45,6 @@ inline constexpr const char* kPreferencesLink =
 inline int crashLoopIterations() {
     const char* text = std::getenv("TAVRIX_CRASH_LOOP_ITERATIONS");
     return text != nullptr && std::atoi(text) > 0 ? std::atoi(text) : 30;
-}
-
-// Asks done() every 20 ms until it holds (true) or the timeout passes (false): for what other
-// processes write to files.
-inline bool pollUntil(const std::function<bool()>& done, std::chrono::milliseconds timeout) {
-    const auto deadline = std::chrono::steady_clock::now() + timeout;
-    while (!done()) {
-        if (std::chrono::steady_clock::now() > deadline) {
-            return false;
-        }
-        std::this_thread::sleep_for(20ms);
-    }
-    return true;
 }
 
 // A device image: the root the daemon runs under, its runtime directory, and the files the tests

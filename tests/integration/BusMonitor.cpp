@@ -8,7 +8,6 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <cerrno>
 #include <stdexcept>
 
@@ -59,14 +58,15 @@ BusMonitor::BusMonitor(const std::string& address, const std::vector<std::string
     auto isMarker = [](const nlohmann::json& message) {
         return message.value("path", "") == kMarkerPath;
     };
-    for (int attempt = 0; attempt < 50; ++attempt) {
-        test::runCommand({"/usr/bin/busctl", "--address=" + address, "emit", kMarkerPath,
-                          "com.zandor.Test", "Ready"});
-        if (next(isMarker, 200ms)) {
-            return;
-        }
+    if (!test::pollUntil(
+            [&] {
+                test::runCommand({"/usr/bin/busctl", "--address=" + address, "emit", kMarkerPath,
+                                  "com.zandor.Test", "Ready"});
+                return next(isMarker, 200ms).has_value();
+            },
+            10s, [](auto) { return true; })) {
+        throw std::runtime_error("busctl monitor never saw the bus");
     }
-    throw std::runtime_error("busctl monitor never saw the bus");
 }
 
 BusMonitor::~BusMonitor() {
@@ -99,25 +99,21 @@ bool BusMonitor::readMore(std::chrono::milliseconds timeout) {
 
 std::optional<nlohmann::json> BusMonitor::next(
     const std::function<bool(const nlohmann::json&)>& matches, std::chrono::milliseconds timeout) {
-    const auto deadline = std::chrono::steady_clock::now() + timeout;
-    for (;;) {
-        while (cursor_ < messages_.size()) {
-            const nlohmann::json& message = messages_[cursor_++];
-            if (matches(message)) {
-                return message;
+    std::optional<nlohmann::json> found;
+    test::pollUntil(
+        [&] {
+            while (!found && cursor_ < messages_.size()) {
+                const nlohmann::json& message = messages_[cursor_++];
+                found = matches(message) ? std::optional(message) : std::nullopt;
             }
-        }
-        const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
-            deadline - std::chrono::steady_clock::now());
-        if (left <= 0ms || !readMore(left)) {
-            return std::nullopt;
-        }
-    }
+            return found.has_value();
+        },
+        timeout, [&](std::chrono::milliseconds left) { return readMore(left); });
+    return found;
 }
 
 std::optional<nlohmann::json> BusMonitor::waitForStatus(const nlohmann::json& expected,
                                                         std::chrono::milliseconds timeout) {
-    const auto deadline = std::chrono::steady_clock::now() + timeout;
     nlohmann::json announced = nlohmann::json::object();
     auto complete = [&] {
         for (const auto& [name, value] : expected.items()) {
@@ -127,16 +123,20 @@ std::optional<nlohmann::json> BusMonitor::waitForStatus(const nlohmann::json& ex
         }
         return true;
     };
-    while (!complete()) {
-        const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
-            deadline - std::chrono::steady_clock::now());
-        auto message = next([](const nlohmann::json& m) { return changedStatus(m).has_value(); },
-                            std::max(left, 0ms));
-        if (!message) {
-            ADD_FAILURE() << "announced " << announced.dump() << ", expected " << expected.dump();
-            return std::nullopt;
+    // One message at a time, so that what follows the last one expected stays unread.
+    auto takeAnnounced = [&] {
+        while (!complete()) {
+            auto message = next([](auto& m) { return changedStatus(m).has_value(); }, 0ms);
+            if (!message) {
+                return false;
+            }
+            announced.update(*changedStatus(*message));
         }
-        announced.update(*changedStatus(*message));
+        return true;
+    };
+    if (!test::pollUntil(takeAnnounced, timeout, [&](auto left) { return readMore(left); })) {
+        ADD_FAILURE() << "announced " << announced.dump() << ", expected " << expected.dump();
+        return std::nullopt;
     }
     return announced;
 }

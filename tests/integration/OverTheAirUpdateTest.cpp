@@ -684,12 +684,13 @@ TEST_F(OverTheAirKeepAliveTest, ScheduledCheckKeepsTheDaemonUntilTheDownloadIsIn
     EXPECT_TRUE(
         waitForLogLine("*********** Beginning Corvex transaction : Update Check ***********"));
     constexpr const char* kContinuing = "Tavrix daemon continuing to run - transactions:";
-    const auto launched = std::chrono::steady_clock::now();
-    while (countLogLinesContaining(kContinuing) == 0 &&
-           std::chrono::steady_clock::now() - launched < 20s) {
-        EXPECT_TRUE(client().isTavrixBundleSupported());
-        std::this_thread::sleep_for(4s);
-    }
+    // A call every 4 s meanwhile.
+    pollUntil([&] { return countLogLinesContaining(kContinuing) > 0; }, 20s,
+              [&](auto) {
+                  EXPECT_TRUE(client().isTavrixBundleSupported());
+                  std::this_thread::sleep_for(4s);
+                  return true;
+              });
     EXPECT_EQ(countLogLinesContaining(kContinuing), 1);
     ASSERT_TRUE(server.waitForHeldResponse(30s));
     EXPECT_TRUE(

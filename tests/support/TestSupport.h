@@ -1,12 +1,16 @@
-// Shared helpers for the tests: temporary directories and small file helpers.
+// Shared helpers for the tests: temporary directories, small file helpers and the one way to
+// wait for a condition.
 #pragma once
 
+#include <chrono>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <map>
 #include <stdexcept>
 #include <string>
+#include <thread>
 
 namespace tavrix::test {
 
@@ -65,6 +69,29 @@ inline Tree snapshotTree(const std::filesystem::path& root) {
         }
     }
     return tree;
+}
+
+// Asks done() until it holds (true) or the timeout passes (false). Between asks, waitForNews(left)
+// waits up to left for what could change the answer (a bus, a pipe) and answers false once nothing
+// more can come; without it, done() is asked every 20 ms (for files other processes write).
+inline bool pollUntil(const std::function<bool()>& done, std::chrono::milliseconds timeout,
+                      const std::function<bool(std::chrono::milliseconds)>& waitForNews = {}) {
+    using namespace std::chrono;
+    const auto deadline = steady_clock::now() + timeout;
+    for (;;) {
+        if (done()) {
+            return true;
+        }
+        const auto left = duration_cast<milliseconds>(deadline - steady_clock::now());
+        if (left <= 0ms) {
+            return false;
+        }
+        if (!waitForNews) {
+            std::this_thread::sleep_for(std::min(left, 20ms));
+        } else if (!waitForNews(left)) {
+            return done();
+        }
+    }
 }
 
 }  // namespace tavrix::test

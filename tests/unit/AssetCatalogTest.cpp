@@ -56,15 +56,6 @@ LocalHttpServer::Response statusResponse(int status, std::string reason) {
     return response;
 }
 
-// Polls until done answers true, for up to kPatience: the answer.
-bool eventually(const std::function<bool()>& done) {
-    const auto deadline = std::chrono::steady_clock::now() + kPatience;
-    while (!done() && std::chrono::steady_clock::now() < deadline) {
-        std::this_thread::sleep_for(std::chrono::milliseconds(10));
-    }
-    return done();
-}
-
 // The reports a download handler receives: each operation, and the bytes of each "Downloading".
 class ProgressLog {
   public:
@@ -487,7 +478,7 @@ TEST_F(AssetCatalogTest, DownloadReportsStepsInOrderInstallsIdenticalFilesAndPur
 
     // Reports made before a handler exists wait for it.
     asset->beginDownload();
-    eventually([&] { return asset->localURL().has_value(); });
+    test::pollUntil([&] { return asset->localURL().has_value(); }, kPatience);
     auto progress = std::make_shared<ProgressLog>();
     asset->setProgressHandler(ProgressLog::handler(progress, asset));
     std::vector<std::string> operations = progress->waitForLast();
@@ -525,7 +516,7 @@ TEST_F(AssetCatalogTest, DownloadReportsStepsInOrderInstallsIdenticalFilesAndPur
     // The handler captured the asset; once the last report is delivered nothing keeps it.
     std::weak_ptr<Asset> weak = asset;
     asset.reset();
-    EXPECT_TRUE(eventually([&] { return weak.expired(); }));
+    EXPECT_TRUE(test::pollUntil([&] { return weak.expired(); }, kPatience));
 }
 
 // Every way a download can go wrong ends in one failure report with one line saying why, no

@@ -7,6 +7,7 @@
 #include <functional>
 
 #include "PrivateBus.h"
+#include "TestSupport.h"
 #include "bus/BusHandles.h"
 #include "bus/BusValueCodec.h"
 
@@ -44,21 +45,22 @@ class BusValueCodec : public testing::Test {
             return r;
         }
         test::check(sd_bus_send(bus_.get(), message.get(), nullptr), "sd_bus_send");
-        const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
-        while (std::chrono::steady_clock::now() < deadline) {
+        BusMessagePtr received;
+        auto arrived = [&] {
             sd_bus_message* raw = nullptr;
             r = sd_bus_process(bus_.get(), &raw);
             test::check(r, "sd_bus_process (did the bus drop the connection?)");
-            BusMessagePtr received(raw);
+            received.reset(raw);
             // Skips what the bus itself says to a new connection.
-            if (received && sd_bus_message_is_method_call(received.get(), "test.Codec", "Carry")) {
-                return read(received.get());
-            }
-            if (r == 0) {
-                sd_bus_wait(bus_.get(), 10'000);
-            }
+            return received && sd_bus_message_is_method_call(raw, "test.Codec", "Carry") > 0;
+        };
+        if (!test::pollUntil(arrived, std::chrono::seconds(10), [&](auto left) {
+                return r > 0 ||
+                       sd_bus_wait(bus_.get(), std::chrono::microseconds(left).count()) >= 0;
+            })) {
+            throw std::runtime_error("the message did not arrive");
         }
-        throw std::runtime_error("the message did not arrive");
+        return read(received.get());
     }
 
     // A message another program might send, read as a value.

@@ -164,14 +164,15 @@ TEST(TavrixClient, AsyncCallsAnswerThroughTheApplicationsOwnLoop) {
     PendingCall second =
         client.isTavrixBundleSupportedAsync([&](AsyncResult<bool> r) { refused = r; });
     client.setClientTypeAsync(7, [&](AsyncResult<bool>) { droppedRan = true; });
-    const auto deadline = std::chrono::steady_clock::now() + 30s;
-    while (!known || !refused) {
-        ASSERT_LT(std::chrono::steady_clock::now(), deadline);
-        pollfd ready{client.fd(), client.events(), 0};
-        const auto timeout = client.timeout();
-        ::poll(&ready, 1, timeout ? static_cast<int>(timeout->count() / 1000) + 1 : 1000);
-        client.process();
-    }
+    ASSERT_TRUE(test::pollUntil(
+        [&] { return known && refused; }, 30s,
+        [&](auto) {
+            pollfd ready{client.fd(), client.events(), 0};
+            const auto timeout = client.timeout();
+            ::poll(&ready, 1, timeout ? static_cast<int>(timeout->count() / 1000) + 1 : 1000);
+            client.process();
+            return true;
+        }));
     EXPECT_EQ(known->value, std::optional<bool>(true));
     ASSERT_TRUE(refused->error);
     EXPECT_FALSE(refused->value);
