@@ -187,17 +187,6 @@ std::string BusFixture::linkedVersion() const {
     return version != nullptr && version->asString() != nullptr ? *version->asString() : "";
 }
 
-void BusFixture::writeBundle(const fs::path& directory, const std::string& version,
-                             const plist::Dictionary& carrierFile) const {
-    fs::create_directories(directory);
-    EXPECT_TRUE(plist::writeFile(
-        (directory / "Info.plist").string(),
-        plist::Value(plist::Dictionary{{"QZBundleIdentifier", "com.zandor.tavrix.bundle.test"},
-                                       {"QZBundleVersion", version}})));
-    EXPECT_TRUE(
-        plist::writeFile((directory / "behavior.plist").string(), plist::Value(carrierFile)));
-}
-
 std::vector<std::uint8_t> BusFixture::pack(const fs::path& directory,
                                            const std::vector<std::string>& options) const {
     const fs::path archive = directory.string() + ".archive";

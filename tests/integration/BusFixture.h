@@ -27,6 +27,7 @@ using namespace std::chrono_literals;
 using test::CommandResult;
 using test::pollUntil;
 using test::runCommand;
+using test::writeBundle;
 
 inline constexpr const char* kDaemonBusName = "com.zandor.tavrixservicesd";
 inline constexpr const char* kDaemonObjectPath = "/com/zandor/tavrixservicesd";
@@ -142,9 +143,6 @@ class BusFixture : public ::testing::Test {
     std::string linkState() const;
     // The version of the bundle the bundle link points at, or "".
     std::string linkedVersion() const;
-    // A bundle directory: Info.plist naming the version, and the base carrier file.
-    void writeBundle(const std::filesystem::path& directory, const std::string& version,
-                     const plist::Dictionary& carrierFile) const;
     // The directory's content packed by bsdtar with these options, as a sender packs a bundle.
     std::vector<std::uint8_t> pack(const std::filesystem::path& directory,
                                    const std::vector<std::string>& options = {"-z"}) const;

@@ -76,8 +76,8 @@ class OverTheAirUpdateTest : public BusFixture {
     // when asked, a large file of bulkBytes that does not compress.
     fs::path writeBundle(const std::string& version, std::size_t bulkBytes = 0) {
         const fs::path directory = device().base() / ("bundles/" + version + "/Default.bundle");
-        BusFixture::writeBundle(directory, version, {{"CarrierName", "Bundle " + version}});
-        writeText(directory / ("Resources/only-in-" + version + ".txt"), version);
+        test::writeBundle(directory, version, {{"CarrierName", "Bundle " + version}},
+                          {{"Resources/only-in-" + version + ".txt", version}});
         if (bulkBytes > 0) {
             std::string bulk(bulkBytes, '\0');
             randombytes_buf(bulk.data(), bulk.size());
@@ -230,7 +230,7 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
     EXPECT_EQ(textAt(status, "BehaviorID"), kBehaviorID);
     EXPECT_EQ(textAt(status, "Supported"), "true");
     EXPECT_EQ(textAt(status, "WhyNotSupported"), "(absent)");
-    EXPECT_EQ(textAt(status, "LinkedBundle.Identifier"), "com.zandor.tavrix.bundle.test");
+    EXPECT_EQ(textAt(status, "LinkedBundle.Identifier"), "com.zandor.tavrix.test");
     EXPECT_EQ(textAt(status, "LinkedBundle.Version"), "1");
     EXPECT_EQ(textAt(status, "LinkedBundle.OverlayType"), "kNoOverlay");
     EXPECT_EQ(textAt(status, "UserBundleVersion"), "1");
@@ -590,7 +590,7 @@ TEST_F(DurabilityProtocolTest, PayloadUpdateAndResetWriteInTheDurableOrder) {
     ASSERT_TRUE(client().checkForTavrixBundleUpdate());
     ASSERT_TRUE(waitForLogLine("Best candidate asset has been purged", 30s));
     EXPECT_EQ(linkedVersion(), "2");
-    BusFixture::writeBundle(at(kSystemBundle), "9", {{"CarrierName", "System"}});
+    test::writeBundle(at(kSystemBundle), "9", {{"CarrierName", "System"}});
     ASSERT_TRUE(client().setTavrixID("acme.other", std::nullopt));
     EXPECT_EQ(linkedVersion(), "9");
 

@@ -1,5 +1,5 @@
-// Shared helpers for the tests: temporary directories, small file helpers and the one way to
-// wait for a condition.
+// Shared helpers for the tests: temporary directories, small file helpers, the one bundle writer
+// and the one way to wait for a condition.
 #pragma once
 
 #include <chrono>
@@ -8,9 +8,12 @@
 #include <fstream>
 #include <functional>
 #include <map>
+#include <optional>
 #include <stdexcept>
 #include <string>
 #include <thread>
+
+#include "plist/PropertyListFormat.h"
 
 namespace tavrix::test {
 
@@ -47,6 +50,27 @@ inline void writeText(const std::string& path, const std::string& text) {
 inline std::string readText(const std::string& path) {
     std::ifstream in(path, std::ofstream::binary);
     return std::string(std::istreambuf_iterator<char>(in), {});
+}
+
+// A bundle directory as senders make it: Info.plist with an identifier and the version (left out
+// when absent), the base carrier file, and other files (relative path to content).
+inline void writeBundle(const std::filesystem::path& directory,
+                        const std::optional<plist::Value>& version,
+                        const plist::Dictionary& carrierFile = {},
+                        const std::map<std::string, std::string>& files = {},
+                        plist::Format infoFormat = plist::Format::Xml) {
+    plist::Dictionary info{{"QZBundleIdentifier", "com.zandor.tavrix.test"}};
+    if (version) {
+        info.emplace("QZBundleVersion", *version);
+    }
+    std::filesystem::create_directories(directory);
+    if (!plist::writeFile((directory / "Info.plist").string(), plist::Value(info), infoFormat) ||
+        !plist::writeFile((directory / "behavior.plist").string(), plist::Value(carrierFile))) {
+        throw std::runtime_error("cannot write the bundle " + directory.string());
+    }
+    for (const auto& [path, content] : files) {
+        writeText((directory / path).string(), content);
+    }
 }
 
 // Every entry below root by its path relative to root: directories as "/", links as

@@ -278,7 +278,7 @@ TEST_F(AssetCatalogTest, UntrustworthyCatalogsAreRefusedWithTheirReason) {
     };
     auto publish = [&](const char* version, const char* key, const char* id) {
         std::string bundle = work / (std::string(version) + "/Default.bundle");
-        test::makeBundle(bundle, version, {{"a.plist", version}});
+        test::writeBundle(bundle, version, {}, {{"a.plist", version}});
         tool({"publish", work / "out", "--key", work / key, "--key-id", id, "--fresh", bundle});
     };
     writeTypeSettings(trusting({{"new", plist::Value(newKey)}}));
@@ -354,7 +354,7 @@ TEST_F(AssetCatalogTest, UntrustworthyCatalogsAreRefusedWithTheirReason) {
 // A device that fetches the catalog just before a publication and its signature just after takes
 // the new pair, not a refusal that would keep it waiting for its next check.
 TEST_F(AssetCatalogTest, FetchCaughtBetweenSignatureAndCatalogReplacementTriesAgain) {
-    test::makeBundle(work / "b/Default.bundle", "1.0", {{"a.plist", "one"}});
+    test::writeBundle(work / "b/Default.bundle", "1.0", {}, {{"a.plist", "one"}});
     tool({"publish", work / "out", "--key", work / "secret.key", work / "b/Default.bundle"});
     writeSettings(publicKey);
     LocalHttpServer::Response held = bodyResponse(readText(out("catalog.plist")));
@@ -362,7 +362,7 @@ TEST_F(AssetCatalogTest, FetchCaughtBetweenSignatureAndCatalogReplacementTriesAg
     server.serve("/catalog/catalog.plist", held);
     auto assets = std::async(std::launch::async, [this] { return query(); });
     ASSERT_TRUE(server.waitForHeldResponse(kPatience));
-    test::makeBundle(work / "c/Default.bundle", "2.0", {{"a.plist", "two"}});
+    test::writeBundle(work / "c/Default.bundle", "2.0", {}, {{"a.plist", "two"}});
     tool({"publish", work / "out", "--key", work / "secret.key", work / "c/Default.bundle"});
     server.serve("/catalog/catalog.plist", bodyResponse(readText(out("catalog.plist"))));
     server.releaseHeldResponses();
@@ -376,7 +376,7 @@ TEST_F(AssetCatalogTest, FetchCaughtBetweenSignatureAndCatalogReplacementTriesAg
 // The second try has only what the first one left of the time budget: a slow catalog whose
 // signature fails holds a waiting check for one budget, not two.
 TEST_F(AssetCatalogTest, ASecondTryGetsOnlyWhatIsLeftOfTheTimeBudget) {
-    test::makeBundle(work / "b/Default.bundle", "1.0", {{"a.plist", "one"}});
+    test::writeBundle(work / "b/Default.bundle", "1.0", {}, {{"a.plist", "one"}});
     tool({"publish", work / "out", "--key", work / "secret.key", work / "b/Default.bundle"});
     writeSettings(publicKey, {{kSettingsCatalogTimeoutKey, plist::Value(3)}});
     LocalHttpServer::Response slow = bodyResponse(readText(out("catalog.plist")) + "\n");
@@ -389,7 +389,7 @@ TEST_F(AssetCatalogTest, ASecondTryGetsOnlyWhatIsLeftOfTheTimeBudget) {
 // A staged rollout shows an asset to the devices under its percentage, the same ones each time,
 // and a higher percentage keeps every device a lower one had.
 TEST_F(AssetCatalogTest, RolloutsAreStablePerDevice) {
-    test::makeBundle(work / "b/Default.bundle", "1.0", {{"a.plist", "one"}});
+    test::writeBundle(work / "b/Default.bundle", "1.0", {}, {{"a.plist", "one"}});
     writeSettings(std::nullopt);
     std::map<std::string, bool> at40;
     for (const char* percent : {"40", "70"}) {
@@ -466,8 +466,8 @@ TEST_F(AssetCatalogTest, DamagedCatalogsAreRefusedAndMalformedEntriesSkipped) {
 // purges only that.
 TEST_F(AssetCatalogTest, DownloadReportsStepsInOrderInstallsIdenticalFilesAndPurges) {
     std::string payload = test::randomBytes(300 * 1024, 7);
-    test::makeBundle(work / "b/Default.bundle", "1.0",
-                     {{"a.plist", "<plist/>"}, {"b/deep/payload.bin", payload}});
+    test::writeBundle(work / "b/Default.bundle", "1.0", {},
+                      {{"a.plist", "<plist/>"}, {"b/deep/payload.bin", payload}});
     tool({"publish", work / "out", "--key", work / "secret.key", work / "b/Default.bundle"});
     writeSettings(publicKey);
     std::shared_ptr<Asset> asset = onlyAsset();
@@ -623,7 +623,7 @@ class AssetSelectionTest : public AssetCatalogTest {
         // The bundle manager reads the linked bundle's version when first used.
         const fs::path root = test::unitTestRoot();
         const fs::path installed = root / "var/mobile/Library/TavrixBundles/Default.bundle";
-        test::makeBundle(installed.string(), "1.0", {});
+        test::writeBundle(installed.string(), "1.0");
         fs::create_symlink(installed, root / "var/mobile/Library/Tavrix.bundle");
     }
 
@@ -632,7 +632,7 @@ class AssetSelectionTest : public AssetCatalogTest {
         std::vector<std::string> arguments{"publish", work / "out", "--unsigned", "--fresh"};
         for (std::size_t i = 0; i < c.assets.size(); ++i) {
             const std::string bundle = work / ("bundles/Asset" + std::to_string(i) + ".bundle");
-            test::makeBundle(bundle, c.assets[i].version, {});
+            test::writeBundle(bundle, c.assets[i].version);
             arguments.push_back(bundle);
             arguments.insert(arguments.end(), c.assets[i].options.begin(),
                              c.assets[i].options.end());

@@ -49,19 +49,6 @@ class BundleDevice : public ::testing::Test {
                                 {"contains-cellular-radio", false}});
         fs::create_directories(home() + "/Library/Preferences");
     }
-
-    // A bundle directory with a base carrier file; the version is left out when not given.
-    static void writeBundle(const std::string& path, const std::optional<Value>& version,
-                            plist::Format format = plist::Format::Xml) {
-        plist::Dictionary info{{"QZBundleIdentifier", Value("com.zandor.default")}};
-        if (version) {
-            info.emplace("QZBundleVersion", *version);
-        }
-        fs::create_directories(path);
-        ASSERT_TRUE(plist::writeFile(path + "/Info.plist", Value(info), format));
-        ASSERT_TRUE(plist::writeFile(path + "/behavior.plist",
-                                     Value(plist::Dictionary{{"Source", Value(path)}})));
-    }
 };
 
 // --- Locations and the choice of bundle ---
@@ -89,8 +76,8 @@ TEST_F(BundleLocationsTest, FindBundleTakesTheNewerAndTheUserOneOnATie) {
     };
     for (const Case& c : cases) {
         SCOPED_TRACE(c.name);
-        writeBundle(systemBundle(), c.system);
-        writeBundle(userBundle(), c.user, plist::Format::Binary);
+        test::writeBundle(systemBundle(), c.system);
+        test::writeBundle(userBundle(), c.user, {}, {}, plist::Format::Binary);
         if (!c.userUsable) {
             fs::remove(userBundle() + "/behavior.plist");
         }
@@ -113,7 +100,7 @@ TEST_F(BundleLocationsTest, WithoutAHomeNothingIsLinkedOrInstalledAnywhere) {
     // No "mobile" user and no device table: the user location and both link paths are empty.
     test::writeText(root() + "/etc/passwd", "root:x:0:0:root:/root:/bin/sh\n");
     const std::string system = device::resolvePath("/System/Library/TavrixBundles//Default.bundle");
-    writeBundle(system, Value("5"));
+    test::writeBundle(system, Value("5"));
 
     BundleManager& manager = BundleManager::sharedInstance();
     EXPECT_EQ(userBundleLocation(), "");
@@ -137,7 +124,7 @@ using BundleLinksTest = BundleDevice;
 // Each link is read back after it is made: the version is read again from the linked bundle,
 // and a link text longer than the 1023 bytes read back never verifies.
 TEST_F(BundleLinksTest, LinksAreReadBackAndTheVersionRereadFromThem) {
-    writeBundle(userBundle(), Value("10"));
+    test::writeBundle(userBundle(), Value("10"));
     fs::create_directories(home() + "/Library/Preferences");
     CarrierBundle bundle;
     bundle.bundlePath = userBundle();
@@ -189,8 +176,8 @@ TEST_F(BundleManagerStartUp, ReadsDanglingLinksAsTheyAre) {
 // change go at start-up, generated files of versions no longer installed after the relink.
 TEST_F(BundleManagerStartUp, LinksThatDisagreeAreLinkedAgainAndLeftoversRemoved) {
     writeDeviceTable();
-    writeBundle(systemBundle(), Value("9"));
-    writeBundle(userBundle(), Value("10"));
+    test::writeBundle(systemBundle(), Value("9"));
+    test::writeBundle(userBundle(), Value("10"));
     fs::create_symlink(userBundle(), bundleLink());
     fs::create_symlink(systemBundle() + "/behavior.plist", preferencesLink());
     const std::string overlays = home() + "/Library/TavrixBundles/Overlay/";

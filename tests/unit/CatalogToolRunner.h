@@ -42,22 +42,4 @@ inline ToolRun runCatalogTool(const std::vector<std::string>& arguments) {
     return runTool(TAVRIX_CATALOG_TOOL, arguments);
 }
 
-// A bundle directory with an Info.plist giving an identifier and version (no Info.plist when the
-// version is empty), a base carrier file and the given files (relative path -> content).
-inline void makeBundle(const std::string& directory, const std::string& version,
-                       const std::vector<std::pair<std::string, std::string>>& files) {
-    std::filesystem::create_directories(directory);
-    if (!version.empty()) {
-        writeText(directory + "/Info.plist",
-                  "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict>"
-                  "<key>QZBundleIdentifier</key><string>com.zandor.tavrix.test</string>"
-                  "<key>QZBundleVersion</key><string>" +
-                      version + "</string></dict></plist>\n");
-    }
-    writeText(directory + "/behavior.plist", "<plist version=\"1.0\"><dict/></plist>\n");
-    for (const auto& [path, content] : files) {
-        writeText(directory + "/" + path, content);
-    }
-}
-
 }  // namespace tavrix::test

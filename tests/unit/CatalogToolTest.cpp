@@ -20,8 +20,8 @@ class CatalogToolTest : public testing::Test {
   protected:
     void SetUp() override {
         ASSERT_EQ(runCatalogTool({"keygen", work / "secret.key", work / "public.key"}).status, 0);
-        makeBundle(work / "a/Default.bundle", "1.0", {{"a.plist", "a"}});
-        makeBundle(work / "b/Default.bundle", "2.0", {{"sub/b.plist", "b"}});
+        writeBundle(work / "a/Default.bundle", "1.0", {}, {{"a.plist", "a"}});
+        writeBundle(work / "b/Default.bundle", "2.0", {}, {{"sub/b.plist", "b"}});
     }
 
     int publish(std::vector<std::string> arguments) {
@@ -252,7 +252,7 @@ TEST_F(CatalogToolTest, PackAndPublishRefuseADirectoryThatIsNoBundle) {
     for (const Case& c : cases) {
         SCOPED_TRACE(c.name);
         const std::string bundle = work / ("spoiled/" + std::string(c.name));
-        makeBundle(bundle, "3.0", {{"a.plist", "a"}});
+        writeBundle(bundle, "3.0", {}, {{"a.plist", "a"}});
         c.spoil(bundle);
         const std::string payload = work / "payload.tgz";
         ToolRun pack = runTool(TAVRIX_CTL_TOOL, {"pack", bundle, "-o", payload});

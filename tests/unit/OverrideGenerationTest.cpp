@@ -61,11 +61,8 @@ class OverrideGenerationTest : public testing::Test {
         test::writeDeviceTable(table);
     }
 
-    static void writeBundle(const Value& carrier) {
-        fs::create_directories(bundle());
-        ASSERT_TRUE(plist::writeFile(bundle() + "/Info.plist",
-                                     Value(Dictionary{{"QZBundleVersion", "1.0"}})));
-        ASSERT_TRUE(plist::writeFile(baseFile(), carrier));
+    static void writeBundle(const Dictionary& carrier) {
+        test::writeBundle(bundle(), "1.0", carrier);
     }
 
     // The device decision leaves the base bundle in the record, as the reset flow would have it.
@@ -80,7 +77,7 @@ class OverrideGenerationTest : public testing::Test {
 // without a listed ID, so does the behavior overlay.
 TEST_F(OverrideGenerationTest, WithoutAMatchTheRecordKeepsTheBaseFile) {
     writeDevice("T12AP");
-    writeBundle(Value(baseCarrier()));
+    writeBundle(baseCarrier());
     CarrierBundle record;
     record.carrierFilePath = "/stale";
     EXPECT_EQ(makeDeviceOverlayDecision(record, std::nullopt), kNoMatchForOverlay);
@@ -91,7 +88,7 @@ TEST_F(OverrideGenerationTest, WithoutAMatchTheRecordKeepsTheBaseFile) {
     EXPECT_EQ(applyMultimodeOverlay(record, std::string("")), kOverrideNotRequired);
     EXPECT_EQ(applyMultimodeOverlay(record, std::nullopt), kOverrideNotRequired);
 
-    writeBundle(Value(Dictionary{{"Name", "Base"}}));
+    writeBundle(Dictionary{{"Name", "Base"}});
     EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kOverrideNotRequired);
     EXPECT_EQ(record.carrierFilePath, baseFile());
     EXPECT_EQ(record.overlayType, kNoOverlay);
@@ -102,7 +99,7 @@ TEST_F(OverrideGenerationTest, WithoutAMatchTheRecordKeepsTheBaseFile) {
 // overlay built on it shows on the real daemon.)
 TEST_F(OverrideGenerationTest, DeviceOverlayIsFoundByTheModelAsAWholeField) {
     writeDevice("T12AP");
-    writeBundle(Value(baseCarrier()));
+    writeBundle(baseCarrier());
     ASSERT_TRUE(plist::writeFile(bundle() + "/overrides_T12.plist", Value(Dictionary{})));
     ASSERT_TRUE(plist::writeFile(bundle() + "/overrides_T12AP.txt", Value(Dictionary{})));
     ASSERT_TRUE(plist::writeFile(bundle() + "/overrides_X1_T12AP.plist",
@@ -120,7 +117,7 @@ TEST_F(OverrideGenerationTest, DeviceOverlayIsFoundByTheModelAsAWholeField) {
 // The hardware model is read once per process: an unknown one needs a test of its own.
 TEST_F(OverrideGenerationTest, AnUnknownModelNeedsNoOverride) {
     writeDevice(std::nullopt);
-    writeBundle(Value(baseCarrier()));
+    writeBundle(baseCarrier());
     CarrierBundle record;
     EXPECT_EQ(makeDeviceOverlayDecision(record, std::nullopt), kOverrideNotRequired);
     EXPECT_EQ(record.carrierFilePath, baseFile());
@@ -134,7 +131,8 @@ TEST_F(OverrideGenerationTest, AnUnreadableBaseMeansNoCarrierInfo) {
     EXPECT_TRUE(record.bundlePath.empty());
 
     // A base carrier file that holds no dictionary.
-    writeBundle(Value(Array{"ABC"}));
+    writeBundle({});
+    ASSERT_TRUE(plist::writeFile(baseFile(), Value(Array{"ABC"})));
     record = baseBundle();
     EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kCarrierInfoNotPresent);
     EXPECT_EQ(record.carrierFilePath, baseFile());
@@ -154,7 +152,7 @@ TEST_F(OverrideGenerationTest, EveryBehaviorIDGetsItsOwnFileInsideTheOverlayDire
         Dictionary{{"g", Dictionary{{"SupportedBehaviorIDs",
                                      Array{"abc", escaping, lookalike, withFields, tooLong}},
                                     {"OverrideConfiguration", Dictionary{{"Name", "X"}}}}}});
-    writeBundle(Value(carrier));
+    writeBundle(carrier);
 
     std::set<std::string> files;
     for (const std::string& id : {escaping, lookalike, withFields}) {
