@@ -199,6 +199,48 @@ std::vector<std::uint8_t> BusFixture::pack(const fs::path& directory,
     return {bytes.begin(), bytes.end()};
 }
 
+test::LocalHttpServer& BusFixture::catalogServer() {
+    if (!catalogServer_) {
+        const fs::path keys = device_.base() / "keys";
+        fs::create_directories(keys);
+        CommandResult made = runCommand({TAVRIX_CATALOG_TOOL, "keygen", (keys / "secret").string(),
+                                         (keys / "public").string()});
+        EXPECT_EQ(made.status, 0) << made.output;
+        catalogServer_.emplace().serveDirectory("/updates/", site());
+        std::string publicKey = test::readText(keys / "public");
+        writeCatalogSettings({{"PublicKey", publicKey.substr(0, publicKey.find('\n'))}});
+    }
+    return *catalogServer_;
+}
+
+std::string BusFixture::publishSigned(const fs::path& bundle) {
+    catalogServer();
+    CommandResult run =
+        runCommand({TAVRIX_CATALOG_TOOL, "publish", site().string(), "--key",
+                    (device_.base() / "keys/secret").string(), "--fresh", bundle.string()});
+    EXPECT_EQ(run.status, 0) << run.output;
+    auto catalog = plist::readFile((site() / "catalog.plist").string());
+    const plist::Value* assets = catalog ? catalog->find("Assets") : nullptr;
+    return assets != nullptr && !assets->asArray()->empty()
+               ? "/updates/" + *assets->asArray()->front().find("ArchiveURL")->asString()
+               : "(not listed)";
+}
+
+void BusFixture::writeCatalogSettings(plist::Dictionary typeSettings) const {
+    typeSettings.insert_or_assign("CatalogURL", catalogServer_->url("/updates/catalog.plist"));
+    const plist::Dictionary types{{"com.zandor.Grellas.TavrixBundles", std::move(typeSettings)}};
+    EXPECT_TRUE(plist::writeFile(at("/etc/tavrix/AssetCatalog.plist").string(),
+                                 plist::Value(plist::Dictionary{{"AssetTypes", types}})));
+}
+
+void BusFixture::holdPublished(const std::string& urlPath, double part) {
+    test::LocalHttpServer::Response held;
+    held.body = test::readText(site() / urlPath.substr(std::string("/updates/").size()));
+    held.holdAfterBodyBytes =
+        static_cast<std::size_t>(static_cast<double>(held.body.size()) * part);
+    catalogServer().serve(urlPath, held);
+}
+
 bool BusFixture::killDaemon(pid_t pid) {
     killed_.insert(pid);
     return ::kill(pid, SIGKILL) == 0 && waitForDaemonExit(pid).has_value();

@@ -17,6 +17,7 @@
 #include <string_view>
 #include <vector>
 
+#include "LocalHttpServer.h"
 #include "PrivateBus.h"
 #include "client/TavrixClient.h"
 #include "plist/Value.h"
@@ -146,6 +147,18 @@ class BusFixture : public ::testing::Test {
     // The directory's content packed by bsdtar with these options, as a sender packs a bundle.
     std::vector<std::uint8_t> pack(const std::filesystem::path& directory,
                                    const std::vector<std::string>& options = {"-z"}) const;
+    // The catalog site the device trusts, made on first use: a signing key of its own, the site
+    // directory served on 127.0.0.1 under /updates/, and the device's catalog settings naming it
+    // with the key in the single-key form.
+    test::LocalHttpServer& catalogServer();
+    std::filesystem::path site() const { return device_.base() / "site"; }
+    // Publishes the bundle directory, signed, as the only asset of the catalog; answers the URL
+    // path of its archive.
+    std::string publishSigned(const std::filesystem::path& bundle);
+    // The device's catalog settings: the bundle type at the site, with these settings (keys).
+    void writeCatalogSettings(plist::Dictionary typeSettings) const;
+    // The site's file at urlPath served held after that part of its bytes, until released.
+    void holdPublished(const std::string& urlPath, double part);
     const std::string& busAddress() const { return bus_->address(); }
     BusWatcher& watcher() { return *watcher_; }
     // A new client of the daemon with a connection of its own.
@@ -194,6 +207,7 @@ class BusFixture : public ::testing::Test {
     std::set<pid_t> killed_;
     std::unique_ptr<test::PrivateBus> bus_;
     std::unique_ptr<BusWatcher> watcher_;
+    std::optional<test::LocalHttpServer> catalogServer_;
 };
 
 }  // namespace tavrix::integration

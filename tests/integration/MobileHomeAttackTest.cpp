@@ -17,7 +17,6 @@
 #include <sstream>
 
 #include "BusFixture.h"
-#include "LocalHttpServer.h"
 #include "TestSupport.h"
 #include "plist/PropertyListFormat.h"
 
@@ -198,28 +197,9 @@ class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInter
 
     // Version 13 published in a signed catalog on 127.0.0.1 that the device trusts.
     void publishSignedUpdate() {
-        const fs::path keys = device().base() / "keys";
-        const fs::path site = device().base() / "site";
-        fs::create_directories(keys);
-        CommandResult run = runCommand({TAVRIX_CATALOG_TOOL, "keygen", (keys / "secret").string(),
-                                        (keys / "public").string()});
-        ASSERT_EQ(run.status, 0) << run.output;
         const fs::path bundle = device().base() / "bundles/13/Default.bundle";
         writeBundle(bundle, "13", {{"CarrierName", "Bundle 13"}});
-        run = runCommand({TAVRIX_CATALOG_TOOL, "publish", site.string(), "--key",
-                          (keys / "secret").string(), "--fresh", bundle.string()});
-        ASSERT_EQ(run.status, 0) << run.output;
-        server_.serveDirectory("/updates/", site);
-        std::string publicKey = test::readText(keys / "public");
-        publicKey.pop_back();
-        ASSERT_TRUE(plist::writeFile(
-            at("/etc/tavrix/AssetCatalog.plist").string(),
-            plist::Value(plist::Dictionary{
-                {"AssetTypes",
-                 plist::Dictionary{
-                     {"com.zandor.Grellas.TavrixBundles",
-                      plist::Dictionary{{"CatalogURL", server_.url("/updates/catalog.plist")},
-                                        {"PublicKey", publicKey}}}}}})));
+        publishSigned(bundle);
     }
 
     // Both links are the daemon's own and lead into the user bundle of this version.
@@ -283,7 +263,6 @@ class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInter
 
     std::pair<uid_t, gid_t> daemon_;
     std::pair<uid_t, gid_t> mobile_;
-    test::LocalHttpServer server_;
 };
 
 TEST_P(MobileHomeAttackTest, TheDaemonInstallsAndTrustsOnlyItsOwn) {

@@ -8,6 +8,7 @@
 #include <sys/statvfs.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cmath>
 #include <cstdlib>
 #include <filesystem>
@@ -22,7 +23,6 @@
 #include "BusFixture.h"
 #include "BusMonitor.h"
 #include "FileSystemTrace.h"
-#include "LocalHttpServer.h"
 #include "TestSupport.h"
 #include "bus/BackgroundJobScheduler.h"
 #include "daemon/UpdateCheckScheduler.h"
@@ -48,29 +48,12 @@ class OverTheAirUpdateTest : public BusFixture {
   protected:
     void SetUp() override {
         BusFixture::SetUp();
-        fs::create_directories(keys_);
-        CommandResult keys = runCommand(
-            {TAVRIX_CATALOG_TOOL, "keygen", secretKey().string(), (keys_ / "public").string()});
-        ASSERT_EQ(keys.status, 0) << keys.output;
-        server.serveDirectory("/updates/", site());
-        // The device trusts the publisher's key, in the single-key form.
-        std::string publicKey = readText(keys_ / "public");
-        publicKey.pop_back();  // the line break
-        plist::Dictionary type{{"CatalogURL", server.url("/updates/catalog.plist")},
-                               {"PublicKey", publicKey}};
-        ASSERT_TRUE(plist::writeFile(
-            at("/etc/tavrix/AssetCatalog.plist").string(),
-            plist::Value(plist::Dictionary{
-                {"AssetTypes",
-                 plist::Dictionary{{"com.zandor.Grellas.TavrixBundles", std::move(type)}}}})));
         // A check already armed a few days ahead, so that every re-arm shows.
         device().writeDaemonPreferences(
             {{"EnableSupport", true}, {"NextUpdate", plist::Date{now() + 3 * kOneDay}}});
     }
 
     static double now() { return Clock::absoluteTimeNow(); }
-    fs::path site() { return device().base() / "site"; }
-    fs::path secretKey() { return keys_ / "secret"; }
 
     // A bundle: its Info.plist, the base carrier file naming the version, one file of its own and,
     // when asked, a large file of bulkBytes that does not compress.
@@ -91,47 +74,9 @@ class OverTheAirUpdateTest : public BusFixture {
         ASSERT_TRUE(client().setTavrixID(kBehaviorID, pack(writeBundle(version))));
     }
 
-    // Publishes the bundle of this version, signed, as the only asset of the catalog; answers
-    // the archive's URL path.
+    // Publishes the bundle of this version; answers the archive's URL path.
     std::string publish(const std::string& version, std::size_t bulkBytes = 0) {
-        CommandResult run =
-            runCommand({TAVRIX_CATALOG_TOOL, "publish", site().string(), "--key",
-                        secretKey().string(), "--fresh", writeBundle(version, bulkBytes).string()});
-        EXPECT_EQ(run.status, 0) << run.output;
-        return "/updates/" + archiveListedFor(version);
-    }
-
-    // The archive URL the published catalog lists for this version, relative to the site.
-    std::string archiveListedFor(const std::string& version) {
-        std::optional<plist::Value> catalog = plist::readFile((site() / "catalog.plist").string());
-        const plist::Value* assets = catalog ? catalog->find("Assets") : nullptr;
-        for (const plist::Value& asset : assets ? *assets->asArray() : plist::Array()) {
-            if (*asset.find("Attributes")->find("Version") == plist::Value(version)) {
-                return *asset.find("ArchiveURL")->asString();
-            }
-        }
-        return "(not listed)";
-    }
-
-    // The device trusts these keys (identifier to the public key file keygen wrote).
-    void trustKeys(const std::map<std::string, fs::path>& keys) {
-        plist::Dictionary trusted;
-        for (const auto& [identifier, file] : keys) {
-            std::string publicKey = readText(file);
-            publicKey.pop_back();  // the line break
-            trusted.emplace(identifier, publicKey);
-        }
-        plist::Dictionary type{{"CatalogURL", server.url("/updates/catalog.plist")},
-                               {"TrustedKeys", std::move(trusted)}};
-        ASSERT_TRUE(plist::writeFile(
-            at("/etc/tavrix/AssetCatalog.plist").string(),
-            plist::Value(plist::Dictionary{
-                {"AssetTypes",
-                 plist::Dictionary{{"com.zandor.Grellas.TavrixBundles", std::move(type)}}}})));
-    }
-
-    fs::path published(const std::string& urlPath) {
-        return site() / urlPath.substr(std::string("/updates/").size());
+        return publishSigned(writeBundle(version, bulkBytes));
     }
 
     // Every entry of the user bundle: directories, and files with their content.
@@ -148,18 +93,14 @@ class OverTheAirUpdateTest : public BusFixture {
         return names;
     }
 
-    std::optional<double> nextUpdate() {
-        auto next = device().daemonPreference("NextUpdate");
-        return next && next->asDate() ? std::optional(next->asDate()->secondsSinceReferenceDate)
-                                      : std::nullopt;
-    }
-
     // Waits until "NextUpdate" is within a minute of now + seconds.
     bool waitForNextUpdateIn(double seconds, std::chrono::milliseconds timeout = 10s) {
         return pollUntil(
             [&] {
-                auto next = nextUpdate();
-                return next && std::fabs(*next - (now() + seconds)) < 60.0;
+                auto next = device().daemonPreference("NextUpdate");
+                return next && next->asDate() &&
+                       std::fabs(next->asDate()->secondsSinceReferenceDate - (now() + seconds)) <
+                           60.0;
             },
             timeout);
     }
@@ -177,45 +118,26 @@ class OverTheAirUpdateTest : public BusFixture {
         EXPECT_TRUE(pollUntil([&] { return !fs::exists(at(kPendingInstall)); }, 10s));
     }
 
-    // tavrixctl with --json at the end of the line, where global options may also go; its
-    // answer parsed by Python's strict parser (malformed output or trailing text fails) and
-    // flattened: "LinkedBundle.Version" to "2", a dictionary to "{}", booleans as true or false.
-    std::map<std::string, std::string> tavrixctlJson(std::vector<std::string> arguments,
-                                                     int expectedStatus = 0) {
+    // tavrixctl with --json at the end of the line, where global options may also go; its answer
+    // parsed strictly (malformed output or trailing text fails).
+    nlohmann::json tavrixctlJson(std::vector<std::string> arguments, int expectedStatus = 0) {
         arguments.insert(arguments.begin(), {TAVRIX_CTL_PATH, "--address", busAddress()});
         arguments.push_back("--json");
         CommandResult run = runCommand(arguments);
         EXPECT_EQ(run.status, expectedStatus) << run.output;
-        const fs::path answerFile = device().base() / "answer.json";
-        writeText(answerFile, run.output);
-        CommandResult flat = runCommand({"/usr/bin/python3", "-c", R"(import json, sys
-def walk(prefix, value):
-    for key, item in value.items():
-        text = "{}" if isinstance(item, dict) else item if isinstance(item, str) else json.dumps(item)
-        print(prefix + key + "=" + text)
-        if isinstance(item, dict):
-            walk(prefix + key + ".", item)
-walk("", json.load(open(sys.argv[1]))))",
-                                         answerFile.string()});
-        EXPECT_EQ(flat.status, 0) << run.output << flat.output;
-        std::map<std::string, std::string> answer;
-        std::istringstream lines(flat.output);
-        for (std::string line; std::getline(lines, line);) {
-            answer[line.substr(0, line.find('='))] = line.substr(line.find('=') + 1);
-        }
-        return answer;
+        return nlohmann::json::parse(run.output);
     }
 
-    static std::string textAt(const std::map<std::string, std::string>& answer,
-                              const std::string& key) {
-        auto found = answer.find(key);
-        return found == answer.end() ? "(absent)" : found->second;
+    // The value at a path such as "LinkedBundle.Version": text as it is, anything else as JSON.
+    static std::string textAt(const nlohmann::json& answer, std::string path) {
+        std::replace(path.begin(), path.end(), '.', '/');
+        const nlohmann::json::json_pointer pointer("/" + path);
+        return !answer.contains(pointer)     ? "(absent)"
+               : answer[pointer].is_string() ? answer[pointer].get<std::string>()
+                                             : answer[pointer].dump();
     }
 
-    test::LocalHttpServer server;
-
-  private:
-    fs::path keys_ = device().base() / "keys";
+    test::LocalHttpServer& server = catalogServer();
 };
 
 // The operator's view after each step, as scripts read it: a payload; version 2 published and
@@ -241,11 +163,8 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
 
     const std::string archive = publish("2");
-    test::LocalHttpServer::Response held;
-    held.body = readText(published(archive));
-    held.holdAfterBodyBytes = held.body.size() / 2;
-    server.serve(archive, held);
-    std::map<std::string, std::string> check;
+    holdPublished(archive, 0.5);
+    nlohmann::json check;
     std::thread operatorCheck([&] { check = tavrixctlJson({"check-update", "--wait", "30"}); });
     ASSERT_TRUE(server.waitForHeldResponse(30s));
     EXPECT_FALSE(client().checkForTavrixBundleUpdate());
@@ -350,7 +269,7 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheNextOneInstalls) {
         EXPECT_FALSE(watcher().waitForNotification(kChanged, 2, 200ms));
     };
 
-    fs::path archive = published(publish("2"));
+    fs::path archive = site() / publish("2").substr(std::string("/updates/").size());
     std::string bytes = readText(archive);
     bytes[bytes.size() / 2] = static_cast<char>(bytes[bytes.size() / 2] ^ 0x55);
     writeText(archive, bytes);
@@ -389,10 +308,7 @@ TEST_F(OverTheAirUpdateTest, CheckAnsweredWhileTheDaemonLeavesIsInstalledBeforeI
     ASSERT_TRUE(pid);
 
     publish("2");
-    test::LocalHttpServer::Response held;
-    held.body = readText(site() / "catalog.plist");
-    held.holdAfterBodyBytes = held.body.size() / 2;
-    server.serve("/updates/catalog.plist", held);
+    holdPublished("/updates/catalog.plist", 0.5);
     auto answer =
         std::async(std::launch::async, [this] { return client().checkForTavrixBundleUpdate(); });
     ASSERT_TRUE(server.waitForHeldResponse(10s));
@@ -489,11 +405,8 @@ TEST_F(OverTheAirUpdateTest, DaemonStartedWhileTheLastOneDrainsActsAfterIt) {
         const auto pid = daemonPid();
         ASSERT_TRUE(pid);
         const std::string archive = publish(update, kBulk);
-        test::LocalHttpServer::Response held;
-        held.body = readText(published(archive));
-        held.holdAfterBodyBytes = held.body.size() / 2;
         server.holdAgain();
-        server.serve(archive, held);
+        holdPublished(archive, 0.5);
         ASSERT_TRUE(client().checkForTavrixBundleUpdate());
         ASSERT_TRUE(server.waitForHeldResponse(10s));
         ASSERT_EQ(::kill(*pid, SIGTERM), 0);
@@ -644,10 +557,7 @@ TEST_F(OverTheAirKeepAliveTest, ScheduledCheckKeepsTheDaemonUntilTheDownloadIsIn
     ASSERT_EQ(waitForDaemonExit(*first), std::optional<int>(0));
 
     const std::string archive = publish("2");
-    test::LocalHttpServer::Response held;
-    held.body = readText(published(archive));
-    held.holdAfterBodyBytes = held.body.size() / 3;
-    server.serve(archive, held);
+    holdPublished(archive, 1.0 / 3);
     test::LocalHttpServer::Response slowCatalog;
     slowCatalog.body = readText(site() / "catalog.plist");
     // About 18 s: past the first pass of the run loop.
@@ -755,6 +665,16 @@ class ReleaseTrainTest : public OverTheAirUpdateTest {
         return "";
     }
 
+    // The device trusts these keys (identifier to the public key file keygen wrote).
+    void trustKeys(const std::map<std::string, fs::path>& keys) {
+        plist::Dictionary trusted;
+        for (const auto& [identifier, file] : keys) {
+            const std::string publicKey = readText(file);
+            trusted.emplace(identifier, publicKey.substr(0, publicKey.find('\n')));
+        }
+        writeCatalogSettings({{"TrustedKeys", std::move(trusted)}});
+    }
+
     std::vector<std::pair<std::string, std::string>> steps_ = documentedSteps();
 };
 
@@ -819,14 +739,12 @@ TEST_F(ReleaseTrainTest, TheDocumentedReleaseTrainRunsAgainstADevice) {
 
     // This device fetches the catalog naming version 3 just before it is withdrawn.
     runStep("publish-next");
-    const std::string archive3 = archiveListedFor("3");
-    test::LocalHttpServer::Response heldCatalog;
-    heldCatalog.body = readText(site() / "catalog.plist");
-    heldCatalog.holdAfterBodyBytes = heldCatalog.body.size() / 2;
-    test::LocalHttpServer::Response signature;
-    signature.body = readText(site() / "catalog.plist.sig");
-    server.serve("/updates/catalog.plist", heldCatalog);
-    server.serve("/updates/catalog.plist.sig", signature);
+    std::string archive3;
+    for (const auto& [name, content] : test::snapshotTree(site() / "archives")) {
+        archive3 = archives.contains(name) ? archive3 : "archives/" + name;
+    }
+    holdPublished("/updates/catalog.plist", 0.5);
+    holdPublished("/updates/catalog.plist.sig", 1);  // the signature as it is now
     auto answer =
         std::async(std::launch::async, [this] { return client().checkForTavrixBundleUpdate(); });
     ASSERT_TRUE(server.waitForHeldResponse(30s));
