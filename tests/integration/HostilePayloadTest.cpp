@@ -14,6 +14,7 @@
 #include <set>
 
 #include "BusFixture.h"
+#include "HostilePropertyLists.h"
 #include "TestSupport.h"
 #include "plist/PropertyListFormat.h"
 
@@ -30,52 +31,6 @@ constexpr long kMaxResidentKiB = 640 * 1024;
 #else
 constexpr long kMaxResidentKiB = 160 * 1024;
 #endif
-
-// A binary property list laid out by hand, because no writer produces these shapes: depth arrays,
-// each holding the next one copies times (fewer than 15), and a string at the bottom. One copy
-// nests as deep as there are arrays; with two, 40 arrays in 364 bytes expand to 2^40 nodes.
-std::string nestedBinaryList(std::uint32_t depth, std::uint32_t copies) {
-    const std::size_t count = depth + 1;
-    const int refSize = count > 0xFF ? 2 : 1;
-    std::string bytes = "bplist00";
-    std::vector<std::uint64_t> offsets;
-    auto putBigEndian = [&bytes](std::uint64_t value, int size) {
-        for (int shift = (size - 1) * 8; shift >= 0; shift -= 8) {
-            bytes += static_cast<char>((value >> shift) & 0xFF);
-        }
-    };
-    for (std::uint32_t i = 0; i < depth; ++i) {
-        offsets.push_back(bytes.size());
-        bytes += static_cast<char>(0xA0 | copies);
-        for (std::uint32_t copy = 0; copy < copies; ++copy) {
-            putBigEndian(i + 1, refSize);
-        }
-    }
-    offsets.push_back(bytes.size());
-    bytes += "\x51x";  // the one-letter ASCII string "x"
-    const std::uint64_t tableOffset = bytes.size();
-    for (std::uint64_t offset : offsets) {
-        putBigEndian(offset, 4);
-    }
-    bytes += std::string(6, '\0');
-    bytes += static_cast<char>(4);
-    bytes += static_cast<char>(refSize);
-    putBigEndian(count, 8);
-    putBigEndian(0, 8);
-    putBigEndian(tableOffset, 8);
-    return bytes;
-}
-
-std::string deepXmlList(std::size_t depth) {
-    std::string xml = "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\">";
-    for (std::size_t i = 0; i < depth; ++i) {
-        xml += "<array>";
-    }
-    for (std::size_t i = 0; i < depth; ++i) {
-        xml += "</array>";
-    }
-    return xml + "</plist>\n";
-}
 
 // A carrier file listing many IDs for one large configuration.
 plist::Dictionary manyIDsCarrierFile() {
@@ -114,13 +69,19 @@ const HostileCase kCases[] = {
     {"FifoAsCarrierFile", [](const fs::path& b) { replaceWithFifo(b / "behavior.plist"); }},
     {"FifoAsInfo", [](const fs::path& b) { replaceWithFifo(b / "Info.plist"); }},
     {"DeepXmlCarrierFile",
-     [](const fs::path& b) { test::writeText(b / "behavior.plist", deepXmlList(200000)); }},
+     [](const fs::path& b) { test::writeText(b / "behavior.plist", test::nestedXml(200000)); }},
     {"DeepBinaryCarrierFile",
-     [](const fs::path& b) { test::writeText(b / "behavior.plist", nestedBinaryList(30000, 1)); }},
+     [](const fs::path& b) {
+         test::writeText(b / "behavior.plist", test::nestedBinaryList(30000, 1));
+     }},
     {"DeepBinaryInfo",
-     [](const fs::path& b) { test::writeText(b / "Info.plist", nestedBinaryList(30000, 1)); }},
+     [](const fs::path& b) {
+         test::writeText(b / "Info.plist", test::nestedBinaryList(30000, 1));
+     }},
     {"SelfSharingBinaryCarrierFile",
-     [](const fs::path& b) { test::writeText(b / "behavior.plist", nestedBinaryList(40, 2)); }},
+     [](const fs::path& b) {
+         test::writeText(b / "behavior.plist", test::nestedBinaryList(40, 2));
+     }},
     {"SparseHugeCarrierFile",
      [](const fs::path& b) { fs::resize_file(b / "behavior.plist", std::uintmax_t{100} << 30); }},
     {"ManyIDsForOneConfiguration",

@@ -1,12 +1,13 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include <cerrno>
 #include <climits>
 #include <cmath>
 #include <cstdlib>
 #include <functional>
 
+#include "HostilePropertyLists.h"
+#include "PrivateBus.h"
 #include "TestSupport.h"
 #include "plist/PropertyListBounds.h"
 #include "plist/PropertyListFormat.h"
@@ -135,73 +136,6 @@ INSTANTIATE_TEST_SUITE_P(BothFormats, EitherFormat, testing::Values(Format::Xml,
                              return info.param == Format::Xml ? "Xml" : "Binary";
                          });
 
-// A binary property list of the given encoded objects, the first one at the top, with 4-byte
-// offsets and 2-byte references.
-std::string binaryList(const std::vector<std::string>& objects) {
-    std::string bytes = "bplist00";
-    std::string table;
-    auto bigEndian = [](std::uint64_t value, int width) {
-        std::string out;
-        for (int shift = (width - 1) * 8; shift >= 0; shift -= 8) {
-            out += static_cast<char>((value >> shift) & 0xff);
-        }
-        return out;
-    };
-    for (const std::string& object : objects) {
-        table += bigEndian(bytes.size(), 4);
-        bytes += object;
-    }
-    std::uint64_t tableOffset = bytes.size();
-    bytes += table;
-    bytes += std::string(6, '\0') + '\x04' + '\x02';
-    bytes += bigEndian(objects.size(), 8) + bigEndian(0, 8) + bigEndian(tableOffset, 8);
-    return bytes;
-}
-
-// An array object referring to the given objects (fewer than 15).
-std::string arrayOf(std::initializer_list<std::uint16_t> refs) {
-    std::string object(1, static_cast<char>(0xA0 | refs.size()));
-    for (std::uint16_t ref : refs) {
-        object += static_cast<char>(ref >> 8);
-        object += static_cast<char>(ref & 0xff);
-    }
-    return object;
-}
-
-std::string nestedXml(int depth) {
-    std::string xml = "<plist>";
-    for (int i = 0; i < depth; ++i) {
-        xml += "<array>";
-    }
-    for (int i = 0; i < depth; ++i) {
-        xml += "</array>";
-    }
-    return xml + "</plist>";
-}
-
-// Arrays whose attribute text ends in "/>": libplist reads them as open elements.
-std::string quotedSlashXml(int depth) {
-    std::string xml = "<plist>";
-    for (int i = 0; i < depth; ++i) {
-        xml += "<array x=\"/>\">";
-    }
-    for (int i = 0; i < depth; ++i) {
-        xml += "</array>";
-    }
-    return xml + "</plist>";
-}
-
-// depth arrays inside each other (a chain), or each referring twice to the next one (shared).
-std::string binaryChain(int length, bool shared) {
-    std::vector<std::string> objects;
-    for (int i = 0; i + 1 < length; ++i) {
-        auto next = static_cast<std::uint16_t>(i + 1);
-        objects.push_back(shared ? arrayOf({next, next}) : arrayOf({next}));
-    }
-    objects.push_back("\x51x");
-    return binaryList(objects);
-}
-
 // Whatever a file holds, reading it answers promptly with a value or a reason, never waits, runs
 // out of memory or crashes; the daemon's reader logs the reason with the file's name. (FIFOs and
 // deep or self-sharing nesting are refused on the real daemon too.)
@@ -220,17 +154,21 @@ TEST(PropertyListDamage, HostileFilesAreRefusedWithAReason) {
          [](const std::string& path) { std::filesystem::create_symlink("/dev/zero", path); },
          "not a regular file"},
         {"a byte over the cap", bytes(std::string(kMaxPropertyListBytes + 1, ' ')), "larger than"},
-        {"deep XML whose tags look self-closing", bytes(quotedSlashXml(600)), "deeper than 512"},
-        {"binary array inside itself", bytes(binaryList({arrayOf({0})})), "contains itself"},
+        // Attribute text ending in "/>" makes libplist read the arrays as open elements.
+        {"deep XML whose tags look self-closing", bytes(test::nestedXml(600, " x=\"/>\"")),
+         "deeper than 512"},
+        {"binary array inside itself", bytes(test::binaryList({test::arrayOf({0})})),
+         "contains itself"},
         {"binary key with a NUL",
-         bytes(binaryList({std::string("\xD1\x00\x01\x00\x02", 5),
-                           std::string("\x53"
-                                       "a\0b",
-                                       4),
-                           "\x09"})),
+         bytes(test::binaryList({std::string("\xD1\x00\x01\x00\x02", 5),
+                                 std::string("\x53"
+                                             "a\0b",
+                                             4),
+                                 "\x09"})),
          "NUL"},
-        {"binary offset past the end", bytes(binaryList({arrayOf({7})})), "no object"},
-        {"XML cut short", bytes(nestedXml(3).substr(0, 20)), "not a complete XML property list"},
+        {"binary offset past the end", bytes(test::binaryList({test::arrayOf({7})})), "no object"},
+        {"XML cut short", bytes(test::nestedXml(3).substr(0, 20)),
+         "not a complete XML property list"},
     };
     CapturingLogSink sink;
     ScopedLogSink capture(sink);
@@ -247,11 +185,38 @@ TEST(PropertyListDamage, HostileFilesAreRefusedWithAReason) {
                                                             refusal.reason + "; ignoring it"});
     }
     // Just inside the limits, shared binary objects and deep nesting still read.
-    EXPECT_TRUE(parse(nestedXml(512)).has_value());
-    EXPECT_TRUE(parse(binaryChain(512, false)).has_value());
-    EXPECT_TRUE(parse(binaryChain(16, true)).has_value());
-    EXPECT_FALSE(parse(nestedXml(513)).has_value());
-    EXPECT_FALSE(parse(binaryChain(513, false)).has_value());
+    EXPECT_TRUE(parse(test::nestedXml(512)).has_value());
+    EXPECT_TRUE(parse(test::nestedBinaryList(511, 1)).has_value());
+    EXPECT_TRUE(parse(test::nestedBinaryList(15, 2)).has_value());
+    EXPECT_FALSE(parse(test::nestedXml(513)).has_value());
+    EXPECT_FALSE(parse(test::nestedBinaryList(512, 1)).has_value());
+}
+
+// tavrix-plist in a pipeline, as scripts use it: "-" for standard input and output, and JSON that
+// Python's json module reads with every kind of value still apart.
+TEST(PlistTool, PipesThroughStandardStreamsAndKeepsTypesInJson) {
+    test::TempDir directory;
+    const std::string source = directory / "in.plist";
+    test::writeText(source,
+                    "<plist version=\"1.0\"><dict><key>n</key><integer>1500</integer>"
+                    "<key>s</key><string>1500</string><key>r</key><real>1500</real>"
+                    "<key>d</key><data>AAEC/w==</data>"
+                    "<key>t</key><date>2026-12-07T23:49:17Z</date></dict></plist>");
+    const std::string tool = "'" TAVRIX_PLIST_TOOL "'";
+    // XML in, binary through a pipe, typed JSON out, read by Python.
+    auto [status, output] = test::runCommand(
+        {"/bin/bash", "-c",
+         "set -o pipefail; " + tool + " --binary '" + source + "' - | " + tool +
+             " --json=pretty - | /usr/bin/python3 -c 'import json, sys; v = json.load(sys.stdin); "
+             "print(repr(v[\"n\"]), repr(v[\"s\"]), repr(v[\"r\"]), v[\"d\"], v[\"t\"])'"});
+    EXPECT_EQ(status, 0) << output;
+    EXPECT_EQ(output,
+              "1500 '1500' 1500.0 {'$data': 'AAEC/w=='} {'$date': '2026-12-07T23:49:17Z'}\n");
+
+    auto [refusedStatus, refused] =
+        test::runCommand({"/bin/bash", "-c", "echo 'not a plist' | " + tool + " -"});
+    EXPECT_EQ(refusedStatus, 1) << refused;
+    EXPECT_EQ(refused, "tavrix-plist: standard input: it is not a complete XML property list\n");
 }
 
 }  // namespace
