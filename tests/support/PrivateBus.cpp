@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <signal.h>
 #include <spawn.h>
+#include <sys/mman.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -53,14 +54,15 @@ std::string quoted(const fs::path& path) {
     return "'" + path.string() + "'";
 }
 
-// Starts argv[0] (a path, or a name looked up in PATH) with stdin from /dev/null, stdout and
-// stderr to out, and fd 3 to extra when given.
-pid_t spawn(const std::vector<std::string>& argv, int out, int extra, char** environment) {
+// Starts argv[0] (a path, or a name looked up in PATH) with stdin from /dev/null, stdout to out,
+// stderr to errors, and fd 3 to extra when given.
+pid_t spawn(const std::vector<std::string>& argv, int out, int errors, int extra,
+            char** environment) {
     posix_spawn_file_actions_t actions;
     posix_spawn_file_actions_init(&actions);
     posix_spawn_file_actions_addopen(&actions, 0, "/dev/null", O_RDONLY, 0);
     posix_spawn_file_actions_adddup2(&actions, out, 1);
-    posix_spawn_file_actions_adddup2(&actions, out, 2);
+    posix_spawn_file_actions_adddup2(&actions, errors, 2);
     if (extra >= 0) {
         posix_spawn_file_actions_adddup2(&actions, extra, 3);
     }
@@ -86,14 +88,18 @@ int waitForExit(pid_t pid) {
 
 }  // namespace
 
-CommandResult runCommand(const std::vector<std::string>& argv) {
+CommandResult runCommand(const std::vector<std::string>& argv, bool errorsApart) {
     int ends[2];
     if (argv.empty() || ::pipe2(ends, O_CLOEXEC) != 0) {
         return {};
     }
     io::UniqueFd readEnd(ends[0]);
     io::UniqueFd writeEnd(ends[1]);
-    const pid_t pid = spawn(argv, writeEnd.get(), -1, environ);
+    // A file in memory, read once the command has ended: a second pipe could fill while the first
+    // one is read.
+    io::UniqueFd errors(errorsApart ? ::memfd_create("errors", MFD_CLOEXEC) : -1);
+    const pid_t pid =
+        spawn(argv, writeEnd.get(), errors ? errors.get() : writeEnd.get(), -1, environ);
     // Only the child may hold the write end, or the read below never sees the end.
     writeEnd.reset();
     CommandResult result;
@@ -109,6 +115,7 @@ CommandResult runCommand(const std::vector<std::string>& argv) {
         }
     }
     result.status = waitForExit(pid);
+    result.errors = errors ? readText("/proc/self/fd/" + std::to_string(errors.get())) : "";
     return result;
 }
 
@@ -189,7 +196,7 @@ PrivateBus::PrivateBus(const std::optional<ActivatedDaemon>& daemon,
     environment.push_back(nullptr);
     pid_ = spawn({"dbus-daemon", "--config-file=" + (directory / "bus.conf").string(), "--nofork",
                   "--print-address=3"},
-                 logFile.get(), addressWrite.get(), environment.data());
+                 logFile.get(), logFile.get(), addressWrite.get(), environment.data());
     addressWrite.reset();
     // The first line it prints, or nothing when it ends (or never started) first.
     std::unique_ptr<FILE, int (*)(FILE*)> in(::fdopen(addressRead.release(), "r"), &std::fclose);

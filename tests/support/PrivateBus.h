@@ -20,10 +20,11 @@ namespace tavrix::test {
 struct CommandResult {
     // The exit status, 128 + the signal number when killed, -1 when it could not be started.
     int status = -1;
-    std::string output;  // stdout and stderr together
+    std::string output;  // stdout, and stderr unless kept apart
+    std::string errors;  // stderr, when kept apart
 };
 // Runs argv (argv[0] a path) to its end with the test's environment.
-CommandResult runCommand(const std::vector<std::string>& argv);
+CommandResult runCommand(const std::vector<std::string>& argv, bool errorsApart = false);
 
 // Throws std::runtime_error naming what failed when result is an error.
 void check(int result, const char* what);

@@ -14,8 +14,8 @@
 #include <tuple>
 
 #include "ArchiveFixtures.h"
-#include "CatalogToolRunner.h"
 #include "LocalHttpServer.h"
+#include "PrivateBus.h"
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
 #include "catalog/AssetCatalog.h"
@@ -107,10 +107,10 @@ class AssetCatalogTest : public testing::Test {
         server.serveDirectory("/catalog/", work.path() / "out");
     }
 
-    int tool(const std::vector<std::string>& arguments) {
-        test::ToolRun run = test::runCatalogTool(arguments);
-        EXPECT_EQ(run.status, 0) << run.errors;
-        return run.status;
+    void tool(std::vector<std::string> arguments) {
+        arguments.insert(arguments.begin(), TAVRIX_CATALOG_TOOL);
+        test::CommandResult run = test::runCommand(arguments);
+        EXPECT_EQ(run.status, 0) << run.output;
     }
 
     // A new key pair in the work directory; answers the public key's text.

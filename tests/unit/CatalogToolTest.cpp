@@ -7,7 +7,7 @@
 #include <filesystem>
 #include <functional>
 
-#include "CatalogToolRunner.h"
+#include "PrivateBus.h"
 #include "TestSupport.h"
 #include "plist/PropertyListFormat.h"
 
@@ -15,6 +15,17 @@ namespace tavrix::test {
 namespace {
 
 namespace fs = std::filesystem;
+
+using ToolRun = CommandResult;
+
+ToolRun runTool(const char* tool, std::vector<std::string> arguments) {
+    arguments.insert(arguments.begin(), tool);
+    return runCommand(arguments, true);
+}
+
+ToolRun runCatalogTool(const std::vector<std::string>& arguments) {
+    return runTool(TAVRIX_CATALOG_TOOL, arguments);
+}
 
 class CatalogToolTest : public testing::Test {
   protected:

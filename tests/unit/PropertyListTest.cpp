@@ -181,19 +181,20 @@ TEST(PlistTool, PipesThroughStandardStreamsAndKeepsTypesInJson) {
                     "<key>t</key><date>2026-12-07T23:49:17Z</date></dict></plist>");
     const std::string tool = "'" TAVRIX_PLIST_TOOL "'";
     // XML in, binary through a pipe, typed JSON out, read by Python.
-    auto [status, output] = test::runCommand(
+    test::CommandResult piped = test::runCommand(
         {"/bin/bash", "-c",
          "set -o pipefail; " + tool + " --binary '" + source + "' - | " + tool +
              " --json=pretty - | /usr/bin/python3 -c 'import json, sys; v = json.load(sys.stdin); "
              "print(repr(v[\"n\"]), repr(v[\"s\"]), repr(v[\"r\"]), v[\"d\"], v[\"t\"])'"});
-    EXPECT_EQ(status, 0) << output;
-    EXPECT_EQ(output,
+    EXPECT_EQ(piped.status, 0) << piped.output;
+    EXPECT_EQ(piped.output,
               "1500 '1500' 1500.0 {'$data': 'AAEC/w=='} {'$date': '2026-12-07T23:49:17Z'}\n");
 
-    auto [refusedStatus, refused] =
+    test::CommandResult refused =
         test::runCommand({"/bin/bash", "-c", "echo 'not a plist' | " + tool + " -"});
-    EXPECT_EQ(refusedStatus, 1) << refused;
-    EXPECT_EQ(refused, "tavrix-plist: standard input: it is not a complete XML property list\n");
+    EXPECT_EQ(refused.status, 1);
+    EXPECT_EQ(refused.output,
+              "tavrix-plist: standard input: it is not a complete XML property list\n");
 }
 
 }  // namespace
