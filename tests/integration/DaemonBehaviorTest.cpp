@@ -1,5 +1,14 @@
 // The behavior façade as clients see it through the bus: who may set an ID, how it is stored,
 // what decides support, and where behavior settings come from.
+#include <gmock/gmock.h>
+#include <grp.h>
+#include <pwd.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <iterator>
+#include <sstream>
+
 #include "BusFixture.h"
 #include "TestSupport.h"
 #include "plist/PropertyListFormat.h"
@@ -8,6 +17,8 @@ namespace tavrix::integration {
 namespace {
 
 using DaemonBehaviorTest = BusFixture;
+using ::testing::HasSubstr;
+using ::testing::Not;
 
 // Everything else in place, a cellular radio alone refuses the ID and supports nothing.
 TEST_F(DaemonBehaviorTest, CellularDeviceRefusesTheIdAndSupportsNothing) {
@@ -110,6 +121,162 @@ TEST_F(DaemonBehaviorTest, EnableSupportDecidesSupportOnceAnIdIsSetAndWithItTheS
                   test.supported ? std::optional(limits) : std::nullopt)
             << "EnableSupport " << test.what;
     }
+}
+
+// The packaged bus policy, loaded by a bus that denies by default as the system bus does: anyone
+// may ask, only root and the policy's group may change the ID or start an update, and only the
+// daemon's user may own the name. Clients run as other users, so this needs root; they run
+// copies of tavrixctl and its library, since a private checkout is closed to other users.
+constexpr uid_t kNobody = 65534;
+// Stands in for the "tavrix" group, which the machine running the tests need not have.
+constexpr const char* kStandInGroup = "users";
+
+std::string replaceOnce(std::string text, const std::string& from, const std::string& to) {
+    auto at = text.find(from);
+    if (at == std::string::npos || text.find(from, at + 1) != std::string::npos) {
+        throw std::runtime_error("the policy should name " + from + " exactly once");
+    }
+    return text.replace(at, from.size(), to);
+}
+
+class DaemonPolicyTest : public BusFixture {
+  protected:
+    void SetUp() override {
+        if (::geteuid() != 0) {
+            GTEST_SKIP() << "running clients as other users needs root";
+        }
+        const group* standIn = ::getgrnam(kStandInGroup);
+        if (standIn == nullptr) {
+            GTEST_SKIP() << "no group \"" << kStandInGroup << "\" to stand in for \"tavrix\"";
+        }
+        standInGid_ = standIn->gr_gid;
+        copyClientForOthers();
+        if (asNobody(kNobody, {"/usr/bin/test", "-x", ctl_.string()}).status != 0) {
+            GTEST_SKIP() << "nobody cannot reach " << ctl_ << " (is $TMPDIR private?)";
+        }
+        policyFile = adaptedPolicy();
+        BusFixture::SetUp();
+    }
+
+    // The packaged policy, with the daemon's user being whoever runs the tests (the bus starts
+    // the daemon as that user) and the stand-in group for "tavrix".
+    std::filesystem::path adaptedPolicy() {
+        std::string policy = test::readText(TAVRIX_POLICY_PATH);
+        const passwd* self = ::getpwuid(::geteuid());
+        policy = replaceOnce(policy, "user=\"tavrixservicesd\"",
+                             std::string("user=\"") + self->pw_name + "\"");
+        policy =
+            replaceOnce(policy, "group=\"tavrix\"", std::string("group=\"") + kStandInGroup + "\"");
+        std::filesystem::path path = device().base() / "policy.conf";
+        test::writeText(path, policy);
+        return path;
+    }
+
+    // tavrixctl and the client library in a directory anyone may enter; the library path
+    // comes first, so the copy never reaches back into the build tree.
+    void copyClientForOthers() {
+        namespace fs = std::filesystem;
+        const fs::path directory = clientCopy_.path();
+        fs::permissions(directory, fs::perms::others_read | fs::perms::others_exec,
+                        fs::perm_options::add);
+        ctl_ = directory / "tavrixctl";
+        fs::copy_file(TAVRIX_CTL_PATH, ctl_);
+        fs::copy_file(TAVRIX_CLIENT_LIBRARY_PATH, directory / TAVRIX_CLIENT_LIBRARY_NAME);
+    }
+
+    // command run as the user nobody with the given primary group and no other groups.
+    static CommandResult asNobody(gid_t gid, const std::vector<std::string>& command) {
+        std::vector<std::string> argv = {"/usr/bin/setpriv", "--reuid=" + std::to_string(kNobody),
+                                         "--regid=" + std::to_string(gid), "--clear-groups"};
+        argv.insert(argv.end(), command.begin(), command.end());
+        return runCommand(argv);
+    }
+
+    CommandResult tavrixctlAs(gid_t gid, const std::vector<std::string>& arguments) {
+        std::vector<std::string> command = {"/usr/bin/env",
+                                            "LD_LIBRARY_PATH=" + ctl_.parent_path().string(),
+                                            ctl_.string(), "--address", busAddress()};
+        command.insert(command.end(), arguments.begin(), arguments.end());
+        return asNobody(gid, command);
+    }
+
+    gid_t standInGid_ = 0;
+    test::TempDir clientCopy_;
+    std::filesystem::path ctl_;
+};
+
+TEST_F(DaemonPolicyTest, AnyoneMayAskButOnlyPrivilegedCallersMayChange) {
+    const gid_t nogroup = kNobody;
+    for (const std::vector<std::string>& change :
+         {std::vector<std::string>{"set-id", "x"}, {"set-id", "x", "--bundle", "-"}}) {
+        auto setID = tavrixctlAs(nogroup, change);
+        EXPECT_NE(setID.status, 0) << setID.output;
+        EXPECT_THAT(setID.output, HasSubstr("AccessDenied"));
+    }
+    auto update = tavrixctlAs(nogroup, {"check-update"});
+    EXPECT_NE(update.status, 0) << update.output;
+    // One line that says who may.
+    EXPECT_THAT(update.output, HasSubstr("AccessDenied"));
+    EXPECT_THAT(update.output, HasSubstr("root and members of the \"tavrix\" group"));
+    EXPECT_EQ(std::count(update.output.begin(), update.output.end(), '\n'), 1) << update.output;
+
+    // Answered (value: there is none, hence 1), not refused.
+    for (const std::vector<std::string>& question : {std::vector<std::string>{"supported"},
+                                                     {"value", "CarrierName"},
+                                                     {"client-type", "1"},
+                                                     {"status"},
+                                                     {"show", "-p", "BehaviorID"}}) {
+        auto answer = tavrixctlAs(nogroup, question);
+        EXPECT_EQ(answer.status, question.front() == "value" ? 1 : 0)
+            << question.front() << ": " << answer.output;
+        EXPECT_THAT(answer.output, Not(HasSubstr("AccessDenied"))) << question.front();
+    }
+    // Refused calls never reached the daemon.
+    EXPECT_EQ(countLogLines("Handling Set Tavrix ID with x"), 0);
+
+    auto asGroup = tavrixctlAs(standInGid_, {"set-id", "y"});
+    EXPECT_EQ(asGroup.status, 0) << asGroup.output;
+    EXPECT_TRUE(waitForLogLine("Handling Set Tavrix ID with y"));
+    // By descriptor too (an empty payload: accepted, not extracted).
+    auto withBundle = tavrixctlAs(standInGid_, {"set-id", "w", "--bundle", "-"});
+    EXPECT_EQ(withBundle.status, 1) << withBundle.output;
+    EXPECT_THAT(withBundle.output, testing::StartsWith("yes\n"));
+    EXPECT_TRUE(waitForLogLine("Handling Set Tavrix ID with w"));
+
+    EXPECT_TRUE(client().setTavrixID("z", std::nullopt));
+}
+
+TEST_F(DaemonPolicyTest, OnlyTheDaemonsUserMayOwnTheNameOrPost) {
+    // busctl on the test's bus with the words of arguments.
+    auto busctl = [&](const std::string& arguments) {
+        std::istringstream words(arguments);
+        std::vector<std::string> argv = {"/usr/bin/busctl", "--address=" + busAddress()};
+        argv.insert(argv.end(), std::istream_iterator<std::string>(words), {});
+        return argv;
+    };
+    const auto requestName = busctl(
+        "call org.freedesktop.DBus /org/freedesktop/DBus org.freedesktop.DBus RequestName su " +
+        std::string(kDaemonBusName) + " 0");
+
+    auto refused = asNobody(kNobody, requestName);
+    EXPECT_NE(refused.status, 0) << refused.output;
+    EXPECT_THAT(refused.output, HasSubstr("Access denied"));
+
+    // The daemon's user (here the test's own) gets it: busctl becomes the primary owner (1).
+    auto owned = runCommand(requestName);
+    EXPECT_EQ(owned.status, 0) << owned.output;
+    EXPECT_EQ(owned.output, "u 1\n");
+
+    // A look-alike notification from anyone else never reaches a listener, even one that does
+    // not check the sender; the daemon's user, posting after it, gets through.
+    auto post = [&](const std::string& name) {
+        return busctl("emit /com/zandor/tavrixservicesd com.zandor.NotificationCenter Posted s " +
+                      name);
+    };
+    asNobody(kNobody, post("kTVXBehaviorBundleChangedNotification"));
+    EXPECT_EQ(runCommand(post("PolicyTestMarker")).status, 0);
+    EXPECT_TRUE(watcher().waitForNotification("PolicyTestMarker", 1, std::chrono::seconds(10)));
+    EXPECT_EQ(watcher().notificationCount("kTVXBehaviorBundleChangedNotification"), 0);
 }
 
 }  // namespace

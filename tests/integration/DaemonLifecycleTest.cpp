@@ -1,15 +1,22 @@
 // The daemon's life on the bus: started by the first call, held by its launch transaction and by
-// calls, gone when idle; a daemon that cannot serve says why and fails.
+// calls, gone when idle, every call answered across a restart; its clients counted in and out; a
+// daemon that cannot serve says why and fails.
 #include <signal.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
+#include <cerrno>
+#include <cstdint>
 #include <thread>
+#include <vector>
 
 #include "BusFixture.h"
 
 namespace tavrix::integration {
 namespace {
+
+using DaemonClientsTest = BusFixture;
 
 constexpr const char* kLaunchBegun =
     "*********** Beginning Corvex transaction : TXMinimumLaunchTransaction ***********";
@@ -137,6 +144,94 @@ TEST_F(DaemonLifecycleTest, DaemonThatCannotServeExitsWithAFailure) {
               std::string::npos)
         << taken.output;
     EXPECT_EQ(daemonLaunches().size(), 0u);
+}
+
+// Peers of the daemon: accepted on their first call, removed when they leave the bus. (Calls of
+// the wrong signature never reach the daemon's code: the bus library refuses them by the table.)
+TEST_F(DaemonClientsTest, ClientsAreCountedInOnFirstCallAndOutWhenTheyLeave) {
+    // Clients have no identifier the platform vouches for: nothing a caller chooses reaches the
+    // log.
+    const std::string name = "(null)";
+    std::optional<client::TavrixClient> first(client());
+    EXPECT_TRUE(first->setClientType(0));
+    EXPECT_TRUE(waitForLogLine("Added client: " + name + ", count: 1"));
+    {
+        auto second = client();
+        EXPECT_TRUE(second.setClientType(-7));
+        EXPECT_TRUE(second.setClientType(INT32_MAX));
+        EXPECT_TRUE(waitForLogLine("Added client: " + name + ", count: 2"));
+    }
+    EXPECT_TRUE(waitForLogLine("Removed client: " + name + ", count: 1"));
+    first.reset();
+    EXPECT_TRUE(waitForLogLine("Removed client: " + name + ", count: 0"));
+    // A later call of a known client is not a new acceptance.
+    EXPECT_EQ(countLogLines("Added client: " + name + ", count: 3"), 0);
+    EXPECT_EQ(countLogLines("*********** Beginning Corvex transaction : TXAddClientTransaction "
+                            "***********"),
+              2);
+}
+
+// Calls from several clients while the daemon leaves and the bus starts the next one: every call
+// gets its answer, whichever daemon gives it. Calls keep a daemon from going idle, so it is told to
+// leave (SIGTERM, which leaves the way an idle exit does) while the clients call back to back; each
+// call's kind is chosen by turn, and a wrong answer or an error counts as lost.
+TEST_F(DaemonLifecycleTest, NoCallIsLostWhileTheDaemonLeaves) {
+    constexpr int kClients = 8;
+    constexpr int kCallsAfterRestart = 20;
+    std::atomic<bool> go{false};         // the daemon is about to leave: call without pause
+    std::atomic<bool> restarted{false};  // a new daemon owns the name (or the wait gave up)
+    std::vector<int> calls(kClients);
+    std::vector<std::vector<std::string>> lost(kClients);
+    auto runClient = [&](client::TavrixClient caller, int number) {
+        auto callOnce = [&] {
+            const int kind = calls[number]++ % 3;
+            try {
+                if (kind == 0   ? caller.isTavrixBundleSupported()
+                    : kind == 1 ? !caller.setClientType(number)
+                                : caller.copyTavrixValue("CarrierName").has_value()) {
+                    lost[number].push_back("wrong answer to call kind " + std::to_string(kind));
+                }
+            } catch (const client::ClientError& error) {
+                lost[number].push_back(error.what());
+            }
+        };
+        callOnce();  // a client of the first daemon
+        go.wait(false);
+        while (!restarted.load()) {
+            callOnce();
+        }
+        for (int i = 0; i < kCallsAfterRestart; ++i) {
+            callOnce();
+        }
+    };
+    std::vector<std::thread> threads;
+    for (int i = 0; i < kClients; ++i) {
+        threads.emplace_back(runClient, client(), i);
+    }
+
+    const bool started = waitForNameOwner();
+    const auto first = daemonPid();
+    go = true;
+    go.notify_all();
+    std::this_thread::sleep_for(100ms);  // the clients are calling without pause by now
+    const bool signalled = first && ::kill(*first, SIGTERM) == 0;
+    const bool cameBack =
+        signalled &&
+        watcher().waitUntil(
+            [&] { return watcher().nameReleaseCount() >= 1 && !watcher().nameOwner().empty(); },
+            20s);
+    restarted = true;
+    for (std::thread& thread : threads) {
+        thread.join();
+    }
+
+    ASSERT_TRUE(started && signalled);
+    EXPECT_TRUE(cameBack) << "the daemon did not leave and come back while clients called";
+    for (int i = 0; i < kClients; ++i) {
+        EXPECT_TRUE(lost[i].empty()) << "client " << i << " lost " << lost[i].size() << " of "
+                                     << calls[i] << " calls, first: " << lost[i].front();
+    }
+    EXPECT_GE(daemonLaunches().size(), 2u);
 }
 
 }  // namespace
