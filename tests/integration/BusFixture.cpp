@@ -72,7 +72,9 @@ BusWatcher::BusWatcher(const std::string& address) : bus_(test::connectToBus(add
                      &onNameOwnerChanged},
           std::tuple{&postedSlot_,
                      "type='signal',interface='com.zandor.NotificationCenter',member='Posted'",
-                     &onPosted}}) {
+                     &onPosted},
+          std::tuple{&statusSlot_, "type='signal',path='/com/zandor/tavrixservicesd'",
+                     &onStatusSignal}}) {
         sd_bus_slot* made = nullptr;
         test::check(sd_bus_add_match(bus_.get(), &made, match, handler, this), "sd_bus_add_match");
         slot->reset(made);
@@ -111,6 +113,88 @@ int BusWatcher::onPosted(sd_bus_message* message, void* self, sd_bus_error*) {
         ++static_cast<BusWatcher*>(self)->notifications_[name];
     }
     return 0;
+}
+
+int BusWatcher::onStatusSignal(sd_bus_message* message, void* self, sd_bus_error*) {
+    auto& signals = static_cast<BusWatcher*>(self)->statusSignals_;
+    const char* first = nullptr;
+    const char* second = nullptr;
+    if (sd_bus_message_is_signal(message, kStatusInterface, "UpdateCheckFinished")) {
+        if (sd_bus_message_read(message, "ss", &first, &second) >= 0) {
+            signals.push_back({{"finished", {first, second}}});
+        }
+        return 0;
+    }
+    if (!sd_bus_message_is_signal(message, "org.freedesktop.DBus.Properties",
+                                  "PropertiesChanged") ||
+        sd_bus_message_read(message, "s", &first) < 0 ||
+        std::string_view(first) != kStatusInterface ||
+        sd_bus_message_enter_container(message, 'a', "{sv}") < 0) {
+        return 0;
+    }
+    nlohmann::json values = nlohmann::json::object();
+    while (sd_bus_message_enter_container(message, 'e', "sv") > 0 &&
+           sd_bus_message_read(message, "s", &first) >= 0 &&
+           sd_bus_message_peek_type(message, nullptr, &second) >= 0) {
+        int flag = 0;
+        std::uint64_t number = 0;
+        const std::string_view type(second);
+        values[first] = type == "s" && sd_bus_message_read(message, "v", "s", &second) >= 0
+                            ? nlohmann::json(second)
+                        : type == "b" && sd_bus_message_read(message, "v", "b", &flag) >= 0
+                            ? nlohmann::json(flag != 0)
+                        : type == "t" && sd_bus_message_read(message, "v", "t", &number) >= 0
+                            ? nlohmann::json(number)
+                            : nlohmann::json("(undocumented type)");
+        sd_bus_message_exit_container(message);
+    }
+    signals.push_back({{"changed", values}});
+    return 0;
+}
+
+std::optional<nlohmann::json> BusWatcher::takeStatusSignal(bool checkFinished) {
+    const char* kind = checkFinished ? "finished" : "changed";
+    while (statusTaken_ < statusSignals_.size()) {
+        const nlohmann::json& signal = statusSignals_[statusTaken_++];
+        if (signal.contains(kind)) {
+            return signal[kind];
+        }
+    }
+    return std::nullopt;
+}
+
+std::optional<nlohmann::json> BusWatcher::waitForStatus(const nlohmann::json& expected,
+                                                        std::chrono::milliseconds timeout) {
+    nlohmann::json announced = nlohmann::json::object();
+    auto complete = [&] {
+        for (const auto& [name, value] : expected.items()) {
+            if (!announced.contains(name) || announced[name] != value) {
+                return false;
+            }
+        }
+        return true;
+    };
+    // One signal at a time, so that what follows the last one expected stays to be taken.
+    const bool all = waitUntil(
+        [&] {
+            std::optional<nlohmann::json> changed;
+            while (!complete() && (changed = takeStatusSignal(false))) {
+                announced.update(*changed);
+            }
+            return complete();
+        },
+        timeout);
+    if (!all) {
+        ADD_FAILURE() << "announced " << announced.dump() << ", expected " << expected.dump();
+        return std::nullopt;
+    }
+    return announced;
+}
+
+std::optional<nlohmann::json> BusWatcher::nextCheckFinished(std::chrono::milliseconds timeout) {
+    std::optional<nlohmann::json> finished;
+    waitUntil([&] { return (finished = takeStatusSignal(true)).has_value(); }, timeout);
+    return finished;
 }
 
 void BusFixture::SetUp() {

@@ -11,6 +11,7 @@
 #include <functional>
 #include <map>
 #include <memory>
+#include <nlohmann/json.hpp>
 #include <optional>
 #include <set>
 #include <string>
@@ -33,6 +34,7 @@ using test::writeBundle;
 inline constexpr const char* kDaemonBusName = "com.zandor.tavrixservicesd";
 inline constexpr const char* kDaemonObjectPath = "/com/zandor/tavrixservicesd";
 inline constexpr const char* kDaemonInterface = "com.zandor.TXManagerServerInterface";
+inline constexpr const char* kStatusInterface = "com.zandor.TXManagerStatusInterface";
 inline constexpr const char* kChanged = "kTVXBehaviorBundleChangedNotification";
 // Paths of the device.
 inline constexpr const char* kSystemBundle = "/System/Library/TavrixBundles/Tablet/Default.bundle";
@@ -94,8 +96,9 @@ class DeviceRoot {
     std::string serialNumber_ = "TESTSERIAL01";
 };
 
-// The test's own connection: who owns the daemon's name and which notifications were posted.
-// Everything waits on the bus itself, never on the clock alone.
+// The test's own connection: who owns the daemon's name, which notifications were posted, and the
+// status signals, decoded here rather than by the daemon's codec. Everything waits on the bus
+// itself, never on the clock alone.
 class BusWatcher {
   public:
     explicit BusWatcher(const std::string& address);
@@ -114,18 +117,33 @@ class BusWatcher {
                              std::chrono::milliseconds timeout) {
         return waitUntil([&] { return notificationCount(name) >= count; }, timeout);
     }
+    // Follows the status's PropertiesChanged until each expected value has been announced
+    // (changes may come in more than one signal): what was announced since the call ("Supported"
+    // to true), or nothing, a test failure, when the wait ran out.
+    std::optional<nlohmann::json> waitForStatus(const nlohmann::json& expected,
+                                                std::chrono::milliseconds timeout = 30s);
+    // The arguments of the next UpdateCheckFinished after the last status signal taken, or
+    // nothing when none came within timeout.
+    std::optional<nlohmann::json> nextCheckFinished(std::chrono::milliseconds timeout);
     sd_bus* bus() const { return bus_.get(); }
 
   private:
     static int onNameOwnerChanged(sd_bus_message* message, void* self, sd_bus_error*);
     static int onPosted(sd_bus_message* message, void* self, sd_bus_error*);
+    static int onStatusSignal(sd_bus_message* message, void* self, sd_bus_error*);
+    // The next status signal that is a check's end (or a change), taken once it has arrived.
+    std::optional<nlohmann::json> takeStatusSignal(bool checkFinished);
 
     bus::BusPtr bus_;
     bus::BusSlotPtr ownerSlot_;
     bus::BusSlotPtr postedSlot_;
+    bus::BusSlotPtr statusSlot_;
     std::string owner_;
     int releases_ = 0;
     std::map<std::string, int> notifications_;
+    // In arrival order: a change as {"changed": values}, a check's end as {"finished": arguments}.
+    std::vector<nlohmann::json> statusSignals_;
+    std::size_t statusTaken_ = 0;
 };
 
 class BusFixture : public ::testing::Test {

@@ -22,7 +22,6 @@
 #include <thread>
 
 #include "BusFixture.h"
-#include "BusMonitor.h"
 #include "FileSystemTrace.h"
 #include "TestSupport.h"
 #include "bus/BackgroundJobScheduler.h"
@@ -166,8 +165,7 @@ class OverTheAirUpdateTest : public BusFixture {
 // download purged and the next check 15 days on; a check that finds nothing newer; a refused
 // catalog (kept across the daemon's exit); no catalog at all; a broken payload.
 TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
-    // What busctl sees: each check's end after the properties that describe it.
-    BusMonitor monitor(busAddress(), {"type='signal',path='/com/zandor/tavrixservicesd'"});
+    // On the bus, each check's end comes after the properties that describe it.
     setIDWithBundle("1");
     auto status = tavrixctlJson({"status"});
     expectFields(status, {{"BehaviorID", kBehaviorID},
@@ -192,10 +190,11 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
     operatorCheck.join();
     expectFields(
         check, {{"Started", "true"}, {"Outcome", "installed"}, {"Reason", "installed version 2"}});
-    EXPECT_TRUE(monitor.waitForStatus({{"LinkedBundleVersion", "2"},
-                                       {"UserBundleVersion", "2"},
-                                       {"LastCheckOutcome", "installed"}}));
-    EXPECT_EQ(monitor.nextCheckFinished(30s), nlohmann::json({"installed", "installed version 2"}));
+    EXPECT_TRUE(watcher().waitForStatus({{"LinkedBundleVersion", "2"},
+                                         {"UserBundleVersion", "2"},
+                                         {"LastCheckOutcome", "installed"}}));
+    EXPECT_EQ(watcher().nextCheckFinished(30s),
+              nlohmann::json({"installed", "installed version 2"}));
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 2, 30s));
     expectInstalled("2");
     EXPECT_EQ(cachedAssets(), std::vector<std::string>{});
@@ -218,11 +217,11 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
     check = tavrixctlJson({"check-update"}, 1);
     EXPECT_EQ(textAt(check, "Outcome"), "catalog-refused");
     EXPECT_THAT(textAt(check, "Reason"), StartsWith("catalog refused: bad signature: "));
-    EXPECT_EQ(monitor.nextCheckFinished(30s),
+    EXPECT_EQ(watcher().nextCheckFinished(30s),
               nlohmann::json({"up-to-date", "up to date (version 2 installed)"}));
-    EXPECT_TRUE(monitor.waitForStatus(
+    EXPECT_TRUE(watcher().waitForStatus(
         {{"LastCheckOutcome", "catalog-refused"}, {"LastCheckReason", textAt(check, "Reason")}}));
-    EXPECT_EQ(monitor.nextCheckFinished(30s),
+    EXPECT_EQ(watcher().nextCheckFinished(30s),
               nlohmann::json({"catalog-refused", textAt(check, "Reason")}));
     EXPECT_TRUE(waitForNextUpdateIn(kFifteenDays, 1s)) << "a refused catalog re-arms nothing";
     // What the daemon recorded is still there after it left and was started again.

@@ -1,13 +1,12 @@
-// The daemon as programs the project did not write see it: busctl reads the properties and
-// follows PropertiesChanged and the check signal (its JSON read by a JSON library), Python hands
-// the daemon a bundle by file descriptor and reads tavrixctl's JSON.
+// The daemon as programs the project did not write see it: busctl reads the properties (its JSON
+// read by a JSON library), Python hands the daemon a bundle by file descriptor and reads
+// tavrixctl's JSON; the property changes and the check signal are followed on the bus.
 #include <fcntl.h>
 #include <gmock/gmock.h>
 
 #include <nlohmann/json.hpp>
 
 #include "BusFixture.h"
-#include "BusMonitor.h"
 #include "TestSupport.h"
 #include "io/UniqueFd.h"
 #include "plist/PropertyListFormat.h"
@@ -19,8 +18,6 @@ namespace fs = std::filesystem;
 using nlohmann::json;
 using ::testing::HasSubstr;
 using ::testing::StartsWith;
-
-constexpr const char* kStatusInterface = "com.zandor.TXManagerStatusInterface";
 
 class StatusPropertiesTest : public BusFixture {
   protected:
@@ -95,7 +92,6 @@ print(json.dumps([bool(answer[0]), bool(answer[1]), str(answer[2])])))",
 // descriptor that is neither a file nor a pipe is refused with one error; a check ends with its
 // signal after its properties.
 TEST_F(StatusPropertiesTest, PropertiesAnnounceEachChangeAndTakeABundleByDescriptor) {
-    BusMonitor monitor(busAddress(), {"type='signal',path='/com/zandor/tavrixservicesd'"});
     CommandResult before = getProperties("BehaviorID Supported WhyNotSupported LastPayloadUSec");
     EXPECT_EQ(before.status, 0) << before.output;
     EXPECT_EQ(before.output, "s \"\"\nb false\ns \"no behavior ID has been set\"\nt 0\n");
@@ -115,12 +111,12 @@ TEST_F(StatusPropertiesTest, PropertiesAnnounceEachChangeAndTakeABundleByDescrip
     EXPECT_EQ(json::parse(set.output),
               json({true, true,
                     "extracted " + std::to_string(packed.size()) + " bytes into the user bundle"}));
-    auto announced = monitor.waitForStatus({{"BehaviorID", "acme.default"},
-                                            {"Supported", true},
-                                            {"WhyNotSupported", ""},
-                                            {"LinkedBundleVersion", "1"},
-                                            {"UserBundleVersion", "1"},
-                                            {"LastPayloadExtracted", true}});
+    auto announced = watcher().waitForStatus({{"BehaviorID", "acme.default"},
+                                              {"Supported", true},
+                                              {"WhyNotSupported", ""},
+                                              {"LinkedBundleVersion", "1"},
+                                              {"UserBundleVersion", "1"},
+                                              {"LastPayloadExtracted", true}});
     ASSERT_TRUE(announced);
     EXPECT_GT((*announced)["LastPayloadUSec"].get<std::uint64_t>(), 0u);
     EXPECT_EQ((*announced)["LinkedBundlePath"], at(kUserBundle).string());
@@ -140,7 +136,7 @@ TEST_F(StatusPropertiesTest, PropertiesAnnounceEachChangeAndTakeABundleByDescrip
     CommandResult broken = sendBundle("acme.default", "pipe", garbage);
     EXPECT_EQ(broken.status, 0) << broken.output;
     EXPECT_EQ(json::parse(broken.output)[1], false) << broken.output;
-    announced = monitor.waitForStatus({{"LastPayloadExtracted", false}});
+    announced = watcher().waitForStatus({{"LastPayloadExtracted", false}});
     ASSERT_TRUE(announced);
     EXPECT_NE((*announced)["LastPayloadReason"], "");
 
@@ -166,8 +162,8 @@ TEST_F(StatusPropertiesTest, PropertiesAnnounceEachChangeAndTakeABundleByDescrip
     CommandResult check = busctl("call " + std::string(kDaemonBusName) + " " + kDaemonObjectPath +
                                  " " + kDaemonInterface + " CheckForTavrixBundleUpdate");
     EXPECT_EQ(check.output, "b false\n");
-    ASSERT_TRUE(monitor.waitForStatus({{"LastCheckOutcome", "no-catalog"}}));
-    EXPECT_EQ(monitor.nextCheckFinished(10s), json({"no-catalog", "no catalog configured"}));
+    ASSERT_TRUE(watcher().waitForStatus({{"LastCheckOutcome", "no-catalog"}}));
+    EXPECT_EQ(watcher().nextCheckFinished(10s), json({"no-catalog", "no catalog configured"}));
 }
 
 // The interface XML kept in docs/ is what the daemon introspects as: the same methods with the
