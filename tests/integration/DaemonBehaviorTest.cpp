@@ -89,13 +89,7 @@ except dbus.DBusException as error:
 TEST_F(DaemonBehaviorTest, EnableSupportDecidesSupportOnceAnIdIsSetAndWithItTheSettings) {
     const plist::Value limits(plist::Dictionary{{"daily", 10}, {"since", plist::Date{123456}}});
     device().writeBehaviorSettings({{"Limits", limits}});
-    struct Case {
-        const char* what;
-        std::optional<plist::Value> enableSupport;
-        bool withID;
-        bool supported;
-    };
-    const Case cases[] = {
+    const std::tuple<const char*, std::optional<plist::Value>, bool, bool> cases[] = {
         {"absent", std::nullopt, true, false},
         {"false", plist::Value(false), true, false},
         {"true", plist::Value(true), true, true},
@@ -106,20 +100,19 @@ TEST_F(DaemonBehaviorTest, EnableSupportDecidesSupportOnceAnIdIsSetAndWithItTheS
     auto caller = client();
     // Started first, so that each case's preferences are read by a running daemon.
     ASSERT_TRUE(caller.setClientType(0));
-    for (const Case& test : cases) {
+    for (const auto& [what, enableSupport, withID, supported] : cases) {
         plist::Dictionary preferences;
-        if (test.enableSupport) {
-            preferences.emplace("EnableSupport", *test.enableSupport);
+        if (enableSupport) {
+            preferences.emplace("EnableSupport", *enableSupport);
         }
-        if (test.withID) {
+        if (withID) {
             preferences.emplace("TavrixID", "abc");
         }
         device().writeDaemonPreferences(preferences);
-        EXPECT_EQ(caller.isTavrixBundleSupported(), test.supported)
-            << "EnableSupport " << test.what;
+        EXPECT_EQ(caller.isTavrixBundleSupported(), supported) << "EnableSupport " << what;
         EXPECT_EQ(caller.copyTavrixValue("Limits"),
-                  test.supported ? std::optional(limits) : std::nullopt)
-            << "EnableSupport " << test.what;
+                  supported ? std::optional(limits) : std::nullopt)
+            << "EnableSupport " << what;
     }
 }
 

@@ -225,12 +225,7 @@ class AssetCatalogTest : public testing::Test {
 // Settings that cannot be used answer no assets, say why once and ask no server. (No settings file
 // at all, and a rollout that leaves the device out, show on the real daemon.)
 TEST_F(AssetCatalogTest, WithoutUsableSettingsQueriesAnswerNoAssetsAndSayWhyOnce) {
-    struct Case {
-        const char* name;
-        std::function<void()> arrange;
-        const char* reason;
-    };
-    std::vector<Case> cases{
+    std::vector<std::tuple<const char*, std::function<void()>, const char*>> cases{
         {"damaged file",
          [] { writeText(device::resolvePath(kAssetCatalogSettingsPath), "<plist><dict><key>"); },
          "not a property list"},
@@ -257,16 +252,16 @@ TEST_F(AssetCatalogTest, WithoutUsableSettingsQueriesAnswerNoAssetsAndSayWhyOnce
          },
          "TrustedKeys entry \"bad\""},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.name);
+    for (const auto& [name, arrange, reason] : cases) {
+        SCOPED_TRACE(name);
         sink.clear();
-        c.arrange();
+        arrange();
         for (int attempt = 0; attempt < 2; ++attempt) {
             std::optional<Assets> assets = query();
             ASSERT_TRUE(assets.has_value());
             EXPECT_TRUE(assets->empty());
         }
-        EXPECT_EQ(logLinesContaining(c.reason), 1u);
+        EXPECT_EQ(logLinesContaining(reason), 1u);
     }
     EXPECT_TRUE(server.requests().empty());
 }
@@ -295,11 +290,6 @@ TEST_F(AssetCatalogTest, UntrustworthyCatalogsAreRefusedWithTheirReason) {
     std::string catalog = readText(out("catalog.plist"));
     std::string signature = readText(out("catalog.plist.sig"));
 
-    struct Case {
-        const char* name;
-        std::function<void()> arrange;
-        const char* reason;
-    };
     auto serve = [&](const std::string& bytes, const std::optional<std::string>& sig) {
         writeText(out("catalog.plist"), bytes);
         fs::remove(out("catalog.plist.sig"));
@@ -309,7 +299,7 @@ TEST_F(AssetCatalogTest, UntrustworthyCatalogsAreRefusedWithTheirReason) {
     };
     std::string altered = catalog;
     altered.replace(altered.find("<string>2.1</string>"), 20, "<string>9.0</string>");
-    std::vector<Case> cases{
+    std::vector<std::tuple<const char*, std::function<void()>, const char*>> cases{
         {"altered catalog", [&] { serve(altered, signature); }, "bad signature"},
         {"no signature", [&] { serve(catalog, std::nullopt); }, "missing signature"},
         {"replayed older serial", [&] { serve(oldCatalog, oldSignature); }, "rollback"},
@@ -332,12 +322,12 @@ TEST_F(AssetCatalogTest, UntrustworthyCatalogsAreRefusedWithTheirReason) {
          },
          "fetch failed"},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.name);
+    for (const auto& [name, arrange, reason] : cases) {
+        SCOPED_TRACE(name);
         sink.clear();
-        c.arrange();
+        arrange();
         EXPECT_FALSE(query().has_value());
-        EXPECT_EQ(logLinesContaining(std::string(": ") + c.reason + ": "), 1u);
+        EXPECT_EQ(logLinesContaining(std::string(": ") + reason + ": "), 1u);
     }
     EXPECT_EQ(logLinesContaining("\"https\" not supported"), 1u) << "the redirect was not followed";
     std::size_t requests = server.requests().size();

@@ -20,12 +20,7 @@ using plist::Value;
 // --- The carrier file-name grammar ---
 
 TEST(CarrierFileNameGrammar, ReadsKeyAndVersion) {
-    struct Case {
-        std::string name;
-        std::string behaviorID;
-        std::string version;
-    };
-    const std::vector<Case> cases = {
+    const std::vector<std::tuple<std::string, std::string, std::string>> cases = {
         {"id+behavior+Default.bundle+ab12+7.plist", "ab12", "7"},
         {"device+behavior+Default.bundle+T12AP+2.10.plist", "T12AP", "2.10"},
         // The optional extra identifier makes five pieces; the key is still the third.
@@ -42,10 +37,10 @@ TEST(CarrierFileNameGrammar, ReadsKeyAndVersion) {
         {"device+behavior.plist", "", ""},
         {"id+behavior+Default.bundle+ab12+.plist", "ab12", ""},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.name);
-        EXPECT_EQ(behaviorIDFromCarrierFileName(c.name), c.behaviorID);
-        EXPECT_EQ(versionFromCarrierFileName(c.name), c.version);
+    for (const auto& [name, behaviorID, version] : cases) {
+        SCOPED_TRACE(name);
+        EXPECT_EQ(behaviorIDFromCarrierFileName(name), behaviorID);
+        EXPECT_EQ(versionFromCarrierFileName(name), version);
     }
 }
 
@@ -90,12 +85,7 @@ TEST(OverlayTransition, FollowsTheBitsThatChange) {
 }
 
 TEST(VersionOrder, DigitRunsCompareAsNumbersAndTheRestLiterally) {
-    struct Case {
-        const char* a;
-        const char* b;
-        int expected;
-    };
-    const std::vector<Case> cases = {
+    const std::tuple<const char*, const char*, int> cases[] = {
         {"9", "10", -1},
         {"1.9", "1.10", -1},
         {"", "", 0},
@@ -109,10 +99,10 @@ TEST(VersionOrder, DigitRunsCompareAsNumbersAndTheRestLiterally) {
         {"1.000000000000000000000000000002", "1.2", 0},
         {"123456789012345678901234567891", "123456789012345678901234567890", 1},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(std::string(c.a) + " vs " + c.b);
-        EXPECT_EQ(compareVersionStrings(c.a, c.b), c.expected);
-        EXPECT_EQ(compareVersionStrings(c.b, c.a), -c.expected);
+    for (const auto& [a, b, expected] : cases) {
+        SCOPED_TRACE(std::string(a) + " vs " + b);
+        EXPECT_EQ(compareVersionStrings(a, b), expected);
+        EXPECT_EQ(compareVersionStrings(b, a), -expected);
     }
 }
 

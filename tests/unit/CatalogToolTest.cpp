@@ -192,14 +192,9 @@ TEST_F(CatalogToolTest, OptionsParseAlikeAndMistakesChangeNothing) {
     std::string catalog = readText(work / "out/catalog.plist");
     std::string secret = readText(work / "secret.key");
 
-    struct Case {
-        const char* name;
-        std::vector<std::string> arguments;
-        int status;
-    };
     const std::string out = work / "out";
     const std::string bundle = work / "a/Default.bundle";
-    std::vector<Case> cases{
+    std::vector<std::tuple<const char*, std::vector<std::string>, int>> cases{
         {"keygen over a secret key", {"keygen", work / "secret.key", work / "other.pub"}, 1},
         {"keygen that cannot write the public key",
          {"keygen", work / "lone.key", work / "nowhere/lone.pub"},
@@ -218,11 +213,11 @@ TEST_F(CatalogToolTest, OptionsParseAlikeAndMistakesChangeNothing) {
         {"unknown option", {"publish", out, "--unsigned", "--sereal", "3", bundle}, 2},
         {"value missing", {"publish", out, bundle, "--key"}, 2},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.name);
-        ToolRun run = runCatalogTool(c.arguments);
-        EXPECT_EQ(run.status, c.status);
-        EXPECT_EQ(std::count(run.errors.begin(), run.errors.end(), '\n'), c.status == 2 ? 2 : 1)
+    for (const auto& [name, arguments, status] : cases) {
+        SCOPED_TRACE(name);
+        ToolRun run = runCatalogTool(arguments);
+        EXPECT_EQ(run.status, status);
+        EXPECT_EQ(std::count(run.errors.begin(), run.errors.end(), '\n'), status == 2 ? 2 : 1)
             << run.errors;
     }
     EXPECT_EQ(readText(work / "out/catalog.plist"), catalog);

@@ -163,7 +163,6 @@ TEST(MobileUser, IdsComeFromTheDatabaseUnderThePlatformRoot) {
     EXPECT_EQ(MobileUser::gid(), ::getgid());
 }
 
-
 // Internal, carrier install, vendor from the three answers; only booleans and strings count, and
 // the release type is read only when the build is not internal already.
 TEST(BuildCapabilities, DecisionFollowsTheAnswers) {

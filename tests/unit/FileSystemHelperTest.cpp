@@ -71,14 +71,7 @@ TEST(FileSystemHelperTransfer, AnswersAndResultingTreesFollowWhatLiesAtBothEnds)
         "installed/ installed/payload/ installed/payload/a.txt=new installed/payload/keep.txt=keep "
         "installed/payload/sub/ installed/payload/sub/b.txt=b installed/payload/sub/deep/ "
         "installed/payload/sub/deep/c.txt=c installed/payload/sub/other.txt=other";
-    struct Case {
-        const char* name;
-        std::string before;
-        Operation operation;
-        int answer;
-        std::string after;
-    };
-    const std::vector<Case> cases{
+    const std::vector<std::tuple<const char*, std::string, Operation, int, std::string>> cases{
         // Moved entry by entry: emptied directories below the source stay, and so does it.
         {"move merges into the directory of the source's name", overlapping, move, 0,
          merged + " payload/ payload/sub/"},
@@ -108,13 +101,13 @@ TEST(FileSystemHelperTransfer, AnswersAndResultingTreesFollowWhatLiesAtBothEnds)
          },
          -1, "installed=file payload/ payload/name=n"},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.name);
+    for (const auto& [name, before, operation, answer, after] : cases) {
+        SCOPED_TRACE(name);
         TempDir dir;
-        makeTree(dir.path(), c.before);
+        makeTree(dir.path(), before);
         FileSystemHelper helper;
-        EXPECT_EQ(c.operation(helper, dir / "payload", dir / "installed"), c.answer);
-        EXPECT_EQ(treeLine(dir.path()), c.after);
+        EXPECT_EQ(operation(helper, dir / "payload", dir / "installed"), answer);
+        EXPECT_EQ(treeLine(dir.path()), after);
     }
 }
 

@@ -121,13 +121,7 @@ TEST_F(PayloadExtraction, DamagedPayloadsKeepWhatCameBeforeTheDamage) {
         {test::fileItem("first.txt", "first"), test::fileItem("large.bin", randomBytes(300000, 3)),
          test::fileItem("last.txt", "last")});
     truncated.resize(truncated.size() / 2);
-    struct Case {
-        const char* name;
-        std::string bytes;
-        bool extracted;
-        Tree tree;  // leaving out the entry the damage cut short
-    };
-    const std::vector<Case> cases{
+    const std::vector<std::tuple<const char*, std::string, bool, Tree>> cases{
         {"empty", "", false, {}},
         {"not an archive", "this is plainly not an archive\n" + randomBytes(3000, 1), false, {}},
         {"gzip header alone", "\x1f\x8b\x08", false, {}},
@@ -140,14 +134,14 @@ TEST_F(PayloadExtraction, DamagedPayloadsKeepWhatCameBeforeTheDamage) {
          true,
          {{"before.txt", "before"}, {"after.txt", "after"}}},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.name);
+    for (const auto& [name, bytes, extracted, kept] : cases) {
+        SCOPED_TRACE(name);
         fs::remove_all(destination);
-        EXPECT_EQ(extract(c.bytes), c.extracted);
+        EXPECT_EQ(extract(bytes), extracted);
         EXPECT_TRUE(fs::is_directory(destination));
         Tree tree = snapshotTree(destination);
-        tree.erase("large.bin");
-        EXPECT_EQ(tree, c.tree);
+        tree.erase("large.bin");  // the entry the damage cut short
+        EXPECT_EQ(tree, kept);
     }
     EXPECT_FALSE(extractArchive(dir / "missing.tgz", destination));
     EXPECT_EQ(currentDirectory(), before);
@@ -172,11 +166,7 @@ TEST_F(PayloadExtraction, AsArchivedWritesEscapingEntriesWhereTheyPoint) {
 TEST_F(PayloadExtraction, PathSafeStopsAtTheFirstEntryThatCouldLeave) {
     const std::string outside = dir / "outside";
     writeText(outside + "/secret", "secret");
-    struct Case {
-        const char* name;
-        std::vector<ArchiveItem> hostile;
-    };
-    const std::vector<Case> cases{
+    const std::vector<std::tuple<const char*, std::vector<ArchiveItem>>> cases{
         {"dot-dot path", {test::fileItem("sub/../../up.txt", "up")}},
         {"absolute path", {test::fileItem(outside + "/absolute.txt", "absolute")}},
         {"hard link inside", {test::hardlinkItem("hard", "first.txt")}},
@@ -189,11 +179,11 @@ TEST_F(PayloadExtraction, PathSafeStopsAtTheFirstEntryThatCouldLeave) {
          {test::symlinkItem("self", "."), test::symlinkItem("escape", "self/../outside")}},
         {"fifo", {test::fifoItem("pipe")}},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.name);
+    for (const auto& [name, hostile] : cases) {
+        SCOPED_TRACE(name);
         fs::remove_all(destination);
         std::vector<ArchiveItem> items{test::fileItem("first.txt", "first")};
-        items.insert(items.end(), c.hostile.begin(), c.hostile.end());
+        items.insert(items.end(), hostile.begin(), hostile.end());
         items.push_back(test::fileItem("last.txt", "last"));
 
         EXPECT_FALSE(extract(buildArchive(Container::Tar, Compression::Gzip, items),
@@ -225,46 +215,45 @@ TEST_F(PayloadExtraction, LimitsCutBombsShortWithOneLine) {
     for (int index = 0; index < 40; ++index) {
         manyFiles.push_back(test::fileItem("f" + std::to_string(index), std::string(100, 'x')));
     }
-    struct Case {
-        const char* name;
-        std::vector<ArchiveItem> items;
-        ExtractionLimits limits;
-        const char* reason;
-    };
-    const std::vector<Case> cases{
-        {"one large entry",
-         {test::fileItem("small", "s"), test::fileItem("bomb", zeros)},
-         {1u << 20, 100, 0, false},
-         "expands to more than 1048576 bytes"},
-        {"many entries", manyFiles, {1u << 20, 10, 0, false}, "holds more than 10 entries"},
-        {"many small files adding up", manyFiles, {2000, 100, 0, false}, "more than 2000 bytes"},
-        {"directories a deep path implies",
-         {test::fileItem("a/b/c/d/e/f/g/h/i/j", "x")},
-         {1u << 20, 5, 0, false},
-         "more than 5 entries"},
-        {"no free space left",
-         {test::fileItem("small", "s")},
-         {1u << 20, 100, UINT64_MAX / 2, false},
-         "bytes free"},
-    };
+    const std::vector<
+        std::tuple<const char*, std::vector<ArchiveItem>, ExtractionLimits, const char*>>
+        cases{
+            {"one large entry",
+             {test::fileItem("small", "s"), test::fileItem("bomb", zeros)},
+             {1u << 20, 100, 0, false},
+             "expands to more than 1048576 bytes"},
+            {"many entries", manyFiles, {1u << 20, 10, 0, false}, "holds more than 10 entries"},
+            {"many small files adding up",
+             manyFiles,
+             {2000, 100, 0, false},
+             "more than 2000 bytes"},
+            {"directories a deep path implies",
+             {test::fileItem("a/b/c/d/e/f/g/h/i/j", "x")},
+             {1u << 20, 5, 0, false},
+             "more than 5 entries"},
+            {"no free space left",
+             {test::fileItem("small", "s")},
+             {1u << 20, 100, UINT64_MAX / 2, false},
+             "bytes free"},
+        };
     for (ExtractionSafety safety : {ExtractionSafety::AsArchived, ExtractionSafety::PathSafe}) {
-        for (const Case& c : cases) {
-            SCOPED_TRACE(c.name);
+        for (const auto& [name, items, limits, reason] : cases) {
+            SCOPED_TRACE(name);
             fs::remove_all(destination);
             log.clear();
-            writeText(dir / "payload", buildArchive(Container::Tar, Compression::Gzip, c.items));
-            EXPECT_FALSE(extractArchive(dir / "payload", destination, safety, c.limits));
+            writeText(dir / "payload", buildArchive(Container::Tar, Compression::Gzip, items));
+            EXPECT_FALSE(extractArchive(dir / "payload", destination, safety, limits));
             std::uintmax_t written = 0;
             std::size_t entries = 0;
             for (const auto& entry : fs::recursive_directory_iterator(destination)) {
                 written += entry.is_regular_file() ? entry.file_size() : 0;
                 ++entries;
             }
-            EXPECT_LE(written, c.limits.maxExpandedBytes);
-            EXPECT_LE(entries, c.limits.maxEntries);
+            EXPECT_LE(written, limits.maxExpandedBytes);
+            EXPECT_LE(entries, limits.maxEntries);
             ASSERT_EQ(log.messages().size(), 1u);
             EXPECT_NE(log.messages().front().find("stopped: "), std::string::npos);
-            EXPECT_NE(log.messages().front().find(c.reason), std::string::npos)
+            EXPECT_NE(log.messages().front().find(reason), std::string::npos)
                 << log.messages().front();
         }
     }
