@@ -1,7 +1,6 @@
 #include "FileSystemTrace.h"
 
 #include <map>
-#include <optional>
 #include <set>
 #include <sstream>
 #include <string_view>

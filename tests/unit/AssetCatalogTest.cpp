@@ -4,14 +4,12 @@
 
 #include <algorithm>
 #include <chrono>
-#include <condition_variable>
 #include <filesystem>
 #include <functional>
 #include <future>
 #include <map>
 #include <mutex>
 #include <string>
-#include <thread>
 #include <tuple>
 
 #include "ArchiveFixtures.h"
@@ -60,43 +58,35 @@ LocalHttpServer::Response statusResponse(int status, std::string reason) {
 }
 
 // The reports a download handler receives: each operation, and the bytes of each "Downloading".
-class ProgressLog {
-  public:
+struct ProgressLog {
     // The operations received until a completed or failed one, in order.
     std::vector<std::string> waitForLast() {
-        std::unique_lock lock(mutex_);
-        EXPECT_TRUE(changed_.wait_for(lock, kPatience, [&] { return finished_; }));
-        return operations_;
-    }
-
-    std::vector<std::int64_t> bytesDownloaded() {
-        std::lock_guard lock(mutex_);
-        return bytes_;
+        auto finished = [&] {
+            std::lock_guard lock(mutex);
+            return !operations.empty() && (operations.back() == kAssetOperationCompleted ||
+                                           operations.back() == kAssetOperationFailed);
+        };
+        EXPECT_TRUE(test::pollUntil(finished, kPatience));
+        std::lock_guard lock(mutex);
+        return operations;
     }
 
     // A handler that captures its asset, as an update client's does, so that a kept cycle shows.
     static Asset::ProgressHandler handler(std::shared_ptr<ProgressLog> log,
                                           std::shared_ptr<Asset> asset) {
-        return [log, asset](const plist::Dictionary& progress) { log->record(progress); };
+        return [log, asset](const plist::Dictionary& progress) {
+            std::lock_guard lock(log->mutex);
+            log->operations.push_back(*progress.at(kAssetProgressOperationKey).asString());
+            if (log->operations.back() == kAssetOperationDownloading) {
+                log->bytes.push_back(
+                    progress.at(kAssetProgressBytesWrittenKey).asInteger()->signedValue());
+            }
+        };
     }
 
-  private:
-    void record(const plist::Dictionary& progress) {
-        std::lock_guard lock(mutex_);
-        const std::string* name = progress.at(kAssetProgressOperationKey).asString();
-        operations_.push_back(*name);
-        if (*name == kAssetOperationDownloading) {
-            bytes_.push_back(progress.at(kAssetProgressBytesWrittenKey).asInteger()->signedValue());
-        }
-        finished_ = *name == kAssetOperationCompleted || *name == kAssetOperationFailed;
-        changed_.notify_all();
-    }
-
-    std::mutex mutex_;
-    std::condition_variable changed_;
-    std::vector<std::string> operations_;
-    std::vector<std::int64_t> bytes_;
-    bool finished_ = false;
+    std::mutex mutex;
+    std::vector<std::string> operations;
+    std::vector<std::int64_t> bytes;
 };
 
 class AssetCatalogTest : public testing::Test {
@@ -121,6 +111,20 @@ class AssetCatalogTest : public testing::Test {
         tool({"keygen", work / secret, work / pub});
         std::string key = readText(work / pub);
         return key.substr(0, key.find('\n'));
+    }
+
+    // Publishes a bundle of this version holding a.plist, signed with secret.key unless other
+    // options are given, and with these options of its own.
+    void publish(const std::string& version, std::vector<std::string> options = {},
+                 const std::vector<std::string>& bundleOptions = {}) {
+        const std::string bundle = work / (version + "/Default.bundle");
+        test::writeBundle(bundle, version, {}, {{"a.plist", version}});
+        options =
+            options.empty() ? std::vector<std::string>{"--key", work / "secret.key"} : options;
+        options.insert(options.begin(), {"publish", work / "out"});
+        options.push_back(bundle);
+        options.insert(options.end(), bundleOptions.begin(), bundleOptions.end());
+        tool(options);
     }
 
     // The type trusts key in the single-key form, or without a key takes catalogs unsigned;
@@ -274,18 +278,16 @@ TEST_F(AssetCatalogTest, UntrustworthyCatalogsAreRefusedWithTheirReason) {
     auto trusting = [](plist::Dictionary keys) {
         return plist::Dictionary{{kSettingsTrustedKeysKey, plist::Value(std::move(keys))}};
     };
-    auto publish = [&](const char* version, const char* key, const char* id) {
-        std::string bundle = work / (std::string(version) + "/Default.bundle");
-        test::writeBundle(bundle, version, {}, {{"a.plist", version}});
-        tool({"publish", work / "out", "--key", work / key, "--key-id", id, "--fresh", bundle});
+    auto publishWith = [&](const char* version, const char* key, const char* id) {
+        publish(version, {"--key", work / key, "--key-id", id, "--fresh"});
     };
     writeTypeSettings(trusting({{"new", plist::Value(newKey)}}));
-    publish("2.0", "new.key", "new");
+    publishWith("2.0", "new.key", "new");
     EXPECT_TRUE(query(true).value_or(Assets{nullptr}).empty()) << "nothing is kept before a fetch";
     ASSERT_EQ(query().value_or(Assets()).size(), 1u);
     std::string oldCatalog = readText(out("catalog.plist"));
     std::string oldSignature = readText(out("catalog.plist.sig"));
-    publish("2.1", "new.key", "new");
+    publishWith("2.1", "new.key", "new");
     ASSERT_EQ(query().value_or(Assets()).size(), 1u);
     std::string catalog = readText(out("catalog.plist"));
     std::string signature = readText(out("catalog.plist.sig"));
@@ -303,7 +305,7 @@ TEST_F(AssetCatalogTest, UntrustworthyCatalogsAreRefusedWithTheirReason) {
         {"altered catalog", [&] { serve(altered, signature); }, "bad signature"},
         {"no signature", [&] { serve(catalog, std::nullopt); }, "missing signature"},
         {"replayed older serial", [&] { serve(oldCatalog, oldSignature); }, "rollback"},
-        {"signed with a key not trusted", [&] { publish("3.0", "secret.key", "old"); },
+        {"signed with a key not trusted", [&] { publishWith("3.0", "secret.key", "old"); },
          "unknown key"},
         {"no key and no AllowUnsigned",
          [&] {
@@ -345,18 +347,18 @@ TEST_F(AssetCatalogTest, UntrustworthyCatalogsAreRefusedWithTheirReason) {
 }
 
 // A device that fetches the catalog just before a publication and its signature just after takes
-// the new pair, not a refusal that would keep it waiting for its next check.
-TEST_F(AssetCatalogTest, FetchCaughtBetweenSignatureAndCatalogReplacementTriesAgain) {
-    test::writeBundle(work / "b/Default.bundle", "1.0", {}, {{"a.plist", "one"}});
-    tool({"publish", work / "out", "--key", work / "secret.key", work / "b/Default.bundle"});
+// the new pair, not a refusal that would keep it waiting for its next check; but the second try
+// has only what the first one left of the time budget: a slow catalog whose signature fails holds
+// a waiting check for one budget, not two.
+TEST_F(AssetCatalogTest, ASecondTryTakesANewPairWithinWhatIsLeftOfTheBudget) {
+    publish("1.0");
     writeSettings(publicKey);
     LocalHttpServer::Response held = bodyResponse(readText(out("catalog.plist")));
     held.holdAfterBodyBytes = held.body.size() - 1;
     server.serve("/catalog/catalog.plist", held);
     auto assets = std::async(std::launch::async, [this] { return query(); });
     ASSERT_TRUE(server.waitForHeldResponse(kPatience));
-    test::writeBundle(work / "c/Default.bundle", "2.0", {}, {{"a.plist", "two"}});
-    tool({"publish", work / "out", "--key", work / "secret.key", work / "c/Default.bundle"});
+    publish("2.0");
     server.serve("/catalog/catalog.plist", bodyResponse(readText(out("catalog.plist"))));
     server.releaseHeldResponses();
     std::optional<Assets> answered = assets.get();
@@ -364,13 +366,7 @@ TEST_F(AssetCatalogTest, FetchCaughtBetweenSignatureAndCatalogReplacementTriesAg
     ASSERT_EQ(answered->size(), 2u);
     EXPECT_EQ(answered->back()->attributes(),
               (plist::Dictionary{{"Version", plist::Value("2.0")}}));
-}
 
-// The second try has only what the first one left of the time budget: a slow catalog whose
-// signature fails holds a waiting check for one budget, not two.
-TEST_F(AssetCatalogTest, ASecondTryGetsOnlyWhatIsLeftOfTheTimeBudget) {
-    test::writeBundle(work / "b/Default.bundle", "1.0", {}, {{"a.plist", "one"}});
-    tool({"publish", work / "out", "--key", work / "secret.key", work / "b/Default.bundle"});
     writeSettings(publicKey, {{kSettingsCatalogTimeoutKey, plist::Value(3)}});
     LocalHttpServer::Response slow = bodyResponse(readText(out("catalog.plist")) + "\n");
     slow.trickleBytesPerSecond = slow.body.size() / 3 + 1;  // about two seconds
@@ -382,12 +378,10 @@ TEST_F(AssetCatalogTest, ASecondTryGetsOnlyWhatIsLeftOfTheTimeBudget) {
 // A staged rollout shows an asset to the devices under its percentage, the same ones each time,
 // and a higher percentage keeps every device a lower one had.
 TEST_F(AssetCatalogTest, RolloutsAreStablePerDevice) {
-    test::writeBundle(work / "b/Default.bundle", "1.0", {}, {{"a.plist", "one"}});
     writeSettings(std::nullopt);
     std::map<std::string, bool> at40;
     for (const char* percent : {"40", "70"}) {
-        tool({"publish", work / "out", "--unsigned", work / "b/Default.bundle", "--rollout",
-              percent});
+        publish("1.0", {"--unsigned"}, {"--rollout", percent});
         for (int device = 0; device < 12; ++device) {
             std::string serialNumber = "SN" + std::to_string(device);
             test::writeDeviceTable({{"SerialNumber", serialNumber}});
@@ -480,7 +474,7 @@ TEST_F(AssetCatalogTest, DownloadReportsStepsInOrderInstallsIdenticalFilesAndPur
     EXPECT_EQ(operations.front(), kAssetOperationStarted);
     EXPECT_EQ(operations[operations.size() - 2], kAssetOperationInstalling);
     EXPECT_EQ(operations.back(), kAssetOperationCompleted);
-    std::vector<std::int64_t> bytes = progress->bytesDownloaded();
+    std::vector<std::int64_t> bytes = progress->bytes;
     EXPECT_TRUE(std::is_sorted(bytes.begin(), bytes.end(), std::less_equal<>()));
     ASSERT_FALSE(bytes.empty());
     EXPECT_LE(bytes.size(), 4u) << "a few reports, not one per chunk";

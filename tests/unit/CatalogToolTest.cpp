@@ -1,6 +1,5 @@
 // The publishing tool, run as publishers run it.
 #include <gtest/gtest.h>
-#include <sys/stat.h>
 
 #include <algorithm>
 #include <chrono>

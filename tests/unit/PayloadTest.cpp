@@ -8,7 +8,6 @@
 #include <cerrno>
 #include <cmath>
 #include <filesystem>
-#include <map>
 #include <string>
 
 #include "ArchiveFixtures.h"

@@ -1,10 +1,8 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include <climits>
 #include <cmath>
 #include <cstdlib>
-#include <functional>
 
 #include "HostilePropertyLists.h"
 #include "PrivateBus.h"
