@@ -1,6 +1,7 @@
 // The daemon's life on the bus: started by the first call, held by its launch transaction and by
 // calls, gone when idle, every call answered across a restart; its clients counted in and out; a
 // daemon that cannot serve says why and fails.
+#include <gmock/gmock.h>
 #include <signal.h>
 #include <unistd.h>
 
@@ -15,6 +16,8 @@
 
 namespace tavrix::integration {
 namespace {
+
+using ::testing::HasSubstr;
 
 using DaemonClientsTest = BusFixture;
 
@@ -98,51 +101,38 @@ TEST_F(DaemonActivityTest, CallsOnceASecondKeepOneDaemonAlivePastTheGrace) {
 // file, or its name already owned on the bus) logs why and exits with a failure, so that the
 // service manager's restart policy acts.
 TEST_F(DaemonLifecycleTest, DaemonThatCannotServeExitsWithAFailure) {
-    auto runDaemon = [&](const std::string& busAddress) {
-        return runCommand({"/usr/bin/env", "-i", "TAVRIX_ROOT=" + device().root().string(),
-                           "RUNTIME_DIRECTORY=" + device().runtimeDirectory().string(),
-                           "TAVRIX_LOG_STDERR=1", "TAVRIX_IDLE_EXIT_SEC=1",
-                           "DBUS_SYSTEM_BUS_ADDRESS=" + busAddress, TAVRIX_DAEMON_PATH});
+    // Runs the daemon on the bus at address: it must fail, saying why.
+    auto expectFailure = [&](const std::string& address, const std::string& why) {
+        CommandResult run = runCommand(
+            {"/usr/bin/env", "-i", "TAVRIX_ROOT=" + device().root().string(),
+             "RUNTIME_DIRECTORY=" + device().runtimeDirectory().string(), "TAVRIX_LOG_STDERR=1",
+             "TAVRIX_IDLE_EXIT_SEC=1", "DBUS_SYSTEM_BUS_ADDRESS=" + address, TAVRIX_DAEMON_PATH});
+        EXPECT_EQ(run.status, 1);
+        EXPECT_THAT(run.output, HasSubstr(why));
     };
-
-    const std::string nowhere = "unix:path=" + (device().base() / "no-bus-here").string();
-    CommandResult unreachable = runDaemon(nowhere);
-    EXPECT_EQ(unreachable.status, 1);
-    EXPECT_NE(unreachable.output.find("Cannot connect to the bus for com.zandor.tavrixservicesd"),
-              std::string::npos)
-        << unreachable.output;
+    expectFailure("unix:path=" + (device().base() / "no-bus-here").string(),
+                  "Cannot connect to the bus for com.zandor.tavrixservicesd");
 
     // A planted lock is never followed, opened or waited for.
     const auto lock = device().runtimeDirectory() / "instance.lock";
     const auto elsewhere = device().base() / "not-the-lock";
-    std::filesystem::create_directories(device().runtimeDirectory());
     test::writeText(elsewhere, "kept");
-    std::filesystem::remove(lock);
+    std::filesystem::remove(lock);  // the one the first run made
     std::filesystem::create_symlink(elsewhere, lock);
-    CommandResult linked = runDaemon(busAddress());
-    EXPECT_EQ(linked.status, 1);
-    EXPECT_NE(linked.output.find("Cannot open the instance lock"), std::string::npos)
-        << linked.output;
+    expectFailure(busAddress(), "Cannot open the instance lock");
     EXPECT_EQ(test::readText(elsewhere), "kept");
     std::filesystem::remove(lock);
     if (::geteuid() == 0) {
         test::writeText(lock, "");
         ASSERT_EQ(::chown(lock.c_str(), 65534, 65534), 0);
-        CommandResult foreign = runDaemon(busAddress());
-        EXPECT_EQ(foreign.status, 1);
-        EXPECT_NE(foreign.output.find("is not a file of this daemon's user"), std::string::npos)
-            << foreign.output;
+        expectFailure(busAddress(), "is not a file of this daemon's user");
         std::filesystem::remove(lock);
     }
 
     auto squatter = rawConnection();
     ASSERT_GE(sd_bus_request_name(squatter.get(), kDaemonBusName, 0), 0);
-    CommandResult taken = runDaemon(busAddress());
-    EXPECT_EQ(taken.status, 1);
-    EXPECT_NE(taken.output.find(
-                  "The name com.zandor.tavrixservicesd is owned by another process on the bus"),
-              std::string::npos)
-        << taken.output;
+    expectFailure(busAddress(),
+                  "The name com.zandor.tavrixservicesd is owned by another process on the bus");
     EXPECT_EQ(daemonLaunches().size(), 0u);
 }
 
