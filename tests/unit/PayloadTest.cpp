@@ -281,10 +281,6 @@ TEST_F(BundleInstall, EachPayloadReplacesTheUserBundle) {
               (Tree{{"Info.plist", "one"}, {"Overlay", "/"}, {"Overlay/old.plist", "old"}}));
     EXPECT_FALSE(fs::exists(staged));
 
-    install(buildArchive(Container::Cpio, Compression::Compress,
-                         {test::fileItem("Info.plist", "two")}));
-    EXPECT_EQ(snapshotTree(bundle), (Tree{{"Info.plist", "two"}}));
-
     // An empty payload still removes the old bundle and leaves an empty one.
     install("");
     EXPECT_TRUE(fs::is_directory(bundle));
