@@ -309,8 +309,8 @@ std::string BusFixture::publishSigned(const fs::path& bundle) {
                : "(not listed)";
 }
 
-void BusFixture::writeCatalogSettings(plist::Dictionary typeSettings) const {
-    typeSettings.insert_or_assign("CatalogURL", catalogServer_->url("/updates/catalog.plist"));
+void BusFixture::writeCatalogSettings(plist::Dictionary typeSettings) {
+    typeSettings.insert_or_assign("CatalogURL", catalogServer().url("/updates/catalog.plist"));
     const plist::Dictionary types{{"com.zandor.Grellas.TavrixBundles", std::move(typeSettings)}};
     EXPECT_TRUE(plist::writeFile(at("/etc/tavrix/AssetCatalog.plist").string(),
                                  plist::Value(plist::Dictionary{{"AssetTypes", types}})));

@@ -174,7 +174,7 @@ class BusFixture : public ::testing::Test {
     // path of its archive.
     std::string publishSigned(const std::filesystem::path& bundle);
     // The device's catalog settings: the bundle type at the site, with these settings (keys).
-    void writeCatalogSettings(plist::Dictionary typeSettings) const;
+    void writeCatalogSettings(plist::Dictionary typeSettings);
     // The site's file at urlPath served held after that part of its bytes, until released.
     void holdPublished(const std::string& urlPath, double part);
     const std::string& busAddress() const { return bus_->address(); }
