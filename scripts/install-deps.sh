@@ -1,11 +1,13 @@
 #!/usr/bin/env bash
 # Installs the Debian packages the project builds, tests and runs with; does nothing when all
-# are present. Runs apt-get as root, through sudo otherwise.
+# are present. Runs apt-get as root, through sudo otherwise. Fetches go again when a mirror is
+# caught mid-sync (scripts/fetch-retry.sh); one that keeps failing exits with status 75.
 #   --deb    also what building and checking the Debian packages needs
 #   --boot   also what the boot test needs (a container image booted with systemd)
 #   --cross=ARCH  also Debian's cross toolchain and the libraries for ARCH (arm64, armhf), and
 #            qemu to run what is built, registered with the kernel
 set -euo pipefail
+. "$(dirname "$0")/fetch-retry.sh"
 
 packages=(
     build-essential cmake ninja-build pkg-config clang libclang-rt-14-dev clang-format
@@ -58,7 +60,11 @@ if [ ${#missing[@]} -gt 0 ]; then
     done
     echo "Installing: ${missing[*]}"
     export DEBIAN_FRONTEND=noninteractive
-    $sudo apt-get update -qq
+    fetch_retry "apt-get update" $sudo apt-get update -qq
+    # Whether the packages can be installed needs no network: that fails at once, untried again.
+    $sudo apt-get install -s -qq --no-install-recommends "${missing[@]}" >/dev/null
+    fetch_retry "downloading the packages" \
+        $sudo apt-get install -d -y -qq --no-install-recommends "${missing[@]}"
     $sudo apt-get install -y -qq --no-install-recommends "${missing[@]}"
     trap - EXIT
 fi
