@@ -30,9 +30,10 @@ TEST(PlistTool, PipesThroughStandardStreamsAndKeepsTypesInJson) {
                     "<plist version=\"1.0\"><dict><key>n</key><integer>1500</integer>"
                     "<key>s</key><string>1500</string><key>r</key><real>1500</real>"
                     "<key>d</key><data>AAEC/w==</data>"
-                    "<key>t</key><date>2026-12-07T23:49:17Z</date></dict></plist>");
+                    "<key>t</key><date>2040-02-29T23:49:17.25Z</date></dict></plist>");
     const std::string tool = "'" TAVRIX_PLIST_TOOL "'";
-    // XML in, binary through a pipe, typed JSON out, read by Python.
+    // XML in, binary through a pipe, typed JSON out, read by Python; the date past 2038 keeps its
+    // fraction and its text with a 32-bit time_t too.
     auto [output, status] =
         shell("bash -c \"set -o pipefail; " + tool + " --binary '" + source + "' - | " + tool +
               " --json=pretty - | /usr/bin/python3 -c 'import json, sys; v = json.load(sys.stdin); "
@@ -40,7 +41,7 @@ TEST(PlistTool, PipesThroughStandardStreamsAndKeepsTypesInJson) {
               "v[\\\"t\\\"])'\"");
     EXPECT_EQ(status, 0) << output;
     EXPECT_EQ(output,
-              "1500 '1500' 1500.0 {'$data': 'AAEC/w=='} {'$date': '2026-12-07T23:49:17Z'}\n");
+              "1500 '1500' 1500.0 {'$data': 'AAEC/w=='} {'$date': '2040-02-29T23:49:17.25Z'}\n");
 
     auto [refused, refusedStatus] = shell("echo 'not a plist' | " + tool + " - 2>&1");
     EXPECT_EQ(refusedStatus, 1) << refused;

@@ -74,8 +74,9 @@ TEST(PropertyListXml, ReadsValuesWrittenByOthers) {
     EXPECT_EQ(xml.rfind("<?xml", 0), 0u);
 }
 
-// Dates far from the reference date (past 2038, before 1901) keep their value on every machine;
-// beyond year 9999, which the XML form cannot spell, they are clamped.
+// Dates far from the reference date (past 2038, before 1901) keep their value and their text on
+// every machine, a 32-bit time_t's included; beyond year 9999, which the XML form cannot spell,
+// they are clamped.
 TEST(PropertyListDates, XmlHoldsWholeSecondsAndBinaryKeepsFractions) {
     for (auto [seconds, text] : {std::pair{123456.75, "2001-01-02T10:17:36Z"},
                                  std::pair{-86400.25, "2000-12-30T23:59:59Z"},
@@ -86,6 +87,9 @@ TEST(PropertyListDates, XmlHoldsWholeSecondsAndBinaryKeepsFractions) {
         EXPECT_NE(xml.find(std::string("<date>") + text + "</date>"), std::string::npos) << xml;
         EXPECT_EQ(parse(xml), Value(Date{std::floor(seconds)}));
         EXPECT_EQ(parse(serialize(date, Format::Binary)), date);
+        std::string readable = text;
+        readable[10] = ' ';
+        EXPECT_EQ(date.description(), readable.replace(19, 1, " +0000"));
     }
     EXPECT_NE(serialize(Value(Date{1e15})).find("<date>9999-12-31T23:59:59Z</date>"),
               std::string::npos);
