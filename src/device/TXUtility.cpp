@@ -7,9 +7,7 @@
 
 #include <atomic>
 #include <cerrno>
-#include <cmath>
 #include <cstdlib>
-#include <ctime>
 #include <vector>
 
 #include "device/DeviceInfoService.h"
@@ -164,18 +162,10 @@ std::optional<plist::Date> TXUtility::addToDate(plist::Date date, long numberOfD
 }
 
 std::string TXUtility::prettyPrintDate(plist::Date date) {
-    double whole = std::floor(date.unixTime());
-    std::tm local{};
-    bool representable = std::isfinite(whole) && whole >= -9.2e18 && whole <= 9.2e18;
-    std::time_t seconds = representable ? static_cast<std::time_t>(whole) : 0;
-    ::tzset();
-    char text[128];
-    if (!representable || ::localtime_r(&seconds, &local) == nullptr ||
-        std::strftime(text, sizeof text, "%x %H:%M", &local) == 0) {
-        // Still something readable for a log line.
-        return std::to_string(date.secondsSinceReferenceDate);
-    }
-    return text;
+    // Still something readable for a log line when the date has no local time.
+    return gregorianCalendar()
+        .localText(date, "%x %H:%M")
+        .value_or(std::to_string(date.secondsSinceReferenceDate));
 }
 
 std::optional<std::string> TXUtility::runStateName(int runState) {

@@ -3,6 +3,7 @@
 #pragma once
 
 #include <optional>
+#include <string>
 
 #include "plist/Value.h"
 
@@ -14,6 +15,10 @@ class GregorianCalendar {
     // wall-clock time, with the fraction of a second kept. Nothing when the result cannot be
     // represented.
     std::optional<plist::Date> addingDays(plist::Date date, long numberOfDays) const;
+
+    // The date as local wall-clock time in strftime's format; nothing when it cannot be
+    // represented.
+    std::optional<std::string> localText(plist::Date date, const char* format) const;
 };
 
 }  // namespace tavrix

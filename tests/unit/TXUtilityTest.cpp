@@ -11,6 +11,7 @@
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
 #include "device/TXUtility.h"
+#include "plist/DateText.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix {
@@ -133,6 +134,13 @@ TEST_F(CalendarInZone, DaysFollowTheWallClockAcrossDaylightSaving) {
     // Short date and time, in local time.
     std::setlocale(LC_TIME, "C");
     EXPECT_EQ(TXUtility::prettyPrintDate(localDate(2026, 3, 7, 9, 5)), "03/07/26 09:05");
+
+    // The same past 2038, where a 32-bit time_t ends (so the dates are written in UTC here).
+    auto utc = [](const char* text) { return plist::Date{*plist::parseXmlDateText(text)}; };
+    auto spring2040 = TXUtility::addToDate(utc("2040-03-10T17:00:00Z"), 1);  // noon EST
+    ASSERT_TRUE(spring2040.has_value());
+    EXPECT_EQ(*spring2040, utc("2040-03-11T16:00:00Z"));  // noon EDT
+    EXPECT_EQ(TXUtility::prettyPrintDate(*spring2040), "03/11/40 12:00");
 }
 
 // Days move back and across months keeping fractions; results that cannot be represented are
