@@ -8,13 +8,20 @@
 # are published together; a multiarch library must have one version for both.
 # The kernel hands the binaries to qemu (binfmt_misc), so that the tests and the programs they
 # start run as on a device, under their own names.
-# usage: scripts/cross-build.sh ARCH [LABEL]    (as root; ARCH: arm64 or armhf; build in build-ARCH/)
+# With --deb, the Debian packages instead (dpkg-buildpackage -a ARCH, nocheck: the tests run in
+# the other mode), checked by lintian, into dist/ARCH/.
+# usage: scripts/cross-build.sh [--deb] ARCH [LABEL]  (as root; ARCH: arm64 or armhf; build in build-ARCH/)
 # Status 75: a fetch from the mirror kept failing (scripts/fetch-retry.sh).
 set -euo pipefail
 top=$(cd "$(dirname "$0")/.." && pwd)
 cd "$top"
 . scripts/fetch-retry.sh
-arch=${1:?usage: scripts/cross-build.sh ARCH [LABEL]}
+deb=
+if [ "${1:-}" = --deb ]; then
+    deb=--deb
+    shift
+fi
+arch=${1:?usage: scripts/cross-build.sh [--deb] ARCH [LABEL]}
 label=${2:-unit}
 jobs=${JOBS:-2}
 case "$arch" in
@@ -48,10 +55,20 @@ if [ "${TAVRIX_IN_BUILD_ROOT:-}" != "$arch" ]; then
         --bind="$top" --chdir="$top" --setenv=TAVRIX_IN_BUILD_ROOT="$arch" --setenv=JOBS="$jobs" \
         --setenv=TAVRIX_FETCH_TRIES="${TAVRIX_FETCH_TRIES:-4}" \
         --setenv=TAVRIX_FETCH_PAUSE="${TAVRIX_FETCH_PAUSE:-30}" \
-        scripts/cross-build.sh "$arch" "$label"
+        scripts/cross-build.sh $deb "$arch" "$label"
 fi
 
-scripts/install-deps.sh "--cross=$arch"
+scripts/install-deps.sh "--cross=$arch" $deb
+if [ -n "$deb" ]; then
+    # dpkg-buildpackage leaves the packages beside the checkout, inside the root.
+    rm -f ../*_"$arch".deb ../*_"$arch".changes ../*_"$arch".buildinfo
+    DEB_BUILD_OPTIONS="nocheck parallel=$jobs" DEB_BUILD_PROFILES=nocheck \
+        dpkg-buildpackage -a "$arch" -B -us -uc
+    mkdir -p "dist/$arch"
+    mv ../*_"$arch".deb ../*_"$arch".changes ../*_"$arch".buildinfo "dist/$arch/"
+    lintian --fail-on error,warning "dist/$arch/"*.deb
+    exit
+fi
 triplet=$(dpkg-architecture -a"$arch" -qDEB_HOST_MULTIARCH 2>/dev/null)
 build=build-$arch
 if [ ! -f "$build/build.ninja" ]; then
