@@ -1,6 +1,7 @@
 #!/usr/bin/env bash
 # Builds the project for another Debian architecture with Debian's cross toolchain and that
-# architecture's -dev packages, then runs the tests labelled LABEL (default: unit) under qemu.
+# architecture's -dev packages, then runs the tests whose label matches LABEL (default: unit;
+# 'unit|integration' for both) under qemu.
 # The build runs in a Debian 12 build root (debootstrap, kept in $TAVRIX_CROSS_CACHE, default
 # /var/cache/tavrix-cross/ARCH) entered with systemd-nspawn, the checkout bound at its own path:
 # the build machine's architectures and packages stay as they are, and the root takes both
