@@ -18,7 +18,8 @@ native=(
     libsystemd-dev libplist-dev libarchive-dev libcurl4-openssl-dev libssl-dev libsodium-dev zlib1g-dev
     libgtest-dev libgmock-dev libbenchmark-dev
 )
-test_tools=(dbus libarchive-tools curl python3 python3-dbus tzdata libplist-utils strace)
+# The programs the tests run; busctl, which follows the bus in the integration tests, is systemd's.
+test_tools=(dbus systemd libarchive-tools curl python3 python3-dbus tzdata libplist-utils strace)
 
 extra=()
 cross=()
