@@ -6,7 +6,8 @@ FUZZ_BUILD ?= build-fuzz
 JOBS       ?= 2
 FUZZ_SECONDS ?= 60
 
-.PHONY: all deps build test test-asan test-tsan fuzz bench demo deb boot-test cross-arm64 cross-armhf format clean
+.PHONY: all deps build test test-asan test-tsan fuzz bench demo deb boot-test cross-arm64 cross-armhf \
+	cross-deb-arm64 cross-deb-armhf format clean
 
 all: build
 
@@ -66,12 +67,20 @@ deb:
 boot-test: deb
 	scripts/boot-test.sh
 
-# Cross builds with Debian's cross toolchains into build-<arch>/, the unit tests run under qemu.
+# Cross builds with Debian's cross toolchains into build-<arch>/, the unit tests run under qemu;
+# both in a Debian 12 build root cached in /var/cache/tavrix-cross (root only).
 cross-arm64:
 	JOBS=$(JOBS) scripts/cross-build.sh arm64
 
 cross-armhf:
 	JOBS=$(JOBS) scripts/cross-build.sh armhf
+
+# The Debian packages for another architecture (dpkg-buildpackage -a), into dist/<arch>/.
+cross-deb-arm64:
+	JOBS=$(JOBS) scripts/cross-build.sh --deb arm64
+
+cross-deb-armhf:
+	JOBS=$(JOBS) scripts/cross-build.sh --deb armhf
 
 format:
 	git ls-files '*.cpp' '*.h' | xargs clang-format -i

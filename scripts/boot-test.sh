@@ -4,24 +4,30 @@
 # activation, idle exit, the timer, an update from a signed catalog, the journal, Restart= and a
 # purge, each checked from inside. One PASS/FAIL line per step, non-zero on any failure.
 # Run as root: make boot-test. The base image is cached in $TAVRIX_BOOT_CACHE
-# (default /var/cache/tavrix-boot-test); every run boots a fresh copy of it.
+# (default /var/cache/tavrix-boot-test); every run boots a fresh copy of it. Status 75: a fetch
+# from the mirror kept failing (scripts/fetch-retry.sh), before any step ran.
 set -uo pipefail
 top=$(cd "$(dirname "$0")/.." && pwd)
+. "$top/scripts/fetch-retry.sh"
 cache=${TAVRIX_BOOT_CACHE:-/var/cache/tavrix-boot-test}
 mirror=${TAVRIX_BOOT_MIRROR:-http://deb.debian.org/debian}
 # What the packages need at run time and the test uses, so that the container needs no network.
 image_packages=systemd,systemd-sysv,dbus,libplist3,libarchive13,libcurl4,libsodium23,libssl3,python3,procps
 
 [ "$(id -u)" = 0 ] || { echo "boot-test: run as root" >&2; exit 2; }
-"$top/scripts/install-deps.sh" --boot || { echo "boot-test: cannot install systemd-nspawn and debootstrap" >&2; exit 2; }
+"$top/scripts/install-deps.sh" --boot ||
+    { status=$?; echo "boot-test: cannot install systemd-nspawn and debootstrap" >&2; exit "$status"; }
 if ! ls "$top"/dist/tavrixservicesd_*.deb >/dev/null 2>&1; then
     make -C "$top" deb >/dev/null || { echo "boot-test: make deb failed" >&2; exit 2; }
 fi
 if [ ! -e "$cache/bookworm/etc/os-release" ]; then
-    rm -rf "$cache/bookworm.new"
     mkdir -p "$cache"
-    debootstrap --variant=minbase --include="$image_packages" bookworm "$cache/bookworm.new" "$mirror" \
-        >"$cache/debootstrap.log" 2>&1 || { echo "boot-test: debootstrap failed, see $cache/debootstrap.log" >&2; exit 2; }
+    bootstrap() {
+        rm -rf "$cache/bookworm.new"
+        debootstrap --variant=minbase --include="$image_packages" bookworm "$cache/bookworm.new" \
+            "$mirror" >"$cache/debootstrap.log" 2>&1 || { tail -n 5 "$cache/debootstrap.log" >&2; return 1; }
+    }
+    fetch_retry "debootstrap of the boot image (log: $cache/debootstrap.log)" bootstrap || exit
     mv "$cache/bookworm.new" "$cache/bookworm"
 fi
 

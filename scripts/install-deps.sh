@@ -1,37 +1,58 @@
 #!/usr/bin/env bash
 # Installs the Debian packages the project builds, tests and runs with; does nothing when all
-# are present. Runs apt-get as root, through sudo otherwise.
+# are present. Runs apt-get as root, through sudo otherwise. Fetches go again when a mirror is
+# caught mid-sync (scripts/fetch-retry.sh); one that keeps failing exits with status 75.
 #   --deb    also what building and checking the Debian packages needs
 #   --boot   also what the boot test needs (a container image booted with systemd)
-#   --cross=ARCH  also Debian's cross toolchain and the libraries for ARCH (arm64, armhf), and
-#            qemu to run what is built, registered with the kernel
+#   --emulate=ARCH  what a cross build for ARCH (arm64, armhf) needs on the build machine: the
+#            build root's tools (debootstrap, systemd-nspawn) and qemu, registered with the kernel
+#   --cross=ARCH  instead of the native libraries and compilers: Debian's cross toolchain and
+#            the libraries for ARCH, beside the build tools and the programs the tests run (in
+#            the build root scripts/cross-build.sh makes)
 set -euo pipefail
+. "$(dirname "$0")/fetch-retry.sh"
 
-packages=(
-    build-essential cmake ninja-build pkg-config clang libclang-rt-14-dev clang-format
+build_tools=(build-essential cmake ninja-build pkg-config nlohmann-json3-dev)
+native=(
+    clang libclang-rt-14-dev clang-format
     libsystemd-dev libplist-dev libarchive-dev libcurl4-openssl-dev libssl-dev libsodium-dev zlib1g-dev
-    nlohmann-json3-dev
     libgtest-dev libgmock-dev libbenchmark-dev
-    dbus libarchive-tools curl python3 python3-dbus tzdata libplist-utils strace
 )
+# The programs the tests run; busctl, which follows the bus in the integration tests, is systemd's.
+test_tools=(dbus systemd libarchive-tools curl python3 python3-dbus tzdata libplist-utils strace)
 
+extra=()
 cross=()
+emulate=()
 for flag in "$@"; do
     case "$flag" in
-        --deb) packages+=(debhelper dpkg-dev fakeroot lintian systemd) ;;
-        --boot) packages+=(systemd-container debootstrap) ;;
+        --deb) extra+=(debhelper dpkg-dev fakeroot lintian systemd) ;;
+        --boot) extra+=(systemd-container debootstrap) ;;
+        --emulate=arm64 | --emulate=armhf)
+            emulate+=("${flag#--emulate=}")
+            extra+=(systemd-container debootstrap qemu-user-static)
+            ;;
         --cross=arm64 | --cross=armhf)
             arch=${flag#--cross=}
             cross+=("$arch")
-            packages+=(crossbuild-essential-"$arch" qemu-user-static dpkg-dev pkgconf:"$arch")
+            extra+=(crossbuild-essential-"$arch" dpkg-dev pkgconf:"$arch")
             for library in libsystemd-dev libplist-dev libarchive-dev libcurl4-openssl-dev libssl-dev \
                 libsodium-dev zlib1g-dev libgtest-dev libgmock-dev; do
-                packages+=("$library:$arch")
+                extra+=("$library:$arch")
             done
             ;;
-        *) echo "install-deps: unknown flag $flag (known: --deb --boot --cross=arm64 --cross=armhf)" >&2; exit 2 ;;
+        *)
+            echo "install-deps: unknown flag $flag" \
+                "(known: --deb --boot --emulate=arm64|armhf --cross=arm64|armhf)" >&2
+            exit 2
+            ;;
     esac
 done
+if [ ${#cross[@]} -gt 0 ]; then
+    packages=("${build_tools[@]}" "${test_tools[@]}" "${extra[@]}")
+else
+    packages=("${build_tools[@]}" "${native[@]}" "${test_tools[@]}" "${extra[@]}")
+fi
 
 sudo=""
 if [ "$(id -u)" -ne 0 ]; then
@@ -58,14 +79,19 @@ if [ ${#missing[@]} -gt 0 ]; then
     done
     echo "Installing: ${missing[*]}"
     export DEBIAN_FRONTEND=noninteractive
-    $sudo apt-get update -qq
+    fetch_retry "apt-get update" $sudo apt-get update -qq
+    # Whether the packages can be installed needs no network: that fails at once, untried again.
+    $sudo apt-get install -s -qq --no-install-recommends "${missing[@]}" >/dev/null
+    fetch_retry "downloading the packages" \
+        $sudo apt-get install -d -y -qq --no-install-recommends "${missing[@]}"
     $sudo apt-get install -y -qq --no-install-recommends "${missing[@]}"
     trap - EXIT
 fi
 
 # Programs built for ARCH run through qemu when the kernel knows it: tests start the daemon and
-# the tools as any program would. Without a service manager nobody registers it at install.
-for arch in "${cross[@]}"; do
+# the tools as any program would. Without a service manager nobody registers it at install. The
+# registration opens qemu at once (flag F), so that it runs in a build root too.
+for arch in "${emulate[@]}"; do
     case "$arch" in arm64) emulator=qemu-aarch64 ;; armhf) emulator=qemu-arm ;; esac
     binfmt=/proc/sys/fs/binfmt_misc
     [ -e "$binfmt/register" ] || $sudo mount -t binfmt_misc binfmt_misc "$binfmt"

@@ -4,13 +4,11 @@
 
 #include <cmath>
 #include <cstdio>
-#include <ctime>
+
+#include "plist/DateText.h"
 
 namespace tavrix::tools {
 namespace {
-
-// Dates count from 2001-01-01 00:00:00 UTC.
-constexpr double kReferenceDateUnixSeconds = 978307200.0;
 
 std::string base64(const plist::Data& data) {
     std::string text(sodium_base64_ENCODED_LEN(data.size(), sodium_base64_VARIANT_ORIGINAL), '\0');
@@ -23,32 +21,27 @@ std::string base64(const plist::Data& data) {
 }  // namespace
 
 std::string isoDate(const plist::Date& date) {
-    const double unixSeconds = date.secondsSinceReferenceDate + kReferenceDateUnixSeconds;
-    if (!std::isfinite(unixSeconds)) {
+    if (!std::isfinite(date.secondsSinceReferenceDate)) {
         return "(invalid date)";
     }
-    const double whole = std::floor(unixSeconds);
-    auto micros = static_cast<long>(std::llround((unixSeconds - whole) * 1e6));
-    auto seconds = static_cast<std::time_t>(whole);
+    double whole = std::floor(date.secondsSinceReferenceDate);
+    auto micros = static_cast<long>(std::llround((date.secondsSinceReferenceDate - whole) * 1e6));
     if (micros >= 1000000) {
         micros -= 1000000;
-        ++seconds;
+        whole += 1;
     }
-    std::tm parts{};
-    char text[64] = "";
-    if (::gmtime_r(&seconds, &parts) == nullptr ||
-        std::strftime(text, sizeof text, "%Y-%m-%dT%H:%M:%S", &parts) == 0) {
+    if (!plist::hasDateText(whole)) {
         return "(invalid date)";
     }
-    std::string out = text;
+    std::string out = plist::xmlDateText(whole);
     if (micros > 0) {
         char fraction[32];
         std::snprintf(fraction, sizeof fraction, ".%06ld", micros);
         std::string digits = fraction;
         digits.erase(digits.find_last_not_of('0') + 1);
-        out += digits;
+        out.insert(out.size() - 1, digits);  // before the Z
     }
-    return out + "Z";
+    return out;
 }
 
 nlohmann::json toJson(const plist::Value& value) {

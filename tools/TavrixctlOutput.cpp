@@ -1,26 +1,11 @@
 #include "TavrixctlOutput.h"
 
-#include <cmath>
 #include <cstdio>
-#include <ctime>
+
+#include "plist/DateText.h"
 
 namespace tavrix::tools {
 namespace {
-
-// Dates count from 2001-01-01 00:00:00 UTC.
-constexpr double kReferenceDateUnixSeconds = 978307200.0;
-
-std::string formatDate(const plist::Date& date, const char* format) {
-    const auto seconds = static_cast<std::time_t>(
-        std::floor(date.secondsSinceReferenceDate + kReferenceDateUnixSeconds));
-    std::tm parts{};
-    char text[64] = "";
-    if (::gmtime_r(&seconds, &parts) == nullptr ||
-        std::strftime(text, sizeof text, format, &parts) == 0) {
-        return "(invalid date)";
-    }
-    return text;
-}
 
 const std::string* textAt(const plist::Dictionary& dictionary, const char* key) {
     auto found = dictionary.find(key);
@@ -52,7 +37,9 @@ void line(std::string& out, const char* label, const std::string& text) {
 }  // namespace
 
 std::string readableDate(const plist::Date& date) {
-    return formatDate(date, "%Y-%m-%d %H:%M:%S UTC");
+    const double seconds = date.secondsSinceReferenceDate;
+    return plist::hasDateText(seconds) ? plist::readableDateText(seconds) + " UTC"
+                                       : "(invalid date)";
 }
 
 std::string readableStatus(const plist::Dictionary& status) {

@@ -1,8 +1,7 @@
 #include "catalog/CatalogTrust.h"
 
-#include <ctime>
-
 #include "device/DaemonStateFile.h"
+#include "plist/DateText.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix::catalog {
@@ -19,13 +18,8 @@ std::string serialFileName(std::string_view assetType) {
 }  // namespace
 
 std::string catalogDateText(plist::Date date) {
-    auto seconds = static_cast<std::time_t>(date.unixTime());
-    std::tm parts{};
-    char text[32] = "?";
-    if (::gmtime_r(&seconds, &parts) != nullptr) {
-        std::strftime(text, sizeof text, "%Y-%m-%d %H:%M:%S UTC", &parts);
-    }
-    return text;
+    const double seconds = date.secondsSinceReferenceDate;
+    return plist::hasDateText(seconds) ? plist::readableDateText(seconds) + " UTC" : "?";
 }
 
 std::string defaultKeyIdentifier(const CatalogPublicKey& publicKey) {

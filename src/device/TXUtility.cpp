@@ -9,10 +9,8 @@
 
 #include <atomic>
 #include <cerrno>
-#include <cmath>
 #include <cstdlib>
 #include <cstring>
-#include <ctime>
 #include <memory>
 #include <type_traits>
 #include <vector>
@@ -177,24 +175,16 @@ std::optional<plist::Date> TXUtility::addToDate(plist::Date date, long numberOfD
 }
 
 std::string TXUtility::prettyPrintDate(plist::Date date) {
-    double whole = std::floor(date.unixTime());
-    std::tm local{};
-    bool representable = std::isfinite(whole) && whole >= -9.2e18 && whole <= 9.2e18;
-    std::time_t seconds = representable ? static_cast<std::time_t>(whole) : 0;
-    ::tzset();
     // The environment's time locale (LC_ALL, LC_TIME, LANG), whatever the process's own is.
     LocaleHandle locale(::newlocale(LC_TIME_MASK, "", locale_t{}));
     if (!locale) {
         locale.reset(::newlocale(LC_TIME_MASK, "C", locale_t{}));
     }
-    char text[256];
     const std::string format = std::string("%x ") + shortTimeFormat(locale.get());
-    if (!representable || !locale || ::localtime_r(&seconds, &local) == nullptr ||
-        ::strftime_l(text, sizeof text, format.c_str(), &local, locale.get()) == 0) {
-        // Still something readable for a log line.
-        return std::to_string(date.secondsSinceReferenceDate);
-    }
-    return text;
+    // Still something readable for a log line when the date has no local time.
+    return gregorianCalendar()
+        .localText(date, format.c_str(), locale.get())
+        .value_or(std::to_string(date.secondsSinceReferenceDate));
 }
 
 std::optional<std::string> TXUtility::runStateName(int runState) {

@@ -57,17 +57,30 @@ bool readDigits(std::string_view text, std::size_t at, std::size_t count, unsign
     return true;
 }
 
+// The first and the last whole second of years 1 to 9999.
+constexpr auto kFirstSecond =
+    static_cast<double>((daysFromCivil(1, 1, 1) - kReferenceDay) * kSecondsPerDay);
+constexpr auto kLastSecond =
+    static_cast<double>((daysFromCivil(10000, 1, 1) - kReferenceDay) * kSecondsPerDay - 1);
+
 }  // namespace
 
 double clampedDateSeconds(double secondsSinceReferenceDate) {
-    constexpr auto first =
-        static_cast<double>((daysFromCivil(1, 1, 1) - kReferenceDay) * kSecondsPerDay);
-    constexpr auto last =
-        static_cast<double>((daysFromCivil(10000, 1, 1) - kReferenceDay) * kSecondsPerDay - 1);
-    if (!(secondsSinceReferenceDate >= first)) {
-        return first;
+    if (!(secondsSinceReferenceDate >= kFirstSecond)) {
+        return kFirstSecond;
     }
-    return secondsSinceReferenceDate > last ? last : secondsSinceReferenceDate;
+    return secondsSinceReferenceDate > kLastSecond ? kLastSecond : secondsSinceReferenceDate;
+}
+
+bool hasDateText(double secondsSinceReferenceDate) {
+    return secondsSinceReferenceDate >= kFirstSecond && secondsSinceReferenceDate < kLastSecond + 1;
+}
+
+std::string readableDateText(double secondsSinceReferenceDate) {
+    std::string text = xmlDateText(secondsSinceReferenceDate);
+    text[10] = ' ';
+    text.pop_back();  // the Z
+    return text;
 }
 
 std::string xmlDateText(double secondsSinceReferenceDate) {

@@ -1,8 +1,8 @@
 #include "plist/Value.h"
 
 #include <charconv>
-#include <cmath>
-#include <ctime>
+
+#include "plist/DateText.h"
 
 namespace tavrix::plist {
 
@@ -72,16 +72,11 @@ void appendReal(std::string& out, double value) {
 }
 
 void appendDate(std::string& out, const Date& date) {
-    double unixTime = date.unixTime();
-    std::time_t seconds = static_cast<std::time_t>(std::floor(unixTime));
-    std::tm utc{};
-    char buffer[64];
-    if (gmtime_r(&seconds, &utc) == nullptr ||
-        std::strftime(buffer, sizeof buffer, "%Y-%m-%d %H:%M:%S +0000", &utc) == 0) {
+    if (!hasDateText(date.secondsSinceReferenceDate)) {
         appendReal(out, date.secondsSinceReferenceDate);
         return;
     }
-    out += buffer;
+    out += readableDateText(date.secondsSinceReferenceDate) + " +0000";
 }
 
 void appendData(std::string& out, const Data& data) {

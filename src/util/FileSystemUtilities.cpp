@@ -9,6 +9,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <cmath>
+#include <cstdint>
 #include <cstdio>
 #include <cstring>
 #include <filesystem>
@@ -183,13 +184,27 @@ int compareIntegerWithReal(const plist::Integer& a, double b) {
     if (b < -0x1p63) {
         return 1;
     }
-    __int128 whole = static_cast<__int128>(std::trunc(b));
-    __int128 value = a.isLargeUnsigned() ? static_cast<__int128>(a.unsignedValue())
-                                         : static_cast<__int128>(a.signedValue());
-    if (value != whole) {
-        return value < whole ? -1 : 1;
+    // The whole part fits the integer's own type once the other's range is ruled out (no
+    // 128-bit integers on 32-bit processors).
+    const double whole = std::trunc(b);
+    if (a.isLargeUnsigned()) {
+        if (whole < 0) {
+            return 1;
+        }
+        const auto wholeUnsigned = static_cast<std::uint64_t>(whole);
+        if (a.unsignedValue() != wholeUnsigned) {
+            return a.unsignedValue() < wholeUnsigned ? -1 : 1;
+        }
+    } else {
+        if (whole >= 0x1p63) {
+            return -1;
+        }
+        const auto wholeSigned = static_cast<std::int64_t>(whole);
+        if (a.signedValue() != wholeSigned) {
+            return a.signedValue() < wholeSigned ? -1 : 1;
+        }
     }
-    double fraction = b - std::trunc(b);
+    double fraction = b - whole;
     return fraction > 0 ? -1 : (fraction < 0 ? 1 : 0);
 }
 

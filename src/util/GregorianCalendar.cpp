@@ -1,3 +1,9 @@
+// The C library's 64-bit time functions, also where time_t is 32 bits wide by default (Debian
+// 12's armhf): local dates past 2038 are ordinary dates. Only this file asks for them, and no
+// time_t leaves it, so the rest of the program and the libraries it calls keep their time_t.
+#define _FILE_OFFSET_BITS 64
+#define _TIME_BITS 64
+
 #include "util/GregorianCalendar.h"
 
 #include <cmath>
@@ -6,6 +12,20 @@
 
 namespace tavrix {
 namespace {
+
+static_assert(sizeof(std::time_t) == 8);
+
+// The whole seconds of a date as a time_t, when they fit.
+std::optional<std::time_t> wholeSeconds(double unixTime) {
+    const double whole = std::floor(unixTime);
+    // time_t's limits as doubles: the minimum is exact, the maximum rounds up to 2^63.
+    constexpr double kTimeMin = static_cast<double>(std::numeric_limits<std::time_t>::min());
+    constexpr double kTimeMax = static_cast<double>(std::numeric_limits<std::time_t>::max());
+    if (!std::isfinite(whole) || whole < kTimeMin || whole >= kTimeMax) {
+        return std::nullopt;
+    }
+    return static_cast<std::time_t>(whole);
+}
 
 bool sameFields(const std::tm& a, const std::tm& b) {
     return a.tm_year == b.tm_year && a.tm_mon == b.tm_mon && a.tm_mday == b.tm_mday &&
@@ -27,16 +47,12 @@ bool mktimeFailed(std::time_t result, const std::tm& normalised) {
 
 std::optional<plist::Date> GregorianCalendar::addingDays(plist::Date date,
                                                          long numberOfDays) const {
-    double unixTime = date.unixTime();
-    double whole = std::floor(unixTime);
-    // time_t's limits as doubles: the minimum is exact, the maximum rounds up to 2^63.
-    constexpr double kTimeMin = static_cast<double>(std::numeric_limits<std::time_t>::min());
-    constexpr double kTimeMax = static_cast<double>(std::numeric_limits<std::time_t>::max());
-    if (!std::isfinite(whole) || whole < kTimeMin || whole >= kTimeMax) {
+    const std::optional<std::time_t> whole = wholeSeconds(date.unixTime());
+    if (!whole) {
         return std::nullopt;
     }
-    double fraction = unixTime - whole;
-    std::time_t seconds = static_cast<std::time_t>(whole);
+    std::time_t seconds = *whole;
+    const double fraction = date.unixTime() - static_cast<double>(seconds);
 
     ::tzset();  // pick up a TZ changed since the last conversion
     std::tm local{};
@@ -54,6 +70,20 @@ std::optional<plist::Date> GregorianCalendar::addingDays(plist::Date date,
         return std::nullopt;
     }
     return plist::Date::fromUnixTime(static_cast<double>(result) + fraction);
+}
+
+std::optional<std::string> GregorianCalendar::localText(plist::Date date, const char* format,
+                                                        locale_t locale) const {
+    const std::optional<std::time_t> seconds = wholeSeconds(date.unixTime());
+    ::tzset();
+    std::tm local{};
+    char text[256];
+    if (!seconds || ::localtime_r(&*seconds, &local) == nullptr ||
+        (locale != locale_t{} ? ::strftime_l(text, sizeof text, format, &local, locale)
+                              : std::strftime(text, sizeof text, format, &local)) == 0) {
+        return std::nullopt;
+    }
+    return text;
 }
 
 }  // namespace tavrix

@@ -22,6 +22,7 @@
 #include "catalog/CatalogCrypto.h"
 #include "catalog/Sha256.h"
 #include "device/PlatformRoot.h"
+#include "plist/DateText.h"
 #include "plist/PropertyListFormat.h"
 #include "update/ActivityRecord.h"
 #include "update/AssetHandler.h"
@@ -145,12 +146,13 @@ class AssetCatalogTest : public testing::Test {
         ASSERT_TRUE(plist::writeFile(path, plist::Value(std::move(extra))));
     }
 
-    // An unsigned catalog of serial 1 (none when serial is 0) valid for an hour.
+    // An unsigned catalog of serial 1 (none when serial is 0) valid for an hour, or until expires.
     static std::string catalogBytes(plist::Value assets, const char* type = kAssetType,
-                                    int serial = 1) {
+                                    int serial = 1, std::optional<plist::Date> expires = {}) {
         plist::Dictionary catalog{
             {"AssetType", plist::Value(type)},
-            {"Expires", plist::Value(plist::Date{Clock::absoluteTimeNow() + 3600})},
+            {"Expires",
+             plist::Value(expires.value_or(plist::Date{Clock::absoluteTimeNow() + 3600}))},
             {"Assets", std::move(assets)}};
         if (serial != 0) {
             catalog.emplace("Serial", plist::Value(serial));
@@ -447,6 +449,25 @@ TEST_F(AssetCatalogTest, DamagedCatalogsAreRefusedAndMalformedEntriesSkipped) {
         EXPECT_FALSE(query().has_value());
         EXPECT_EQ(logLinesContaining(reason), 1u);
     }
+
+    // Past 2038, where a 32-bit time_t ends, a catalog is taken until it expires, then refused
+    // with both dates.
+    const plist::Date expires{*plist::parseXmlDateText("2040-02-29T12:00:00Z")};
+    auto clockAt = [](double secondsSinceReferenceDate) {
+        return std::chrono::duration_cast<Clock::Offset>(
+            std::chrono::duration<double>(secondsSinceReferenceDate - Clock::absoluteTimeNow()));
+    };
+    server.serve("/catalog/catalog.plist",
+                 bodyResponse(catalogBytes(entries, kAssetType, 1, expires)));
+    {
+        ScopedClockOffset hourBefore(clockAt(expires.secondsSinceReferenceDate - 3600));
+        EXPECT_EQ(query().value_or(Assets()).size(), 1u);
+    }
+    ScopedClockOffset dayAfter(clockAt(expires.secondsSinceReferenceDate + 86400));
+    sink.clear();
+    EXPECT_FALSE(query().has_value());
+    EXPECT_EQ(
+        logLinesContaining("it expired at 2040-02-29 12:00:00 UTC, it is now 2040-03-01 12:0"), 1u);
 }
 
 // A download reports its steps in order, installs identical files in a directory of its own and

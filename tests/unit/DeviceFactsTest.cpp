@@ -16,6 +16,7 @@
 #include "device/MobileUser.h"
 #include "device/RunningSystemFacts.h"
 #include "device/TXUtility.h"
+#include "plist/DateText.h"
 #include "plist/PropertyListFormat.h"
 #include "util/SystemLog.h"
 
@@ -316,6 +317,12 @@ TEST_F(CalendarInZone, DaysFollowTheWallClockAcrossDaylightSaving) {
         locale ? std::optional<std::string>(locale) : std::nullopt;
     ::setenv("LC_ALL", "C", 1);
     EXPECT_EQ(TXUtility::prettyPrintDate(localDate(2026, 3, 7, 9, 5)), "03/07/26 09:05");
+    // The same past 2038, where a 32-bit time_t ends (so the dates are written in UTC here).
+    auto utc = [](const char* text) { return plist::Date{*plist::parseXmlDateText(text)}; };
+    auto spring2040 = TXUtility::addToDate(utc("2040-03-10T17:00:00Z"), 1);  // noon EST
+    ASSERT_TRUE(spring2040.has_value());
+    EXPECT_EQ(*spring2040, utc("2040-03-11T16:00:00Z"));  // noon EDT
+    EXPECT_EQ(TXUtility::prettyPrintDate(*spring2040), "03/11/40 12:00");
     saved ? ::setenv("LC_ALL", saved->c_str(), 1) : ::unsetenv("LC_ALL");
 }
 

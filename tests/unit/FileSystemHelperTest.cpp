@@ -8,8 +8,10 @@
 #include <cerrno>
 #include <climits>
 #include <cmath>
+#include <cstdint>
 #include <functional>
 #include <sstream>
+#include <tuple>
 
 #include "TestSupport.h"
 #include "plist/PropertyListFormat.h"
@@ -281,6 +283,21 @@ TEST(FileSystemUtilities, CompareNumbersNullsFirst) {
     EXPECT_EQ(compareNumbersNullsFirst(&huge, &one), 1);
     EXPECT_EQ(compareNumbersNullsFirst(&nan, &half), -1);
     EXPECT_EQ(compareNumbersNullsFirst(&text, &one), -1);
+    // Exact at the edges of both integer widths, with the real's fraction deciding a tie.
+    const std::int64_t twoTo53 = std::int64_t{1} << 53;
+    for (auto [integer, real, expected] :
+         {std::tuple{plist::Integer::fromUnsigned(UINT64_MAX), 0x1p64, -1},
+          std::tuple{plist::Integer::fromUnsigned(std::uint64_t{1} << 63), 0x1p63, 0},
+          std::tuple{plist::Integer::fromUnsigned(std::uint64_t{1} << 63), -1.0, 1},
+          std::tuple{plist::Integer(INT64_MAX), 0x1p63, -1},
+          std::tuple{plist::Integer(INT64_MIN), -0x1p63, 0},
+          std::tuple{plist::Integer(twoTo53 + 1), 0x1p53, 1},
+          std::tuple{plist::Integer(-1), -0.5, -1}, std::tuple{plist::Integer(0), -0.5, 1},
+          std::tuple{plist::Integer(2), 2.25, -1}}) {
+        plist::Value a(integer), b(real);
+        EXPECT_EQ(compareNumbersNullsFirst(&a, &b), expected) << a.description() << " " << real;
+        EXPECT_EQ(compareNumbersNullsFirst(&b, &a), -expected) << a.description() << " " << real;
+    }
 }
 
 TEST(FileSystemUtilities, ProcessNamesAndDictionaryFiles) {

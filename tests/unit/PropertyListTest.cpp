@@ -81,8 +81,9 @@ TEST(PropertyListXml, ReadsValuesWrittenByOthers) {
     EXPECT_EQ(xml.rfind("<?xml", 0), 0u);
 }
 
-// Dates far from the reference date (past 2038, before 1901) keep their value on every machine;
-// beyond year 9999, which the XML form cannot spell, they are clamped.
+// Dates far from the reference date (past 2038, before 1901) keep their value and their text on
+// every machine, a 32-bit time_t's included; beyond year 9999, which the XML form cannot spell,
+// they are clamped.
 TEST(PropertyListDates, XmlHoldsWholeSecondsAndBinaryKeepsFractions) {
     for (auto [seconds, text] : {std::pair{123456.75, "2001-01-02T10:17:36Z"},
                                  std::pair{-86400.25, "2000-12-30T23:59:59Z"},
@@ -93,6 +94,9 @@ TEST(PropertyListDates, XmlHoldsWholeSecondsAndBinaryKeepsFractions) {
         EXPECT_NE(xml.find(std::string("<date>") + text + "</date>"), std::string::npos) << xml;
         EXPECT_EQ(parse(xml), Value(Date{std::floor(seconds)}));
         EXPECT_EQ(parse(serialize(date, Format::Binary)), date);
+        std::string readable = text;
+        readable[10] = ' ';
+        EXPECT_EQ(date.description(), readable.replace(19, 1, " +0000"));
     }
     EXPECT_NE(serialize(Value(Date{1e15})).find("<date>9999-12-31T23:59:59Z</date>"),
               std::string::npos);
@@ -176,9 +180,10 @@ TEST(PlistTool, PipesThroughStandardStreamsAndKeepsTypesInJson) {
                     "<plist version=\"1.0\"><dict><key>n</key><integer>1500</integer>"
                     "<key>s</key><string>1500</string><key>r</key><real>1500</real>"
                     "<key>d</key><data>AAEC/w==</data>"
-                    "<key>t</key><date>2026-12-07T23:49:17Z</date></dict></plist>");
+                    "<key>t</key><date>2040-02-29T23:49:17.25Z</date></dict></plist>");
     const std::string tool = "'" TAVRIX_PLIST_TOOL "'";
-    // XML in, binary through a pipe, typed JSON out, read by Python.
+    // XML in, binary through a pipe, typed JSON out, read by Python; the date past 2038 keeps its
+    // fraction and its text with a 32-bit time_t too.
     test::CommandResult piped = test::runCommand(
         {"/bin/bash", "-c",
          "set -o pipefail; " + tool + " --binary '" + source + "' - | " + tool +
@@ -186,7 +191,7 @@ TEST(PlistTool, PipesThroughStandardStreamsAndKeepsTypesInJson) {
              "print(repr(v[\"n\"]), repr(v[\"s\"]), repr(v[\"r\"]), v[\"d\"], v[\"t\"])'"});
     EXPECT_EQ(piped.status, 0) << piped.output;
     EXPECT_EQ(piped.output,
-              "1500 '1500' 1500.0 {'$data': 'AAEC/w=='} {'$date': '2026-12-07T23:49:17Z'}\n");
+              "1500 '1500' 1500.0 {'$data': 'AAEC/w=='} {'$date': '2040-02-29T23:49:17.25Z'}\n");
 
     test::CommandResult refused =
         test::runCommand({"/bin/bash", "-c", "echo 'not a plist' | " + tool + " -"});

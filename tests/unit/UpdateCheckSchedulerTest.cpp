@@ -13,6 +13,7 @@
 #include "bus/TXTransactionManager.h"
 #include "daemon/UpdateCheckScheduler.h"
 #include "device/BehaviorPreferences.h"
+#include "plist/DateText.h"
 #include "plist/PropertyListFormat.h"
 #include "util/Clock.h"
 
@@ -99,6 +100,19 @@ TEST_F(UpdateCheckSchedulerTest, ArmsFifteenDaysAheadUnlessAFutureTimeIsStored) 
     setNextUpdate(Clock::absoluteTimeNow() + 20 * 365 * 86400.0);
     scheduler.startTimer();
     expectArmedFifteenDaysAhead();
+
+    // The same past 2038, where a 32-bit time_t ends: the time stored now lies behind, and one
+    // stored a day ahead stays.
+    ScopedClockOffset in2040(
+        std::chrono::duration_cast<Clock::Offset>(std::chrono::duration<double>(
+            *plist::parseXmlDateText("2040-02-29T12:00:00Z") - Clock::absoluteTimeNow())));
+    scheduler.startTimer();
+    expectArmedFifteenDaysAhead();
+    const double ahead2040 = std::floor(Clock::absoluteTimeNow()) + 86400.0;
+    setNextUpdate(ahead2040);
+    scheduler.startTimer();
+    EXPECT_EQ(nextUpdate(), std::optional<double>(ahead2040));
+    EXPECT_EQ(registeredJobs().size(), 1u);
 }
 
 TEST_F(UpdateCheckSchedulerTest, UnsupportedDeviceRegistersNothingAndKeepsNextUpdate) {
