@@ -126,7 +126,7 @@ watcher=$!
 sleep 1
 step "a behavior ID with a packed bundle" 'tavrixctl set-id Boot-Test --bundle /root/test/Default.tgz'
 wait "$watcher"
-step "nobody hears kTVXBehaviorBundleChangedNotification" \
+step "the user nobody hears kTVXBehaviorBundleChangedNotification" \
     'cat /root/test/watch.out; grep -qx kTVXBehaviorBundleChangedNotification /root/test/watch.out'
 step "the links lead the mobile user to the installed bundle's carrier file" \
     'ls -l /var/mobile/Library/Tavrix.bundle /var/mobile/Library/Preferences/com.zandor.tavrix.plist &&
