@@ -4,14 +4,10 @@
 #include "device/PlatformRoot.h"
 #include "device/TXUtility.h"
 #include "util/Log.h"
+#include "util/SharedInstance.h"
 
 namespace tavrix {
 namespace {
-
-struct BundleLocations {
-    std::string system;
-    std::string user;
-};
 
 BundleLocations computeLocations() {
     const std::optional<std::string>& deviceClass = TXUtility::currentProductCategory();
@@ -26,16 +22,15 @@ BundleLocations computeLocations() {
     return computed;
 }
 
-// Computed and logged by the first caller from any thread; fixed for the process's life.
+// Computed and logged by the first caller from any thread; fixed for the root's life.
 const BundleLocations& locations() {
-    static const BundleLocations instance = [] {
+    return SharedInstance<BundleLocations>::current().instance([] {
         logCFormat("Initializing Carrier Bundle Locations\n");
-        BundleLocations computed = computeLocations();
-        logCFormat("Using %s and %s for respective locations\n", computed.system.c_str(),
-                   computed.user.c_str());
+        auto computed = std::make_unique<BundleLocations>(computeLocations());
+        logCFormat("Using %s and %s for respective locations\n", computed->system.c_str(),
+                   computed->user.c_str());
         return computed;
-    }();
-    return instance;
+    });
 }
 
 }  // namespace

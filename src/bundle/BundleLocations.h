@@ -12,6 +12,11 @@ inline constexpr const char* kUserBundlesDirectory = "/Library/TavrixBundles/";
 inline constexpr const char* kDefaultBundleName = "Default.bundle";
 inline constexpr const char* kBaseCarrierFileName = "behavior.plist";
 
+struct BundleLocations {
+    std::string system;
+    std::string user;
+};
+
 // Computes both locations once per process and logs them; later calls do nothing.
 void initializeBundleLocations();
 

@@ -5,6 +5,7 @@
 // below.
 #pragma once
 
+#include "bundle/BundleLocations.h"
 #include "bundle/BundleManager.h"
 #include "bus/ServiceManager.h"
 #include "bus/TXTransactionManager.h"
@@ -13,6 +14,8 @@
 #include "daemon/TXManager.h"
 #include "daemon/TXManagerServer.h"
 #include "daemon/UpdateCheckScheduler.h"
+#include "device/BuildCapabilities.h"
+#include "device/MobileUser.h"
 #include "device/PreferencesStore.h"
 #include "device/TXUtility.h"
 #include "util/SharedInstance.h"
@@ -22,6 +25,8 @@ namespace tavrix {
 class Daemon {
   public:
     Daemon() = default;
+    // Stops the workers if the run loop did not, then ends the objects in reverse order.
+    ~Daemon() { stopWorkers(); }
     Daemon(const Daemon&) = delete;
     Daemon& operator=(const Daemon&) = delete;
 
@@ -34,7 +39,12 @@ class Daemon {
     // progress reports, reports install bundles.
     void stopWorkers();
 
-    // In the order they are first needed; what depends on another comes after it.
+    // In the order they are first needed; what depends on another comes after it. The facts
+    // about the device come first: they hold for the root's whole life.
+    SharedInstance<TXUtility::StringFacts> deviceStrings_;
+    SharedInstance<device::BuildCapabilities::Facts> build_;
+    SharedInstance<device::MobileUser::Facts> mobileUser_;
+    SharedInstance<BundleLocations> bundleLocations_;
     SharedInstance<device::PreferencesStore> preferences_;
     SharedInstance<bus::ServiceManager> serviceManager_;
     SharedInstance<TXTransactionManager> transactions_;

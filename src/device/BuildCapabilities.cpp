@@ -1,6 +1,7 @@
 #include "device/BuildCapabilities.h"
 
 #include "device/DeviceInfoService.h"
+#include "util/SharedInstance.h"
 
 namespace tavrix::device {
 namespace {
@@ -34,9 +35,10 @@ BuildCapabilities::Facts BuildCapabilities::decide(const plist::Dictionary& answ
 }
 
 const BuildCapabilities::Facts& BuildCapabilities::facts() {
-    static const Facts kFacts = decide(
-        device::copyDeviceAnswers({"InternalBuild", "CarrierInstallCapability", "ReleaseType"}));
-    return kFacts;
+    return SharedInstance<Facts>::current().instance([] {
+        return std::make_unique<Facts>(decide(device::copyDeviceAnswers(
+            {"InternalBuild", "CarrierInstallCapability", "ReleaseType"})));
+    });
 }
 
 bool BuildCapabilities::isInternalBuild() {

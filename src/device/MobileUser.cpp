@@ -2,6 +2,7 @@
 
 #include "device/PlatformRoot.h"
 #include "device/UserDatabase.h"
+#include "util/SharedInstance.h"
 
 namespace tavrix::device {
 
@@ -23,8 +24,8 @@ const std::string& MobileUser::name() {
 }
 
 const MobileUser::Facts& MobileUser::facts() {
-    static const Facts kFacts = lookUpUnder(device::platformRoot());
-    return kFacts;
+    return SharedInstance<Facts>::current().instance(
+        [] { return std::make_unique<Facts>(lookUpUnder(device::platformRoot())); });
 }
 
 const char* MobileUser::homeDirectory() {

@@ -69,6 +69,18 @@ std::optional<std::string> homeDirectory() {
     }
 }
 
+// The answer for key, asked the first time and kept by the root for the rest of its life.
+const std::optional<std::string>& stringFact(std::string_view key) {
+    auto& facts = SharedInstance<TXUtility::StringFacts>::current().instance(
+        [] { return std::make_unique<TXUtility::StringFacts>(); });
+    std::lock_guard lock(facts.mutex);
+    auto found = facts.answers.find(key);
+    if (found == facts.answers.end()) {
+        found = facts.answers.emplace(std::string(key), device::copyDeviceStringAnswer(key)).first;
+    }
+    return found->second;
+}
+
 }  // namespace
 
 TXUtility::TaskQueue& TXUtility::taskQueue() {
@@ -93,38 +105,31 @@ bool TXUtility::hasCellularRadio() {
 }
 
 const std::optional<std::string>& TXUtility::serialNumber() {
-    static const std::optional<std::string> fact = device::copyDeviceStringAnswer("SerialNumber");
-    return fact;
+    return stringFact("SerialNumber");
 }
 
 const std::optional<std::string>& TXUtility::currentProductCategory() {
-    static const std::optional<std::string> fact = device::copyDeviceStringAnswer("DeviceClass");
-    return fact;
+    return stringFact("DeviceClass");
 }
 
 const std::optional<std::string>& TXUtility::currentProductType() {
-    static const std::optional<std::string> fact = device::copyDeviceStringAnswer("ProductType");
-    return fact;
+    return stringFact("ProductType");
 }
 
 const std::optional<std::string>& TXUtility::currentProductVersion() {
-    static const std::optional<std::string> fact = device::copyDeviceStringAnswer("ProductVersion");
-    return fact;
+    return stringFact("ProductVersion");
 }
 
 const std::optional<std::string>& TXUtility::currentProductBuild() {
-    static const std::optional<std::string> fact = device::copyDeviceStringAnswer("BuildVersion");
-    return fact;
+    return stringFact("BuildVersion");
 }
 
 const std::optional<std::string>& TXUtility::currentReleaseType() {
-    static const std::optional<std::string> fact = device::copyDeviceStringAnswer("ReleaseType");
-    return fact;
+    return stringFact("ReleaseType");
 }
 
 const std::optional<std::string>& TXUtility::currentHardwareModel() {
-    static const std::optional<std::string> fact = device::copyDeviceStringAnswer("HWModelStr");
-    return fact;
+    return stringFact("HWModelStr");
 }
 
 bool TXUtility::freeSpaceExceeds(std::uint64_t blockSize, std::uint64_t freeBlocks,

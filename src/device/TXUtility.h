@@ -4,6 +4,9 @@
 
 #include <chrono>
 #include <cstdint>
+#include <functional>
+#include <map>
+#include <mutex>
 #include <optional>
 #include <string>
 
@@ -35,6 +38,10 @@ class TXUtility {
 
     // String facts, asked on the first call only. Nil when the answer is missing or not a string,
     // and then for the rest of the process's life.
+    struct StringFacts {
+        std::mutex mutex;
+        std::map<std::string, std::optional<std::string>, std::less<>> answers;
+    };
     static const std::optional<std::string>& serialNumber();
     static const std::optional<std::string>& currentProductCategory();
     static const std::optional<std::string>& currentProductType();

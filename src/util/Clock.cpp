@@ -10,9 +10,9 @@
 namespace tavrix {
 namespace {
 
-// Ticks of the system clock's duration; trivially destructible, so threads still running while
-// the process exits may read it.
-std::atomic<Clock::Offset::rep> offsetTicks{0};
+// Null for the system clock; trivially destructible, so threads still running while the process
+// exits may read it.
+std::atomic<ClockSource*> installedSource{nullptr};
 
 struct Subscribers {
     std::mutex mutex;
@@ -25,19 +25,7 @@ Subscribers& subscribers() {
     return *registry;
 }
 
-}  // namespace
-
-Clock::TimePoint Clock::now() {
-    return std::chrono::system_clock::now() + offset();
-}
-
-double Clock::absoluteTimeNow() {
-    std::chrono::duration<double> sinceEpoch = now().time_since_epoch();
-    return plist::Date::fromUnixTime(sinceEpoch.count()).secondsSinceReferenceDate;
-}
-
-void Clock::setOffset(Offset offset) {
-    offsetTicks.store(offset.count());
+void notifySubscribers() {
     // Called under the lock, so that a subscription being destroyed waits for its callback.
     Subscribers& registry = subscribers();
     std::lock_guard lock(registry.mutex);
@@ -46,8 +34,26 @@ void Clock::setOffset(Offset offset) {
     }
 }
 
-Clock::Offset Clock::offset() {
-    return Offset(offsetTicks.load());
+}  // namespace
+
+Clock::TimePoint Clock::now() {
+    ClockSource* source = installedSource.load(std::memory_order_acquire);
+    return source != nullptr ? source->now() : std::chrono::system_clock::now();
+}
+
+double Clock::absoluteTimeNow() {
+    std::chrono::duration<double> sinceEpoch = now().time_since_epoch();
+    return plist::Date::fromUnixTime(sinceEpoch.count()).secondsSinceReferenceDate;
+}
+
+Clock::ScopedSource::ScopedSource(ClockSource& source)
+    : previous_(installedSource.exchange(&source, std::memory_order_acq_rel)) {
+    notifySubscribers();
+}
+
+Clock::ScopedSource::~ScopedSource() {
+    installedSource.store(previous_, std::memory_order_release);
+    notifySubscribers();
 }
 
 Clock::ChangeSubscription::ChangeSubscription(std::function<void()> onChange)

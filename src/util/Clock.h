@@ -1,5 +1,6 @@
-// Wall-clock time for the daemon's schedules. Unit tests may shift it for the whole process, so
-// that a schedule days ahead can be reached without waiting; the daemon itself never does.
+// Wall-clock time for the daemon's schedules. It reads the system clock unless another source
+// is installed (tests put a clock days ahead here); timers that wait for a moment subscribe to
+// hear when the source changes, and recompute their deadlines.
 #pragma once
 
 #include <chrono>
@@ -8,23 +9,33 @@
 
 namespace tavrix {
 
+class ClockSource;
+
 class Clock {
   public:
     using TimePoint = std::chrono::system_clock::time_point;
-    using Offset = std::chrono::system_clock::duration;
+    using Duration = std::chrono::system_clock::duration;
 
-    // The current time: the system's wall clock plus the test offset.
+    // The current time from the installed source.
     static TimePoint now();
 
     // The current time as seconds since 2001-01-01 00:00:00 UTC, as property-list dates hold it.
     static double absoluteTimeNow();
 
-    // Replaces the test offset and runs every change callback (unit tests only).
-    static void setOffset(Offset offset);
-    static Offset offset();
+    // Installs a source for every thread while the guard lives, and runs every change callback
+    // when it comes and when it goes. Guards nest.
+    class ScopedSource {
+      public:
+        explicit ScopedSource(ClockSource& source);
+        ~ScopedSource();
+        ScopedSource(const ScopedSource&) = delete;
+        ScopedSource& operator=(const ScopedSource&) = delete;
 
-    // Keeps a callback that runs after each change of the offset, until the object goes.
-    // Timers use it to recompute deadlines they are waiting for.
+      private:
+        ClockSource* previous_;
+    };
+
+    // Keeps a callback that runs after each change of the source, until the object goes.
     class ChangeSubscription {
       public:
         explicit ChangeSubscription(std::function<void()> onChange);
@@ -37,18 +48,10 @@ class Clock {
     };
 };
 
-// Shifts the clock by offset while the object lives (unit tests).
-class ScopedClockOffset {
+class ClockSource {
   public:
-    explicit ScopedClockOffset(Clock::Offset offset) : previous_(Clock::offset()) {
-        Clock::setOffset(offset);
-    }
-    ~ScopedClockOffset() { Clock::setOffset(previous_); }
-    ScopedClockOffset(const ScopedClockOffset&) = delete;
-    ScopedClockOffset& operator=(const ScopedClockOffset&) = delete;
-
-  private:
-    Clock::Offset previous_;
+    virtual ~ClockSource() = default;
+    virtual Clock::TimePoint now() = 0;
 };
 
 }  // namespace tavrix

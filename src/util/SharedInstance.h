@@ -1,8 +1,8 @@
 // Where the one instance of a long-lived object lives. The daemon's root object owns a slot for
 // each such type (SharedInstance<T> members, installed while it lives); T::sharedInstance() answers
 // the instance in the installed slot, made there on first use, and the root destroys it, after
-// joining every thread, when it ends. A process without a root (a tool, a unit test) gets a slot
-// of its own on first use, which lasts until the process exits.
+// joining every thread, when it ends. A process without a root (a tool) gets a slot of its own
+// on first use, which lasts until the process exits.
 #pragma once
 
 #include <atomic>

@@ -144,31 +144,4 @@ ScopedLogSink::~ScopedLogSink() {
     overridingSink.store(previous_, std::memory_order_release);
 }
 
-void CapturingLogSink::write(int priority, std::string_view message) {
-    std::lock_guard lock(mutex_);
-    messages_.emplace_back(message);
-    priorities_.push_back(priority);
-}
-
-std::vector<int> CapturingLogSink::priorities() const {
-    std::lock_guard lock(mutex_);
-    return priorities_;
-}
-
-std::vector<std::string> CapturingLogSink::messages() const {
-    std::lock_guard lock(mutex_);
-    return messages_;
-}
-
-bool CapturingLogSink::contains(std::string_view message) const {
-    std::lock_guard lock(mutex_);
-    return std::find(messages_.begin(), messages_.end(), message) != messages_.end();
-}
-
-void CapturingLogSink::clear() {
-    std::lock_guard lock(mutex_);
-    messages_.clear();
-    priorities_.clear();
-}
-
 }  // namespace tavrix

@@ -8,7 +8,6 @@
 
 #include <syslog.h>
 
-#include <mutex>
 #include <string>
 #include <string_view>
 #include <utility>
@@ -49,22 +48,6 @@ class ScopedLogSink {
 
   private:
     LogSink* previous_;
-};
-
-// A sink that keeps every message, for tests that assert exact lines.
-class CapturingLogSink : public LogSink {
-  public:
-    void write(int priority, std::string_view message) override;
-    std::vector<std::string> messages() const;
-    // The priority of each message, in the same order.
-    std::vector<int> priorities() const;
-    bool contains(std::string_view message) const;
-    void clear();
-
-  private:
-    mutable std::mutex mutex_;
-    std::vector<std::string> messages_;
-    std::vector<int> priorities_;
 };
 
 }  // namespace tavrix

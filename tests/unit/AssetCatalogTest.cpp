@@ -15,6 +15,7 @@
 #include "ArchiveFixtures.h"
 #include "LocalHttpServer.h"
 #include "PrivateBus.h"
+#include "TestDoubles.h"
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
 #include "catalog/AssetCatalog.h"
@@ -26,9 +27,7 @@
 #include "plist/PropertyListFormat.h"
 #include "update/ActivityRecord.h"
 #include "update/AssetHandler.h"
-#include "util/Clock.h"
 #include "util/SharedLibrary.h"
-#include "util/SystemLog.h"
 
 namespace tavrix::catalog {
 namespace {
@@ -454,7 +453,7 @@ TEST_F(AssetCatalogTest, DamagedCatalogsAreRefusedAndMalformedEntriesSkipped) {
     // with both dates.
     const plist::Date expires{*plist::parseXmlDateText("2040-02-29T12:00:00Z")};
     auto clockAt = [](double secondsSinceReferenceDate) {
-        return std::chrono::duration_cast<Clock::Offset>(
+        return std::chrono::duration_cast<Clock::Duration>(
             std::chrono::duration<double>(secondsSinceReferenceDate - Clock::absoluteTimeNow()));
     };
     server.serve("/catalog/catalog.plist",

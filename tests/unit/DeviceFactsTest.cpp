@@ -9,6 +9,7 @@
 #include <filesystem>
 #include <tuple>
 
+#include "TestDoubles.h"
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
 #include "device/BuildCapabilities.h"
@@ -18,7 +19,6 @@
 #include "device/TXUtility.h"
 #include "plist/DateText.h"
 #include "plist/PropertyListFormat.h"
-#include "util/SystemLog.h"
 
 namespace tavrix::device {
 namespace {

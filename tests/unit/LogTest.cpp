@@ -1,8 +1,8 @@
 #include <gtest/gtest.h>
 
+#include "TestDoubles.h"
 #include "plist/Value.h"
 #include "util/Log.h"
-#include "util/SystemLog.h"
 
 namespace tavrix {
 namespace {

@@ -12,6 +12,7 @@
 #include <vector>
 
 #include "LocalHttpServer.h"
+#include "TestDoubles.h"
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
 #include "bundle/BundleLinks.h"
@@ -22,7 +23,6 @@
 #include "device/PlatformRoot.h"
 #include "plist/PropertyListFormat.h"
 #include "plist/Value.h"
-#include "util/SystemLog.h"
 
 namespace tavrix {
 namespace {

@@ -11,6 +11,7 @@
 #include <string>
 
 #include "ArchiveFixtures.h"
+#include "TestDoubles.h"
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
 #include "bundle/BundleLocations.h"
@@ -19,7 +20,6 @@
 #include "io/UniqueFd.h"
 #include "payload/Archive.h"
 #include "payload/PayloadUnpack.h"
-#include "util/SystemLog.h"
 
 namespace tavrix::payload {
 namespace {

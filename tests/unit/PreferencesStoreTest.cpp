@@ -10,11 +10,11 @@
 #include <functional>
 #include <thread>
 
+#include "TestDoubles.h"
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
 #include "device/PreferencesStore.h"
 #include "plist/PropertyListFormat.h"
-#include "util/SystemLog.h"
 
 namespace tavrix {
 namespace {

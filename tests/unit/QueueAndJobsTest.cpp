@@ -14,11 +14,11 @@
 #include <thread>
 #include <vector>
 
+#include "TestDoubles.h"
 #include "TestSupport.h"
 #include "bus/BackgroundJobScheduler.h"
 #include "plist/PropertyListFormat.h"
 #include "util/SerialQueue.h"
-#include "util/SystemLog.h"
 
 namespace tavrix::bus {
 namespace {

@@ -3,11 +3,11 @@
 #include <cstdlib>
 #include <filesystem>
 
+#include "TestDoubles.h"
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
 #include "bus/ServiceManager.h"
 #include "bus/TXTransactionManager.h"
-#include "util/SystemLog.h"
 
 namespace tavrix {
 namespace {

@@ -8,6 +8,7 @@
 #include <string>
 #include <vector>
 
+#include "TestDoubles.h"
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
 #include "bus/TXTransactionManager.h"
@@ -15,7 +16,6 @@
 #include "device/BehaviorPreferences.h"
 #include "plist/DateText.h"
 #include "plist/PropertyListFormat.h"
-#include "util/Clock.h"
 
 namespace tavrix {
 namespace {
@@ -104,7 +104,7 @@ TEST_F(UpdateCheckSchedulerTest, ArmsFifteenDaysAheadUnlessAFutureTimeIsStored) 
     // The same past 2038, where a 32-bit time_t ends: the time stored now lies behind, and one
     // stored a day ahead stays.
     ScopedClockOffset in2040(
-        std::chrono::duration_cast<Clock::Offset>(std::chrono::duration<double>(
+        std::chrono::duration_cast<Clock::Duration>(std::chrono::duration<double>(
             *plist::parseXmlDateText("2040-02-29T12:00:00Z") - Clock::absoluteTimeNow())));
     scheduler.startTimer();
     expectArmedFifteenDaysAhead();
