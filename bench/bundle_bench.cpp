@@ -158,7 +158,7 @@ void benchMerge() {
         std::string overlayKey = i % 2 == 0 ? key : "New" + std::to_string(i);
         overlay.emplace(overlayKey, plist::Dictionary{{"Value", -1}});
     }
-    const std::string baseXml = plist::serialize(plist::Value(base));
+    const std::string baseXml = *plist::serialize(plist::Value(base));
 
     std::size_t mergedSize = 0;
     double ours = bench::medianMicros(

@@ -41,7 +41,7 @@ plist_t libplistParse(const std::string& bytes) {
 }
 
 void compare(const char* label, const plist::Value& document, plist::Format format) {
-    std::string bytes = plist::serialize(document, format);
+    std::string bytes = *plist::serialize(document, format);
     std::unique_ptr<void, NodeDeleter> node(libplistParse(bytes));
     if (!node || !plist::parse(bytes)) {
         std::fprintf(stderr, "cannot read back the %s document\n", label);

@@ -269,10 +269,9 @@ std::optional<Completion> completionFrom(const std::vector<Argument>& arguments,
                       : unsignedCatalog ? Completion::Mode::Unsigned
                                         : Completion::Mode::SignNow;
     if (!keyPath.empty()) {
-        std::string error;
-        auto secretKey = tavrix::tools::readSecretKey(keyPath, error);
+        auto secretKey = tavrix::tools::readSecretKey(keyPath);
         if (!secretKey) {
-            status = failure(error);
+            status = failure(secretKey.reason());
             return std::nullopt;
         }
         completion.signer = tavrix::tools::CatalogSigner{*secretKey, {}, {}};
@@ -280,8 +279,8 @@ std::optional<Completion> completionFrom(const std::vector<Argument>& arguments,
     return completion;
 }
 
-int finish(const std::optional<std::string>& error) {
-    return error ? failure(*error) : 0;
+int finish(const tavrix::Result<>& done) {
+    return done ? 0 : failure(done.reason());
 }
 
 int runKeygen(const std::vector<Argument>& arguments) {
@@ -289,10 +288,9 @@ int runKeygen(const std::vector<Argument>& arguments) {
     if (operands.size() != 2) {
         return usageError("keygen takes SECRET_KEY_FILE PUBLIC_KEY_FILE");
     }
-    std::string error;
-    auto publicKey = tavrix::tools::generateKeyPair(operands[0], operands[1], error);
+    auto publicKey = tavrix::tools::generateKeyPair(operands[0], operands[1]);
     if (!publicKey) {
-        return failure(error);
+        return failure(publicKey.reason());
     }
     std::printf("%s\n", publicKey->c_str());
     return 0;
@@ -404,24 +402,26 @@ std::optional<tavrix::tools::CatalogSigner> signerFrom(const std::vector<Argumen
         command = argument.code == kSigner ? argument.value : command;
         publicKeyPath = argument.code == kPublicKey ? argument.value : publicKeyPath;
     }
-    std::string error;
     tavrix::tools::CatalogSigner signer;
     if (!keyPath.empty() && command.empty() && publicKeyPath.empty()) {
-        signer.secretKey = tavrix::tools::readSecretKey(keyPath, error);
+        auto secretKey = tavrix::tools::readSecretKey(keyPath);
+        if (!secretKey) {
+            status = failure(secretKey.reason());
+            return std::nullopt;
+        }
+        signer.secretKey = *secretKey;
     } else if (commandAllowed && keyPath.empty() && !command.empty() && !publicKeyPath.empty()) {
         signer.command = command;
-        auto publicKey = tavrix::tools::readPublicKey(publicKeyPath, "", error);
-        if (publicKey) {
-            signer.publicKey = publicKey->publicKey;
+        auto publicKey = tavrix::tools::readPublicKey(publicKeyPath, "");
+        if (!publicKey) {
+            status = failure(publicKey.reason());
+            return std::nullopt;
         }
+        signer.publicKey = publicKey->publicKey;
     } else {
         status = usageError(commandAllowed
                                 ? "give --key FILE, or --signer COMMAND with --public-key FILE"
                                 : "give --key FILE");
-        return std::nullopt;
-    }
-    if (!error.empty()) {
-        status = failure(error);
         return std::nullopt;
     }
     return signer;
@@ -451,10 +451,9 @@ int runSignStdin(const std::vector<Argument>& arguments) {
         error != 0) {
         return failure(std::string("cannot read the catalog on stdin: ") + std::strerror(error));
     }
-    std::string error;
-    std::optional<std::string> signature = tavrix::tools::signCatalogBytes(*signer, bytes, error);
+    auto signature = tavrix::tools::signCatalogBytes(*signer, bytes);
     if (!signature) {
-        return failure(error);
+        return failure(signature.reason());
     }
     return std::fwrite(signature->data(), 1, signature->size(), stdout) == signature->size() &&
                    std::fflush(stdout) == 0
@@ -485,10 +484,9 @@ int runVerify(const std::vector<Argument>& arguments) {
             std::size_t equals = value.find('=');
             std::string identifier = equals == std::string::npos ? "" : value.substr(0, equals);
             std::string path = equals == std::string::npos ? value : value.substr(equals + 1);
-            std::string error;
-            auto key = tavrix::tools::readPublicKey(path, identifier, error);
+            auto key = tavrix::tools::readPublicKey(path, identifier);
             if (!key) {
-                return failure(error);
+                return failure(key.reason());
             }
             request.keys.push_back(*key);
         } else if (argument.code == kAllowUnsigned) {

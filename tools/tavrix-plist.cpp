@@ -76,7 +76,12 @@ std::optional<Value> readValue(const std::string& path) {
 
 bool writeValue(const std::string& path, const Value& value, Format format) {
     if (path == "-") {
-        return tavrix::io::writeAll(STDOUT_FILENO, serialize(value, format)) == 0;
+        tavrix::Result<std::string> bytes = serialize(value, format);
+        if (!bytes) {
+            std::fprintf(stderr, "tavrix-plist: %s\n", bytes.reason().c_str());
+            return false;
+        }
+        return tavrix::io::writeAll(STDOUT_FILENO, *bytes) == 0;
     }
     return writeFile(path, value, format);
 }

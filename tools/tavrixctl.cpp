@@ -400,9 +400,8 @@ int pack(const std::string& directory, const std::optional<std::string>& output)
     if (!output || output->empty()) {
         throw UsageError{"pack: -o FILE is required"};
     }
-    std::string notABundle;
-    if (!tavrix::tools::checkBundleDirectory(directory, notABundle)) {
-        throw Failure{"pack: refused " + notABundle};
+    if (auto bundle = tavrix::tools::checkBundleDirectory(directory); !bundle) {
+        throw Failure{"pack: refused " + bundle.reason()};
     }
 
     std::vector<FileToPack> files;

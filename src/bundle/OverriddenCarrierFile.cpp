@@ -115,8 +115,8 @@ std::optional<std::string> overriddenFilePath(OverlayContext& context) {
 
 bool writeOverriddenCarrierFile(const plist::Value& dictionary,
                                 const std::optional<std::string>& path) {
-    std::string xml = plist::serialize(dictionary, plist::Format::Xml);
-    if (xml.empty()) {
+    Result<std::string> xml = plist::serialize(dictionary);
+    if (!xml) {
         logCFormat(LogPriority::Warning, "Failed to serialize the overridden dictionary\n");
         return false;
     }
@@ -129,7 +129,7 @@ bool writeOverriddenCarrierFile(const plist::Value& dictionary,
         return false;
     }
     const int error = directory ? directory->writeFile(baseNameOfPath(*path), kOverriddenFileMode,
-                                                       /*replace=*/false, xml)
+                                                       /*replace=*/false, *xml)
                                 : EACCES;
     if (error != 0) {
         logCFormat(LogPriority::Warning,

@@ -251,15 +251,13 @@ void BackgroundJobScheduler::saveLocked() {
     for (const auto& [name, job] : jobs_) {
         contents.emplace(name, job.criteria);
     }
-    std::string whyNot;
-    std::string bytes =
-        plist::serialize(plist::Value(std::move(contents)), plist::Format::Xml, &whyNot);
-    if (bytes.empty()) {
+    Result<std::string> bytes = plist::serialize(plist::Value(std::move(contents)));
+    if (!bytes) {
         logCFormat("Background jobs: not saving the jobs of %s: %s", clientName_.c_str(),
-                   whyNot.c_str());
+                   bytes.reason().c_str());
         return;
     }
-    if (int failure = io::replaceFileAtomically(filePath_, bytes, kJobsFileMode); failure != 0) {
+    if (int failure = io::replaceFileAtomically(filePath_, *bytes, kJobsFileMode); failure != 0) {
         logCFormat(LogPriority::Warning, "Background jobs: cannot save %s: %s", filePath_.c_str(),
                    errorText(failure).c_str());
     }

@@ -37,11 +37,11 @@ int writeDaemonStateFile(std::string_view fileName, const plist::Value& value, p
     if (error != 0) {
         return error;
     }
-    const std::string bytes = plist::serialize(value, format);
-    if (bytes.empty()) {
+    const Result<std::string> bytes = plist::serialize(value, format);
+    if (!bytes) {
         return EFBIG;  // nothing its reader would take
     }
-    return io::replaceFileAtomically(daemonStateFilePath(fileName), bytes, mode);
+    return io::replaceFileAtomically(daemonStateFilePath(fileName), *bytes, mode);
 }
 
 }  // namespace tavrix::device

@@ -327,14 +327,12 @@ bool PreferencesStore::writePending(Domain& domain) {
         }
     }
     // Never a file its own reader would refuse, and then read as empty.
-    std::string whyNot;
-    std::string bytes =
-        plist::serialize(plist::Value(std::move(contents)), plist::Format::Xml, &whyNot);
-    if (bytes.empty()) {
-        logCFormat("Preferences: not writing %s: %s", domain.path.c_str(), whyNot.c_str());
+    Result<std::string> bytes = plist::serialize(plist::Value(std::move(contents)));
+    if (!bytes) {
+        logCFormat("Preferences: not writing %s: %s", domain.path.c_str(), bytes.reason().c_str());
         return false;
     }
-    if (int failure = preferences->writeFile(domain.fileName, kFileMode, true, bytes);
+    if (int failure = preferences->writeFile(domain.fileName, kFileMode, true, *bytes);
         failure != 0) {
         logFailure("replace", domain.path, failure);
         return false;

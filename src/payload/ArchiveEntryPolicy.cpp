@@ -55,16 +55,16 @@ bool linkTargetStaysInside(std::string_view linkPath, std::string_view target) {
     return !climbsAfterName && climbs <= depth;
 }
 
-std::optional<std::string> whyEntryIsUnsafe(archive_entry* entry) {
+Result<> checkEntryIsSafe(archive_entry* entry) {
     const char* name = libarchive().archive_entry_pathname(entry);
     if (name == nullptr || name[0] == '\0') {
-        return "it has no usable name";
+        return Failure{"it has no usable name"};
     }
     if (leavesDestination(name)) {
-        return "its path leads outside the destination";
+        return Failure{"its path leads outside the destination"};
     }
     if (libarchive().archive_entry_hardlink(entry) != nullptr) {
-        return "hard links are not accepted";
+        return Failure{"hard links are not accepted"};
     }
     // The disk writer makes a symbolic link whenever a target is set, whatever the entry's type.
     const char* linkTarget = libarchive().archive_entry_symlink(entry);
@@ -72,17 +72,18 @@ std::optional<std::string> whyEntryIsUnsafe(archive_entry* entry) {
         case AE_IFREG:
         case AE_IFDIR:
             if (linkTarget != nullptr) {
-                return "it is a file that carries a link target";
+                return Failure{"it is a file that carries a link target"};
             }
-            return std::nullopt;
+            return {};
         case AE_IFLNK:
             if (linkTarget == nullptr || !linkTargetStaysInside(name, linkTarget)) {
-                return std::string("its link target ") + (linkTarget ? linkTarget : "(none)") +
-                       " leads outside the destination";
+                return Failure{std::string("its link target ") +
+                               (linkTarget ? linkTarget : "(none)") +
+                               " leads outside the destination"};
             }
-            return std::nullopt;
+            return {};
         default:
-            return "only regular files, directories and symbolic links are accepted";
+            return Failure{"only regular files, directories and symbolic links are accepted"};
     }
 }
 

@@ -4,9 +4,9 @@
 
 #include <archive_entry.h>
 
-#include <optional>
-#include <string>
 #include <string_view>
+
+#include "base/Result.h"
 
 namespace tavrix::payload {
 
@@ -19,9 +19,9 @@ bool leavesDestination(std::string_view path);
 // itself a link (a -> ., b -> a/..), which no look at the names alone can rule out.
 bool linkTargetStaysInside(std::string_view linkPath, std::string_view target);
 
-// Why the entry must not be extracted from a network archive, or nothing when it may be: its path
-// leads outside, it is a hard link, something other than a regular file, directory or symbolic
-// link, or a symbolic link leading outside.
-std::optional<std::string> whyEntryIsUnsafe(archive_entry* entry);
+// Fails with why the entry must not be extracted from a network archive: its path leads outside, it
+// is a hard link, something other than a regular file, directory or symbolic link, or a symbolic
+// link leading outside.
+Result<> checkEntryIsSafe(archive_entry* entry);
 
 }  // namespace tavrix::payload

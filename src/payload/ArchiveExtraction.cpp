@@ -106,15 +106,15 @@ std::uint64_t declaredSize(archive_entry* entry) {
 }
 
 // Copies the current entry's data block by block (sparse entries keep their holes); stops at the
-// entry's end, at the first failure on either side, or when the budget runs out (the answer).
-std::optional<std::string> copyEntryData(archive* reader, archive* writer,
-                                         ExtractionBudget& budget) {
+// entry's end or at the first failure on either side; fails only when the budget runs out, which
+// stops the extraction.
+Result<> copyEntryData(archive* reader, archive* writer, ExtractionBudget& budget) {
     for (;;) {
         const void* block = nullptr;
         size_t size = 0;
         la_int64_t offset = 0;
         if (libarchive().archive_read_data_block(reader, &block, &size, &offset) != ARCHIVE_OK) {
-            return std::nullopt;
+            return {};
         }
         std::uint64_t start = offset > 0 ? static_cast<std::uint64_t>(offset) : 0;
         std::uint64_t extent = 0;
@@ -122,11 +122,11 @@ std::optional<std::string> copyEntryData(archive* reader, archive* writer,
             extent = UINT64_MAX;
         }
         // Counted before the write, so that a block past the cap never reaches the disk.
-        if (std::optional<std::string> exceeded = budget.noteExtent(extent)) {
-            return exceeded;
+        if (Result<> fits = budget.noteExtent(extent); !fits) {
+            return fits;
         }
         if (libarchive().archive_write_data_block(writer, block, size, offset) != ARCHIVE_OK) {
-            return std::nullopt;
+            return {};
         }
     }
 }
@@ -197,27 +197,23 @@ ExtractionOutcome extract(const std::string& archivePath, const std::function<in
         int status = libarchive().archive_read_next_header(reader.get(), &entry);
         if (status == ARCHIVE_EOF) {
             libarchive().archive_read_close(reader.get());
-            if (std::optional<std::string> exceeded = budget.checkFinalRoom()) {
-                return stop(*exceeded);
+            if (Result<> room = budget.checkFinalRoom(); !room) {
+                return stop(room.reason());
             }
             return ExtractionOutcome::Complete;
         }
         if (status != ARCHIVE_OK) {
             return fail("Cannot read the archive " + archivePath + ": " + errorText(reader.get()));
         }
+        const char* name = libarchive().archive_entry_pathname(entry);
         if (safety == ExtractionSafety::PathSafe) {
-            if (std::optional<std::string> unsafe = whyEntryIsUnsafe(entry)) {
-                const char* name = libarchive().archive_entry_pathname(entry);
+            if (Result<> safe = checkEntryIsSafe(entry); !safe) {
                 return fail(std::string("Refusing the archive entry ") + (name ? name : "") +
-                            " of " + archivePath + ": " + *unsafe);
+                            " of " + archivePath + ": " + safe.reason());
             }
         }
-        if (std::optional<std::string> exceeded =
-                budget.admitEntry(libarchive().archive_entry_pathname(entry)
-                                      ? libarchive().archive_entry_pathname(entry)
-                                      : "",
-                                  declaredSize(entry))) {
-            return stop(*exceeded);
+        if (Result<> fits = budget.admitEntry(name ? name : "", declaredSize(entry)); !fits) {
+            return stop(fits.reason());
         }
         if (!placeEntry(entry, placement)) {
             continue;
@@ -226,10 +222,10 @@ ExtractionOutcome extract(const std::string& archivePath, const std::function<in
             logCFormat("%s", "");
             continue;
         }
-        std::optional<std::string> exceeded = copyEntryData(reader.get(), writer.get(), budget);
+        Result<> copied = copyEntryData(reader.get(), writer.get(), budget);
         libarchive().archive_write_finish_entry(writer.get());
-        if (exceeded) {
-            return stop(*exceeded);
+        if (!copied) {
+            return stop(copied.reason());
         }
     }
 }

@@ -21,8 +21,7 @@ std::uint64_t saturatingAdd(std::uint64_t a, std::uint64_t b) {
 ExtractionBudget::ExtractionBudget(const ExtractionLimits& limits, std::string destination)
     : limits_(limits), destination_(std::move(destination)) {}
 
-std::optional<std::string> ExtractionBudget::admitEntry(std::string_view path,
-                                                        std::uint64_t declaredSize) {
+Result<> ExtractionBudget::admitEntry(std::string_view path, std::uint64_t declaredSize) {
     finishedBytes_ = saturatingAdd(finishedBytes_, entryExtent_);
     entryExtent_ = 0;
     // The disk writer creates missing parents on its own: one entry with a deep path would
@@ -40,27 +39,29 @@ std::optional<std::string> ExtractionBudget::admitEntry(std::string_view path,
     }
     entries_ += created;
     if (entries_ > limits_.maxEntries) {
-        return "it holds more than " + std::to_string(limits_.maxEntries) +
-               " entries (with the directories their paths imply)";
+        return Failure{"it holds more than " + std::to_string(limits_.maxEntries) +
+                       " entries (with the directories their paths imply)"};
     }
     if (saturatingAdd(finishedBytes_, declaredSize) > limits_.maxExpandedBytes) {
-        return "it expands to more than " + std::to_string(limits_.maxExpandedBytes) + " bytes";
+        return Failure{"it expands to more than " + std::to_string(limits_.maxExpandedBytes) +
+                       " bytes"};
     }
     uncheckedBytes_ = 0;
     return checkFreeSpace(declaredSize);
 }
 
-std::optional<std::string> ExtractionBudget::noteExtent(std::uint64_t extent) {
+Result<> ExtractionBudget::noteExtent(std::uint64_t extent) {
     if (extent <= entryExtent_) {
-        return std::nullopt;
+        return {};
     }
     uncheckedBytes_ += extent - entryExtent_;
     entryExtent_ = extent;
     if (saturatingAdd(finishedBytes_, entryExtent_) > limits_.maxExpandedBytes) {
-        return "it expands to more than " + std::to_string(limits_.maxExpandedBytes) + " bytes";
+        return Failure{"it expands to more than " + std::to_string(limits_.maxExpandedBytes) +
+                       " bytes"};
     }
     if (uncheckedBytes_ < kFreeSpaceCheckInterval) {
-        return std::nullopt;
+        return {};
     }
     uncheckedBytes_ = 0;
     return checkFreeSpace(0);
@@ -76,11 +77,11 @@ std::uint64_t ExtractionBudget::reserve() {
     return *reserve_;
 }
 
-std::optional<std::string> ExtractionBudget::checkFinalRoom() {
+Result<> ExtractionBudget::checkFinalRoom() {
     return checkFreeSpace(0);
 }
 
-std::optional<std::string> ExtractionBudget::checkFreeSpace(std::uint64_t stillToWrite) {
+Result<> ExtractionBudget::checkFreeSpace(std::uint64_t stillToWrite) {
     std::uint64_t needed = saturatingAdd(reserve(), stillToWrite);
     if (limits_.keepRoomForCopy) {
         std::uint64_t expanded = saturatingAdd(finishedBytes_, entryExtent_);
@@ -88,13 +89,13 @@ std::optional<std::string> ExtractionBudget::checkFreeSpace(std::uint64_t stillT
     }
     std::optional<std::uint64_t> available = availableBytesAt(destination_);
     if (!available) {
-        return "the free space of " + destination_ + " cannot be read";
+        return Failure{"the free space of " + destination_ + " cannot be read"};
     }
     if (*available < needed) {
-        return "the file system of " + destination_ + " has " + std::to_string(*available) +
-               " bytes free, " + std::to_string(needed) + " are needed";
+        return Failure{"the file system of " + destination_ + " has " + std::to_string(*available) +
+                       " bytes free, " + std::to_string(needed) + " are needed"};
     }
-    return std::nullopt;
+    return {};
 }
 
 }  // namespace tavrix::payload

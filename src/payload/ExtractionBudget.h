@@ -8,6 +8,7 @@
 #include <string_view>
 #include <unordered_set>
 
+#include "base/Result.h"
 #include "payload/PayloadUnpack.h"
 
 namespace tavrix::payload {
@@ -17,16 +18,16 @@ class ExtractionBudget {
     ExtractionBudget(const ExtractionLimits& limits, std::string destination);
 
     // Before an entry is written: counts it, with the parent directories its path implies that no
-    // entry before it implied, and makes room for the size it declares. Each answer is nothing
-    // when it fits, else why the extraction must stop.
-    std::optional<std::string> admitEntry(std::string_view path, std::uint64_t declaredSize);
+    // entry before it implied, and makes room for the size it declares. Each fails with why the
+    // extraction must stop.
+    Result<> admitEntry(std::string_view path, std::uint64_t declaredSize);
     // After a block: the current entry now reaches extent bytes (its end, holes included).
-    std::optional<std::string> noteExtent(std::uint64_t extent);
+    Result<> noteExtent(std::uint64_t extent);
     // When the extraction is over: the room for its copy, when asked for, is still there.
-    std::optional<std::string> checkFinalRoom();
+    Result<> checkFinalRoom();
 
   private:
-    std::optional<std::string> checkFreeSpace(std::uint64_t stillToWrite);
+    Result<> checkFreeSpace(std::uint64_t stillToWrite);
 
     // The free space kept: the limits' reserve, less on a small file system.
     std::uint64_t reserve();

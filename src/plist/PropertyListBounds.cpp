@@ -6,12 +6,12 @@
 namespace tavrix::plist {
 namespace {
 
-std::string tooDeep() {
-    return "it nests deeper than " + std::to_string(kMaxPropertyListDepth) + " levels";
+Failure tooDeep() {
+    return {"it nests deeper than " + std::to_string(kMaxPropertyListDepth) + " levels"};
 }
 
-std::string tooManyNodes() {
-    return "it holds more than " + std::to_string(kMaxPropertyListNodes) + " values";
+Failure tooManyNodes() {
+    return {"it holds more than " + std::to_string(kMaxPropertyListNodes) + " values"};
 }
 
 // Scans XML markup the way libplist's reader does, counting elements and their nesting. Where
@@ -23,7 +23,7 @@ class XmlScan {
   public:
     explicit XmlScan(std::string_view xml) : xml_(xml) {}
 
-    std::optional<std::string> run() {
+    Result<> run() {
         std::size_t at = 0;
         while ((at = xml_.find('<', at)) != std::string_view::npos) {
             std::string_view rest = xml_.substr(at);
@@ -48,7 +48,7 @@ class XmlScan {
                 return tooManyNodes();
             }
         }
-        return std::nullopt;
+        return {};
     }
 
   private:
@@ -154,11 +154,11 @@ class BinaryWalk {
   public:
     explicit BinaryWalk(std::string_view bytes) : bytes_(bytes) {}
 
-    std::optional<std::string> run() {
+    Result<> run() {
         static constexpr std::size_t kHeader = 8;
         static constexpr std::size_t kTrailer = 32;
         if (bytes_.size() < kHeader + kTrailer || !bytes_.starts_with("bplist00")) {
-            return std::string("it is not a binary property list");
+            return Failure{"it is not a binary property list"};
         }
         std::size_t trailer = bytes_.size() - kTrailer;
         offsetSize_ = static_cast<unsigned char>(bytes_[trailer + 6]);
@@ -170,7 +170,7 @@ class BinaryWalk {
         if (offsetSize_ < 1 || offsetSize_ > 8 || refSize_ < 1 || refSize_ > 8 || table < kHeader ||
             table > trailer || objectCount == 0 || objectCount > (trailer - table) / offsetSize_ ||
             top >= objectCount) {
-            return std::string("its trailer is damaged");
+            return Failure{"its trailer is damaged"};
         }
         // Every object of a well-formed list is reached at least once, so more objects than
         // nodes would exceed the limit anyway; this also bounds the table of expansions below.
@@ -181,10 +181,10 @@ class BinaryWalk {
         objectCount_ = objectCount;
         expansions_.assign(objectCount, Expansion{});
         Expansion root;
-        if (auto failure = walk(top, 1, root)) {
+        if (Result<> failure = walk(top, 1, root); !failure) {
             return failure;
         }
-        return std::nullopt;
+        return {};
     }
 
   private:
@@ -198,57 +198,56 @@ class BinaryWalk {
     }
 
     // The length of the object whose marker is at marker and where its contents start.
-    std::optional<std::string> length(std::size_t marker, std::uint64_t& count,
-                                      std::size_t& contents) const {
+    Result<> length(std::size_t marker, std::uint64_t& count, std::size_t& contents) const {
         count = static_cast<unsigned char>(bytes_[marker]) & 0x0F;
         contents = marker + 1;
         if (count != 0x0F) {
-            return std::nullopt;
+            return {};
         }
         if (contents >= objectsEnd_) {
-            return std::string("an object runs past the end");
+            return Failure{"an object runs past the end"};
         }
         auto intMarker = static_cast<unsigned char>(bytes_[contents]);
         std::size_t width = std::size_t{1} << (intMarker & 0x0F);
         if ((intMarker & 0xF0) != 0x10 || width > 8 || objectsEnd_ - contents - 1 < width) {
-            return std::string("an object has a damaged length");
+            return Failure{"an object has a damaged length"};
         }
         count = number(contents + 1, width);
         contents += 1 + width;
-        return std::nullopt;
+        return {};
     }
 
     bool fits(std::size_t contents, std::uint64_t size) const {
         return contents <= objectsEnd_ && size <= objectsEnd_ - contents;
     }
 
-    std::optional<std::string> walk(std::uint64_t index, std::size_t depth, Expansion& out) {
+    Result<> walk(std::uint64_t index, std::size_t depth, Expansion& out) {
         if (depth > kMaxPropertyListDepth) {
             return tooDeep();
         }
         Expansion& known = expansions_[index];
         if (known.state == Expansion::kWalking) {
-            return std::string("an object contains itself");
+            return Failure{"an object contains itself"};
         }
         if (known.state == Expansion::kDone) {
             out = known;
-            return std::nullopt;
+            return {};
         }
         known.state = Expansion::kWalking;
         Expansion expansion;
-        if (auto failure = expand(index, depth, expansion)) {
+        if (Result<> failure = expand(index, depth, expansion); !failure) {
             return failure;
         }
         expansion.state = Expansion::kDone;
         expansions_[index] = expansion;
         out = expansion;
-        return std::nullopt;
+        return {};
     }
 
-    std::optional<std::string> expand(std::uint64_t index, std::size_t depth, Expansion& out) {
+    Result<> expand(std::uint64_t index, std::size_t depth, Expansion& out) {
         std::uint64_t offset = number(table_ + index * offsetSize_, offsetSize_);
         if (offset < 8 || offset >= objectsEnd_) {
-            return std::string("an object offset points outside the objects");
+            return Failure{"an object offset points outside the objects"};
         }
         auto marker = static_cast<std::size_t>(offset);
         auto kind = static_cast<unsigned char>(bytes_[marker]) >> 4;
@@ -257,60 +256,59 @@ class BinaryWalk {
         std::size_t contents = 0;
         switch (kind) {
             case 0x0:  // null, booleans, fill
-                return std::nullopt;
+                return {};
             case 0x1:  // integer
             case 0x2:  // real
                 if (!fits(marker + 1, std::uint64_t{1} << (bytes_[marker] & 0x0F))) {
-                    return std::string("a number runs past the end");
+                    return Failure{"a number runs past the end"};
                 }
-                return std::nullopt;
+                return {};
             case 0x3:  // date
-                return fits(marker + 1, 8) ? std::nullopt
-                                           : std::optional<std::string>("a date runs past the end");
+                return fits(marker + 1, 8) ? Result<>() : Failure{"a date runs past the end"};
             case 0x8:  // uid
                 return fits(marker + 1, (bytes_[marker] & 0x0F) + 1u)
-                           ? std::nullopt
-                           : std::optional<std::string>("a uid runs past the end");
+                           ? Result<>()
+                           : Failure{"a uid runs past the end"};
             case 0x4:  // data
             case 0x5:  // ASCII string
             case 0x6:  // UTF-16 string
             case 0x7: {
-                if (auto failure = length(marker, count, contents)) {
+                if (Result<> failure = length(marker, count, contents); !failure) {
                     return failure;
                 }
                 std::uint64_t size = kind == 0x6 ? count * 2 : count;
                 if (count > objectsEnd_ || !fits(contents, size)) {
-                    return std::string("a string or data object runs past the end");
+                    return Failure{"a string or data object runs past the end"};
                 }
                 std::string_view text = bytes_.substr(contents, static_cast<std::size_t>(size));
                 if (kind != 0x4 && hasNul(text, kind == 0x6)) {
-                    return std::string("a string holds a NUL character");
+                    return Failure{"a string holds a NUL character"};
                 }
                 // UTF-16 becomes up to three UTF-8 bytes per unit.
                 out.payloadBytes = static_cast<std::uint32_t>(kind == 0x6 ? count * 3 : count);
-                return std::nullopt;
+                return {};
             }
             case 0xA:  // array
             case 0xB:  // ordered set
             case 0xC:  // set
             case 0xD: {
-                if (auto failure = length(marker, count, contents)) {
+                if (Result<> failure = length(marker, count, contents); !failure) {
                     return failure;
                 }
                 std::uint64_t refs = kind == 0xD ? count * 2 : count;
                 if (count > objectsEnd_ || !fits(contents, refs * refSize_)) {
-                    return std::string("a container runs past the end");
+                    return Failure{"a container runs past the end"};
                 }
                 for (std::uint64_t i = 0; i < refs; ++i) {
                     std::uint64_t child = number(contents + i * refSize_, refSize_);
                     if (child >= objectCount_) {
-                        return std::string("a reference points to no object");
+                        return Failure{"a reference points to no object"};
                     }
                     if (kind == 0xD && i < count && !isString(child)) {
-                        return std::string("a dictionary key is not a string");
+                        return Failure{"a dictionary key is not a string"};
                     }
                     Expansion part;
-                    if (auto failure = walk(child, depth + 1, part)) {
+                    if (Result<> failure = walk(child, depth + 1, part); !failure) {
                         return failure;
                     }
                     out.nodes += part.nodes;
@@ -320,17 +318,17 @@ class BinaryWalk {
                         return tooManyNodes();
                     }
                     if (out.payloadBytes > kMaxPropertyListPayloadBytes) {
-                        return "its strings and data exceed " +
-                               std::to_string(kMaxPropertyListPayloadBytes) + " bytes";
+                        return Failure{"its strings and data exceed " +
+                                       std::to_string(kMaxPropertyListPayloadBytes) + " bytes"};
                     }
                     if (depth + part.height > kMaxPropertyListDepth) {
                         return tooDeep();
                     }
                 }
-                return std::nullopt;
+                return {};
             }
             default:
-                return std::string("it holds an object of unknown type");
+                return Failure{"it holds an object of unknown type"};
         }
     }
 
@@ -367,11 +365,11 @@ class BinaryWalk {
 
 }  // namespace
 
-std::optional<std::string> checkXmlBounds(std::string_view xml) {
+Result<> checkXmlBounds(std::string_view xml) {
     return XmlScan(xml).run();
 }
 
-std::optional<std::string> checkBinaryBounds(std::string_view bytes) {
+Result<> checkBinaryBounds(std::string_view bytes) {
     return BinaryWalk(bytes).run();
 }
 

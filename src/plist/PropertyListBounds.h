@@ -9,6 +9,8 @@
 #include <string>
 #include <string_view>
 
+#include "base/Result.h"
+
 namespace tavrix::plist {
 
 // Largest property-list file read; the daemon's own files are a few kilobytes, a catalog about a
@@ -22,11 +24,11 @@ inline constexpr std::size_t kMaxPropertyListNodes = 256 * 1024;
 // Most string and data bytes one binary document may become, shared objects counted the same way.
 inline constexpr std::size_t kMaxPropertyListPayloadBytes = 64 * 1024 * 1024;
 
-// Nothing when the XML document stays within the limits, else why it does not.
-std::optional<std::string> checkXmlBounds(std::string_view xml);
+// Fails, with why, when the XML document goes past the limits.
+Result<> checkXmlBounds(std::string_view xml);
 
-// Nothing when the binary document is well formed and stays within the limits, else why not.
-// Also refuses a string or key holding a NUL character, which libplist cannot read back.
-std::optional<std::string> checkBinaryBounds(std::string_view bytes);
+// Fails, with why, unless the binary document is well formed and stays within the limits. Also
+// refuses a string or key holding a NUL character, which libplist cannot read back.
+Result<> checkBinaryBounds(std::string_view bytes);
 
 }  // namespace tavrix::plist

@@ -383,18 +383,18 @@ bool endsWithClosingTag(std::string_view xml) {
     return xml.ends_with("</plist>");
 }
 
-// Why bytes are refused before libplist sees them, or nothing. The one table of what the reader
+// Fails, with why, for bytes refused before libplist sees them. The one table of what the reader
 // takes: the writer checks its own output against it.
-std::optional<std::string> whyRefused(std::string_view bytes, bool binary) {
+Result<> checkReadable(std::string_view bytes, bool binary) {
     if (bytes.empty()) {
-        return "it is empty";
+        return Failure{"it is empty"};
     }
     if (bytes.size() > kMaxPropertyListBytes) {
-        return tooLarge();
+        return Failure{tooLarge()};
     }
     // libplist accepts a document cut off before its closing tag; a truncated file is no value.
     if (!binary && !endsWithClosingTag(bytes)) {
-        return "it is not a complete XML property list";
+        return Failure{"it is not a complete XML property list"};
     }
     return binary ? checkBinaryBounds(bytes) : checkXmlBounds(bytes);
 }
@@ -414,8 +414,8 @@ std::optional<Value> parse(std::string_view bytes, Refusal* refusal) {
         return std::nullopt;
     };
     const bool binary = isBinary(bytes);
-    if (auto why = whyRefused(bytes, binary)) {
-        return refuse(std::move(*why));
+    if (Result<> readable = checkReadable(bytes, binary); !readable) {
+        return refuse(readable.reason());
     }
     plist_t raw = nullptr;
     plist_from_memory(bytes.data(), static_cast<uint32_t>(bytes.size()), &raw);
@@ -492,30 +492,21 @@ std::optional<Value> readOpenFile(int fd, Refusal* refusal) {
     return parse(*bytes, refusal);
 }
 
-std::string serialize(const Value& value, Format format, std::string* whyNot) {
+Result<std::string> serialize(const Value& value, Format format) {
     std::string bytes = format == Format::Binary ? writeBinary(value) : writeXml(value);
     if (bytes.empty()) {
-        if (whyNot != nullptr) {
-            *whyNot = "the value cannot be encoded";
-        }
-        return bytes;
+        return Failure{"the value cannot be encoded"};
     }
     // Never bytes the reader would refuse: a file written so would read back as no value.
-    if (auto why = whyRefused(bytes, format == Format::Binary)) {
-        if (whyNot != nullptr) {
-            *whyNot = "a reader would refuse it: " + *why;
-        }
-        return {};
+    if (Result<> readable = checkReadable(bytes, format == Format::Binary); !readable) {
+        return Failure{"a reader would refuse it: " + readable.reason()};
     }
     return bytes;
 }
 
 bool writeFile(const std::string& path, const Value& value, Format format) {
-    std::string bytes = serialize(value, format);
-    if (bytes.empty()) {
-        return false;
-    }
-    return io::replaceFileAtomically(path, bytes, 0644) == 0;
+    Result<std::string> bytes = serialize(value, format);
+    return bytes && io::replaceFileAtomically(path, *bytes, 0644) == 0;
 }
 
 }  // namespace tavrix::plist

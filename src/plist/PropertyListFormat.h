@@ -8,6 +8,7 @@
 #include <string>
 #include <string_view>
 
+#include "base/Result.h"
 #include "plist/PropertyListBounds.h"
 #include "plist/Value.h"
 
@@ -32,11 +33,10 @@ std::optional<Value> parse(std::string_view bytes, Refusal* refusal = nullptr);
 std::optional<Value> readFile(const std::string& path, Refusal* refusal = nullptr);
 
 // The value encoded in the given format. XML dates are whole seconds, as every reader of the
-// format expects; binary dates keep their fractions. Empty, with the reason in whyNot when given,
-// when the value cannot be encoded or parse() would refuse the encoding (the bounds of
-// PropertyListBounds.h), so that nothing is written that its reader refuses.
-std::string serialize(const Value& value, Format format = Format::Xml,
-                      std::string* whyNot = nullptr);
+// format expects; binary dates keep their fractions. Fails when the value cannot be encoded or
+// parse() would refuse the encoding (the bounds of PropertyListBounds.h), so that nothing is
+// written that its reader refuses.
+Result<std::string> serialize(const Value& value, Format format = Format::Xml);
 
 // Writes the serialized value over the file at path (not atomically). False when the file
 // cannot be written.

@@ -68,7 +68,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     auto value = parse(bytes);
     if (size > 0 && size <= kMaxPropertyListBytes) {
         bool binary = plist_is_binary(bytes.data(), static_cast<uint32_t>(size)) != 0;
-        if (!(binary ? checkBinaryBounds(bytes) : checkXmlBounds(bytes))) {
+        if (binary ? checkBinaryBounds(bytes) : checkXmlBounds(bytes)) {
             checkTreeWithinBounds(bytes);
         }
     }
@@ -78,7 +78,8 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     (void)value->description();
     for (Format format : {Format::Xml, Format::Binary}) {
         // Reals that are not numbers never compare equal, so only presence is checked.
-        if (!parse(serialize(*value, format))) {
+        tavrix::Result<std::string> bytesBack = serialize(*value, format);
+        if (!bytesBack || !parse(*bytesBack)) {
             std::abort();
         }
     }

@@ -3,13 +3,14 @@
 set -euo pipefail
 src="${1:?usage: check-layers.sh SRC_DIR}"
 declare -A below=(
-    [io]="" [plist]="io" [util]="plist io" [device]="util plist io"
-    [bus]="device util plist io" [http]="util" [payload]="device util plist io"
-    [catalog]="payload http bus device util plist io"
-    [bundle]="payload http bus device util plist io"
-    [update]="bundle catalog payload http bus device util plist io"
-    [daemon]="update bundle catalog payload http bus device util plist io"
-    [client]="bus plist"
+    [base]="" [io]="base" [plist]="io base" [util]="plist io base"
+    [device]="util plist io base" [bus]="device util plist io base" [http]="util base"
+    [payload]="device util plist io base"
+    [catalog]="payload http bus device util plist io base"
+    [bundle]="payload http bus device util plist io base"
+    [update]="bundle catalog payload http bus device util plist io base"
+    [daemon]="update bundle catalog payload http bus device util plist io base"
+    [client]="bus plist base"
 )
 status=0
 for directory in "$src"/*/; do

@@ -156,7 +156,7 @@ class AssetCatalogTest : public testing::Test {
         if (serial != 0) {
             catalog.emplace("Serial", plist::Value(serial));
         }
-        return plist::serialize(plist::Value(std::move(catalog)));
+        return *plist::serialize(plist::Value(std::move(catalog)));
     }
 
     // Serves bytes as the catalog's only archive, listed unsigned with their size and digest.

@@ -52,7 +52,7 @@ TEST_F(DeviceInfoTable, UnusableTableIsLoggedOncePerVersionAndAnswersNothing) {
     EXPECT_EQ(sink.messages(), std::vector<std::string>{damaged});
 
     sink.clear();
-    writeTableBytes(plist::serialize(plist::Array{Value("DeviceClass")}));
+    writeTableBytes(*plist::serialize(plist::Array{Value("DeviceClass")}));
     EXPECT_EQ(copyDeviceStringAnswer("DeviceClass"), std::nullopt);
     EXPECT_EQ(copyDeviceStringAnswer("DeviceClass"), std::nullopt);
     EXPECT_EQ(sink.messages(), std::vector<std::string>{"Device information table " + tablePath() +

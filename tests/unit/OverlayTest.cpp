@@ -397,12 +397,12 @@ TEST_F(CarrierFileLoaderTest, LocalFilesLoadOnlyWhenTheyHoldADictionary) {
     // Spaces, '%', '+' and non-ASCII bytes must survive the trip through a file URL.
     for (const std::string name :
          {"behavior.plist", "dir with space/a%20b+c.plist", "d\xC3\xA9j\xC3\xA0/x#y?.plist"}) {
-        test::writeText(dir / name, plist::serialize(kCarrier, plist::Format::Binary));
+        test::writeText(dir / name, *plist::serialize(kCarrier, plist::Format::Binary));
         EXPECT_EQ(copyDictionaryFromFile(dir / name), kCarrier) << name;
     }
     for (const std::string& content :
-         {plist::serialize(plist::Value(plist::Array{"a", "b"})),
-          plist::serialize(plist::Value("text"), plist::Format::Binary), std::string(),
+         {*plist::serialize(plist::Value(plist::Array{"a", "b"})),
+          *plist::serialize(plist::Value("text"), plist::Format::Binary), std::string(),
           std::string("<plist><dict><key>cut")}) {
         test::writeText(dir / "carrier.plist", content);
         EXPECT_FALSE(copyDictionaryFromFile(dir / "carrier.plist")) << content;
@@ -425,13 +425,13 @@ TEST_F(CarrierFileLoaderTest, HttpBodiesAreTheFileWhateverTheStatus) {
     ::setenv("no_proxy", "127.0.0.1", 1);
     ::setenv("NO_PROXY", "127.0.0.1", 1);
     test::LocalHttpServer server;
-    const std::string xml = plist::serialize(kCarrier);
+    const std::string xml = *plist::serialize(kCarrier);
     const std::string compressed = gzipped(xml);
     plist::Dictionary large;
     for (int i = 0; i < 5000; ++i) {
         large.emplace("Key" + std::to_string(i), std::string(20, 'a' + i % 26));
     }
-    const std::string largeXml = plist::serialize(plist::Value(large));
+    const std::string largeXml = *plist::serialize(plist::Value(large));
     ASSERT_GT(largeXml.size(), 100000u);
     auto response = [](std::string body, std::vector<std::pair<std::string, std::string>> headers,
                        int status = 200) {

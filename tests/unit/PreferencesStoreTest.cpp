@@ -83,7 +83,7 @@ TEST_F(PreferencesStoreTest, DamagedFileReadsEmptyIsLoggedOncePerVersionAndIsRep
     const std::string path = domainPath(domain);
     const std::vector<std::pair<std::string, std::string>> damaged = {
         {"not a property list at all", "it is not a complete XML property list"},
-        {plist::serialize(Value(plist::Array{Value("not"), Value("a dictionary")})),
+        {*plist::serialize(Value(plist::Array{Value("not"), Value("a dictionary")})),
          "it is not a dictionary"},
     };
 
@@ -116,8 +116,8 @@ TEST_F(PreferencesStoreTest, SymbolicLinkDomainIsReadThroughAndRepointed) {
     const std::string link = domainPath(domain);
     const std::string first = (test::unitTestRoot() / "elsewhere/first.plist").string();
     const std::string second = (test::unitTestRoot() / "elsewhere/second.plist").string();
-    test::writeText(first, plist::serialize(Value(plist::Dictionary{{"k", Value("first")}})));
-    test::writeText(second, plist::serialize(Value(plist::Dictionary{{"k", Value("second")}})));
+    test::writeText(first, *plist::serialize(Value(plist::Dictionary{{"k", Value("first")}})));
+    test::writeText(second, *plist::serialize(Value(plist::Dictionary{{"k", Value("second")}})));
     fs::create_directories(preferencesDirectory());
     fs::create_symlink(first, link);
     EXPECT_EQ(store.copyValue("k", domain, kUser), Value("first"));

@@ -101,7 +101,7 @@ TEST_F(BackgroundJobSchedulerTest, JobsOutliveTheBindingPerClient) {
 TEST_F(BackgroundJobSchedulerTest, DamagedFilesReadAsNoJobsAndBadEntriesAreSkipped) {
     const double start = Clock::absoluteTimeNow() + kHour;
     for (const std::string& damaged :
-         {std::string("not a property list\0\x01", 22), plist::serialize(plist::Array{1, 2})}) {
+         {std::string("not a property list\0\x01", 22), *plist::serialize(plist::Array{1, 2})}) {
         test::writeText(jobsFile(), damaged);
         auto binding = launch();
         EXPECT_TRUE(binding->copyJobs().empty());

@@ -14,53 +14,53 @@ constexpr const char* kBaseCarrierFileName = "behavior.plist";
 constexpr const char* kIdentifierKey = "QZBundleIdentifier";
 constexpr const char* kVersionKey = "QZBundleVersion";
 
-// The property list at path when it is a dictionary; otherwise error says why.
-std::optional<plist::Value> readDictionary(const std::string& path, std::string& error) {
+// The property list at path when it is a dictionary.
+Result<plist::Dictionary> readDictionary(const std::string& path) {
     plist::Refusal refusal;
     std::optional<plist::Value> value = plist::readFile(path, &refusal);
     if (!value) {
-        error = path + ": " + (refusal.reason.empty() ? "cannot be read" : refusal.reason);
-        return std::nullopt;
+        return Failure{path + ": " + (refusal.reason.empty() ? "cannot be read" : refusal.reason)};
     }
     if (value->asDictionary() == nullptr) {
-        error = path + ": not a dictionary";
-        return std::nullopt;
+        return Failure{path + ": not a dictionary"};
     }
-    return value;
+    return std::move(*value->asDictionary());
 }
 
-std::optional<std::string> nonEmptyString(const plist::Value& info, const char* key,
-                                          const std::string& path, std::string& error) {
-    const plist::Value* value = info.find(key);
+Result<std::string> nonEmptyString(const plist::Dictionary& info, const char* key,
+                                   const std::string& path) {
+    auto entry = info.find(key);
+    const plist::Value* value = entry != info.end() ? &entry->second : nullptr;
     if (value == nullptr || value->asString() == nullptr || value->asString()->empty()) {
-        error = path + ": no " + key + " string";
-        return std::nullopt;
+        return Failure{path + ": no " + key + " string"};
     }
     return *value->asString();
 }
 
 }  // namespace
 
-std::optional<BundleIdentity> checkBundleDirectory(const std::string& directory,
-                                                   std::string& error) {
+Result<BundleIdentity> checkBundleDirectory(const std::string& directory) {
     std::error_code status;
     if (!fs::is_directory(directory, status)) {
-        error = directory + ": not a directory";
-        return std::nullopt;
+        return Failure{directory + ": not a directory"};
     }
     const std::string infoPath = (fs::path(directory) / kInfoFileName).string();
-    std::optional<plist::Value> info = readDictionary(infoPath, error);
+    Result<plist::Dictionary> info = readDictionary(infoPath);
     if (!info) {
-        return std::nullopt;
+        return info.failure();
     }
-    BundleIdentity identity;
-    auto identifier = nonEmptyString(*info, kIdentifierKey, infoPath, error);
-    auto version = identifier ? nonEmptyString(*info, kVersionKey, infoPath, error) : std::nullopt;
+    Result<std::string> identifier = nonEmptyString(*info, kIdentifierKey, infoPath);
+    if (!identifier) {
+        return identifier.failure();
+    }
+    Result<std::string> version = nonEmptyString(*info, kVersionKey, infoPath);
     if (!version) {
-        return std::nullopt;
+        return version.failure();
     }
-    if (!readDictionary((fs::path(directory) / kBaseCarrierFileName).string(), error)) {
-        return std::nullopt;
+    if (Result<plist::Dictionary> carrier =
+            readDictionary((fs::path(directory) / kBaseCarrierFileName).string());
+        !carrier) {
+        return carrier.failure();
     }
     return BundleIdentity{*identifier, *version};
 }

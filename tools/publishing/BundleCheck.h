@@ -7,6 +7,8 @@
 #include <optional>
 #include <string>
 
+#include "base/Result.h"
+
 namespace tavrix::tools {
 
 struct BundleIdentity {
@@ -14,9 +16,8 @@ struct BundleIdentity {
     std::string version;
 };
 
-// The identity read from directory's Info.plist, or nothing with error set to one line naming the
-// file and what is wrong with it.
-std::optional<BundleIdentity> checkBundleDirectory(const std::string& directory,
-                                                   std::string& error);
+// The identity read from directory's Info.plist; a failure is one line naming the file and what
+// is wrong with it.
+Result<BundleIdentity> checkBundleDirectory(const std::string& directory);
 
 }  // namespace tavrix::tools

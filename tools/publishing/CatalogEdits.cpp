@@ -8,8 +8,6 @@
 namespace tavrix::tools {
 namespace {
 
-using Failure = std::optional<std::string>;
-
 bool hasVersion(const plist::Value& entry, const std::string& version) {
     const plist::Value* attributes = entry.find(catalog::kCatalogAttributesKey);
     const plist::Value* listed = attributes != nullptr ? attributes->find("Version") : nullptr;
@@ -18,24 +16,23 @@ bool hasVersion(const plist::Value& entry, const std::string& version) {
 
 // Applies change to the served catalog's assets and completes the result. change answers false
 // when it found nothing to change.
-Failure editCatalog(const std::string& site, const Completion& completion,
-                    const std::function<bool(plist::Array& assets)>& change,
-                    const std::string& nothingToChange) {
-    if (Failure staged = refuseWhileStaged(site)) {
-        return staged;
+Result<> editCatalog(const std::string& site, const Completion& completion,
+                     const std::function<bool(plist::Array& assets)>& change,
+                     const std::string& nothingToChange) {
+    if (Result<> open = refuseWhileStaged(site); !open) {
+        return open;
     }
-    std::string error;
-    std::optional<plist::Dictionary> catalog = readServedCatalog(site, error);
+    Result<plist::Dictionary> catalog = readServedCatalog(site);
     if (!catalog) {
-        return error;
+        return catalog.failure();
     }
     auto assets = catalog->find(catalog::kCatalogAssetsKey);
     if (assets == catalog->end() || assets->second.asArray() == nullptr) {
-        return site + "/" + kCatalogFileName + " has no Assets array";
+        return Failure{site + "/" + kCatalogFileName + " has no Assets array"};
     }
     plist::Array entries = *assets->second.asArray();
     if (!change(entries)) {
-        return nothingToChange;
+        return Failure{nothingToChange};
     }
     assets->second = plist::Value(std::move(entries));
     return completeCatalog(site, std::move(*catalog), completion);
@@ -43,12 +40,12 @@ Failure editCatalog(const std::string& site, const Completion& completion,
 
 }  // namespace
 
-std::optional<std::string> refreshCatalog(const std::string& site, const Completion& completion) {
+Result<> refreshCatalog(const std::string& site, const Completion& completion) {
     return editCatalog(site, completion, [](plist::Array&) { return true; }, {});
 }
 
-std::optional<std::string> withdrawVersion(const std::string& site, const std::string& version,
-                                           const Completion& completion) {
+Result<> withdrawVersion(const std::string& site, const std::string& version,
+                         const Completion& completion) {
     return editCatalog(
         site, completion,
         [&](plist::Array& assets) {
@@ -59,8 +56,8 @@ std::optional<std::string> withdrawVersion(const std::string& site, const std::s
         "the catalog lists no version " + version);
 }
 
-std::optional<std::string> setRollout(const std::string& site, const std::string& version,
-                                      int percent, const Completion& completion) {
+Result<> setRollout(const std::string& site, const std::string& version, int percent,
+                    const Completion& completion) {
     return editCatalog(
         site, completion,
         [&](plist::Array& assets) {

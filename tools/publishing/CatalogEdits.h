@@ -11,15 +11,15 @@
 namespace tavrix::tools {
 
 // The same assets under a new serial and expiry.
-std::optional<std::string> refreshCatalog(const std::string& site, const Completion& completion);
+Result<> refreshCatalog(const std::string& site, const Completion& completion);
 
 // Every asset of version left out. An error when the catalog lists none.
-std::optional<std::string> withdrawVersion(const std::string& site, const std::string& version,
-                                           const Completion& completion);
+Result<> withdrawVersion(const std::string& site, const std::string& version,
+                         const Completion& completion);
 
 // Every asset of version offered to percent of the devices (100: all). An error when the catalog
 // lists none.
-std::optional<std::string> setRollout(const std::string& site, const std::string& version,
-                                      int percent, const Completion& completion);
+Result<> setRollout(const std::string& site, const std::string& version, int percent,
+                    const Completion& completion);
 
 }  // namespace tavrix::tools

@@ -23,26 +23,22 @@ std::string systemError(const std::string& action, const std::string& path, int 
     return action + " " + path + ": " + std::strerror(error);
 }
 
-// Runs command with input on its standard input; its standard output, or nothing with error set.
+// Runs command with input on its standard input; its standard output.
 // Its standard error stays the tool's, so what it says reaches the operator.
-std::optional<std::string> runSigner(const std::string& command, std::string_view input,
-                                     std::string& error) {
+Result<std::string> runSigner(const std::string& command, std::string_view input) {
     int toChild[2];
     int fromChild[2];
     if (::pipe2(toChild, O_CLOEXEC) != 0) {
-        error = std::string("cannot run the signer: ") + std::strerror(errno);
-        return std::nullopt;
+        return Failure{std::string("cannot run the signer: ") + std::strerror(errno)};
     }
     io::UniqueFd childInput(toChild[0]), parentOutput(toChild[1]);
     if (::pipe2(fromChild, O_CLOEXEC) != 0) {
-        error = std::string("cannot run the signer: ") + std::strerror(errno);
-        return std::nullopt;
+        return Failure{std::string("cannot run the signer: ") + std::strerror(errno)};
     }
     io::UniqueFd parentInput(fromChild[0]), childOutput(fromChild[1]);
     const pid_t pid = ::fork();
     if (pid < 0) {
-        error = std::string("cannot run the signer: ") + std::strerror(errno);
-        return std::nullopt;
+        return Failure{std::string("cannot run the signer: ") + std::strerror(errno)};
     }
     if (pid == 0) {
         if (::dup2(childInput.get(), STDIN_FILENO) < 0 ||
@@ -69,26 +65,24 @@ std::optional<std::string> runSigner(const std::string& command, std::string_vie
     while (::waitpid(pid, &status, 0) < 0 && errno == EINTR) {
     }
     if (!WIFEXITED(status) || WEXITSTATUS(status) != 0) {
-        error = "the signer '" + command + "' failed (" +
-                (WIFEXITED(status) ? "exit status " + std::to_string(WEXITSTATUS(status))
-                                   : std::string("killed")) +
-                ")";
-        return std::nullopt;
+        return Failure{"the signer '" + command + "' failed (" +
+                       (WIFEXITED(status) ? "exit status " + std::to_string(WEXITSTATUS(status))
+                                          : std::string("killed")) +
+                       ")"};
     }
     if (writeError != 0 || readError != 0) {
-        error = "the signer '" + command + "' did not read the catalog or answered too much";
-        return std::nullopt;
+        return Failure{"the signer '" + command +
+                       "' did not read the catalog or answered too much"};
     }
     return output;
 }
 
 }  // namespace
 
-std::optional<std::string> generateKeyPair(const std::string& secretKeyPath,
-                                           const std::string& publicKeyPath, std::string& error) {
+Result<std::string> generateKeyPair(const std::string& secretKeyPath,
+                                    const std::string& publicKeyPath) {
     if (!catalog::sodiumReady()) {
-        error = "libsodium cannot be initialised";
-        return std::nullopt;
+        return Failure{"libsodium cannot be initialised"};
     }
     catalog::CatalogPublicKey publicKey{};
     catalog::CatalogSecretKey secretKey{};
@@ -99,41 +93,35 @@ std::optional<std::string> generateKeyPair(const std::string& secretKeyPath,
         std::string_view(reinterpret_cast<const char*>(secretKey.data()), secretKey.size()), 0600);
     sodium_memzero(secretKey.data(), secretKey.size());
     if (secretError != 0) {
-        error = systemError("cannot create", secretKeyPath, secretError);
-        return std::nullopt;
+        return Failure{systemError("cannot create", secretKeyPath, secretError)};
     }
     if (int publicError = io::replaceFileAtomically(publicKeyPath, publicText + "\n", 0644);
         publicError != 0) {
         // A lone secret key would make the retry refuse to overwrite it.
         ::unlink(secretKeyPath.c_str());
-        error = systemError("cannot write", publicKeyPath, publicError);
-        return std::nullopt;
+        return Failure{systemError("cannot write", publicKeyPath, publicError)};
     }
     return publicText;
 }
 
-std::optional<catalog::CatalogSecretKey> readSecretKey(const std::string& path,
-                                                       std::string& error) {
+Result<catalog::CatalogSecretKey> readSecretKey(const std::string& path) {
     std::optional<std::string> bytes = plist::readFileBytes(path);
     catalog::CatalogSecretKey key{};
     if (!bytes || bytes->size() != key.size()) {
-        error = path + " is not a secret key made by 'tavrix-catalog keygen'";
-        return std::nullopt;
+        return Failure{path + " is not a secret key made by 'tavrix-catalog keygen'"};
     }
     std::memcpy(key.data(), bytes->data(), key.size());
     sodium_memzero(bytes->data(), bytes->size());
     return key;
 }
 
-std::optional<catalog::TrustedCatalogKey> readPublicKey(const std::string& path,
-                                                        const std::string& identifier,
-                                                        std::string& error) {
+Result<catalog::TrustedCatalogKey> readPublicKey(const std::string& path,
+                                                 const std::string& identifier) {
     std::optional<std::string> text = plist::readFileBytes(path);
     std::optional<std::string> bytes = text ? catalog::base64Decode(*text) : std::nullopt;
     catalog::TrustedCatalogKey key;
     if (!bytes || bytes->size() != key.publicKey.size()) {
-        error = path + " is not a public key made by 'tavrix-catalog keygen'";
-        return std::nullopt;
+        return Failure{path + " is not a public key made by 'tavrix-catalog keygen'"};
     }
     std::memcpy(key.publicKey.data(), bytes->data(), key.publicKey.size());
     key.identifier = identifier.empty() ? catalog::defaultKeyIdentifier(key.publicKey) : identifier;
@@ -146,11 +134,9 @@ catalog::CatalogPublicKey publicKeyOf(const catalog::CatalogSecretKey& secretKey
     return publicKey;
 }
 
-std::optional<std::string> signCatalogBytes(const CatalogSigner& signer, std::string_view bytes,
-                                            std::string& error) {
+Result<std::string> signCatalogBytes(const CatalogSigner& signer, std::string_view bytes) {
     if (!catalog::sodiumReady()) {
-        error = "libsodium cannot be initialised";
-        return std::nullopt;
+        return Failure{"libsodium cannot be initialised"};
     }
     std::string signature(catalog::kCatalogSignatureBytes, '\0');
     catalog::CatalogPublicKey publicKey = signer.publicKey;
@@ -160,15 +146,14 @@ std::optional<std::string> signCatalogBytes(const CatalogSigner& signer, std::st
                              signer.secretKey->data());
         publicKey = publicKeyOf(*signer.secretKey);
     } else {
-        std::optional<std::string> answer = runSigner(signer.command, bytes, error);
+        Result<std::string> answer = runSigner(signer.command, bytes);
         if (!answer) {
-            return std::nullopt;
+            return answer;
         }
         signature = std::move(*answer);
     }
     if (!catalog::verifyCatalogSignature(bytes, signature, publicKey)) {
-        error = "the signature does not verify with the public key; nothing was published";
-        return std::nullopt;
+        return Failure{"the signature does not verify with the public key; nothing was published"};
     }
     return signature;
 }

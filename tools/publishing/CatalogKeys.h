@@ -7,6 +7,7 @@
 #include <string>
 #include <string_view>
 
+#include "base/Result.h"
 #include "catalog/CatalogCrypto.h"
 #include "catalog/CatalogTrust.h"
 
@@ -14,19 +15,16 @@ namespace tavrix::tools {
 
 // Makes an Ed25519 key pair: the secret key as 64 raw bytes (mode 0600) and the public key as
 // base64 text. Both files are written or neither: never over an existing secret key, and a secret
-// key whose public half could not be written is removed again. The public key's base64 on
-// success, else nothing with error set.
-std::optional<std::string> generateKeyPair(const std::string& secretKeyPath,
-                                           const std::string& publicKeyPath, std::string& error);
+// key whose public half could not be written is removed again. The public key's base64.
+Result<std::string> generateKeyPair(const std::string& secretKeyPath,
+                                    const std::string& publicKeyPath);
 
-// The secret key in the file keygen wrote, or nothing with error set.
-std::optional<catalog::CatalogSecretKey> readSecretKey(const std::string& path, std::string& error);
+// The secret key in the file keygen wrote.
+Result<catalog::CatalogSecretKey> readSecretKey(const std::string& path);
 
-// The public key in the file keygen wrote, named identifier (its default identifier when empty),
-// or nothing with error set.
-std::optional<catalog::TrustedCatalogKey> readPublicKey(const std::string& path,
-                                                        const std::string& identifier,
-                                                        std::string& error);
+// The public key in the file keygen wrote, named identifier (its default identifier when empty).
+Result<catalog::TrustedCatalogKey> readPublicKey(const std::string& path,
+                                                 const std::string& identifier);
 
 // The public half of secretKey.
 catalog::CatalogPublicKey publicKeyOf(const catalog::CatalogSecretKey& secretKey);
@@ -40,8 +38,7 @@ struct CatalogSigner {
     catalog::CatalogPublicKey publicKey{};
 };
 
-// The detached signature of bytes, checked with the signer's public key; nothing with error set.
-std::optional<std::string> signCatalogBytes(const CatalogSigner& signer, std::string_view bytes,
-                                            std::string& error);
+// The detached signature of bytes, checked with the signer's public key.
+Result<std::string> signCatalogBytes(const CatalogSigner& signer, std::string_view bytes);
 
 }  // namespace tavrix::tools

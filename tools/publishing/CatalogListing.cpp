@@ -70,24 +70,24 @@ void printCatalog(const plist::Value& catalog) {
     }
 }
 
-std::optional<std::string> showOne(const std::string& location) {
+Result<> showOne(const std::string& location) {
     std::string error;
     std::optional<std::string> bytes = readPublished(location, catalog::kMaxCatalogBytes, error);
     std::optional<plist::Value> catalog =
         bytes ? catalog::parseCatalog(*bytes, error) : std::nullopt;
     if (!catalog) {
-        return error;
+        return Failure{error};
     }
     std::printf("catalog: %s\n", location.c_str());
     printCatalog(*catalog);
-    return std::nullopt;
+    return {};
 }
 
 }  // namespace
 
-std::optional<std::string> showCatalog(const std::string& source) {
-    if (std::optional<std::string> error = showOne(catalogLocation(source))) {
-        return error;
+Result<> showCatalog(const std::string& source) {
+    if (Result<> shown = showOne(catalogLocation(source)); !shown) {
+        return shown;
     }
     std::error_code code;
     const fs::path staged = fs::path(source) / kUnsignedCatalogFileName;
@@ -96,7 +96,7 @@ std::optional<std::string> showCatalog(const std::string& source) {
         std::printf("\nwaiting for its signature ('tavrix-catalog sign'):\n");
         return showOne(staged.string());
     }
-    return std::nullopt;
+    return {};
 }
 
 }  // namespace tavrix::tools

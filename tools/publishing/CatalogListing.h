@@ -2,13 +2,14 @@
 // rollout, as the catalog says it (nothing is verified here; that is `verify`).
 #pragma once
 
-#include <optional>
 #include <string>
+
+#include "base/Result.h"
 
 namespace tavrix::tools {
 
 // Prints the catalog at source (a URL or a site directory) on stdout; for a directory, also a
-// catalog waiting for its signature. Nothing on success, else the error.
-std::optional<std::string> showCatalog(const std::string& source);
+// catalog waiting for its signature.
+Result<> showCatalog(const std::string& source);
 
 }  // namespace tavrix::tools

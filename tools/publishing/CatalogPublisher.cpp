@@ -27,8 +27,6 @@ constexpr std::uint32_t kMaxBundleBytes = 1u << 30;
 // Every entry's modification time (2001-01-01), so that archives depend on file contents only.
 constexpr std::int64_t kEntryModificationTime = 978307200;
 
-using Failure = std::optional<std::string>;
-
 std::string systemError(const std::string& action, const std::string& path, int error) {
     return action + " " + path + ": " + std::strerror(error);
 }
@@ -61,27 +59,24 @@ std::string archiveNameFor(const std::string& directory, const std::string& vers
 
 // The version is always the bundle's own: a catalog that names another one makes every device
 // download the bundle again at each check.
-std::optional<std::string> bundleVersion(const BundleToPublish& bundle, std::string& error) {
-    std::optional<BundleIdentity> identity = checkBundleDirectory(bundle.directory, error);
+Result<std::string> bundleVersion(const BundleToPublish& bundle) {
+    Result<BundleIdentity> identity = checkBundleDirectory(bundle.directory);
     if (!identity) {
-        return std::nullopt;
+        return identity.failure();
     }
     if (!bundle.version.empty() && bundle.version != identity->version) {
-        error = bundle.directory + ": --version " + bundle.version + " differs from " +
-                kInfoFileName + " " + kBundleVersionKey + " " + identity->version;
-        return std::nullopt;
+        return Failure{bundle.directory + ": --version " + bundle.version + " differs from " +
+                       kInfoFileName + " " + kBundleVersionKey + " " + identity->version};
     }
     return identity->version;
 }
 
 // The regular files below directory as paths relative to it, sorted so archives are
 // reproducible. Symbolic links and special files are left out with a warning.
-std::optional<std::vector<std::string>> bundleFiles(const std::string& directory,
-                                                    std::string& error) {
+Result<std::vector<std::string>> bundleFiles(const std::string& directory) {
     std::error_code code;
     if (!fs::is_directory(directory, code)) {
-        error = directory + " is not a directory";
-        return std::nullopt;
+        return Failure{directory + " is not a directory"};
     }
     std::vector<std::string> files;
     fs::recursive_directory_iterator walk(directory, code);
@@ -99,34 +94,30 @@ std::optional<std::vector<std::string>> bundleFiles(const std::string& directory
         }
     }
     if (code) {
-        error = systemError("cannot list", directory, code.value());
-        return std::nullopt;
+        return Failure{systemError("cannot list", directory, code.value())};
     }
     std::sort(files.begin(), files.end());
     return files;
 }
 
-// The archive of the files, or nothing with error set.
-std::optional<std::string> packBundle(const std::string& directory,
-                                      const std::vector<std::string>& files, std::string& error) {
+// The archive of the files.
+Result<std::string> packBundle(const std::string& directory,
+                               const std::vector<std::string>& files) {
     std::unique_ptr<payload::Archive> archive =
         payload::Archive::initWithMaxUncompressedSize(kMaxBundleBytes, directory);
     if (!archive) {
-        error = "cannot set up an archive for " + directory;
-        return std::nullopt;
+        return Failure{"cannot set up an archive for " + directory};
     }
     archive->setEntryModificationTime(kEntryModificationTime);
     for (const std::string& file : files) {
         std::string path = (fs::path(directory) / file).string();
         if (!archive->addFile(path, file)) {
-            error = "cannot add " + path + " (unreadable, or the bundle is over " +
-                    std::to_string(kMaxBundleBytes) + " bytes)";
-            return std::nullopt;
+            return Failure{"cannot add " + path + " (unreadable, or the bundle is over " +
+                           std::to_string(kMaxBundleBytes) + " bytes)"};
         }
     }
     if (!archive->close()) {
-        error = "cannot finish the archive of " + directory;
-        return std::nullopt;
+        return Failure{"cannot finish the archive of " + directory};
     }
     const plist::Data& data = archive->archiveData();
     return std::string(reinterpret_cast<const char*>(data.data()), data.size());
@@ -134,15 +125,20 @@ std::optional<std::string> packBundle(const std::string& directory,
 
 // Writes the archive under its content-addressed name. A file already there with that name holds
 // the same bytes and is left alone; one that does not is damaged, and is refused.
-Failure storeArchive(const std::string& path, const std::string& bytes, const std::string& digest) {
+Result<> storeArchive(const std::string& path, const std::string& bytes,
+                      const std::string& digest) {
     int error = io::createFileAtomically(path, bytes, 0644);
     if (error == EEXIST) {
         std::optional<std::string> existing = catalog::sha256HexOfFile(path);
-        return existing == digest
-                   ? Failure()
-                   : Failure(path + " does not hold the bytes its name says; remove it");
+        if (existing != digest) {
+            return Failure{path + " does not hold the bytes its name says; remove it"};
+        }
+        return {};
     }
-    return error == 0 ? Failure() : systemError("cannot write", path, error);
+    if (error != 0) {
+        return Failure{systemError("cannot write", path, error)};
+    }
+    return {};
 }
 
 plist::Value attributesFor(const BundleToPublish& bundle, const std::string& version) {
@@ -161,38 +157,35 @@ plist::Value attributesFor(const BundleToPublish& bundle, const std::string& ver
 }
 
 // Packs one bundle into the archives directory and answers its catalog entry.
-std::optional<plist::Value> publishBundle(const PublishRequest& request,
-                                          const BundleToPublish& bundle, std::string& error) {
-    std::optional<std::string> version = bundleVersion(bundle, error);
+Result<plist::Value> publishBundle(const PublishRequest& request, const BundleToPublish& bundle) {
+    Result<std::string> version = bundleVersion(bundle);
     if (!version) {
-        return std::nullopt;
+        return version.failure();
     }
-    std::optional<std::vector<std::string>> files = bundleFiles(bundle.directory, error);
+    Result<std::vector<std::string>> files = bundleFiles(bundle.directory);
     if (!files) {
-        return std::nullopt;
+        return files.failure();
     }
-    std::optional<std::string> bytes = packBundle(bundle.directory, *files, error);
+    Result<std::string> bytes = packBundle(bundle.directory, *files);
     if (!bytes) {
-        return std::nullopt;
+        return bytes.failure();
     }
     const std::size_t size = bytes->size();
     if (size > catalog::kMaxArchiveBytes) {
-        error = bundle.directory + " packs larger than devices accept";
-        return std::nullopt;
+        return Failure{bundle.directory + " packs larger than devices accept"};
     }
     catalog::Sha256Digest hasher;
     hasher.update(*bytes);
     const std::string digest = hasher.finishHex();
     if (digest.empty()) {
-        error = "cannot take the SHA-256 of the archive of " + bundle.directory;
-        return std::nullopt;
+        return Failure{"cannot take the SHA-256 of the archive of " + bundle.directory};
     }
     std::string relativeURL = std::string(kArchivesDirectoryName) + "/" +
                               archiveNameFor(bundle.directory, *version, digest);
-    if (Failure failure = storeArchive((fs::path(request.outputDirectory) / relativeURL).string(),
-                                       *bytes, digest)) {
-        error = *failure;
-        return std::nullopt;
+    if (Result<> stored = storeArchive((fs::path(request.outputDirectory) / relativeURL).string(),
+                                       *bytes, digest);
+        !stored) {
+        return stored.failure();
     }
     std::printf("packed %s: %zu files, %zu bytes, Version %s\n", relativeURL.c_str(), files->size(),
                 size, version->c_str());
@@ -209,8 +202,7 @@ std::optional<plist::Value> publishBundle(const PublishRequest& request,
 }
 
 // The catalog already in the output directory, or a new one when there is none yet or with fresh.
-std::optional<plist::Dictionary> startingCatalog(const PublishRequest& request,
-                                                 std::string& error) {
+Result<plist::Dictionary> startingCatalog(const PublishRequest& request) {
     plist::Dictionary fresh{{catalog::kCatalogAssetTypeKey, plist::Value(request.assetType)},
                             {catalog::kCatalogAssetsKey, plist::Value(plist::Array())}};
     std::string path = (fs::path(request.outputDirectory) / kCatalogFileName).string();
@@ -218,21 +210,18 @@ std::optional<plist::Dictionary> startingCatalog(const PublishRequest& request,
     if (request.fresh || !fs::exists(path, code)) {
         return fresh;
     }
-    std::optional<plist::Dictionary> catalog = readServedCatalog(request.outputDirectory, error);
+    Result<plist::Dictionary> catalog = readServedCatalog(request.outputDirectory);
     if (!catalog) {
-        error += "; use --fresh to replace it";
-        return std::nullopt;
+        return Failure{catalog.reason() + "; use --fresh to replace it"};
     }
     auto type = catalog->find(catalog::kCatalogAssetTypeKey);
     auto assets = catalog->find(catalog::kCatalogAssetsKey);
     if (assets == catalog->end() || assets->second.asArray() == nullptr) {
-        error = path + " is not a catalog; use --fresh to replace it";
-        return std::nullopt;
+        return Failure{path + " is not a catalog; use --fresh to replace it"};
     }
     if (type == catalog->end() || type->second.asString() == nullptr ||
         *type->second.asString() != request.assetType) {
-        error = path + " lists another asset type; use --fresh to replace it";
-        return std::nullopt;
+        return Failure{path + " lists another asset type; use --fresh to replace it"};
     }
     return catalog;
 }
@@ -257,26 +246,25 @@ void addOrReplace(plist::Array& entries, plist::Value entry) {
 
 }  // namespace
 
-std::optional<std::string> publishCatalog(const PublishRequest& request) {
-    if (Failure staged = refuseWhileStaged(request.outputDirectory)) {
-        return staged;
+Result<> publishCatalog(const PublishRequest& request) {
+    if (Result<> open = refuseWhileStaged(request.outputDirectory); !open) {
+        return open;
     }
     std::string archives = (fs::path(request.outputDirectory) / kArchivesDirectoryName).string();
     std::error_code code;
     fs::create_directories(archives, code);
     if (code) {
-        return systemError("cannot create", archives, code.value());
+        return Failure{systemError("cannot create", archives, code.value())};
     }
-    std::string error;
-    std::optional<plist::Dictionary> catalog = startingCatalog(request, error);
+    Result<plist::Dictionary> catalog = startingCatalog(request);
     if (!catalog) {
-        return error;
+        return catalog.failure();
     }
     plist::Array entries = *catalog->at(catalog::kCatalogAssetsKey).asArray();
     for (const BundleToPublish& bundle : request.bundles) {
-        std::optional<plist::Value> entry = publishBundle(request, bundle, error);
+        Result<plist::Value> entry = publishBundle(request, bundle);
         if (!entry) {
-            return error;
+            return entry.failure();
         }
         addOrReplace(entries, std::move(*entry));
     }

@@ -33,8 +33,7 @@ struct PublishRequest {
 
 // Packs every bundle into an archive named after its digest, adds it to the catalog (replacing an
 // entry of the same version) and completes the catalog. Archives are the same bytes for the same
-// files, and a file once written is never changed. Progress goes to stdout. Nothing on success,
-// else the error.
-std::optional<std::string> publishCatalog(const PublishRequest& request);
+// files, and a file once written is never changed. Progress goes to stdout.
+Result<> publishCatalog(const PublishRequest& request);
 
 }  // namespace tavrix::tools

@@ -19,15 +19,13 @@ namespace fs = std::filesystem;
 constexpr double kSecondsPerDay = 86400.0;
 constexpr const char* kArchiveExtension = ".tgz";
 
-using Failure = std::optional<std::string>;
-
 std::string pathIn(const std::string& site, const char* name) {
     return (fs::path(site) / name).string();
 }
 
 Failure writeFailure(const std::string& path, int error) {
-    return "cannot write " + path + ": " +
-           std::error_code(error, std::generic_category()).message();
+    return {"cannot write " + path + ": " +
+            std::error_code(error, std::generic_category()).message()};
 }
 
 // The archive file names a catalog lists in the site's archives directory.
@@ -79,13 +77,12 @@ void removeUnlistedArchives(const std::string& site, const std::set<std::string>
 }
 
 // Puts bytes live as the site's catalog, with its signature when there is one.
-Failure goLive(const std::string& site, const plist::Dictionary& catalog, const std::string& bytes,
-               const std::optional<std::string>& signature) {
+Result<> goLive(const std::string& site, const plist::Dictionary& catalog, const std::string& bytes,
+                const std::optional<std::string>& signature) {
     const std::string path = pathIn(site, kCatalogFileName);
     const std::string signaturePath = path + catalog::kCatalogSignatureSuffix;
-    std::string ignored;
     std::set<std::string> keep = listedArchives(catalog);
-    if (std::optional<plist::Dictionary> previous = readServedCatalog(site, ignored)) {
+    if (Result<plist::Dictionary> previous = readServedCatalog(site)) {
         keep.merge(listedArchives(*previous));
     }
     // The signature first: a device that fetches between the two sees a pair that does not
@@ -118,39 +115,37 @@ Failure goLive(const std::string& site, const plist::Dictionary& catalog, const 
                 keyID != catalog.end() && keyID->second.asString() != nullptr
                     ? ("signed with " + *keyID->second.asString()).c_str()
                     : "unsigned");
-    return std::nullopt;
+    return {};
 }
 
 }  // namespace
 
-std::optional<plist::Dictionary> readServedCatalog(const std::string& site, std::string& error) {
+Result<plist::Dictionary> readServedCatalog(const std::string& site) {
     const std::string path = pathIn(site, kCatalogFileName);
     plist::Refusal refusal;
     std::optional<plist::Value> catalog = plist::readFile(path, &refusal);
     if (!catalog) {
-        error = path + ": " + (refusal.reason.empty() ? "cannot be read" : refusal.reason);
-        return std::nullopt;
+        return Failure{path + ": " + (refusal.reason.empty() ? "cannot be read" : refusal.reason)};
     }
     if (catalog->asDictionary() == nullptr) {
-        error = path + " is not a catalog";
-        return std::nullopt;
+        return Failure{path + " is not a catalog"};
     }
     return *catalog->asDictionary();
 }
 
-std::optional<std::string> refuseWhileStaged(const std::string& site) {
+Result<> refuseWhileStaged(const std::string& site) {
     std::error_code code;
     const std::string staged = pathIn(site, kUnsignedCatalogFileName);
     if (fs::exists(staged, code)) {
-        return staged + " waits for its signature: sign it with 'tavrix-catalog sign' or remove it";
+        return Failure{staged +
+                       " waits for its signature: sign it with 'tavrix-catalog sign' or remove it"};
     }
-    return std::nullopt;
+    return {};
 }
 
-std::optional<std::string> completeCatalog(const std::string& site, plist::Dictionary catalog,
-                                           const Completion& completion) {
-    std::string ignored;
-    const std::optional<plist::Dictionary> served = readServedCatalog(site, ignored);
+Result<> completeCatalog(const std::string& site, plist::Dictionary catalog,
+                         const Completion& completion) {
+    const Result<plist::Dictionary> served = readServedCatalog(site);
     const std::int64_t serial = completion.serial.value_or((served ? serialOf(*served) : 0) + 1);
     const double now = static_cast<double>(std::time(nullptr));
     catalog.insert_or_assign(catalog::kCatalogSerialKey,
@@ -169,7 +164,11 @@ std::optional<std::string> completeCatalog(const std::string& site, plist::Dicti
     } else {
         catalog.insert_or_assign(catalog::kCatalogKeyIDKey, plist::Value(keyIdentifier));
     }
-    const std::string bytes = plist::serialize(plist::Value(catalog));
+    const Result<std::string> encoded = plist::serialize(plist::Value(catalog));
+    if (!encoded) {
+        return Failure{"the catalog cannot be written: " + encoded.reason()};
+    }
+    const std::string& bytes = *encoded;
     switch (completion.mode) {
         case Completion::Mode::Stage: {
             const std::string path = pathIn(site, kUnsignedCatalogFileName);
@@ -180,39 +179,38 @@ std::optional<std::string> completeCatalog(const std::string& site, plist::Dicti
                 "staged %s: serial %lld, for the key %s; devices see nothing until "
                 "'tavrix-catalog sign' puts it live\n",
                 path.c_str(), static_cast<long long>(serial), keyIdentifier.c_str());
-            return std::nullopt;
+            return {};
         }
         case Completion::Mode::Unsigned:
             return goLive(site, catalog, bytes, std::nullopt);
         case Completion::Mode::SignNow:
             break;
     }
-    std::string error;
-    std::optional<std::string> signature = signCatalogBytes(*completion.signer, bytes, error);
+    Result<std::string> signature = signCatalogBytes(*completion.signer, bytes);
     if (!signature) {
-        return error;
+        return signature.failure();
     }
-    return goLive(site, catalog, bytes, signature);
+    return goLive(site, catalog, bytes, *signature);
 }
 
-std::optional<std::string> signStagedCatalog(const std::string& site, const CatalogSigner& signer) {
+Result<> signStagedCatalog(const std::string& site, const CatalogSigner& signer) {
     const std::string path = pathIn(site, kUnsignedCatalogFileName);
     plist::Refusal refusal;
     std::optional<std::string> bytes = plist::readFileBytes(path, &refusal);
     if (!bytes) {
-        return path + ": " + (refusal.reason.empty() ? "cannot be read" : refusal.reason) +
-               "; 'publish --stage' and the other commands write it";
+        return Failure{path + ": " + (refusal.reason.empty() ? "cannot be read" : refusal.reason) +
+                       "; 'publish --stage' and the other commands write it"};
     }
     std::string error;
     std::optional<plist::Value> catalog = catalog::parseCatalog(*bytes, error);
     if (!catalog) {
-        return path + ": " + error;
+        return Failure{path + ": " + error};
     }
-    std::optional<std::string> signature = signCatalogBytes(signer, *bytes, error);
+    Result<std::string> signature = signCatalogBytes(signer, *bytes);
     if (!signature) {
-        return error;
+        return signature.failure();
     }
-    return goLive(site, *catalog->asDictionary(), *bytes, signature);
+    return goLive(site, *catalog->asDictionary(), *bytes, *signature);
 }
 
 }  // namespace tavrix::tools

@@ -7,6 +7,7 @@
 #include <optional>
 #include <string>
 
+#include "base/Result.h"
 #include "catalog/CatalogCrypto.h"
 #include "plist/Value.h"
 #include "publishing/CatalogKeys.h"
@@ -31,22 +32,22 @@ struct Completion {
     int expiresInDays = 30;
 };
 
-// The catalog the site serves now; nothing with error set when there is none or it is damaged.
-std::optional<plist::Dictionary> readServedCatalog(const std::string& site, std::string& error);
+// The catalog the site serves now; fails when there is none or it is damaged.
+Result<plist::Dictionary> readServedCatalog(const std::string& site);
 
-// Nothing when no catalog waits for its signature in site, else the error to refuse a change
-// with: the change would be made to a catalog that is about to be replaced.
-std::optional<std::string> refuseWhileStaged(const std::string& site);
+// Fails when a catalog waits for its signature in site, with the error to refuse a change with:
+// the change would be made to a catalog that is about to be replaced.
+Result<> refuseWhileStaged(const std::string& site);
 
 // Gives catalog its serial, expiry and KeyID and signs it and puts it live, or stages it, as
 // completion says. Going live, the signature is written before the catalog, each file replaced
 // whole, and then archives that neither this catalog nor the one it replaced names are removed:
 // a device that fetched the previous catalog can still download what it names. Prints one line
-// saying what it did. Nothing on success, else the error.
-std::optional<std::string> completeCatalog(const std::string& site, plist::Dictionary catalog,
-                                           const Completion& completion);
+// saying what it did.
+Result<> completeCatalog(const std::string& site, plist::Dictionary catalog,
+                         const Completion& completion);
 
 // Signs the staged catalog as it is and puts it live as completeCatalog does.
-std::optional<std::string> signStagedCatalog(const std::string& site, const CatalogSigner& signer);
+Result<> signStagedCatalog(const std::string& site, const CatalogSigner& signer);
 
 }  // namespace tavrix::tools
