@@ -8,7 +8,7 @@
 
 namespace tavrix {
 
-bool BundleManager::installBehaviorBundleData(const plist::Data& data, std::string* whyNot) {
+Result<> BundleManager::installBehaviorBundleData(const plist::Data& data) {
     std::string reason;
     logCFormat("Behavior bundle data is received %ld\n", static_cast<long>(data.size()));
     logCFormat("Writing the zipped file into: %s\n", payload::kBundleArchiveTempPath);
@@ -16,34 +16,31 @@ bool BundleManager::installBehaviorBundleData(const plist::Data& data, std::stri
     // Only bytes this call wrote are unpacked: a payload that cannot be staged is refused, and
     // the bundle linked now stays.
     std::optional<payload::StagedPayload> staged = payload::stagePayload(data, stagedPath, &reason);
-    bool installed = false;
-    if (staged) {
-        // Extracted beside the old bundle, which goes only once the new one is there. A damaged
-        // payload still replaces it with whatever was extracted; one stopped at a limit (its size,
-        // its entries, the free space it would leave) keeps the old bundle: nothing was wrong
-        // with it, only there is no room for the new one.
-        installed = replaceUserBundle(
-            [&](const std::string& staging, std::string* failure) {
-                // Entries reaching into the bundle directory itself belong to the new bundle.
-                const payload::ExtractionOutcome outcome = payload::extractArchive(
-                    staged->fd(), stagedPath, staging, payload::ExtractionSafety::AsArchived,
-                    payload::kClientPayloadLimits, failure, userBundleLocation());
-                if (outcome == payload::ExtractionOutcome::Complete) {
-                    return BundleFill::Whole;
-                }
-                if (failure->empty()) {
-                    *failure = "the archive could not be extracted";
-                }
-                logCFormat("%s\n", failure->c_str());
-                return outcome == payload::ExtractionOutcome::OverLimit ? BundleFill::Refused
-                                                                        : BundleFill::Incomplete;
-            },
-            &reason);
+    if (!staged) {
+        return Failure{reason};
     }
-    if (!installed && whyNot != nullptr) {
-        *whyNot = reason;
-    }
-    return installed;
+    // Extracted beside the old bundle, which goes only once the new one is there. A damaged
+    // payload still replaces it with whatever was extracted; one stopped at a limit (its size,
+    // its entries, the free space it would leave) keeps the old bundle: nothing was wrong
+    // with it, only there is no room for the new one.
+    return replaceUserBundle([&](const std::string& staging) {
+        // Entries reaching into the bundle directory itself belong to the new bundle.
+        std::string failure;
+        const payload::ExtractionOutcome outcome = payload::extractArchive(
+            staged->fd(), stagedPath, staging, payload::ExtractionSafety::AsArchived,
+            payload::kClientPayloadLimits, &failure, userBundleLocation());
+        if (outcome == payload::ExtractionOutcome::Complete) {
+            return BundleFillOutcome{};
+        }
+        if (failure.empty()) {
+            failure = "the archive could not be extracted";
+        }
+        logCFormat("%s\n", failure.c_str());
+        return BundleFillOutcome{outcome == payload::ExtractionOutcome::OverLimit
+                                     ? BundleFill::Refused
+                                     : BundleFill::Incomplete,
+                                 failure};
+    });
 }
 
 }  // namespace tavrix

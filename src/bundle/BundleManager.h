@@ -7,6 +7,7 @@
 #include <optional>
 #include <string>
 
+#include "base/Result.h"
 #include "bundle/BundleTypes.h"
 #include "bundle/CarrierBundle.h"
 #include "bundle/UserBundleReplacement.h"
@@ -24,13 +25,13 @@ class BundleManager {
     BundleManager& operator=(const BundleManager&) = delete;
 
     // Replaces the user bundle with the one packed in data (a gzip- or compress-compressed tar or
-    // cpio archive). Failures are logged; the old user bundle is gone even then. True when the
-    // archive was extracted whole and put in place; otherwise whyNot, when given, says why.
-    bool installBehaviorBundleData(const plist::Data& data, std::string* whyNot = nullptr);
+    // cpio archive). Failures are logged; the old user bundle is gone even then. Fails unless the
+    // archive was extracted whole and put in place.
+    Result<> installBehaviorBundleData(const plist::Data& data);
     // The one way the user bundle is replaced (a client's payload, a downloaded update): with what
-    // fill makes, under the lock. True when it was filled whole and put in place; otherwise false
-    // with the reason in whyNot (the old bundle stays unless the new one was placed).
-    bool replaceUserBundle(const UserBundleFill& fill, std::string* whyNot);
+    // fill makes, under the lock. Fails unless it was filled whole and put in place (the old
+    // bundle stays unless the new one was placed).
+    Result<> replaceUserBundle(const UserBundleFill& fill);
 
     // Keeps behaviorID and runs the reset flow for it.
     BundleChangeType resetBehaviorBundle(const std::optional<std::string>& behaviorID);

@@ -13,8 +13,13 @@ namespace tavrix {
 // refused, the old bundle staying.
 enum class BundleFill { Whole, Incomplete, Refused };
 
-// Fills the empty directory at staging with the new bundle's files; anything but Whole comes with
-// the reason in whyNot.
-using UserBundleFill = std::function<BundleFill(const std::string& staging, std::string* whyNot)>;
+// How filling went, with the reason for anything but Whole.
+struct BundleFillOutcome {
+    BundleFill fill = BundleFill::Whole;
+    std::string reason;
+};
+
+// Fills the empty directory at staging with the new bundle's files.
+using UserBundleFill = std::function<BundleFillOutcome(const std::string& staging)>;
 
 }  // namespace tavrix

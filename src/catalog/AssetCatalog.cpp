@@ -61,15 +61,15 @@ void Asset::beginDownload(const plist::Dictionary& /*options*/) {
 void Asset::runDownload() {
     logCFormat("Asset catalog: downloading %s", entry_.archiveURL.c_str());
     AssetCacheLocation location = AssetCacheLocation::forDownload(typeCacheDirectory_, entry_);
-    std::optional<std::string> failure = downloadAndInstallAsset(
+    Result<> installed = downloadAndInstallAsset(
         entry_, location, limits_,
         [this](plist::Dictionary progress) { report(std::move(progress)); });
     plist::Dictionary last;
-    if (failure) {
+    if (!installed) {
         logCFormat(LogPriority::Warning, "Asset catalog: download of %s failed: %s",
-                   entry_.archiveURL.c_str(), failure->c_str());
+                   entry_.archiveURL.c_str(), installed.reason().c_str());
         last = {{kAssetProgressOperationKey, plist::Value(kAssetOperationFailed)},
-                {kAssetProgressErrorKey, plist::Value(*failure)}};
+                {kAssetProgressErrorKey, plist::Value(installed.reason())}};
     } else {
         logCFormat("Asset catalog: installed %s in %s", entry_.archiveURL.c_str(),
                    location.directory.c_str());
@@ -78,7 +78,7 @@ void Asset::runDownload() {
     {
         std::lock_guard lock(mutex_);
         downloading_ = false;
-        if (!failure) {
+        if (installed) {
             downloaded_.push_back(location.directory);
         }
     }

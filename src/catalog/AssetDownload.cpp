@@ -47,8 +47,8 @@ class StagedPath {
     std::string path_;
 };
 
-std::string errnoText(const char* action, const std::string& path, int error) {
-    return std::string("cannot ") + action + " " + path + ": " + std::strerror(error);
+Failure errnoFailure(const char* action, const std::string& path, int error) {
+    return {std::string("cannot ") + action + " " + path + ": " + std::strerror(error)};
 }
 
 plist::Dictionary progress(const char* operation) {
@@ -62,10 +62,9 @@ plist::Dictionary byteProgress(const char* operation, std::uint64_t written, std
     return report;
 }
 
-// Streams the archive into fd, hashing it on the way. Nothing on success, else why not.
-std::optional<std::string> downloadArchive(const CatalogEntry& entry, int fd,
-                                           const AssetLimits& limits,
-                                           const AssetProgressReporter& report) {
+// Streams the archive into fd, hashing it on the way.
+Result<> downloadArchive(const CatalogEntry& entry, int fd, const AssetLimits& limits,
+                         const AssetProgressReporter& report) {
     Sha256Digest digest;
     std::uint64_t received = 0;
     const std::uint64_t step = std::max<std::uint64_t>(entry.archiveSize / kDownloadReportSteps, 1);
@@ -96,17 +95,18 @@ std::optional<std::string> downloadArchive(const CatalogEntry& entry, int fd,
     };
     std::string error;
     if (!http::transferHttpBody(entry.archiveURL, receiver, limits.archiveTransfer(), error)) {
-        return "cannot download " + entry.archiveURL + ": " + error;
+        return Failure{"cannot download " + entry.archiveURL + ": " + error};
     }
     if (received != entry.archiveSize) {
-        return "the archive is " + std::to_string(received) + " bytes, the catalog says " +
-               std::to_string(entry.archiveSize);
+        return Failure{"the archive is " + std::to_string(received) + " bytes, the catalog says " +
+                       std::to_string(entry.archiveSize)};
     }
     std::string actual = digest.finishHex();
     if (actual != entry.archiveSHA256) {
-        return "the archive's SHA-256 is " + actual + ", the catalog says " + entry.archiveSHA256;
+        return Failure{"the archive's SHA-256 is " + actual + ", the catalog says " +
+                       entry.archiveSHA256};
     }
-    return std::nullopt;
+    return {};
 }
 
 // 64 random bits as hex; should the kernel give none, the process and a count still keep this
@@ -167,14 +167,12 @@ AssetCacheLocation AssetCacheLocation::forDownload(const std::string& typeCacheD
             base + "." + name + kStagedExtractionSuffix};
 }
 
-std::optional<std::string> downloadAndInstallAsset(const CatalogEntry& entry,
-                                                   const AssetCacheLocation& location,
-                                                   const AssetLimits& limits,
-                                                   const AssetProgressReporter& report) {
+Result<> downloadAndInstallAsset(const CatalogEntry& entry, const AssetCacheLocation& location,
+                                 const AssetLimits& limits, const AssetProgressReporter& report) {
     report(byteProgress(kAssetOperationStarted, 0, entry.archiveSize));
     std::string cacheDirectory = io::parentDirectory(location.directory);
     if (int error = createDirectoryAt(cacheDirectory, 0755, true)) {
-        return errnoText("create", cacheDirectory, error);
+        return errnoFailure("create", cacheDirectory, error);
     }
     removeAbandonedDownloads(cacheDirectory, /*completedToo=*/false);
     StagedPath archive(location.archiveFile);
@@ -182,10 +180,10 @@ std::optional<std::string> downloadAndInstallAsset(const CatalogEntry& entry,
         io::UniqueFd fd(::open(archive.path().c_str(),
                                O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, 0600));
         if (!fd) {
-            return errnoText("create", archive.path(), errno);
+            return errnoFailure("create", archive.path(), errno);
         }
-        if (std::optional<std::string> failure = downloadArchive(entry, fd.get(), limits, report)) {
-            return failure;
+        if (Result<> downloaded = downloadArchive(entry, fd.get(), limits, report); !downloaded) {
+            return downloaded;
         }
     }
     report(progress(kAssetOperationInstalling));
@@ -195,22 +193,22 @@ std::optional<std::string> downloadAndInstallAsset(const CatalogEntry& entry,
     if (!payload::extractArchive(archive.path(), extraction.path(),
                                  payload::ExtractionSafety::PathSafe, extractionLimits(limits),
                                  &whyNot)) {
-        return whyNot;
+        return Failure{whyNot};
     }
     // A resumed install copies from here, so the tree is on the disk before it takes its name.
     int error = 0;
     auto cache = io::Directory::open(cacheDirectory, io::Directory::LastLink::Follow, &error);
     if (!cache) {
-        return errnoText("open", cacheDirectory, error);
+        return errnoFailure("open", cacheDirectory, error);
     }
     if ((error = cache->flushTree(io::lastPathComponent(extraction.path()))) != 0) {
-        return errnoText("flush", extraction.path(), error);
+        return errnoFailure("flush", extraction.path(), error);
     }
     if ((error = cache->renameEntry(io::lastPathComponent(extraction.path()),
                                     io::lastPathComponent(location.directory))) != 0) {
-        return errnoText("install into", location.directory, error);
+        return errnoFailure("install into", location.directory, error);
     }
-    return std::nullopt;
+    return {};
 }
 
 }  // namespace tavrix::catalog

@@ -6,6 +6,7 @@
 #include <optional>
 #include <string>
 
+#include "base/Result.h"
 #include "catalog/AssetCatalogFormat.h"
 #include "catalog/AssetCatalogSettings.h"
 #include "plist/Value.h"
@@ -33,12 +34,9 @@ void removeAbandonedDownloads(const std::string& typeCacheDirectory, bool comple
 using AssetProgressReporter = std::function<void(plist::Dictionary progress)>;
 
 // Downloads, verifies and extracts the entry's archive within limits, renames the extraction to
-// location.directory when it is whole, and reports the intermediate steps. Nothing on success,
-// else why it failed. Either way the staged archive and any partial extraction are gone
-// afterwards.
-std::optional<std::string> downloadAndInstallAsset(const CatalogEntry& entry,
-                                                   const AssetCacheLocation& location,
-                                                   const AssetLimits& limits,
-                                                   const AssetProgressReporter& report);
+// location.directory when it is whole, and reports the intermediate steps. Either way the
+// staged archive and any partial extraction are gone afterwards.
+Result<> downloadAndInstallAsset(const CatalogEntry& entry, const AssetCacheLocation& location,
+                                 const AssetLimits& limits, const AssetProgressReporter& report);
 
 }  // namespace tavrix::catalog

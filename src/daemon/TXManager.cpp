@@ -69,11 +69,11 @@ bool TXManager::setTavrixID(const std::string& tavrixID, const std::optional<pli
     // matches what is on disk then, for the ID stored above.
     BundleManager& bundles = BundleManager::sharedInstance();
     if (bundle) {
-        std::string whyNot;
-        const bool extracted = bundles.installBehaviorBundleData(*bundle, &whyNot);
+        const Result<> installed = bundles.installBehaviorBundleData(*bundle);
+        const bool extracted = installed.ok();
         std::string reason = extracted ? "extracted " + std::to_string(bundle->size()) +
                                              " bytes into the user bundle"
-                                       : whyNot;
+                                       : installed.reason();
         recordPayload(extracted, reason);
         if (payload != nullptr) {
             *payload = {extracted, std::move(reason)};

@@ -49,11 +49,11 @@ std::optional<io::Directory> openProtectedChild(const io::Directory& parent,
         std::optional<io::Directory> child = parent.openChild(name, &error);
         std::string why;
         if (child) {
-            std::optional<std::string> unprotected = io::whyNotProtected(child->status());
-            if (!unprotected) {
+            Result<> protectedChild = io::checkProtected(child->status());
+            if (protectedChild) {
                 return child;
             }
-            why = *unprotected;
+            why = protectedChild.reason();
         } else if (error == ENOENT && createMissing) {
             if (::mkdirat(parent.fd(), name.c_str(), kDirectoryMode) == 0) {
                 // The umask must not narrow what the mobile user's applications need to read.
@@ -110,8 +110,8 @@ std::optional<io::Directory> openDirectoryInHome(const std::string& home,
         logDistrustOnce(home, error == ELOOP ? "it is a symbolic link" : errorText(error));
         return std::nullopt;
     }
-    if (std::optional<std::string> why = io::whyNotProtected(current->status())) {
-        logDistrustOnce(home, *why);
+    if (Result<> protectedHome = io::checkProtected(current->status()); !protectedHome) {
+        logDistrustOnce(home, protectedHome.reason());
         return std::nullopt;
     }
     std::string_view rest = std::string_view(directoryPath).substr(home.size());

@@ -93,17 +93,17 @@ bool isTrustedOwner(uid_t owner) {
     return owner == 0 || owner == ::geteuid();
 }
 
-std::optional<std::string> whyNotProtected(const struct stat& directory) {
+Result<> checkProtected(const struct stat& directory) {
     if (!S_ISDIR(directory.st_mode)) {
-        return "it is not a directory";
+        return Failure{"it is not a directory"};
     }
     if (!isTrustedOwner(directory.st_uid)) {
-        return "it belongs to user " + std::to_string(directory.st_uid);
+        return Failure{"it belongs to user " + std::to_string(directory.st_uid)};
     }
     if ((directory.st_mode & (S_IWGRP | S_IWOTH)) != 0 && (directory.st_mode & S_ISVTX) == 0) {
-        return "others may write in it and it is not sticky";
+        return Failure{"others may write in it and it is not sticky"};
     }
-    return std::nullopt;
+    return {};
 }
 
 Directory::Directory(UniqueFd fd, std::string path, const struct stat& status)
@@ -342,7 +342,7 @@ UniqueFd openOwnFile(const std::string& path, int* error) {
     if (!directory) {
         return UniqueFd();
     }
-    if (whyNotProtected(directory->status())) {
+    if (!checkProtected(directory->status())) {
         *error = EPERM;
         return UniqueFd();
     }

@@ -11,6 +11,7 @@
 #include <string>
 #include <string_view>
 
+#include "base/Result.h"
 #include "io/UniqueFd.h"
 
 namespace tavrix::io {
@@ -21,10 +22,10 @@ inline constexpr const char* kAtomicWritePrefix = ".tavrix-write-";
 // Root and the process's own user: the only owners whose files and directories are trusted.
 bool isTrustedOwner(uid_t owner);
 
-// Why a directory is no place for the daemon's own files, or nothing when it is one: owned by a
+// Fails, saying why, unless a directory is a place for the daemon's own files: owned by a
 // trusted user, and writable by others only with the sticky bit, so that nobody else can rename,
 // replace or remove what the daemon keeps there.
-std::optional<std::string> whyNotProtected(const struct stat& directory);
+Result<> checkProtected(const struct stat& directory);
 
 class Directory {
   public:

@@ -30,8 +30,9 @@ std::optional<io::Directory> openStagingDirectory(const std::string& path, std::
         return std::nullopt;
     }
     // In a directory where others may rename what the daemon writes, nothing written is safe.
-    if (std::optional<std::string> why = io::whyNotProtected(directory->status())) {
-        *whyNot = path + " is unsafe: " + *why;
+    if (Result<> protectedDirectory = io::checkProtected(directory->status());
+        !protectedDirectory) {
+        *whyNot = path + " is unsafe: " + protectedDirectory.reason();
         return std::nullopt;
     }
     return directory;

@@ -334,9 +334,8 @@ bool AssetHandler::copyDownloadedBundle(const std::string& source, const std::st
     // Copied beside the user bundle and put in its place only when whole: a copy that fails (a
     // disk that fills) leaves the old bundle as it was, and every file in the copy appears whole
     // or not at all.
-    std::string whyNot;
-    const bool copied = BundleManager::sharedInstance().replaceUserBundle(
-        [&](const std::string& staging, std::string* failure) {
+    const Result<> copied =
+        BundleManager::sharedInstance().replaceUserBundle([&](const std::string& staging) {
             FileSystemHelper files;
             logCFormat("Copying the directory %s to %s\n", source.c_str(), destination.c_str());
             files.createDirectory(staging, 0755, true);
@@ -352,18 +351,16 @@ bool AssetHandler::copyDownloadedBundle(const std::string& source, const std::st
                 error = copyItemTree(entry, staging + "/" + names[index]);
             }
             if (error != 0) {
-                *failure = std::strerror(error);
-                return BundleFill::Refused;
+                return BundleFillOutcome{BundleFill::Refused, std::strerror(error)};
             }
             logCFormat("Removing the directory %s\n", destination.c_str());
-            return BundleFill::Whole;
-        },
-        &whyNot);
+            return BundleFillOutcome{};
+        });
     if (!copied) {
         logCFormat(LogPriority::Warning, "Failed to install %s into %s: %s\n", source.c_str(),
-                   destination.c_str(), whyNot.c_str());
+                   destination.c_str(), copied.reason().c_str());
     }
-    return copied;
+    return copied.ok();
 }
 
 void AssetHandler::resumeInterruptedInstall() {

@@ -265,7 +265,7 @@ class BundleInstall : public testing::Test {
     const fs::path staged = root / "tmp/behaviorbundle_zipped.tgz";
 
     void install(const std::string& bytes) {
-        BundleManager::sharedInstance().installBehaviorBundleData(
+        (void)BundleManager::sharedInstance().installBehaviorBundleData(
             plist::Data(bytes.begin(), bytes.end()));
     }
 };
