@@ -69,21 +69,18 @@ Result<> downloadArchive(const CatalogEntry& entry, int fd, const AssetLimits& l
     std::uint64_t received = 0;
     const std::uint64_t step = std::max<std::uint64_t>(entry.archiveSize / kDownloadReportSteps, 1);
     std::uint64_t nextReport = step;
-    http::HttpBodyReceiver receiver = [&](std::string_view bytes, std::string& refusal) {
+    http::HttpBodyReceiver receiver = [&](std::string_view bytes) -> Result<> {
         // The daemon ends after the transactions it waits for: a download still running then
         // fails, and the next launch checks again.
         if (AssetCatalogService::shared().stopping()) {
-            refusal = "the daemon is stopping";
-            return false;
+            return Failure{"the daemon is stopping"};
         }
         if (bytes.size() > entry.archiveSize - received) {
-            refusal = "the server sent more than the catalog's " +
-                      std::to_string(entry.archiveSize) + " bytes";
-            return false;
+            return Failure{"the server sent more than the catalog's " +
+                           std::to_string(entry.archiveSize) + " bytes"};
         }
         if (int error = io::writeAll(fd, bytes); error != 0) {
-            refusal = std::string("cannot write the archive: ") + std::strerror(error);
-            return false;
+            return Failure{std::string("cannot write the archive: ") + std::strerror(error)};
         }
         digest.update(bytes);
         received += bytes.size();
@@ -91,11 +88,12 @@ Result<> downloadArchive(const CatalogEntry& entry, int fd, const AssetLimits& l
             report(byteProgress(kAssetOperationDownloading, received, entry.archiveSize));
             nextReport = (received / step + 1) * step;
         }
-        return true;
+        return {};
     };
-    std::string error;
-    if (!http::transferHttpBody(entry.archiveURL, receiver, limits.archiveTransfer(), error)) {
-        return Failure{"cannot download " + entry.archiveURL + ": " + error};
+    if (Result<> transferred =
+            http::transferHttpBody(entry.archiveURL, receiver, limits.archiveTransfer());
+        !transferred) {
+        return Failure{"cannot download " + entry.archiveURL + ": " + transferred.reason()};
     }
     if (received != entry.archiveSize) {
         return Failure{"the archive is " + std::to_string(received) + " bytes, the catalog says " +

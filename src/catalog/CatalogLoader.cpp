@@ -48,25 +48,24 @@ class FetchDeadline {
 std::optional<SignedCatalog> fetchFromServer(const AssetTypeSettings& settings,
                                              const FetchDeadline& deadline,
                                              CatalogRefusal& refusal) {
-    std::string error;
     SignedCatalog catalog;
     const AssetLimits& limits = settings.limits;
-    std::optional<std::string> bytes =
+    Result<std::string> bytes =
         http::fetchHttpBody(settings.catalogURL, kMaxCatalogBytes,
-                            limits.catalogTransfer(deadline.remainingMilliseconds()), error);
+                            limits.catalogTransfer(deadline.remainingMilliseconds()));
     if (!bytes) {
-        refusal = {CatalogRefusalKind::FetchFailed, "cannot fetch it: " + error};
+        refusal = {CatalogRefusalKind::FetchFailed, "cannot fetch it: " + bytes.reason()};
         return std::nullopt;
     }
     catalog.bytes = std::move(*bytes);
     if (isSigned(settings)) {
         std::string signatureURL = settings.catalogURL + kCatalogSignatureSuffix;
-        std::optional<std::string> signature =
+        Result<std::string> signature =
             http::fetchHttpBody(signatureURL, kMaxSignatureBytes,
-                                limits.catalogTransfer(deadline.remainingMilliseconds()), error);
+                                limits.catalogTransfer(deadline.remainingMilliseconds()));
         if (!signature) {
             refusal = {CatalogRefusalKind::MissingSignature,
-                       "cannot fetch its signature " + signatureURL + ": " + error};
+                       "cannot fetch its signature " + signatureURL + ": " + signature.reason()};
             return std::nullopt;
         }
         catalog.signature = std::move(*signature);

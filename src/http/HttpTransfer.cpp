@@ -11,18 +11,14 @@ constexpr long kMaxRedirects = 5;
 
 struct TransferState {
     const HttpBodyReceiver* receiver = nullptr;
-    std::string refusal;
-    bool refused = false;
+    Result<> received;
 };
 
 std::size_t receiveBody(char* bytes, std::size_t size, std::size_t count, void* context) {
     auto* state = static_cast<TransferState*>(context);
     std::size_t length = size * count;
-    if (!(*state->receiver)(std::string_view(bytes, length), state->refusal)) {
-        state->refused = true;
-        return CURL_WRITEFUNC_ERROR;
-    }
-    return length;
+    state->received = (*state->receiver)(std::string_view(bytes, length));
+    return state->received ? length : CURL_WRITEFUNC_ERROR;
 }
 
 bool isHttpScheme(const char* scheme) {
@@ -32,19 +28,19 @@ bool isHttpScheme(const char* scheme) {
 
 }  // namespace
 
-bool transferHttpBody(const std::string& url, const HttpBodyReceiver& receiver,
-                      const HttpTransferLimits& limits, std::string& error) {
-    const CurlLibrary* libcurl = loadCurl(&error);
+Result<> transferHttpBody(const std::string& url, const HttpBodyReceiver& receiver,
+                          const HttpTransferLimits& limits) {
+    std::string unavailable;
+    const CurlLibrary* libcurl = loadCurl(&unavailable);
     if (libcurl == nullptr) {
-        return false;
+        return Failure{unavailable};
     }
     CurlEasy handle(libcurl->easy_init());
     if (!handle) {
-        error = "libcurl could not create a transfer";
-        return false;
+        return Failure{"libcurl could not create a transfer"};
     }
     CURL* curl = handle.get();
-    TransferState state{&receiver, {}, false};
+    TransferState state{&receiver, {}};
     char errorText[CURL_ERROR_SIZE] = {};
     // A redirect keeps the URL's own scheme: never https to http, never anywhere else.
     const char* scheme =
@@ -68,38 +64,35 @@ bool transferHttpBody(const std::string& url, const HttpBodyReceiver& receiver,
         libcurl->easy_setopt(curl, CURLOPT_WRITEFUNCTION, receiveBody) == CURLE_OK &&
         libcurl->easy_setopt(curl, CURLOPT_WRITEDATA, &state) == CURLE_OK;
     if (!configured) {
-        error = "libcurl refused the transfer options";
-        return false;
+        return Failure{"libcurl refused the transfer options"};
     }
     CURLcode result = libcurl->easy_perform(curl);
     if (result == CURLE_OK) {
-        return true;
+        return {};
     }
-    if (state.refused) {
-        error = state.refusal;
-    } else if (result == CURLE_HTTP_RETURNED_ERROR) {
+    if (!state.received) {
+        return state.received;
+    }
+    if (result == CURLE_HTTP_RETURNED_ERROR) {
         long status = 0;
         libcurl->easy_getinfo(curl, CURLINFO_RESPONSE_CODE, &status);
-        error = "the server answered HTTP status " + std::to_string(status);
-    } else {
-        error = errorText[0] != '\0' ? errorText : libcurl->easy_strerror(result);
+        return Failure{"the server answered HTTP status " + std::to_string(status)};
     }
-    return false;
+    return Failure{errorText[0] != '\0' ? errorText : libcurl->easy_strerror(result)};
 }
 
-std::optional<std::string> fetchHttpBody(const std::string& url, std::size_t maxBytes,
-                                         const HttpTransferLimits& limits, std::string& error) {
+Result<std::string> fetchHttpBody(const std::string& url, std::size_t maxBytes,
+                                  const HttpTransferLimits& limits) {
     std::string body;
-    HttpBodyReceiver collect = [&](std::string_view bytes, std::string& refusal) {
+    HttpBodyReceiver collect = [&](std::string_view bytes) -> Result<> {
         if (bytes.size() > maxBytes - body.size()) {
-            refusal = "the body is longer than " + std::to_string(maxBytes) + " bytes";
-            return false;
+            return Failure{"the body is longer than " + std::to_string(maxBytes) + " bytes"};
         }
         body.append(bytes);
-        return true;
+        return {};
     };
-    if (!transferHttpBody(url, collect, limits, error)) {
-        return std::nullopt;
+    if (Result<> transferred = transferHttpBody(url, collect, limits); !transferred) {
+        return transferred.failure();
     }
     return body;
 }

@@ -9,10 +9,12 @@
 #include <string>
 #include <string_view>
 
+#include "base/Result.h"
+
 namespace tavrix::http {
 
-// Receives the body piece by piece. Answering false stops the transfer; refusal then says why.
-using HttpBodyReceiver = std::function<bool(std::string_view bytes, std::string& refusal)>;
+// Receives the body piece by piece. A failure stops the transfer, and becomes its failure.
+using HttpBodyReceiver = std::function<Result<>(std::string_view bytes)>;
 
 // How long a transfer may take. A server that accepts and then trickles must not hold the thread
 // that waits for it: a transfer slower than lowSpeedBytesPerSecond for lowSpeedSeconds ends, and
@@ -25,15 +27,14 @@ struct HttpTransferLimits {
     long totalTimeoutMilliseconds = 0;
 };
 
-// Runs a GET of url, handing the body to receiver. True when the whole body arrived; otherwise
-// false with error saying why (the receiver's refusal when it stopped the transfer).
-bool transferHttpBody(const std::string& url, const HttpBodyReceiver& receiver,
-                      const HttpTransferLimits& limits, std::string& error);
+// Runs a GET of url, handing the body to receiver. Fails unless the whole body arrived (with the
+// receiver's reason when it stopped the transfer).
+Result<> transferHttpBody(const std::string& url, const HttpBodyReceiver& receiver,
+                          const HttpTransferLimits& limits);
 
-// The whole body of url, or nothing (with error set) when the transfer fails or the body is
-// longer than maxBytes.
-std::optional<std::string> fetchHttpBody(const std::string& url, std::size_t maxBytes,
-                                         const HttpTransferLimits& limits, std::string& error);
+// The whole body of url; fails when the transfer fails or the body is longer than maxBytes.
+Result<std::string> fetchHttpBody(const std::string& url, std::size_t maxBytes,
+                                  const HttpTransferLimits& limits);
 
 // reference resolved against base (an absolute reference is kept as it is), or nothing when the
 // result is not a valid http or https URL.

@@ -71,10 +71,12 @@ void printCatalog(const plist::Value& catalog) {
 }
 
 Result<> showOne(const std::string& location) {
+    Result<std::string> bytes = readPublished(location, catalog::kMaxCatalogBytes);
+    if (!bytes) {
+        return bytes.failure();
+    }
     std::string error;
-    std::optional<std::string> bytes = readPublished(location, catalog::kMaxCatalogBytes, error);
-    std::optional<plist::Value> catalog =
-        bytes ? catalog::parseCatalog(*bytes, error) : std::nullopt;
+    std::optional<plist::Value> catalog = catalog::parseCatalog(*bytes, error);
     if (!catalog) {
         return Failure{error};
     }

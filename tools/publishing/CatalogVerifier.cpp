@@ -44,20 +44,20 @@ std::optional<std::pair<std::uint64_t, std::string>> measureArchive(
     }
     catalog::Sha256Digest digest;
     std::uint64_t size = 0;
-    bool fetched = http::transferHttpBody(
+    Result<> fetched = http::transferHttpBody(
         entry.archiveURL,
-        [&](std::string_view bytes, std::string& refusal) {
+        [&](std::string_view bytes) -> Result<> {
             size += bytes.size();
             if (size > entry.archiveSize) {
-                refusal =
-                    "it is longer than the " + std::to_string(entry.archiveSize) + " bytes listed";
-                return false;
+                return Failure{"it is longer than the " + std::to_string(entry.archiveSize) +
+                               " bytes listed"};
             }
             digest.update(bytes);
-            return true;
+            return {};
         },
-        kTransferLimits, error);
+        kTransferLimits);
     if (!fetched) {
+        error = fetched.reason();
         return std::nullopt;
     }
     return std::make_pair(size, digest.finishHex());
@@ -91,9 +91,9 @@ void checkCatalog(const VerifyRequest& request, const std::string& location,
     if (request.keys.empty()) {
         report.signature = "not checked";
     } else {
-        std::string signature =
-            readPublished(location + catalog::kCatalogSignatureSuffix, kMaxSignatureBytes, error)
-                .value_or(std::string());
+        Result<std::string> published =
+            readPublished(location + catalog::kCatalogSignatureSuffix, kMaxSignatureBytes);
+        std::string signature = published ? *published : std::string();
         if (catalog::verifyWithTrustedKey(bytes, signature, report.keyID, request.keys, refusal)) {
             report.signature = "verified";
         } else {
@@ -167,26 +167,25 @@ std::string catalogLocation(const std::string& source) {
     return isURL(source) ? source : (fs::path(source) / kCatalogFileName).string();
 }
 
-std::optional<std::string> readPublished(const std::string& location, std::size_t maxBytes,
-                                         std::string& error) {
+Result<std::string> readPublished(const std::string& location, std::size_t maxBytes) {
     if (isURL(location)) {
-        return http::fetchHttpBody(location, maxBytes, kTransferLimits, error);
+        return http::fetchHttpBody(location, maxBytes, kTransferLimits);
     }
     plist::Refusal refusal;
     std::optional<std::string> bytes = plist::readFileBytes(location, &refusal);
     if (!bytes) {
-        error = "cannot read " + location + (refusal.reason.empty() ? "" : ": " + refusal.reason);
+        return Failure{"cannot read " + location +
+                       (refusal.reason.empty() ? "" : ": " + refusal.reason)};
     }
-    return bytes;
+    return std::move(*bytes);
 }
 
 VerifyReport verifyPublishedCatalog(const VerifyRequest& request) {
     VerifyReport report;
     const std::string location = catalogLocation(request.source);
-    std::string error;
-    std::optional<std::string> bytes = readPublished(location, catalog::kMaxCatalogBytes, error);
+    Result<std::string> bytes = readPublished(location, catalog::kMaxCatalogBytes);
     if (!bytes) {
-        report.problems.push_back("fetch failed: " + error);
+        report.problems.push_back("fetch failed: " + bytes.reason());
     } else {
         checkCatalog(request, location, *bytes, report);
     }

@@ -7,6 +7,7 @@
 #include <string>
 #include <vector>
 
+#include "base/Result.h"
 #include "catalog/CatalogTrust.h"
 
 namespace tavrix::tools {
@@ -57,8 +58,7 @@ void printVerifyReport(const VerifyReport& report, bool json);
 
 // Where the catalog of a source (URL or directory) is.
 std::string catalogLocation(const std::string& source);
-// The bytes at an http(s) URL or a file path, at most maxBytes; nothing with error set.
-std::optional<std::string> readPublished(const std::string& location, std::size_t maxBytes,
-                                         std::string& error);
+// The bytes at an http(s) URL or a file path, at most maxBytes.
+Result<std::string> readPublished(const std::string& location, std::size_t maxBytes);
 
 }  // namespace tavrix::tools
