@@ -3,9 +3,9 @@
 // with nothing to answer. Results cannot be dropped unread.
 #pragma once
 
+#include <optional>
 #include <string>
 #include <utility>
-#include <variant>
 
 namespace tavrix {
 
@@ -16,24 +16,26 @@ struct Failure {
 template <typename T = void>
 class [[nodiscard]] Result {
   public:
-    Result(T value) : state_(std::in_place_index<0>, std::move(value)) {}
-    Result(Failure failure) : state_(std::in_place_index<1>, std::move(failure)) {}
+    Result(const T& value) : value_(value) {}
+    Result(T&& value) : value_(std::move(value)) {}
+    Result(Failure failure) : failure_(std::move(failure)) {}
 
-    bool ok() const { return state_.index() == 0; }
+    bool ok() const { return value_.has_value(); }
     explicit operator bool() const { return ok(); }
 
     // Only when ok().
-    T& operator*() { return std::get<0>(state_); }
-    const T& operator*() const { return std::get<0>(state_); }
-    T* operator->() { return &std::get<0>(state_); }
-    const T* operator->() const { return &std::get<0>(state_); }
+    T& operator*() { return value_.value(); }
+    const T& operator*() const { return value_.value(); }
+    T* operator->() { return &value_.value(); }
+    const T* operator->() const { return &value_.value(); }
 
     // Only when !ok().
-    const std::string& reason() const { return std::get<1>(state_).reason; }
-    Failure failure() const { return std::get<1>(state_); }
+    const std::string& reason() const { return failure_.reason; }
+    Failure failure() const { return failure_; }
 
   private:
-    std::variant<T, Failure> state_;
+    std::optional<T> value_;
+    Failure failure_;
 };
 
 template <>

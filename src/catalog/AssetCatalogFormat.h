@@ -23,6 +23,7 @@
 #include <string_view>
 #include <vector>
 
+#include "base/Result.h"
 #include "plist/Value.h"
 
 namespace tavrix::catalog {
@@ -52,14 +53,13 @@ struct CatalogEntry {
     int rolloutPercent = 100;
 };
 
-// The catalog's bytes as a property-list dictionary, or nothing with whyNot saying why.
-std::optional<plist::Value> parseCatalog(std::string_view bytes, std::string& whyNot);
+// The catalog's bytes as a property-list dictionary.
+Result<plist::Value> parseCatalog(std::string_view bytes);
 
 // The entries of a parsed catalog. A catalog that lists another asset type or has no Assets array
-// is refused: nothing, with whyNot saying why. Malformed entries are skipped, each with a log line.
-std::optional<std::vector<CatalogEntry>> readCatalogEntries(const plist::Value& catalog,
-                                                            const std::string& catalogURL,
-                                                            std::string_view assetType,
-                                                            std::string& whyNot);
+// is refused. Malformed entries are skipped, each with a log line.
+Result<std::vector<CatalogEntry>> readCatalogEntries(const plist::Value& catalog,
+                                                     const std::string& catalogURL,
+                                                     std::string_view assetType);
 
 }  // namespace tavrix::catalog

@@ -37,10 +37,12 @@ std::optional<AssetTypeSettings> AssetCatalogService::settingsFor(std::string_vi
     } else if (snapshot.state == plist::CachedPropertyListFile::State::Damaged) {
         reason = "the settings file is not a property list: " + snapshot.refusal.reason;
     } else {
-        settings = parseAssetTypeSettings(*snapshot.value, assetType, reason);
-    }
-    if (settings) {
-        reason.clear();
+        Result<AssetTypeSettings> parsed = parseAssetTypeSettings(*snapshot.value, assetType);
+        if (parsed) {
+            settings = std::move(*parsed);
+        } else {
+            reason = parsed.reason();
+        }
     }
     if (problems == Problems::Logged) {
         noteSettingsProblem(assetType, reason);

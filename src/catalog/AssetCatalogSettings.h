@@ -20,6 +20,7 @@
 #include <string_view>
 #include <vector>
 
+#include "base/Result.h"
 #include "catalog/CatalogTrust.h"
 #include "http/HttpTransfer.h"
 #include "plist/Value.h"
@@ -77,11 +78,10 @@ struct AssetTypeSettings {
     AssetLimits limits;
 };
 
-// The settings for assetType from the settings file's value, or nothing with whyNot saying what
-// is missing or malformed. A malformed key refuses the type rather than dropping verification, and
+// The settings for assetType from the settings file's value; a failure says what is missing or
+// malformed. A malformed key refuses the type rather than dropping verification, and
 // a malformed limit rather than dropping the limit.
-std::optional<AssetTypeSettings> parseAssetTypeSettings(const plist::Value& settings,
-                                                        std::string_view assetType,
-                                                        std::string& whyNot);
+Result<AssetTypeSettings> parseAssetTypeSettings(const plist::Value& settings,
+                                                 std::string_view assetType);
 
 }  // namespace tavrix::catalog

@@ -135,10 +135,9 @@ std::optional<std::vector<CatalogEntry>> loadOnce(const AssetTypeSettings& setti
             return std::nullopt;
         }
     }
-    std::string whyNot;
-    std::optional<plist::Value> parsed = parseCatalog(catalog->bytes, whyNot);
+    Result<plist::Value> parsed = parseCatalog(catalog->bytes);
     if (!parsed) {
-        refusal = {CatalogRefusalKind::Malformed, whyNot};
+        refusal = {CatalogRefusalKind::Malformed, parsed.reason()};
         return std::nullopt;
     }
     if (isSigned(settings)) {
@@ -161,17 +160,17 @@ std::optional<std::vector<CatalogEntry>> loadOnce(const AssetTypeSettings& setti
                         refusal)) {
         return std::nullopt;
     }
-    std::optional<std::vector<CatalogEntry>> entries =
-        readCatalogEntries(*parsed, settings.catalogURL, settings.assetType, whyNot);
+    Result<std::vector<CatalogEntry>> entries =
+        readCatalogEntries(*parsed, settings.catalogURL, settings.assetType);
     if (!entries) {
-        refusal = {CatalogRefusalKind::Malformed, whyNot};
+        refusal = {CatalogRefusalKind::Malformed, entries.reason()};
         return std::nullopt;
     }
     if (!localOnly) {
         recordSerial(settings, metadata->serial, highestAccepted);
         keepLocalCopy(settings, *catalog);
     }
-    return entries;
+    return std::move(*entries);
 }
 
 }  // namespace

@@ -748,9 +748,8 @@ TEST(SampleAssetCatalogTest, ReadsAsDocumentedWithTheDefaultLimits) {
     plist::Refusal refusal;
     std::optional<plist::Value> sample = plist::readFile(TAVRIX_SAMPLE_ASSET_CATALOG, &refusal);
     ASSERT_TRUE(sample.has_value()) << refusal.reason;
-    std::string whyNot;
-    auto settings = parseAssetTypeSettings(*sample, kAssetTypeTavrixBundles, whyNot);
-    ASSERT_TRUE(settings.has_value()) << whyNot;
+    auto settings = parseAssetTypeSettings(*sample, kAssetTypeTavrixBundles);
+    ASSERT_TRUE(settings) << settings.reason();
     EXPECT_EQ(settings->catalogURL, "https://updates.example.net/tavrix/catalog.plist");
     ASSERT_EQ(settings->trustedKeys.size(), 1u);
     EXPECT_EQ(settings->trustedKeys.front().identifier, "release-2026");

@@ -75,10 +75,9 @@ Result<> showOne(const std::string& location) {
     if (!bytes) {
         return bytes.failure();
     }
-    std::string error;
-    std::optional<plist::Value> catalog = catalog::parseCatalog(*bytes, error);
+    Result<plist::Value> catalog = catalog::parseCatalog(*bytes);
     if (!catalog) {
-        return Failure{error};
+        return catalog.failure();
     }
     std::printf("catalog: %s\n", location.c_str());
     printCatalog(*catalog);

@@ -201,10 +201,9 @@ Result<> signStagedCatalog(const std::string& site, const CatalogSigner& signer)
         return Failure{path + ": " + (refusal.reason.empty() ? "cannot be read" : refusal.reason) +
                        "; 'publish --stage' and the other commands write it"};
     }
-    std::string error;
-    std::optional<plist::Value> catalog = catalog::parseCatalog(*bytes, error);
+    Result<plist::Value> catalog = catalog::parseCatalog(*bytes);
     if (!catalog) {
-        return Failure{path + ": " + error};
+        return Failure{path + ": " + catalog.reason()};
     }
     Result<std::string> signature = signCatalogBytes(signer, *bytes);
     if (!signature) {

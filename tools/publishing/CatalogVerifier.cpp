@@ -26,10 +26,10 @@ bool isURL(const std::string& source) {
     return source.starts_with("http://") || source.starts_with("https://");
 }
 
-// The size and SHA-256 of an archive, or nothing with error set. Reading stops past the size
-// listed, as a device's download does.
-std::optional<std::pair<std::uint64_t, std::string>> measureArchive(
-    const std::string& directory, const catalog::CatalogEntry& entry, std::string& error) {
+// The size and SHA-256 of an archive. Reading stops past the size listed, as a device's download
+// does.
+Result<std::pair<std::uint64_t, std::string>> measureArchive(const std::string& directory,
+                                                             const catalog::CatalogEntry& entry) {
     if (entry.archiveURL.starts_with(kDirectoryBase)) {
         std::string path =
             (fs::path(directory) / entry.archiveURL.substr(kDirectoryBase.size())).string();
@@ -37,8 +37,7 @@ std::optional<std::pair<std::uint64_t, std::string>> measureArchive(
         std::uintmax_t size = fs::file_size(path, code);
         std::optional<std::string> digest = catalog::sha256HexOfFile(path);
         if (code || !digest) {
-            error = "cannot read " + path;
-            return std::nullopt;
+            return Failure{"cannot read " + path};
         }
         return std::make_pair(static_cast<std::uint64_t>(size), *digest);
     }
@@ -57,8 +56,7 @@ std::optional<std::pair<std::uint64_t, std::string>> measureArchive(
         },
         kTransferLimits);
     if (!fetched) {
-        error = fetched.reason();
-        return std::nullopt;
+        return fetched.failure();
     }
     return std::make_pair(size, digest.finishHex());
 }
@@ -80,10 +78,9 @@ const char* verdictName(Verdict verdict) {
 // The checks that run once the catalog's bytes are in hand; each finding goes into report.
 void checkCatalog(const VerifyRequest& request, const std::string& location,
                   const std::string& bytes, VerifyReport& report) {
-    std::string error;
-    std::optional<plist::Value> catalog = catalog::parseCatalog(bytes, error);
+    Result<plist::Value> catalog = catalog::parseCatalog(bytes);
     if (!catalog) {
-        report.problems.push_back("malformed: " + error);
+        report.problems.push_back("malformed: " + catalog.reason());
         return;
     }
     report.keyID = catalog::catalogKeyID(*catalog);
@@ -120,10 +117,10 @@ void checkCatalog(const VerifyRequest& request, const std::string& location,
     }
     bool remote = isURL(request.source);
     std::string base = remote ? request.source : std::string(kDirectoryBase) + kCatalogFileName;
-    std::optional<std::vector<catalog::CatalogEntry>> entries =
-        catalog::readCatalogEntries(*catalog, base, request.assetType, error);
+    Result<std::vector<catalog::CatalogEntry>> entries =
+        catalog::readCatalogEntries(*catalog, base, request.assetType);
     if (!entries) {
-        report.problems.push_back("malformed: " + error);
+        report.problems.push_back("malformed: " + entries.reason());
         return;
     }
     // Devices skip malformed entries; a publisher wants to hear of them.
@@ -145,9 +142,9 @@ void checkCatalog(const VerifyRequest& request, const std::string& location,
         check.size = entry.archiveSize;
         check.sha256 = entry.archiveSHA256;
         check.rolloutPercent = entry.rolloutPercent;
-        auto measured = measureArchive(request.source, entry, error);
+        auto measured = measureArchive(request.source, entry);
         if (!measured) {
-            report.problems.push_back(check.archive + ": " + error);
+            report.problems.push_back(check.archive + ": " + measured.reason());
         } else if (measured->first != entry.archiveSize) {
             report.problems.push_back(check.archive + ": " + std::to_string(measured->first) +
                                       " bytes, listed as " + std::to_string(entry.archiveSize));
