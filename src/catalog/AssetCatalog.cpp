@@ -177,13 +177,12 @@ void Asset::purge(PurgeCompletion completion) {
 
 AssetQuery::AssetQuery(std::string assetType) : assetType_(std::move(assetType)) {}
 
-std::optional<std::vector<std::shared_ptr<Asset>>> AssetQuery::runQuery() const {
-    std::vector<std::shared_ptr<Asset>> assets;
+QueryResult AssetQuery::runQuery() const {
     std::optional<AssetTypeSettings> settings =
         AssetCatalogService::shared().settingsFor(assetType_);
     if (!settings) {
-        lastResult_ = {QueryOutcome::NoCatalogConfigured, "no catalog configured", {}};
-        return assets;
+        return {std::vector<std::shared_ptr<Asset>>(), QueryOutcome::NoCatalogConfigured,
+                "no catalog configured", {}};
     }
     CatalogRefusal refusal;
     std::optional<std::vector<CatalogEntry>> entries =
@@ -192,11 +191,10 @@ std::optional<std::vector<std::shared_ptr<Asset>>> AssetQuery::runQuery() const 
         logCFormat(LogPriority::Warning, "Asset catalog: refusing the catalog %s: %s",
                    settings->catalogURL.c_str(), refusal.what().c_str());
         const bool fetchFailed = refusal.kind() == CatalogRefusalKind::FetchFailed;
-        lastResult_ = {
-            fetchFailed ? QueryOutcome::FetchFailed : QueryOutcome::Refused, refusal.what(), {}};
-        return std::nullopt;
+        return {std::nullopt, fetchFailed ? QueryOutcome::FetchFailed : QueryOutcome::Refused,
+                refusal.what(), {}};
     }
-    lastResult_ = {QueryOutcome::Answered, {}, {}};
+    QueryResult result{std::vector<std::shared_ptr<Asset>>(), QueryOutcome::Answered, {}, {}};
     std::string heldBack;
     std::string serialNumber;
     bool serialNumberRead = false;
@@ -215,17 +213,17 @@ std::optional<std::vector<std::shared_ptr<Asset>>> AssetQuery::runQuery() const 
             if (!takesPartInRollout(serialNumber, versionText, entry.rolloutPercent)) {
                 heldBack += (heldBack.empty() ? "" : ", ") + versionText + " (" +
                             std::to_string(entry.rolloutPercent) + "%)";
-                lastResult_.heldBack.push_back({std::move(entry.attributes), entry.rolloutPercent});
+                result.heldBack.push_back({std::move(entry.attributes), entry.rolloutPercent});
                 continue;
             }
         }
-        assets.push_back(
+        result.assets->push_back(
             std::make_shared<Asset>(std::move(entry), settings->cacheDirectory, settings->limits));
     }
     if (!heldBack.empty()) {
         logCFormat("Asset catalog: this device is outside the rollout of %s", heldBack.c_str());
     }
-    return assets;
+    return result;
 }
 
 void AssetQuery::removeAbandonedDownloads() const {

@@ -92,7 +92,7 @@ class Asset : public std::enable_shared_from_this<Asset> {
     std::optional<bus::ScopedServiceTransaction> unfinished_;
 };
 
-// How the last runQuery() went, for a caller that tells "nothing newer" from "could not ask".
+// How a query went, for a caller that tells "nothing newer" from "could not ask".
 enum class QueryOutcome { NotRun, Answered, NoCatalogConfigured, FetchFailed, Refused };
 
 // An asset the catalog lists that a staged rollout keeps from this device for now.
@@ -102,6 +102,9 @@ struct HeldBackAsset {
 };
 
 struct QueryResult {
+    // The assets in the catalog's order, less those whose staged rollout leaves this device out;
+    // nothing when the catalog could not be fetched or was refused.
+    std::optional<std::vector<std::shared_ptr<Asset>>> assets;
     QueryOutcome outcome = QueryOutcome::NotRun;
     // One line: why the catalog gave no assets (empty when it answered).
     std::string reason;
@@ -118,13 +121,9 @@ class AssetQuery {
     // True: answer from the copy of the last catalog fetched, without asking the server.
     void setQueriesLocalInformationOnly(bool localOnly) { localOnly_ = localOnly; }
 
-    // Runs the query on the calling thread (it blocks while the catalog is fetched). The assets in
-    // the catalog's order, less those whose staged rollout leaves this device out (one log line
-    // for them all), or nothing when the catalog cannot be fetched or is refused (one log line
-    // with the refusal's reason).
-    std::optional<std::vector<std::shared_ptr<Asset>>> runQuery() const;
-    // The outcome of the last runQuery().
-    const QueryResult& lastResult() const { return lastResult_; }
+    // Runs the query on the calling thread (it blocks while the catalog is fetched). Assets the
+    // rollout holds back are logged in one line, a refused catalog in one line with its reason.
+    QueryResult runQuery() const;
 
     // Removes the downloads a process that ended left in this type's cache (see
     // removeAbandonedDownloads); for the launch, before any download can start.
@@ -136,7 +135,6 @@ class AssetQuery {
   private:
     std::string assetType_;
     bool localOnly_ = false;
-    mutable QueryResult lastResult_;
 };
 
 }  // namespace tavrix::catalog

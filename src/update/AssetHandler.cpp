@@ -149,13 +149,14 @@ std::optional<std::vector<AssetHandler::AssetPtr>> AssetHandler::downloadAvailab
     catalog::AssetQuery query(kAssetTypeTavrixBundles);
     query.setQueriesLocalInformationOnly(false);
     logCFormat("Issuing query\n");
-    auto results = query.runQuery();
+    catalog::QueryResult answer = query.runQuery();
     logCFormat("Query returned back with %d items\n",
-               results ? static_cast<int>(results->size()) : 0);
+               answer.assets ? static_cast<int>(answer.assets->size()) : 0);
+    std::optional<std::vector<AssetPtr>> assets = answer.assets;
     if (result != nullptr) {
-        *result = query.lastResult();
+        *result = std::move(answer);
     }
-    return results;
+    return assets;
 }
 
 AssetHandler::AssetPtr AssetHandler::findTheBestAsset(catalog::QueryResult* result) {

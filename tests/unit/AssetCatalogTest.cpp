@@ -182,7 +182,7 @@ class AssetCatalogTest : public testing::Test {
     std::optional<Assets> query(bool localOnly = false) {
         AssetQuery assetQuery(kAssetType);
         assetQuery.setQueriesLocalInformationOnly(localOnly);
-        return assetQuery.runQuery();
+        return assetQuery.runQuery().assets;
     }
 
     // The single asset the catalog answers.
