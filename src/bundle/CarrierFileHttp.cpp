@@ -133,10 +133,11 @@ bool copyDataFromHTTP(const std::string& url, std::optional<plist::Data>* out) {
         return false;
     }
     out->reset();
-    const http::CurlLibrary* libcurl = http::loadCurl();
-    if (libcurl == nullptr) {
+    Result<const http::CurlLibrary*> loaded = http::loadCurl();
+    if (!loaded) {
         return false;
     }
+    const http::CurlLibrary* libcurl = *loaded;
     http::CurlEasy handle(libcurl->easy_init());
     HeaderList headers(libcurl->slist_append(nullptr, "Accept-Encoding: compress, gzip"));
     if (!handle || !headers) {

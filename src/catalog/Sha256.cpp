@@ -27,21 +27,25 @@ struct Crypto {
 };
 
 Crypto load() {
+    Result<std::unique_ptr<SharedLibrary>> library = SharedLibrary::open(kLibraryName);
+    if (!library) {
+        writeSystemLog(LOG_ERR, "SHA-256 digests are unavailable: " + library.reason());
+        return Crypto{};
+    }
     Crypto crypto;
-    std::string error;
-    auto library = SharedLibrary::open(kLibraryName, error);
-    bool bound = library && library->bind(crypto.contextNew, "EVP_MD_CTX_new", error) &&
-                 library->bind(crypto.contextFree, "EVP_MD_CTX_free", error) &&
-                 library->bind(crypto.sha256, "EVP_sha256", error) &&
-                 library->bind(crypto.init, "EVP_DigestInit_ex", error) &&
-                 library->bind(crypto.update, "EVP_DigestUpdate", error) &&
-                 library->bind(crypto.final, "EVP_DigestFinal_ex", error);
-    if (!bound) {
-        writeSystemLog(LOG_ERR, "SHA-256 digests are unavailable: " + error);
+    SharedLibrary& libcrypto = **library;
+    libcrypto.bind(crypto.contextNew, "EVP_MD_CTX_new");
+    libcrypto.bind(crypto.contextFree, "EVP_MD_CTX_free");
+    libcrypto.bind(crypto.sha256, "EVP_sha256");
+    libcrypto.bind(crypto.init, "EVP_DigestInit_ex");
+    libcrypto.bind(crypto.update, "EVP_DigestUpdate");
+    libcrypto.bind(crypto.final, "EVP_DigestFinal_ex");
+    if (Result<> bound = libcrypto.allBound(); !bound) {
+        writeSystemLog(LOG_ERR, "SHA-256 digests are unavailable: " + bound.reason());
         return Crypto{};
     }
     // Kept for the rest of the process: libcrypto cleans up at exit, not at dlclose.
-    crypto.library = std::move(library);
+    crypto.library = std::move(*library);
     return crypto;
 }
 

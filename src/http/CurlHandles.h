@@ -9,16 +9,16 @@
 namespace tavrix::http {
 
 struct CurlEasyCleanup {
-    void operator()(CURL* handle) const { loadCurl()->easy_cleanup(handle); }
+    void operator()(CURL* handle) const { (*loadCurl())->easy_cleanup(handle); }
 };
 struct CurlUrlCleanup {
-    void operator()(CURLU* handle) const { loadCurl()->url_cleanup(handle); }
+    void operator()(CURLU* handle) const { (*loadCurl())->url_cleanup(handle); }
 };
 struct CurlSlistFree {
-    void operator()(curl_slist* list) const { loadCurl()->slist_free_all(list); }
+    void operator()(curl_slist* list) const { (*loadCurl())->slist_free_all(list); }
 };
 struct CurlFree {
-    void operator()(char* text) const { loadCurl()->free(text); }
+    void operator()(char* text) const { (*loadCurl())->free(text); }
 };
 
 using CurlEasy = std::unique_ptr<CURL, CurlEasyCleanup>;

@@ -17,49 +17,57 @@ struct LoadedCurl {
 };
 
 LoadedCurl load() {
+    Result<std::unique_ptr<SharedLibrary>> library = SharedLibrary::open(kLibraryName);
+    if (!library) {
+        return LoadedCurl{nullptr, {}, library.reason()};
+    }
     LoadedCurl loaded;
-    std::string& error = loaded.error;
-    auto library = SharedLibrary::open(kLibraryName, error);
     CurlLibrary& f = loaded.functions;
     decltype(&::curl_global_init) globalInit = nullptr;
-    bool bound = library && library->bind(globalInit, "curl_global_init", error) &&
-                 library->bind(f.easy_init, "curl_easy_init", error) &&
-                 library->bind(f.easy_cleanup, "curl_easy_cleanup", error) &&
-                 library->bind(f.easy_setopt, "curl_easy_setopt", error) &&
-                 library->bind(f.easy_perform, "curl_easy_perform", error) &&
-                 library->bind(f.easy_getinfo, "curl_easy_getinfo", error) &&
-                 library->bind(f.easy_strerror, "curl_easy_strerror", error) &&
-                 library->bind(f.slist_append, "curl_slist_append", error) &&
-                 library->bind(f.slist_free_all, "curl_slist_free_all", error) &&
-                 library->bind(f.url, "curl_url", error) &&
-                 library->bind(f.url_cleanup, "curl_url_cleanup", error) &&
-                 library->bind(f.url_set, "curl_url_set", error) &&
-                 library->bind(f.url_get, "curl_url_get", error) &&
-                 library->bind(f.free, "curl_free", error);
-    if (bound && globalInit(CURL_GLOBAL_DEFAULT) != CURLE_OK) {
-        error = std::string(kLibraryName) + " could not be initialised";
-        bound = false;
+    SharedLibrary& curl = **library;
+    curl.bind(globalInit, "curl_global_init");
+    curl.bind(f.easy_init, "curl_easy_init");
+    curl.bind(f.easy_cleanup, "curl_easy_cleanup");
+    curl.bind(f.easy_setopt, "curl_easy_setopt");
+    curl.bind(f.easy_perform, "curl_easy_perform");
+    curl.bind(f.easy_getinfo, "curl_easy_getinfo");
+    curl.bind(f.easy_strerror, "curl_easy_strerror");
+    curl.bind(f.slist_append, "curl_slist_append");
+    curl.bind(f.slist_free_all, "curl_slist_free_all");
+    curl.bind(f.url, "curl_url");
+    curl.bind(f.url_cleanup, "curl_url_cleanup");
+    curl.bind(f.url_set, "curl_url_set");
+    curl.bind(f.url_get, "curl_url_get");
+    curl.bind(f.free, "curl_free");
+    if (Result<> bound = curl.allBound(); !bound) {
+        return LoadedCurl{nullptr, {}, bound.reason()};
     }
-    if (!bound) {
-        writeSystemLog(LOG_ERR, "HTTP transfers are unavailable: " + error);
-        return LoadedCurl{nullptr, {}, std::move(error)};
+    if (globalInit(CURL_GLOBAL_DEFAULT) != CURLE_OK) {
+        return LoadedCurl{nullptr, {}, std::string(kLibraryName) + " could not be initialised"};
     }
     // Kept for the rest of the process: libcurl's global state is never torn down.
-    loaded.library = std::move(library);
+    loaded.library = std::move(*library);
     return loaded;
+}
+
+const LoadedCurl& loaded() {
+    static const LoadedCurl curl = [] {
+        LoadedCurl made = load();
+        if (!made.library) {
+            writeSystemLog(LOG_ERR, "HTTP transfers are unavailable: " + made.error);
+        }
+        return made;
+    }();
+    return curl;
 }
 
 }  // namespace
 
-const CurlLibrary* loadCurl(std::string* error) {
-    static const LoadedCurl loaded = load();
-    if (!loaded.library) {
-        if (error != nullptr) {
-            *error = "HTTP transfers are unavailable: " + loaded.error;
-        }
-        return nullptr;
+Result<const CurlLibrary*> loadCurl() {
+    if (!loaded().library) {
+        return Failure{"HTTP transfers are unavailable: " + loaded().error};
     }
-    return &loaded.functions;
+    return &loaded().functions;
 }
 
 }  // namespace tavrix::http

@@ -8,6 +8,8 @@
 
 #include <string>
 
+#include "base/Result.h"
+
 namespace tavrix::http {
 
 struct CurlLibrary {
@@ -26,8 +28,8 @@ struct CurlLibrary {
     decltype(&::curl_free) free = nullptr;
 };
 
-// libcurl, loaded and globally initialised on the first call (thread-safe); null when it cannot
-// be, with error saying why. The failure is logged once; each caller fails its own operation.
-const CurlLibrary* loadCurl(std::string* error = nullptr);
+// libcurl, loaded and globally initialised on the first call (thread-safe). A failure is logged
+// once; each caller fails its own operation.
+Result<const CurlLibrary*> loadCurl();
 
 }  // namespace tavrix::http

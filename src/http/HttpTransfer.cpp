@@ -30,11 +30,11 @@ bool isHttpScheme(const char* scheme) {
 
 Result<> transferHttpBody(const std::string& url, const HttpBodyReceiver& receiver,
                           const HttpTransferLimits& limits) {
-    std::string unavailable;
-    const CurlLibrary* libcurl = loadCurl(&unavailable);
-    if (libcurl == nullptr) {
-        return Failure{unavailable};
+    Result<const CurlLibrary*> loaded = loadCurl();
+    if (!loaded) {
+        return loaded.failure();
     }
+    const CurlLibrary* libcurl = *loaded;
     CurlEasy handle(libcurl->easy_init());
     if (!handle) {
         return Failure{"libcurl could not create a transfer"};
@@ -98,10 +98,11 @@ Result<std::string> fetchHttpBody(const std::string& url, std::size_t maxBytes,
 }
 
 std::optional<std::string> resolveHttpURL(const std::string& base, const std::string& reference) {
-    const CurlLibrary* libcurl = loadCurl();
-    if (libcurl == nullptr) {
+    Result<const CurlLibrary*> loaded = loadCurl();
+    if (!loaded) {
         return std::nullopt;
     }
+    const CurlLibrary* libcurl = *loaded;
     CurlUrl handle(libcurl->url());
     if (!handle || libcurl->url_set(handle.get(), CURLUPART_URL, base.c_str(), 0) != CURLUE_OK ||
         libcurl->url_set(handle.get(), CURLUPART_URL, reference.c_str(), 0) != CURLUE_OK) {

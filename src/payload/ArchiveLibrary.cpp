@@ -17,19 +17,20 @@ struct LoadedArchive {
 };
 
 LoadedArchive load() {
-    LoadedArchive loaded;
-    std::string error;
-    auto library = SharedLibrary::open(kLibraryName, error);
-    bool bound = library != nullptr;
-#define TAVRIX_ARCHIVE_BIND(name) \
-    bound = bound && library->bind(loaded.functions.name, #name, error);
-    TAVRIX_ARCHIVE_FUNCTIONS(TAVRIX_ARCHIVE_BIND)
-#undef TAVRIX_ARCHIVE_BIND
-    if (!bound) {
-        writeSystemLog(LOG_ERR, "Archives are unavailable: " + error);
+    Result<std::unique_ptr<SharedLibrary>> library = SharedLibrary::open(kLibraryName);
+    if (!library) {
+        writeSystemLog(LOG_ERR, "Archives are unavailable: " + library.reason());
         return LoadedArchive{};
     }
-    loaded.library = std::move(library);
+    LoadedArchive loaded;
+#define TAVRIX_ARCHIVE_BIND(name) (*library)->bind(loaded.functions.name, #name);
+    TAVRIX_ARCHIVE_FUNCTIONS(TAVRIX_ARCHIVE_BIND)
+#undef TAVRIX_ARCHIVE_BIND
+    if (Result<> bound = (*library)->allBound(); !bound) {
+        writeSystemLog(LOG_ERR, "Archives are unavailable: " + bound.reason());
+        return LoadedArchive{};
+    }
+    loaded.library = std::move(*library);
     return loaded;
 }
 

@@ -2,13 +2,12 @@
 
 namespace tavrix {
 
-std::unique_ptr<SharedLibrary> SharedLibrary::open(const char* name, std::string& error) {
+Result<std::unique_ptr<SharedLibrary>> SharedLibrary::open(const char* name) {
     // RTLD_NOW: a library too old for a symbol fails here, not in the middle of a transfer.
     void* handle = ::dlopen(name, RTLD_NOW | RTLD_LOCAL);
     if (handle == nullptr) {
         const char* why = ::dlerror();
-        error = why != nullptr ? why : std::string(name) + " cannot be loaded";
-        return nullptr;
+        return Failure{why != nullptr ? why : std::string(name) + " cannot be loaded"};
     }
     return std::unique_ptr<SharedLibrary>(new SharedLibrary(name, handle));
 }

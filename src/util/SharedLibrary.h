@@ -7,23 +7,32 @@
 #include <memory>
 #include <string>
 
+#include "base/Result.h"
+
 namespace tavrix {
 
 class SharedLibrary {
   public:
-    // Opens the library by its run-time name ("libcurl.so.4"); on failure error says why.
-    static std::unique_ptr<SharedLibrary> open(const char* name, std::string& error);
+    // Opens the library by its run-time name ("libcurl.so.4").
+    static Result<std::unique_ptr<SharedLibrary>> open(const char* name);
 
-    // Points function at the library's symbol; false with error set when it has none.
+    // Points function at the library's symbol, or leaves it null and remembers the first symbol
+    // that was missing, for allBound().
     template <typename Function>
-    bool bind(Function*& function, const char* symbol, std::string& error) const {
+    void bind(Function*& function, const char* symbol) {
         void* address = ::dlsym(handle_.get(), symbol);
-        if (address == nullptr) {
-            error = name_ + " has no " + symbol;
-            return false;
+        if (address == nullptr && missing_.empty()) {
+            missing_ = symbol;
         }
         function = reinterpret_cast<Function*>(address);
-        return true;
+    }
+
+    // Fails, naming the first missing symbol, unless every bind found its symbol.
+    Result<> allBound() const {
+        if (!missing_.empty()) {
+            return Failure{name_ + " has no " + missing_};
+        }
+        return {};
     }
 
     SharedLibrary(const SharedLibrary&) = delete;
@@ -37,6 +46,7 @@ class SharedLibrary {
 
     std::string name_;
     std::unique_ptr<void, Close> handle_;
+    std::string missing_;
 };
 
 }  // namespace tavrix

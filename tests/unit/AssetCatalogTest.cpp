@@ -786,15 +786,17 @@ TEST(Sha256, MatchesKnownDigestsFedInPieces) {
 
 // A missing optional library fails the operation that needs it with a reason naming it.
 TEST(SharedLibrary, MissingLibraryOrSymbolSaysWhich) {
-    std::string error;
-    EXPECT_EQ(SharedLibrary::open("libtavrix-absent.so.1", error), nullptr);
-    EXPECT_NE(error.find("libtavrix-absent.so.1"), std::string::npos) << error;
+    auto absent = SharedLibrary::open("libtavrix-absent.so.1");
+    ASSERT_FALSE(absent);
+    EXPECT_NE(absent.reason().find("libtavrix-absent.so.1"), std::string::npos) << absent.reason();
 
-    auto library = SharedLibrary::open("libcrypto.so.3", error);
-    ASSERT_NE(library, nullptr) << error;
+    auto library = SharedLibrary::open("libcrypto.so.3");
+    ASSERT_TRUE(library) << library.reason();
     void (*function)() = nullptr;
-    EXPECT_FALSE(library->bind(function, "no_such_function_here", error));
-    EXPECT_EQ(error, "libcrypto.so.3 has no no_such_function_here");
+    (*library)->bind(function, "no_such_function_here");
+    (*library)->bind(function, "EVP_sha256");
+    ASSERT_FALSE((*library)->allBound());
+    EXPECT_EQ((*library)->allBound().reason(), "libcrypto.so.3 has no no_such_function_here");
 }
 
 }  // namespace
