@@ -9,15 +9,14 @@
 namespace tavrix {
 
 Result<> BundleManager::installBehaviorBundleData(const plist::Data& data) {
-    std::string reason;
     logCFormat("Behavior bundle data is received %ld\n", static_cast<long>(data.size()));
     logCFormat("Writing the zipped file into: %s\n", payload::kBundleArchiveTempPath);
     const std::string stagedPath = device::resolvePath(payload::kBundleArchiveTempPath);
     // Only bytes this call wrote are unpacked: a payload that cannot be staged is refused, and
     // the bundle linked now stays.
-    std::optional<payload::StagedPayload> staged = payload::stagePayload(data, stagedPath, &reason);
+    Result<payload::StagedPayload> staged = payload::stagePayload(data, stagedPath);
     if (!staged) {
-        return Failure{reason};
+        return staged.failure();
     }
     // Extracted beside the old bundle, which goes only once the new one is there. A damaged
     // payload still replaces it with whatever was extracted; one stopped at a limit (its size,

@@ -18,7 +18,7 @@ constexpr mode_t kStagedFileMode = 0600;
 // A device root made for tests or the demo may lack /tmp; it gets the usual one.
 constexpr mode_t kTemporaryDirectoryMode = 01777;
 
-std::optional<io::Directory> openStagingDirectory(const std::string& path, std::string* whyNot) {
+Result<io::Directory> openStagingDirectory(const std::string& path) {
     int error = 0;
     auto directory = io::Directory::open(path, io::Directory::LastLink::Follow, &error);
     if (!directory && error == ENOENT && ::mkdir(path.c_str(), kTemporaryDirectoryMode) == 0) {
@@ -26,42 +26,37 @@ std::optional<io::Directory> openStagingDirectory(const std::string& path, std::
         directory = io::Directory::open(path, io::Directory::LastLink::Follow, &error);
     }
     if (!directory) {
-        *whyNot = path + " cannot be opened: " + std::strerror(error);
-        return std::nullopt;
+        return Failure{path + " cannot be opened: " + std::strerror(error)};
     }
     // In a directory where others may rename what the daemon writes, nothing written is safe.
     if (Result<> protectedDirectory = io::checkProtected(directory->status());
         !protectedDirectory) {
-        *whyNot = path + " is unsafe: " + protectedDirectory.reason();
-        return std::nullopt;
+        return Failure{path + " is unsafe: " + protectedDirectory.reason()};
     }
-    return directory;
+    return std::move(*directory);
 }
 
-std::optional<StagedPayload> stageIn(io::Directory directory, const std::string& name,
-                                     const plist::Data& data, std::string* whyNot) {
+Result<StagedPayload> stageIn(io::Directory directory, const std::string& name,
+                              const plist::Data& data) {
     if (auto existing = directory.entryStatus(name)) {
         if (existing->st_uid != ::geteuid()) {
-            *whyNot = "a file of user " + std::to_string(existing->st_uid) + " is in the way";
-            return std::nullopt;
+            return Failure{"a file of user " + std::to_string(existing->st_uid) + " is in the way"};
         }
         if (int error = directory.removeEntry(name); error != 0 && error != ENOENT) {
-            *whyNot = std::string("the previous one cannot be removed: ") + std::strerror(error);
-            return std::nullopt;
+            return Failure{std::string("the previous one cannot be removed: ") +
+                           std::strerror(error)};
         }
     }
     const std::string_view bytes(reinterpret_cast<const char*>(data.data()), data.size());
     if (int error = directory.writeFile(name, kStagedFileMode, /*replace=*/false, bytes);
         error != 0) {
-        *whyNot = error == EEXIST ? std::string("something else appeared there")
-                                  : std::string(std::strerror(error));
-        return std::nullopt;
+        return Failure{error == EEXIST ? std::string("something else appeared there")
+                                       : std::string(std::strerror(error))};
     }
     int error = 0;
     io::UniqueFd file = directory.openOwnFile(name, &error);
     if (!file) {
-        *whyNot = std::string("it cannot be opened again: ") + std::strerror(error);
-        return std::nullopt;
+        return Failure{std::string("it cannot be opened again: ") + std::strerror(error)};
     }
     return StagedPayload(std::move(directory), name, std::move(file));
 }
@@ -88,19 +83,17 @@ StagedPayload::~StagedPayload() {
     }
 }
 
-std::optional<StagedPayload> stagePayload(const plist::Data& data, const std::string& path,
-                                          std::string* whyNot) {
-    std::string reason;
-    if (auto directory = openStagingDirectory(io::parentDirectory(path), &reason)) {
-        if (auto staged =
-                stageIn(std::move(*directory), io::lastPathComponent(path), data, &reason)) {
-            logCFormat("Successfully wrote the KW Data to file: %s\n", path.c_str());
-            return staged;
-        }
+Result<StagedPayload> stagePayload(const plist::Data& data, const std::string& path) {
+    Result<io::Directory> directory = openStagingDirectory(io::parentDirectory(path));
+    Result<StagedPayload> staged =
+        directory ? stageIn(std::move(*directory), io::lastPathComponent(path), data)
+                  : Result<StagedPayload>(directory.failure());
+    if (staged) {
+        logCFormat("Successfully wrote the KW Data to file: %s\n", path.c_str());
+        return staged;
     }
     logCFormat(LogPriority::Warning, "Failed to write the zipped file: %s\n", path.c_str());
-    *whyNot = "the payload could not be staged at " + path + ": " + reason;
-    return std::nullopt;
+    return Failure{"the payload could not be staged at " + path + ": " + staged.reason()};
 }
 
 }  // namespace payload

@@ -6,6 +6,7 @@
 #include <optional>
 #include <string>
 
+#include "base/Result.h"
 #include "io/Directory.h"
 #include "io/UniqueFd.h"
 #include "plist/Value.h"
@@ -39,10 +40,8 @@ class StagedPayload {
 
 // Writes the bytes to path (whose directory others may write in, like /tmp) whole, as a file
 // created where nothing is: what is at path already is removed first only when it is this
-// process's own, and anything else there refuses the payload. Logs the outcome. Nothing, with the
-// reason in whyNot, when the payload could not be staged.
-std::optional<StagedPayload> stagePayload(const plist::Data& data, const std::string& path,
-                                          std::string* whyNot);
+// process's own, and anything else there refuses the payload. Logs the outcome.
+Result<StagedPayload> stagePayload(const plist::Data& data, const std::string& path);
 
 // How entry paths are trusted. A client's own bundle payload is written where its entries point;
 // archives from the network hold only what stays inside the destination.

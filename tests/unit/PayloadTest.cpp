@@ -294,10 +294,9 @@ TEST(StagePayload, WritesItsOwnFileAndRefusesAnUnsafeDirectory) {
     TempDir dir;
     const std::string path = dir / "staged.tgz";
     writeText(path, "older and longer content");
-    std::string whyNot;
     {
-        auto staged = stagePayload(plist::Data{'n', 'e', 'w'}, path, &whyNot);
-        ASSERT_TRUE(staged) << whyNot;
+        auto staged = stagePayload(plist::Data{'n', 'e', 'w'}, path);
+        ASSERT_TRUE(staged) << staged.reason();
         EXPECT_EQ(snapshotTree(dir.path()), (Tree{{"staged.tgz", "new"}}));
         char bytes[8] = {};
         EXPECT_EQ(::read(staged->fd(), bytes, sizeof bytes), 3);
@@ -305,8 +304,10 @@ TEST(StagePayload, WritesItsOwnFileAndRefusesAnUnsafeDirectory) {
     EXPECT_TRUE(fs::is_empty(dir.path()));
 
     fs::permissions(dir.path(), fs::perms::all);
-    EXPECT_FALSE(stagePayload(plist::Data{'x'}, path, &whyNot));
-    EXPECT_THAT(whyNot, ::testing::HasSubstr("others may write in it and it is not sticky"));
+    auto refused = stagePayload(plist::Data{'x'}, path);
+    ASSERT_FALSE(refused);
+    EXPECT_THAT(refused.reason(),
+                ::testing::HasSubstr("others may write in it and it is not sticky"));
     EXPECT_FALSE(fs::exists(path));
 }
 
