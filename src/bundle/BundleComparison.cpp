@@ -6,6 +6,7 @@
 #include "bundle/BundleLinks.h"
 #include "bundle/BundleManager.h"
 #include "bundle/VersionCompare.h"
+#include "io/Paths.h"
 #include "util/FileSystemHelper.h"
 #include "util/Log.h"
 
@@ -168,7 +169,7 @@ bool bundleLinksExist(const CarrierBundle& bundle) {
                    fileSystem.fileExists(bundle.bundlePath) &&
                    fileSystem.fileExists(bundle.bundleRealPath);
     bool match = readLinkTarget(bundle.bundleLinkPath) == bundle.bundlePath &&
-                 realPathOf(bundle.bundlePath) == bundle.bundleRealPath;
+                 io::realPathOf(bundle.bundlePath) == bundle.bundleRealPath;
     bool preferencesPresent = fileSystem.fileExists(bundle.preferencesLinkPath) &&
                               fileSystem.fileExists(readLinkTarget(bundle.preferencesLinkPath));
     logCFormat(

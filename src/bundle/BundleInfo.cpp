@@ -8,6 +8,7 @@
 #include <memory>
 #include <mutex>
 
+#include "io/Paths.h"
 #include "plist/CachedPropertyListFile.h"
 #include "util/PropertyListFile.h"
 
@@ -57,8 +58,7 @@ std::optional<plist::Value> BundleDirectory::copyInfoValue(std::string_view key,
 }
 
 std::optional<BundleDirectory> createBundleAtPath(const std::string& path) {
-    struct stat info {};
-    if (path.empty() || ::stat(path.c_str(), &info) != 0 || !S_ISDIR(info.st_mode)) {
+    if (io::kindOfPath(path) != io::PathKind::Directory) {
         return std::nullopt;
     }
     return BundleDirectory(path);

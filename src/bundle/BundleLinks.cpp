@@ -21,10 +21,6 @@ namespace {
 
 constexpr std::size_t kPathBufferSize = 1024;
 
-struct FreeDeleter {
-    void operator()(char* pointer) const { std::free(pointer); }
-};
-
 // Copies path into buffer, cut at kPathBufferSize - 1 bytes, for the POSIX calls that may write
 // into their argument.
 void copyCut(const std::string& path, char (&buffer)[kPathBufferSize]) {
@@ -114,19 +110,19 @@ bool isDaemonLink(const std::string& linkPath) {
 }
 
 bool linksDisagree(const CarrierBundle& linked, const std::string& overlayDirectory) {
-    struct stat info {};
-    const std::string bundle = realPathOf(linked.bundleLinkPath);
-    if (bundle.empty() || ::stat(bundle.c_str(), &info) != 0 || !S_ISDIR(info.st_mode)) {
+    const std::string bundle = io::realPathOf(linked.bundleLinkPath);
+    if (io::kindOfPath(bundle) != io::PathKind::Directory) {
         return false;
     }
-    const std::string carrierFile = realPathOf(linked.preferencesLinkPath);
-    if (carrierFile.empty() || ::stat(carrierFile.c_str(), &info) != 0 || !S_ISREG(info.st_mode)) {
+    const std::string carrierFile = io::realPathOf(linked.preferencesLinkPath);
+    if (io::kindOfPath(carrierFile) != io::PathKind::RegularFile) {
         return false;
     }
     auto inside = [&carrierFile](const std::string& directory) {
         return !directory.empty() && carrierFile.starts_with(directory + "/");
     };
-    return !inside(bundle) && (overlayDirectory.empty() || !inside(realPathOf(overlayDirectory)));
+    return !inside(bundle) &&
+           (overlayDirectory.empty() || !inside(io::realPathOf(overlayDirectory)));
 }
 
 std::string baseNameOfPath(const std::string& path) {
@@ -139,12 +135,6 @@ std::string dirNameOfPath(const std::string& path) {
     char buffer[kPathBufferSize];
     copyCut(path, buffer);
     return dirname(buffer);
-}
-
-std::string realPathOf(const std::string& path) {
-    // Allocated by realpath itself: a fixed buffer smaller than PATH_MAX is not safe here.
-    std::unique_ptr<char, FreeDeleter> resolved(::realpath(path.c_str(), nullptr));
-    return resolved ? std::string(resolved.get()) : std::string();
 }
 
 std::string readLinkTarget(const std::string& path) {

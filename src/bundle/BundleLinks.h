@@ -29,8 +29,6 @@ bool isDaemonLink(const std::string& linkPath);
 // POSIX basename / dirname of the path (cut at 1023 bytes); "." for an empty path.
 std::string baseNameOfPath(const std::string& path);
 std::string dirNameOfPath(const std::string& path);
-// The resolved real path, or empty when it cannot be resolved.
-std::string realPathOf(const std::string& path);
 // A symbolic link's text (at most 1023 bytes), or empty when path is no readable link.
 std::string readLinkTarget(const std::string& path);
 

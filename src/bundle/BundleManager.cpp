@@ -18,6 +18,7 @@
 #include "device/HomeDirectories.h"
 #include "device/MobileUser.h"
 #include "device/PreferencesStore.h"
+#include "io/Paths.h"
 #include "util/Log.h"
 #include "util/SharedInstance.h"
 #include "util/SystemLog.h"
@@ -43,9 +44,7 @@ std::string homeLinkPath(const char* home, const char* format) {
 }
 
 bool hasBaseCarrierFile(const std::string& bundle) {
-    struct stat info {};
-    return ::stat((bundle + "/" + kBaseCarrierFileName).c_str(), &info) == 0 &&
-           S_ISREG(info.st_mode);
+    return io::kindOfPath(bundle + "/" + kBaseCarrierFileName) == io::PathKind::RegularFile;
 }
 
 // The path a chosen bundle location converts to; nothing when it does not fit a path buffer.

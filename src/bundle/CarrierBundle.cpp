@@ -2,6 +2,7 @@
 
 #include "bundle/BundleInfo.h"
 #include "bundle/BundleLinks.h"
+#include "io/Paths.h"
 #include "util/Log.h"
 
 namespace tavrix {
@@ -16,7 +17,7 @@ void CarrierBundle::resetWithPath(const std::string& path) {
     std::string kept = path;
     reset();
     bundlePath = std::move(kept);
-    bundleRealPath = realPathOf(bundlePath);
+    bundleRealPath = io::realPathOf(bundlePath);
     bundleVersion = bundleInfoValueText(copyBundleVersionAtPath(bundlePath));
 }
 
@@ -25,7 +26,7 @@ void CarrierBundle::initFromLinks(const std::string& bundleLink,
     bundleLinkPath = bundleLink;
     // The link's own text, so that a later comparison sees exactly what was linked.
     bundlePath = readLinkTarget(bundleLink);
-    bundleRealPath = realPathOf(bundleLink);
+    bundleRealPath = io::realPathOf(bundleLink);
     bundleVersion = bundleInfoValueText(copyBundleVersionAtPath(bundlePath));
     preferencesLinkPath = preferencesLink;
 }

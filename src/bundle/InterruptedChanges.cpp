@@ -40,7 +40,7 @@ void removeOwnLeftovers(const std::optional<io::Directory>& directory,
     }
     for (const std::string& name : names) {
         auto entry = directory->entryStatus(name);
-        const bool leftover = name == staged ? entry && entry->st_uid == ::geteuid()
+        const bool leftover = name == staged ? entry && io::isOwnUser(entry->st_uid)
                                              : io::isAbandonedTemporary(*directory, name);
         if (leftover && directory->removeEntry(name) == 0) {
             logCFormat("Removed %s, left by an interrupted change\n",

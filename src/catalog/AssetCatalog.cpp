@@ -10,6 +10,7 @@
 #include "catalog/CatalogLoader.h"
 #include "catalog/CatalogRollout.h"
 #include "device/DeviceInfoService.h"
+#include "io/Paths.h"
 #include "util/FileSystemUtilities.h"
 #include "util/Log.h"
 
@@ -143,8 +144,7 @@ std::optional<std::string> Asset::localURL() const {
         }
         directory = downloaded_.back();
     }
-    struct stat info {};
-    if (::stat(directory.c_str(), &info) != 0 || !S_ISDIR(info.st_mode)) {
+    if (io::kindOfPath(directory) != io::PathKind::Directory) {
         return std::nullopt;
     }
     return directory;
@@ -181,8 +181,10 @@ QueryResult AssetQuery::runQuery() const {
     std::optional<AssetTypeSettings> settings =
         AssetCatalogService::shared().settingsFor(assetType_);
     if (!settings) {
-        return {std::vector<std::shared_ptr<Asset>>(), QueryOutcome::NoCatalogConfigured,
-                "no catalog configured", {}};
+        return {std::vector<std::shared_ptr<Asset>>(),
+                QueryOutcome::NoCatalogConfigured,
+                "no catalog configured",
+                {}};
     }
     CatalogRefusal refusal;
     std::optional<std::vector<CatalogEntry>> entries =
@@ -191,8 +193,10 @@ QueryResult AssetQuery::runQuery() const {
         logCFormat(LogPriority::Warning, "Asset catalog: refusing the catalog %s: %s",
                    settings->catalogURL.c_str(), refusal.what().c_str());
         const bool fetchFailed = refusal.kind() == CatalogRefusalKind::FetchFailed;
-        return {std::nullopt, fetchFailed ? QueryOutcome::FetchFailed : QueryOutcome::Refused,
-                refusal.what(), {}};
+        return {std::nullopt,
+                fetchFailed ? QueryOutcome::FetchFailed : QueryOutcome::Refused,
+                refusal.what(),
+                {}};
     }
     QueryResult result{std::vector<std::shared_ptr<Asset>>(), QueryOutcome::Answered, {}, {}};
     std::string heldBack;

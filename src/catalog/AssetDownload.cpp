@@ -1,15 +1,12 @@
 #include "catalog/AssetDownload.h"
 
 #include <fcntl.h>
-#include <sys/random.h>
 #include <unistd.h>
 
 #include <algorithm>
-#include <atomic>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
-#include <ctime>
 #include <vector>
 
 #include "catalog/AssetCatalog.h"
@@ -19,6 +16,7 @@
 #include "io/Directory.h"
 #include "io/FileIO.h"
 #include "io/Paths.h"
+#include "io/Random.h"
 #include "io/UniqueFd.h"
 #include "payload/PayloadUnpack.h"
 #include "util/FileSystemUtilities.h"
@@ -107,20 +105,6 @@ Result<> downloadArchive(const CatalogEntry& entry, int fd, const AssetLimits& l
     return {};
 }
 
-// 64 random bits as hex; should the kernel give none, the process and a count still keep this
-// process's downloads apart from each other and from those of an earlier run.
-std::string uniqueSuffix() {
-    std::uint64_t bits = 0;
-    if (::getrandom(&bits, sizeof bits, 0) != static_cast<ssize_t>(sizeof bits)) {
-        static std::atomic<std::uint64_t> counter{0};
-        bits = (static_cast<std::uint64_t>(::getpid()) << 32) ^ ++counter ^
-               static_cast<std::uint64_t>(::time(nullptr));
-    }
-    char text[17];
-    std::snprintf(text, sizeof text, "%016llx", static_cast<unsigned long long>(bits));
-    return text;
-}
-
 payload::ExtractionLimits extractionLimits(const AssetLimits& limits) {
     return {limits.maxExpandedBytes, limits.maxArchiveEntries, limits.freeSpaceReserveBytes, true};
 }
@@ -159,7 +143,7 @@ void removeAbandonedDownloads(const std::string& typeCacheDirectory, bool comple
 
 AssetCacheLocation AssetCacheLocation::forDownload(const std::string& typeCacheDirectory,
                                                    const CatalogEntry& entry) {
-    std::string name = entry.archiveSHA256 + "-" + uniqueSuffix();
+    std::string name = entry.archiveSHA256 + "-" + io::uniqueHexSuffix();
     std::string base = typeCacheDirectory + "/";
     return {base + name, base + "." + name + kStagedArchiveSuffix,
             base + "." + name + kStagedExtractionSuffix};
@@ -175,8 +159,8 @@ Result<> downloadAndInstallAsset(const CatalogEntry& entry, const AssetCacheLoca
     removeAbandonedDownloads(cacheDirectory, /*completedToo=*/false);
     StagedPath archive(location.archiveFile);
     {
-        io::UniqueFd fd(::open(archive.path().c_str(),
-                               O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, 0600));
+        io::UniqueFd fd =
+            io::openFile(archive.path(), O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW, 0600);
         if (!fd) {
             return errnoFailure("create", archive.path(), errno);
         }

@@ -106,7 +106,7 @@ std::string Sha256Digest::finishHex() {
 }
 
 std::optional<std::string> sha256HexOfFile(const std::string& path) {
-    io::UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    io::UniqueFd fd = io::openFile(path, O_RDONLY);
     if (!fd) {
         return std::nullopt;
     }

@@ -4,7 +4,6 @@
 #include <fcntl.h>
 #include <stdio.h>
 #include <sys/file.h>
-#include <sys/random.h>
 #include <time.h>
 #include <unistd.h>
 
@@ -14,6 +13,7 @@
 
 #include "io/FileIO.h"
 #include "io/Paths.h"
+#include "io/Random.h"
 
 namespace tavrix::io {
 namespace {
@@ -29,15 +29,7 @@ std::string temporaryName() {
     static constexpr char kAlphabet[] =
         "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789";
     unsigned char random[12] = {};
-    std::size_t filled = 0;
-    while (filled < sizeof random) {
-        ssize_t got = ::getrandom(random + filled, sizeof random - filled, 0);
-        if (got > 0) {
-            filled += static_cast<std::size_t>(got);
-        } else if (errno != EINTR) {
-            break;
-        }
-    }
+    fillRandom(random, sizeof random);
     std::string name = kAtomicWritePrefix;
     for (unsigned char byte : random) {
         name += kAlphabet[byte % (sizeof kAlphabet - 1)];
@@ -90,7 +82,11 @@ bool isValidName(std::string_view name) {
 }  // namespace
 
 bool isTrustedOwner(uid_t owner) {
-    return owner == 0 || owner == ::geteuid();
+    return owner == 0 || isOwnUser(owner);
+}
+
+bool isOwnUser(uid_t owner) {
+    return owner == ::geteuid();
 }
 
 Result<> checkProtected(const struct stat& directory) {

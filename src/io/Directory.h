@@ -21,6 +21,8 @@ inline constexpr const char* kAtomicWritePrefix = ".tavrix-write-";
 
 // Root and the process's own user: the only owners whose files and directories are trusted.
 bool isTrustedOwner(uid_t owner);
+// Whether owner is the user this process runs as.
+bool isOwnUser(uid_t owner);
 
 // Fails, saying why, unless a directory is a place for the daemon's own files: owned by a
 // trusted user, and writable by others only with the sticky bit, so that nobody else can rename,

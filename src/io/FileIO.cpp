@@ -1,5 +1,6 @@
 #include "io/FileIO.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -84,6 +85,14 @@ int readAll(int fd, std::string& bytes, std::size_t limit) {
     }
     bytes.resize(filled);
     return 0;
+}
+
+UniqueFd openFile(const std::string& path, int flags, mode_t mode) {
+    int fd = -1;
+    do {
+        fd = ::open(path.c_str(), flags | O_CLOEXEC, mode);
+    } while (fd < 0 && errno == EINTR);
+    return UniqueFd(fd);
 }
 
 }  // namespace tavrix::io

@@ -7,7 +7,13 @@
 #include <string>
 #include <string_view>
 
+#include "io/UniqueFd.h"
+
 namespace tavrix::io {
+
+// Opens path with flags (O_CLOEXEC added) and, when it creates the file, mode. Empty with errno
+// set when it cannot.
+UniqueFd openFile(const std::string& path, int flags, mode_t mode = 0);
 
 // Writes all of bytes. 0, or the errno of the write that failed (EIO for one that wrote nothing).
 int writeAll(int fd, std::string_view bytes);

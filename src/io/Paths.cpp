@@ -1,8 +1,11 @@
 #include "io/Paths.h"
 
 #include <limits.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
+#include <cstdlib>
+#include <memory>
 #include <vector>
 
 namespace tavrix::io {
@@ -47,6 +50,25 @@ std::optional<std::string> readLinkTarget(const std::string& path) {
         }
         buffer.resize(buffer.size() * 2);
     }
+}
+
+PathKind kindOfPath(const std::string& path) {
+    struct stat status {};
+    if (path.empty() || ::stat(path.c_str(), &status) != 0) {
+        return PathKind::Missing;
+    }
+    return S_ISDIR(status.st_mode)   ? PathKind::Directory
+           : S_ISREG(status.st_mode) ? PathKind::RegularFile
+                                     : PathKind::Other;
+}
+
+std::string realPathOf(const std::string& path) {
+    struct FreeDeleter {
+        void operator()(char* text) const { std::free(text); }
+    };
+    // Allocated by realpath itself: a fixed buffer smaller than PATH_MAX is not safe here.
+    std::unique_ptr<char, FreeDeleter> resolved(::realpath(path.c_str(), nullptr));
+    return resolved ? std::string(resolved.get()) : std::string();
 }
 
 }  // namespace tavrix::io

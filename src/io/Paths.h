@@ -18,4 +18,11 @@ std::string lastPathComponent(std::string_view path);
 // The target of the symbolic link at path, however long, or nothing with errno set.
 std::optional<std::string> readLinkTarget(const std::string& path);
 
+// What is at path, symbolic links followed.
+enum class PathKind { Missing, Directory, RegularFile, Other };
+PathKind kindOfPath(const std::string& path);
+
+// path with every link, "." and ".." resolved, however long; empty when it does not resolve.
+std::string realPathOf(const std::string& path);
+
 }  // namespace tavrix::io
