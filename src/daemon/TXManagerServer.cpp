@@ -201,7 +201,7 @@ int TXManagerServer::_onLockRetry(sd_event_source* source, uint64_t, void* userd
 }
 
 int TXManagerServer::deferUntilLocked(sd_bus_message* message, sd_bus_message_handler_t handler,
-                                      void (*refuse)(sd_bus_message*)) {
+                                      int (*refuse)(sd_bus_message*)) {
     if (_finishing) {
         refuse(message);
         return 1;

@@ -95,7 +95,7 @@ class TXManagerServer : private bus::ServiceListener::Delegate {
     // it again; answers it with refuse (its "no" reply) when the lock has not come within
     // kLockPatience or the daemon leaves first. Returns what a method handler returns.
     int deferUntilLocked(sd_bus_message* message, sd_bus_message_handler_t handler,
-                         void (*refuse)(sd_bus_message*));
+                         int (*refuse)(sd_bus_message*));
 
   private:
     TXManagerServer();
@@ -137,7 +137,7 @@ class TXManagerServer : private bus::ServiceListener::Delegate {
     struct DeferredCall {
         bus::BusMessagePtr message;
         sd_bus_message_handler_t handler;
-        void (*refuse)(sd_bus_message*);
+        int (*refuse)(sd_bus_message*);
         std::chrono::steady_clock::time_point since;
     };
     std::vector<DeferredCall> _deferredCalls;

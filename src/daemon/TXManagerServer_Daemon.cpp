@@ -1,8 +1,8 @@
-// The service interface on the bus: each handler reads its arguments, makes the sender the current
-// connection (accepting it on its first call), calls the server's operation and replies. Calls
-// with a wrong signature never get here: sd-bus answers them with InvalidArgs. Nothing thrown
-// below a handler goes further: it is logged and the call gets the normal "no" answer (NO or no
-// value), and the daemon goes on serving.
+// The service interface on the bus: each handler reads its arguments and checks them, makes the
+// sender the current connection (accepting it on its first call), calls the server's operation
+// and replies. Calls with a wrong signature never get here: sd-bus answers them with InvalidArgs.
+// One wrapper, handled<>, stands around every handler: whatever is thrown below it is logged and
+// the call gets its "no" answer (NO, no value, or an error), and the daemon goes on serving.
 #include <systemd/sd-bus.h>
 
 #include <cerrno>
@@ -62,26 +62,40 @@ int replyBoolean(sd_bus_message* message, bool answer) {
     return sd_bus_reply_method_return(message, "b", answer ? 1 : 0);
 }
 
-// Runs one operation for the call; if it throws, the answer is the fallback, its "no" value.
-template <typename Answer, typename Operation>
-Answer answerOf(const char* request, TXManagerServer& server, sd_bus_message* message,
-                const Answer& fallback, Operation&& operation) {
-    Answer answer = fallback;
-    const bool completed = containExceptions(request, [&] {
-        MessageScope scope(server, message);
-        operation(answer);
-    });
-    return completed ? answer : fallback;
+// The "no" answer of each kind of call, for a call that failed or waited too long.
+int refuseBoolean(sd_bus_message* message) {
+    return replyBoolean(message, false);
+}
+int refuseBundleFD(sd_bus_message* message) {
+    return sd_bus_reply_method_return(message, "bbs", 0, 0, "the request failed");
+}
+int refuseValue(sd_bus_message* message);
+int refuseStatus(sd_bus_message* message) {
+    return sd_bus_reply_method_errorf(message, SD_BUS_ERROR_FAILED, "The status could not be read");
 }
 
-void refuseBoolean(sd_bus_message* message) {
-    replyBoolean(message, false);
+// The one wrapper around every handler: an exception must not unwind through sd-bus. One thrown
+// while the call was handled is logged with the method's name, the call gets its "no" answer,
+// and the status properties are looked at again, as the call may have changed what they show.
+template <int (*Handler)(sd_bus_message*, void*, sd_bus_error*), int (*Refuse)(sd_bus_message*)>
+int handled(sd_bus_message* message, void* userdata, sd_bus_error* error) noexcept {
+    int result = 0;
+    const char* method = sd_bus_message_get_member(message);
+    if (!containExceptions(method != nullptr ? method : "A call",
+                           [&] { result = Handler(message, userdata, error); })) {
+        containExceptions("A refusal", [&] {
+            StatusPublisher::shared().markStale();
+            result = Refuse(message);
+        });
+    }
+    return result;
 }
 
 int handleSetTavrixID(sd_bus_message* message, void* userdata, sd_bus_error* error) {
     auto& server = *static_cast<TXManagerServer*>(userdata);
     if (!server.holdsInstanceLock()) {
-        return server.deferUntilLocked(message, handleSetTavrixID, refuseBoolean);
+        return server.deferUntilLocked(message, handled<handleSetTavrixID, refuseBoolean>,
+                                       refuseBoolean);
     }
     const char* tavrixID = nullptr;
     std::optional<std::vector<std::uint8_t>> bundle;
@@ -92,9 +106,11 @@ int handleSetTavrixID(sd_bus_message* message, void* userdata, sd_bus_error* err
         return sd_bus_error_set(error, SD_BUS_ERROR_INVALID_ARGS,
                                 "The bundle must be an array of at most one byte array");
     }
-    bool answer = answerOf("Set Tavrix ID", server, message, false, [&](bool& result) {
-        server.setTavrixID(tavrixID, bundle, [&](bool accepted) { result = accepted; });
-    });
+    bool answer = false;
+    {
+        MessageScope scope(server, message);
+        server.setTavrixID(tavrixID, bundle, [&](bool accepted) { answer = accepted; });
+    }
     StatusPublisher::shared().markStale();
     return replyBoolean(message, answer);
 }
@@ -116,29 +132,30 @@ int handleSetTavrixIDWithBundleFD(sd_bus_message* message, void* userdata, sd_bu
         return sd_bus_error_setf(error, SD_BUS_ERROR_INVALID_ARGS, "Bundle refused: %s",
                                  whyNot.c_str());
     }
-    struct Answer {
-        bool accepted = false;
-        PayloadOutcome payload{false, "the request failed"};
-    };
-    Answer answer = answerOf("Set Tavrix ID", server, message, Answer(), [&](Answer& result) {
+    bool accepted = false;
+    PayloadOutcome payload{false, "the request failed"};
+    {
+        MessageScope scope(server, message);
         server.setTavrixIDWithBundle(tavrixID, bundle,
-                                     [&](bool accepted, const PayloadOutcome& payload) {
-                                         result = {accepted, payload};
+                                     [&](bool wasAccepted, const PayloadOutcome& outcome) {
+                                         accepted = wasAccepted;
+                                         payload = outcome;
                                      });
-    });
+    }
     StatusPublisher::shared().markStale();
     // An archive's error may quote a member's name, which may be any bytes.
-    const char* reason =
-        isValidUtf8(answer.payload.reason) ? answer.payload.reason.c_str() : "(not UTF-8)";
-    return sd_bus_reply_method_return(message, "bbs", answer.accepted ? 1 : 0,
-                                      answer.payload.extracted ? 1 : 0, reason);
+    const char* reason = isValidUtf8(payload.reason) ? payload.reason.c_str() : "(not UTF-8)";
+    return sd_bus_reply_method_return(message, "bbs", accepted ? 1 : 0, payload.extracted ? 1 : 0,
+                                      reason);
 }
 
 int handleIsTavrixBundleSupported(sd_bus_message* message, void* userdata, sd_bus_error*) {
     auto& server = *static_cast<TXManagerServer*>(userdata);
-    bool answer = answerOf("Is Tavrix Bundle Supported", server, message, false, [&](bool& result) {
-        server.isTavrixBundleSupported([&](bool supported) { result = supported; });
-    });
+    bool answer = false;
+    {
+        MessageScope scope(server, message);
+        server.isTavrixBundleSupported([&](bool supported) { answer = supported; });
+    }
     return replyBoolean(message, answer);
 }
 
@@ -158,25 +175,19 @@ int handleCopyTavrixValue(sd_bus_message* message, void* userdata, sd_bus_error*
     if (r < 0) {
         return invalidArgument(error, r, "key");
     }
-    bus::BusMessagePtr replyMessage;
-    containExceptions("Copy Tavrix Value", [&] {
-        auto answer = answerOf(
-            "Copy Tavrix Value", server, message, std::optional<plist::Value>(),
-            [&](std::optional<plist::Value>& result) {
-                server.copyTavrixValue(
-                    key, [&](std::optional<plist::Value> value) { result = std::move(value); });
-            });
-        replyMessage = valueReply(message, answer);
-        if (!replyMessage && answer) {
-            // A setting the bus cannot carry (too deep, or text that is not UTF-8) is answered as
-            // no value: every well-formed call gets a normal reply.
-            logCFormat(LogPriority::Warning,
-                       "The value for key %s cannot be sent over the bus; answering no value\n",
-                       key);
-        }
-    });
-    if (!replyMessage) {
-        replyMessage = valueReply(message, std::nullopt);
+    std::optional<plist::Value> answer;
+    {
+        MessageScope scope(server, message);
+        server.copyTavrixValue(
+            key, [&](std::optional<plist::Value> value) { answer = std::move(value); });
+    }
+    bus::BusMessagePtr replyMessage = valueReply(message, answer);
+    if (!replyMessage && answer) {
+        // A setting the bus cannot carry (too deep, or text that is not UTF-8) is answered as no
+        // value: every well-formed call gets a normal reply.
+        logCFormat(LogPriority::Warning,
+                   "The value for key %s cannot be sent over the bus; answering no value\n", key);
+        return refuseValue(message);
     }
     if (!replyMessage) {
         return -ENOMEM;
@@ -184,15 +195,22 @@ int handleCopyTavrixValue(sd_bus_message* message, void* userdata, sd_bus_error*
     return sd_bus_send(nullptr, replyMessage.get(), nullptr);
 }
 
+int refuseValue(sd_bus_message* message) {
+    bus::BusMessagePtr replyMessage = valueReply(message, std::nullopt);
+    return replyMessage ? sd_bus_send(nullptr, replyMessage.get(), nullptr) : -ENOMEM;
+}
+
 int handleCheckForTavrixBundleUpdate(sd_bus_message* message, void* userdata, sd_bus_error*) {
     auto& server = *static_cast<TXManagerServer*>(userdata);
     if (!server.holdsInstanceLock()) {
-        return server.deferUntilLocked(message, handleCheckForTavrixBundleUpdate, refuseBoolean);
+        return server.deferUntilLocked(
+            message, handled<handleCheckForTavrixBundleUpdate, refuseBoolean>, refuseBoolean);
     }
-    bool answer =
-        answerOf("Check For Tavrix Bundle Update", server, message, false, [&](bool& result) {
-            server.checkForTavrixBundleUpdate([&](bool started) { result = started; });
-        });
+    bool answer = false;
+    {
+        MessageScope scope(server, message);
+        server.checkForTavrixBundleUpdate([&](bool started) { answer = started; });
+    }
     StatusPublisher::shared().markStale();
     return replyBoolean(message, answer);
 }
@@ -204,21 +222,23 @@ int handleSetClientType(sd_bus_message* message, void* userdata, sd_bus_error* e
     if (r < 0) {
         return invalidArgument(error, r, "client type");
     }
-    bool answer = answerOf("Set Client Type", server, message, false, [&](bool& result) {
-        server.setClientType(type, [&](bool known) { result = known; });
-    });
+    bool answer = false;
+    {
+        MessageScope scope(server, message);
+        server.setClientType(type, [&](bool known) { answer = known; });
+    }
     return replyBoolean(message, answer);
 }
 
 int handleGetStatus(sd_bus_message* message, void* userdata, sd_bus_error* error) {
     auto& server = *static_cast<TXManagerServer*>(userdata);
     std::optional<plist::Dictionary> status;
-    containExceptions("Get Status", [&] {
+    {
         MessageScope scope(server, message);
         server.getStatus([&](plist::Dictionary answer) { status = std::move(answer); });
-    });
+    }
     if (!status) {
-        return sd_bus_error_set(error, SD_BUS_ERROR_FAILED, "The status could not be read");
+        return refuseStatus(message);
     }
     sd_bus_message* raw = nullptr;
     int r = sd_bus_message_new_method_return(message, &raw);
@@ -236,33 +256,34 @@ int handleGetStatus(sd_bus_message* message, void* userdata, sd_bus_error* error
     return sd_bus_send(nullptr, replyMessage.get(), nullptr);
 }
 
-// The last resort around a handler, for what happens outside its operation (reading the arguments,
-// building the reply): an exception must not unwind through sd-bus, so it becomes an error reply.
-template <int (*Handler)(sd_bus_message*, void*, sd_bus_error*)>
-int contained(sd_bus_message* message, void* userdata, sd_bus_error* error) noexcept {
-    int result = -ENOMEM;
-    containExceptions("A call", [&] { result = Handler(message, userdata, error); });
-    return result;
-}
+// Each method as the bus calls it: its handler inside the one wrapper, with its "no" answer.
+constexpr sd_bus_message_handler_t kSetTavrixID = handled<handleSetTavrixID, refuseBoolean>;
+constexpr sd_bus_message_handler_t kSetTavrixIDWithBundleFD =
+    handled<handleSetTavrixIDWithBundleFD, refuseBundleFD>;
+constexpr sd_bus_message_handler_t kIsTavrixBundleSupported =
+    handled<handleIsTavrixBundleSupported, refuseBoolean>;
+constexpr sd_bus_message_handler_t kCopyTavrixValue = handled<handleCopyTavrixValue, refuseValue>;
+constexpr sd_bus_message_handler_t kCheckForTavrixBundleUpdate =
+    handled<handleCheckForTavrixBundleUpdate, refuseBoolean>;
+constexpr sd_bus_message_handler_t kSetClientType = handled<handleSetClientType, refuseBoolean>;
+constexpr sd_bus_message_handler_t kGetStatus = handled<handleGetStatus, refuseStatus>;
 
 const sd_bus_vtable kManagerServerVTable[] = {
     SD_BUS_VTABLE_START(0),
     SD_BUS_METHOD_WITH_NAMES("SetTavrixID", "saay", SD_BUS_PARAM(tavrixID) SD_BUS_PARAM(bundle),
-                             "b", SD_BUS_PARAM(accepted), contained<handleSetTavrixID>,
-                             SD_BUS_VTABLE_UNPRIVILEGED),
+                             "b", SD_BUS_PARAM(accepted), kSetTavrixID, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_METHOD_WITH_NAMES("SetTavrixIDWithBundleFD", "sh",
                              SD_BUS_PARAM(tavrixID) SD_BUS_PARAM(bundle), "bbs",
                              SD_BUS_PARAM(accepted) SD_BUS_PARAM(extracted) SD_BUS_PARAM(reason),
-                             contained<handleSetTavrixIDWithBundleFD>, SD_BUS_VTABLE_UNPRIVILEGED),
+                             kSetTavrixIDWithBundleFD, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_METHOD_WITH_NAMES("IsTavrixBundleSupported", "", , "b", SD_BUS_PARAM(supported),
-                             contained<handleIsTavrixBundleSupported>, SD_BUS_VTABLE_UNPRIVILEGED),
+                             kIsTavrixBundleSupported, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_METHOD_WITH_NAMES("CopyTavrixValue", "s", SD_BUS_PARAM(key), "av", SD_BUS_PARAM(value),
-                             contained<handleCopyTavrixValue>, SD_BUS_VTABLE_UNPRIVILEGED),
+                             kCopyTavrixValue, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_METHOD_WITH_NAMES("CheckForTavrixBundleUpdate", "", , "b", SD_BUS_PARAM(started),
-                             contained<handleCheckForTavrixBundleUpdate>,
-                             SD_BUS_VTABLE_UNPRIVILEGED),
+                             kCheckForTavrixBundleUpdate, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_METHOD_WITH_NAMES("SetClientType", "i", SD_BUS_PARAM(type), "b", SD_BUS_PARAM(known),
-                             contained<handleSetClientType>, SD_BUS_VTABLE_UNPRIVILEGED),
+                             kSetClientType, SD_BUS_VTABLE_UNPRIVILEGED),
     SD_BUS_VTABLE_END,
 };
 
@@ -281,7 +302,7 @@ const sd_bus_vtable* notificationCenterVTable() {
     return kNotificationCenterVTable;
 }
 const sd_bus_vtable* statusVTable() {
-    return StatusPublisher::vtable(contained<handleGetStatus>);
+    return StatusPublisher::vtable(kGetStatus);
 }
 
 }  // namespace tavrix
