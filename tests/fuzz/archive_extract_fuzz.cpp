@@ -15,35 +15,14 @@
 #include <string_view>
 #include <vector>
 
+#include "FuzzSupport.h"
+#include "TestSupport.h"
 #include "payload/PayloadUnpack.h"
-#include "util/SystemLog.h"
 
 namespace {
 
 namespace fs = std::filesystem;
-
-// A directory of this process's, on a memory file system when there is one (the extractor's many
-// small files are made and removed far faster there); removed when the process exits.
-class WorkDirectory {
-  public:
-    WorkDirectory() {
-        fs::path base =
-            fs::is_directory("/dev/shm") ? fs::path("/dev/shm") : fs::temp_directory_path();
-        std::string pattern = (base / "archive-extract-fuzz-XXXXXX").string();
-        if (::mkdtemp(pattern.data()) == nullptr) {
-            std::abort();
-        }
-        path_ = pattern;
-    }
-    ~WorkDirectory() {
-        std::error_code error;
-        fs::remove_all(path_, error);
-    }
-    const fs::path& path() const { return path_; }
-
-  private:
-    fs::path path_;
-};
+using tavrix::fuzz::require;
 
 // Undoes what an entry may have set that would stop its removal: directories without search or
 // write permission. (Path-safe extraction restores no file flags.)
@@ -58,12 +37,6 @@ void makeRemovable(const fs::path& path) {
         makeRemovable(it->path());
     }
 }
-
-// The extractor logs refused entries; a fuzzing run would drown in them.
-class DiscardingLogSink : public tavrix::LogSink {
-  public:
-    void write(int, std::string_view) override {}
-};
 
 // Small enough that bombs are cut quickly, large enough for every seed to extract.
 constexpr tavrix::payload::ExtractionLimits kLimits{4u << 20, 200, 0, true};
@@ -93,9 +66,7 @@ Contents inspect(const fs::path& destination) {
             if (!unresolved) {
                 auto [end, at] =
                     std::mismatch(inside.begin(), inside.end(), target.begin(), target.end());
-                if (end != inside.end()) {
-                    std::abort();
-                }
+                require(end == inside.end());
             }
         }
     }
@@ -124,9 +95,10 @@ extern "C" int LLVMFuzzerInitialize(int* argc, char*** argv) {
 }
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
-    static DiscardingLogSink sink;
-    static tavrix::ScopedLogSink quiet(sink);
-    static WorkDirectory workDirectory;
+    tavrix::fuzz::silenceTheLog();
+    // On a memory file system when there is one: the many small files go far faster there.
+    static const tavrix::test::TempDir workDirectory(
+        fs::is_directory("/dev/shm") ? fs::path("/dev/shm") : fs::temp_directory_path());
     const fs::path& work = workDirectory.path();
     const fs::path archivePath = work / "payload";
     // Two levels down, so that entries climbing out with ".." are seen in the levels above.
@@ -144,16 +116,12 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
                                     tavrix::payload::ExtractionSafety::PathSafe, kLimits);
     makeRemovable(destination);
     Contents contents = inspect(destination);
-    if (contents.bytes > kLimits.maxExpandedBytes || contents.objects > kLimits.maxEntries) {
-        std::abort();
-    }
+    require(contents.bytes <= kLimits.maxExpandedBytes && contents.objects <= kLimits.maxEntries);
     std::error_code error;
     fs::remove_all(destination, error);
     // Anything left besides the payload and the emptied level means an entry escaped.
     for (const auto& entry : fs::recursive_directory_iterator(work)) {
-        if (entry.path() != archivePath && entry.path() != levels && entry.path() != bait) {
-            std::abort();
-        }
+        require(entry.path() == archivePath || entry.path() == levels || entry.path() == bait);
     }
     return 0;
 }

@@ -12,12 +12,14 @@
 #include <string>
 #include <vector>
 
+#include "FuzzSupport.h"
 #include "bus/BusHandles.h"
 #include "bus/BusValueCodec.h"
 
 namespace {
 
 using tavrix::bus::BusMessagePtr;
+using tavrix::fuzz::require;
 
 // Messages need a started bus object, not a bus: one over a socket pair will do, as nothing is
 // ever sent.
@@ -25,11 +27,9 @@ sd_bus* messageFactory() {
     static sd_bus* bus = [] {
         int fds[2];
         sd_bus* made = nullptr;
-        if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds) != 0 ||
-            sd_bus_new(&made) < 0 || sd_bus_set_fd(made, fds[0], fds[0]) < 0 ||
-            sd_bus_start(made) < 0) {
-            std::abort();
-        }
+        require(::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds) == 0 &&
+                sd_bus_new(&made) >= 0 && sd_bus_set_fd(made, fds[0], fds[0]) >= 0 &&
+                sd_bus_start(made) >= 0);
         return made;  // lives for the whole run, with fds[1] keeping the pair open
     }();
     return bus;
@@ -127,10 +127,8 @@ bool fill(Input& in, sd_bus_message* m, const Type& type) {
 
 BusMessagePtr newMessage() {
     sd_bus_message* raw = nullptr;
-    if (sd_bus_message_new_method_call(messageFactory(), &raw, nullptr, "/fuzz", "fuzz.Codec",
-                                       "Carry") < 0) {
-        std::abort();
-    }
+    require(sd_bus_message_new_method_call(messageFactory(), &raw, nullptr, "/fuzz", "fuzz.Codec",
+                                           "Carry") >= 0);
     return BusMessagePtr(raw);
 }
 
@@ -146,10 +144,8 @@ void checkRoundTrip(const tavrix::plist::Value& value) {
         return;  // deeper than the encoding carries
     }
     std::optional<tavrix::plist::Value> back;
-    if (!seal(again.get()) || tavrix::bus::readValue(again.get(), back) < 0 || !back ||
-        (*back != value && back->description() != value.description())) {
-        std::abort();
-    }
+    require(seal(again.get()) && tavrix::bus::readValue(again.get(), back) >= 0 && back &&
+            (*back == value || back->description() == value.description()));
 }
 
 }  // namespace

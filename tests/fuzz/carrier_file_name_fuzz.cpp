@@ -7,22 +7,13 @@
 #include <string>
 #include <string_view>
 
+#include "FuzzSupport.h"
 #include "bundle/BundleComparison.h"
 #include "bundle/VersionCompare.h"
-#include "util/SystemLog.h"
 
 namespace {
 
-class DiscardingLogSink : public tavrix::LogSink {
-  public:
-    void write(int, std::string_view) override {}
-};
-
-void require(bool condition) {
-    if (!condition) {
-        std::abort();
-    }
-}
+using tavrix::fuzz::require;
 
 void checkName(const std::string& name) {
     std::string behaviorID = tavrix::behaviorIDFromCarrierFileName(name);
@@ -36,9 +27,7 @@ void checkName(const std::string& name) {
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
-    static DiscardingLogSink sink;
-    static tavrix::ScopedLogSink scope(sink);
-
+    tavrix::fuzz::silenceTheLog();
     std::string_view input(reinterpret_cast<const char*>(data), size);
     std::string first(input.substr(0, size / 2));
     std::string second(input.substr(size / 2));

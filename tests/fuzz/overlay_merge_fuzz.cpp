@@ -7,25 +7,15 @@
 #include <string_view>
 #include <vector>
 
+#include "FuzzSupport.h"
 #include "bundle/OverlayConfiguration.h"
 #include "plist/PropertyListFormat.h"
-#include "util/SystemLog.h"
 
 namespace {
 
+using tavrix::fuzz::require;
 using tavrix::plist::Dictionary;
 using tavrix::plist::Value;
-
-class SilentSink : public tavrix::LogSink {
-  public:
-    void write(int, std::string_view) override {}
-};
-
-void check(bool condition) {
-    if (!condition) {
-        std::abort();
-    }
-}
 
 // Equality in which a real that is not a number equals itself (by its description), so that
 // copies compare equal.
@@ -39,17 +29,17 @@ void mergeAndCheck(const Dictionary& base, const Dictionary& overlay) {
     const Dictionary baseBefore = base;
     const Dictionary overlayBefore = overlay;
     Dictionary merged = tavrix::mergeDictionaries(base, overlay);
-    check(identical(Value(base), Value(baseBefore)) &&
-          identical(Value(overlay), Value(overlayBefore)));
+    require(identical(Value(base), Value(baseBefore)) &&
+            identical(Value(overlay), Value(overlayBefore)));
 
     std::vector<std::string_view> excluded;
     auto entry = overlay.find(tavrix::kExcludeKey);
     const Value* exclude = entry != overlay.end() ? &entry->second : nullptr;
     if (exclude != nullptr && exclude->asArray() != nullptr) {
-        check(!merged.contains(tavrix::kExcludeKey));
+        require(!merged.contains(tavrix::kExcludeKey));
         for (const Value& name : *exclude->asArray()) {
             if (const std::string* key = name.asString()) {
-                check(!merged.contains(*key));
+                require(!merged.contains(*key));
                 excluded.push_back(*key);
             }
         }
@@ -62,24 +52,23 @@ void mergeAndCheck(const Dictionary& base, const Dictionary& overlay) {
         if (isExcluded) {
             continue;
         }
-        check(merged.contains(key));
+        require(merged.contains(key));
         if (!value.isDictionary() || !base.contains(key)) {
-            check(identical(merged.at(key), value));
+            require(identical(merged.at(key), value));
         }
     }
     for (const auto& [key, value] : base) {
         if (!overlay.contains(key) && merged.contains(key)) {
-            check(identical(merged.at(key), value));
+            require(identical(merged.at(key), value));
         }
     }
-    check(!tavrix::removeBehaviorOverrides(merged).contains(tavrix::kBehaviorOverridesKey));
+    require(!tavrix::removeBehaviorOverrides(merged).contains(tavrix::kBehaviorOverridesKey));
 }
 
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
-    static SilentSink sink;
-    static tavrix::ScopedLogSink quiet(sink);
+    tavrix::fuzz::silenceTheLog();
     auto value = tavrix::plist::parse(std::string_view(reinterpret_cast<const char*>(data), size));
     if (!value) {
         return 0;
@@ -95,15 +84,15 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     auto map = tavrix::copyBehaviorOverrides(*value);
     for (const char* id : {"abc", "", "ABC", "42"}) {
         tavrix::BehaviorOverlayConfiguration configuration(id, *value);
-        check(configuration.overlayKey().empty() == (!map || *id == '\0'));
-        check(!configuration.overrideConfiguration() || map->contains(id));
+        require(configuration.overlayKey().empty() == (!map || *id == '\0'));
+        require(!configuration.overrideConfiguration() || map->contains(id));
     }
     if (!value->isDictionary()) {
         return 0;
     }
     const Dictionary& base = *value->asDictionary();
     mergeAndCheck(base, Dictionary{});
-    check(identical(Value(tavrix::mergeDictionaries(base, Dictionary{})), Value(base)));
+    require(identical(Value(tavrix::mergeDictionaries(base, Dictionary{})), Value(base)));
     if (map) {
         // Many IDs may share one configuration; a few are enough.
         std::size_t merges = 0;

@@ -2,6 +2,9 @@
 // and the one way to wait for a condition.
 #pragma once
 
+#include <sys/mount.h>
+#include <unistd.h>
+
 #include <chrono>
 #include <cstdlib>
 #include <filesystem>
@@ -9,6 +12,7 @@
 #include <functional>
 #include <map>
 #include <optional>
+#include <random>
 #include <stdexcept>
 #include <string>
 #include <thread>
@@ -17,12 +21,11 @@
 
 namespace tavrix::test {
 
-// A fresh directory under $TMPDIR, removed with everything in it when the object goes.
+// A fresh directory under base ($TMPDIR), removed with everything in it when the object goes.
 class TempDir {
   public:
-    TempDir() {
-        std::string pattern =
-            (std::filesystem::temp_directory_path() / "tavrix-test-XXXXXX").string();
+    explicit TempDir(const std::filesystem::path& base = std::filesystem::temp_directory_path()) {
+        std::string pattern = (base / "tavrix-test-XXXXXX").string();
         if (::mkdtemp(pattern.data()) == nullptr) {
             throw std::runtime_error("mkdtemp failed");
         }
@@ -51,6 +54,33 @@ inline std::string readText(const std::string& path) {
     std::ifstream in(path, std::ofstream::binary);
     return std::string(std::istreambuf_iterator<char>(in), {});
 }
+
+// Bytes that do not compress.
+inline std::string randomBytes(std::size_t size, unsigned seed) {
+    std::mt19937 generator(seed);
+    std::string bytes(size, '\0');
+    for (char& byte : bytes) {
+        byte = static_cast<char>(generator());
+    }
+    return bytes;
+}
+
+// A tmpfs of the given size ("size=1m") over path until the object goes; mounting needs root.
+struct TmpfsMount {
+    TmpfsMount(std::filesystem::path at, const char* size)
+        : path(std::move(at)),
+          mounted(::geteuid() == 0 && ::mount("tmpfs", path.c_str(), "tmpfs", 0, size) == 0) {}
+    ~TmpfsMount() {
+        if (mounted) {
+            ::umount2(path.c_str(), MNT_DETACH);
+        }
+    }
+    TmpfsMount(const TmpfsMount&) = delete;
+    TmpfsMount& operator=(const TmpfsMount&) = delete;
+
+    std::filesystem::path path;
+    bool mounted;
+};
 
 // A bundle directory as senders make it: Info.plist with an identifier and the version (left out
 // when absent), the base carrier file, and other files (relative path to content).

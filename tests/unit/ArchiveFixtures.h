@@ -8,11 +8,11 @@
 
 #include <cstdint>
 #include <ctime>
-#include <random>
 #include <stdexcept>
 #include <string>
 #include <vector>
 
+#include "TestSupport.h"
 #include "payload/ArchiveHandles.h"
 
 namespace tavrix::test {
@@ -47,16 +47,6 @@ inline ArchiveItem hardlinkItem(std::string path, std::string target) {
 }
 inline ArchiveItem fifoItem(std::string path) {
     return {ArchiveItem::Kind::Fifo, std::move(path), {}, 0644, 1500000000, {}};
-}
-
-// Bytes that do not compress.
-inline std::string randomBytes(std::size_t size, unsigned seed) {
-    std::mt19937 generator(seed);
-    std::string bytes(size, '\0');
-    for (char& byte : bytes) {
-        byte = static_cast<char>(generator());
-    }
-    return bytes;
 }
 
 // The archive holding items, in order, as a file's bytes.
