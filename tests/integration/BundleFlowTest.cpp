@@ -2,7 +2,6 @@
 // right carrier file linked into the mobile home and one notification, nothing changes when nothing
 // changed, and payloads chosen to hurt leave it serving.
 #include <signal.h>
-#include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/types.h>
 
@@ -14,6 +13,7 @@
 #include <random>
 #include <set>
 #include <thread>
+#include <tuple>
 
 #include "BusFixture.h"
 #include "HostilePropertyLists.h"
@@ -99,15 +99,12 @@ TEST_F(BundleFlowTest, FirstSetLinksTheOverlaidCarrierFileAndRepeatingItChangesN
                                  ",^\\./Absolute," + userBundle + "/Absolute,"});
     fs::path payloadFile = device().base() / "payload.tgz";
     test::writeText(payloadFile, std::string(payload.begin(), payload.end()));
-    const std::vector<std::string> setID = {
-        TAVRIX_CTL_PATH, "--address", busAddress(),        "set-id",
-        "AbC",           "--bundle",  payloadFile.string()};
+    const std::vector<std::string> setID = {"set-id", "AbC", "--bundle", payloadFile.string()};
 
     // First without a payload: said before the bundle manager starts.
-    CommandResult withoutPayload =
-        runCommand({TAVRIX_CTL_PATH, "--address", busAddress(), "set-id", "AbC"});
+    CommandResult withoutPayload = tavrixctl({"set-id", "AbC"});
     ASSERT_EQ(withoutPayload.status, 0) << withoutPayload.output;
-    CommandResult first = runCommand(setID);
+    CommandResult first = tavrixctl(setID);
     ASSERT_EQ(first.status, 0) << first.output;
     EXPECT_EQ(first.output,
               "yes\nextracted " + std::to_string(payload.size()) + " bytes into the user bundle\n");
@@ -174,7 +171,7 @@ TEST_F(BundleFlowTest, FirstSetLinksTheOverlaidCarrierFileAndRepeatingItChangesN
     const struct stat bundleLinkBefore = linkStat(at(kBundleLink));
     const struct stat preferencesLinkBefore = linkStat(at(kPreferencesLink));
     const struct stat overlayBefore = linkStat(overlayFile);
-    CommandResult second = runCommand(setID);
+    CommandResult second = tavrixctl(setID);
     ASSERT_EQ(second.status, 0) << second.output;
     EXPECT_TRUE(waitForLogLine(matchResult("kBundleChangeTypeNoChange")));
     EXPECT_FALSE(watcher().waitForNotification(kChanged, 2, 1s));
@@ -195,39 +192,36 @@ TEST_F(BundleFlowTest, FirstSetLinksTheOverlaidCarrierFileAndRepeatingItChangesN
     EXPECT_EQ(broken.output, "True False True\n");
 }
 
-// Only the behavior bit differs between an unlisted ID (the base carrier file) and a listed one:
-// an override switch, which relinks both ways. (Two listed IDs are the comparison's unit test.)
-TEST_F(BundleFlowTest, BehaviorOverlayTransitionsSwitchOrUpdate) {
+// A real directory where the bundle link belongs is left alone (answered, nothing posted) until it
+// is gone. Then only the behavior bit differs between an unlisted ID (the base carrier file) and a
+// listed one: an override switch, which relinks both ways. The device overlay file for this
+// hardware model is merged first and keeps the overlay section; a listed ID then overlays it, and
+// that file drops the section. (Two listed IDs are the comparison's unit test.)
+TEST_F(BundleFlowTest, OverlayChangesRelinkOnceTheBundleLinkCanBeMade) {
     auto caller = client();
+    fs::create_directories(at(kBundleLink) / "keep");
+    ASSERT_TRUE(caller.setTavrixID("abc", packBundle("10")));
+    EXPECT_TRUE(fs::is_directory(at(kBundleLink) / "keep"));
+    EXPECT_FALSE(fs::exists(fs::symlink_status(at(kPreferencesLink))));
+    EXPECT_EQ(watcher().notificationCount(kChanged), 0);
+    fs::remove_all(at(kBundleLink));
+
     const fs::path overlays = at(kOverlayDirectory);
     const std::string baseFile = (at(kUserBundle) / "behavior.plist").string();
-    struct Step {
-        const char* id;
-        const char* changeType;
-        std::string carrierFile;
-    };
-    const Step steps[] = {
+    const std::tuple<const char*, const char*, std::string> steps[] = {
         {"not-listed", "kBundleChangeTypeUpdate", baseFile},
         {"abc", "kBundleChangeTypeOverrideSwitch",
          (overlays / "id+behavior+Default.bundle+abc+10.plist").string()},
         {"not-listed", "kBundleChangeTypeOverrideSwitch", baseFile},
     };
-    auto payload = packBundle("10");
-    bool first = true;
-    for (const Step& expected : steps) {
-        ASSERT_TRUE(caller.setTavrixID(expected.id, first ? std::optional(payload) : std::nullopt));
-        first = false;
-        EXPECT_EQ(linkTarget(kPreferencesLink), expected.carrierFile) << expected.id;
-        EXPECT_EQ(lastMatchResult(), expected.changeType) << expected.id;
+    for (const auto& [id, changeType, carrierFile] : steps) {
+        ASSERT_TRUE(caller.setTavrixID(id, std::nullopt));
+        EXPECT_EQ(linkTarget(kPreferencesLink), carrierFile) << id;
+        EXPECT_EQ(lastMatchResult(), changeType) << id;
     }
     EXPECT_TRUE(watcher().waitForNotification(kChanged, 3, 5s));
-}
+    EXPECT_EQ(linkTarget(kBundleLink), at(kUserBundle).string());
 
-// The device overlay file for this hardware model is merged first and keeps the overlay
-// section; a listed ID then overlays it, and that file drops the section.
-TEST_F(BundleFlowTest, DeviceOverlayKeepsTheSectionAndBehaviorOverlayBuildsOnIt) {
-    auto caller = client();
-    const fs::path overlays = at(kOverlayDirectory);
     ASSERT_TRUE(caller.setTavrixID("not-listed", packBundle("10", /*deviceOverlay=*/true)));
     EXPECT_EQ(linkTarget(kPreferencesLink),
               (overlays / "device+behavior+Default.bundle+T71AP+10.plist").string());
@@ -247,22 +241,6 @@ TEST_F(BundleFlowTest, DeviceOverlayKeepsTheSectionAndBehaviorOverlayBuildsOnIt)
     EXPECT_EQ(*both->find("Data"), plist::Value(plist::Dictionary{{"MaxRate", 1}}));
 }
 
-// A real directory where the bundle link belongs cannot be replaced: answered, and the daemon goes
-// on; once it is gone the next call links.
-TEST_F(BundleFlowTest, DirectoryInPlaceOfTheBundleLinkIsReportedAndLeftAlone) {
-    fs::create_directories(at(kBundleLink) / "keep");
-    auto caller = client();
-    ASSERT_TRUE(caller.setTavrixID("abc", packBundle("10")));
-    EXPECT_TRUE(fs::is_directory(at(kBundleLink) / "keep"));
-    EXPECT_FALSE(fs::exists(fs::symlink_status(at(kPreferencesLink))));
-    EXPECT_EQ(watcher().notificationCount(kChanged), 0);
-
-    fs::remove_all(at(kBundleLink));
-    ASSERT_TRUE(caller.setTavrixID("abc", std::nullopt));
-    EXPECT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
-    EXPECT_EQ(linkTarget(kBundleLink), at(kUserBundle).string());
-}
-
 // A client's SetTavrixID with a multi-megabyte payload, the daemon killed at a random instant of
 // it: every next launch finds (or makes) one whole state: both links resolve, the carrier file is
 // in the linked bundle or the generated files and parses, the daemon preferences parse. The call
@@ -273,13 +251,9 @@ TEST_F(BundleFlowTest, KilledAnywhereInSetTavrixIDTheNextLaunchFindsOneWholeStat
     auto packLarge = [&](const std::string& version) {
         const fs::path source = device().base() / ("large-" + version);
         writeBundle(source, version, baseCarrierFile("Bundle " + version));
-        std::mt19937 bytes(static_cast<unsigned>(std::stoi(version)));
-        std::string bulk(3 << 20, '\0');
-        for (char& byte : bulk) {
-            byte = static_cast<char>(bytes());
-        }
+        test::writeText(source / "Resources/bulk.bin",
+                        test::randomBytes(3 << 20, std::stoi(version)));
         fs::create_directories(source / "Resources/small");
-        std::ofstream(source / "Resources/bulk.bin", std::fstream::binary) << bulk;
         for (int i = 0; i < 100; ++i) {
             std::ofstream(source / ("Resources/small/" + std::to_string(i) + ".txt")) << version;
         }
@@ -515,30 +489,15 @@ TEST_F(SmallFileSystemsTest, PayloadsThatDoNotFitKeepTheBundleBeforeThem) {
     if (::geteuid() != 0) {
         GTEST_SKIP() << "needs root to mount small file systems";
     }
-    struct Mount {
-        fs::path path;
-        bool mounted;
-        Mount(fs::path at, const char* size)
-            : path(std::move(at)), mounted(::mount("tmpfs", path.c_str(), "tmpfs", 0, size) == 0) {}
-        ~Mount() {
-            if (mounted) {
-                ::umount2(path.c_str(), MNT_DETACH);
-            }
-        }
-    };
-    const Mount home(at("/var/mobile"), "size=40m");
+    const test::TmpfsMount home(at("/var/mobile"), "size=40m");
     ASSERT_TRUE(home.mounted);
     device().writeDaemonPreferences({{"EnableSupport", true}});
     // Random bytes weigh in the payload what they take on disk; zeros hardly at all.
     auto bundleWith = [&](const std::string& version, std::size_t bytes, bool random) {
         const fs::path source = device().base() / ("small-" + version);
         writeBundle(source, version, {{"CarrierName", version}});
-        std::string bulk(bytes, '\0');
-        std::mt19937 generator(7);
-        for (char& byte : bulk) {
-            byte = random ? static_cast<char>(generator()) : '\0';
-        }
-        test::writeText(source / "bulk", bulk);
+        test::writeText(source / "bulk",
+                        random ? test::randomBytes(bytes, 7) : std::string(bytes, 0));
         return pack(source, {"-z"});
     };
     ASSERT_TRUE(client().setTavrixID("id-7", bundleWith("5", 1 << 20, true)));
@@ -548,10 +507,9 @@ TEST_F(SmallFileSystemsTest, PayloadsThatDoNotFitKeepTheBundleBeforeThem) {
     EXPECT_EQ(countLogLinesContaining("stopped:"), 1);
     EXPECT_EQ(linkedVersion(), "5");
 
-    const Mount tmp(at("/tmp"), "size=1m");
+    const test::TmpfsMount tmp(at("/tmp"), "size=1m");
     ASSERT_TRUE(tmp.mounted);
-    std::string filler(1 << 20, 'x');
-    std::ofstream(tmp.path / "filler", std::ofstream::binary).write(filler.data(), filler.size());
+    test::writeText(tmp.path / "filler", std::string(1 << 20, 'x'));
     ASSERT_TRUE(client().setTavrixID("id-7", bundleWith("7", 2 << 20, true)));
     EXPECT_EQ(countLogLinesContaining("Failed to write the zipped file"), 1);
     EXPECT_EQ(linkedVersion(), "5");

@@ -51,6 +51,14 @@ inline int crashLoopIterations() {
     return text != nullptr && std::atoi(text) > 0 ? std::atoi(text) : 30;
 }
 
+// command run through setpriv as user (uid, gid), without supplementary groups.
+inline std::vector<std::string> asUser(std::pair<uid_t, gid_t> user,
+                                       std::vector<std::string> command) {
+    command.insert(command.begin(), {"/usr/bin/setpriv", "--reuid=" + std::to_string(user.first),
+                                     "--regid=" + std::to_string(user.second), "--clear-groups"});
+    return command;
+}
+
 // A device image: the root the daemon runs under, its runtime directory, and the files the tests
 // prepare or inspect. "mobile" is the test's own user (home /var/mobile); no cellular radio.
 class DeviceRoot {
@@ -185,6 +193,10 @@ class BusFixture : public ::testing::Test {
     }
     // A plain bus connection, for calls the client library would not make.
     bus::BusPtr rawConnection() const { return bus_->connect(); }
+    CommandResult tavrixctl(std::vector<std::string> arguments) const {
+        arguments.insert(arguments.begin(), {TAVRIX_CTL_PATH, "--address", busAddress()});
+        return runCommand(arguments);
+    }
 
     bool waitForNameOwner(std::chrono::milliseconds timeout = 10s) {
         return watcher_->waitUntil([this] { return !watcher_->nameOwner().empty(); }, timeout);

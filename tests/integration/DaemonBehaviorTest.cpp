@@ -20,18 +20,6 @@ using DaemonBehaviorTest = BusFixture;
 using ::testing::HasSubstr;
 using ::testing::Not;
 
-// Everything else in place, a cellular radio alone refuses the ID and supports nothing.
-TEST_F(DaemonBehaviorTest, CellularDeviceRefusesTheIdAndSupportsNothing) {
-    device().setCellularRadio(true);
-    device().writeDaemonPreferences({{"TavrixID", "abc"}, {"EnableSupport", true}});
-    auto caller = client();
-
-    EXPECT_FALSE(caller.setTavrixID("xyz", std::nullopt));
-    EXPECT_EQ(device().daemonPreference("TavrixID"), std::optional<plist::Value>("abc"));
-    EXPECT_FALSE(caller.isTavrixBundleSupported());
-    EXPECT_FALSE(caller.checkForTavrixBundleUpdate());
-}
-
 // Setting the ID checks only the radio: without "EnableSupport" it is still stored, lower-cased
 // (every letter with a lower-case form, not only ASCII ones), and an empty bundle is no failure.
 TEST_F(DaemonBehaviorTest, IdIsStoredLowerCasedWhetherOrNotSupportIsEnabled) {
@@ -85,7 +73,8 @@ except dbus.DBusException as error:
               std::optional<plist::Value>(std::string(1024, 'y')));
 }
 
-// Behavior settings (any value, as it is in the file) are read exactly while supported.
+// Behavior settings (any value, as it is in the file) are read exactly while supported. Everything
+// else in place, a cellular radio alone refuses the ID and supports nothing.
 TEST_F(DaemonBehaviorTest, EnableSupportDecidesSupportOnceAnIdIsSetAndWithItTheSettings) {
     const plist::Value limits(plist::Dictionary{{"daily", 10}, {"since", plist::Date{123456}}});
     device().writeBehaviorSettings({{"Limits", limits}});
@@ -114,6 +103,13 @@ TEST_F(DaemonBehaviorTest, EnableSupportDecidesSupportOnceAnIdIsSetAndWithItTheS
                   supported ? std::optional(limits) : std::nullopt)
             << "EnableSupport " << what;
     }
+
+    device().writeDaemonPreferences({{"TavrixID", "abc"}, {"EnableSupport", true}});
+    device().setCellularRadio(true);
+    EXPECT_FALSE(caller.setTavrixID("xyz", std::nullopt));
+    EXPECT_EQ(device().daemonPreference("TavrixID"), std::optional<plist::Value>("abc"));
+    EXPECT_FALSE(caller.isTavrixBundleSupported());
+    EXPECT_FALSE(caller.checkForTavrixBundleUpdate());
 }
 
 // The packaged bus policy, loaded by a bus that denies by default as the system bus does: anyone
@@ -179,10 +175,7 @@ class DaemonPolicyTest : public BusFixture {
 
     // command run as the user nobody with the given primary group and no other groups.
     static CommandResult asNobody(gid_t gid, const std::vector<std::string>& command) {
-        std::vector<std::string> argv = {"/usr/bin/setpriv", "--reuid=" + std::to_string(kNobody),
-                                         "--regid=" + std::to_string(gid), "--clear-groups"};
-        argv.insert(argv.end(), command.begin(), command.end());
-        return runCommand(argv);
+        return runCommand(asUser({kNobody, gid}, command));
     }
 
     CommandResult tavrixctlAs(gid_t gid, const std::vector<std::string>& arguments) {
@@ -199,6 +192,37 @@ class DaemonPolicyTest : public BusFixture {
 };
 
 TEST_F(DaemonPolicyTest, AnyoneMayAskButOnlyPrivilegedCallersMayChange) {
+    // busctl on the test's bus with the words of arguments.
+    auto busctl = [&](const std::string& arguments) {
+        std::istringstream words(arguments);
+        std::vector<std::string> argv = {"/usr/bin/busctl", "--address=" + busAddress()};
+        argv.insert(argv.end(), std::istream_iterator<std::string>(words), {});
+        return argv;
+    };
+    const auto requestName = busctl(
+        "call org.freedesktop.DBus /org/freedesktop/DBus org.freedesktop.DBus RequestName su " +
+        std::string(kDaemonBusName) + " 0");
+
+    auto refused = asNobody(kNobody, requestName);
+    EXPECT_NE(refused.status, 0) << refused.output;
+    EXPECT_THAT(refused.output, HasSubstr("Access denied"));
+
+    // The daemon's user (here the test's own) gets it: busctl becomes the primary owner (1).
+    auto owned = runCommand(requestName);
+    EXPECT_EQ(owned.status, 0) << owned.output;
+    EXPECT_EQ(owned.output, "u 1\n");
+
+    // A look-alike notification from anyone else never reaches a listener, even one that does
+    // not check the sender; the daemon's user, posting after it, gets through.
+    auto post = [&](const std::string& name) {
+        return busctl("emit /com/zandor/tavrixservicesd com.zandor.NotificationCenter Posted s " +
+                      name);
+    };
+    asNobody(kNobody, post("kTVXBehaviorBundleChangedNotification"));
+    EXPECT_EQ(runCommand(post("PolicyTestMarker")).status, 0);
+    EXPECT_TRUE(watcher().waitForNotification("PolicyTestMarker", 1, std::chrono::seconds(10)));
+    EXPECT_EQ(watcher().notificationCount("kTVXBehaviorBundleChangedNotification"), 0);
+
     const gid_t nogroup = kNobody;
     for (const std::vector<std::string>& change :
          {std::vector<std::string>{"set-id", "x"}, {"set-id", "x", "--bundle", "-"}}) {
@@ -237,39 +261,6 @@ TEST_F(DaemonPolicyTest, AnyoneMayAskButOnlyPrivilegedCallersMayChange) {
     EXPECT_TRUE(waitForLogLine("Handling Set Tavrix ID with w"));
 
     EXPECT_TRUE(client().setTavrixID("z", std::nullopt));
-}
-
-TEST_F(DaemonPolicyTest, OnlyTheDaemonsUserMayOwnTheNameOrPost) {
-    // busctl on the test's bus with the words of arguments.
-    auto busctl = [&](const std::string& arguments) {
-        std::istringstream words(arguments);
-        std::vector<std::string> argv = {"/usr/bin/busctl", "--address=" + busAddress()};
-        argv.insert(argv.end(), std::istream_iterator<std::string>(words), {});
-        return argv;
-    };
-    const auto requestName = busctl(
-        "call org.freedesktop.DBus /org/freedesktop/DBus org.freedesktop.DBus RequestName su " +
-        std::string(kDaemonBusName) + " 0");
-
-    auto refused = asNobody(kNobody, requestName);
-    EXPECT_NE(refused.status, 0) << refused.output;
-    EXPECT_THAT(refused.output, HasSubstr("Access denied"));
-
-    // The daemon's user (here the test's own) gets it: busctl becomes the primary owner (1).
-    auto owned = runCommand(requestName);
-    EXPECT_EQ(owned.status, 0) << owned.output;
-    EXPECT_EQ(owned.output, "u 1\n");
-
-    // A look-alike notification from anyone else never reaches a listener, even one that does
-    // not check the sender; the daemon's user, posting after it, gets through.
-    auto post = [&](const std::string& name) {
-        return busctl("emit /com/zandor/tavrixservicesd com.zandor.NotificationCenter Posted s " +
-                      name);
-    };
-    asNobody(kNobody, post("kTVXBehaviorBundleChangedNotification"));
-    EXPECT_EQ(runCommand(post("PolicyTestMarker")).status, 0);
-    EXPECT_TRUE(watcher().waitForNotification("PolicyTestMarker", 1, std::chrono::seconds(10)));
-    EXPECT_EQ(watcher().notificationCount("kTVXBehaviorBundleChangedNotification"), 0);
 }
 
 }  // namespace

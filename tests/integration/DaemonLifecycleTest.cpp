@@ -63,24 +63,16 @@ TEST_F(DaemonLifecycleTest, StartsOnCallStaysForLaunchTransactionAndLeavesWhenId
     EXPECT_EQ(waitForDaemonExit(*firstPid), std::optional<int>(0));
 }
 
-// A keep-alive flag left set by an earlier run is seen at start and cleared once started. (SIGTERM
-// with the launch transaction open, leaving with 0, is every test's teardown.)
-TEST_F(DaemonLifecycleTest, KeepAliveLeftByEarlierRunIsCleared) {
-    test::writeText(device().runtimeDirectory() / "keep-alive", "1");
-    auto caller = client();
-    EXPECT_TRUE(caller.setClientType(0));
-    EXPECT_TRUE(waitForLogLine("Starting the server: keepAlive = ENABLED"));
-    EXPECT_EQ(device().keepAliveFlag(), "0\n");
-}
-
 class DaemonActivityTest : public DaemonLifecycleTest {
   protected:
     DaemonActivityTest() { idleExitSeconds = 2; }
 };
 
 // A client calling once a second, from before the launch transaction ends until well past it,
-// keeps the one daemon: the grace runs from the last call. Once the calls stop, it leaves.
+// keeps the one daemon: the grace runs from the last call. Once the calls stop, it leaves. A
+// keep-alive flag left set by an earlier run is seen at start and cleared once started.
 TEST_F(DaemonActivityTest, CallsOnceASecondKeepOneDaemonAlivePastTheGrace) {
+    test::writeText(device().runtimeDirectory() / "keep-alive", "1");
     auto caller = client();
     EXPECT_FALSE(caller.isTavrixBundleSupported());
     const auto pid = daemonPid();
@@ -90,6 +82,8 @@ TEST_F(DaemonActivityTest, CallsOnceASecondKeepOneDaemonAlivePastTheGrace) {
         EXPECT_TRUE(caller.setClientType(second));
     }
     EXPECT_EQ(countLogLines(kLaunchEnded), 1);
+    EXPECT_EQ(countLogLines("Starting the server: keepAlive = ENABLED"), 1);
+    EXPECT_EQ(device().keepAliveFlag(), "0\n");
     EXPECT_EQ(daemonPid(), pid);
     EXPECT_EQ(daemonLaunches().size(), 1u);
 

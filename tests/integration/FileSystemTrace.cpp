@@ -161,8 +161,7 @@ std::string pathAt(const Call& call, std::size_t index) {
 
 class Checker {
   public:
-    Checker(std::string temporaryPrefix, std::vector<std::string> exemptPrefixes)
-        : temporaryPrefix_(std::move(temporaryPrefix)), exempt_(std::move(exemptPrefixes)) {}
+    explicit Checker(std::string temporaryPrefix) : temporaryPrefix_(std::move(temporaryPrefix)) {}
 
     void check(const Call& call) {
         const std::string& name = call.name;
@@ -189,7 +188,7 @@ class Checker {
         } else if (name == "sync" || name == "syncfs") {
             dirtyFiles_.clear();
             dirtyDirectories_.clear();
-            ++counts_.flushes;
+            ++report_.flushes;
         } else if (name == "rename") {
             renamed(call, quotedText(argument(call, 0)), quotedText(argument(call, 1)));
         } else if (name == "renameat" || name == "renameat2") {
@@ -213,7 +212,7 @@ class Checker {
         }
     }
 
-    std::vector<std::string> finish() {
+    DurabilityReport finish() {
         for (const auto& [thread, pending] : awaitingDirectoryFlush_) {
             violation("directory not flushed after a rename into it", pending.line);
         }
@@ -222,10 +221,8 @@ class Checker {
                 violation("written in place under its final name", write.line);
             }
         }
-        return violations_;
+        return report_;
     }
-
-    const DurabilityCounts& counts() const { return counts_; }
 
   private:
     struct Pending {
@@ -245,17 +242,9 @@ class Checker {
     bool isTemporary(const std::string& path) const {
         return lastComponentOf(path).starts_with(temporaryPrefix_);
     }
-    bool isExempt(const std::string& path) const {
-        for (const std::string& prefix : exempt_) {
-            if (path.starts_with(prefix)) {
-                return true;
-            }
-        }
-        return false;
-    }
 
     void violation(const std::string& rule, const std::string& line) {
-        violations_.push_back(rule + ": " + line);
+        report_.violations.push_back(rule + ": " + line);
     }
 
     // A thread that renamed into a directory must flush it before it changes anything else.
@@ -286,13 +275,13 @@ class Checker {
             return;
         }
         dirtyFiles_.insert(path);
-        if (!isTemporary(path) && !isExempt(path)) {
+        if (!isTemporary(path)) {
             inPlaceWrites_.push_back({path, call.line});
         }
     }
 
     void flushed(const Call& call, const std::string& path) {
-        ++counts_.flushes;
+        ++report_.flushes;
         dirtyFiles_.erase(path);
         dirtyDirectories_.erase(path);
         auto pending = awaitingDirectoryFlush_.find(call.thread);
@@ -317,7 +306,7 @@ class Checker {
 
     void linked(const Call& call, const std::string& path) {
         changedEntry(call, path);
-        if (!isTemporary(path) && !isExempt(path)) {
+        if (!isTemporary(path)) {
             violation("link made under its final name, not renamed into place", call.line);
         }
         temporaryLinks_.insert(path);
@@ -325,10 +314,9 @@ class Checker {
 
     void renamed(const Call& call, const std::string& from, const std::string& to) {
         beforeEntryChange(call);
-        const bool intoPlace = !isTemporary(to) && !isExempt(to);
-        if (intoPlace) {
-            ++counts_.renamesIntoPlace;
-            counts_.linksReplaced += temporaryLinks_.erase(from) > 0 ? 1 : 0;
+        if (!isTemporary(to)) {
+            ++report_.renamesIntoPlace;
+            report_.linksReplaced += temporaryLinks_.erase(from) > 0 ? 1 : 0;
             for (const std::string& file : dirtyFiles_) {
                 if (file == from || isUnder(file, from)) {
                     violation("renamed into place before " + file + " was flushed", call.line);
@@ -370,31 +358,22 @@ class Checker {
     }
 
     std::string temporaryPrefix_;
-    std::vector<std::string> exempt_;
     std::set<std::string> dirtyFiles_;
     std::set<std::string> temporaryLinks_;
     std::set<std::string> dirtyDirectories_;
     std::map<std::string, Pending> awaitingDirectoryFlush_;
     std::vector<InPlaceWrite> inPlaceWrites_;
-    std::vector<std::string> violations_;
-    DurabilityCounts counts_;
+    DurabilityReport report_;
 };
 
 }  // namespace
 
-std::vector<std::string> durabilityViolations(const std::string& trace,
-                                              const std::string& temporaryPrefix,
-                                              const std::vector<std::string>& exemptPrefixes,
-                                              DurabilityCounts* counts) {
-    Checker checker(temporaryPrefix, exemptPrefixes);
+DurabilityReport checkDurability(const std::string& trace, const std::string& temporaryPrefix) {
+    Checker checker(temporaryPrefix);
     for (const Call& call : parseTrace(trace)) {
         checker.check(call);
     }
-    std::vector<std::string> violations = checker.finish();
-    if (counts != nullptr) {
-        *counts = checker.counts();
-    }
-    return violations;
+    return checker.finish();
 }
 
 }  // namespace tavrix::integration

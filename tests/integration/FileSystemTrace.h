@@ -10,24 +10,22 @@
 
 namespace tavrix::integration {
 
-// What strace must record for durabilityViolations (its -e trace= list).
+// What strace must record for checkDurability (its -e trace= list).
 inline constexpr const char* kTracedFileSystemCalls =
     "trace=open,openat,creat,write,pwrite64,writev,pwritev,pwritev2,ftruncate,truncate,"
     "copy_file_range,sendfile,fsync,fdatasync,sync,syncfs,rename,renameat,renameat2,symlink,"
     "symlinkat,link,linkat,mkdir,mkdirat,unlink,unlinkat";
 
-struct DurabilityCounts {
+struct DurabilityReport {
+    // One line per violation, naming its rule and quoting the call.
+    std::vector<std::string> violations;
+    // How much was checked.
     int renamesIntoPlace = 0;
     int linksReplaced = 0;
     int flushes = 0;
 };
 
-// One line per violation, naming its rule and quoting the call; empty when the trace keeps every
-// rule. Temporary names start with temporaryPrefix; paths under an exempt prefix are not final
-// (downloads checked before use, the lock file). counts, when given, says how much was checked.
-std::vector<std::string> durabilityViolations(const std::string& trace,
-                                              const std::string& temporaryPrefix,
-                                              const std::vector<std::string>& exemptPrefixes,
-                                              DurabilityCounts* counts = nullptr);
+// The trace checked; temporary names start with temporaryPrefix.
+DurabilityReport checkDurability(const std::string& trace, const std::string& temporaryPrefix);
 
 }  // namespace tavrix::integration

@@ -7,14 +7,15 @@
 // by the daemon anywhere, the daemon's preferences hold what the client set, and the update
 // installs. Starting processes as other users needs root.
 #include <gmock/gmock.h>
+#include <pwd.h>
 #include <signal.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cstdio>
 #include <filesystem>
-#include <fstream>
-#include <sstream>
+#include <memory>
 
 #include "BusFixture.h"
 #include "TestSupport.h"
@@ -26,7 +27,6 @@ namespace {
 namespace fs = std::filesystem;
 using ::testing::HasSubstr;
 
-constexpr const char* kSetpriv = "/usr/bin/setpriv";
 constexpr const char* kBehaviorID = "acme.default";
 constexpr const char* kDaemonPreferences =
     "/var/mobile/Library/Preferences/com.zandor.tavrixservices.plist";
@@ -45,27 +45,14 @@ std::ostream& operator<<(std::ostream& out, const Attack& attack) {
 }
 
 // The uid and gid of name in the device's user database.
-std::pair<uid_t, gid_t> userIn(const fs::path& passwd, const std::string& name) {
-    std::ifstream in(passwd);
-    for (std::string line; std::getline(in, line);) {
-        std::istringstream fields(line);
-        std::string user, password, uid, gid;
-        std::getline(fields, user, ':');
-        std::getline(fields, password, ':');
-        std::getline(fields, uid, ':');
-        std::getline(fields, gid, ':');
-        if (user == name) {
-            return {static_cast<uid_t>(std::stoul(uid)), static_cast<gid_t>(std::stoul(gid))};
+std::pair<uid_t, gid_t> userIn(const fs::path& database, const std::string& name) {
+    std::unique_ptr<FILE, int (*)(FILE*)> file(std::fopen(database.c_str(), "r"), &std::fclose);
+    for (passwd* entry = nullptr; file && (entry = ::fgetpwent(file.get())) != nullptr;) {
+        if (name == entry->pw_name) {
+            return {entry->pw_uid, entry->pw_gid};
         }
     }
-    throw std::runtime_error("no user " + name + " in " + passwd.string());
-}
-
-std::vector<std::string> asUser(std::pair<uid_t, gid_t> user, std::vector<std::string> command) {
-    std::vector<std::string> argv = {kSetpriv, "--reuid=" + std::to_string(user.first),
-                                     "--regid=" + std::to_string(user.second), "--clear-groups"};
-    argv.insert(argv.end(), command.begin(), command.end());
-    return argv;
+    throw std::runtime_error("no user " + name + " in " + database.string());
 }
 
 // The attack repeated in a loop of its own until the object goes.
@@ -104,7 +91,7 @@ class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInter
             GTEST_SKIP() << "running the daemon and the attacker as other users needs root";
         }
         for (const char* tool :
-             {kSetpriv, "/usr/bin/systemd-sysusers", "/usr/bin/systemd-tmpfiles"}) {
+             {"/usr/bin/setpriv", "/usr/bin/systemd-sysusers", "/usr/bin/systemd-tmpfiles"}) {
             if (::access(tool, X_OK) != 0) {
                 GTEST_SKIP() << tool << " is missing";
             }

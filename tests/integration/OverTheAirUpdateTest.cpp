@@ -4,8 +4,6 @@
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <signal.h>
-#include <sodium.h>
-#include <sys/mount.h>
 #include <sys/statvfs.h>
 #include <unistd.h>
 
@@ -62,9 +60,8 @@ class OverTheAirUpdateTest : public BusFixture {
         test::writeBundle(directory, version, {{"CarrierName", "Bundle " + version}},
                           {{"Resources/only-in-" + version + ".txt", version}});
         if (bulkBytes > 0) {
-            std::string bulk(bulkBytes, '\0');
-            randombytes_buf(bulk.data(), bulk.size());
-            writeText(directory / "Resources/bulk.bin", bulk);
+            writeText(directory / "Resources/bulk.bin",
+                      test::randomBytes(bulkBytes, std::hash<std::string>()(version)));
         }
         return directory;
     }
@@ -121,9 +118,8 @@ class OverTheAirUpdateTest : public BusFixture {
     // tavrixctl with --json at the end of the line, where global options may also go; its answer
     // parsed strictly (malformed output or trailing text fails).
     nlohmann::json tavrixctlJson(std::vector<std::string> arguments, int expectedStatus = 0) {
-        arguments.insert(arguments.begin(), {TAVRIX_CTL_PATH, "--address", busAddress()});
         arguments.push_back("--json");
-        CommandResult run = runCommand(arguments);
+        CommandResult run = tavrixctl(arguments);
         EXPECT_EQ(run.status, expectedStatus) << run.output;
         return nlohmann::json::parse(run.output);
     }
@@ -202,8 +198,7 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
                  {{"LinkedBundle.Version", "2"}, {"LastCheck.Outcome", "installed"}});
 
     // Plain output this time.
-    CommandResult upToDate =
-        runCommand({TAVRIX_CTL_PATH, "--address", busAddress(), "check-update", "--wait", "30"});
+    CommandResult upToDate = tavrixctl({"check-update", "--wait", "30"});
     EXPECT_EQ(upToDate.status, 0);
     EXPECT_EQ(upToDate.output, "no\nup to date (version 2 installed)\n")
         << "nothing started, nothing to wait for";
@@ -238,16 +233,7 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
 // the check a day ahead, the failed install, like any install, fifteen days ahead.
 TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheNextOneInstallsAsTheDaemonLeaves) {
     const fs::path home = at("/var/mobile");
-    struct Unmount {
-        fs::path path;
-        bool mounted;
-        ~Unmount() {
-            if (mounted) {
-                ::umount2(path.c_str(), MNT_DETACH);
-            }
-        }
-    } smallHome{home,
-                ::geteuid() == 0 && ::mount("tmpfs", home.c_str(), "tmpfs", 0, "size=72m") == 0};
+    const test::TmpfsMount smallHome(home, "size=72m");
     auto armInThreeDays = [&] {
         device().writeDaemonPreferences({{"EnableSupport", true},
                                          {"TavrixID", kBehaviorID},
@@ -490,18 +476,16 @@ TEST_F(DurabilityProtocolTest, PayloadUpdateAndResetWriteInTheDurableOrder) {
         },
         30s));
 
-    DurabilityCounts counts;
-    const std::vector<std::string> violations =
-        durabilityViolations(readText(trace()), ".tavrix-write-", {}, &counts);
-    for (const std::string& violation : violations) {
+    const DurabilityReport report = checkDurability(readText(trace()), ".tavrix-write-");
+    for (const std::string& violation : report.violations) {
         ADD_FAILURE() << violation;
     }
     // Enough was seen for the rules to mean something: both bundles, the preferences, the links.
-    EXPECT_GE(counts.renamesIntoPlace, 8);
-    EXPECT_GE(counts.linksReplaced, 4);
-    std::cout << "[ durability ] renames into place: " << counts.renamesIntoPlace
-              << "; links replaced: " << counts.linksReplaced << "; flushes: " << counts.flushes
-              << "; violations: " << violations.size() << "\n";
+    EXPECT_GE(report.renamesIntoPlace, 8);
+    EXPECT_GE(report.linksReplaced, 4);
+    std::cout << "[ durability ] renames into place: " << report.renamesIntoPlace
+              << "; links replaced: " << report.linksReplaced << "; flushes: " << report.flushes
+              << "; violations: " << report.violations.size() << "\n";
 }
 
 class OverTheAirKeepAliveTest : public OverTheAirUpdateTest {

@@ -60,11 +60,6 @@ except dbus.exceptions.DBusException as error:
 print(json.dumps([bool(answer[0]), bool(answer[1]), str(answer[2])])))",
                            busAddress(), id, how, file.string()});
     }
-    CommandResult tavrixctl(std::vector<std::string> arguments) {
-        arguments.insert(arguments.begin(), {TAVRIX_CTL_PATH, "--address=" + busAddress()});
-        return runCommand(arguments);
-    }
-
     // tavrixctl's answer with Python's expression applied to the parsed JSON as "answer"; the
     // exit status is tavrixctl's.
     CommandResult throughPython(const std::vector<std::string>& arguments,
