@@ -83,9 +83,7 @@ class BundleFlowTest : public BusFixture {
     }
 };
 
-// The main flow through tavrixctl: the first set installs, overlays, links and notifies once;
-// the same call again reports no change, posts nothing and leaves the links and the generated
-// file alone.
+// The first set installs, overlays, links and notifies once; the same call again changes nothing.
 TEST_F(BundleFlowTest, FirstSetLinksTheOverlaidCarrierFileAndRepeatingItChangesNothing) {
     device().writeDaemonPreferences({{"EnableSupport", true}});
     // Entries that name the bundle directory from outside (by "..", by an absolute path) are
@@ -192,11 +190,9 @@ TEST_F(BundleFlowTest, FirstSetLinksTheOverlaidCarrierFileAndRepeatingItChangesN
     EXPECT_EQ(broken.output, "True False True\n");
 }
 
-// A real directory where the bundle link belongs is left alone (answered, nothing posted) until it
-// is gone. Then only the behavior bit differs between an unlisted ID (the base carrier file) and a
-// listed one: an override switch, which relinks both ways. The device overlay file for this
-// hardware model is merged first and keeps the overlay section; a listed ID then overlays it, and
-// that file drops the section. (Two listed IDs are the comparison's unit test.)
+// A real directory where the bundle link belongs is left alone until it is gone. An unlisted and a
+// listed ID differ by the behavior bit only: an override switch. The device overlay keeps the
+// overlay section, and a listed ID's overlay built on it drops it.
 TEST_F(BundleFlowTest, OverlayChangesRelinkOnceTheBundleLinkCanBeMade) {
     auto caller = client();
     fs::create_directories(at(kBundleLink) / "keep");
@@ -241,10 +237,8 @@ TEST_F(BundleFlowTest, OverlayChangesRelinkOnceTheBundleLinkCanBeMade) {
     EXPECT_EQ(*both->find("Data"), plist::Value(plist::Dictionary{{"MaxRate", 1}}));
 }
 
-// A client's SetTavrixID with a multi-megabyte payload, the daemon killed at a random instant of
-// it: every next launch finds (or makes) one whole state: both links resolve, the carrier file is
-// in the linked bundle or the generated files and parses, the daemon preferences parse. The call
-// made again ends with the payload's bundle linked. Nothing of the interrupted calls stays.
+// Killed anywhere in a SetTavrixID with a large payload, the next launch finds (or makes) one
+// whole state, and the call made again links the payload; nothing of the interrupted calls stays.
 TEST_F(BundleFlowTest, KilledAnywhereInSetTavrixIDTheNextLaunchFindsOneWholeState) {
     writeBundle(at(kSystemBundle), "9", baseCarrierFile("Bundle 9"));
     // Two versions, each with a large file that does not compress and many small ones.
@@ -317,13 +311,10 @@ TEST_F(BundleFlowTest, KilledAnywhereInSetTavrixIDTheNextLaunchFindsOneWholeStat
               << "\n";
 }
 
-// Payloads chosen to hurt, sent to the real daemon. Whatever a payload holds, the call is
-// answered, the daemon stays small, every later call is answered, and so is every call to the
-// next launch (which redoes the bundle match from the stored ID, so a payload that stopped one
-// process would stop every one after it).
-// An idle daemon holds about 12 MB; a payload may cost working memory, never its expansion. Under
-// a sanitizer memory is shadowed (and freed memory held back in quarantine), so the bound there
-// only catches an expansion.
+// Payloads chosen to hurt leave the daemon answering and small, and its next launch too: that one
+// redoes the bundle match from the stored ID, so a payload that stopped one process would stop
+// every one after it. An idle daemon holds about 12 MB; under a sanitizer memory is shadowed, so
+// the bound there only catches an expansion.
 #if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
 constexpr long kMaxResidentKiB = 640 * 1024;
 #else
@@ -481,10 +472,8 @@ TEST_P(HostilePayloadTest, DaemonKeepsServingAndSoDoesItsNextLaunch) {
 
 using SmallFileSystemsTest = BusFixture;
 
-// A payload is checked against the room it needs before the bundle before it is touched: on a home
-// of 40 MiB a bundle still installs (the free-space reserve is a sixteenth of so small a file
-// system), one that would not fit is refused, and with /tmp full the payload cannot be staged;
-// either way the bundle before it stays linked. (Root only: the small file systems are mounted.)
+// On a home of 40 MiB a bundle still installs (the reserve is a sixteenth of so small a file
+// system); one that does not fit, or a full /tmp, keeps the bundle before it linked.
 TEST_F(SmallFileSystemsTest, PayloadsThatDoNotFitKeepTheBundleBeforeThem) {
     if (::geteuid() != 0) {
         GTEST_SKIP() << "needs root to mount small file systems";

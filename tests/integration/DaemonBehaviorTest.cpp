@@ -35,9 +35,8 @@ TEST_F(DaemonBehaviorTest, IdIsStoredLowerCasedWhetherOrNotSupportIsEnabled) {
     EXPECT_TRUE(caller.setTavrixID(id, std::vector<std::uint8_t>{}));
 }
 
-// An ID longer than the stored limit, or one that cannot be written (here a directory sits where
-// the preferences' lock file goes, as a full disk would fail it), is refused: the client hears NO,
-// and the stored ID is what the status view, the next call and the next launch see.
+// An ID longer than the limit, or one that cannot be written, is refused: the client hears NO, and
+// the stored ID is what the status view, the next call and the next launch see.
 TEST_F(DaemonBehaviorTest, IdsThatCannotBeStoredAreRefusedAndTheStoredOneStays) {
     device().writeDaemonPreferences({{"TavrixID", "abc"}, {"EnableSupport", true}});
     auto caller = client();
@@ -59,6 +58,7 @@ except dbus.DBusException as error:
               "can read: invalid UTF-8 or a Unicode noncharacter\n");
     EXPECT_EQ(device().daemonPreference("TavrixID"), std::optional<plist::Value>("abc"));
 
+    // A directory where the lock file goes fails the write, as a full disk would.
     const auto lock = at("/var/mobile/Library/Preferences/.com.zandor.tavrixservices.plist.lock");
     std::filesystem::remove(lock);
     test::writeText(lock / "in-the-way", "");
@@ -112,10 +112,8 @@ TEST_F(DaemonBehaviorTest, EnableSupportDecidesSupportOnceAnIdIsSetAndWithItTheS
     EXPECT_FALSE(caller.checkForTavrixBundleUpdate());
 }
 
-// The packaged bus policy, loaded by a bus that denies by default as the system bus does: anyone
-// may ask, only root and the policy's group may change the ID or start an update, and only the
-// daemon's user may own the name. Clients run as other users, so this needs root; they run
-// copies of tavrixctl and its library, since a private checkout is closed to other users.
+// The packaged bus policy on a bus that denies by default, as the system bus does. Clients run as
+// other users (root only), from copies of tavrixctl and its library that those users can reach.
 constexpr uid_t kNobody = 65534;
 // Stands in for the "tavrix" group, which the machine running the tests need not have.
 constexpr const char* kStandInGroup = "users";

@@ -39,9 +39,8 @@ class DaemonLifecycleTest : public BusFixture {
     }
 };
 
-// One wait for the launch transaction covers the whole cycle: activation, the start-up order,
-// staying for the transaction although idle exit is 1 s, and leaving with 0. (The next call
-// starting the next daemon is the burst test's.)
+// Activation, the start-up order, staying for the launch transaction although idle exit is 1 s,
+// and leaving with 0.
 TEST_F(DaemonLifecycleTest, StartsOnCallStaysForLaunchTransactionAndLeavesWhenIdle) {
     ASSERT_TRUE(watcher().nameOwner().empty());
     auto caller = client();
@@ -68,9 +67,8 @@ class DaemonActivityTest : public DaemonLifecycleTest {
     DaemonActivityTest() { idleExitSeconds = 2; }
 };
 
-// A client calling once a second, from before the launch transaction ends until well past it,
-// keeps the one daemon: the grace runs from the last call. Once the calls stop, it leaves. A
-// keep-alive flag left set by an earlier run is seen at start and cleared once started.
+// Calls once a second keep the one daemon past the launch transaction: the grace runs from the last
+// call. A keep-alive flag left set by an earlier run is seen at start and cleared once started.
 TEST_F(DaemonActivityTest, CallsOnceASecondKeepOneDaemonAlivePastTheGrace) {
     test::writeText(device().runtimeDirectory() / "keep-alive", "1");
     auto caller = client();
@@ -91,9 +89,8 @@ TEST_F(DaemonActivityTest, CallsOnceASecondKeepOneDaemonAlivePastTheGrace) {
     EXPECT_EQ(waitForDaemonExit(*pid), std::optional<int>(0));
 }
 
-// A daemon that cannot serve (no bus to reach, an instance lock that is a link or someone else's
-// file, or its name already owned on the bus) logs why and exits with a failure, so that the
-// service manager's restart policy acts.
+// A daemon that cannot serve logs why and exits with a failure, so that the service manager's
+// restart policy acts.
 TEST_F(DaemonLifecycleTest, DaemonThatCannotServeExitsWithAFailure) {
     // Runs the daemon on the bus at address: it must fail, saying why.
     auto expectFailure = [&](const std::string& address, const std::string& why) {
@@ -130,8 +127,7 @@ TEST_F(DaemonLifecycleTest, DaemonThatCannotServeExitsWithAFailure) {
     EXPECT_EQ(daemonLaunches().size(), 0u);
 }
 
-// Peers of the daemon: accepted on their first call, removed when they leave the bus. (Calls of
-// the wrong signature never reach the daemon's code: the bus library refuses them by the table.)
+// Peers are accepted on their first call and removed when they leave the bus.
 TEST_F(DaemonClientsTest, ClientsAreCountedInOnFirstCallAndOutWhenTheyLeave) {
     // Clients have no identifier the platform vouches for: nothing a caller chooses reaches the
     // log.
@@ -155,10 +151,8 @@ TEST_F(DaemonClientsTest, ClientsAreCountedInOnFirstCallAndOutWhenTheyLeave) {
               2);
 }
 
-// Calls from several clients while the daemon leaves and the bus starts the next one: every call
-// gets its answer, whichever daemon gives it. Calls keep a daemon from going idle, so it is told to
-// leave (SIGTERM, which leaves the way an idle exit does) while the clients call back to back; each
-// call's kind is chosen by turn, and a wrong answer or an error counts as lost.
+// Clients calling back to back while the daemon leaves (SIGTERM, as an idle exit leaves) and the
+// bus starts the next one: every call gets its answer, whichever daemon gives it.
 TEST_F(DaemonLifecycleTest, NoCallIsLostWhileTheDaemonLeaves) {
     constexpr int kClients = 8;
     constexpr int kCallsAfterRestart = 20;

@@ -1,11 +1,7 @@
 // The mobile home is hostile ground: every application runs as the mobile user. On a device root
-// laid out by the packaged users and directories snippets, with the daemon running as its own
-// user, a process of the mobile user attacks what the daemon installs, links and stores, once
-// before anything is installed and then over and over while a privileged client sets the
-// behavior ID with a bundle, the daemon relaunches and a signed update installs. Whatever it
-// does: the linked bundle is one the daemon installed, nothing the attacker supplied is written
-// by the daemon anywhere, the daemon's preferences hold what the client set, and the update
-// installs. Starting processes as other users needs root.
+// laid out by the packaged snippets, with the daemon as its own user, a mobile-user process
+// attacks what the daemon installs, links and stores, while a client sets a bundle, the daemon
+// relaunches and a signed update installs. Starting processes as other users needs root.
 #include <gmock/gmock.h>
 #include <pwd.h>
 #include <signal.h>
@@ -165,30 +161,6 @@ class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInter
         ASSERT_TRUE(client().setTavrixID("ACME.default", pack(bundle)));
     }
 
-    void relaunch() {
-        std::optional<pid_t> pid = daemonPid();
-        ASSERT_TRUE(pid);
-        ::kill(*pid, SIGTERM);
-        ASSERT_TRUE(waitForDaemonExit(*pid));
-        client().isTavrixBundleSupported();
-    }
-
-    // The device's configuration turns bundle support on, as root, keeping what is stored.
-    void enableSupport() {
-        auto stored = device().readDaemonPreferences();
-        plist::Dictionary values =
-            stored && stored->asDictionary() ? *stored->asDictionary() : plist::Dictionary();
-        values.insert_or_assign("EnableSupport", true);
-        device().writeDaemonPreferences(values);
-    }
-
-    // Version 13 published in a signed catalog on 127.0.0.1 that the device trusts.
-    void publishSignedUpdate() {
-        const fs::path bundle = device().base() / "bundles/13/Default.bundle";
-        writeBundle(bundle, "13", {{"CarrierName", "Bundle 13"}});
-        publishSigned(bundle);
-    }
-
     // Both links are the daemon's own and lead into the user bundle of this version.
     void expectLinked(const std::string& version) {
         EXPECT_EQ(linkedVersion(), version);
@@ -199,15 +171,6 @@ class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInter
             EXPECT_TRUE(S_ISLNK(info.st_mode)) << link;
             EXPECT_EQ(info.st_uid, daemon_.first) << link;
         }
-    }
-
-    // The daemon's preferences hold nothing of the attacker's: no support it did not get from the
-    // device's configuration, no update date of its choosing.
-    void expectNoPreferenceOfTheAttacker() {
-        EXPECT_EQ(device().daemonPreference("EnableSupport"), std::nullopt);
-        auto next = device().daemonPreference("NextUpdate");
-        EXPECT_TRUE(!next || (next->asDate() &&
-                              next->asDate()->secondsSinceReferenceDate < 2'000'000'000.0));
     }
 
     // Nothing the daemon owns carries the attacker's marks, and its state directory holds only
@@ -237,17 +200,6 @@ class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInter
         }
     }
 
-    void expectPreferencesOfTheClient() {
-        struct stat info {};
-        ASSERT_EQ(::lstat(at(kDaemonPreferences).c_str(), &info), 0);
-        EXPECT_TRUE(S_ISREG(info.st_mode));
-        EXPECT_TRUE(info.st_uid == daemon_.first || info.st_uid == 0);
-        EXPECT_EQ(device().daemonPreference("TavrixID"), std::optional<plist::Value>(kBehaviorID));
-        auto next = device().daemonPreference("NextUpdate");
-        ASSERT_TRUE(next && next->asDate());
-        EXPECT_LT(next->asDate()->secondsSinceReferenceDate, 2'000'000'000.0);
-    }
-
     std::pair<uid_t, gid_t> daemon_;
     std::pair<uid_t, gid_t> mobile_;
 };
@@ -261,7 +213,11 @@ TEST_P(MobileHomeAttackTest, TheDaemonInstallsAndTrustsOnlyItsOwn) {
     setIDWithBundle("12");
     const std::string payloadVersion = GetParam().blocksPayloads ? "10" : "12";
     expectLinked(payloadVersion);
-    expectNoPreferenceOfTheAttacker();
+    // No support the device's configuration did not give, no update date of the attacker's.
+    EXPECT_EQ(device().daemonPreference("EnableSupport"), std::nullopt);
+    auto next = device().daemonPreference("NextUpdate");
+    EXPECT_TRUE(!next ||
+                (next->asDate() && next->asDate()->secondsSinceReferenceDate < 2'000'000'000.0));
     if (GetParam().blocksPayloads) {
         const plist::Value status(client().status());
         const plist::Value* payload = status.find("LastPayload");
@@ -269,11 +225,23 @@ TEST_P(MobileHomeAttackTest, TheDaemonInstallsAndTrustsOnlyItsOwn) {
         EXPECT_THAT(*payload->find("Reason")->asString(), HasSubstr("could not be staged"));
     }
 
-    relaunch();
+    std::optional<pid_t> pid = daemonPid();
+    ASSERT_TRUE(pid);
+    ::kill(*pid, SIGTERM);
+    ASSERT_TRUE(waitForDaemonExit(*pid));
+    client().isTavrixBundleSupported();
     expectLinked(payloadVersion);
 
-    enableSupport();
-    publishSignedUpdate();
+    // The device's configuration turns support on, as root, keeping what is stored; version 13 is
+    // published in a catalog the device trusts.
+    auto stored = device().readDaemonPreferences();
+    plist::Dictionary values =
+        stored && stored->asDictionary() ? *stored->asDictionary() : plist::Dictionary();
+    values.insert_or_assign("EnableSupport", true);
+    device().writeDaemonPreferences(values);
+    const fs::path bundle = device().base() / "bundles/13/Default.bundle";
+    writeBundle(bundle, "13", {{"CarrierName", "Bundle 13"}});
+    publishSigned(bundle);
     client().checkForTavrixBundleUpdate();
     // The carrier file link follows the bundle link: both must have moved.
     EXPECT_TRUE(
@@ -281,7 +249,14 @@ TEST_P(MobileHomeAttackTest, TheDaemonInstallsAndTrustsOnlyItsOwn) {
     // What is left is judged once the attacker has stopped changing it.
     repeated.reset();
     expectLinked("13");
-    expectPreferencesOfTheClient();
+    struct stat info {};
+    ASSERT_EQ(::lstat(at(kDaemonPreferences).c_str(), &info), 0);
+    EXPECT_TRUE(S_ISREG(info.st_mode));
+    EXPECT_TRUE(info.st_uid == daemon_.first || info.st_uid == 0);
+    EXPECT_EQ(device().daemonPreference("TavrixID"), std::optional<plist::Value>(kBehaviorID));
+    next = device().daemonPreference("NextUpdate");
+    ASSERT_TRUE(next && next->asDate());
+    EXPECT_LT(next->asDate()->secondsSinceReferenceDate, 2'000'000'000.0);
     expectNothingWrittenForTheAttacker();
 }
 

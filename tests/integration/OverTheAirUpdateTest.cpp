@@ -66,17 +66,15 @@ class OverTheAirUpdateTest : public BusFixture {
         return directory;
     }
 
-    // Sets the behavior ID with the bundle of this version, packed as senders pack it.
     void setIDWithBundle(const std::string& version) {
         ASSERT_TRUE(client().setTavrixID(kBehaviorID, pack(writeBundle(version))));
     }
 
-    // Publishes the bundle of this version; answers the archive's URL path.
+    // Answers the archive's URL path.
     std::string publish(const std::string& version, std::size_t bulkBytes = 0) {
         return publishSigned(writeBundle(version, bulkBytes));
     }
 
-    // Every entry of the user bundle: directories, and files with their content.
     test::Tree userBundleFiles() { return test::snapshotTree(at(kUserBundle)); }
 
     // What the cache holds besides the kept catalog: downloads, staging and installed assets.
@@ -124,18 +122,15 @@ class OverTheAirUpdateTest : public BusFixture {
         return nlohmann::json::parse(run.output);
     }
 
-    // The reason tavrixctl check-update gives.
     std::string checkReason(int expectedStatus = 0) {
         return textAt(tavrixctlJson({"check-update"}, expectedStatus), "Reason");
     }
 
-    // The site serves this catalog and signature.
     void serveCatalog(const std::string& catalog, const std::string& signature) {
         writeText(site() / "catalog.plist", catalog);
         writeText(site() / "catalog.plist.sig", signature);
     }
 
-    // Each field at its path has this text (see textAt).
     static void expectFields(const nlohmann::json& answer,
                              const std::map<std::string, std::string>& fields) {
         for (const auto& [path, text] : fields) {
@@ -155,10 +150,8 @@ class OverTheAirUpdateTest : public BusFixture {
     test::LocalHttpServer& server = catalogServer();
 };
 
-// The operator's view after each step, as scripts read it: a payload; version 2 published and
-// installed (a second check while that one downloads starts nothing), linked, announced once, the
-// download purged and the next check 15 days on; a check that finds nothing newer; a refused
-// catalog (kept across the daemon's exit). (No catalog and a broken payload: the properties test.)
+// The operator's view after each step: a payload; an update (a second check meanwhile starts
+// nothing); nothing newer; a refused catalog, kept across the daemon's exit.
 TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
     // On the bus, each check's end comes after the properties that describe it.
     setIDWithBundle("1");
@@ -227,10 +220,8 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
                  {{"LastCheck.Outcome", "catalog-refused"}, {"LinkedBundle.Version", "2"}});
 }
 
-// A download that fails (the archive changed on the server) and a bundle larger than the free
-// space of the mobile home (refused before the old bundle is touched) leave the linked bundle and
-// its files as they were, post nothing and leave no download behind; the failed download re-arms
-// the check a day ahead, the failed install, like any install, fifteen days ahead.
+// A failed download re-arms the check a day ahead, a bundle too large for the mobile home fifteen
+// days ahead as any install; neither touches the linked bundle, posts or leaves a download.
 TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheNextOneInstallsAsTheDaemonLeaves) {
     const fs::path home = at("/var/mobile");
     const test::TmpfsMount smallHome(home, "size=72m");
@@ -303,10 +294,8 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheNextOneInstallsAsTh
     expectInstalled("4");
 }
 
-// The daemon killed at a random instant of an over-the-air update (download, copy, match, purge):
-// every next launch finds both links resolving to a whole bundle and a carrier file that parses,
-// and either completes the interrupted install from the cached download or, when the download had
-// not completed, the next check installs it. Nothing is left in the cache.
+// Killed anywhere in an update, the next launch finds whole links and either completes the install
+// from the cached download or the next check installs it; nothing is left in the cache.
 TEST_F(OverTheAirUpdateTest, KilledAnywhereInAnUpdateTheNextLaunchCompletesOrRedoesIt) {
     constexpr std::size_t kBulk = 2 << 20;
     constexpr const char* kPurged = "Best candidate asset has been purged";
@@ -366,10 +355,8 @@ TEST_F(OverTheAirUpdateTest, KilledAnywhereInAnUpdateTheNextLaunchCompletesOrRed
               << "\n";
 }
 
-// A daemon that is leaving while it still installs an update, and a new one activated meanwhile by
-// a payload, repeated: the old daemon installs the update before it ends (its last check says so),
-// the new one answers the payload only once the old one has ended, so every round ends with the
-// payload linked, whole, and a status view that says what the disk holds.
+// A daemon leaving while it installs an update finishes it; one activated meanwhile by a payload
+// acts only once the old one has ended, so the payload ends linked, whole and reported.
 TEST_F(OverTheAirUpdateTest, DaemonStartedWhileTheLastOneDrainsActsAfterIt) {
     constexpr std::size_t kBulk = 1 << 20;
     setIDWithBundle("1");
@@ -446,9 +433,7 @@ class DurabilityProtocolTest : public OverTheAirUpdateTest {
     fs::path trace() { return device().base() / "daemon.strace"; }
 };
 
-// A payload, an over-the-air update and a reset to a newer system bundle: every file renamed into
-// place was flushed first and its directory after, the links were replaced by rename, and nothing
-// final was written in place.
+// A payload, an over-the-air update and a reset to a newer system bundle.
 TEST_F(DurabilityProtocolTest, PayloadUpdateAndResetWriteInTheDurableOrder) {
     setIDWithBundle("1");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 10s));
@@ -493,12 +478,9 @@ class OverTheAirKeepAliveTest : public OverTheAirUpdateTest {
     OverTheAirKeepAliveTest() { idleExitSeconds = 1; }
 };
 
-// The scheduled check of a daemon that was started for it: while the catalog is slow to come,
-// its keep-alive transaction is open and each 15-second pass of the run loop says so, calls
-// coming meanwhile or not. The transaction ends with the download's first report, but the daemon
-// stays while the download runs, however long the server takes, installs the bundle, and leaves
-// when idle afterwards: the install ending on another thread wakes the run loop, rather than the
-// end of its pass.
+// A daemon started for its scheduled check stays while the catalog is slow (its keep-alive
+// transaction open, each 15-second pass saying so) and while the download runs after that
+// transaction ends; the install ending on another thread wakes the run loop, so it leaves at once.
 TEST_F(OverTheAirKeepAliveTest, ScheduledCheckKeepsTheDaemonUntilTheDownloadIsInstalled) {
     setIDWithBundle("1");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
@@ -572,12 +554,8 @@ TEST_F(OverTheAirKeepAliveTest, ScheduledCheckKeepsTheDaemonUntilTheDownloadIsIn
               1);
 }
 
-// The release train of docs/asset-catalog.md, run block by block as the document gives them, in
-// the operator's directory, against one device (bucket 37 for version 2 under the doc's serial):
-// held back at 5 %, installed once widened (without repacking); a refreshed catalog accepted and
-// the one it replaced refused; a device that fetched the catalog naming the next version just
-// before its withdrawal still installs it whole, while one asking afterwards never sees it; the
-// key rotated through a staged catalog and an external signer.
+// The release train of docs/asset-catalog.md, run block by block in the operator's directory
+// against one device (bucket 37 for version 2 under the doc's serial).
 class ReleaseTrainTest : public OverTheAirUpdateTest {
   protected:
     // The "# step:" blocks of the document's release train, by name, in order.

@@ -82,10 +82,8 @@ print(json.dumps([bool(answer[0]), bool(answer[1]), str(answer[2])])))",
     }
 };
 
-// Read before any set (which starts the daemon), then a bundle by descriptor: the properties and
-// GetAll agree with what PropertiesChanged announced; a broken payload is announced as such; a
-// descriptor that is neither a file nor a pipe is refused with one error; a check ends with its
-// signal after its properties.
+// Read before any set, then a bundle by descriptor: the properties and GetAll agree with what
+// PropertiesChanged announced; a check ends with its signal after its properties.
 TEST_F(StatusPropertiesTest, PropertiesAnnounceEachChangeAndTakeABundleByDescriptor) {
     CommandResult before = getProperties("BehaviorID Supported WhyNotSupported LastPayloadUSec");
     EXPECT_EQ(before.status, 0) << before.output;
