@@ -41,9 +41,6 @@ std::optional<Value> readFresh(const std::string& key, const std::string& domain
 
 class PreferencesStoreTest : public testing::Test {
   protected:
-    // Tests may share one device root when run in one process.
-    void SetUp() override { fs::remove_all(preferencesDirectory()); }
-
     CapturingLogSink sink;
     ScopedLogSink guard{sink};
     PreferencesStore store;

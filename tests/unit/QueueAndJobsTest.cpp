@@ -4,7 +4,6 @@
 #include <algorithm>
 #include <atomic>
 #include <chrono>
-#include <condition_variable>
 #include <filesystem>
 #include <future>
 #include <memory>
@@ -32,7 +31,7 @@ plist::Dictionary window(double start, double end) {
     return {{std::string(kJobWindowStartDate), start}, {std::string(kJobWindowEndDate), end}};
 }
 
-// Records each fire, and lets a test wait for one.
+// Records each fire: the names in order, the threads they ran on and the last job's criteria.
 class FiredJobs {
   public:
     BackgroundJobScheduler::Handler handler() {
@@ -41,31 +40,23 @@ class FiredJobs {
             names_.push_back(name);
             threads_.insert(std::this_thread::get_id());
             lastJob_ = job != nullptr ? *job : plist::Dictionary{};
-            fired_.notify_all();
         };
     }
     bool waitFor(const std::string& name) {
-        std::unique_lock lock(mutex_);
-        return fired_.wait_for(lock, 20s, [&] {
-            return std::find(names_.begin(), names_.end(), name) != names_.end();
-        });
+        return test::pollUntil([&] { return std::ranges::count(names(), name) > 0; }, 20s);
     }
-    std::vector<std::string> names() {
-        std::lock_guard lock(mutex_);
-        return names_;
-    }
-    std::set<std::thread::id> threads() {
-        std::lock_guard lock(mutex_);
-        return threads_;
-    }
-    plist::Dictionary lastJob() {
-        std::lock_guard lock(mutex_);
-        return lastJob_;
-    }
+    std::vector<std::string> names() { return locked(names_); }
+    std::set<std::thread::id> threads() { return locked(threads_); }
+    plist::Dictionary lastJob() { return locked(lastJob_); }
 
   private:
+    template <typename T>
+    T locked(const T& member) {
+        std::lock_guard lock(mutex_);
+        return member;
+    }
+
     std::mutex mutex_;
-    std::condition_variable fired_;
     std::vector<std::string> names_;
     std::set<std::thread::id> threads_;
     plist::Dictionary lastJob_;
