@@ -13,20 +13,20 @@
 namespace tavrix::bus {
 namespace {
 
-int refuse(int error, std::string& whyNot, std::string reason) {
-    whyNot = std::move(reason);
-    return error;
+using Bytes = std::vector<std::uint8_t>;
+
+Failure tooLarge(std::size_t limit) {
+    return {"the bundle is larger than " + std::to_string(limit) + " bytes"};
 }
 
-std::string tooLarge(std::size_t limit) {
-    return "the bundle is larger than " + std::to_string(limit) + " bytes";
+Failure cannotRead(const char* what, int error) {
+    return {std::string(what) + std::strerror(error)};
 }
 
 // From the start with pread, so that the client's offset neither matters nor moves.
-int readRegularFile(int fd, std::size_t size, std::size_t limit, std::vector<std::uint8_t>& bytes,
-                    std::string& whyNot) {
+Result<Bytes> readRegularFile(int fd, std::size_t size, std::size_t limit) {
     // One byte more than it claims tells a file that grew since fstat.
-    bytes.assign(size + 1, 0);
+    Bytes bytes(size + 1, 0);
     std::size_t filled = 0;
     while (filled < bytes.size()) {
         ssize_t got =
@@ -35,10 +35,7 @@ int readRegularFile(int fd, std::size_t size, std::size_t limit, std::vector<std
             continue;
         }
         if (got < 0) {
-            const int error = errno;
-            bytes.clear();
-            return refuse(error, whyNot,
-                          std::string("cannot read the bundle: ") + std::strerror(error));
+            return cannotRead("cannot read the bundle: ", errno);
         }
         if (got == 0) {
             break;
@@ -49,60 +46,52 @@ int readRegularFile(int fd, std::size_t size, std::size_t limit, std::vector<std
         }
     }
     if (filled > limit) {
-        bytes.clear();
-        return refuse(EFBIG, whyNot, tooLarge(limit));
+        return tooLarge(limit);
     }
     bytes.resize(filled);
-    return 0;
+    return bytes;
 }
 
 }  // namespace
 
-int readHandedPayload(int fd, std::size_t limit, std::vector<std::uint8_t>& bytes,
-                      std::string& whyNot) {
-    bytes.clear();
+Result<Bytes> readHandedPayload(int fd, std::size_t limit) {
     struct stat info {};
     if (::fstat(fd, &info) != 0) {
-        return refuse(errno, whyNot,
-                      std::string("cannot inspect the descriptor: ") + std::strerror(errno));
+        return cannotRead("cannot inspect the descriptor: ", errno);
     }
     const int flags = ::fcntl(fd, F_GETFL);
     if (flags < 0 || (flags & O_ACCMODE) == O_WRONLY) {
-        return refuse(EBADF, whyNot, "the descriptor is not open for reading");
+        return Failure{"the descriptor is not open for reading"};
     }
     if (S_ISREG(info.st_mode)) {
         if (info.st_size < 0 || static_cast<std::uint64_t>(info.st_size) > limit) {
-            return refuse(EFBIG, whyNot, tooLarge(limit));
+            return tooLarge(limit);
         }
-        return readRegularFile(fd, static_cast<std::size_t>(info.st_size), limit, bytes, whyNot);
+        return readRegularFile(fd, static_cast<std::size_t>(info.st_size), limit);
     }
     if (!S_ISFIFO(info.st_mode)) {
-        return refuse(EINVAL, whyNot, "the descriptor must be a regular file or a pipe");
+        return Failure{"the descriptor must be a regular file or a pipe"};
     }
     // A writer that never finishes must not hold the daemon: what the pipe holds is read without
     // waiting, and it must end there. The flag is the pipe's, shared with the client's copy,
     // which only ever writes.
     if ((flags & O_NONBLOCK) == 0 && ::fcntl(fd, F_SETFL, flags | O_NONBLOCK) != 0) {
-        return refuse(
-            errno, whyNot,
-            std::string("cannot read the pipe without blocking: ") + std::strerror(errno));
+        return cannotRead("cannot read the pipe without blocking: ", errno);
     }
     std::string text;
     const int error = io::readAll(fd, text, limit);
     if (error == EFBIG) {
-        return refuse(error, whyNot, tooLarge(limit));
+        return tooLarge(limit);
     }
     if (error == EAGAIN) {
-        return refuse(error, whyNot,
-                      "the pipe is still open for writing: write the whole bundle and close it "
-                      "before the call");
+        return Failure{
+            "the pipe is still open for writing: write the whole bundle and close it before the "
+            "call"};
     }
     if (error != 0) {
-        return refuse(error, whyNot,
-                      std::string("cannot read the bundle: ") + std::strerror(error));
+        return cannotRead("cannot read the bundle: ", error);
     }
-    bytes.assign(text.begin(), text.end());
-    return 0;
+    return Bytes(text.begin(), text.end());
 }
 
 }  // namespace tavrix::bus

@@ -6,18 +6,17 @@
 
 #include <cstddef>
 #include <cstdint>
-#include <string>
 #include <vector>
+
+#include "base/Result.h"
 
 namespace tavrix::bus {
 
 // The largest message sd-bus takes, so that a bundle that fits one way fits the other.
 inline constexpr std::size_t kMaxHandedPayloadBytes = 128u << 20;
 
-// Reads fd into bytes. 0, or an errno with whyNot saying in one line what was refused: not a
-// regular file or pipe, not open for reading, more than limit bytes, a pipe still open for
-// writing, or a failed read.
-int readHandedPayload(int fd, std::size_t limit, std::vector<std::uint8_t>& bytes,
-                      std::string& whyNot);
+// The bytes fd holds, or what was refused: not a regular file or pipe, not open for reading,
+// more than limit bytes, a pipe still open for writing, or a failed read.
+Result<std::vector<std::uint8_t>> readHandedPayload(int fd, std::size_t limit);
 
 }  // namespace tavrix::bus

@@ -15,9 +15,11 @@
 #include "daemon/TXManagerServer.h"
 #include "daemon/UpdateCheckScheduler.h"
 #include "device/BuildCapabilities.h"
+#include "device/HomeDirectories.h"
 #include "device/MobileUser.h"
 #include "device/PreferencesStore.h"
 #include "device/TXUtility.h"
+#include "update/AssetHandler.h"
 #include "util/SharedInstance.h"
 
 namespace tavrix {
@@ -44,6 +46,7 @@ class Daemon {
     SharedInstance<TXUtility::StringFacts> deviceStrings_;
     SharedInstance<device::BuildCapabilities::Facts> build_;
     SharedInstance<device::MobileUser::Facts> mobileUser_;
+    SharedInstance<device::DistrustedPaths> distrustedPaths_;
     SharedInstance<BundleLocations> bundleLocations_;
     SharedInstance<device::PreferencesStore> preferences_;
     SharedInstance<bus::ServiceManager> serviceManager_;
@@ -53,6 +56,7 @@ class Daemon {
     SharedInstance<TXUtility::TaskQueue> tasks_;
     SharedInstance<BundleManager> bundles_;
     SharedInstance<TXManager> manager_;
+    SharedInstance<AssetHandler::CheckState> updateCheck_;
     SharedInstance<catalog::AssetCatalogService> catalog_;
     SharedInstance<UpdateCheckScheduler> scheduler_;
 };

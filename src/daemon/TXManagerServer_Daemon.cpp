@@ -126,17 +126,16 @@ int handleSetTavrixIDWithBundleFD(sd_bus_message* message, void* userdata, sd_bu
     if (r < 0) {
         return invalidArgument(error, r, "behavior ID");
     }
-    plist::Data bundle;
-    std::string whyNot;
-    if (bus::readHandedPayload(fd, bus::kMaxHandedPayloadBytes, bundle, whyNot) != 0) {
+    Result<plist::Data> bundle = bus::readHandedPayload(fd, bus::kMaxHandedPayloadBytes);
+    if (!bundle) {
         return sd_bus_error_setf(error, SD_BUS_ERROR_INVALID_ARGS, "Bundle refused: %s",
-                                 whyNot.c_str());
+                                 bundle.reason().c_str());
     }
     bool accepted = false;
     PayloadOutcome payload{false, "the request failed"};
     {
         MessageScope scope(server, message);
-        server.setTavrixIDWithBundle(tavrixID, bundle,
+        server.setTavrixIDWithBundle(tavrixID, *bundle,
                                      [&](bool wasAccepted, const PayloadOutcome& outcome) {
                                          accepted = wasAccepted;
                                          payload = outcome;

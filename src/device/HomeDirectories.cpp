@@ -7,13 +7,12 @@
 
 #include <cerrno>
 #include <cstring>
-#include <mutex>
-#include <set>
 #include <string_view>
 #include <utility>
 
 #include "device/MobileUser.h"
 #include "util/Log.h"
+#include "util/SharedInstance.h"
 
 namespace tavrix::device {
 namespace {
@@ -84,14 +83,16 @@ std::optional<io::Directory> openProtectedChild(const io::Directory& parent,
 
 }  // namespace
 
+bool DistrustedPaths::addFirst(const std::string& path, const std::string& reason) {
+    std::lock_guard lock(mutex_);
+    return logged_.emplace(path, reason).second;
+}
+
 void logDistrustOnce(const std::string& path, const std::string& reason) {
-    static std::mutex mutex;
-    static std::set<std::pair<std::string, std::string>> logged;
-    {
-        std::lock_guard lock(mutex);
-        if (!logged.emplace(path, reason).second) {
-            return;
-        }
+    auto& distrusted = SharedInstance<DistrustedPaths>::current().instance(
+        [] { return std::make_unique<DistrustedPaths>(); });
+    if (!distrusted.addFirst(path, reason)) {
+        return;
     }
     logCFormat("Not trusting %s: %s; treating it as absent\n", path.c_str(), reason.c_str());
 }

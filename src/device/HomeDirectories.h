@@ -5,8 +5,11 @@
 // redirect anything the daemon keeps below it. What fails is logged once and treated as absent.
 #pragma once
 
+#include <mutex>
 #include <optional>
+#include <set>
 #include <string>
+#include <utility>
 
 #include "io/Directory.h"
 
@@ -24,8 +27,20 @@ std::optional<io::Directory> openDirectoryInHome(const std::string& home,
 std::optional<io::Directory> openMobileHomeDirectory(const std::string& directoryPath,
                                                      bool createMissing);
 
+// The paths distrusted so far, each with its reason: one per daemon root, so that a path is
+// reported once for the daemon's life however often it is looked at.
+class DistrustedPaths {
+  public:
+    // True the first time this path is distrusted for this reason.
+    bool addFirst(const std::string& path, const std::string& reason);
+
+  private:
+    std::mutex mutex_;
+    std::set<std::pair<std::string, std::string>> logged_;
+};
+
 // Logs "Not trusting <path>: <reason>; treating it as absent" the first time this path is
-// distrusted for this reason in the process.
+// distrusted for this reason.
 void logDistrustOnce(const std::string& path, const std::string& reason);
 
 }  // namespace tavrix::device

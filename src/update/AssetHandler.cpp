@@ -20,6 +20,7 @@
 #include "util/FileSystemHelper.h"
 #include "util/FileSystemUtilities.h"
 #include "util/Log.h"
+#include "util/SharedInstance.h"
 #include "util/SystemLog.h"
 
 namespace tavrix {
@@ -208,7 +209,9 @@ AssetHandler::AssetPtr AssetHandler::findTheBestAsset(catalog::QueryResult* resu
 bool AssetHandler::downloadUpdateIfAvailable(EndCheck endCheck) {
     // Two checks would download into and purge the same cache directory, and install over each
     // other. Held until the check's download has been installed and purged.
-    static std::atomic<bool> checkRunning{false};
+    std::atomic<bool>& checkRunning = SharedInstance<CheckState>::current()
+                                          .instance([] { return std::make_unique<CheckState>(); })
+                                          .running;
     bool idle = false;
     if (!checkRunning.compare_exchange_strong(idle, true)) {
         logCFormat("An update check is already running, not starting another\n");

@@ -1,5 +1,6 @@
 // Finds, downloads and installs newer behavior bundles from the asset catalog. Class members
-// only; a download's state lives in its progress handler.
+// only; a download's state lives in its progress handler, and whether a check runs in the
+// daemon root.
 #pragma once
 
 #include <atomic>
@@ -30,6 +31,12 @@ class AssetHandler {
     AssetHandler() = delete;
 
     using AssetPtr = std::shared_ptr<catalog::Asset>;
+
+    // Whether an update check is running, from its start until its download is installed and
+    // purged. One per daemon root, made before the catalog service and so ending after it.
+    struct CheckState {
+        std::atomic<bool> running{false};
+    };
 
     // Every asset of the bundle type the catalog lists (asking its server), or nothing when the
     // query failed; result, when given, says how the query went.

@@ -29,12 +29,6 @@ using plist::Value;
 // locations and the two links.
 class BundleDevice : public ::testing::Test {
   protected:
-    void SetUp() override {
-        // Posting must never reach a bus outside the test.
-        ::setenv("DBUS_SYSTEM_BUS_ADDRESS", ("unix:path=" + root() + "/no-bus").c_str(), 1);
-        ::unsetenv("DBUS_STARTER_ADDRESS");
-    }
-
     static std::string root() { return test::unitTestRoot().string(); }
     static std::string home() { return root() + "/var/mobile"; }
     static std::string systemBundle() {

@@ -244,7 +244,7 @@ TEST(TXUtilityDiskSpace, NeedsStrictlyMoreFreeBytesThanAskedOnTheHomeFileSystem)
     // The home's own file system is asked; a home that cannot be asked answers NO.
     EXPECT_TRUE(TXUtility::hasEnoughDiskSpace(0));
     EXPECT_FALSE(TXUtility::hasEnoughDiskSpace(UINT64_MAX));
-    ::setenv("HOME", "/nonexistent/tavrix-home", 1);  // the test has a process of its own
+    ScopedEnvironment home("HOME", "/nonexistent/tavrix-home");
     EXPECT_FALSE(TXUtility::hasEnoughDiskSpace(0));
 }
 
@@ -265,12 +265,12 @@ TEST(TXUtilityFiles, URLIfFileExistsAnswersExistingPathsOnly) {
 class CalendarInZone : public testing::Test {
   protected:
     bool useZone(const char* zone) {
-        ::setenv("TZ", zone, 1);
+        zone_.emplace("TZ", zone);
         ::tzset();
         return std::filesystem::exists(std::string("/usr/share/zoneinfo/") + zone);
     }
     void TearDown() override {
-        saved_ ? ::setenv("TZ", saved_->c_str(), 1) : ::unsetenv("TZ");
+        zone_.reset();
         ::tzset();
     }
 
@@ -286,8 +286,7 @@ class CalendarInZone : public testing::Test {
     }
 
   private:
-    const char* tz_ = std::getenv("TZ");
-    std::optional<std::string> saved_ = tz_ ? std::optional<std::string>(tz_) : std::nullopt;
+    std::optional<ScopedEnvironment> zone_;
 };
 
 TEST_F(CalendarInZone, DaysFollowTheWallClockAcrossDaylightSaving) {

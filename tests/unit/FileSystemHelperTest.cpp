@@ -327,6 +327,7 @@ void* failingAllocate(std::size_t) {
 // The caller's buffer is used only when the string and its NUL fit; a failed allocation answers
 // the buffer emptied, or nothing, with length 0.
 TEST(FileSystemUtilities, CopyCStringFromString) {
+    allocations = 0;
     CStringAllocator allocator{countingAllocate, std::free};
     char buffer[6];
     std::size_t length = sizeof buffer;

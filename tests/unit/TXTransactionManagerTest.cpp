@@ -12,19 +12,13 @@
 namespace tavrix {
 namespace {
 
-// Each test runs in a process of its own, so the service manager binding is created here, with the
-// keep-alive flag under the test's device root.
+// The keep-alive flag is where it is without a service manager: under the device root.
 class TXTransactionManagerTest : public testing::Test {
   protected:
-    void SetUp() override {
-        runtime_ = (test::unitTestRoot() / "run/tavrixservicesd").string();
-        ::setenv("RUNTIME_DIRECTORY", runtime_.c_str(), 1);
-    }
-
     std::string flag() const { return test::readText(runtime_ + "/keep-alive"); }
     bus::ServiceManager& serviceManager() { return bus::ServiceManager::shared(); }
 
-    std::string runtime_;
+    const std::string runtime_ = (test::unitTestRoot() / "run/tavrixservicesd").string();
     CapturingLogSink log_;
     ScopedLogSink guard_{log_};
 };

@@ -6,11 +6,13 @@
 #include <cstdlib>
 #include <functional>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <thread>
 #include <vector>
 
 #include "PrivateBus.h"
+#include "TestDoubles.h"
 #include "client/TavrixClient.h"
 
 namespace tavrix::client {
@@ -112,11 +114,12 @@ TEST(TavrixClient, ConnectingWhereNothingListensNamesTheProblem) {
     test::PrivateBus bus;
     EXPECT_THAT(failureOf([&] { TavrixClient::connectToAddress(bus.deadAddress()); }),
                 HasSubstr("cannot connect to " + bus.deadAddress() + ": No such file"));
-    ::setenv("DBUS_SYSTEM_BUS_ADDRESS", bus.deadAddress().c_str(), 1);
+    std::optional<ScopedEnvironment> systemBus(std::in_place, "DBUS_SYSTEM_BUS_ADDRESS",
+                                               bus.deadAddress().c_str());
     EXPECT_THAT(failureOf([] { TavrixClient::connectToSystemBus(); }),
                 HasSubstr("cannot connect to the system bus: No such file"));
     // And the system bus is the one the variable names.
-    ::setenv("DBUS_SYSTEM_BUS_ADDRESS", bus.address().c_str(), 1);
+    systemBus.emplace("DBUS_SYSTEM_BUS_ADDRESS", bus.address().c_str());
     EXPECT_NO_THROW(TavrixClient::connectToSystemBus());
 }
 

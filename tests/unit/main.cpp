@@ -78,6 +78,12 @@ class RootEnvironment : public testing::Environment {
 
 int main(int argc, char** argv) {
     ::setenv("TAVRIX_ROOT", tavrix::test::unitTestRoot().c_str(), 1);
+    // Nothing reaches a bus or a proxy outside the tests: a test that wants a bus brings its own.
+    ::setenv("DBUS_SYSTEM_BUS_ADDRESS", "unix:path=/nonexistent/tavrix-unit-tests", 1);
+    ::unsetenv("DBUS_STARTER_ADDRESS");
+    ::unsetenv("RUNTIME_DIRECTORY");
+    ::setenv("no_proxy", "127.0.0.1", 1);
+    ::setenv("NO_PROXY", "127.0.0.1", 1);
     testing::InitGoogleTest(&argc, argv);
     testing::AddGlobalTestEnvironment(new tavrix::test::RootEnvironment);
     testing::UnitTest::GetInstance()->listeners().Append(new tavrix::test::RootPerTest);
