@@ -57,8 +57,6 @@ class ServiceManager {
     void notifyStatus(const std::string& status);
     void notifyStopping();
 
-    const std::string& keepAlivePath() const { return keepAlivePath_; }
-
     enum class InstanceLock { Held, HeldByAnother, Unusable };
     // Takes the instance lock without waiting; once Held, every later call answers Held.
     // Unusable (logged) when the lock file cannot be opened or is not a regular file of the

@@ -97,10 +97,6 @@ bool SerialQueue::shutdown(std::optional<std::chrono::milliseconds> patience) {
     return true;
 }
 
-const std::string& SerialQueue::label() const {
-    return state_->label;
-}
-
 bool SerialQueue::isCurrent() const {
     std::lock_guard lock(state_->mutex);
     return state_->workerId == std::this_thread::get_id();

@@ -14,7 +14,7 @@ namespace tavrix {
 class SerialQueue {
   public:
     // Starts the worker thread. Its system name is the label cut to 15 characters (the kernel's
-    // limit); label() keeps the whole of it.
+    // limit); log lines give the whole of it.
     explicit SerialQueue(std::string label);
     // Stops accepting tasks, runs those already queued and joins the worker. Called from a task
     // on this queue, it cannot wait for itself: the worker is then detached and finishes the
@@ -22,8 +22,6 @@ class SerialQueue {
     ~SerialQueue();
     SerialQueue(const SerialQueue&) = delete;
     SerialQueue& operator=(const SerialQueue&) = delete;
-
-    const std::string& label() const;
 
     // What the destructor does, ahead of it: refuses new tasks, lets the queued ones run and joins
     // the worker. With patience, gives up (false, logged) when the worker is still busy by then,
