@@ -2,7 +2,6 @@
 // clock shifted ahead so that a schedule days away can be reached without waiting.
 #pragma once
 
-#include <algorithm>
 #include <mutex>
 #include <string>
 #include <string_view>
@@ -28,10 +27,6 @@ class CapturingLogSink : public LogSink {
     std::vector<int> priorities() const {
         std::lock_guard lock(mutex_);
         return priorities_;
-    }
-    bool contains(std::string_view message) const {
-        std::lock_guard lock(mutex_);
-        return std::find(messages_.begin(), messages_.end(), message) != messages_.end();
     }
     void clear() {
         std::lock_guard lock(mutex_);

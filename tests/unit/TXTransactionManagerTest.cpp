@@ -1,6 +1,5 @@
 #include <gtest/gtest.h>
 
-#include <cstdlib>
 #include <filesystem>
 
 #include "TestDoubles.h"
@@ -12,19 +11,13 @@
 namespace tavrix {
 namespace {
 
-// Each test runs in a process of its own, so the service manager binding is created here, with the
-// keep-alive flag under the test's device root.
+// The service manager is the test's own, its keep-alive flag under the test's device root.
 class TXTransactionManagerTest : public testing::Test {
   protected:
-    void SetUp() override {
-        runtime_ = (test::unitTestRoot() / "run/tavrixservicesd").string();
-        ::setenv("RUNTIME_DIRECTORY", runtime_.c_str(), 1);
-    }
-
-    std::string flag() const { return test::readText(runtime_ + "/keep-alive"); }
+    std::string flag() const { return test::readText(flagPath); }
     bus::ServiceManager& serviceManager() { return bus::ServiceManager::shared(); }
 
-    std::string runtime_;
+    const std::string flagPath = (test::unitTestRoot() / "run/tavrixservicesd/keep-alive").string();
     CapturingLogSink log_;
     ScopedLogSink guard_{log_};
 };
@@ -48,7 +41,7 @@ TEST_F(TXTransactionManagerTest, NamesAreCountedOnce) {
 TEST_F(TXTransactionManagerTest, KeepAliveFollowsKeepAliveTransactionsWhenClearable) {
     TXTransactionManager transactions;
     transactions.clearKeepAliveIfNecessary(true);  // no flag yet: already clear
-    EXPECT_FALSE(std::filesystem::exists(runtime_ + "/keep-alive"));
+    EXPECT_FALSE(std::filesystem::exists(flagPath));
     transactions.beginTransaction("Update Check", true);
     EXPECT_EQ(flag(), "1\n");
     EXPECT_TRUE(transactions.isKeepAliveEnabled());
@@ -80,12 +73,12 @@ TEST_F(TXTransactionManagerTest, KeepAliveFollowsKeepAliveTransactionsWhenCleara
 // A flag that cannot be read counts as enabled, so the daemon stays rather than leaving early.
 TEST_F(TXTransactionManagerTest, UnreadableFlagCountsAsEnabled) {
     // A directory where the flag file should be: it can be neither read nor replaced.
-    std::filesystem::create_directories(runtime_ + "/keep-alive");
+    std::filesystem::create_directories(flagPath);
     TXTransactionManager transactions;
     EXPECT_TRUE(transactions.isKeepAliveEnabled());
     EXPECT_FALSE(serviceManager().isIdle());
     transactions.clearKeepAliveIfNecessary(true);
-    EXPECT_TRUE(std::filesystem::is_directory(runtime_ + "/keep-alive"));
+    EXPECT_TRUE(std::filesystem::is_directory(flagPath));
 }
 
 }  // namespace

@@ -78,6 +78,7 @@ class RootEnvironment : public testing::Environment {
 
 int main(int argc, char** argv) {
     ::setenv("TAVRIX_ROOT", tavrix::test::unitTestRoot().c_str(), 1);
+    ::unsetenv("RUNTIME_DIRECTORY");  // so that the keep-alive flag lies under the root too
     testing::InitGoogleTest(&argc, argv);
     testing::AddGlobalTestEnvironment(new tavrix::test::RootEnvironment);
     testing::UnitTest::GetInstance()->listeners().Append(new tavrix::test::RootPerTest);
