@@ -5,7 +5,6 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <cstddef>
 #include <cstdint>
 #include <cstdlib>
@@ -18,25 +17,12 @@
 #include "FuzzSupport.h"
 #include "TestSupport.h"
 #include "payload/PayloadUnpack.h"
+#include "util/FileSystemUtilities.h"
 
 namespace {
 
 namespace fs = std::filesystem;
 using tavrix::fuzz::require;
-
-// Undoes what an entry may have set that would stop its removal: directories without search or
-// write permission. (Path-safe extraction restores no file flags.)
-void makeRemovable(const fs::path& path) {
-    struct stat info {};
-    if (::lstat(path.c_str(), &info) != 0 || !S_ISDIR(info.st_mode)) {
-        return;
-    }
-    ::chmod(path.c_str(), 0700);
-    std::error_code error;
-    for (fs::directory_iterator it(path, error), end; !error && it != end; it.increment(error)) {
-        makeRemovable(it->path());
-    }
-}
 
 // Small enough that bombs are cut quickly, large enough for every seed to extract.
 constexpr tavrix::payload::ExtractionLimits kLimits{4u << 20, 200, 0, true};
@@ -63,11 +49,7 @@ Contents inspect(const fs::path& destination) {
         } else if (S_ISLNK(info.st_mode)) {
             std::error_code unresolved;
             fs::path target = fs::canonical(it->path(), unresolved);
-            if (!unresolved) {
-                auto [end, at] =
-                    std::mismatch(inside.begin(), inside.end(), target.begin(), target.end());
-                require(end == inside.end());
-            }
+            require(unresolved || *target.lexically_relative(inside).begin() != "..");
         }
     }
     return contents;
@@ -108,13 +90,12 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     const fs::path bait = work / "bait";
     static const bool baited = std::ofstream(bait).good();
     (void)baited;
-    {
-        std::ofstream out(archivePath, std::ofstream::binary | std::ofstream::trunc);
-        out.write(reinterpret_cast<const char*>(data), static_cast<std::streamsize>(size));
-    }
+    tavrix::test::writeText(archivePath, std::string(reinterpret_cast<const char*>(data), size));
     tavrix::payload::extractArchive(archivePath, destination,
                                     tavrix::payload::ExtractionSafety::PathSafe, kLimits);
-    makeRemovable(destination);
+    // Directories an entry left without search or write permission are opened up first, so
+    // that all of it is counted and removed. (Path-safe extraction restores no file flags.)
+    tavrix::makeDirectoriesWritable(destination);
     Contents contents = inspect(destination);
     require(contents.bytes <= kLimits.maxExpandedBytes && contents.objects <= kLimits.maxEntries);
     std::error_code error;

@@ -16,15 +16,11 @@
 
 namespace {
 
-struct NodeDeleter {
-    void operator()(void* node) const { plist_free(node); }
-};
-
 // libplist's own tree of bytes that passed the bounds check, measured without recursion.
 void checkTreeWithinBounds(std::string_view bytes) {
     plist_t raw = nullptr;
     plist_from_memory(bytes.data(), static_cast<uint32_t>(bytes.size()), &raw);
-    std::unique_ptr<void, NodeDeleter> root(raw);
+    std::unique_ptr<void, decltype(&plist_free)> root(raw, &plist_free);
     if (!root) {
         return;
     }

@@ -191,8 +191,6 @@ class BusFixture : public ::testing::Test {
     client::TavrixClient client() const {
         return client::TavrixClient::connectToAddress(busAddress());
     }
-    // A plain bus connection, for calls the client library would not make.
-    bus::BusPtr rawConnection() const { return bus_->connect(); }
     CommandResult tavrixctl(std::vector<std::string> arguments) const {
         arguments.insert(arguments.begin(), {TAVRIX_CTL_PATH, "--address", busAddress()});
         return runCommand(arguments);

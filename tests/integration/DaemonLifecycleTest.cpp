@@ -120,7 +120,7 @@ TEST_F(DaemonLifecycleTest, DaemonThatCannotServeExitsWithAFailure) {
         std::filesystem::remove(lock);
     }
 
-    auto squatter = rawConnection();
+    auto squatter = test::connectToBus(busAddress());
     ASSERT_GE(sd_bus_request_name(squatter.get(), kDaemonBusName, 0), 0);
     expectFailure(busAddress(),
                   "The name com.zandor.tavrixservicesd is owned by another process on the bus");

@@ -6,12 +6,12 @@
 #include <pwd.h>
 #include <signal.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <cstdio>
 #include <filesystem>
 #include <memory>
+#include <thread>
 
 #include "BusFixture.h"
 #include "TestSupport.h"
@@ -51,33 +51,11 @@ std::pair<uid_t, gid_t> userIn(const fs::path& database, const std::string& name
     throw std::runtime_error("no user " + name + " in " + database.string());
 }
 
-// The attack repeated in a loop of its own until the object goes.
-class RepeatedAttack {
-  public:
-    explicit RepeatedAttack(const std::vector<std::string>& argv) {
-        pid_ = ::fork();
-        if (pid_ == 0) {
-            ::setpgid(0, 0);
-            std::vector<char*> words;
-            for (const std::string& word : argv) {
-                words.push_back(const_cast<char*>(word.c_str()));
-            }
-            words.push_back(nullptr);
-            ::execv(words[0], words.data());
-            ::_exit(127);
-        }
-    }
-    ~RepeatedAttack() {
-        if (pid_ > 0) {
-            ::kill(pid_, SIGKILL);
-            ::waitpid(pid_, nullptr, 0);
-        }
-    }
-    RepeatedAttack(const RepeatedAttack&) = delete;
-    RepeatedAttack& operator=(const RepeatedAttack&) = delete;
-
-  private:
-    pid_t pid_ = -1;
+// The attack repeated on a thread of its own until the object goes.
+struct RepeatedAttack {
+    ~RepeatedAttack() { test::writeText(stop, ""); }  // before the thread is joined
+    fs::path stop;  // the attack's loop ends once this file exists
+    std::jthread loop;
 };
 
 class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInterface<Attack> {
@@ -146,13 +124,15 @@ class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInter
         ASSERT_EQ(opened.status, 0) << opened.output;
     }
 
-    std::vector<std::string> attackCommand(bool repeat) {
-        std::string script =
-            std::string("H='") + at("/var/mobile").string() + "' STATE='" +
-            at("/var/lib/tavrixservicesd").string() + "' T='" + at("/tmp").string() + "' EVIL='" +
-            (device().base() / "evil").string() + "'; " + (repeat ? "while :; do " : "") +
-            GetParam().script + (repeat ? "; sleep 0.05; done" : "");
-        return asUser(mobile_, {"/bin/sh", "-c", "exec 2>/dev/null; " + script});
+    // Once, or repeated until the file stop exists.
+    CommandResult attack(const std::optional<fs::path>& stop = std::nullopt) {
+        std::string script = std::string("H='") + at("/var/mobile").string() + "' STATE='" +
+                             at("/var/lib/tavrixservicesd").string() + "' T='" +
+                             at("/tmp").string() + "' EVIL='" +
+                             (device().base() / "evil").string() + "'; " +
+                             (stop ? "while [ ! -e '" + stop->string() + "' ]; do " : "") +
+                             GetParam().script + (stop ? "; sleep 0.05; done" : "");
+        return runCommand(asUser(mobile_, {"/bin/sh", "-c", "exec 2>/dev/null; " + script}));
     }
 
     void setIDWithBundle(const std::string& version) {
@@ -205,9 +185,10 @@ class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInter
 };
 
 TEST_P(MobileHomeAttackTest, TheDaemonInstallsAndTrustsOnlyItsOwn) {
-    CommandResult first = runCommand(attackCommand(false));
-    (void)first;  // each attack is expected to fail in part
-    std::optional<RepeatedAttack> repeated(std::in_place, attackCommand(true));
+    attack();  // each attack is expected to fail in part
+    const fs::path stop = device().base() / "evil/stop";
+    auto repeated =
+        std::make_unique<RepeatedAttack>(stop, std::jthread([this, stop] { attack(stop); }));
 
     setIDWithBundle("11");
     setIDWithBundle("12");

@@ -491,11 +491,10 @@ TEST_F(OverTheAirKeepAliveTest, ScheduledCheckKeepsTheDaemonUntilTheDownloadIsIn
 
     const std::string archive = publish("2");
     holdPublished(archive, 1.0 / 3);
-    test::LocalHttpServer::Response slowCatalog;
-    slowCatalog.body = readText(site() / "catalog.plist");
+    const std::string catalog = readText(site() / "catalog.plist");
     // About 18 s: past the first pass of the run loop.
-    slowCatalog.trickleBytesPerSecond = slowCatalog.body.size() / 18 + 1;
-    server.serve("/updates/catalog.plist", slowCatalog);
+    server.serve("/updates/catalog.plist",
+                 {.body = catalog, .trickleBytesPerSecond = catalog.size() / 18 + 1});
     std::optional<plist::Value> settings =
         plist::readFile(at("/etc/tavrix/AssetCatalog.plist").string());
     ASSERT_TRUE(settings);

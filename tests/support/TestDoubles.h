@@ -5,7 +5,6 @@
 
 #include <stdlib.h>
 
-#include <algorithm>
 #include <mutex>
 #include <optional>
 #include <string>
@@ -32,10 +31,6 @@ class CapturingLogSink : public LogSink {
     std::vector<int> priorities() const {
         std::lock_guard lock(mutex_);
         return priorities_;
-    }
-    bool contains(std::string_view message) const {
-        std::lock_guard lock(mutex_);
-        return std::find(messages_.begin(), messages_.end(), message) != messages_.end();
     }
     void clear() {
         std::lock_guard lock(mutex_);

@@ -18,7 +18,7 @@
 namespace tavrix::test {
 
 enum class Container { Tar, Cpio };
-enum class Compression { Gzip, Compress, Bzip2 };
+enum class Compression { Gzip, Compress };
 
 struct ArchiveItem {
     enum class Kind { File, Directory, Symlink, Hardlink, Fifo };
@@ -65,9 +65,6 @@ inline std::string buildArchive(Container container, Compression compression,
             break;
         case Compression::Compress:
             archive_write_add_filter_compress(handle);
-            break;
-        case Compression::Bzip2:
-            archive_write_add_filter_bzip2(handle);
             break;
     }
     std::string bytes;

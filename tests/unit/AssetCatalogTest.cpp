@@ -42,21 +42,6 @@ constexpr auto kPatience = std::chrono::seconds(60);
 
 using Assets = std::vector<std::shared_ptr<Asset>>;
 
-LocalHttpServer::Response bodyResponse(std::string body,
-                                       std::optional<std::size_t> cutAfter = std::nullopt) {
-    LocalHttpServer::Response response;
-    response.body = std::move(body);
-    response.cutAfterBodyBytes = cutAfter;
-    return response;
-}
-
-LocalHttpServer::Response statusResponse(int status, std::string reason) {
-    LocalHttpServer::Response response;
-    response.status = status;
-    response.reason = std::move(reason);
-    return response;
-}
-
 // The reports a download handler receives: each operation, and the bytes of each "Downloading".
 struct ProgressLog {
     // The operations received until a completed or failed one, in order.
@@ -168,9 +153,9 @@ class AssetCatalogTest : public testing::Test {
             {"ArchiveSize", plist::Value(static_cast<long long>(bytes.size()))},
             {"ArchiveSHA256", plist::Value(digest.finishHex())},
             {"Attributes", plist::Value(plist::Dictionary{{"Version", plist::Value("1.0")}})}};
-        server.serve("/catalog/archive.tgz", bodyResponse(bytes));
+        server.serve("/catalog/archive.tgz", {.body = bytes});
         server.serve("/catalog/catalog.plist",
-                     bodyResponse(catalogBytes(plist::Value(plist::Array{plist::Value(entry)}))));
+                     {.body = catalogBytes(plist::Value(plist::Array{plist::Value(entry)}))});
     }
 
     std::string catalogURL() const { return server.url("/catalog/catalog.plist"); }
@@ -318,10 +303,12 @@ TEST_F(AssetCatalogTest, UntrustworthyCatalogsAreRefusedWithTheirReason) {
         {"redirect to another scheme",
          [&] {
              writeTypeSettings(trusting({{"new", plist::Value(newKey)}}));
-             LocalHttpServer::Response moved = statusResponse(302, "Found");
-             moved.headers = {{"Location", "https://127.0.0.1:" + std::to_string(server.port()) +
-                                               "/catalog/catalog.plist"}};
-             server.serve("/catalog/catalog.plist", moved);
+             server.serve(
+                 "/catalog/catalog.plist",
+                 {.status = 302,
+                  .reason = "Found",
+                  .headers = {{"Location", "https://127.0.0.1:" + std::to_string(server.port()) +
+                                               "/catalog/catalog.plist"}}});
          },
          "fetch failed"},
     };
@@ -354,13 +341,12 @@ TEST_F(AssetCatalogTest, UntrustworthyCatalogsAreRefusedWithTheirReason) {
 TEST_F(AssetCatalogTest, ASecondTryTakesANewPairWithinWhatIsLeftOfTheBudget) {
     publish("1.0");
     writeSettings(publicKey);
-    LocalHttpServer::Response held = bodyResponse(readText(out("catalog.plist")));
-    held.holdAfterBodyBytes = held.body.size() - 1;
-    server.serve("/catalog/catalog.plist", held);
+    const std::string first = readText(out("catalog.plist"));
+    server.serve("/catalog/catalog.plist", {.body = first, .holdAfterBodyBytes = first.size() - 1});
     auto assets = std::async(std::launch::async, [this] { return query(); });
     ASSERT_TRUE(server.waitForHeldResponse(kPatience));
     publish("2.0");
-    server.serve("/catalog/catalog.plist", bodyResponse(readText(out("catalog.plist"))));
+    server.serve("/catalog/catalog.plist", {.body = readText(out("catalog.plist"))});
     server.releaseHeldResponses();
     std::optional<Assets> answered = assets.get();
     ASSERT_TRUE(answered.has_value());
@@ -369,9 +355,10 @@ TEST_F(AssetCatalogTest, ASecondTryTakesANewPairWithinWhatIsLeftOfTheBudget) {
               (plist::Dictionary{{"Version", plist::Value("2.0")}}));
 
     writeSettings(publicKey, {{kSettingsCatalogTimeoutKey, plist::Value(3)}});
-    LocalHttpServer::Response slow = bodyResponse(readText(out("catalog.plist")) + "\n");
-    slow.trickleBytesPerSecond = slow.body.size() / 3 + 1;  // about two seconds
-    server.serve("/catalog/catalog.plist", slow);
+    const std::string slow = readText(out("catalog.plist")) + "\n";
+    // About two seconds.
+    server.serve("/catalog/catalog.plist",
+                 {.body = slow, .trickleBytesPerSecond = slow.size() / 3 + 1});
     EXPECT_FALSE(query().has_value());
     EXPECT_EQ(logLinesContaining("cannot fetch it"), 1u);
 }
@@ -422,24 +409,23 @@ TEST_F(AssetCatalogTest, DamagedCatalogsAreRefusedAndMalformedEntriesSkipped) {
         with("Attributes", plist::Value(plist::Array{})),
         with("RolloutPercent", plist::Value(101)),
     };
-    server.serve("/catalog/catalog.plist", bodyResponse(catalogBytes(entries)));
+    server.serve("/catalog/catalog.plist", {.body = catalogBytes(entries)});
     std::optional<Assets> assets = query();
     ASSERT_TRUE(assets.has_value());
     ASSERT_EQ(assets->size(), 1u);
     EXPECT_EQ(assets->front()->attributes(), *good.at("Attributes").asDictionary());
     EXPECT_EQ(logLinesContaining("skipping entry"), entries.size() - 1);
 
-    LocalHttpServer::Response trickling = bodyResponse(std::string(4096, ' '));
-    trickling.trickleBytesPerSecond = 2000;
     const std::vector<std::tuple<const char*, LocalHttpServer::Response, const char*>> refused{
-        {"not a property list", bodyResponse("\x89PNG garbage"), "not a property list"},
-        {"another type", bodyResponse(catalogBytes(entries, "other.type")), "AssetType is not"},
-        {"assets of the wrong type", bodyResponse(catalogBytes(plist::Value("x"))),
-         "no Assets array"},
-        {"over the size cap", bodyResponse(std::string(9u << 20, ' ')), "cannot fetch it"},
-        {"no serial", bodyResponse(catalogBytes(entries, kAssetType, 0)), "no Serial"},
-        {"server error", statusResponse(500, "Oops"), "HTTP status 500"},
-        {"trickling server", trickling, "cannot fetch it"},
+        {"not a property list", {.body = "\x89PNG garbage"}, "not a property list"},
+        {"another type", {.body = catalogBytes(entries, "other.type")}, "AssetType is not"},
+        {"assets of the wrong type", {.body = catalogBytes(plist::Value("x"))}, "no Assets array"},
+        {"over the size cap", {.body = std::string(9u << 20, ' ')}, "cannot fetch it"},
+        {"no serial", {.body = catalogBytes(entries, kAssetType, 0)}, "no Serial"},
+        {"server error", {.status = 500, .reason = "Oops"}, "HTTP status 500"},
+        {"trickling server",
+         {.body = std::string(4096, ' '), .trickleBytesPerSecond = 2000},
+         "cannot fetch it"},
     };
     for (const auto& [name, response, reason] : refused) {
         SCOPED_TRACE(name);
@@ -456,8 +442,7 @@ TEST_F(AssetCatalogTest, DamagedCatalogsAreRefusedAndMalformedEntriesSkipped) {
         return std::chrono::duration_cast<Clock::Duration>(
             std::chrono::duration<double>(secondsSinceReferenceDate - Clock::absoluteTimeNow()));
     };
-    server.serve("/catalog/catalog.plist",
-                 bodyResponse(catalogBytes(entries, kAssetType, 1, expires)));
+    server.serve("/catalog/catalog.plist", {.body = catalogBytes(entries, kAssetType, 1, expires)});
     {
         ScopedClockOffset hourBefore(clockAt(expires.secondsSinceReferenceDate - 3600));
         EXPECT_EQ(query().value_or(Assets()).size(), 1u);
@@ -543,8 +528,6 @@ TEST_F(AssetCatalogTest, FailedDownloadsReportFailureAndLeaveNothingBehind) {
                            {test::fileItem("Info.plist", "<plist/>"), plain.front()});
     std::string flipped = archive;
     flipped[flipped.size() / 2] ^= 0x55;
-    LocalHttpServer::Response trickle = bodyResponse(archive);
-    trickle.trickleBytesPerSecond = 2;
     struct Case {
         const char* name;
         std::vector<test::ArchiveItem> items;
@@ -555,12 +538,15 @@ TEST_F(AssetCatalogTest, FailedDownloadsReportFailureAndLeaveNothingBehind) {
     const plist::Dictionary small{{kSettingsMaxExpandedBytesKey, plist::Value(1 << 20)},
                                   {kSettingsMaxArchiveEntriesKey, plist::Value(20)}};
     const std::vector<Case> cases{
-        {"altered archive", plain, bodyResponse(flipped), "SHA-256"},
-        {"cut connection", plain, bodyResponse(archive, archive.size() / 2), "cannot download"},
-        {"longer than listed", plain, bodyResponse(archive + "tail"), "more than the catalog's"},
+        {"altered archive", plain, {{.body = flipped}}, "SHA-256"},
+        {"cut connection",
+         plain,
+         {{.body = archive, .cutAfterBodyBytes = archive.size() / 2}},
+         "cannot download"},
+        {"longer than listed", plain, {{.body = archive + "tail"}}, "more than the catalog's"},
         {"trickling server",
          plain,
-         trickle,
+         {{.body = archive, .trickleBytesPerSecond = 2}},
          "cannot download",
          {{kSettingsLowSpeedSecondsKey, plist::Value(1)}}},
         {"absolute symlink",

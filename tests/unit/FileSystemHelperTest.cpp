@@ -1,5 +1,4 @@
 #include <gtest/gtest.h>
-#include <sys/mount.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -210,18 +209,14 @@ TEST(FileSystemHelper, RemoveItemOpensUpDirectoriesWithoutWritePermission) {
 // file.
 TEST(FileSystemPrimitives, ACopyThatRunsOutOfSpaceLeavesNoFileBehind) {
     TempDir dir;
-    const std::string small = dir / "small";
-    fs::create_directory(small);
-    if (::geteuid() != 0 || ::mount("tmpfs", small.c_str(), "tmpfs", 0, "size=1m") != 0) {
+    fs::create_directory(dir / "small");
+    const test::TmpfsMount small(dir / "small", "size=1m");
+    if (!small.mounted) {
         GTEST_SKIP() << "cannot mount a small tmpfs (needs root)";
     }
-    struct Unmount {
-        std::string path;
-        ~Unmount() { ::umount2(path.c_str(), MNT_DETACH); }
-    } unmount{small};
     writeText(dir / "big", std::string(3 << 20, 'b'));
-    EXPECT_EQ(copyItemTree(dir / "big", small + "/big"), ENOSPC);
-    EXPECT_TRUE(fs::is_empty(small));
+    EXPECT_EQ(copyItemTree(dir / "big", dir / "small/big"), ENOSPC);
+    EXPECT_TRUE(fs::is_empty(small.path));
 }
 
 // Attributes reach the whole tree but not through links; a missing path answers 5 recursively

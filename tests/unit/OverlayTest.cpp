@@ -430,35 +430,26 @@ TEST_F(CarrierFileLoaderTest, HttpBodiesAreTheFileWhateverTheStatus) {
     }
     const std::string largeXml = *plist::serialize(plist::Value(large));
     ASSERT_GT(largeXml.size(), 100000u);
-    auto response = [](std::string body, std::vector<std::pair<std::string, std::string>> headers,
-                       int status = 200) {
-        test::LocalHttpServer::Response response;
-        response.body = std::move(body);
-        response.headers = std::move(headers);
-        response.status = status;
-        return response;
-    };
-    test::LocalHttpServer::Response cut = response(xml, {});
-    cut.cutAfterBodyBytes = xml.size() / 2;
-    test::LocalHttpServer::Response moved = response("", {}, 302);
-    moved.reason = "Found";
-    // The redirect's own encoding must not decide how the final body is read.
-    moved.headers = {{"Location", "/large"}, {"Content-Encoding", "deflate"}};
     struct Case {
         const char* path;
         test::LocalHttpServer::Response response;
         std::optional<plist::Value> loaded;
     };
     const std::vector<Case> cases{
-        {"/gzip", response(compressed, {{"Content-Encoding", "gzip"}}), kCarrier},
-        {"/mixed", response(compressed, {{"content-encoding", "x-GZip"}}), kCarrier},
-        {"/large", response(largeXml, {}), plist::Value(large)},
-        {"/redirected", moved, plist::Value(large)},
-        {"/compress", response(xml, {{"Content-Encoding", "compress"}}), std::nullopt},
-        {"/damaged", response(xml, {{"Content-Encoding", "gzip"}}), std::nullopt},
-        {"/empty", response("", {{"Content-Encoding", "gzip"}}), std::nullopt},
-        {"/missing", response("404 Not Found", {}, 404), std::nullopt},
-        {"/cut", cut, std::nullopt},
+        {"/gzip", {.headers = {{"Content-Encoding", "gzip"}}, .body = compressed}, kCarrier},
+        {"/mixed", {.headers = {{"content-encoding", "x-GZip"}}, .body = compressed}, kCarrier},
+        {"/large", {.body = largeXml}, plist::Value(large)},
+        // The redirect's own encoding must not decide how the final body is read.
+        {"/redirected",
+         {.status = 302,
+          .reason = "Found",
+          .headers = {{"Location", "/large"}, {"Content-Encoding", "deflate"}}},
+         plist::Value(large)},
+        {"/compress", {.headers = {{"Content-Encoding", "compress"}}, .body = xml}, std::nullopt},
+        {"/damaged", {.headers = {{"Content-Encoding", "gzip"}}, .body = xml}, std::nullopt},
+        {"/empty", {.headers = {{"Content-Encoding", "gzip"}}}, std::nullopt},
+        {"/missing", {.status = 404, .body = "404 Not Found"}, std::nullopt},
+        {"/cut", {.body = xml, .cutAfterBodyBytes = xml.size() / 2}, std::nullopt},
     };
     for (const Case& c : cases) {
         server.serve(c.path, c.response);

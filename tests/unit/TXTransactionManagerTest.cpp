@@ -1,6 +1,5 @@
 #include <gtest/gtest.h>
 
-#include <cstdlib>
 #include <filesystem>
 
 #include "TestDoubles.h"
@@ -12,13 +11,13 @@
 namespace tavrix {
 namespace {
 
-// The keep-alive flag is where it is without a service manager: under the device root.
+// The service manager is the test's own, its keep-alive flag under the test's device root.
 class TXTransactionManagerTest : public testing::Test {
   protected:
-    std::string flag() const { return test::readText(runtime_ + "/keep-alive"); }
+    std::string flag() const { return test::readText(flagPath); }
     bus::ServiceManager& serviceManager() { return bus::ServiceManager::shared(); }
 
-    const std::string runtime_ = (test::unitTestRoot() / "run/tavrixservicesd").string();
+    const std::string flagPath = (test::unitTestRoot() / "run/tavrixservicesd/keep-alive").string();
     CapturingLogSink log_;
     ScopedLogSink guard_{log_};
 };
@@ -42,7 +41,7 @@ TEST_F(TXTransactionManagerTest, NamesAreCountedOnce) {
 TEST_F(TXTransactionManagerTest, KeepAliveFollowsKeepAliveTransactionsWhenClearable) {
     TXTransactionManager transactions;
     transactions.clearKeepAliveIfNecessary(true);  // no flag yet: already clear
-    EXPECT_FALSE(std::filesystem::exists(runtime_ + "/keep-alive"));
+    EXPECT_FALSE(std::filesystem::exists(flagPath));
     transactions.beginTransaction("Update Check", true);
     EXPECT_EQ(flag(), "1\n");
     EXPECT_TRUE(transactions.isKeepAliveEnabled());
@@ -74,12 +73,12 @@ TEST_F(TXTransactionManagerTest, KeepAliveFollowsKeepAliveTransactionsWhenCleara
 // A flag that cannot be read counts as enabled, so the daemon stays rather than leaving early.
 TEST_F(TXTransactionManagerTest, UnreadableFlagCountsAsEnabled) {
     // A directory where the flag file should be: it can be neither read nor replaced.
-    std::filesystem::create_directories(runtime_ + "/keep-alive");
+    std::filesystem::create_directories(flagPath);
     TXTransactionManager transactions;
     EXPECT_TRUE(transactions.isKeepAliveEnabled());
     EXPECT_FALSE(serviceManager().isIdle());
     transactions.clearKeepAliveIfNecessary(true);
-    EXPECT_TRUE(std::filesystem::is_directory(runtime_ + "/keep-alive"));
+    EXPECT_TRUE(std::filesystem::is_directory(flagPath));
 }
 
 }  // namespace

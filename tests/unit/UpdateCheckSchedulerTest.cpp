@@ -3,7 +3,6 @@
 
 #include <chrono>
 #include <cmath>
-#include <cstdlib>
 #include <optional>
 #include <string>
 #include <vector>
@@ -22,11 +21,7 @@ namespace {
 
 class UpdateCheckSchedulerTest : public testing::Test {
   protected:
-    void SetUp() override {
-        runtime_ = (test::unitTestRoot() / "run/tavrixservicesd").string();
-        ::setenv("RUNTIME_DIRECTORY", runtime_.c_str(), 1);
-        test::writeDeviceTable({{"contains-cellular-radio", false}});
-    }
+    void SetUp() override { test::writeDeviceTable({{"contains-cellular-radio", false}}); }
 
     static void enableSupport(bool enabled) {
         setBehaviorPreference(kEnableSupportKey, plist::Value(enabled));
@@ -66,8 +61,6 @@ class UpdateCheckSchedulerTest : public testing::Test {
         EXPECT_EQ(criterion(bus::kJobPowerOptimizationLevel), plist::Value(plist::Integer(1)));
         EXPECT_EQ(criterion(bus::kJobAllowedDuringVoiceCall), plist::Value(true));
     }
-
-    std::string runtime_;
 };
 
 // A stored time still ahead (by at most 15 days) is kept; none, a mistyped one, a past one or one
@@ -133,7 +126,8 @@ TEST_F(UpdateCheckSchedulerTest, FiredJobWhoseCheckFailsReArmsAndLeavesNothingOp
     setNextUpdate(Clock::absoluteTimeNow() - 600.0);
     scheduler.onJobFired("Behavior Bundle Update Check", nullptr);
     EXPECT_FALSE(TXTransactionManager::sharedInstance().hasOpenTransactionForName("Update Check"));
-    EXPECT_EQ(test::readText(runtime_ + "/keep-alive"), "0\n");
+    EXPECT_EQ(test::readText((test::unitTestRoot() / "run/tavrixservicesd/keep-alive").string()),
+              "0\n");
     expectArmedFifteenDaysAhead();
 }
 
