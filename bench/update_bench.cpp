@@ -231,8 +231,7 @@ void benchUpdate(const fs::path& work) {
         mustRun({TAVRIX_CATALOG_TOOL, "publish", site.string(), "--key",
                  (work / "keys/secret").string(), "--fresh", bundle.string()});
         // The only asset of a fresh catalog; its archive is named after its digest.
-        const std::optional<plist::Value> catalog =
-            plist::readFile((site / "catalog.plist").string());
+        const Result<plist::Value> catalog = plist::readFile((site / "catalog.plist").string());
         const std::string archive =
             "/" + *catalog->find("Assets")->asArray()->front().find("ArchiveURL")->asString();
         archiveBytes = fs::file_size(site / archive.substr(1));

@@ -54,24 +54,24 @@ int usage(const std::string& mistake) {
 
 // The value in path, or standard input for "-", with the same bounds either way.
 std::optional<Value> readValue(const std::string& path) {
-    Refusal refusal;
-    std::optional<Value> value;
-    if (path == "-") {
+    auto read = [&]() -> tavrix::Result<Value> {
+        if (path != "-") {
+            return readFile(path);
+        }
         std::string bytes;
         if (int error = tavrix::io::readAll(STDIN_FILENO, bytes, kMaxPropertyListBytes)) {
-            refusal.reason = error == EFBIG ? "it is larger than the limit" : std::strerror(error);
-        } else {
-            value = parse(bytes, &refusal);
+            return tavrix::Failure{
+                error == EFBIG ? "it is larger than the limit" : std::strerror(error), error};
         }
-    } else {
-        value = readFile(path, &refusal);
-    }
+        return parse(bytes);
+    };
+    tavrix::Result<Value> value = read();
     if (!value) {
         std::fprintf(stderr, "tavrix-plist: %s: %s\n",
-                     path == "-" ? "standard input" : path.c_str(),
-                     refusal.reason.empty() ? "not a property list" : refusal.reason.c_str());
+                     path == "-" ? "standard input" : path.c_str(), value.reason().c_str());
+        return std::nullopt;
     }
-    return value;
+    return std::move(*value);
 }
 
 bool writeValue(const std::string& path, const Value& value, Format format) {

@@ -11,6 +11,8 @@ namespace tavrix {
 
 struct Failure {
     std::string reason;
+    // The errno behind it when a system call failed (ENOENT: there is nothing there), else 0.
+    int error = 0;
 };
 
 template <typename T = void>
@@ -28,10 +30,17 @@ class [[nodiscard]] Result {
     const T& operator*() const { return value_.value(); }
     T* operator->() { return &value_.value(); }
     const T* operator->() const { return &value_.value(); }
+    // The value, or fallback when the operation failed and its reason does not matter.
+    T value_or(T fallback) && { return ok() ? std::move(*value_) : std::move(fallback); }
 
     // Only when !ok().
     const std::string& reason() const { return failure_.reason; }
     Failure failure() const { return failure_; }
+
+    // Equal to a value when it holds one equal to it.
+    friend bool operator==(const Result& result, const T& value) {
+        return result.ok() && *result == value;
+    }
 
   private:
     std::optional<T> value_;

@@ -41,20 +41,24 @@ std::shared_ptr<plist::CachedPropertyListFile> cachedInfoFile(const std::string&
 
 }  // namespace
 
-std::optional<plist::Value> BundleDirectory::copyInfoValue(std::string_view key,
-                                                           plist::Refusal* refusal) const {
+Result<std::optional<plist::Value>> BundleDirectory::copyInfoValue(std::string_view key) const {
     const plist::CachedPropertyListFile::Snapshot info = cachedInfoFile(infoPath())->read();
-    std::optional<plist::Value> unopened;
-    const plist::Value* dictionary = info.value.get();
-    if (info.state == plist::CachedPropertyListFile::State::Missing) {
-        // Not opened: read directly for the reason (missing, or not readable).
-        unopened = plist::readFile(infoPath(), refusal);
-        dictionary = unopened ? &*unopened : nullptr;
-    } else if (info.state == plist::CachedPropertyListFile::State::Damaged && refusal != nullptr) {
-        *refusal = info.refusal;
+    if (info.state == plist::CachedPropertyListFile::State::Damaged) {
+        return info.refusal;
     }
-    const plist::Value* value = dictionary != nullptr ? dictionary->find(key) : nullptr;
-    return value == nullptr ? std::nullopt : std::optional<plist::Value>(*value);
+    auto valueFor = [&](const plist::Value& dictionary) {
+        const plist::Value* value = dictionary.find(key);
+        return value == nullptr ? std::nullopt : std::optional<plist::Value>(*value);
+    };
+    if (info.state == plist::CachedPropertyListFile::State::Valid) {
+        return valueFor(*info.value);
+    }
+    // Not opened: read directly for the reason (missing, or not readable).
+    Result<plist::Value> unopened = plist::readFile(infoPath());
+    if (!unopened) {
+        return unopened.failure();
+    }
+    return valueFor(*unopened);
 }
 
 std::optional<BundleDirectory> createBundleAtPath(const std::string& path) {
@@ -68,8 +72,8 @@ namespace {
 
 // A refused Info dictionary is logged once per request, after the last attempt; a missing one is
 // not (a bundle being installed has none yet).
-void logInfoRefusal(const BundleDirectory& bundle, const plist::Refusal& refusal) {
-    if (!refusal.reason.empty() && refusal.error != ENOENT) {
+void logInfoRefusal(const BundleDirectory& bundle, const Failure& refusal) {
+    if (refusal.error != ENOENT) {
         logPropertyListRefusal(bundle.infoPath(), refusal, "ignoring it");
     }
 }
@@ -83,12 +87,12 @@ std::optional<plist::Value> copyBundleInfoValue(const std::string& path, std::st
         if (!bundle) {
             return std::nullopt;
         }
-        plist::Refusal refusal;
-        if (auto value = bundle->copyInfoValue(key, &refusal)) {
-            return value;
+        Result<std::optional<plist::Value>> value = bundle->copyInfoValue(key);
+        if (value && *value) {
+            return std::move(*value);
         }
-        if (attempt + 1 == kBundleInfoRetryCount) {
-            logInfoRefusal(*bundle, refusal);
+        if (!value && attempt + 1 == kBundleInfoRetryCount) {
+            logInfoRefusal(*bundle, value.failure());
         }
         ::usleep(kBundleInfoRetryDelayMicroseconds);
     }
@@ -108,13 +112,15 @@ std::optional<std::string> copyBundleIdentifierAtPath(const std::string& path) {
     if (!bundle) {
         return std::nullopt;
     }
-    plist::Refusal refusal;
-    std::optional<plist::Value> value = bundle->copyInfoValue(kBundleIdentifierKey, &refusal);
-    logInfoRefusal(*bundle, refusal);
-    if (!value || !value->isString()) {
+    Result<std::optional<plist::Value>> value = bundle->copyInfoValue(kBundleIdentifierKey);
+    if (!value) {
+        logInfoRefusal(*bundle, value.failure());
         return std::nullopt;
     }
-    return *value->asString();
+    if (!*value || !(*value)->isString()) {
+        return std::nullopt;
+    }
+    return *(*value)->asString();
 }
 
 std::string bundleInfoValueText(const std::optional<plist::Value>& value) {

@@ -29,10 +29,9 @@ class BundleDirectory {
 
     const std::string& path() const { return path_; }
     std::string infoPath() const;
-    // The Info dictionary's value for key; nothing when the dictionary or the key is missing
-    // (refusal then says why the dictionary was not read, if it was not).
-    std::optional<plist::Value> copyInfoValue(std::string_view key,
-                                              plist::Refusal* refusal = nullptr) const;
+    // The Info dictionary's value for key, nothing when the key is missing; a failure when the
+    // dictionary cannot be read (ENOENT: there is none).
+    Result<std::optional<plist::Value>> copyInfoValue(std::string_view key) const;
 
   private:
     std::string path_;

@@ -12,7 +12,7 @@ namespace tavrix {
 namespace {
 
 std::optional<plist::Data> readLocalFile(const std::string& path) {
-    std::optional<std::string> bytes = plist::readFileBytes(path);
+    Result<std::string> bytes = plist::readFileBytes(path);
     if (!bytes) {
         return std::nullopt;
     }
@@ -29,8 +29,12 @@ std::optional<plist::Value> parseLoaded(bool loaded, const std::optional<plist::
     if (!data || data->empty()) {
         return std::nullopt;
     }
-    return plist::parse(
-        std::string_view(reinterpret_cast<const char*>(data->data()), data->size()));
+    Result<plist::Value> parsed =
+        plist::parse(std::string_view(reinterpret_cast<const char*>(data->data()), data->size()));
+    if (!parsed) {
+        return std::nullopt;
+    }
+    return std::move(*parsed);
 }
 
 }  // namespace

@@ -175,10 +175,9 @@ void BackgroundJobScheduler::load() {
         }
         return;
     }
-    plist::Refusal refusal;
-    auto contents = plist::readOpenFile(file.get(), &refusal);
+    Result<plist::Value> contents = plist::readOpenFile(file.get());
     if (!contents) {
-        logPropertyListRefusal(filePath_, refusal, "starting with no jobs");
+        logPropertyListRefusal(filePath_, contents.failure(), "starting with no jobs");
         return;
     }
     if (!contents->isDictionary()) {

@@ -62,10 +62,9 @@ Result<CatalogEntry> readEntry(const plist::Value& value, const std::string& cat
 }  // namespace
 
 Result<plist::Value> parseCatalog(std::string_view bytes) {
-    plist::Refusal refusal;
-    std::optional<plist::Value> catalog = plist::parse(bytes, &refusal);
+    Result<plist::Value> catalog = plist::parse(bytes);
     if (!catalog) {
-        return Failure{"it is not a property list: " + refusal.reason};
+        return Failure{"it is not a property list: " + catalog.reason()};
     }
     if (!catalog->isDictionary()) {
         return Failure{"it is not a property-list dictionary"};

@@ -120,7 +120,7 @@ std::optional<std::vector<CatalogEntry>> loadOnce(const AssetTypeSettings& setti
     std::optional<SignedCatalog> catalog;
     if (localOnly) {
         std::string path = settings.cacheDirectory + kLocalCopyName;
-        std::optional<std::string> bytes = plist::readFileBytes(path);
+        Result<std::string> bytes = plist::readFileBytes(path);
         if (!bytes) {
             return std::vector<CatalogEntry>();
         }

@@ -26,7 +26,7 @@ plist::Dictionary readDaemonStateFile(std::string_view fileName) {
     if (!file) {
         return {};
     }
-    std::optional<plist::Value> stored = plist::readOpenFile(file.get());
+    Result<plist::Value> stored = plist::readOpenFile(file.get());
     const plist::Dictionary* values = stored ? stored->asDictionary() : nullptr;
     return values != nullptr ? *values : plist::Dictionary();
 }

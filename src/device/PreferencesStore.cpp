@@ -24,7 +24,7 @@
 namespace tavrix::device {
 namespace {
 
-const plist::Refusal kNotADictionary{0, "it is not a dictionary"};
+const Failure kNotADictionary{"it is not a dictionary"};
 
 constexpr std::string_view kPreferencesDirectory = "/Library/Preferences";
 constexpr std::string_view kExtension = ".plist";
@@ -298,16 +298,15 @@ bool PreferencesStore::writePending(Domain& domain) {
             logFailure("read", domain.path, EFBIG);
             return false;
         }
-        plist::Refusal refusal;
-        auto stored = plist::readOpenFile(current.get(), &refusal);
-        if (!stored && refusal.error != 0) {
-            logFailure("read", domain.path, refusal.error);
+        Result<plist::Value> stored = plist::readOpenFile(current.get());
+        if (!stored && stored.failure().error != 0) {
+            logFailure("read", domain.path, stored.failure().error);
             return false;
         }
         if (stored && stored->isDictionary()) {
             contents = std::move(*stored->asDictionary());
         } else {
-            logDamage(domain, stored ? kNotADictionary : refusal);
+            logDamage(domain, stored ? kNotADictionary : stored.failure());
         }
     } else if (error == EPERM || error == ELOOP || error == EINVAL) {
         auto entry = preferences->entryStatus(domain.fileName);
@@ -340,7 +339,7 @@ bool PreferencesStore::writePending(Domain& domain) {
     return true;
 }
 
-void PreferencesStore::logDamage(Domain& domain, const plist::Refusal& refusal) {
+void PreferencesStore::logDamage(Domain& domain, const Failure& refusal) {
     auto version = versionOf(domain.path);
     if (version && domain.loggedDamage == version) {
         return;

@@ -61,7 +61,7 @@ class PreferencesStore {
     bool synchronizeLocked(Domain& domain);
     bool writePending(Domain& domain);
     // Logs that the domain's file is damaged, once per version of the file.
-    void logDamage(Domain& domain, const plist::Refusal& refusal);
+    void logDamage(Domain& domain, const Failure& refusal);
 
     std::mutex mutex_;
     std::map<std::string, UserDomains, std::less<>> users_;

@@ -42,10 +42,12 @@ CachedPropertyListFile::Snapshot CachedPropertyListFile::read() {
         state_ = State::Missing;
         return {state_, nullptr, true, refusal_};
     }
-    auto parsed = readOpenFile(file.get(), &refusal_);
+    Result<Value> parsed = readOpenFile(file.get());
     state_ = parsed ? State::Valid : State::Damaged;
     if (parsed) {
         value_ = std::make_shared<const Value>(std::move(*parsed));
+    } else {
+        refusal_ = parsed.failure();
     }
     return {state_, value_, true, refusal_};
 }

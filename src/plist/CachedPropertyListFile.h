@@ -28,7 +28,7 @@ class CachedPropertyListFile {
         // True when this read parsed the file (the first read of a new version of it).
         bool freshlyRead = false;
         // Why the file is Damaged.
-        plist::Refusal refusal;
+        Failure refusal;
     };
 
     // Opens the file for reading; an empty descriptor means there is none.
@@ -60,7 +60,7 @@ class CachedPropertyListFile {
     Identity identity_;
     State state_ = State::Missing;
     std::shared_ptr<const Value> value_;
-    Refusal refusal_;
+    Failure refusal_;
 };
 
 }  // namespace tavrix::plist

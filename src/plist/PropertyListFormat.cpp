@@ -406,22 +406,16 @@ bool isBinary(std::string_view bytes) {
 
 }  // namespace
 
-std::optional<Value> parse(std::string_view bytes, Refusal* refusal) {
-    auto refuse = [refusal](std::string reason) -> std::optional<Value> {
-        if (refusal != nullptr) {
-            *refusal = Refusal{0, std::move(reason)};
-        }
-        return std::nullopt;
-    };
+Result<Value> parse(std::string_view bytes) {
     const bool binary = isBinary(bytes);
     if (Result<> readable = checkReadable(bytes, binary); !readable) {
-        return refuse(readable.reason());
+        return readable.failure();
     }
     plist_t raw = nullptr;
     plist_from_memory(bytes.data(), static_cast<uint32_t>(bytes.size()), &raw);
     Node root(raw);
     if (!root) {
-        return refuse("it is not a property list");
+        return Failure{"it is not a property list"};
     }
     std::optional<std::vector<double>> dates = binary ? BinaryDates(bytes).read() : xmlDates(bytes);
     if (!dates || dates->size() != countDates(root.get(), 0)) {
@@ -429,67 +423,61 @@ std::optional<Value> parse(std::string_view bytes, Refusal* refusal) {
     }
     auto value = NodeReader(std::move(*dates)).read(root.get(), 0);
     if (!value) {
-        return refuse("it holds text that is not UTF-8 or a damaged dictionary");
+        return Failure{"it holds text that is not UTF-8 or a damaged dictionary"};
     }
-    return value;
+    return std::move(*value);
 }
 
 namespace {
 
-std::optional<std::string> refuseRead(Refusal* refusal, int error, std::string reason) {
-    if (refusal != nullptr) {
-        *refusal = Refusal{error, std::move(reason)};
-    }
-    return std::nullopt;
+Failure systemFailure(int error) {
+    return {std::strerror(error), error};
 }
 
 }  // namespace
 
-std::optional<std::string> readFileBytes(const std::string& path, Refusal* refusal) {
+Result<std::string> readFileBytes(const std::string& path) {
     // Without O_NONBLOCK, opening a FIFO would wait for a writer for ever.
     io::UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
     if (!fd) {
-        int error = errno;
-        return refuseRead(refusal, error, std::strerror(error));
+        return systemFailure(errno);
     }
-    return readOpenFileBytes(fd.get(), refusal);
+    return readOpenFileBytes(fd.get());
 }
 
-std::optional<std::string> readOpenFileBytes(int fd, Refusal* refusal) {
+Result<std::string> readOpenFileBytes(int fd) {
     struct stat info {};
     if (::fstat(fd, &info) != 0) {
-        int error = errno;
-        return refuseRead(refusal, error, std::strerror(error));
+        return systemFailure(errno);
     }
     if (!S_ISREG(info.st_mode)) {
-        return refuseRead(refusal, 0, "it is not a regular file");
+        return Failure{"it is not a regular file"};
     }
     if (info.st_size < 0 || static_cast<std::uint64_t>(info.st_size) > kMaxPropertyListBytes) {
-        return refuseRead(refusal, 0, tooLarge());
+        return Failure{tooLarge()};
     }
     // A file that grew since fstat is still held to the cap.
     std::string bytes;
     if (int error = io::readAll(fd, bytes, kMaxPropertyListBytes); error != 0) {
-        return error == EFBIG ? refuseRead(refusal, 0, tooLarge())
-                              : refuseRead(refusal, error, std::strerror(error));
+        return error == EFBIG ? Failure{tooLarge()} : systemFailure(error);
     }
     return bytes;
 }
 
-std::optional<Value> readFile(const std::string& path, Refusal* refusal) {
-    auto bytes = readFileBytes(path, refusal);
+Result<Value> readFile(const std::string& path) {
+    Result<std::string> bytes = readFileBytes(path);
     if (!bytes) {
-        return std::nullopt;
+        return bytes.failure();
     }
-    return parse(*bytes, refusal);
+    return parse(*bytes);
 }
 
-std::optional<Value> readOpenFile(int fd, Refusal* refusal) {
-    auto bytes = readOpenFileBytes(fd, refusal);
+Result<Value> readOpenFile(int fd) {
+    Result<std::string> bytes = readOpenFileBytes(fd);
     if (!bytes) {
-        return std::nullopt;
+        return bytes.failure();
     }
-    return parse(*bytes, refusal);
+    return parse(*bytes);
 }
 
 Result<std::string> serialize(const Value& value, Format format) {

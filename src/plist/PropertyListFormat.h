@@ -16,21 +16,17 @@ namespace tavrix::plist {
 
 enum class Format { Xml, Binary };
 
-// Why a read answered no value.
-struct Refusal {
-    // The errno of a file that could not be opened or read (ENOENT: there is none), else 0.
-    int error = 0;
-    // For a log line: "it is not a regular file", "it nests deeper than 512 levels", ...
-    std::string reason;
-};
+// A read that answers no value fails with a reason for a log line ("it is not a regular file",
+// "it nests deeper than 512 levels", ...) and, when the file could not be opened or read, its
+// errno (ENOENT: there is none).
 
-// The value encoded in bytes (XML or binary, detected from the content), or nothing when the
+// The value encoded in bytes (XML or binary, detected from the content); a failure when the
 // bytes are not a complete property list or exceed the limits.
-std::optional<Value> parse(std::string_view bytes, Refusal* refusal = nullptr);
+Result<Value> parse(std::string_view bytes);
 
-// The value stored in the file at path (symbolic links followed), or nothing when the file is
+// The value stored in the file at path (symbolic links followed); a failure when the file is
 // missing, not a regular file, too large, unreadable or not a property list.
-std::optional<Value> readFile(const std::string& path, Refusal* refusal = nullptr);
+Result<Value> readFile(const std::string& path);
 
 // The value encoded in the given format. XML dates are whole seconds, as every reader of the
 // format expects; binary dates keep their fractions. Fails when the value cannot be encoded or
@@ -42,12 +38,12 @@ Result<std::string> serialize(const Value& value, Format format = Format::Xml);
 // cannot be written.
 bool writeFile(const std::string& path, const Value& value, Format format = Format::Xml);
 
-// Reads the whole of a regular file of at most kMaxPropertyListBytes into memory, or nothing.
-// Opening never blocks (a FIFO or device is refused, not waited on).
-std::optional<std::string> readFileBytes(const std::string& path, Refusal* refusal = nullptr);
+// Reads the whole of a regular file of at most kMaxPropertyListBytes into memory. Opening never
+// blocks (a FIFO or device is refused, not waited on).
+Result<std::string> readFileBytes(const std::string& path);
 
 // The same for a file the caller opened (read from its current offset).
-std::optional<std::string> readOpenFileBytes(int fd, Refusal* refusal = nullptr);
-std::optional<Value> readOpenFile(int fd, Refusal* refusal = nullptr);
+Result<std::string> readOpenFileBytes(int fd);
+Result<Value> readOpenFile(int fd);
 
 }  // namespace tavrix::plist

@@ -498,14 +498,14 @@ std::optional<std::string> copyProcessNameForPID(pid_t pid) {
         return std::nullopt;
     }
     // The kernel's process table, not a file of the device root.
-    auto name = plist::readFileBytes("/proc/" + std::to_string(pid) + "/comm");
+    Result<std::string> name = plist::readFileBytes("/proc/" + std::to_string(pid) + "/comm");
     if (!name) {
         return std::nullopt;
     }
     if (!name->empty() && name->back() == '\n') {
         name->pop_back();
     }
-    return name;
+    return std::move(*name);
 }
 
 char* copyCStringFromString(const CStringAllocator& allocator, std::string_view string,
@@ -537,11 +537,11 @@ char* copyCStringFromString(const CStringAllocator& allocator, std::string_view 
 
 std::optional<plist::Value> loadDictionaryAtPath(const std::string& path) {
     // Says nothing about a file it cannot read, as none of these utilities logs.
-    auto value = plist::readFile(path);
+    Result<plist::Value> value = plist::readFile(path);
     if (!value || !value->isDictionary()) {
         return std::nullopt;
     }
-    return value;
+    return std::move(*value);
 }
 
 }  // namespace tavrix

@@ -5,12 +5,12 @@
 #include <optional>
 #include <string>
 
-#include "plist/PropertyListFormat.h"
+#include "base/Result.h"
 
 namespace tavrix {
 
 // Logs "Property list <path> refused: <reason>; <consequence>".
-void logPropertyListRefusal(const std::string& path, const plist::Refusal& refusal,
+void logPropertyListRefusal(const std::string& path, const Failure& refusal,
                             const char* consequence);
 
 }  // namespace tavrix

@@ -60,7 +60,7 @@ class BundleFlowTest : public BusFixture {
         return pack(source);
     }
 
-    std::optional<plist::Value> linkedCarrierFile() {
+    Result<plist::Value> linkedCarrierFile() {
         return plist::readFile(at(kPreferencesLink).string());
     }
 
@@ -288,8 +288,8 @@ TEST_F(BundleFlowTest, KilledAnywhereInSetTavrixIDTheNextLaunchFindsOneWholeStat
         client().isTavrixBundleSupported();  // a fresh launch
         ASSERT_EQ(linkState(), "links agree");
         EXPECT_TRUE(fs::exists(at(kBundleLink) / "Info.plist"));
-        EXPECT_TRUE(linkedCarrierFile().has_value());
-        EXPECT_TRUE(device().readDaemonPreferences().has_value());
+        EXPECT_TRUE(linkedCarrierFile());
+        EXPECT_TRUE(device().readDaemonPreferences());
 
         ASSERT_TRUE(client().setTavrixID("abc", payload));
         EXPECT_EQ(linkedVersion(), version);

@@ -47,7 +47,7 @@ void DeviceRoot::setCellularRadio(bool present) {
                                                       });
 }
 
-std::optional<plist::Value> DeviceRoot::readDaemonPreferences() const {
+Result<plist::Value> DeviceRoot::readDaemonPreferences() const {
     return plist::readFile(path(kDaemonPreferences).string());
 }
 

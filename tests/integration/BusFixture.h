@@ -80,7 +80,7 @@ class DeviceRoot {
     void writeDaemonPreferences(const plist::Dictionary& values) {
         writePropertyList(kDaemonPreferences, values);
     }
-    std::optional<plist::Value> readDaemonPreferences() const;
+    Result<plist::Value> readDaemonPreferences() const;
     // One key of the daemon's preferences, or nothing.
     std::optional<plist::Value> daemonPreference(const std::string& key) const {
         auto preferences = readDaemonPreferences();

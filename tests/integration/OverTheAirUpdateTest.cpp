@@ -332,8 +332,8 @@ TEST_F(OverTheAirUpdateTest, KilledAnywhereInAnUpdateTheNextLaunchCompletesOrRed
 
         client().isTavrixBundleSupported();  // a fresh launch
         ASSERT_EQ(linkState(), "links agree");
-        EXPECT_TRUE(plist::readFile(at(kPreferencesLink).string()).has_value());
-        EXPECT_TRUE(device().readDaemonPreferences().has_value());
+        EXPECT_TRUE(plist::readFile(at(kPreferencesLink).string()));
+        EXPECT_TRUE(device().readDaemonPreferences());
         EXPECT_FALSE(fs::exists(device().path(kPendingInstall)));
         if (linkedVersion() != version) {
             const int purged = countLogLines(kPurged);
@@ -495,8 +495,7 @@ TEST_F(OverTheAirKeepAliveTest, ScheduledCheckKeepsTheDaemonUntilTheDownloadIsIn
     // About 18 s: past the first pass of the run loop.
     server.serve("/updates/catalog.plist",
                  {.body = catalog, .trickleBytesPerSecond = catalog.size() / 18 + 1});
-    std::optional<plist::Value> settings =
-        plist::readFile(at("/etc/tavrix/AssetCatalog.plist").string());
+    Result<plist::Value> settings = plist::readFile(at("/etc/tavrix/AssetCatalog.plist").string());
     ASSERT_TRUE(settings);
     plist::Dictionary patient = *settings->asDictionary();
     patient.insert_or_assign("CatalogTimeoutSeconds", plist::Value(60));

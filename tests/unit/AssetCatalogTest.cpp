@@ -633,7 +633,7 @@ class AssetSelectionTest : public AssetCatalogTest {
         tool(arguments);
         if (c.edit) {
             const std::string path = out("catalog.plist");
-            std::optional<plist::Value> catalog = plist::readFile(path);
+            Result<plist::Value> catalog = plist::readFile(path);
             ASSERT_TRUE(catalog);
             c.edit(*catalog);
             ASSERT_TRUE(plist::writeFile(path, *catalog));
@@ -688,7 +688,7 @@ TEST_F(AssetSelectionTest, ChoosesTheHighestFittingVersionAboveTheInstalledOne) 
         SCOPED_TRACE(c.name);
         publish(c);
         AssetHandler::AssetPtr best = AssetHandler::findTheBestAsset();
-        std::optional<plist::Value> catalog = plist::readFile(out("catalog.plist"));
+        Result<plist::Value> catalog = plist::readFile(out("catalog.plist"));
         ASSERT_TRUE(catalog);
         if (c.chosen < 0 || best == nullptr) {
             EXPECT_EQ(best == nullptr, c.chosen < 0);
@@ -731,9 +731,8 @@ TEST_F(AssetSelectionTest, HeldBackOnlyWhenARolloutKeepsANewerFittingVersion) {
 // The commented sample shipped for integrators reads as the daemon reads it, with the defaults it
 // claims: a renamed key or a wrong number there would mislead every device set up from it.
 TEST(SampleAssetCatalogTest, ReadsAsDocumentedWithTheDefaultLimits) {
-    plist::Refusal refusal;
-    std::optional<plist::Value> sample = plist::readFile(TAVRIX_SAMPLE_ASSET_CATALOG, &refusal);
-    ASSERT_TRUE(sample.has_value()) << refusal.reason;
+    Result<plist::Value> sample = plist::readFile(TAVRIX_SAMPLE_ASSET_CATALOG);
+    ASSERT_TRUE(sample) << sample.reason();
     auto settings = parseAssetTypeSettings(*sample, kAssetTypeTavrixBundles);
     ASSERT_TRUE(settings) << settings.reason();
     EXPECT_EQ(settings->catalogURL, "https://updates.example.net/tavrix/catalog.plist");

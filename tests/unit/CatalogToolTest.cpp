@@ -44,7 +44,7 @@ class CatalogToolTest : public testing::Test {
     // Versions listed by the catalog, in order.
     std::vector<std::string> listedVersions() {
         std::vector<std::string> versions;
-        std::optional<plist::Value> catalog = plist::readFile(work / "out/catalog.plist");
+        Result<plist::Value> catalog = plist::readFile(work / "out/catalog.plist");
         const plist::Value* assets = catalog ? catalog->find("Assets") : nullptr;
         for (const plist::Value& asset : assets ? *assets->asArray() : plist::Array()) {
             versions.push_back(*asset.find("Attributes")->find("Version")->asString());
@@ -60,7 +60,7 @@ class CatalogToolTest : public testing::Test {
 
     // The archive the catalog lists for version, relative to the output directory.
     std::string archiveOf(const std::string& version) {
-        std::optional<plist::Value> catalog = plist::readFile(work / "out/catalog.plist");
+        Result<plist::Value> catalog = plist::readFile(work / "out/catalog.plist");
         const plist::Value* assets = catalog ? catalog->find("Assets") : nullptr;
         for (const plist::Value& asset : assets ? *assets->asArray() : plist::Array()) {
             if (*asset.find("Attributes")->find("Version")->asString() == version) {
@@ -71,7 +71,7 @@ class CatalogToolTest : public testing::Test {
     }
 
     std::int64_t serial() {
-        std::optional<plist::Value> catalog = plist::readFile(work / "out/catalog.plist");
+        Result<plist::Value> catalog = plist::readFile(work / "out/catalog.plist");
         const plist::Value* value = catalog ? catalog->find("Serial") : nullptr;
         return value != nullptr ? value->asInteger()->signedValue() : -1;
     }

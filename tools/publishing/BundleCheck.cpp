@@ -16,10 +16,9 @@ constexpr const char* kVersionKey = "QZBundleVersion";
 
 // The property list at path when it is a dictionary.
 Result<plist::Dictionary> readDictionary(const std::string& path) {
-    plist::Refusal refusal;
-    std::optional<plist::Value> value = plist::readFile(path, &refusal);
+    Result<plist::Value> value = plist::readFile(path);
     if (!value) {
-        return Failure{path + ": " + (refusal.reason.empty() ? "cannot be read" : refusal.reason)};
+        return Failure{path + ": " + value.reason()};
     }
     if (value->asDictionary() == nullptr) {
         return Failure{path + ": not a dictionary"};

@@ -105,7 +105,7 @@ Result<std::string> generateKeyPair(const std::string& secretKeyPath,
 }
 
 Result<catalog::CatalogSecretKey> readSecretKey(const std::string& path) {
-    std::optional<std::string> bytes = plist::readFileBytes(path);
+    Result<std::string> bytes = plist::readFileBytes(path);
     catalog::CatalogSecretKey key{};
     if (!bytes || bytes->size() != key.size()) {
         return Failure{path + " is not a secret key made by 'tavrix-catalog keygen'"};
@@ -117,7 +117,7 @@ Result<catalog::CatalogSecretKey> readSecretKey(const std::string& path) {
 
 Result<catalog::TrustedCatalogKey> readPublicKey(const std::string& path,
                                                  const std::string& identifier) {
-    std::optional<std::string> text = plist::readFileBytes(path);
+    Result<std::string> text = plist::readFileBytes(path);
     std::optional<std::string> bytes = text ? catalog::base64Decode(*text) : std::nullopt;
     catalog::TrustedCatalogKey key;
     if (!bytes || bytes->size() != key.publicKey.size()) {

@@ -122,10 +122,9 @@ Result<> goLive(const std::string& site, const plist::Dictionary& catalog, const
 
 Result<plist::Dictionary> readServedCatalog(const std::string& site) {
     const std::string path = pathIn(site, kCatalogFileName);
-    plist::Refusal refusal;
-    std::optional<plist::Value> catalog = plist::readFile(path, &refusal);
+    Result<plist::Value> catalog = plist::readFile(path);
     if (!catalog) {
-        return Failure{path + ": " + (refusal.reason.empty() ? "cannot be read" : refusal.reason)};
+        return Failure{path + ": " + catalog.reason()};
     }
     if (catalog->asDictionary() == nullptr) {
         return Failure{path + " is not a catalog"};
@@ -195,10 +194,9 @@ Result<> completeCatalog(const std::string& site, plist::Dictionary catalog,
 
 Result<> signStagedCatalog(const std::string& site, const CatalogSigner& signer) {
     const std::string path = pathIn(site, kUnsignedCatalogFileName);
-    plist::Refusal refusal;
-    std::optional<std::string> bytes = plist::readFileBytes(path, &refusal);
+    Result<std::string> bytes = plist::readFileBytes(path);
     if (!bytes) {
-        return Failure{path + ": " + (refusal.reason.empty() ? "cannot be read" : refusal.reason) +
+        return Failure{path + ": " + bytes.reason() +
                        "; 'publish --stage' and the other commands write it"};
     }
     Result<plist::Value> catalog = catalog::parseCatalog(*bytes);

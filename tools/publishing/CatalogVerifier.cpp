@@ -168,13 +168,11 @@ Result<std::string> readPublished(const std::string& location, std::size_t maxBy
     if (isURL(location)) {
         return http::fetchHttpBody(location, maxBytes, kTransferLimits);
     }
-    plist::Refusal refusal;
-    std::optional<std::string> bytes = plist::readFileBytes(location, &refusal);
+    Result<std::string> bytes = plist::readFileBytes(location);
     if (!bytes) {
-        return Failure{"cannot read " + location +
-                       (refusal.reason.empty() ? "" : ": " + refusal.reason)};
+        return Failure{"cannot read " + location + ": " + bytes.reason()};
     }
-    return std::move(*bytes);
+    return bytes;
 }
 
 VerifyReport verifyPublishedCatalog(const VerifyRequest& request) {
