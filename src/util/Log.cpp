@@ -278,17 +278,10 @@ void logObjectFormatV(const char* format, va_list arguments) {
     logObjectFormatV(LogPriority::Notice, format, arguments);
 }
 
-void logObjectFormat(LogPriority priority, const char* format, ...) {
+void logObjectFormatArguments(LogPriority priority, const char* format, ...) {
     va_list arguments;
     va_start(arguments, format);
     logObjectFormatV(priority, format, arguments);
-    va_end(arguments);
-}
-
-void logObjectFormat(const char* format, ...) {
-    va_list arguments;
-    va_start(arguments, format);
-    logObjectFormatV(LogPriority::Notice, format, arguments);
     va_end(arguments);
 }
 

@@ -5,20 +5,34 @@
 //
 // Object formats are printf formats plus "%@", whose argument is a `const tavrix::plist::Value*`
 // rendered by its description, or "(null)" for a null pointer. C formats are plain printf
-// formats, checked by the compiler.
+// formats. The compiler checks both against their arguments (LogFormatCheck.h, and the format
+// attribute).
 //
 // A message is a notice unless its caller says it reports a failure (LogPriority::Warning).
 #pragma once
 
 #include <cstdarg>
 #include <string>
+#include <type_traits>
+
+#include "util/LogFormatCheck.h"
 
 namespace tavrix {
 
 enum class LogPriority { Notice, Warning };
 
-void logObjectFormat(const char* format, ...);
-void logObjectFormat(LogPriority priority, const char* format, ...);
+// What the checked calls below hand their arguments to.
+void logObjectFormatArguments(LogPriority priority, const char* format, ...);
+
+template <typename... Args>
+void logObjectFormat(ObjectFormat<std::type_identity_t<Args>...> format, Args... arguments) {
+    logObjectFormatArguments(LogPriority::Notice, format.text, arguments...);
+}
+template <typename... Args>
+void logObjectFormat(LogPriority priority, ObjectFormat<std::type_identity_t<Args>...> format,
+                     Args... arguments) {
+    logObjectFormatArguments(priority, format.text, arguments...);
+}
 void logObjectFormatV(const char* format, va_list arguments);
 void logObjectFormatV(LogPriority priority, const char* format, va_list arguments);
 void logCFormat(const char* format, ...) __attribute__((format(printf, 1, 2)));

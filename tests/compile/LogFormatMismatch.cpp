@@ -1,0 +1,21 @@
+// Object formats that must not compile, one per CASE; CASE 0 is the well-formed call beside them,
+// so that the others fail for their mismatch and not for a broken build line.
+#include <cstddef>
+
+#include "plist/Value.h"
+#include "util/Log.h"
+
+void logSomething(const tavrix::plist::Value& value) {
+    using tavrix::logObjectFormat;
+#if CASE == 0
+    logObjectFormat("%@ %zu %*d %s", &value, std::size_t{1}, 2, 3, "text");
+#elif CASE == 1
+    logObjectFormat("%@", value);  // the value, not a pointer to it
+#elif CASE == 2
+    logObjectFormat("%@ and %u", &value);  // an argument missing
+#elif CASE == 3
+    logObjectFormat("%d", 1, 2);  // one too many
+#elif CASE == 4
+    logObjectFormat("%d", std::size_t{1});  // a wider integer than the conversion reads
+#endif
+}
