@@ -5,6 +5,7 @@
 
 #include <array>
 #include <cstddef>
+#include <cstdint>
 #include <type_traits>
 
 namespace tavrix {
@@ -46,13 +47,13 @@ consteval Kind kindOf() {
         } else {
             return Kind::Pointer;
         }
-    } else if constexpr (std::is_integral_v<U> && sizeof(U) <= sizeof(int)) {
-        // Promoted to int (or passed as unsigned int, of the same width).
-        return Kind::Int;
     } else if constexpr (std::is_same_v<U, long> || std::is_same_v<U, unsigned long>) {
         return Kind::Long;
     } else if constexpr (std::is_same_v<U, long long> || std::is_same_v<U, unsigned long long>) {
         return Kind::LongLong;
+    } else if constexpr (std::is_integral_v<U> && sizeof(U) <= sizeof(int)) {
+        // Promoted to int (or passed as unsigned int, of the same width).
+        return Kind::Int;
     } else if constexpr (std::is_same_v<U, float> || std::is_same_v<U, double>) {
         return Kind::Double;
     } else if constexpr (std::is_same_v<U, long double>) {
@@ -118,9 +119,15 @@ consteval void check(const char* format, const std::array<Kind, Count>& argument
         } else if (*p == 'q') {
             integer = Kind::LongLong;
             ++p;
-        } else if (*p == 'l' || *p == 'j' || *p == 'z' || *p == 't') {
+        } else if (*p == 'l') {
             integer = Kind::Long;
-            longForm = *p == 'l';
+            longForm = true;
+            ++p;
+        } else if (*p == 'j' || *p == 'z' || *p == 't') {
+            // Whichever type the platform's intmax_t, size_t and ptrdiff_t are.
+            integer = *p == 'j'   ? kindOf<std::intmax_t>()
+                      : *p == 'z' ? kindOf<std::size_t>()
+                                  : kindOf<std::ptrdiff_t>();
             ++p;
         } else if (*p == 'L') {
             longForm = true;

@@ -16,6 +16,6 @@ void logSomething(const tavrix::plist::Value& value) {
 #elif CASE == 3
     logObjectFormat("%d", 1, 2);  // one too many
 #elif CASE == 4
-    logObjectFormat("%d", std::size_t{1});  // a wider integer than the conversion reads
+    logObjectFormat("%d", 1LL);  // a wider integer than the conversion reads
 #endif
 }
