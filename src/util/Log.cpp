@@ -8,6 +8,7 @@
 #include <string_view>
 
 #include "plist/Value.h"
+#include "util/FormatConversion.h"
 #include "util/SystemLog.h"
 
 namespace tavrix {
@@ -51,7 +52,8 @@ void appendValue(std::string& out, std::string_view value) {
     }
 }
 
-enum class Length { None, Char, Short, Long, LongLong, IntMax, Size, PtrDiff, LongDouble };
+using logformat::Length;
+using logformat::Reads;
 
 // Formats one printf conversion (already stripped of '*') with one argument.
 template <typename T>
@@ -133,136 +135,82 @@ std::string formatObjectMessage(const char* format, va_list arguments) {
             break;
         }
         out.append(p, static_cast<std::size_t>(percent - p));
-        p = percent + 1;
+        const logformat::Conversion conversion = logformat::parseConversion(percent + 1);
+        p = conversion.next;
+        // Width and precision given as '*' are taken from the arguments and written in place;
+        // spec leaves the length out, for the conversions that read a promoted argument.
         std::string spec = "%";
-        while (*p != '\0' && std::strchr("-+ #0'", *p) != nullptr) {
-            spec += *p++;
-        }
-        // Width and precision given as '*' are taken from the arguments and written in place.
-        auto takeNumber = [&]() {
-            if (*p == '*') {
+        spec += conversion.flags;
+        auto appendNumber = [&](std::string_view number) {
+            if (number == "*") {
                 spec += std::to_string(va_arg(cursor, int));
-                ++p;
-                return;
-            }
-            while (*p >= '0' && *p <= '9') {
-                spec += *p++;
+            } else {
+                spec += number;
             }
         };
-        takeNumber();
-        if (*p == '.') {
-            spec += *p++;
-            takeNumber();
+        appendNumber(conversion.width);
+        if (conversion.hasPrecision) {
+            spec += '.';
+            appendNumber(conversion.precision);
         }
-        Length length = Length::None;
-        std::size_t lengthStart = spec.size();
-        for (bool more = true; more && *p != '\0';) {
-            switch (*p) {
-                case 'h':
-                    length = length == Length::Short ? Length::Char : Length::Short;
-                    break;
-                case 'l':
-                    length = length == Length::Long ? Length::LongLong : Length::Long;
-                    break;
-                case 'q':
-                    length = Length::LongLong;
-                    break;
-                case 'j':
-                    length = Length::IntMax;
-                    break;
-                case 'z':
-                    length = Length::Size;
-                    break;
-                case 't':
-                    length = Length::PtrDiff;
-                    break;
-                case 'L':
-                    length = Length::LongDouble;
-                    break;
-                default:
-                    more = false;
-                    continue;
-            }
-            spec += *p++;
-        }
-        char conversion = *p;
-        if (conversion == '\0') {
-            out += spec;  // a format ending in a lone '%' keeps its text
-            break;
-        }
-        ++p;
-        if (conversion == 'q') {
-            conversion = 'd';
-        }
-        switch (conversion) {
-            case '%':
-                out += '%';
+        const char letter = conversion.letter;
+        const std::string withLength = spec + std::string(conversion.lengthText);
+        const Length length = conversion.length;
+        switch (logformat::readsOf(letter)) {
+            case Reads::Nothing:
+                if (letter == '%') {
+                    out += '%';
+                } else {
+                    // An unknown conversion, or the end of the format inside one, is kept as text.
+                    out += withLength;
+                    out += std::string_view(&letter, letter == '\0' ? 0 : 1);
+                }
                 break;
-            case '@': {
+            case Reads::Object: {
                 const auto* value = va_arg(cursor, const plist::Value*);
                 appendValue(out, plist::describe(value));
                 break;
             }
-            case 'd':
-            case 'i':
-                appendSigned(out, spec + conversion, length, cursor);
+            case Reads::Signed:
+                appendSigned(out, withLength + letter, length, cursor);
                 break;
-            case 'u':
-            case 'o':
-            case 'x':
-            case 'X':
-                appendUnsigned(out, spec + conversion, length, cursor);
+            case Reads::Unsigned:
+                appendUnsigned(out, withLength + letter, length, cursor);
                 break;
-            case 'c':
+            case Reads::Character:
                 if (length == Length::Long) {
-                    appendFormatted(out, spec + conversion, va_arg(cursor, wint_t));
+                    appendFormatted(out, withLength + letter, va_arg(cursor, wint_t));
                 } else {
-                    appendFormatted(out, spec.substr(0, lengthStart) + conversion,
-                                    va_arg(cursor, int));
+                    appendFormatted(out, spec + letter, va_arg(cursor, int));
                 }
                 break;
-            case 'e':
-            case 'E':
-            case 'f':
-            case 'F':
-            case 'g':
-            case 'G':
-            case 'a':
-            case 'A':
+            case Reads::Real:
                 if (length == Length::LongDouble) {
-                    appendFormatted(out, spec + conversion, va_arg(cursor, long double));
+                    appendFormatted(out, withLength + letter, va_arg(cursor, long double));
                 } else {
-                    appendFormatted(out, spec.substr(0, lengthStart) + conversion,
-                                    va_arg(cursor, double));
+                    appendFormatted(out, spec + letter, va_arg(cursor, double));
                 }
                 break;
-            case 's': {
+            case Reads::Text:
                 if (length == Length::Long) {
                     const auto* text = va_arg(cursor, const wchar_t*);
-                    appendFormatted(out, spec + conversion, text == nullptr ? L"(null)" : text);
+                    appendFormatted(out, withLength + letter, text == nullptr ? L"(null)" : text);
                 } else {
                     const char* text = va_arg(cursor, const char*);
                     // Only what can be shown is read, and the rest is never copied.
                     std::string shown(text == nullptr ? "(null)" : text,
                                       text == nullptr ? 6 : ::strnlen(text, kMaxValueBytes + 1));
                     std::string formatted;
-                    appendFormatted(formatted, spec.substr(0, lengthStart) + conversion,
-                                    shown.c_str());
+                    appendFormatted(formatted, spec + letter, shown.c_str());
                     appendValue(out, formatted);
                 }
                 break;
-            }
-            case 'p':
-                appendFormatted(out, spec.substr(0, lengthStart) + conversion,
-                                va_arg(cursor, void*));
+            case Reads::Pointer:
+                appendFormatted(out, spec + letter, va_arg(cursor, void*));
                 break;
-            case 'n':
+            case Reads::Count:
                 // Writing through a log argument is never wanted; the pointer is skipped.
                 (void)va_arg(cursor, void*);
-                break;
-            default:
-                // An unknown conversion is kept as text; it consumes no argument.
-                out += spec + conversion;
                 break;
         }
     }

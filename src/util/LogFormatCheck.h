@@ -8,6 +8,8 @@
 #include <cstdint>
 #include <type_traits>
 
+#include "util/FormatConversion.h"
+
 namespace tavrix {
 
 namespace plist {
@@ -66,13 +68,28 @@ consteval Kind kindOf() {
 // Not constexpr: reaching it while checking a format stops the compilation there.
 void formatDoesNotMatchItsArguments();
 
-constexpr bool isDigit(char c) {
-    return c >= '0' && c <= '9';
-}
-
 constexpr bool isPointer(Kind kind) {
     return kind == Kind::Pointer || kind == Kind::Text || kind == Kind::WideText ||
            kind == Kind::Value || kind == Kind::Null;
+}
+
+// The integer a conversion with this length reads, as the platform defines intmax_t, size_t and
+// ptrdiff_t.
+consteval Kind integerKind(Length length) {
+    switch (length) {
+        case Length::Long:
+            return Kind::Long;
+        case Length::LongLong:
+            return Kind::LongLong;
+        case Length::IntMax:
+            return kindOf<std::intmax_t>();
+        case Length::Size:
+            return kindOf<std::size_t>();
+        case Length::PtrDiff:
+            return kindOf<std::ptrdiff_t>();
+        default:
+            return Kind::Int;
+    }
 }
 
 template <std::size_t Count>
@@ -85,94 +102,44 @@ consteval void check(const char* format, const std::array<Kind, Count>& argument
         ++next;
     };
     auto is = [](Kind wanted) { return [wanted](Kind kind) { return kind == wanted; }; };
-    for (const char* p = format; *p != '\0'; ++p) {
-        if (*p != '%') {
+    for (const char* p = format; *p != '\0';) {
+        if (*p++ != '%') {
             continue;
         }
-        ++p;
-        while (*p == '-' || *p == '+' || *p == ' ' || *p == '#' || *p == '0' || *p == '\'') {
-            ++p;
+        const Conversion conversion = parseConversion(p);
+        p = conversion.next;
+        if (conversion.width == "*") {
+            take(is(Kind::Int));
         }
-        for (int part = 0; part < 2; ++part) {
-            if (*p == '*') {
-                take(is(Kind::Int));
-                ++p;
-            }
-            while (isDigit(*p)) {
-                ++p;
-            }
-            if (part == 0 && *p != '.') {
-                break;
-            }
-            if (part == 0) {
-                ++p;
-            }
+        if (conversion.precision == "*") {
+            take(is(Kind::Int));
         }
-        // The length modifier: which integer or real the conversion reads.
-        Kind integer = Kind::Int;
-        bool longForm = false;
-        if (*p == 'h') {
-            p += p[1] == 'h' ? 2 : 1;
-        } else if (*p == 'l' && p[1] == 'l') {
-            integer = Kind::LongLong;
-            p += 2;
-        } else if (*p == 'q') {
-            integer = Kind::LongLong;
-            ++p;
-        } else if (*p == 'l') {
-            integer = Kind::Long;
-            longForm = true;
-            ++p;
-        } else if (*p == 'j' || *p == 'z' || *p == 't') {
-            // Whichever type the platform's intmax_t, size_t and ptrdiff_t are.
-            integer = *p == 'j'   ? kindOf<std::intmax_t>()
-                      : *p == 'z' ? kindOf<std::size_t>()
-                                  : kindOf<std::ptrdiff_t>();
-            ++p;
-        } else if (*p == 'L') {
-            longForm = true;
-            ++p;
-        }
-        switch (*p) {
-            case '\0':
-                // A lone '%' ends the format as text.
-                --p;
+        const bool wide = conversion.length == Length::Long;
+        switch (readsOf(conversion.letter)) {
+            case Reads::Signed:
+            case Reads::Unsigned:
+                take(is(integerKind(conversion.length)));
                 break;
-            case 'd':
-            case 'i':
-            case 'u':
-            case 'o':
-            case 'x':
-            case 'X':
-                take(is(integer));
-                break;
-            case 'c':
+            case Reads::Character:
+                // An int, or a wint_t of the same width.
                 take(is(Kind::Int));
                 break;
-            case 'e':
-            case 'E':
-            case 'f':
-            case 'F':
-            case 'g':
-            case 'G':
-            case 'a':
-            case 'A':
-                take(is(longForm ? Kind::LongDouble : Kind::Double));
+            case Reads::Real:
+                take(is(conversion.length == Length::LongDouble ? Kind::LongDouble : Kind::Double));
                 break;
-            case 's':
-                take([longForm](Kind kind) {
-                    return kind == (longForm ? Kind::WideText : Kind::Text) || kind == Kind::Null;
+            case Reads::Text:
+                take([wide](Kind kind) {
+                    return kind == (wide ? Kind::WideText : Kind::Text) || kind == Kind::Null;
                 });
                 break;
-            case '@':
+            case Reads::Object:
                 take([](Kind kind) { return kind == Kind::Value || kind == Kind::Null; });
                 break;
-            case 'p':
-            case 'n':
+            case Reads::Pointer:
+            case Reads::Count:
                 take(isPointer);
                 break;
-            default:
-                // "%%", and an unknown conversion kept as text, read nothing.
+            case Reads::Nothing:
                 break;
         }
     }
