@@ -1,8 +1,5 @@
 #include "bundle/BundleInfo.h"
 
-#include <sys/stat.h>
-#include <unistd.h>
-
 #include <cerrno>
 #include <map>
 #include <memory>

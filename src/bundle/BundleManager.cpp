@@ -1,7 +1,5 @@
 #include "bundle/BundleManager.h"
 
-#include <sys/stat.h>
-
 #include <cstdio>
 #include <optional>
 

@@ -1,7 +1,5 @@
 #include "bundle/InterruptedChanges.h"
 
-#include <unistd.h>
-
 #include <algorithm>
 #include <optional>
 #include <vector>

@@ -1,7 +1,5 @@
 #include "catalog/AssetCatalog.h"
 
-#include <sys/stat.h>
-
 #include <cerrno>
 #include <cstring>
 

@@ -1,7 +1,6 @@
 #include "catalog/AssetDownload.h"
 
 #include <fcntl.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>

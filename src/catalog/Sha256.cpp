@@ -2,7 +2,6 @@
 
 #include <fcntl.h>
 #include <openssl/evp.h>
-#include <unistd.h>
 
 #include <cerrno>
 
