@@ -124,9 +124,11 @@ StatusPublisher& StatusPublisher::shared() {
         [] { return std::unique_ptr<StatusPublisher>(new StatusPublisher()); });
 }
 
-bool StatusPublisher::attach(sd_event* event, sd_bus* bus, const char* path) {
+bool StatusPublisher::attach(sd_event* event, sd_bus* bus, const char* path,
+                             std::function<bool()> holdsInstanceLock) {
     bus_ = bus;
     path_ = path;
+    holdsInstanceLock_ = std::move(holdsInstanceLock);
     io::UniqueFd wakeFd(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
     sd_event_source* raw = nullptr;
     int r = wakeFd ? sd_event_add_io(event, &raw, wakeFd.get(), EPOLLIN, onWake, this) : -errno;
@@ -200,7 +202,7 @@ void StatusPublisher::publish() {
         return;
     }
     if (TXManager::exists()) {
-        plist::Dictionary status = copyDaemonStatus();
+        plist::Dictionary status = copyDaemonStatus(holdsInstanceLock());
         std::vector<const char*> changed;
         for (const StatusProperty& property : kChangingProperties) {
             if (!announced_ ||
@@ -238,7 +240,7 @@ const plist::Dictionary& StatusPublisher::statusForCall(sd_bus_message* reply) {
     std::pair<std::string, std::uint64_t> call(destination != nullptr ? destination : "", cookie);
     // GetAll asks for every property with the same reply: one read answers them all.
     if (cookie == 0 || call != readFor_) {
-        readForCall_ = copyDaemonStatus();
+        readForCall_ = copyDaemonStatus(holdsInstanceLock());
         readFor_ = std::move(call);
         if (!announced_ && !stale_) {
             announced_ = readForCall_;  // what this client now knows needs no announcement

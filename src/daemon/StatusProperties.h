@@ -13,6 +13,7 @@
 
 #include <atomic>
 #include <cstdint>
+#include <functional>
 #include <mutex>
 #include <optional>
 #include <string>
@@ -32,9 +33,12 @@ class StatusPublisher {
     // The process's publisher; never destroyed, as worker threads may still report to it.
     static StatusPublisher& shared();
 
-    // Announces on bus, at path on the status interface, from event's loop. False (logged) when
-    // the loop refused the wake-up source; the properties are then still readable.
-    bool attach(sd_event* event, sd_bus* bus, const char* path);
+    // Announces on bus, at path on the status interface, from event's loop. Until
+    // holdsInstanceLock() is true, reads leave out what would start the previous daemon's work
+    // here. False (logged) when the loop refused the wake-up source; the properties are then
+    // still readable.
+    bool attach(sd_event* event, sd_bus* bus, const char* path,
+                std::function<bool()> holdsInstanceLock);
     // Announces what is pending, then stops announcing.
     void detach();
 
@@ -60,10 +64,13 @@ class StatusPublisher {
     // The status a Get or GetAll answers from: read once per call.
     const plist::Dictionary& statusForCall(sd_bus_message* reply);
     void wake();
+    // False until attached: nothing is known to be safe to start.
+    bool holdsInstanceLock() const { return holdsInstanceLock_ && holdsInstanceLock_(); }
 
     // Main thread only.
     sd_bus* bus_ = nullptr;
     const char* path_ = nullptr;
+    std::function<bool()> holdsInstanceLock_;
     bus::EventSourcePtr source_;
     // What the last PropertiesChanged said; nothing until the status was first read.
     std::optional<plist::Dictionary> announced_;

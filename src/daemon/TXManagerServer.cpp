@@ -272,7 +272,8 @@ bool TXManagerServer::_startServing() {
         return false;
     }
     // Without announcements the properties still answer; that is no reason not to serve.
-    StatusPublisher::shared().attach(event, _listener.bus(), kTXServiceObjectPath);
+    StatusPublisher::shared().attach(event, _listener.bus(), kTXServiceObjectPath,
+                                     [this] { return _holdsInstanceLock; });
 
     TXTransactionManager::sharedInstance().beginTransaction(kMinimumLaunchTransaction);
     auto endLaunchTransaction = [](sd_event_source*, uint64_t, void*) -> int {

@@ -74,15 +74,27 @@ int refuseStatus(sd_bus_message* message) {
     return sd_bus_reply_method_errorf(message, SD_BUS_ERROR_FAILED, "The status could not be read");
 }
 
+// What a call needs before it may run: nothing (it only reads), or this daemon holding the
+// instance lock (it may change bundles, which the previous daemon may still be doing).
+enum class Needs { Nothing, InstanceLock };
+
 // The one wrapper around every handler: an exception must not unwind through sd-bus. One thrown
 // while the call was handled is logged with the method's name, the call gets its "no" answer,
 // and the status properties are looked at again, as the call may have changed what they show.
-template <int (*Handler)(sd_bus_message*, void*, sd_bus_error*), int (*Refuse)(sd_bus_message*)>
+template <int (*Handler)(sd_bus_message*, void*, sd_bus_error*), int (*Refuse)(sd_bus_message*),
+          Needs Requirement = Needs::Nothing>
 int handled(sd_bus_message* message, void* userdata, sd_bus_error* error) noexcept {
     int result = 0;
     const char* method = sd_bus_message_get_member(message);
-    if (!containExceptions(method != nullptr ? method : "A call",
-                           [&] { result = Handler(message, userdata, error); })) {
+    if (!containExceptions(method != nullptr ? method : "A call", [&] {
+            auto& server = *static_cast<TXManagerServer*>(userdata);
+            if (Requirement == Needs::InstanceLock && !server.holdsInstanceLock()) {
+                result =
+                    server.deferUntilLocked(message, handled<Handler, Refuse, Requirement>, Refuse);
+            } else {
+                result = Handler(message, userdata, error);
+            }
+        })) {
         containExceptions("A refusal", [&] {
             StatusPublisher::shared().markStale();
             result = Refuse(message);
@@ -93,10 +105,6 @@ int handled(sd_bus_message* message, void* userdata, sd_bus_error* error) noexce
 
 int handleSetTavrixID(sd_bus_message* message, void* userdata, sd_bus_error* error) {
     auto& server = *static_cast<TXManagerServer*>(userdata);
-    if (!server.holdsInstanceLock()) {
-        return server.deferUntilLocked(message, handled<handleSetTavrixID, refuseBoolean>,
-                                       refuseBoolean);
-    }
     const char* tavrixID = nullptr;
     std::optional<std::vector<std::uint8_t>> bundle;
     if (int r = sd_bus_message_read(message, "s", &tavrixID); r < 0) {
@@ -201,10 +209,6 @@ int refuseValue(sd_bus_message* message) {
 
 int handleCheckForTavrixBundleUpdate(sd_bus_message* message, void* userdata, sd_bus_error*) {
     auto& server = *static_cast<TXManagerServer*>(userdata);
-    if (!server.holdsInstanceLock()) {
-        return server.deferUntilLocked(
-            message, handled<handleCheckForTavrixBundleUpdate, refuseBoolean>, refuseBoolean);
-    }
     bool answer = false;
     {
         MessageScope scope(server, message);
@@ -255,15 +259,17 @@ int handleGetStatus(sd_bus_message* message, void* userdata, sd_bus_error* error
     return sd_bus_send(nullptr, replyMessage.get(), nullptr);
 }
 
-// Each method as the bus calls it: its handler inside the one wrapper, with its "no" answer.
-constexpr sd_bus_message_handler_t kSetTavrixID = handled<handleSetTavrixID, refuseBoolean>;
+// Each method as the bus calls it: its handler inside the one wrapper, with its "no" answer and
+// what it needs before it runs.
+constexpr sd_bus_message_handler_t kSetTavrixID =
+    handled<handleSetTavrixID, refuseBoolean, Needs::InstanceLock>;
 constexpr sd_bus_message_handler_t kSetTavrixIDWithBundleFD =
-    handled<handleSetTavrixIDWithBundleFD, refuseBundleFD>;
+    handled<handleSetTavrixIDWithBundleFD, refuseBundleFD, Needs::InstanceLock>;
 constexpr sd_bus_message_handler_t kIsTavrixBundleSupported =
     handled<handleIsTavrixBundleSupported, refuseBoolean>;
 constexpr sd_bus_message_handler_t kCopyTavrixValue = handled<handleCopyTavrixValue, refuseValue>;
 constexpr sd_bus_message_handler_t kCheckForTavrixBundleUpdate =
-    handled<handleCheckForTavrixBundleUpdate, refuseBoolean>;
+    handled<handleCheckForTavrixBundleUpdate, refuseBoolean, Needs::InstanceLock>;
 constexpr sd_bus_message_handler_t kSetClientType = handled<handleSetClientType, refuseBoolean>;
 constexpr sd_bus_message_handler_t kGetStatus = handled<handleGetStatus, refuseStatus>;
 

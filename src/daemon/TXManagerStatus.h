@@ -22,6 +22,6 @@ inline constexpr const char* kStatusWaitingForPreviousDaemonKey = "WaitingForPre
 // The status dictionary; a key is absent when its answer is unknown or none. A daemon that does not
 // hold the instance lock yet leaves out the linked bundle and the next check (reading them would
 // start the bundle manager's clean-up and the check timer) and says it is waiting.
-plist::Dictionary copyDaemonStatus(bool holdsInstanceLock = true);
+plist::Dictionary copyDaemonStatus(bool holdsInstanceLock);
 
 }  // namespace tavrix

@@ -356,7 +356,8 @@ TEST_F(OverTheAirUpdateTest, KilledAnywhereInAnUpdateTheNextLaunchCompletesOrRed
 }
 
 // A daemon leaving while it installs an update finishes it; one activated meanwhile by a payload
-// acts only once the old one has ended, so the payload ends linked, whole and reported.
+// (as bytes or, every other round, as a descriptor) acts only once the old one has ended, so the
+// payload ends linked, whole and reported; reading its status meanwhile starts nothing either.
 TEST_F(OverTheAirUpdateTest, DaemonStartedWhileTheLastOneDrainsActsAfterIt) {
     constexpr std::size_t kBulk = 1 << 20;
     setIDWithBundle("1");
@@ -377,13 +378,28 @@ TEST_F(OverTheAirUpdateTest, DaemonStartedWhileTheLastOneDrainsActsAfterIt) {
         ASSERT_TRUE(waitForNoNameOwner());
 
         const std::vector<std::uint8_t> packed = pack(writeBundle(payload, kBulk));
-        auto answer = std::async(std::launch::async,
-                                 [&] { return client().setTavrixID(kBehaviorID, packed); });
+        auto answer = std::async(std::launch::async, [&] {
+            if (round % 2 == 0) {
+                return client().setTavrixID(kBehaviorID, packed);
+            }
+            const fs::path file = device().base() / ("payload-" + payload);
+            writeText(file, std::string(packed.begin(), packed.end()));
+            io::UniqueFd fd(::open(file.c_str(), O_RDONLY | O_CLOEXEC));
+            return client().setTavrixIDWithBundleFile(kBehaviorID, fd.get()).extracted;
+        });
         ASSERT_TRUE(waitForNameOwner());
-        // Meanwhile the new daemon answers what only reads, and says that it waits.
+        // Meanwhile the new daemon answers what only reads, and says that it waits; its
+        // properties leave out the linked bundle, whose reading would start a bundle match.
         EXPECT_TRUE(client().isTavrixBundleSupported());
         expectFields(tavrixctlJson({"status"}),
                      {{"WaitingForPreviousDaemon", "true"}, {"LinkedBundle", "(absent)"}});
+        char* versionProperty = nullptr;
+        ASSERT_GE(sd_bus_get_property_string(watcher().bus(), kDaemonBusName, kDaemonObjectPath,
+                                             kStatusInterface, "LinkedBundleVersion", nullptr,
+                                             &versionProperty),
+                  0);
+        EXPECT_STREQ(versionProperty, "");
+        std::free(versionProperty);
         server.releaseHeldResponses();
         EXPECT_TRUE(answer.get());
         ASSERT_EQ(waitForDaemonExit(*pid, 70s), std::optional<int>(0));
