@@ -211,8 +211,10 @@ BundleChangeType BundleManager::runBundleReset() {
             logCFormat(LogPriority::Warning, "Could not link bundle file!\n");
             return kBundleChangeTypeNoChange;
         }
-        device::PreferencesStore::shared().synchronize(kBehaviorPreferencesDomain,
-                                                       device::MobileUser::name());
+        // Nothing is pending here: this drops the cached reading, so that the settings are read
+        // again through the new link.
+        (void)device::PreferencesStore::shared().synchronize(kBehaviorPreferencesDomain,
+                                                             device::MobileUser::name());
         bus::postNotification(kBundleChangedNotification);
         pruneOverriddenFilesOfRemovedBundles(currentBundle_.carrierFilePath);
     }

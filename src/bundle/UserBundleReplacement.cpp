@@ -32,7 +32,14 @@ Result<> BundleManager::replaceUserBundle(const UserBundleFill& fill) {
         return failure;
     }
     const std::string staging = payload::extractionStagingPathFor(bundle);
-    removeItemTree(staging);
+    // A fill into what an earlier attempt left would mix the two bundles.
+    if (int error = removeItemTree(staging); error != 0 && error != ENOENT) {
+        logCFormat(LogPriority::Warning,
+                   "Could not clear the staging directory %s (error %d), keeping the old bundle\n",
+                   staging.c_str(), error);
+        return Failure{std::string("the staging directory could not be cleared: ") +
+                       std::strerror(error)};
+    }
     const BundleFillOutcome filled = fill(staging);
     if (filled.fill == BundleFill::Refused) {
         removeItemTree(staging);

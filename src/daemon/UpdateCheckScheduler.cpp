@@ -1,5 +1,7 @@
 #include "daemon/UpdateCheckScheduler.h"
 
+#include <cmath>
+
 #include "bus/TXTransactionManager.h"
 #include "daemon/TXManager.h"
 #include "device/BehaviorPreferences.h"
@@ -66,9 +68,14 @@ void UpdateCheckScheduler::startTimer() {
 void UpdateCheckScheduler::setUpNewTimer(double seconds) {
     std::lock_guard lock(_rearmLock);
     logObjectFormat("Setting up a new update check timer");
-    plist::Date nextUpdate{Clock::absoluteTimeNow() + seconds};
-    setBehaviorPreference(kNextUpdateKey, plist::Value(nextUpdate));
-    scheduleJob();
+    // Whole seconds, as the stored date keeps them: the job and "NextUpdate" name one moment.
+    const double start = std::floor(Clock::absoluteTimeNow() + seconds);
+    if (!setBehaviorPreference(kNextUpdateKey, plist::Value(plist::Date{start}))) {
+        // This run still checks on time; a later launch arms from what is stored.
+        logCFormat(LogPriority::Warning,
+                   "Could not store the next update time; scheduling the check all the same\n");
+    }
+    scheduleJobAt(start);
 }
 
 void UpdateCheckScheduler::scheduleJob() {
@@ -80,7 +87,10 @@ void UpdateCheckScheduler::scheduleJob() {
             "No update time in the preferences list, the update check is not scheduled");
         return;
     }
-    const double start = nextUpdate->secondsSinceReferenceDate;
+    scheduleJobAt(nextUpdate->secondsSinceReferenceDate);
+}
+
+void UpdateCheckScheduler::scheduleJobAt(double start) {
     plist::Dictionary criteria{
         {std::string(bus::kJobWindowStartDate), start},
         {std::string(bus::kJobWindowEndDate), start + kUpdateCheckWindowSeconds},

@@ -54,12 +54,14 @@ class UpdateCheckScheduler {
 
   private:
     UpdateCheckScheduler();
+    // Registers the one job for a window starting then; the caller holds _rearmLock.
+    void scheduleJobAt(double start);
 
     SerialQueue _schedulerQueue;
     std::optional<bus::BackgroundJobScheduler> _jobScheduler;
     // Re-arming runs on the main thread, the scheduler queue and the download thread; this keeps
     // "NextUpdate" and the registered job in step.
-    std::recursive_mutex _rearmLock;
+    std::mutex _rearmLock;
 };
 
 }  // namespace tavrix

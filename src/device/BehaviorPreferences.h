@@ -30,6 +30,6 @@ std::optional<plist::Value> copyBehaviorPreference(std::string_view key);
 // Sets the value for key (nothing removes it) and synchronizes the domain at once, so the value is
 // on disk when this returns. Answers whether synchronizing succeeded; when it did not, the value
 // is dropped, so that reads show what is stored.
-bool setBehaviorPreference(std::string_view key, const std::optional<plist::Value>& value);
+[[nodiscard]] bool setBehaviorPreference(std::string_view key, const std::optional<plist::Value>& value);
 
 }  // namespace tavrix

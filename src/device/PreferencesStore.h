@@ -44,11 +44,11 @@ class PreferencesStore {
 
     // Writes the pending values of the domain to disk and forgets cached reads, so changes made by
     // others are seen. False when the domain could not be written; its pending values are kept.
-    bool synchronize(std::string_view domain, std::string_view user);
+    [[nodiscard]] bool synchronize(std::string_view domain, std::string_view user);
 
     // setValue and synchronize in one step; when the domain cannot be written, the value is not
     // kept pending, so that reads answer what is stored.
-    bool storeValue(std::string_view key, const std::optional<plist::Value>& value,
+    [[nodiscard]] bool storeValue(std::string_view key, const std::optional<plist::Value>& value,
                     std::string_view domain, std::string_view user);
 
   private:

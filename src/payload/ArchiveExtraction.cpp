@@ -152,7 +152,10 @@ ExtractionOutcome extract(const std::string& archivePath, const std::function<in
     }
     FileSystemHelper helper;
     if (!helper.fileExists(destinationDirectory)) {
-        helper.createDirectory(destinationDirectory, kDestinationMode, true);
+        if (int error = helper.createDirectory(destinationDirectory, kDestinationMode, true);
+            error != 0) {
+            return fail("Cannot create " + destinationDirectory + ": " + std::strerror(error));
+        }
     }
     std::string destination = destinationDirectory;
     if (safety == ExtractionSafety::PathSafe) {

@@ -329,8 +329,11 @@ bool AssetHandler::installDownloadedBundle(const std::string& source) {
         BundleManager::sharedInstance().resetBehaviorBundle(*behaviorID->asString());
     }
     // From here on a crash leaves only the purge to do: a purge cut short leaves part of the
-    // download, which must never be installed.
-    writePendingInstall({source, true});
+    // download, which must never be installed. A record that cannot say so must not stay
+    // saying "not installed".
+    if (!writePendingInstall({source, true})) {
+        removePendingInstall();
+    }
     return copied;
 }
 
@@ -342,9 +345,11 @@ bool AssetHandler::copyDownloadedBundle(const std::string& source, const std::st
         BundleManager::sharedInstance().replaceUserBundle([&](const std::string& staging) {
             FileSystemHelper files;
             logCFormat("Copying the directory %s to %s\n", source.c_str(), destination.c_str());
-            files.createDirectory(staging, 0755, true);
             std::vector<std::string> names;
-            int error = files.listDirectory(source, names, false);
+            int error = files.createDirectory(staging, 0755, true);
+            if (error == 0) {
+                error = files.listDirectory(source, names, false);
+            }
             if (error == 0) {
                 logCFormat("There are %ld files in directory %s\n", static_cast<long>(names.size()),
                            source.c_str());
@@ -393,9 +398,15 @@ void AssetHandler::resumePendingInstall(const PendingInstall& pendingInstall) {
                    "The interrupted install of %s cannot be completed: the download is gone\n",
                    asset.c_str());
     }
-    removeItemTree(asset);
+    const int purged = removeItemTree(asset);
     removePendingInstall();
-    logCFormat("Purged the download %s of the interrupted install\n", asset.c_str());
+    if (purged != 0 && purged != ENOENT) {
+        logCFormat(LogPriority::Warning,
+                   "Could not purge the download %s of the interrupted install (error %d)\n",
+                   asset.c_str(), purged);
+    } else {
+        logCFormat("Purged the download %s of the interrupted install\n", asset.c_str());
+    }
 }
 
 }  // namespace tavrix

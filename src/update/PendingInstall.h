@@ -20,7 +20,7 @@ std::string pendingInstallMarkerPath();
 
 // Records the install's state (flushed to disk before it answers). False, logged, when it cannot
 // be written.
-bool writePendingInstall(const PendingInstall& install);
+[[nodiscard]] bool writePendingInstall(const PendingInstall& install);
 // The install that did not finish, or nothing.
 std::optional<PendingInstall> readPendingInstall();
 void removePendingInstall();

@@ -22,7 +22,7 @@ class FileSystemHelper {
 
     // Creates a directory whose permissions are mode (not reduced by the umask); with
     // withIntermediates missing parents are created too and an existing directory is accepted.
-    int createDirectory(const std::string& path, mode_t mode, bool withIntermediates) const;
+    [[nodiscard]] int createDirectory(const std::string& path, mode_t mode, bool withIntermediates) const;
 
     // Removes a file, a symbolic link or a whole tree.
     int removeItem(const std::string& path) const;

@@ -24,8 +24,8 @@ class UpdateCheckSchedulerTest : public testing::Test {
     void SetUp() override { test::writeDeviceTable({{"contains-cellular-radio", false}}); }
 
     static void enableSupport(bool enabled) {
-        setBehaviorPreference(kEnableSupportKey, plist::Value(enabled));
-        setBehaviorPreference(kTavrixIDKey, plist::Value("acme.default"));
+        ASSERT_TRUE(setBehaviorPreference(kEnableSupportKey, plist::Value(enabled)));
+        ASSERT_TRUE(setBehaviorPreference(kTavrixIDKey, plist::Value("acme.default")));
     }
     static std::optional<double> nextUpdate() {
         auto stored = copyBehaviorPreference(kNextUpdateKey);
@@ -35,7 +35,7 @@ class UpdateCheckSchedulerTest : public testing::Test {
         return stored->asDate()->secondsSinceReferenceDate;
     }
     static void setNextUpdate(double seconds) {
-        setBehaviorPreference(kNextUpdateKey, plist::Value(plist::Date{seconds}));
+        ASSERT_TRUE(setBehaviorPreference(kNextUpdateKey, plist::Value(plist::Date{seconds})));
     }
     static plist::Dictionary registeredJobs() {
         auto stored =
@@ -79,7 +79,7 @@ TEST_F(UpdateCheckSchedulerTest, ArmsFifteenDaysAheadUnlessAFutureTimeIsStored) 
 
     // Without a date the job is left as it is, never registered for time 0 (at once).
     const auto registered = registeredJobs();
-    setBehaviorPreference(kNextUpdateKey, plist::Value("tomorrow"));
+    ASSERT_TRUE(setBehaviorPreference(kNextUpdateKey, plist::Value("tomorrow")));
     scheduler.scheduleJob();
     EXPECT_EQ(registeredJobs(), registered);
     scheduler.startTimer();
