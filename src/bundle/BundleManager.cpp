@@ -164,11 +164,15 @@ std::optional<std::string> BundleManager::copyBundleVersion() const {
 BundleChangeType BundleManager::resetBehaviorBundle(const std::optional<std::string>& behaviorID) {
     std::lock_guard lock(operationLock_);
     behaviorID_ = behaviorID;
-    return runBundleReset();
+    return runBundleResetLocked();
 }
 
 BundleChangeType BundleManager::runBundleReset() {
     std::lock_guard lock(operationLock_);
+    return runBundleResetLocked();
+}
+
+BundleChangeType BundleManager::runBundleResetLocked() {
     BundleChangeType result = kBundleChangeTypeNoChange;
     if (!behaviorID_) {
         logCFormat("There is no tavrix ID provided\n");

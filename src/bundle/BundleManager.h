@@ -55,6 +55,8 @@ class BundleManager {
 
   private:
     BundleManager();
+    // The reset flow; the caller holds operationLock_.
+    BundleChangeType runBundleResetLocked();
 
     std::optional<std::string> behaviorID_;
     std::string bundleLinkPath_;
@@ -64,8 +66,8 @@ class BundleManager {
     // the comparison says.
     bool linksDisagree_ = false;
     // Taken by every change of the bundles and every read of currentBundle_: the main thread and
-    // the download thread both come here. Recursive: a reset runs inside an install's call.
-    mutable std::recursive_mutex operationLock_;
+    // the download thread both come here.
+    mutable std::mutex operationLock_;
 };
 
 }  // namespace tavrix

@@ -43,7 +43,7 @@ class TXTransactionManager {
     std::set<std::string> _openTransactions;
     std::set<std::string> _keepAliveTransactions;
     bool _keepAliveClearable = true;
-    mutable std::recursive_mutex _lock;
+    mutable std::mutex _lock;
 };
 
 }  // namespace tavrix
