@@ -1,8 +1,5 @@
 #include "bus/NotificationCenter.h"
 
-#include <sys/eventfd.h>
-#include <unistd.h>
-
 #include <cstdint>
 #include <mutex>
 #include <thread>
@@ -10,7 +7,7 @@
 
 #include "bus/BusConnection.h"
 #include "bus/BusHandles.h"
-#include "io/UniqueFd.h"
+#include "io/WakeEvent.h"
 
 namespace tavrix::bus {
 namespace {
@@ -23,12 +20,12 @@ int emit(sd_bus* bus, const std::string& name) {
 
 // Subscribers match the sender against the owner of the daemon's name, so every notification
 // leaves on the connection that owns it. Other threads may not touch that connection: they hand
-// their names to the main loop, which an eventfd wakes.
+// their names to the main loop, which a wake event wakes.
 struct MainConnection {
     std::mutex mutex;
     sd_bus* bus = nullptr;
     std::thread::id thread;
-    io::UniqueFd wake;
+    io::WakeEvent wake;
     EventSourcePtr source;
     std::vector<std::string> pending;
 };
@@ -42,10 +39,7 @@ MainConnection& mainConnection() {
 // Takes what other threads queued; called on the main thread.
 std::vector<std::string> takePending(MainConnection& main) {
     std::lock_guard lock(main.mutex);
-    std::uint64_t count = 0;
-    if (main.wake && ::read(main.wake.get(), &count, sizeof count) < 0) {
-        // Nothing to read: another wake-up already took the names.
-    }
+    main.wake.consume();
     return std::exchange(main.pending, {});
 }
 
@@ -71,21 +65,21 @@ void setNotificationBus(sd_bus* bus) {
         }
         std::lock_guard lock(main.mutex);
         main.source.reset();
-        main.wake.reset();
+        main.wake = io::WakeEvent();
         main.bus = nullptr;
         return;
     }
     std::lock_guard lock(main.mutex);
     main.bus = bus;
     main.thread = std::this_thread::get_id();
-    main.wake.reset(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
+    main.wake = io::WakeEvent::create();
     sd_event_source* raw = nullptr;
     if (main.wake && sd_bus_get_event(bus) != nullptr &&
-        sd_event_add_io(sd_bus_get_event(bus), &raw, main.wake.get(), EPOLLIN, onQueued, nullptr) >=
+        sd_event_add_io(sd_bus_get_event(bus), &raw, main.wake.fd(), EPOLLIN, onQueued, nullptr) >=
             0) {
         main.source.reset(raw);
     } else {
-        main.wake.reset();
+        main.wake = io::WakeEvent();
     }
 }
 
@@ -99,8 +93,8 @@ bool postNotification(const std::string& name) {
         }
         if (main.source) {
             main.pending.push_back(name);
-            const std::uint64_t one = 1;
-            return ::write(main.wake.get(), &one, sizeof one) == sizeof one;
+            main.wake.raise();
+            return true;
         }
     }
     // No daemon connection (tools, tests of the core): a connection of this thread's own.

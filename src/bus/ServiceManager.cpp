@@ -1,7 +1,6 @@
 #include "bus/ServiceManager.h"
 
 #include <fcntl.h>
-#include <sys/eventfd.h>
 #include <sys/file.h>
 #include <sys/stat.h>
 #include <systemd/sd-daemon.h>
@@ -64,7 +63,7 @@ ServiceManager::ServiceManager()
       keepAlivePath_(runtimeDirectory_ + "/keep-alive"),
       idleGrace_(idleGraceFromEnvironment()),
       lastActivityTicks_(ticksNow()),
-      wakeFd_(::eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC)) {}
+      wake_(io::WakeEvent::create()) {}
 
 void ServiceManager::openTransaction() {
     openTransactions_.fetch_add(1);
@@ -133,21 +132,6 @@ void ServiceManager::noteActivity() {
 std::chrono::steady_clock::time_point ServiceManager::lastActivity() const {
     return std::chrono::steady_clock::time_point(
         std::chrono::steady_clock::duration(lastActivityTicks_.load()));
-}
-
-void ServiceManager::wake() {
-    if (wakeFd_) {
-        // A full counter already wakes the reader, so a failed write loses nothing.
-        std::uint64_t one = 1;
-        [[maybe_unused]] ssize_t written = ::write(wakeFd_.get(), &one, sizeof one);
-    }
-}
-
-void ServiceManager::consumeWake() {
-    if (wakeFd_) {
-        std::uint64_t count = 0;
-        [[maybe_unused]] ssize_t got = ::read(wakeFd_.get(), &count, sizeof count);
-    }
 }
 
 ServiceManager::InstanceLock ServiceManager::tryLockInstance() {

@@ -17,6 +17,7 @@
 #include <string>
 
 #include "io/UniqueFd.h"
+#include "io/WakeEvent.h"
 
 namespace tavrix::bus {
 
@@ -46,8 +47,8 @@ class ServiceManager {
     // the last wake was consumed, from whatever thread: the run loop watches it so that it
     // re-checks for idleness at once instead of at the end of its pass. -1 when it could not be
     // made (the loop then notices at the end of its pass).
-    int wakeFd() const { return wakeFd_.get(); }
-    void consumeWake();
+    int wakeFd() const { return wake_.fd(); }
+    void consumeWake() const { wake_.consume(); }
 
     // How long the daemon stays after becoming idle: $TAVRIX_IDLE_EXIT_SEC or 30 s.
     std::chrono::milliseconds idleGrace() const { return idleGrace_; }
@@ -65,7 +66,7 @@ class ServiceManager {
 
   private:
     ServiceManager();
-    void wake();
+    void wake() const { wake_.raise(); }
 
     std::string runtimeDirectory_;
     std::string keepAlivePath_;
@@ -73,7 +74,7 @@ class ServiceManager {
     std::atomic<int> openTransactions_{0};
     std::atomic<std::int64_t> lastActivityTicks_;
     mutable std::mutex keepAliveMutex_;
-    io::UniqueFd wakeFd_;
+    io::WakeEvent wake_;
     io::UniqueFd instanceLockFd_;  // kept open, and so locked, until the process ends
     bool instanceLockHeld_ = false;
     bool instanceLockFailureLogged_ = false;

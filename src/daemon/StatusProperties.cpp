@@ -1,8 +1,5 @@
 #include "daemon/StatusProperties.h"
 
-#include <sys/eventfd.h>
-#include <unistd.h>
-
 #include <cmath>
 #include <cstring>
 
@@ -129,9 +126,10 @@ bool StatusPublisher::attach(sd_event* event, sd_bus* bus, const char* path,
     bus_ = bus;
     path_ = path;
     holdsInstanceLock_ = std::move(holdsInstanceLock);
-    io::UniqueFd wakeFd(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK));
+    io::WakeEvent wakeEvent = io::WakeEvent::create();
     sd_event_source* raw = nullptr;
-    int r = wakeFd ? sd_event_add_io(event, &raw, wakeFd.get(), EPOLLIN, onWake, this) : -errno;
+    int r =
+        wakeEvent ? sd_event_add_io(event, &raw, wakeEvent.fd(), EPOLLIN, onWake, this) : -errno;
     source_.reset(raw);
     // Before the next call is handled, so that announcements keep the order of what caused them.
     if (r >= 0) {
@@ -143,7 +141,7 @@ bool StatusPublisher::attach(sd_event* event, sd_bus* bus, const char* path,
     }
     {
         std::lock_guard lock(pendingLock_);
-        wakeFd_ = std::move(wakeFd);
+        wakeEvent_ = std::move(wakeEvent);
     }
     setActivityObserver(onActivity);
     return true;
@@ -154,7 +152,7 @@ void StatusPublisher::detach() {
     publish();
     {
         std::lock_guard lock(pendingLock_);
-        wakeFd_.reset();
+        wakeEvent_ = io::WakeEvent();
     }
     source_.reset();
     bus_ = nullptr;
@@ -163,10 +161,7 @@ void StatusPublisher::detach() {
 void StatusPublisher::wake() {
     stale_ = true;
     std::lock_guard lock(pendingLock_);
-    const std::uint64_t one = 1;
-    if (wakeFd_ && ::write(wakeFd_.get(), &one, sizeof one) < 0) {
-        // The counter is full: the loop has a wake-up waiting already.
-    }
+    wakeEvent_.raise();
 }
 
 void StatusPublisher::markStale() {
@@ -181,10 +176,11 @@ void StatusPublisher::noteCheckFinished(const std::string& outcome, const std::s
     wake();
 }
 
-int StatusPublisher::onWake(sd_event_source*, int fd, uint32_t, void* userdata) noexcept {
-    std::uint64_t count = 0;
-    if (::read(fd, &count, sizeof count) < 0) {
-        // Another pass already took the wake-up.
+int StatusPublisher::onWake(sd_event_source*, int, uint32_t, void* userdata) noexcept {
+    auto* publisher = static_cast<StatusPublisher*>(userdata);
+    {
+        std::lock_guard lock(publisher->pendingLock_);
+        publisher->wakeEvent_.consume();
     }
     containExceptions("Announcing the status",
                       [userdata] { static_cast<StatusPublisher*>(userdata)->publish(); });

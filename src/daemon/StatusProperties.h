@@ -21,7 +21,7 @@
 #include <vector>
 
 #include "bus/BusHandles.h"
-#include "io/UniqueFd.h"
+#include "io/WakeEvent.h"
 #include "plist/Value.h"
 
 namespace tavrix {
@@ -80,9 +80,9 @@ class StatusPublisher {
     // Set by every wake-up until publish() runs: a read then must not be taken for what was
     // announced, or the announcement on its way would find nothing changed.
     std::atomic<bool> stale_{false};
-    // Guards what other threads hand over, and the eventfd they write.
+    // Guards what other threads hand over, and the wake-up they raise.
     std::mutex pendingLock_;
-    io::UniqueFd wakeFd_;
+    io::WakeEvent wakeEvent_;
     std::vector<std::pair<std::string, std::string>> finishedChecks_;
 };
 
