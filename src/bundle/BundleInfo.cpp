@@ -1,9 +1,11 @@
 #include "bundle/BundleInfo.h"
 
 #include <cerrno>
+#include <chrono>
 #include <map>
 #include <memory>
 #include <mutex>
+#include <thread>
 
 #include "io/Paths.h"
 #include "plist/CachedPropertyListFile.h"
@@ -91,7 +93,7 @@ std::optional<plist::Value> copyBundleInfoValue(const std::string& path, std::st
         if (!value && attempt + 1 == kBundleInfoRetryCount) {
             logInfoRefusal(*bundle, value.failure());
         }
-        ::usleep(kBundleInfoRetryDelayMicroseconds);
+        std::this_thread::sleep_for(std::chrono::microseconds(kBundleInfoRetryDelayMicroseconds));
     }
     return std::nullopt;
 }

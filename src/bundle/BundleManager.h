@@ -17,8 +17,8 @@ namespace tavrix {
 
 class BundleManager {
   public:
-    // The process's bundle manager: sets the bundle locations once, then creates the manager on
-    // first use (reading the existing links); never destroyed.
+    // The daemon root's bundle manager: sets the bundle locations once, then creates the manager
+    // on first use (reading the existing links); it lives as long as the root.
     static BundleManager& sharedInstance();
 
     BundleManager(const BundleManager&) = delete;

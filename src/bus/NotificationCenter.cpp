@@ -8,6 +8,7 @@
 #include "bus/BusConnection.h"
 #include "bus/BusHandles.h"
 #include "io/WakeEvent.h"
+#include "util/ContainExceptions.h"
 
 namespace tavrix::bus {
 namespace {
@@ -43,11 +44,14 @@ std::vector<std::string> takePending(MainConnection& main) {
     return std::exchange(main.pending, {});
 }
 
-int onQueued(sd_event_source* /*source*/, int /*fd*/, uint32_t /*revents*/, void* /*userdata*/) {
-    MainConnection& main = mainConnection();
-    for (const std::string& name : takePending(main)) {
-        emit(main.bus, name);
-    }
+int onQueued(sd_event_source* /*source*/, int /*fd*/, uint32_t /*revents*/,
+             void* /*userdata*/) noexcept {
+    containExceptions("Posting queued notifications", [] {
+        MainConnection& main = mainConnection();
+        for (const std::string& name : takePending(main)) {
+            emit(main.bus, name);
+        }
+    });
     return 0;
 }
 

@@ -11,7 +11,7 @@ namespace tavrix {
 
 class TXTransactionManager {
   public:
-    // The process's transaction manager, created on first use and never destroyed.
+    // The daemon root's transaction manager, created on first use; it lives as long as the root.
     static TXTransactionManager& sharedInstance();
 
     TXTransactionManager();

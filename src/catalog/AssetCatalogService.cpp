@@ -14,8 +14,8 @@ AssetCatalogService& AssetCatalogService::shared() {
 void AssetCatalogService::stop() {
     stopping_.store(true);
     // Downloads first: they queue the reports that the delivery thread hands out.
-    worker_.shutdown(std::nullopt);
-    delivery_.shutdown(std::nullopt);
+    worker_.shutdown();
+    delivery_.shutdown();
 }
 
 AssetCatalogService::~AssetCatalogService() {

@@ -1,4 +1,4 @@
-// What the asset catalog's queries and assets share for the life of the process: the settings
+// What the asset catalog's queries and assets share for the life of the daemon root: the settings
 // file, the worker that downloads, and the thread that delivers progress reports.
 #pragma once
 

@@ -18,7 +18,7 @@ void Daemon::stopWorkers() {
         catalog->stop();
     }
     if (TXUtility::TaskQueue* tasks = tasks_.ifMade()) {
-        tasks->shutdown(std::nullopt);
+        tasks->shutdown();
     }
 }
 

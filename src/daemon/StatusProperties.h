@@ -30,7 +30,7 @@ inline constexpr const char* kUpdateCheckFinishedSignal = "UpdateCheckFinished";
 
 class StatusPublisher {
   public:
-    // The process's publisher; never destroyed, as worker threads may still report to it.
+    // The daemon root's publisher; it outlives the worker threads that report to it.
     static StatusPublisher& shared();
 
     // Announces on bus, at path on the status interface, from event's loop. Until

@@ -36,11 +36,9 @@ ServerLogStyle serverLogStyle() {
     return kServerLogStyleVerbose;
 }
 
-std::thread::id mainThreadId;
-
 // Connection handlers must run where the client list lives.
-void assertMainThread(const char* method) {
-    if (std::this_thread::get_id() != mainThreadId) {
+void assertMainThread(std::thread::id mainThread, const char* method) {
+    if (std::this_thread::get_id() != mainThread) {
         logCFormat(LogPriority::Warning, "Assertion failure in %s, %s:%d: %s\n", method,
                    "daemon/TXManagerServer_Daemon", 135, "Must be invoked on the main thread");
         std::abort();
@@ -79,7 +77,7 @@ TXManager& TXManagerServer::manager() {
 }
 
 int TXManagerServer::runUntilIdleExit() {
-    mainThreadId = std::this_thread::get_id();
+    _mainThread = std::this_thread::get_id();
     auto& transactions = TXTransactionManager::sharedInstance();
     auto& serviceManager = bus::ServiceManager::shared();
     transactions.setKeepAliveClearable(false);
@@ -240,8 +238,10 @@ bool TXManagerServer::_startServing() {
     // Transactions closed on other threads wake the loop, so that it looks at idleness again.
     // A transaction that closed ended some work, which may have changed the status.
     auto onWake = [](sd_event_source*, int, uint32_t, void*) -> int {
-        bus::ServiceManager::shared().consumeWake();
-        StatusPublisher::shared().markStale();
+        containExceptions("Looking at idleness again", [] {
+            bus::ServiceManager::shared().consumeWake();
+            StatusPublisher::shared().markStale();
+        });
         return 0;
     };
     sd_event_source* terminate = nullptr;
@@ -389,7 +389,7 @@ bool TXManagerServer::isAcceptedConnection(const std::string& uniqueName) const 
 }
 
 void TXManagerServer::connectionInvalidated(const std::string& uniqueName) {
-    assertMainThread("shouldAcceptNewConnection");
+    assertMainThread(_mainThread, "shouldAcceptNewConnection");
     if (auto client = _clientForConnection(uniqueName)) {
         removeClient(client);
     }

@@ -22,6 +22,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "bus/BusHandles.h"
@@ -123,7 +124,6 @@ class TXManagerServer : private bus::ServiceListener::Delegate {
     void _refuseDeferredCalls(std::chrono::steady_clock::time_point cutoff);
     // Releases the name and answers what is queued; _run then waits for open transactions.
     void _finish();
-    // Stops and joins every worker thread, in the order they feed each other.
 
     TXManager* _manager = nullptr;
     std::vector<std::shared_ptr<TXManagerServerClient>> _clients;
@@ -142,6 +142,8 @@ class TXManagerServer : private bus::ServiceListener::Delegate {
     };
     std::vector<DeferredCall> _deferredCalls;
     bool _holdsInstanceLock = false;
+    // The thread of the run loop, where the client list lives.
+    std::thread::id _mainThread;
     bool _finishing = false;
     std::chrono::steady_clock::time_point _drainDeadline;
     std::function<void()> _stopWorkers = [] {};

@@ -235,19 +235,16 @@ int handleSetClientType(sd_bus_message* message, void* userdata, sd_bus_error* e
 
 int handleGetStatus(sd_bus_message* message, void* userdata, sd_bus_error* error) {
     auto& server = *static_cast<TXManagerServer*>(userdata);
-    std::optional<plist::Dictionary> status;
+    plist::Dictionary status;
     {
         MessageScope scope(server, message);
         server.getStatus([&](plist::Dictionary answer) { status = std::move(answer); });
-    }
-    if (!status) {
-        return refuseStatus(message);
     }
     sd_bus_message* raw = nullptr;
     int r = sd_bus_message_new_method_return(message, &raw);
     bus::BusMessagePtr replyMessage(raw);
     if (r >= 0) {
-        r = bus::appendDictionary(replyMessage.get(), *status);
+        r = bus::appendDictionary(replyMessage.get(), status);
     }
     if (r < 0) {
         // A value the bus cannot carry (text that is not UTF-8 in a path).

@@ -19,7 +19,7 @@ UpdateCheckScheduler& UpdateCheckScheduler::sharedInstance() {
 void UpdateCheckScheduler::stop() {
     // The timer first: it is what queues jobs on the scheduler queue.
     _jobScheduler->stopTimer();
-    _schedulerQueue.shutdown(std::nullopt);
+    _schedulerQueue.shutdown();
 }
 
 UpdateCheckScheduler::~UpdateCheckScheduler() {

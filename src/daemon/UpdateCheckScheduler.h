@@ -27,7 +27,7 @@ inline constexpr const char* kUpdateCheckQueueLabel = "com.zandor.quorrd.TimerMa
 
 class UpdateCheckScheduler {
   public:
-    // The process's scheduler, created once from any thread; creating it arms its timer.
+    // The daemon root's scheduler, created once from any thread; creating it arms its timer.
     static UpdateCheckScheduler& sharedInstance();
 
     // Stops the job timer and the scheduler queue, letting a check already queued run. The

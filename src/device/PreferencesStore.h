@@ -24,7 +24,7 @@ namespace tavrix::device {
 
 class PreferencesStore {
   public:
-    // The process-wide store.
+    // The daemon root's store.
     static PreferencesStore& shared();
 
     // A store of its own, with nothing cached or pending (tests; another process's view).

@@ -118,8 +118,7 @@ void appendUnsigned(std::string& out, const std::string& spec, Length length, va
     }
 }
 
-}  // namespace
-
+// The message an object format produces.
 std::string formatObjectMessage(const char* format, va_list arguments) {
     std::string out;
     if (format == nullptr) {
@@ -217,6 +216,8 @@ std::string formatObjectMessage(const char* format, va_list arguments) {
     va_end(cursor);
     return out;
 }
+
+}  // namespace
 
 void logObjectFormatV(LogPriority priority, const char* format, va_list arguments) {
     writeSystemLog(syslogPriority(priority), formatObjectMessage(format, arguments));

@@ -39,7 +39,4 @@ void logCFormat(const char* format, ...) __attribute__((format(printf, 1, 2)));
 void logCFormat(LogPriority priority, const char* format, ...)
     __attribute__((format(printf, 2, 3)));
 
-// The message an object format produces, without logging it.
-std::string formatObjectMessage(const char* format, va_list arguments);
-
 }  // namespace tavrix

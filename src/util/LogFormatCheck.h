@@ -136,10 +136,17 @@ consteval void check(const char* format, const std::array<Kind, Count>& argument
                 take([](Kind kind) { return kind == Kind::Value || kind == Kind::Null; });
                 break;
             case Reads::Pointer:
-            case Reads::Count:
                 take(isPointer);
                 break;
+            case Reads::Count:
+                // Writing through a log argument is never wanted.
+                formatDoesNotMatchItsArguments();
+                break;
             case Reads::Nothing:
+                // "%%" and a lone '%' at the end are text; an unknown conversion is a typo.
+                if (conversion.letter != '%' && conversion.letter != '\0') {
+                    formatDoesNotMatchItsArguments();
+                }
                 break;
         }
     }

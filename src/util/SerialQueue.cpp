@@ -24,9 +24,6 @@ struct SerialQueue::State {
     std::condition_variable wake;
     std::deque<std::function<void()>> tasks;
     bool stopping = false;
-    // Set by the worker as it returns, so that a shutdown can wait for it with patience.
-    bool finished = false;
-    std::condition_variable finishedChanged;
     std::thread::id workerId;
 };
 
@@ -52,8 +49,6 @@ void SerialQueue::runWorker(const std::shared_ptr<State>& state) {
             state->wake.wait(lock, [&] { return state->stopping || !state->tasks.empty(); });
             if (state->tasks.empty()) {
                 // Stopping, and everything queued has run.
-                state->finished = true;
-                state->finishedChanged.notify_all();
                 return;
             }
             task = std::move(state->tasks.front());
@@ -72,29 +67,22 @@ SerialQueue::SerialQueue(std::string label) : state_(std::make_shared<State>(std
 }
 
 SerialQueue::~SerialQueue() {
-    shutdown(std::nullopt);
+    shutdown();
 }
 
-bool SerialQueue::shutdown(std::optional<std::chrono::milliseconds> patience) {
+void SerialQueue::shutdown() {
     std::unique_lock lock(state_->mutex);
     state_->stopping = true;
     state_->wake.notify_all();
     if (!worker_.joinable()) {
-        return true;
+        return;
     }
     if (state_->workerId == std::this_thread::get_id()) {
         worker_.detach();
-        return true;
-    }
-    if (patience &&
-        !state_->finishedChanged.wait_for(lock, *patience, [&] { return state_->finished; })) {
-        logCFormat("Queue %s is still busy after %lld ms; not waiting for it",
-                   state_->label.c_str(), static_cast<long long>(patience->count()));
-        return false;
+        return;
     }
     lock.unlock();
     worker_.join();
-    return true;
 }
 
 bool SerialQueue::isCurrent() const {

@@ -2,10 +2,8 @@
 // were dispatched.
 #pragma once
 
-#include <chrono>
 #include <functional>
 #include <memory>
-#include <optional>
 #include <string>
 #include <thread>
 
@@ -24,9 +22,8 @@ class SerialQueue {
     SerialQueue& operator=(const SerialQueue&) = delete;
 
     // What the destructor does, ahead of it: refuses new tasks, lets the queued ones run and joins
-    // the worker. With patience, gives up (false, logged) when the worker is still busy by then,
-    // leaving it running. Called from the queue's own task, detaches the worker instead.
-    bool shutdown(std::optional<std::chrono::milliseconds> patience);
+    // the worker. Called from the queue's own task, detaches the worker instead.
+    void shutdown();
 
     // Queues task and returns at once. False (and logged) once the queue is shutting down.
     bool dispatchAsync(std::function<void()> task);

@@ -8,7 +8,7 @@
 void logSomething(const tavrix::plist::Value& value) {
     using tavrix::logObjectFormat;
 #if CASE == 0
-    logObjectFormat("%@ %zu %*d %s", &value, std::size_t{1}, 2, 3, "text");
+    logObjectFormat("%@ %zu %*d %s %.1lf 100%%", &value, std::size_t{1}, 2, 3, "text", 2.5);
 #elif CASE == 1
     logObjectFormat("%@", value);  // the value, not a pointer to it
 #elif CASE == 2
@@ -17,5 +17,7 @@ void logSomething(const tavrix::plist::Value& value) {
     logObjectFormat("%d", 1, 2);  // one too many
 #elif CASE == 4
     logObjectFormat("%d", 1LL);  // a wider integer than the conversion reads
+#elif CASE == 5
+    logObjectFormat("%y", 1);  // no such conversion (and "%n", which writes, is refused too)
 #endif
 }

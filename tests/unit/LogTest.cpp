@@ -18,16 +18,15 @@ class LogTest : public testing::Test {
 TEST_F(LogTest, FormatsAreKeptExactly) {
     plist::Value key("k");
     plist::Value set(plist::Array{plist::Value("TXMinimumLaunchTransaction")});
-    logObjectFormat("%s|%5d|%-3s|%lu|%lld|%.2f|%x|%c|%%|%@|%*d|%.*s|%zu|%p|%.1lf", "a", 42, "b",
-                    7ul, -9ll, 3.14159, 255u, 'z', &key, 4, 1, 2, "xyz", std::size_t{5}, nullptr,
-                    2.5);
+    logObjectFormat("%s|%5d|%-3s|%lu|%lld|%.2f|%x|%c|%%|%@|%*d|%.*s|%zu|%p", "a", 42, "b", 7ul,
+                    -9ll, 3.14159, 255u, 'z', &key, 4, 1, 2, "xyz", std::size_t{5}, nullptr);
     logObjectFormat("Removed client: %@, count: %u", static_cast<const plist::Value*>(nullptr), 0u);
     logObjectFormat("transactions: %@", &set);
     logCFormat("Behavior ID %s is already sent, redoing bundle match\n", "abc");
     logCFormat("no newline %d", 1);
     logObjectFormat("trailing %");
     EXPECT_EQ(sink.messages(),
-              (std::vector<std::string>{"a|   42|b  |7|-9|3.14|ff|z|%|k|   1|xy|5|(nil)|2.5",
+              (std::vector<std::string>{"a|   42|b  |7|-9|3.14|ff|z|%|k|   1|xy|5|(nil)",
                                         "Removed client: (null), count: 0",
                                         "transactions: (\\n    TXMinimumLaunchTransaction\\n)",
                                         "Behavior ID abc is already sent, redoing bundle match\n",

@@ -269,23 +269,6 @@ TEST(SerialQueue, DestructionRunsQueuedWorkAndRefusesNewWork) {
     EXPECT_EQ(count, 100);
 }
 
-// The daemon's bounded stop: a worker still busy when patience runs out is left running, new
-// work is refused meanwhile, and a later stop joins it once it is done.
-TEST(SerialQueue, ShutdownWithPatienceGivesUpOnABusyWorkerThenJoinsItLater) {
-    SerialQueue queue("test.patience");
-    std::promise<void> release;
-    std::atomic<bool> finished{false};
-    queue.dispatchAsync([released = release.get_future().share(), &finished] {
-        released.wait();
-        finished = true;
-    });
-    EXPECT_FALSE(queue.shutdown(20ms));
-    EXPECT_FALSE(queue.dispatchAsync([] {}));
-    release.set_value();
-    EXPECT_TRUE(queue.shutdown(5s));
-    EXPECT_TRUE(finished);
-}
-
 TEST(SerialQueue, DestructionFromItsOwnTaskDoesNotDeadlock) {
     auto queue = std::make_unique<SerialQueue>("test.self");
     std::promise<void> gate;
