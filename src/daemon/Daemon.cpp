@@ -6,8 +6,10 @@ namespace tavrix {
 
 int Daemon::run() {
     TXManagerServer& server = TXManagerServer::sharedInstance();
-    server.whenLoopEnds([this] { stopWorkers(); });
-    return server.runUntilIdleExit();
+    const int status = server.runUntilIdleExit();
+    stopWorkers();
+    server.endServing();
+    return status;
 }
 
 void Daemon::stopWorkers() {

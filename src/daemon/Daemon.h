@@ -32,8 +32,8 @@ class Daemon {
     Daemon(const Daemon&) = delete;
     Daemon& operator=(const Daemon&) = delete;
 
-    // The whole life of the daemon: the server's start-up and run loop, then the workers'
-    // end. The process's exit status.
+    // The whole life of the daemon: the server's start-up and run loop, then, whichever way
+    // the loop ended, the workers' end and the server's. The process's exit status.
     int run();
 
   private:

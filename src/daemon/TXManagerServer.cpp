@@ -97,7 +97,6 @@ int TXManagerServer::runUntilIdleExit() {
     // A daemon that cannot serve leaves with a failure, so that the service manager's restart
     // policy and the caller see it.
     if (!_startServing()) {
-        _stopWorkers();
         return 1;
     }
     bus::setNotificationBus(_listener.bus());
@@ -109,20 +108,20 @@ int TXManagerServer::runUntilIdleExit() {
         // The previous daemon is still finishing its work: serve, and act once it has ended.
         logCFormat("Another daemon is still finishing its work; waiting for it to end\n");
         if (!_armLockRetry()) {
-            _stopWorkers();
             return 1;
         }
         serviceManager.notifyReady("Waiting for the previous daemon to end");
     }
     _run();
-    _stopWorkers();
-    StatusPublisher::shared().detach();
+    return 0;
+}
 
+void TXManagerServer::endServing() {
+    StatusPublisher::shared().detach();
     if (_holdsInstanceLock) {
-        transactions.clearKeepAliveIfNecessary(true);
+        TXTransactionManager::sharedInstance().clearKeepAliveIfNecessary(true);
     }
     bus::setNotificationBus(nullptr);
-    return 0;
 }
 
 void TXManagerServer::_startActing() {

@@ -54,17 +54,18 @@ class TXManagerServer : private bus::ServiceListener::Delegate {
     // How often a daemon waiting for the instance lock tries it again.
     static constexpr std::chrono::milliseconds kLockRetryInterval{50};
 
-    // The process's server, created on first use.
+    // The daemon root's server, created on first use.
     static TXManagerServer& sharedInstance();
 
     TXManager& manager();
 
-    // The whole life of the daemon; returns the process's exit status when the run loop has
+    // Serves until the daemon leaves; returns the process's exit status when the run loop has
     // finished: 0, or 1 when the daemon could not start serving (logged).
     int runUntilIdleExit();
-    // What ends the worker threads (the process's root owns them): run once the loop has
-    // finished, before the bus goes, since workers post notifications and status.
-    void whenLoopEnds(std::function<void()> stopWorkers) { _stopWorkers = std::move(stopWorkers); }
+    // After the loop, on every way out of it, once the root has stopped the worker threads
+    // (which post notifications and status): stops announcing, clears the keep-alive flag of a
+    // daemon that acted, and gives up the notification connection.
+    void endServing();
 
     // The service interface. A reply handler is called exactly once before the call returns;
     // the first four accept an empty handler.
@@ -146,7 +147,6 @@ class TXManagerServer : private bus::ServiceListener::Delegate {
     std::thread::id _mainThread;
     bool _finishing = false;
     std::chrono::steady_clock::time_point _drainDeadline;
-    std::function<void()> _stopWorkers = [] {};
 };
 
 // The exported interface's method table (TXManagerServer_Daemon.cpp).
