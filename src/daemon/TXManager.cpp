@@ -42,24 +42,29 @@ bool TXManager::exists() {
 
 bool TXManager::setTavrixID(const std::string& tavrixID, const std::optional<plist::Data>& bundle,
                             PayloadOutcome* payload) {
-    if (TXUtility::hasCellularRadio()) {
-        logObjectFormat("Device has cellular radio, not accepting tavrix ID");
+    // Every refusal tells a caller that asked why the bundle was not extracted.
+    auto refuse = [payload](std::string reason) {
         if (payload != nullptr) {
-            *payload = {false, "not accepted: the device has a cellular radio"};
+            *payload = {false, "not accepted: " + std::move(reason)};
         }
         return false;
+    };
+    if (TXUtility::hasCellularRadio()) {
+        logObjectFormat("Device has cellular radio, not accepting tavrix ID");
+        return refuse("the device has a cellular radio");
     }
     if (tavrixID.size() > kMaxBehaviorIDBytes) {
         logCFormat("Behavior ID of %zu bytes is longer than the %zu allowed, not accepting it\n",
                    tavrixID.size(), kMaxBehaviorIDBytes);
-        return false;
+        return refuse("the behavior ID is longer than " + std::to_string(kMaxBehaviorIDBytes) +
+                      " bytes");
     }
     std::string lowered = lowercaseText(tavrixID);
     // An ID that is not on disk would be lost at the next launch: the client is told, and
     // nothing is installed for it.
     if (!setBehaviorPreference(kTavrixIDKey, plist::Value(lowered))) {
         logCFormat(LogPriority::Warning, "Could not store the behavior ID, not accepting it\n");
-        return false;
+        return refuse("the behavior ID could not be stored");
     }
     if (!bundle) {
         // Before the bundle manager is first taken: its start-up lines follow this one.

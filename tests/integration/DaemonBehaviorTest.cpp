@@ -1,5 +1,6 @@
 // The behavior façade as clients see it through the bus: who may set an ID, how it is stored,
 // what decides support, and where behavior settings come from.
+#include <fcntl.h>
 #include <gmock/gmock.h>
 #include <grp.h>
 #include <pwd.h>
@@ -11,6 +12,7 @@
 
 #include "BusFixture.h"
 #include "TestSupport.h"
+#include "io/UniqueFd.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix::integration {
@@ -62,7 +64,13 @@ except dbus.DBusException as error:
     const auto lock = at("/var/mobile/Library/Preferences/.com.zandor.tavrixservices.plist.lock");
     std::filesystem::remove(lock);
     test::writeText(lock / "in-the-way", "");
-    EXPECT_FALSE(caller.setTavrixID("new", std::nullopt));
+    // Asked with a bundle by descriptor, the caller also hears why nothing was extracted.
+    const auto payloadFile = device().base() / "payload";
+    test::writeText(payloadFile, "never looked at");
+    io::UniqueFd payload(::open(payloadFile.c_str(), O_RDONLY | O_CLOEXEC));
+    const client::PayloadResult refused = caller.setTavrixIDWithBundleFile("new", payload.get());
+    EXPECT_FALSE(refused.accepted);
+    EXPECT_EQ(refused.reason, "not accepted: the behavior ID could not be stored");
     const plist::Value status(caller.status());
     EXPECT_EQ(*status.find("BehaviorID"), plist::Value("abc"));
     EXPECT_TRUE(caller.isTavrixBundleSupported());
