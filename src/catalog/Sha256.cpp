@@ -8,7 +8,6 @@
 #include "io/FileIO.h"
 #include "io/UniqueFd.h"
 #include "util/SharedLibrary.h"
-#include "util/SystemLog.h"
 
 namespace tavrix::catalog {
 namespace {
@@ -16,7 +15,6 @@ namespace {
 constexpr const char* kLibraryName = "libcrypto.so.3";
 
 struct Crypto {
-    std::unique_ptr<SharedLibrary> library;
     decltype(&::EVP_MD_CTX_new) contextNew = nullptr;
     decltype(&::EVP_MD_CTX_free) contextFree = nullptr;
     decltype(&::EVP_sha256) sha256 = nullptr;
@@ -25,32 +23,18 @@ struct Crypto {
     decltype(&::EVP_DigestFinal_ex) final = nullptr;
 };
 
-Crypto load() {
-    Result<std::unique_ptr<SharedLibrary>> library = SharedLibrary::open(kLibraryName);
-    if (!library) {
-        writeSystemLog(LOG_ERR, "SHA-256 digests are unavailable: " + library.reason());
-        return Crypto{};
-    }
-    Crypto crypto;
-    SharedLibrary& libcrypto = **library;
-    libcrypto.bind(crypto.contextNew, "EVP_MD_CTX_new");
-    libcrypto.bind(crypto.contextFree, "EVP_MD_CTX_free");
-    libcrypto.bind(crypto.sha256, "EVP_sha256");
-    libcrypto.bind(crypto.init, "EVP_DigestInit_ex");
-    libcrypto.bind(crypto.update, "EVP_DigestUpdate");
-    libcrypto.bind(crypto.final, "EVP_DigestFinal_ex");
-    if (Result<> bound = libcrypto.allBound(); !bound) {
-        writeSystemLog(LOG_ERR, "SHA-256 digests are unavailable: " + bound.reason());
-        return Crypto{};
-    }
-    // Kept for the rest of the process: libcrypto cleans up at exit, not at dlclose.
-    crypto.library = std::move(*library);
-    return crypto;
-}
-
-const Crypto* loadCrypto() {
-    static const Crypto crypto = load();
-    return crypto.library ? &crypto : nullptr;
+Result<const Crypto*> loadCrypto() {
+    static const LoadedLibrary<Crypto> libcrypto(kLibraryName, "SHA-256 digests are unavailable",
+                                                 [](SharedLibrary& library, Crypto& f) {
+                                                     library.bind(f.contextNew, "EVP_MD_CTX_new");
+                                                     library.bind(f.contextFree, "EVP_MD_CTX_free");
+                                                     library.bind(f.sha256, "EVP_sha256");
+                                                     library.bind(f.init, "EVP_DigestInit_ex");
+                                                     library.bind(f.update, "EVP_DigestUpdate");
+                                                     library.bind(f.final, "EVP_DigestFinal_ex");
+                                                     return library.allBound();
+                                                 });
+    return libcrypto.functions();
 }
 
 }  // namespace
@@ -62,11 +46,12 @@ struct Sha256Digest::Context {
 };
 
 Sha256Digest::Sha256Digest() : context_(std::make_unique<Context>()) {
-    const Crypto* crypto = loadCrypto();
-    if (crypto == nullptr) {
+    Result<const Crypto*> loaded = loadCrypto();
+    if (!loaded) {
         context_->failed = true;
         return;
     }
+    const Crypto* crypto = *loaded;
     context_->crypto = crypto;
     context_->state = crypto->contextNew();
     context_->failed =

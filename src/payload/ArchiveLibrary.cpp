@@ -4,41 +4,23 @@
 #include <string>
 
 #include "util/SharedLibrary.h"
-#include "util/SystemLog.h"
 
 namespace tavrix::payload {
 namespace {
 
 constexpr const char* kLibraryName = "libarchive.so.13";
 
-struct LoadedArchive {
-    std::unique_ptr<SharedLibrary> library;
-    ArchiveLibrary functions;
-};
-
-LoadedArchive load() {
-    Result<std::unique_ptr<SharedLibrary>> library = SharedLibrary::open(kLibraryName);
-    if (!library) {
-        writeSystemLog(LOG_ERR, "Archives are unavailable: " + library.reason());
-        return LoadedArchive{};
-    }
-    LoadedArchive loaded;
-#define TAVRIX_ARCHIVE_BIND(name) (*library)->bind(loaded.functions.name, #name);
-    TAVRIX_ARCHIVE_FUNCTIONS(TAVRIX_ARCHIVE_BIND)
-#undef TAVRIX_ARCHIVE_BIND
-    if (Result<> bound = (*library)->allBound(); !bound) {
-        writeSystemLog(LOG_ERR, "Archives are unavailable: " + bound.reason());
-        return LoadedArchive{};
-    }
-    loaded.library = std::move(*library);
-    return loaded;
-}
-
 }  // namespace
 
 const ArchiveLibrary* loadArchive() {
-    static const LoadedArchive loaded = load();
-    return loaded.library ? &loaded.functions : nullptr;
+    static const LoadedLibrary<ArchiveLibrary> libarchive(
+        kLibraryName, "Archives are unavailable", [](SharedLibrary& library, ArchiveLibrary& f) {
+#define TAVRIX_ARCHIVE_BIND(name) library.bind(f.name, #name);
+            TAVRIX_ARCHIVE_FUNCTIONS(TAVRIX_ARCHIVE_BIND)
+#undef TAVRIX_ARCHIVE_BIND
+            return library.allBound();
+        });
+    return libarchive.functions().value_or(nullptr);
 }
 
 }  // namespace tavrix::payload

@@ -1,5 +1,7 @@
 #include "util/SharedLibrary.h"
 
+#include "util/SystemLog.h"
+
 namespace tavrix {
 
 Result<std::unique_ptr<SharedLibrary>> SharedLibrary::open(const char* name) {
@@ -10,6 +12,10 @@ Result<std::unique_ptr<SharedLibrary>> SharedLibrary::open(const char* name) {
         return Failure{why != nullptr ? why : std::string(name) + " cannot be loaded"};
     }
     return std::unique_ptr<SharedLibrary>(new SharedLibrary(name, handle));
+}
+
+void logUnusableLibrary(const std::string& line) {
+    writeSystemLog(LOG_ERR, line);
 }
 
 }  // namespace tavrix

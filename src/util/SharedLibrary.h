@@ -49,4 +49,40 @@ class SharedLibrary {
     std::string missing_;
 };
 
+// Logs, at err, that a library cannot be used and what is unavailable without it.
+void logUnusableLibrary(const std::string& line);
+
+// A library's functions, bound once and kept for the rest of the process (libraries with global
+// state clean up at exit, not at dlclose). bind(library, functions) fills the struct of function
+// pointers and answers library.allBound(), after running the library's own set-up where it has
+// one. A library that cannot be used is logged once, "<unavailable>: <reason>", and every use
+// answers that failure. Made in a function-local static, it loads on the first use, once.
+template <typename Functions>
+class LoadedLibrary {
+  public:
+    template <typename Bind>
+    LoadedLibrary(const char* name, const std::string& unavailable, Bind bind) {
+        Result<std::unique_ptr<SharedLibrary>> library = SharedLibrary::open(name);
+        const Result<> ready = library ? bind(**library, functions_) : Result<>(library.failure());
+        if (!ready) {
+            failure_ = unavailable + ": " + ready.reason();
+            logUnusableLibrary(failure_);
+            return;
+        }
+        library_ = std::move(*library);
+    }
+
+    Result<const Functions*> functions() const {
+        if (!library_) {
+            return Failure{failure_};
+        }
+        return &functions_;
+    }
+
+  private:
+    std::unique_ptr<SharedLibrary> library_;
+    Functions functions_{};
+    std::string failure_;
+};
+
 }  // namespace tavrix
