@@ -2,7 +2,6 @@
 
 #include <langinfo.h>
 #include <locale.h>
-#include <pwd.h>
 #include <sys/stat.h>
 #include <sys/statfs.h>
 #include <unistd.h>
@@ -13,9 +12,9 @@
 #include <cstring>
 #include <memory>
 #include <type_traits>
-#include <vector>
 
 #include "device/DeviceInfoService.h"
+#include "device/UserDatabase.h"
 #include "util/Log.h"
 #include "util/SharedInstance.h"
 
@@ -52,21 +51,11 @@ std::optional<std::string> homeDirectory() {
     if (home != nullptr && *home != '\0') {
         return std::string(home);
     }
-    long suggested = ::sysconf(_SC_GETPW_R_SIZE_MAX);
-    std::vector<char> buffer(suggested > 0 ? static_cast<std::size_t>(suggested) : 4096);
-    for (;;) {
-        passwd entry{};
-        passwd* found = nullptr;
-        int error = ::getpwuid_r(::geteuid(), &entry, buffer.data(), buffer.size(), &found);
-        if (error == ERANGE && buffer.size() < (1u << 20)) {
-            buffer.resize(buffer.size() * 2);
-            continue;
-        }
-        if (error != 0 || found == nullptr || entry.pw_dir == nullptr || *entry.pw_dir == '\0') {
-            return std::nullopt;
-        }
-        return std::string(entry.pw_dir);
+    std::optional<device::UserRecord> user = device::lookupSystemUser(::geteuid());
+    if (!user || user->homeDirectory.empty()) {
+        return std::nullopt;
     }
+    return std::move(user->homeDirectory);
 }
 
 // The answer for key, asked the first time and kept by the root for the rest of its life.

@@ -26,14 +26,16 @@ UserRecord recordFrom(const passwd& entry, std::string_view root) {
     return record;
 }
 
-std::optional<UserRecord> lookupInSystem(std::string_view name) {
+// The system's entry that lookup(entry, buffer, size, found) answers, with a buffer that grows
+// while the C library says it is too small (up to 1 MiB).
+template <typename Lookup>
+std::optional<UserRecord> lookupInSystem(Lookup lookup) {
     long suggested = ::sysconf(_SC_GETPW_R_SIZE_MAX);
     std::vector<char> buffer(suggested > 0 ? static_cast<std::size_t>(suggested) : 4096);
-    std::string key(name);
     for (;;) {
         passwd entry{};
         passwd* found = nullptr;
-        int error = ::getpwnam_r(key.c_str(), &entry, buffer.data(), buffer.size(), &found);
+        int error = lookup(&entry, buffer.data(), buffer.size(), &found);
         if (error == ERANGE && buffer.size() < (1u << 20)) {
             buffer.resize(buffer.size() * 2);
             continue;
@@ -76,7 +78,19 @@ std::optional<UserRecord> lookupUserUnder(std::string_view root, std::string_vie
     while (!root.empty() && root.back() == '/') {
         root.remove_suffix(1);
     }
-    return root.empty() ? lookupInSystem(name) : lookupInFile(root, name);
+    if (!root.empty()) {
+        return lookupInFile(root, name);
+    }
+    const std::string key(name);
+    return lookupInSystem([&](passwd* entry, char* buffer, std::size_t size, passwd** found) {
+        return ::getpwnam_r(key.c_str(), entry, buffer, size, found);
+    });
+}
+
+std::optional<UserRecord> lookupSystemUser(uid_t uid) {
+    return lookupInSystem([uid](passwd* entry, char* buffer, std::size_t size, passwd** found) {
+        return ::getpwuid_r(uid, entry, buffer, size, found);
+    });
 }
 
 std::optional<UserRecord> lookupUser(std::string_view name) {

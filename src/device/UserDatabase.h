@@ -24,4 +24,7 @@ std::optional<UserRecord> lookupUser(std::string_view name);
 // The entry for name in the user database of the given root ("" or "/" for the system's own).
 std::optional<UserRecord> lookupUserUnder(std::string_view root, std::string_view name);
 
+// The system's own entry for uid, its home directory as the system has it.
+std::optional<UserRecord> lookupSystemUser(uid_t uid);
+
 }  // namespace tavrix::device
