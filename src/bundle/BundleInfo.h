@@ -7,14 +7,11 @@
 #include <string_view>
 #include <utility>
 
+#include "bundle/BundleKeys.h"
 #include "plist/PropertyListFormat.h"
 #include "plist/Value.h"
 
 namespace tavrix {
-
-inline constexpr const char* kBundleInfoFileName = "Info.plist";
-inline constexpr const char* kBundleVersionKey = "QZBundleVersion";
-inline constexpr const char* kBundleIdentifierKey = "QZBundleIdentifier";
 
 // A just-extracted bundle may not show its Info dictionary yet, so value reads try again a few
 // times before giving up.

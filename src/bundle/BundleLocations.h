@@ -5,12 +5,13 @@
 
 #include <string>
 
+#include "bundle/BundleKeys.h"
+
 namespace tavrix {
 
 inline constexpr const char* kSystemBundlesDirectory = "/System/Library/TavrixBundles/";
 inline constexpr const char* kUserBundlesDirectory = "/Library/TavrixBundles/";
 inline constexpr const char* kDefaultBundleName = "Default.bundle";
-inline constexpr const char* kBaseCarrierFileName = "behavior.plist";
 
 struct BundleLocations {
     std::string system;

@@ -16,7 +16,6 @@ namespace tavrix::catalog {
 namespace {
 
 constexpr const char* kSerialNumberKey = "SerialNumber";
-constexpr const char* kVersionAttribute = "Version";
 
 bool isFinalReport(const plist::Dictionary& progress) {
     auto operation = progress.find(kAssetProgressOperationKey);
@@ -207,7 +206,7 @@ QueryResult AssetQuery::runQuery() const {
                     device::copyDeviceStringAnswer(kSerialNumberKey).value_or(std::string());
                 serialNumberRead = true;
             }
-            auto version = entry.attributes.find(kVersionAttribute);
+            auto version = entry.attributes.find(kCatalogVersionAttribute);
             std::string versionText =
                 version != entry.attributes.end() && version->second.asString() != nullptr
                     ? *version->second.asString()

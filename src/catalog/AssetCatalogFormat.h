@@ -38,6 +38,8 @@ inline constexpr const char* kCatalogSerialKey = "Serial";
 inline constexpr const char* kCatalogExpiresKey = "Expires";
 inline constexpr const char* kCatalogKeyIDKey = "KeyID";
 inline constexpr const char* kCatalogRolloutPercentKey = "RolloutPercent";
+// The attribute that names an asset's version (rollouts are bucketed by it).
+inline constexpr const char* kCatalogVersionAttribute = "Version";
 inline constexpr const char* kCatalogSignatureSuffix = ".sig";
 
 // Bounds on what a server may make the daemon hold or store.

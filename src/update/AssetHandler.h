@@ -17,7 +17,7 @@ namespace tavrix {
 struct PendingInstall;
 
 inline constexpr const char* kAssetTypeTavrixBundles = "com.zandor.Grellas.TavrixBundles";
-inline constexpr const char* kAssetAttributeVersion = "Version";
+inline constexpr const char* kAssetAttributeVersion = catalog::kCatalogVersionAttribute;
 inline constexpr const char* kAssetAttributeSupportedProductTypes = "SupportedProductTypes";
 inline constexpr const char* kAssetAttributeMinimumOSVersion = "MinimumOSVersion";
 inline constexpr const char* kAssetAttributeMaximumOSVersion = "MaximumOSVersion";

@@ -2,17 +2,13 @@
 
 #include <filesystem>
 
+#include "bundle/BundleKeys.h"
 #include "plist/PropertyListFormat.h"
 
 namespace tavrix::tools {
 namespace {
 
 namespace fs = std::filesystem;
-
-constexpr const char* kInfoFileName = "Info.plist";
-constexpr const char* kBaseCarrierFileName = "behavior.plist";
-constexpr const char* kIdentifierKey = "QZBundleIdentifier";
-constexpr const char* kVersionKey = "QZBundleVersion";
 
 // The property list at path when it is a dictionary.
 Result<plist::Dictionary> readDictionary(const std::string& path) {
@@ -43,16 +39,16 @@ Result<BundleIdentity> checkBundleDirectory(const std::string& directory) {
     if (!fs::is_directory(directory, status)) {
         return Failure{directory + ": not a directory"};
     }
-    const std::string infoPath = (fs::path(directory) / kInfoFileName).string();
+    const std::string infoPath = (fs::path(directory) / kBundleInfoFileName).string();
     Result<plist::Dictionary> info = readDictionary(infoPath);
     if (!info) {
         return info.failure();
     }
-    Result<std::string> identifier = nonEmptyString(*info, kIdentifierKey, infoPath);
+    Result<std::string> identifier = nonEmptyString(*info, kBundleIdentifierKey, infoPath);
     if (!identifier) {
         return identifier.failure();
     }
-    Result<std::string> version = nonEmptyString(*info, kVersionKey, infoPath);
+    Result<std::string> version = nonEmptyString(*info, kBundleVersionKey, infoPath);
     if (!version) {
         return version.failure();
     }

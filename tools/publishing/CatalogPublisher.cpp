@@ -7,6 +7,7 @@
 #include <filesystem>
 #include <system_error>
 
+#include "bundle/BundleKeys.h"
 #include "catalog/AssetCatalogFormat.h"
 #include "catalog/CatalogTrust.h"
 #include "io/AtomicFile.h"
@@ -19,8 +20,6 @@ namespace {
 
 namespace fs = std::filesystem;
 
-constexpr const char* kInfoFileName = "Info.plist";
-constexpr const char* kBundleVersionKey = "QZBundleVersion";
 constexpr const char* kBundleExtension = ".bundle";
 // The whole bundle is packed in memory; this keeps that bounded.
 constexpr std::uint32_t kMaxBundleBytes = 1u << 30;
@@ -66,7 +65,7 @@ Result<std::string> bundleVersion(const BundleToPublish& bundle) {
     }
     if (!bundle.version.empty() && bundle.version != identity->version) {
         return Failure{bundle.directory + ": --version " + bundle.version + " differs from " +
-                       kInfoFileName + " " + kBundleVersionKey + " " + identity->version};
+                       kBundleInfoFileName + " " + kBundleVersionKey + " " + identity->version};
     }
     return identity->version;
 }
@@ -142,7 +141,7 @@ Result<> storeArchive(const std::string& path, const std::string& bytes,
 }
 
 plist::Value attributesFor(const BundleToPublish& bundle, const std::string& version) {
-    plist::Dictionary attributes{{"Version", plist::Value(version)}};
+    plist::Dictionary attributes{{catalog::kCatalogVersionAttribute, plist::Value(version)}};
     if (!bundle.productTypes.empty()) {
         plist::Array types(bundle.productTypes.begin(), bundle.productTypes.end());
         attributes.emplace("SupportedProductTypes", plist::Value(std::move(types)));
@@ -228,7 +227,7 @@ Result<plist::Dictionary> startingCatalog(const PublishRequest& request) {
 
 const plist::Value* versionOf(const plist::Value& entry) {
     const plist::Value* attributes = entry.find(catalog::kCatalogAttributesKey);
-    return attributes != nullptr ? attributes->find("Version") : nullptr;
+    return attributes != nullptr ? attributes->find(catalog::kCatalogVersionAttribute) : nullptr;
 }
 
 // Devices install by version, so a version published again replaces its entry.
