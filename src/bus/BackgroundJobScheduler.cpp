@@ -160,6 +160,12 @@ plist::Dictionary BackgroundJobScheduler::copyJobs() const {
     return jobs;
 }
 
+std::optional<double> BackgroundJobScheduler::windowStart(const std::string& name) const {
+    std::lock_guard lock(mutex_);
+    auto job = jobs_.find(name);
+    return job != jobs_.end() ? std::optional(job->second.windowStart) : std::nullopt;
+}
+
 void BackgroundJobScheduler::load() {
     if (filePath_.empty()) {
         return;

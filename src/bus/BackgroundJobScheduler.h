@@ -59,6 +59,9 @@ class BackgroundJobScheduler {
 
     // The jobs waiting to fire, by name, with their criteria.
     plist::Dictionary copyJobs() const;
+    // When the named job's window starts (seconds since the reference date), or nothing when no
+    // such job waits.
+    std::optional<double> windowStart(const std::string& name) const;
 
     // The file holding clientName's jobs under the process's platform root, or under root.
     static std::string jobsFilePath(std::string_view clientName);

@@ -135,26 +135,7 @@ void UpdateCheckScheduler::rescheduleAndEndCheck(double seconds) {
 }
 
 std::optional<double> UpdateCheckScheduler::nextCheckTime() const {
-    if (!_jobScheduler) {
-        return std::nullopt;
-    }
-    plist::Dictionary jobs = _jobScheduler->copyJobs();
-    auto job = jobs.find(kUpdateCheckJobName);
-    const plist::Dictionary* criteria = job != jobs.end() ? job->second.asDictionary() : nullptr;
-    if (criteria == nullptr) {
-        return std::nullopt;
-    }
-    auto start = criteria->find(std::string(bus::kJobWindowStartDate));
-    if (start == criteria->end()) {
-        return std::nullopt;
-    }
-    if (const double* real = start->second.asReal()) {
-        return *real;
-    }
-    if (const plist::Integer* integer = start->second.asInteger()) {
-        return static_cast<double>(integer->signedValue());
-    }
-    return std::nullopt;
+    return _jobScheduler ? _jobScheduler->windowStart(kUpdateCheckJobName) : std::nullopt;
 }
 
 }  // namespace tavrix
