@@ -55,22 +55,38 @@ Result<> BundleManager::replaceUserBundle(const UserBundleFill& fill) {
         removeItemTree(staging);
         return Failure{std::string("the new bundle could not be flushed: ") + std::strerror(error)};
     }
-    // A bundle that cannot be removed whole (and would mix with the new one) stays as it is.
-    if (int removed = removeItemTree(bundle); removed != 0 && removed != ENOENT) {
-        logCFormat(LogPriority::Warning, "Could not remove the bundle %s (error %d), keeping it\n",
-                   bundle.c_str(), removed);
-        removeItemTree(staging);
-        return Failure{std::string("the old bundle could not be removed: ") +
-                       std::strerror(removed)};
+    const std::string stagingName = io::lastPathComponent(staging);
+    const std::string bundleName = io::lastPathComponent(bundle);
+    // The new bundle takes the name in one step and the old one the staging name, whence it is
+    // removed (or, after a crash, at the next launch): a crash or a tree that cannot be removed
+    // whole leaves one whole bundle under the name, never part of the old one.
+    int error = bundles->exchangeEntries(stagingName, bundleName);
+    if (error == EINVAL || error == ENOSYS) {
+        // A file system that cannot swap: the old bundle is removed first, and is kept when it
+        // cannot be removed whole (what went by then is lost).
+        if (int removed = removeItemTree(bundle); removed != 0 && removed != ENOENT) {
+            logCFormat(LogPriority::Warning,
+                       "Could not remove the bundle %s (error %d), keeping it\n", bundle.c_str(),
+                       removed);
+            removeItemTree(staging);
+            return Failure{std::string("the old bundle could not be removed: ") +
+                           std::strerror(removed)};
+        }
+        error = ENOENT;
     }
-    if (int error =
-            bundles->renameEntry(io::lastPathComponent(staging), io::lastPathComponent(bundle));
-        error != 0) {
+    if (error == ENOENT) {
+        error = bundles->renameEntry(stagingName, bundleName);  // no old bundle
+    }
+    if (error != 0) {
         logCFormat(LogPriority::Warning, "Could not move the extracted bundle into %s (error %d)\n",
                    bundle.c_str(), error);
         removeItemTree(staging);
         return Failure{std::string("the extracted bundle could not be moved into place: ") +
                        std::strerror(error)};
+    }
+    if (int removed = removeItemTree(staging); removed != 0 && removed != ENOENT) {
+        logCFormat(LogPriority::Warning, "Could not remove the old bundle, now %s (error %d)\n",
+                   staging.c_str(), removed);
     }
     if (filled.fill != BundleFill::Whole) {
         return Failure{filled.reason};

@@ -333,6 +333,18 @@ int Directory::renameEntry(std::string_view from, std::string_view to) const {
     return 0;
 }
 
+int Directory::exchangeEntries(std::string_view a, std::string_view b) const {
+    if (!isValidName(a) || !isValidName(b)) {
+        return EINVAL;
+    }
+    if (::renameat2(fd_.get(), std::string(a).c_str(), fd_.get(), std::string(b).c_str(),
+                    RENAME_EXCHANGE) != 0) {
+        return errno;
+    }
+    ::fsync(fd_.get());
+    return 0;
+}
+
 UniqueFd openOwnFile(const std::string& path, int* error) {
     auto directory = Directory::open(parentDirectory(path), Directory::LastLink::Refuse, error);
     if (!directory) {

@@ -77,6 +77,11 @@ class Directory {
     // Renames from over to, both in this directory, and flushes it. 0 or an errno.
     int renameEntry(std::string_view from, std::string_view to) const;
 
+    // Swaps the entries at a and b, both in this directory, in one step, and flushes it: a
+    // reader finds one or the other under each name, never neither. 0 or an errno (ENOENT when
+    // either is missing, EINVAL or ENOSYS where the file system cannot swap).
+    int exchangeEntries(std::string_view a, std::string_view b) const;
+
   private:
     Directory(UniqueFd fd, std::string path, const struct stat& status);
 

@@ -284,6 +284,10 @@ TEST_F(BundleFlowTest, KilledAnywhereInSetTavrixIDTheNextLaunchFindsOneWholeStat
         ASSERT_TRUE(killDaemon(*pid));
         victim.join();
         ++statesFound[linkState()];
+        // The user bundle is the old one or the new one, whole: never what is left of either.
+        std::error_code error;
+        EXPECT_EQ(fs::file_size(at(kUserBundle) / "Resources/bulk.bin", error), 3u << 20);
+        EXPECT_TRUE(fs::exists(at(kUserBundle) / "Resources/small/99.txt"));
 
         client().isTavrixBundleSupported();  // a fresh launch
         ASSERT_EQ(linkState(), "links agree");

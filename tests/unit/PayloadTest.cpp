@@ -288,6 +288,32 @@ TEST_F(BundleInstall, EachPayloadReplacesTheUserBundle) {
     EXPECT_FALSE(fs::exists(staged));
 }
 
+// The old bundle leaves the name in one step: one that cannot be removed whole (here a mount in
+// it; a crash while removing is the other way) must not be left behind in part, under the name
+// or mixed into the next payload.
+TEST_F(BundleInstall, TheOldBundleNeverStaysInPart) {
+    const fs::path staging = bundle.parent_path() / ".Default.bundle.incoming";
+    install(buildArchive(Container::Tar, Compression::Gzip,
+                         {test::fileItem("Info.plist", "one"), test::fileItem("a/old", "old"),
+                          test::directoryItem("busy")}));
+    test::TmpfsMount busy(bundle / "busy", "size=64k");
+    if (!busy.mounted) {
+        GTEST_SKIP() << "mounting needs root";
+    }
+    const std::string second =
+        buildArchive(Container::Tar, Compression::Gzip, {test::fileItem("Info.plist", "two")});
+    install(second);
+    EXPECT_EQ(snapshotTree(bundle), (Tree{{"Info.plist", "two"}}));
+
+    // The old tree stays aside while it cannot go; no payload is mixed into it meanwhile.
+    install(second);
+    EXPECT_EQ(snapshotTree(bundle), (Tree{{"Info.plist", "two"}}));
+    ::umount2((staging / "busy").c_str(), MNT_DETACH);
+    install(buildArchive(Container::Tar, Compression::Gzip, {test::fileItem("Info.plist", "3")}));
+    EXPECT_EQ(snapshotTree(bundle), (Tree{{"Info.plist", "3"}}));
+    EXPECT_FALSE(fs::exists(staging));
+}
+
 // The daemon's own earlier file is replaced, what is unpacked is what was written, and the file
 // goes with the staging; a directory where others could rename the file refuses the payload.
 TEST(StagePayload, WritesItsOwnFileAndRefusesAnUnsafeDirectory) {
