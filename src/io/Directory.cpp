@@ -281,10 +281,19 @@ int Directory::flushTree(std::string_view name) const {
         return EINVAL;
     }
     const std::string entry(name);
+    // A link, a FIFO, a socket or a device node has no data of its own to flush (fsync refuses
+    // them) and is flushed with the directory that holds it; a device is never opened.
+    struct stat entryStatus {};
+    if (::fstatat(fd_.get(), entry.c_str(), &entryStatus, AT_SYMLINK_NOFOLLOW) != 0) {
+        return errno;
+    }
+    if (!S_ISREG(entryStatus.st_mode) && !S_ISDIR(entryStatus.st_mode)) {
+        return 0;
+    }
     UniqueFd fd(::openat(fd_.get(), entry.c_str(),
                          O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
     if (!fd) {
-        // A link is flushed with the directory that holds it.
+        // Replaced by a link since: that is flushed with the directory too.
         return errno == ELOOP ? 0 : errno;
     }
     struct stat status {};

@@ -71,7 +71,8 @@ class Directory {
 
     // Flushes every file and directory of the tree at name, deepest first, without following a
     // link: what a writer that does not flush (the archive extractor, a copy) left there is on
-    // the disk before the tree is renamed into place. 0 or an errno.
+    // the disk before the tree is renamed into place. Links, FIFOs, sockets and device nodes are
+    // left to their directory's flush, never opened. 0 or an errno.
     int flushTree(std::string_view name) const;
 
     // Renames from over to, both in this directory, and flushes it. 0 or an errno.

@@ -281,6 +281,12 @@ TEST_F(BundleInstall, EachPayloadReplacesTheUserBundle) {
               (Tree{{"Info.plist", "one"}, {"Overlay", "/"}, {"Overlay/old.plist", "old"}}));
     EXPECT_FALSE(fs::exists(staged));
 
+    // A client's payload may hold a FIFO: it is created, and neither opened nor refused.
+    install(buildArchive(Container::Tar, Compression::Gzip,
+                         {test::fileItem("Info.plist", "two"), test::fifoItem("pipe")}));
+    EXPECT_EQ(readText(bundle / "Info.plist"), "two");
+    EXPECT_TRUE(fs::is_fifo(bundle / "pipe"));
+
     // An empty payload still removes the old bundle and leaves an empty one.
     install("");
     EXPECT_TRUE(fs::is_directory(bundle));
