@@ -270,6 +270,21 @@ bool TXManagerServer::_startServing() {
                           this)) {
         return false;
     }
+    // A bus that goes away (its daemon restarted or killed) brings no more calls: leave as on
+    // SIGTERM, finishing the work under way, rather than idle until the grace runs out.
+    auto onMessage = [](sd_bus_message* message, void* userdata, sd_bus_error*) -> int {
+        if (sd_bus_message_is_signal(message, "org.freedesktop.DBus.Local", "Disconnected") > 0) {
+            containExceptions("Leaving without a bus", [userdata] {
+                logCFormat("The bus connection is gone; leaving\n");
+                static_cast<TXManagerServer*>(userdata)->_finish();
+            });
+        }
+        return 0;
+    };
+    sd_bus_slot* disconnect = nullptr;
+    if (sd_bus_add_filter(_listener.bus(), &disconnect, onMessage, this) >= 0) {
+        _disconnectFilter.reset(disconnect);
+    }
     // Without announcements the properties still answer; that is no reason not to serve.
     StatusPublisher::shared().attach(event, _listener.bus(), kTXServiceObjectPath,
                                      [this] { return _holdsInstanceLock; });

@@ -134,6 +134,7 @@ class TXManagerServer : private bus::ServiceListener::Delegate {
     bus::EventSourcePtr _terminateSource;
     bus::EventSourcePtr _interruptSource;
     bus::EventSourcePtr _wakeSource;
+    bus::BusSlotPtr _disconnectFilter;
     bus::EventSourcePtr _lockRetryTimer;
     struct DeferredCall {
         bus::BusMessagePtr message;

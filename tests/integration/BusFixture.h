@@ -186,6 +186,8 @@ class BusFixture : public ::testing::Test {
     // The site's file at urlPath served held after that part of its bytes, until released.
     void holdPublished(const std::string& urlPath, double part);
     const std::string& busAddress() const { return bus_->address(); }
+    // Ends the bus, as a restart of the system bus would; the daemons' launch records stay.
+    void stopBus() { bus_->stop(); }
     BusWatcher& watcher() { return *watcher_; }
     // A new client of the daemon with a connection of its own.
     client::TavrixClient client() const {

@@ -62,6 +62,17 @@ TEST_F(DaemonLifecycleTest, StartsOnCallStaysForLaunchTransactionAndLeavesWhenId
     EXPECT_EQ(waitForDaemonExit(*firstPid), std::optional<int>(0));
 }
 
+// A daemon whose bus goes can be called no more: it leaves at once, with 0, rather than after its
+// launch transaction and grace.
+TEST_F(DaemonLifecycleTest, LeavesWhenItsBusGoes) {
+    client().isTavrixBundleSupported();
+    const auto pid = daemonPid();
+    ASSERT_TRUE(pid);
+    stopBus();
+    EXPECT_EQ(waitForDaemonExit(*pid, 5s), std::optional<int>(0));
+    EXPECT_EQ(countLogLines("The bus connection is gone; leaving"), 1);
+}
+
 class DaemonActivityTest : public DaemonLifecycleTest {
   protected:
     DaemonActivityTest() { idleExitSeconds = 2; }
