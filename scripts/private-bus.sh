@@ -37,8 +37,20 @@ CONFIG
 
 stop_private_bus() {
     [ -n "${PRIVATE_BUS_PID:-}" ] || return 0
-    pkill -TERM -f "tavrixservicesd" -P "$PRIVATE_BUS_PID" 2>/dev/null || true
+    # The bus started the daemon, so it is no child of ours: ask the bus which process it is.
+    local daemon_pid
+    daemon_pid=$(dbus-send --bus="$DBUS_SYSTEM_BUS_ADDRESS" --print-reply=literal \
+        --dest=org.freedesktop.DBus /org/freedesktop/DBus \
+        org.freedesktop.DBus.GetConnectionUnixProcessID string:com.zandor.tavrixservicesd \
+        2>/dev/null | awk '{print $2}')
     kill "$PRIVATE_BUS_PID" 2>/dev/null || true
     wait "$PRIVATE_BUS_PID" 2>/dev/null || true
     PRIVATE_BUS_PID=
+    # Without its bus the daemon finishes what it was doing and leaves; wait for that.
+    [ -n "$daemon_pid" ] || return 0
+    for _ in $(seq 600); do
+        kill -0 "$daemon_pid" 2>/dev/null || return 0
+        sleep 0.1
+    done
+    echo "the daemon $daemon_pid did not leave with its bus" >&2
 }
