@@ -80,10 +80,10 @@ constexpr const char* kOverallHelp =
     "  -h, --help         show this help; 'tavrixctl COMMAND --help' shows a command's\n"
     "  --                 ends the options (for a negative client type)\n"
     "\n"
-    "Exit status: 0 on success, 1 on failure (value: no value; set-id --bundle: the bundle\n"
-    "was not extracted; check-update: the check failed; show: no such property), 2 on a\n"
-    "usage mistake. Setting the behavior ID and starting a check are for root and members\n"
-    "of the \"tavrix\" group; anyone may ask the rest.\n";
+    "Exit status: 0 on success, 1 on failure (value: no value; set-id: the ID was refused,\n"
+    "or with --bundle the bundle was not extracted; check-update: the check failed; show:\n"
+    "no such property), 2 on a usage mistake. Setting the behavior ID and starting a check\n"
+    "are for root and members of the \"tavrix\" group; anyone may ask the rest.\n";
 
 // Options a command takes besides the global ones.
 enum Option : int {
@@ -670,9 +670,11 @@ Action parseCommand(const Command& command, const CommandLine& line) {
         const std::string id = line.operands[1];
         auto file = line.value(kOptionBundle);
         if (!file) {
+            // A refused ID fails the command, so that "set-id X && ..." stops there.
             return [id](TavrixClient& client) {
-                printBoolean(client.setTavrixID(id, std::nullopt), "Accepted");
-                return 0;
+                const bool accepted = client.setTavrixID(id, std::nullopt);
+                printBoolean(accepted, "Accepted");
+                return accepted ? 0 : kFailure;
             };
         }
         // The daemon reads the file itself; "-" is standard input.

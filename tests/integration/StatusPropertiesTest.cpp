@@ -227,6 +227,11 @@ TEST_F(StatusPropertiesTest, ScriptsGetExitStatusesAndTypedJson) {
     EXPECT_EQ(valueOf("When"), "{\"$date\": \"2001-01-01T00:00:01.25Z\"}\n");
     EXPECT_EQ(valueOf("Nested"), "{\"$dictionary\": {\"$date\": \"not a date\"}}\n");
 
+    // A refused ID (here one too long) fails the command; "no" is printed all the same.
+    CommandResult refused = tavrixctl({"set-id", std::string(1025, 'x')});
+    EXPECT_EQ(refused.status, 1);
+    EXPECT_EQ(refused.output, "no\n");
+
     CommandResult missing = throughPython({"value", "NoSuchKey", "--json"}, "answer[\"Value\"]");
     EXPECT_EQ(missing.status, 1);
     EXPECT_EQ(missing.output, "None\n");
