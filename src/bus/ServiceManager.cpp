@@ -78,27 +78,25 @@ void ServiceManager::closeTransaction() {
     wake();
 }
 
-bool ServiceManager::readKeepAlive(std::int64_t& value) const {
+Result<std::int64_t> ServiceManager::readKeepAlive() const {
     std::lock_guard lock(keepAliveMutex_);
     io::UniqueFd fd(::open(keepAlivePath_.c_str(), O_RDONLY | O_CLOEXEC));
     if (!fd) {
         if (errno == ENOENT) {
-            value = 0;
-            return true;
+            return std::int64_t{0};
         }
-        return false;
+        return Failure{"cannot open " + keepAlivePath_, errno};
     }
     std::string text;
-    if (io::readAll(fd.get(), text, 31) != 0) {
-        return false;
+    if (int error = io::readAll(fd.get(), text, 31); error != 0) {
+        return Failure{"cannot read " + keepAlivePath_, error};
     }
     char* end = nullptr;
     long long parsed = std::strtoll(text.c_str(), &end, 10);
     if (end == text.c_str()) {
-        return false;
+        return Failure{keepAlivePath_ + " holds no number"};
     }
-    value = parsed;
-    return true;
+    return std::int64_t{parsed};
 }
 
 bool ServiceManager::writeKeepAlive(std::int64_t value) {
@@ -120,9 +118,8 @@ bool ServiceManager::isIdle() const {
     if (openTransactions_.load() > 0) {
         return false;
     }
-    std::int64_t keepAlive = 0;
     // A flag that cannot be read counts as set: better to stay than to leave work behind.
-    return readKeepAlive(keepAlive) && keepAlive == 0;
+    return readKeepAlive() == std::int64_t{0};
 }
 
 void ServiceManager::noteActivity() {

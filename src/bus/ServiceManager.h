@@ -16,6 +16,7 @@
 #include <mutex>
 #include <string>
 
+#include "base/Result.h"
 #include "io/UniqueFd.h"
 #include "io/WakeEvent.h"
 
@@ -30,8 +31,8 @@ class ServiceManager {
     void closeTransaction();
     int openTransactionCount() const { return openTransactions_.load(); }
 
-    // Reads the keep-alive flag into value (0 when never written). False when it cannot be read.
-    bool readKeepAlive(std::int64_t& value) const;
+    // The keep-alive flag (0 when never written), or why it cannot be read.
+    Result<std::int64_t> readKeepAlive() const;
     // Writes the keep-alive flag atomically. False when it cannot be written.
     bool writeKeepAlive(std::int64_t value);
 

@@ -100,13 +100,13 @@ void TXTransactionManager::_setKeepAlive(bool enable) {
 }
 
 bool TXTransactionManager::_isKeepAliveEnabled(bool* /*error: accepted, never written*/) {
-    std::int64_t value = 1;
-    if (!bus::ServiceManager::shared().readKeepAlive(value)) {
+    const Result<std::int64_t> value = bus::ServiceManager::shared().readKeepAlive();
+    if (!value) {
         logObjectFormat(LogPriority::Warning,
                         "pelgarind could not read keep alive status from stelmard.");
         return true;
     }
-    return value != 0;
+    return *value != 0;
 }
 
 }  // namespace tavrix
