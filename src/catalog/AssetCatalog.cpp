@@ -17,15 +17,6 @@ namespace {
 
 constexpr const char* kSerialNumberKey = "SerialNumber";
 
-bool isFinalReport(const plist::Dictionary& progress) {
-    auto operation = progress.find(kAssetProgressOperationKey);
-    if (operation == progress.end() || operation->second.asString() == nullptr) {
-        return false;
-    }
-    const std::string& name = *operation->second.asString();
-    return name == kAssetOperationCompleted || name == kAssetOperationFailed;
-}
-
 }  // namespace
 
 Asset::Asset(CatalogEntry entry, std::string typeCacheDirectory, AssetLimits limits)
@@ -60,18 +51,16 @@ void Asset::runDownload() {
     logCFormat("Asset catalog: downloading %s", entry_.archiveURL.c_str());
     AssetCacheLocation location = AssetCacheLocation::forDownload(typeCacheDirectory_, entry_);
     Result<> installed = downloadAndInstallAsset(
-        entry_, location, limits_,
-        [this](plist::Dictionary progress) { report(std::move(progress)); });
-    plist::Dictionary last;
+        entry_, location, limits_, [this](AssetProgress progress) { report(std::move(progress)); });
+    AssetProgress last;
     if (!installed) {
         logCFormat(LogPriority::Warning, "Asset catalog: download of %s failed: %s",
                    entry_.archiveURL.c_str(), installed.reason().c_str());
-        last = {{kAssetProgressOperationKey, plist::Value(kAssetOperationFailed)},
-                {kAssetProgressErrorKey, plist::Value(installed.reason())}};
+        last = AssetProgress(kAssetOperationFailed, installed.reason());
     } else {
         logCFormat("Asset catalog: installed %s in %s", entry_.archiveURL.c_str(),
                    location.directory.c_str());
-        last = {{kAssetProgressOperationKey, plist::Value(kAssetOperationCompleted)}};
+        last = AssetProgress(kAssetOperationCompleted);
     }
     {
         std::lock_guard lock(mutex_);
@@ -83,7 +72,7 @@ void Asset::runDownload() {
     report(std::move(last));
 }
 
-void Asset::report(plist::Dictionary progress) {
+void Asset::report(AssetProgress progress) {
     {
         std::lock_guard lock(mutex_);
         undelivered_.push_back(std::move(progress));
@@ -105,7 +94,7 @@ void Asset::setProgressHandler(ProgressHandler handler) {
 void Asset::deliverReports() {
     for (;;) {
         ProgressHandler handler;
-        plist::Dictionary progress;
+        AssetProgress progress;
         bool last = false;
         {
             std::lock_guard lock(mutex_);
@@ -115,13 +104,13 @@ void Asset::deliverReports() {
             handler = handler_;
             progress = std::move(undelivered_.front());
             undelivered_.pop_front();
-            last = isFinalReport(progress);
+            last = progress.isFinal();
             if (last) {
                 // The handler usually captures this asset; dropping it breaks that cycle.
                 handler_ = nullptr;
             }
         }
-        handler(progress);
+        handler(progress.dictionary());
         if (last) {
             // The handler has installed what was downloaded: the process may leave now.
             std::lock_guard lock(mutex_);

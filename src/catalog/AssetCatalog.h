@@ -24,6 +24,7 @@
 #include "bus/ServiceManager.h"
 #include "catalog/AssetCatalogFormat.h"
 #include "catalog/AssetCatalogSettings.h"
+#include "catalog/AssetDownload.h"
 #include "plist/Value.h"
 
 namespace tavrix::catalog {
@@ -74,7 +75,7 @@ class Asset : public std::enable_shared_from_this<Asset> {
     void purge(PurgeCompletion completion);
 
   private:
-    void report(plist::Dictionary progress);
+    void report(AssetProgress progress);
     void deliverReports();
     void runDownload();
 
@@ -87,7 +88,7 @@ class Asset : public std::enable_shared_from_this<Asset> {
     std::vector<std::string> downloaded_;
     bool downloading_ = false;
     ProgressHandler handler_;
-    std::deque<plist::Dictionary> undelivered_;
+    std::deque<AssetProgress> undelivered_;
     // Open from beginDownload until the last report has been handled.
     std::optional<bus::ScopedServiceTransaction> unfinished_;
 };

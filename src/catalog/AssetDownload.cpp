@@ -48,14 +48,10 @@ Failure errnoFailure(const char* action, const std::string& path, int error) {
     return {std::string("cannot ") + action + " " + path + ": " + std::strerror(error)};
 }
 
-plist::Dictionary progress(const char* operation) {
-    return plist::Dictionary{{kAssetProgressOperationKey, plist::Value(operation)}};
-}
-
-plist::Dictionary byteProgress(const char* operation, std::uint64_t written, std::uint64_t total) {
-    plist::Dictionary report = progress(operation);
-    report.emplace(kAssetProgressBytesWrittenKey, plist::Value(static_cast<long long>(written)));
-    report.emplace(kAssetProgressTotalBytesKey, plist::Value(static_cast<long long>(total)));
+AssetProgress byteProgress(const char* operation, std::uint64_t written, std::uint64_t total) {
+    AssetProgress report(operation);
+    report.bytesWritten = written;
+    report.totalBytes = total;
     return report;
 }
 
@@ -167,7 +163,7 @@ Result<> downloadAndInstallAsset(const CatalogEntry& entry, const AssetCacheLoca
             return downloaded;
         }
     }
-    report(progress(kAssetOperationInstalling));
+    report(AssetProgress(kAssetOperationInstalling));
     StagedPath extraction(location.extractionDirectory);
     // The installer copies the extracted tree next: the extraction keeps room for that copy.
     std::string whyNot;
@@ -190,6 +186,27 @@ Result<> downloadAndInstallAsset(const CatalogEntry& entry, const AssetCacheLoca
         return errnoFailure("install into", location.directory, error);
     }
     return {};
+}
+
+bool AssetProgress::isFinal() const {
+    return std::string_view(operation) == kAssetOperationCompleted ||
+           std::string_view(operation) == kAssetOperationFailed;
+}
+
+plist::Dictionary AssetProgress::dictionary() const {
+    plist::Dictionary report{{kAssetProgressOperationKey, plist::Value(operation)}};
+    if (bytesWritten) {
+        report.emplace(kAssetProgressBytesWrittenKey,
+                       plist::Value(static_cast<long long>(*bytesWritten)));
+    }
+    if (totalBytes) {
+        report.emplace(kAssetProgressTotalBytesKey,
+                       plist::Value(static_cast<long long>(*totalBytes)));
+    }
+    if (!error.empty()) {
+        report.emplace(kAssetProgressErrorKey, plist::Value(error));
+    }
+    return report;
 }
 
 }  // namespace tavrix::catalog

@@ -2,6 +2,7 @@
 // the catalog, extract it, and only then put it where its local URL points.
 #pragma once
 
+#include <cstdint>
 #include <functional>
 #include <optional>
 #include <string>
@@ -31,7 +32,23 @@ struct AssetCacheLocation {
 // (at launch, once an interrupted install has been resumed, when none can be in use).
 void removeAbandonedDownloads(const std::string& typeCacheDirectory, bool completedToo);
 
-using AssetProgressReporter = std::function<void(plist::Dictionary progress)>;
+// One step of a download as the catalog passes it along; a progress handler receives it as the
+// dictionary of the keys in AssetCatalog.h.
+struct AssetProgress {
+    AssetProgress() = default;
+    explicit AssetProgress(const char* step, std::string why = {})
+        : operation(step), error(std::move(why)) {}
+
+    const char* operation = nullptr;  // one of the kAssetOperation names
+    std::optional<std::uint64_t> bytesWritten;
+    std::optional<std::uint64_t> totalBytes;
+    std::string error;  // of a failed download
+
+    bool isFinal() const;
+    plist::Dictionary dictionary() const;
+};
+
+using AssetProgressReporter = std::function<void(AssetProgress progress)>;
 
 // Downloads, verifies and extracts the entry's archive within limits, renames the extraction to
 // location.directory when it is whole, and reports the intermediate steps. Either way the
