@@ -1,4 +1,4 @@
-// Archives made and read in the tests with libarchive itself, so that the unpacker is checked
+// Archives made in the tests with libarchive itself, so that the unpacker is checked
 // against the real formats rather than against bytes of our own making.
 #pragma once
 
@@ -113,54 +113,6 @@ inline std::string buildArchive(Container container, Compression compression,
     }
     archive_write_close(handle);
     return bytes;
-}
-
-// One entry of an archive as libarchive reads it back.
-struct ReadEntry {
-    std::string path;
-    mode_t type = 0;
-    mode_t permissions = 0;
-    std::int64_t size = 0;
-    std::time_t mtime = 0;
-    bool hasOwnerNames = false;
-    std::int64_t uid = 0;
-};
-
-struct ReadArchive {
-    // The first filter's code (ARCHIVE_FILTER_GZIP, ...).
-    int filter = 0;
-    std::vector<ReadEntry> entries;
-};
-
-// Every entry of an archive given as bytes, compressed by any filter libarchive knows.
-inline ReadArchive readArchive(const void* bytes, std::size_t size) {
-    payload::ArchiveReader reader(archive_read_new());
-    archive_read_support_filter_all(reader.get());
-    archive_read_support_format_all(reader.get());
-    if (archive_read_open_memory(reader.get(), bytes, size) != ARCHIVE_OK) {
-        throw std::runtime_error(archive_error_string(reader.get()));
-    }
-    ReadArchive result;
-    archive_entry* entry = nullptr;
-    int status = ARCHIVE_OK;
-    while ((status = archive_read_next_header(reader.get(), &entry)) == ARCHIVE_OK) {
-        ReadEntry read;
-        read.path = archive_entry_pathname(entry);
-        read.type = archive_entry_filetype(entry);
-        read.permissions = archive_entry_perm(entry);
-        read.size = archive_entry_size(entry);
-        read.mtime = archive_entry_mtime(entry);
-        auto present = [](const char* name) { return name != nullptr && name[0] != '\0'; };
-        read.hasOwnerNames =
-            present(archive_entry_uname(entry)) || present(archive_entry_gname(entry));
-        read.uid = archive_entry_uid(entry);
-        result.entries.push_back(std::move(read));
-    }
-    if (status != ARCHIVE_EOF) {
-        throw std::runtime_error(archive_error_string(reader.get()));
-    }
-    result.filter = archive_filter_code(reader.get(), 0);
-    return result;
 }
 
 }  // namespace tavrix::test

@@ -1,23 +1,18 @@
 #include <gtest/gtest.h>
-#include <zlib.h>
 
-#include <cstdlib>
 #include <filesystem>
 #include <optional>
 #include <set>
-#include <span>
 #include <string>
 #include <tuple>
 #include <utility>
 #include <vector>
 
-#include "LocalHttpServer.h"
 #include "TestDoubles.h"
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
 #include "bundle/BundleLinks.h"
 #include "bundle/CarrierFileLoader.h"
-#include "bundle/GzipInflater.h"
 #include "bundle/OverlayConfiguration.h"
 #include "bundle/OverrideGeneration.h"
 #include "device/PlatformRoot.h"
@@ -359,22 +354,6 @@ const plist::Value kCarrier(plist::Dictionary{
     {"Nested", plist::Dictionary{{"List", plist::Array{1, 2, 3}}}},
 });
 
-std::string gzipped(const std::string& bytes) {
-    z_stream stream{};
-    EXPECT_EQ(deflateInit2(&stream, Z_BEST_COMPRESSION, Z_DEFLATED, 16 + MAX_WBITS, 8,
-                           Z_DEFAULT_STRATEGY),
-              Z_OK);
-    std::string out(deflateBound(&stream, bytes.size()), '\0');
-    stream.next_in = reinterpret_cast<Bytef*>(const_cast<char*>(bytes.data()));
-    stream.avail_in = static_cast<uInt>(bytes.size());
-    stream.next_out = reinterpret_cast<Bytef*>(out.data());
-    stream.avail_out = static_cast<uInt>(out.size());
-    EXPECT_EQ(deflate(&stream, Z_FINISH), Z_STREAM_END);
-    out.resize(stream.total_out);
-    deflateEnd(&stream);
-    return out;
-}
-
 // The loader's lines carry their own priorities.
 class CarrierFileLoaderTest : public testing::Test {
   protected:
@@ -415,76 +394,6 @@ TEST_F(CarrierFileLoaderTest, LocalFilesLoadOnlyWhenTheyHoldADictionary) {
     EXPECT_EQ(lines(), (std::vector<Line>{{LOG_ERR, "Failed to load the file\n"},
                                           {LOG_ERR, "Failed to load the file\n"},
                                           {LOG_ERR, "Failed to get the URL for the file \n"}}));
-}
-
-// Over HTTP whatever body arrives is the file: gzip (named in any letter case) is inflated, no
-// encoding is taken as it is, any other encoding or a broken gzip body yields nothing, an error
-// page parses to nothing, and only a broken transfer is a failure.
-TEST_F(CarrierFileLoaderTest, HttpBodiesAreTheFileWhateverTheStatus) {
-    test::LocalHttpServer server;
-    const std::string xml = *plist::serialize(kCarrier);
-    const std::string compressed = gzipped(xml);
-    plist::Dictionary large;
-    for (int i = 0; i < 5000; ++i) {
-        large.emplace("Key" + std::to_string(i), std::string(20, 'a' + i % 26));
-    }
-    const std::string largeXml = *plist::serialize(plist::Value(large));
-    ASSERT_GT(largeXml.size(), 100000u);
-    struct Case {
-        const char* path;
-        test::LocalHttpServer::Response response;
-        std::optional<plist::Value> loaded;
-    };
-    const std::vector<Case> cases{
-        {"/gzip", {.headers = {{"Content-Encoding", "gzip"}}, .body = compressed}, kCarrier},
-        {"/mixed", {.headers = {{"content-encoding", "x-GZip"}}, .body = compressed}, kCarrier},
-        {"/large", {.body = largeXml}, plist::Value(large)},
-        // The redirect's own encoding must not decide how the final body is read.
-        {"/redirected",
-         {.status = 302,
-          .reason = "Found",
-          .headers = {{"Location", "/large"}, {"Content-Encoding", "deflate"}}},
-         plist::Value(large)},
-        {"/compress", {.headers = {{"Content-Encoding", "compress"}}, .body = xml}, std::nullopt},
-        {"/damaged", {.headers = {{"Content-Encoding", "gzip"}}, .body = xml}, std::nullopt},
-        {"/empty", {.headers = {{"Content-Encoding", "gzip"}}}, std::nullopt},
-        {"/missing", {.status = 404, .body = "404 Not Found"}, std::nullopt},
-        {"/cut", {.body = xml, .cutAfterBodyBytes = xml.size() / 2}, std::nullopt},
-    };
-    for (const Case& c : cases) {
-        server.serve(c.path, c.response);
-    }
-    for (const Case& c : cases) {
-        EXPECT_EQ(copyPropertyListFromURL(server.url(c.path), kCarrierFileSourceRemote), c.loaded)
-            << c.path;
-    }
-    // A transfer that ended well answers true even with nothing to show.
-    std::optional<plist::Data> data{plist::Data{1}};
-    EXPECT_TRUE(copyDataFromHTTP(server.url("/compress"), &data));
-    EXPECT_FALSE(data);
-    EXPECT_FALSE(copyDataFromHTTP(server.url("/gzip"), nullptr));
-    const test::LocalHttpServer::Request request = server.requests().front();
-    EXPECT_EQ(request.method, "GET");
-    EXPECT_EQ(request.version, "HTTP/1.0");
-    EXPECT_EQ(request.header("Accept-Encoding"), "compress, gzip");
-    // Only HTTP is fetched over the remote source.
-    test::writeText(dir / "local.plist", xml);
-    EXPECT_FALSE(
-        copyPropertyListFromURL("file://" + dir / "local.plist", kCarrierFileSourceRemote));
-}
-
-TEST(GzipInflaterTest, RefusesResultsBeyondTheCap) {
-    std::string zeros(1 << 20, '\0');
-    std::string compressed = gzipped(zeros);
-    std::span<const std::uint8_t> input(reinterpret_cast<const std::uint8_t*>(compressed.data()),
-                                        compressed.size());
-    plist::Data out{7};
-    EXPECT_FALSE(inflateGzip(input, out, zeros.size() - 1));
-    EXPECT_EQ(out, plist::Data{7});
-    EXPECT_TRUE(inflateGzip(input, out, zeros.size()));
-    EXPECT_EQ(out.size(), zeros.size());
-    // Cut input never inflates, whatever the room.
-    EXPECT_FALSE(inflateGzip(input.first(input.size() - 4), out));
 }
 
 }  // namespace
