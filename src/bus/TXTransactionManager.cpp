@@ -9,10 +9,11 @@ namespace tavrix {
 
 TXTransactionManager& TXTransactionManager::sharedInstance() {
     return SharedInstance<TXTransactionManager>::current().instance(
-        [] { return std::make_unique<TXTransactionManager>(); });
+        [] { return std::make_unique<TXTransactionManager>(bus::ServiceManager::shared()); });
 }
 
-TXTransactionManager::TXTransactionManager() = default;
+TXTransactionManager::TXTransactionManager(bus::ServiceManager& serviceManager)
+    : _serviceManager(serviceManager) {}
 
 TXTransactionManager::~TXTransactionManager() {
     for (const std::string& name : openTransactions()) {
@@ -36,7 +37,7 @@ void TXTransactionManager::beginTransaction(const std::string& name, bool keepAl
     }
     plist::Value nameValue(name);
     logObjectFormat("*********** Beginning Corvex transaction : %@ ***********", &nameValue);
-    bus::ServiceManager::shared().openTransaction();
+    _serviceManager.openTransaction();
 }
 
 void TXTransactionManager::endTransaction(const std::string& name) {
@@ -49,7 +50,7 @@ void TXTransactionManager::endTransaction(const std::string& name) {
     }
     plist::Value nameValue(name);
     logObjectFormat("*********** Ended Corvex transaction : %@ ***********", &nameValue);
-    bus::ServiceManager::shared().closeTransaction();
+    _serviceManager.closeTransaction();
 }
 
 bool TXTransactionManager::hasOpenTransactionForName(const std::string& name) const {
@@ -90,7 +91,7 @@ void TXTransactionManager::_setKeepAlive(bool enable) {
     if (_isKeepAliveEnabled(&readError) == enable && !readError) {
         return;
     }
-    if (!bus::ServiceManager::shared().writeKeepAlive(enable ? 1 : 0)) {
+    if (!_serviceManager.writeKeepAlive(enable ? 1 : 0)) {
         logObjectFormat(LogPriority::Warning,
                         "pelgarind could not toggle keep alive status to stelmard.");
         return;
@@ -100,7 +101,7 @@ void TXTransactionManager::_setKeepAlive(bool enable) {
 }
 
 bool TXTransactionManager::_isKeepAliveEnabled(bool* /*error: accepted, never written*/) {
-    const Result<std::int64_t> value = bus::ServiceManager::shared().readKeepAlive();
+    const Result<std::int64_t> value = _serviceManager.readKeepAlive();
     if (!value) {
         logObjectFormat(LogPriority::Warning,
                         "pelgarind could not read keep alive status from stelmard.");

@@ -9,12 +9,17 @@
 
 namespace tavrix {
 
+namespace bus {
+class ServiceManager;
+}
+
 class TXTransactionManager {
   public:
     // The daemon root's transaction manager, created on first use; it lives as long as the root.
     static TXTransactionManager& sharedInstance();
 
-    TXTransactionManager();
+    // Each open name is one open transaction of serviceManager, which also keeps the flag.
+    explicit TXTransactionManager(bus::ServiceManager& serviceManager);
     // Ends every name still open, so that each service-manager transaction is closed.
     ~TXTransactionManager();
     TXTransactionManager(const TXTransactionManager&) = delete;
@@ -40,6 +45,7 @@ class TXTransactionManager {
     // A flag that cannot be read counts as enabled, erring towards staying alive.
     bool _isKeepAliveEnabled(bool* error);
 
+    bus::ServiceManager& _serviceManager;
     std::set<std::string> _openTransactions;
     std::set<std::string> _keepAliveTransactions;
     bool _keepAliveClearable = true;

@@ -63,11 +63,19 @@ std::string transactionStatus(const std::set<std::string>& open) {
 }  // namespace
 
 TXManagerServer& TXManagerServer::sharedInstance() {
-    return SharedInstance<TXManagerServer>::current().instance(
-        [] { return std::unique_ptr<TXManagerServer>(new TXManagerServer()); });
+    return SharedInstance<TXManagerServer>::current().instance([] {
+        return std::unique_ptr<TXManagerServer>(
+            new TXManagerServer(TXTransactionManager::sharedInstance(),
+                                bus::ServiceManager::shared(), StatusPublisher::shared()));
+    });
 }
 
-TXManagerServer::TXManagerServer() : _listener(kTXServiceName, *this) {}
+TXManagerServer::TXManagerServer(TXTransactionManager& transactions,
+                                 bus::ServiceManager& serviceManager, StatusPublisher& status)
+    : _transactions(transactions),
+      _serviceManager(serviceManager),
+      _status(status),
+      _listener(kTXServiceName, *this) {}
 
 TXManager& TXManagerServer::manager() {
     if (_manager == nullptr) {
@@ -78,19 +86,17 @@ TXManager& TXManagerServer::manager() {
 
 int TXManagerServer::runUntilIdleExit() {
     _mainThread = std::this_thread::get_id();
-    auto& transactions = TXTransactionManager::sharedInstance();
-    auto& serviceManager = bus::ServiceManager::shared();
-    transactions.setKeepAliveClearable(false);
+    _transactions.setKeepAliveClearable(false);
 
     if (serverLogStyle() == kServerLogStyleVerbose) {
-        plist::Value state(transactions.isKeepAliveEnabled() ? "ENABLED" : "DISABLED");
+        plist::Value state(_transactions.isKeepAliveEnabled() ? "ENABLED" : "DISABLED");
         logObjectFormat("Starting the server: keepAlive = %@", &state);
     } else if (serverLogStyle() == kServerLogStyleQuiet) {
         logObjectFormat("Starting the server.");
     }
 
     // Before the name: a daemon that could never hold the lock must not serve at all.
-    const auto lock = serviceManager.tryLockInstance();
+    const auto lock = _serviceManager.tryLockInstance();
     if (lock == bus::ServiceManager::InstanceLock::Unusable) {
         return 1;
     }
@@ -103,23 +109,23 @@ int TXManagerServer::runUntilIdleExit() {
 
     if (lock == bus::ServiceManager::InstanceLock::Held) {
         _startActing();
-        serviceManager.notifyReady(transactionStatus(transactions.openTransactions()));
+        _serviceManager.notifyReady(transactionStatus(_transactions.openTransactions()));
     } else {
         // The previous daemon is still finishing its work: serve, and act once it has ended.
         logCFormat("Another daemon is still finishing its work; waiting for it to end\n");
         if (!_armLockRetry()) {
             return 1;
         }
-        serviceManager.notifyReady("Waiting for the previous daemon to end");
+        _serviceManager.notifyReady("Waiting for the previous daemon to end");
     }
     _run();
     return 0;
 }
 
 void TXManagerServer::endServing() {
-    StatusPublisher::shared().detach();
+    _status.detach();
     if (_holdsInstanceLock) {
-        TXTransactionManager::sharedInstance().clearKeepAliveIfNecessary(true);
+        _transactions.clearKeepAliveIfNecessary(true);
     }
     bus::setNotificationBus(nullptr);
 }
@@ -127,13 +133,12 @@ void TXManagerServer::endServing() {
 void TXManagerServer::_startActing() {
     _holdsInstanceLock = true;
     _lockRetryTimer.reset();
-    auto& transactions = TXTransactionManager::sharedInstance();
 
     logObjectFormat("Notifying observers of start");
     _notifyServerStart();
 
-    transactions.setKeepAliveClearable(true);
-    transactions.clearKeepAliveIfNecessary(false);
+    _transactions.setKeepAliveClearable(true);
+    _transactions.clearKeepAliveIfNecessary(false);
 
     UpdateCheckScheduler::sharedInstance();
 
@@ -178,11 +183,10 @@ bool TXManagerServer::_armLockRetry() {
 int TXManagerServer::_onLockRetry(sd_event_source* source, uint64_t, void* userdata) {
     auto& server = *static_cast<TXManagerServer*>(userdata);
     containExceptions("Waiting for the instance lock", [&] {
-        if (bus::ServiceManager::shared().tryLockInstance() ==
-            bus::ServiceManager::InstanceLock::Held) {
+        if (server._serviceManager.tryLockInstance() == bus::ServiceManager::InstanceLock::Held) {
             logCFormat("The previous daemon has ended; acting\n");
             server._startActing();
-            bus::ServiceManager::shared().notifyStatus("Serving");
+            server._serviceManager.notifyStatus("Serving");
             return;
         }
         server._refuseDeferredCalls(std::chrono::steady_clock::now() - kLockPatience);
@@ -236,10 +240,11 @@ bool TXManagerServer::_startServing() {
     };
     // Transactions closed on other threads wake the loop, so that it looks at idleness again.
     // A transaction that closed ended some work, which may have changed the status.
-    auto onWake = [](sd_event_source*, int, uint32_t, void*) -> int {
-        containExceptions("Looking at idleness again", [] {
-            bus::ServiceManager::shared().consumeWake();
-            StatusPublisher::shared().markStale();
+    auto onWake = [](sd_event_source*, int, uint32_t, void* userdata) -> int {
+        containExceptions("Looking at idleness again", [userdata] {
+            auto& server = *static_cast<TXManagerServer*>(userdata);
+            server._serviceManager.consumeWake();
+            server._status.markStale();
         });
         return 0;
     };
@@ -251,10 +256,10 @@ bool TXManagerServer::_startServing() {
         r = sd_event_add_signal(event, &interrupt, SIGINT, onSignal, this);
         _interruptSource.reset(interrupt);
     }
-    const int wakeFd = bus::ServiceManager::shared().wakeFd();
+    const int wakeFd = _serviceManager.wakeFd();
     if (r >= 0 && wakeFd >= 0) {
         sd_event_source* wake = nullptr;
-        r = sd_event_add_io(event, &wake, wakeFd, EPOLLIN, onWake, nullptr);
+        r = sd_event_add_io(event, &wake, wakeFd, EPOLLIN, onWake, this);
         _wakeSource.reset(wake);
     }
     if (r < 0) {
@@ -286,19 +291,20 @@ bool TXManagerServer::_startServing() {
         _disconnectFilter.reset(disconnect);
     }
     // Without announcements the properties still answer; that is no reason not to serve.
-    StatusPublisher::shared().attach(event, _listener.bus(), kTXServiceObjectPath,
-                                     [this] { return _holdsInstanceLock; });
+    _status.attach(event, _listener.bus(), kTXServiceObjectPath,
+                   [this] { return _holdsInstanceLock; });
 
-    TXTransactionManager::sharedInstance().beginTransaction(kMinimumLaunchTransaction);
-    auto endLaunchTransaction = [](sd_event_source*, uint64_t, void*) -> int {
-        containExceptions("Ending the launch transaction", [] {
-            TXTransactionManager::sharedInstance().endTransaction(kMinimumLaunchTransaction);
+    _transactions.beginTransaction(kMinimumLaunchTransaction);
+    auto endLaunchTransaction = [](sd_event_source*, uint64_t, void* self) -> int {
+        containExceptions("Ending the launch transaction", [self] {
+            static_cast<TXManagerServer*>(self)->_transactions.endTransaction(
+                kMinimumLaunchTransaction);
         });
         return 0;
     };
     sd_event_source* launch = nullptr;
     r = sd_event_add_time_relative(event, &launch, CLOCK_MONOTONIC, kMinimumLaunchSeconds * 1000000,
-                                   0, endLaunchTransaction, nullptr);
+                                   0, endLaunchTransaction, this);
     _launchTimer.reset(launch);
     if (r < 0) {
         logCFormat(LogPriority::Warning, "Cannot set up the launch timer: %s\n", std::strerror(-r));
@@ -309,8 +315,6 @@ bool TXManagerServer::_startServing() {
 
 void TXManagerServer::_run() {
     using namespace std::chrono;
-    auto& serviceManager = bus::ServiceManager::shared();
-    auto& transactions = TXTransactionManager::sharedInstance();
     const auto slice = duration_cast<microseconds>(duration<double>(kRunLoopSliceSeconds));
     std::string lastStatus;
     // A pass lasts its whole slice whatever it handles; each event only wakes the loop within it.
@@ -321,7 +325,7 @@ void TXManagerServer::_run() {
             std::max(microseconds(0), duration_cast<microseconds>(passEnd - now));
         if (_finishing) {
             // Work started by an answered call (a download, an install) ends before the process.
-            const int open = serviceManager.openTransactionCount();
+            const int open = _serviceManager.openTransactionCount();
             if (open == 0) {
                 break;
             }
@@ -332,10 +336,10 @@ void TXManagerServer::_run() {
             }
             timeout = std::min(
                 timeout, duration_cast<microseconds>(_drainDeadline - now) + microseconds(1000));
-        } else if (_holdsInstanceLock && serviceManager.isIdle()) {
+        } else if (_holdsInstanceLock && _serviceManager.isIdle()) {
             // (A daemon waiting for the lock stays: the previous one is about to end.)
             // Nothing open, keep-alive clear, and no activity (a call included) for the grace.
-            const auto deadline = serviceManager.lastActivity() + serviceManager.idleGrace();
+            const auto deadline = _serviceManager.lastActivity() + _serviceManager.idleGrace();
             if (now >= deadline) {
                 _finish();
                 continue;  // look again: the calls answered while leaving may have started work
@@ -348,7 +352,7 @@ void TXManagerServer::_run() {
             logCFormat(LogPriority::Warning, "The main event loop failed: %s\n", std::strerror(-r));
             break;
         }
-        std::set<std::string> open = transactions.openTransactions();
+        std::set<std::string> open = _transactions.openTransactions();
         if (steady_clock::now() >= passEnd) {
             passEnd = steady_clock::now() + slice;
             if (!open.empty()) {
@@ -359,7 +363,7 @@ void TXManagerServer::_run() {
         }
         std::string status = transactionStatus(open);
         if (status != lastStatus) {
-            serviceManager.notifyStatus(status);
+            _serviceManager.notifyStatus(status);
             lastStatus = std::move(status);
         }
     }
@@ -371,13 +375,13 @@ void TXManagerServer::_finish() {
     }
     _finishing = true;
     _drainDeadline = std::chrono::steady_clock::now() + kDrainLimit;
-    bus::ServiceManager::shared().notifyStopping();
+    _serviceManager.notifyStopping();
     // The launch transaction only guards a fresh daemon against idleness; leaving on a signal
     // does not wait for it.
     _launchTimer.reset();
-    TXTransactionManager::sharedInstance().endTransaction(kMinimumLaunchTransaction);
+    _transactions.endTransaction(kMinimumLaunchTransaction);
     // While the name is still ours: subscribers match on it.
-    StatusPublisher::shared().publish();
+    _status.publish();
     _listener.releaseNameAndDrain();
     // Leaving without ever holding the lock: the kept calls get their "no" now.
     _lockRetryTimer.reset();
@@ -390,11 +394,10 @@ void TXManagerServer::_notifyServerStart() {
 
 bool TXManagerServer::shouldAcceptNewConnection(bus::ServiceListener& listener,
                                                 const bus::PeerConnection& connection) {
-    auto& transactions = TXTransactionManager::sharedInstance();
-    transactions.beginTransaction(kAddClientTransaction);
+    _transactions.beginTransaction(kAddClientTransaction);
     addClient(std::make_shared<TXManagerServerClient>(
         connection.uniqueName, connection.pid, listener.watchConnection(connection.uniqueName)));
-    transactions.endTransaction(kAddClientTransaction);
+    _transactions.endTransaction(kAddClientTransaction);
     return true;
 }
 

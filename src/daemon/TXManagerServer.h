@@ -33,6 +33,12 @@
 
 namespace tavrix {
 
+namespace bus {
+class ServiceManager;
+}
+class StatusPublisher;
+class TXTransactionManager;
+
 inline constexpr const char* kTXServiceName = "com.zandor.tavrixservicesd";
 inline constexpr const char* kTXServiceObjectPath = "/com/zandor/tavrixservicesd";
 inline constexpr const char* kTXServiceInterface = "com.zandor.TXManagerServerInterface";
@@ -90,6 +96,8 @@ class TXManagerServer : private bus::ServiceListener::Delegate {
     std::vector<std::shared_ptr<const TXManagerServerClient>> clients() const;
 
     bus::ServiceListener& listener() { return _listener; }
+    bus::ServiceManager& serviceManager() { return _serviceManager; }
+    StatusPublisher& status() { return _status; }
 
     // True once this process holds the instance lock and may act on bundles.
     bool holdsInstanceLock() const { return _holdsInstanceLock; }
@@ -100,7 +108,9 @@ class TXManagerServer : private bus::ServiceListener::Delegate {
                          int (*refuse)(sd_bus_message*));
 
   private:
-    TXManagerServer();
+    // What the server serves with, all of them made before it and ended after it.
+    TXManagerServer(TXTransactionManager& transactions, bus::ServiceManager& serviceManager,
+                    StatusPublisher& status);
 
     // Listener delegate.
     bool shouldAcceptNewConnection(bus::ServiceListener& listener,
@@ -126,6 +136,9 @@ class TXManagerServer : private bus::ServiceListener::Delegate {
     // Releases the name and answers what is queued; _run then waits for open transactions.
     void _finish();
 
+    TXTransactionManager& _transactions;
+    bus::ServiceManager& _serviceManager;
+    StatusPublisher& _status;
     TXManager* _manager = nullptr;
     std::vector<std::shared_ptr<TXManagerServerClient>> _clients;
     bus::ServiceListener _listener;

@@ -26,8 +26,9 @@ namespace {
 // the idle grace counts from the end of the last one.
 class MessageScope {
   public:
-    MessageScope(TXManagerServer& server, sd_bus_message* message) : listener_(server.listener()) {
-        bus::ServiceManager::shared().noteActivity();
+    MessageScope(TXManagerServer& server, sd_bus_message* message)
+        : listener_(server.listener()), serviceManager_(server.serviceManager()) {
+        serviceManager_.noteActivity();
         try {
             listener_.beginMessage(message);
         } catch (...) {
@@ -37,13 +38,14 @@ class MessageScope {
     }
     ~MessageScope() {
         listener_.endMessage();
-        bus::ServiceManager::shared().noteActivity();
+        serviceManager_.noteActivity();
     }
     MessageScope(const MessageScope&) = delete;
     MessageScope& operator=(const MessageScope&) = delete;
 
   private:
     bus::ServiceListener& listener_;
+    bus::ServiceManager& serviceManager_;
 };
 
 // An argument the bus library could not read. For text that is invalid UTF-8 or holds a Unicode
@@ -96,7 +98,7 @@ int handled(sd_bus_message* message, void* userdata, sd_bus_error* error) noexce
             }
         })) {
         containExceptions("A refusal", [&] {
-            StatusPublisher::shared().markStale();
+            static_cast<TXManagerServer*>(userdata)->status().markStale();
             result = Refuse(message);
         });
     }
@@ -119,7 +121,7 @@ int handleSetTavrixID(sd_bus_message* message, void* userdata, sd_bus_error* err
         MessageScope scope(server, message);
         server.setTavrixID(tavrixID, bundle, [&](bool accepted) { answer = accepted; });
     }
-    StatusPublisher::shared().markStale();
+    server.status().markStale();
     return replyBoolean(message, answer);
 }
 
@@ -149,7 +151,7 @@ int handleSetTavrixIDWithBundleFD(sd_bus_message* message, void* userdata, sd_bu
                                          payload = outcome;
                                      });
     }
-    StatusPublisher::shared().markStale();
+    server.status().markStale();
     // An archive's error may quote a member's name, which may be any bytes.
     const char* reason = isValidUtf8(payload.reason) ? payload.reason.c_str() : "(not UTF-8)";
     return sd_bus_reply_method_return(message, "bbs", accepted ? 1 : 0, payload.extracted ? 1 : 0,
@@ -214,7 +216,7 @@ int handleCheckForTavrixBundleUpdate(sd_bus_message* message, void* userdata, sd
         MessageScope scope(server, message);
         server.checkForTavrixBundleUpdate([&](bool started) { answer = started; });
     }
-    StatusPublisher::shared().markStale();
+    server.status().markStale();
     return replyBoolean(message, answer);
 }
 

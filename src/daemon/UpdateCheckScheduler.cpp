@@ -12,8 +12,10 @@
 namespace tavrix {
 
 UpdateCheckScheduler& UpdateCheckScheduler::sharedInstance() {
-    return SharedInstance<UpdateCheckScheduler>::current().instance(
-        [] { return std::unique_ptr<UpdateCheckScheduler>(new UpdateCheckScheduler()); });
+    return SharedInstance<UpdateCheckScheduler>::current().instance([] {
+        return std::unique_ptr<UpdateCheckScheduler>(
+            new UpdateCheckScheduler(TXTransactionManager::sharedInstance()));
+    });
 }
 
 void UpdateCheckScheduler::stop() {
@@ -26,7 +28,8 @@ UpdateCheckScheduler::~UpdateCheckScheduler() {
     stop();
 }
 
-UpdateCheckScheduler::UpdateCheckScheduler() : _schedulerQueue(kUpdateCheckQueueLabel) {
+UpdateCheckScheduler::UpdateCheckScheduler(TXTransactionManager& transactions)
+    : _transactions(transactions), _schedulerQueue(kUpdateCheckQueueLabel) {
     logObjectFormat("Initializing Timers Manager");
     // Created on the queue: a job due at launch is queued by the binding's constructor, and so
     // reaches onJobFired only once the binding is in place.
@@ -112,9 +115,8 @@ void UpdateCheckScheduler::scheduleJobAt(double start) {
 
 void UpdateCheckScheduler::onJobFired(const std::string& /*jobName*/,
                                       const plist::Dictionary* job) {
-    auto& transactions = TXTransactionManager::sharedInstance();
     // Keep-alive, so that the daemon stays for the download that may follow.
-    transactions.beginTransaction(TXUpdateCheckTransaction, true);
+    _transactions.beginTransaction(TXUpdateCheckTransaction, true);
     if (job == nullptr) {
         logObjectFormat(LogPriority::Warning,
                         "Invalid Corvex job object received in the call back");
@@ -125,13 +127,13 @@ void UpdateCheckScheduler::onJobFired(const std::string& /*jobName*/,
     logObjectFormat(LogPriority::Warning, "Update check has failed, rescheduling the next update");
     setUpNewTimer(kUpdateCheckIntervalSeconds);
     // Ended twice, as this path always has; the second end finds the name closed and does nothing.
-    transactions.endTransaction(TXUpdateCheckTransaction);
-    transactions.endTransaction(TXUpdateCheckTransaction);
+    _transactions.endTransaction(TXUpdateCheckTransaction);
+    _transactions.endTransaction(TXUpdateCheckTransaction);
 }
 
 void UpdateCheckScheduler::rescheduleAndEndCheck(double seconds) {
     setUpNewTimer(seconds);
-    TXTransactionManager::sharedInstance().endTransaction(TXUpdateCheckTransaction);
+    _transactions.endTransaction(TXUpdateCheckTransaction);
 }
 
 std::optional<double> UpdateCheckScheduler::nextCheckTime() const {

@@ -14,6 +14,8 @@
 
 namespace tavrix {
 
+class TXTransactionManager;
+
 // The interval the scheduler arms itself with: 15 days.
 inline constexpr double kUpdateCheckIntervalSeconds = 1296000.0;
 // How long the job's window stays open after "NextUpdate".
@@ -53,10 +55,12 @@ class UpdateCheckScheduler {
     std::optional<double> nextCheckTime() const;
 
   private:
-    UpdateCheckScheduler();
+    // A check holds its transaction in transactions from the job firing to its end.
+    explicit UpdateCheckScheduler(TXTransactionManager& transactions);
     // Registers the one job for a window starting then; the caller holds _rearmLock.
     void scheduleJobAt(double start);
 
+    TXTransactionManager& _transactions;
     SerialQueue _schedulerQueue;
     std::optional<bus::BackgroundJobScheduler> _jobScheduler;
     // Re-arming runs on the main thread, the scheduler queue and the download thread; this keeps

@@ -24,7 +24,7 @@ class TXTransactionManagerTest : public testing::Test {
 
 // A name is open once however often it begins; ending an unknown name is harmless.
 TEST_F(TXTransactionManagerTest, NamesAreCountedOnce) {
-    TXTransactionManager transactions;
+    TXTransactionManager transactions(serviceManager());
     transactions.beginTransaction("A");
     transactions.beginTransaction("A");
     EXPECT_EQ(serviceManager().openTransactionCount(), 1);
@@ -39,7 +39,7 @@ TEST_F(TXTransactionManagerTest, NamesAreCountedOnce) {
 // The flag follows keep-alive transactions while clearable; not clearable, it stays set even when
 // forced. Setting the value it already has writes nothing.
 TEST_F(TXTransactionManagerTest, KeepAliveFollowsKeepAliveTransactionsWhenClearable) {
-    TXTransactionManager transactions;
+    TXTransactionManager transactions(serviceManager());
     transactions.clearKeepAliveIfNecessary(true);  // no flag yet: already clear
     EXPECT_FALSE(std::filesystem::exists(flagPath));
     transactions.beginTransaction("Update Check", true);
@@ -74,7 +74,7 @@ TEST_F(TXTransactionManagerTest, KeepAliveFollowsKeepAliveTransactionsWhenCleara
 TEST_F(TXTransactionManagerTest, UnreadableFlagCountsAsEnabled) {
     // A directory where the flag file should be: it can be neither read nor replaced.
     std::filesystem::create_directories(flagPath);
-    TXTransactionManager transactions;
+    TXTransactionManager transactions(serviceManager());
     EXPECT_TRUE(transactions.isKeepAliveEnabled());
     EXPECT_FALSE(serviceManager().isIdle());
     transactions.clearKeepAliveIfNecessary(true);
