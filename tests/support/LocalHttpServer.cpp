@@ -2,7 +2,6 @@
 
 #include <arpa/inet.h>
 #include <netinet/in.h>
-#include <strings.h>
 #include <sys/socket.h>
 #include <sys/time.h>
 
@@ -50,16 +49,7 @@ std::optional<std::string> readRequestHead(int fd) {
 LocalHttpServer::Request parseRequest(const std::string& head) {
     LocalHttpServer::Request request;
     std::istringstream lines(head);
-    lines >> request.method >> request.target >> request.version;
-    for (std::string line; std::getline(lines, line);) {
-        const std::size_t colon = line.find(':');
-        if (colon != std::string::npos) {
-            const std::size_t value = line.find_first_not_of(" \t", colon + 1);
-            request.headers.emplace_back(
-                line.substr(0, colon),
-                value == std::string::npos ? "" : line.substr(value, line.find('\r') - value));
-        }
-    }
+    lines >> request.method >> request.target;
     return request;
 }
 
@@ -74,15 +64,6 @@ std::string responseHead(const LocalHttpServer::Response& response) {
 }
 
 }  // namespace
-
-std::optional<std::string> LocalHttpServer::Request::header(std::string_view name) const {
-    for (const auto& [headerName, value] : headers) {
-        if (::strcasecmp(headerName.c_str(), std::string(name).c_str()) == 0) {
-            return value;
-        }
-    }
-    return std::nullopt;
-}
 
 LocalHttpServer::LocalHttpServer() {
     listenFd_.reset(::socket(AF_INET, SOCK_STREAM | SOCK_CLOEXEC, 0));

@@ -44,10 +44,6 @@ class LocalHttpServer {
     struct Request {
         std::string method;
         std::string target;
-        std::string version;  // "HTTP/1.0"
-        std::vector<std::pair<std::string, std::string>> headers;
-        // The first header of that name (any letter case), or nothing.
-        std::optional<std::string> header(std::string_view name) const;
     };
 
     // Listens on 127.0.0.1 at a port the kernel chooses; throws std::runtime_error when it cannot.
