@@ -77,10 +77,6 @@ struct ProgressLog {
 class AssetCatalogTest : public testing::Test {
   protected:
     void SetUp() override {
-        std::error_code ignored;
-        fs::remove_all(device::resolvePath("/etc/tavrix"), ignored);
-        fs::remove_all(device::resolvePath("/var/cache"), ignored);
-        fs::remove_all(device::resolvePath(std::string(device::kDaemonStateDirectory)), ignored);
         publicKey = keygen("secret.key", "public.key");
         server.serveDirectory("/catalog/", work.path() / "out");
     }
@@ -373,7 +369,6 @@ TEST_F(AssetCatalogTest, RolloutsFollowTheDevicesSerialNumber) {
         test::writeDeviceTable({{"SerialNumber", serialNumber}});
         EXPECT_EQ(query().value_or(Assets()).size(), taking ? 1u : 0u) << serialNumber;
     }
-    fs::remove(device::resolvePath("/etc/tavrix/DeviceInfo.plist"));
 }
 
 TEST_F(AssetCatalogTest, DamagedCatalogsAreRefusedAndMalformedEntriesSkipped) {

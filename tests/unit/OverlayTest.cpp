@@ -32,13 +32,6 @@ using Line = std::pair<int, std::string>;
 // lists behavior overrides for "ABC".
 class OverrideGenerationTest : public testing::Test {
   protected:
-    void TearDown() override {
-        std::error_code ignored;
-        fs::remove_all(device::resolvePath("/System"), ignored);
-        fs::remove_all(device::resolvePath("/etc/tavrix"), ignored);
-        fs::remove_all(home() + "/Library", ignored);
-    }
-
     static std::string home() { return test::unitTestRoot().string() + "/var/mobile"; }
     static std::string bundle() {
         return device::resolvePath("/System/Library/TavrixBundles/Phone/Default.bundle");
