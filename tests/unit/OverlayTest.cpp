@@ -73,11 +73,22 @@ class OverrideGenerationTest : public testing::Test {
 };
 
 // Without a device file for the model, the device decision leaves the base bundle in the record;
-// without a listed ID, so does the behavior overlay.
+// without a listed ID, so does the behavior overlay. Without a readable base there is no carrier
+// info.
 TEST_F(OverrideGenerationTest, WithoutAMatchTheRecordKeepsTheBaseFile) {
     writeDevice("T12AP");
-    writeBundle(baseCarrier());
+    // No bundle at all: the empty carrier path cannot be loaded.
     CarrierBundle record;
+    EXPECT_EQ(makeDeviceOverlayDecision(record, std::nullopt), kCarrierInfoNotPresent);
+    EXPECT_TRUE(record.bundlePath.empty());
+    // A base carrier file that holds no dictionary.
+    writeBundle({});
+    ASSERT_TRUE(plist::writeFile(baseFile(), Value(Array{"ABC"})));
+    record = baseBundle();
+    EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kCarrierInfoNotPresent);
+    EXPECT_EQ(record.carrierFilePath, baseFile());
+
+    writeBundle(baseCarrier());
     record.carrierFilePath = "/stale";
     EXPECT_EQ(makeDeviceOverlayDecision(record, std::nullopt), kNoMatchForOverlay);
     EXPECT_EQ(record.bundlePath, bundle());
@@ -119,21 +130,6 @@ TEST_F(OverrideGenerationTest, AnUnknownModelNeedsNoOverride) {
     writeBundle(baseCarrier());
     CarrierBundle record;
     EXPECT_EQ(makeDeviceOverlayDecision(record, std::nullopt), kOverrideNotRequired);
-    EXPECT_EQ(record.carrierFilePath, baseFile());
-}
-
-TEST_F(OverrideGenerationTest, AnUnreadableBaseMeansNoCarrierInfo) {
-    writeDevice("T12AP");
-    // No bundle at all: the empty carrier path cannot be loaded.
-    CarrierBundle record;
-    EXPECT_EQ(makeDeviceOverlayDecision(record, std::nullopt), kCarrierInfoNotPresent);
-    EXPECT_TRUE(record.bundlePath.empty());
-
-    // A base carrier file that holds no dictionary.
-    writeBundle({});
-    ASSERT_TRUE(plist::writeFile(baseFile(), Value(Array{"ABC"})));
-    record = baseBundle();
-    EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kCarrierInfoNotPresent);
     EXPECT_EQ(record.carrierFilePath, baseFile());
 }
 
