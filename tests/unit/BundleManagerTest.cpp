@@ -151,7 +151,6 @@ TEST_F(BundleManagerStartUp, ReadsDanglingLinksAsTheyAre) {
     writeDeviceTable();
     const std::string carrierFile =
         userBundle() + "/Overlay/device+id+behavior+Default.bundle+T12AP+ab12+1.plist";
-    fs::create_directories(home() + "/Library/Preferences");
     fs::create_symlink(home() + "/gone.bundle", bundleLink());
     fs::create_symlink(carrierFile, preferencesLink());
 
@@ -199,17 +198,13 @@ TEST_F(BundleManagerStartUp, LinksThatDisagreeAreLinkedAgainAndLeftoversRemoved)
         EXPECT_FALSE(fs::exists(fs::symlink_status(leftover))) << leftover;
     }
 
+    // Without an ID the reset runs nothing, not even the relink.
+    EXPECT_EQ(manager.resetBehaviorBundle(std::nullopt), kBundleChangeTypeNoChange);
     EXPECT_EQ(manager.resetBehaviorBundle("ab12"), kBundleChangeTypeUpdate);
     EXPECT_EQ(readLinkTarget(preferencesLink()), userBundle() + "/behavior.plist");
     EXPECT_FALSE(fs::exists(overlays + "id+behavior+Default.bundle+ab12+7.plist"));
     EXPECT_TRUE(fs::exists(overlays + "id+behavior+Default.bundle+ab12+9.plist"));
     EXPECT_EQ(manager.resetBehaviorBundle("ab12"), kBundleChangeTypeNoChange);
-}
-
-TEST_F(BundleManagerStartUp, WithoutAnIDTheResetRunsNothing) {
-    BundleManager& manager = BundleManager::sharedInstance();
-    EXPECT_EQ(manager.resetBehaviorBundle(std::nullopt), kBundleChangeTypeNoChange);
-    EXPECT_FALSE(fs::exists(fs::symlink_status(bundleLink())));
 }
 
 // --- The carrier file-name grammar ---
