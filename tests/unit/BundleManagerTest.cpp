@@ -209,7 +209,7 @@ TEST_F(BundleManagerStartUp, LinksThatDisagreeAreLinkedAgainAndLeftoversRemoved)
 
 // --- The carrier file-name grammar ---
 
-TEST(CarrierFileNameGrammar, ReadsKeyAndVersion) {
+TEST(CarrierFileNameGrammar, ReadsKeyAndVersionAndOrdersNames) {
     const std::vector<std::tuple<std::string, std::string, std::string>> cases = {
         {"id+behavior+Default.bundle+ab12+7.plist", "ab12", "7"},
         {"device+behavior+Default.bundle+T12AP+2.10.plist", "T12AP", "2.10"},
@@ -232,11 +232,9 @@ TEST(CarrierFileNameGrammar, ReadsKeyAndVersion) {
         EXPECT_EQ(behaviorIDFromCarrierFileName(name), behaviorID);
         EXPECT_EQ(versionFromCarrierFileName(name), version);
     }
-}
 
-// The matched file wins only with another ID or a higher version (both decide bundles in the
-// comparison test below); names that cannot be read are never newer.
-TEST(CarrierFileNameGrammar, MatchedFileWinsOnlyWithAnotherIDOrAHigherVersion) {
+    // The matched file wins only with another ID or a higher version (both decide bundles in the
+    // comparison test below); names that cannot be read are never newer.
     const std::string current = "id+behavior+Default.bundle+ab12+1.9.plist";
     EXPECT_TRUE(compareCarrierFileNames(current, "id+behavior+Default.bundle+ab12+1.10.plist"));
     const std::pair<std::string, std::string> notNewer[] = {
