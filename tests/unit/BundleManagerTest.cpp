@@ -151,7 +151,6 @@ TEST_F(BundleManagerStartUp, ReadsDanglingLinksAsTheyAre) {
     writeDeviceTable();
     const std::string carrierFile =
         userBundle() + "/Overlay/device+id+behavior+Default.bundle+T12AP+ab12+1.plist";
-    fs::create_directories(home() + "/Library/Preferences");
     fs::create_symlink(home() + "/gone.bundle", bundleLink());
     fs::create_symlink(carrierFile, preferencesLink());
 
@@ -199,6 +198,8 @@ TEST_F(BundleManagerStartUp, LinksThatDisagreeAreLinkedAgainAndLeftoversRemoved)
         EXPECT_FALSE(fs::exists(fs::symlink_status(leftover))) << leftover;
     }
 
+    // Without an ID the reset runs nothing, not even the relink.
+    EXPECT_EQ(manager.resetBehaviorBundle(std::nullopt), kBundleChangeTypeNoChange);
     EXPECT_EQ(manager.resetBehaviorBundle("ab12"), kBundleChangeTypeUpdate);
     EXPECT_EQ(readLinkTarget(preferencesLink()), userBundle() + "/behavior.plist");
     EXPECT_FALSE(fs::exists(overlays + "id+behavior+Default.bundle+ab12+7.plist"));
@@ -206,15 +207,9 @@ TEST_F(BundleManagerStartUp, LinksThatDisagreeAreLinkedAgainAndLeftoversRemoved)
     EXPECT_EQ(manager.resetBehaviorBundle("ab12"), kBundleChangeTypeNoChange);
 }
 
-TEST_F(BundleManagerStartUp, WithoutAnIDTheResetRunsNothing) {
-    BundleManager& manager = BundleManager::sharedInstance();
-    EXPECT_EQ(manager.resetBehaviorBundle(std::nullopt), kBundleChangeTypeNoChange);
-    EXPECT_FALSE(fs::exists(fs::symlink_status(bundleLink())));
-}
-
 // --- The carrier file-name grammar ---
 
-TEST(CarrierFileNameGrammar, ReadsKeyAndVersion) {
+TEST(CarrierFileNameGrammar, ReadsKeyAndVersionAndOrdersNames) {
     const std::vector<std::tuple<std::string, std::string, std::string>> cases = {
         {"id+behavior+Default.bundle+ab12+7.plist", "ab12", "7"},
         {"device+behavior+Default.bundle+T12AP+2.10.plist", "T12AP", "2.10"},
@@ -237,11 +232,9 @@ TEST(CarrierFileNameGrammar, ReadsKeyAndVersion) {
         EXPECT_EQ(behaviorIDFromCarrierFileName(name), behaviorID);
         EXPECT_EQ(versionFromCarrierFileName(name), version);
     }
-}
 
-// The matched file wins only with another ID or a higher version (both decide bundles in the
-// comparison test below); names that cannot be read are never newer.
-TEST(CarrierFileNameGrammar, MatchedFileWinsOnlyWithAnotherIDOrAHigherVersion) {
+    // The matched file wins only with another ID or a higher version (both decide bundles in the
+    // comparison test below); names that cannot be read are never newer.
     const std::string current = "id+behavior+Default.bundle+ab12+1.9.plist";
     EXPECT_TRUE(compareCarrierFileNames(current, "id+behavior+Default.bundle+ab12+1.10.plist"));
     const std::pair<std::string, std::string> notNewer[] = {

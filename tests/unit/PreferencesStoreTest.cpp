@@ -108,26 +108,6 @@ TEST_F(PreferencesStoreTest, DamagedFileReadsEmptyIsLoggedOncePerVersionAndIsRep
     EXPECT_EQ(std::distance(fs::directory_iterator(preferencesDirectory()), {}), 2);
 }
 
-TEST_F(PreferencesStoreTest, SymbolicLinkDomainIsReadThroughAndRepointed) {
-    const std::string domain = "test.linked";
-    const std::string link = domainPath(domain);
-    const std::string first = (test::unitTestRoot() / "elsewhere/first.plist").string();
-    const std::string second = (test::unitTestRoot() / "elsewhere/second.plist").string();
-    test::writeText(first, *plist::serialize(Value(plist::Dictionary{{"k", Value("first")}})));
-    test::writeText(second, *plist::serialize(Value(plist::Dictionary{{"k", Value("second")}})));
-    fs::create_directories(preferencesDirectory());
-    fs::create_symlink(first, link);
-    EXPECT_EQ(store.copyValue("k", domain, kUser), Value("first"));
-
-    // Re-pointed with a relative link, as a rename over the old one.
-    fs::create_symlink("../../../../elsewhere/second.plist", link + ".new");
-    fs::rename(link + ".new", link);
-    ASSERT_TRUE(store.synchronize(domain, kUser));
-    EXPECT_EQ(store.copyValue("k", domain, kUser), Value("second"));
-
-    EXPECT_TRUE(fs::is_symlink(link));  // the carrier file link: never rewritten by the store
-}
-
 // Names that could reach outside the Preferences directory, or no file name at all, answer
 // nothing and write nothing anywhere.
 TEST_F(PreferencesStoreTest, InvalidDomainsAndUsersAnswerNothing) {

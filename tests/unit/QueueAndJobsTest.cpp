@@ -74,7 +74,7 @@ class BackgroundJobSchedulerTest : public testing::Test {
     SerialQueue queue_{"jobs-test"};
 };
 
-TEST_F(BackgroundJobSchedulerTest, JobsOutliveTheBindingPerClient) {
+TEST_F(BackgroundJobSchedulerTest, JobsOutliveTheBindingPerClientUnlessTheFileIsDamaged) {
     const double start = Clock::absoluteTimeNow() + kHour;
     plist::Dictionary criteria = window(start, start + kHour);
     criteria.emplace(std::string(kJobPowerOptimizationLevel), plist::Integer(1));
@@ -87,10 +87,8 @@ TEST_F(BackgroundJobSchedulerTest, JobsOutliveTheBindingPerClient) {
     struct stat info {};
     ASSERT_EQ(::stat(jobsFile().c_str(), &info), 0);
     EXPECT_EQ(info.st_mode & 0777, 0600u);
-}
 
-TEST_F(BackgroundJobSchedulerTest, DamagedFilesReadAsNoJobsAndBadEntriesAreSkipped) {
-    const double start = Clock::absoluteTimeNow() + kHour;
+    // Damaged files read as no jobs, and bad entries are skipped.
     for (const std::string& damaged :
          {std::string("not a property list\0\x01", 22), *plist::serialize(plist::Array{1, 2})}) {
         test::writeText(jobsFile(), damaged);
