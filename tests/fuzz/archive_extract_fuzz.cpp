@@ -3,11 +3,9 @@
 // afterwards. Whatever the bytes, nothing may be written outside that directory, no symbolic link
 // left in it may lead outside, and what it holds stays within the limits.
 #include <sys/stat.h>
-#include <unistd.h>
 
 #include <cstddef>
 #include <cstdint>
-#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <string>

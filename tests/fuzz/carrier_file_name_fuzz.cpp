@@ -3,7 +3,6 @@
 // grammar extracts must be a piece of the name that it was read from.
 #include <cstddef>
 #include <cstdint>
-#include <cstdlib>
 #include <string>
 #include <string_view>
 

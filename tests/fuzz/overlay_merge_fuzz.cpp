@@ -3,7 +3,6 @@
 // and overlay; any other input is merged with its own override configurations.
 #include <cstddef>
 #include <cstdint>
-#include <cstdlib>
 #include <string_view>
 #include <vector>
 

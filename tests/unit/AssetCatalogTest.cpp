@@ -7,7 +7,6 @@
 #include <filesystem>
 #include <functional>
 #include <future>
-#include <map>
 #include <mutex>
 #include <string>
 #include <tuple>
@@ -20,7 +19,6 @@
 #include "UnitTestRoot.h"
 #include "catalog/AssetCatalog.h"
 #include "catalog/AssetCatalogSettings.h"
-#include "catalog/CatalogCrypto.h"
 #include "catalog/Sha256.h"
 #include "device/PlatformRoot.h"
 #include "plist/DateText.h"
@@ -118,7 +116,7 @@ class AssetCatalogTest : public testing::Test {
 
     void writeTypeSettings(plist::Dictionary type, plist::Dictionary extra = {},
                            const char* typeName = kAssetType) {
-        type.emplace(kSettingsCatalogURLKey, plist::Value(catalogURL()));
+        type.emplace(kSettingsCatalogURLKey, plist::Value(server.url("/catalog/catalog.plist")));
         extra.insert_or_assign(kSettingsAssetTypesKey,
                                plist::Value(plist::Dictionary{{typeName, type}}));
         std::string path = device::resolvePath(kAssetCatalogSettingsPath);
@@ -154,7 +152,6 @@ class AssetCatalogTest : public testing::Test {
                      {.body = catalogBytes(plist::Value(plist::Array{plist::Value(entry)}))});
     }
 
-    std::string catalogURL() const { return server.url("/catalog/catalog.plist"); }
     std::string out(const std::string& relative) const { return work / ("out/" + relative); }
     std::string typeCache() const {
         return device::resolvePath(kDefaultAssetCacheDirectory) + "/" + kAssetType;
@@ -724,18 +721,13 @@ TEST(SampleAssetCatalogTest, ReadsAsDocumentedWithTheDefaultLimits) {
     ASSERT_EQ(settings->trustedKeys.size(), 1u);
     EXPECT_EQ(settings->trustedKeys.front().identifier, "release-2026");
     EXPECT_FALSE(settings->allowUnsigned);
+    auto fields = [](const AssetLimits& l) {
+        return std::tie(l.maxExpandedBytes, l.maxArchiveEntries, l.freeSpaceReserveBytes,
+                        l.connectTimeoutSeconds, l.lowSpeedBytesPerSecond, l.lowSpeedSeconds,
+                        l.catalogTimeoutSeconds, l.archiveTimeoutSeconds);
+    };
     const AssetLimits defaults;
-    const AssetLimits& limits = settings->limits;
-    EXPECT_EQ(
-        std::tie(limits.maxExpandedBytes, limits.maxArchiveEntries, limits.freeSpaceReserveBytes),
-        std::tie(defaults.maxExpandedBytes, defaults.maxArchiveEntries,
-                 defaults.freeSpaceReserveBytes));
-    EXPECT_EQ(std::tie(limits.connectTimeoutSeconds, limits.lowSpeedBytesPerSecond,
-                       limits.lowSpeedSeconds, limits.catalogTimeoutSeconds,
-                       limits.archiveTimeoutSeconds),
-              std::tie(defaults.connectTimeoutSeconds, defaults.lowSpeedBytesPerSecond,
-                       defaults.lowSpeedSeconds, defaults.catalogTimeoutSeconds,
-                       defaults.archiveTimeoutSeconds));
+    EXPECT_EQ(fields(settings->limits), fields(defaults));
 }
 
 // The digest is libcrypto's, loaded on first use: known vectors, fed in pieces that cross its

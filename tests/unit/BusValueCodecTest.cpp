@@ -177,27 +177,17 @@ TEST_F(BusValueCodec, RefusesStringsTheBusCannotCarry) {
     }
 }
 
-Value nestedArrays(std::size_t depth) {
-    Value value("leaf");
-    for (std::size_t level = 1; level < depth; ++level) {
-        value = Value(Array{value});
-    }
-    return value;
-}
-
-Value nestedDictionaries(std::size_t depth) {
-    Value value(Data{1, 2, 3});
-    for (std::size_t level = 1; level < depth; ++level) {
-        value = Value(Dictionary{{"level", value}});
-    }
-    return value;
-}
-
 // The deepest values this side sends, in the optional shape that replies use, pass the bus
 // daemon; one level more is refused when writing, and a deeper message written by hand is
 // refused when reading.
 TEST_F(BusValueCodec, NestingStopsAtTheDeepestValueTheBusCarries) {
-    for (const Value& value : {nestedArrays(kMaxValueDepth), nestedDictionaries(kMaxValueDepth)}) {
+    Value arrays("leaf");
+    Value dictionaries(Data{1, 2, 3});
+    for (std::size_t level = 1; level < kMaxValueDepth; ++level) {
+        arrays = Value(Array{arrays});
+        dictionaries = Value(Dictionary{{"level", dictionaries}});
+    }
+    for (const Value& value : {arrays, dictionaries}) {
         std::optional<Value> back;
         ASSERT_GE(roundTrip([&](sd_bus_message* m) { return appendOptionalValue(m, value); },
                             [&](sd_bus_message* m) { return readOptionalValue(m, back); }),
@@ -212,15 +202,11 @@ TEST_F(BusValueCodec, NestingStopsAtTheDeepestValueTheBusCarries) {
                       int r = 0;
                       for (std::size_t level = 0; level <= kMaxValueDepth && r >= 0; ++level) {
                           r = sd_bus_message_open_container(m, 'v', "av");
-                          if (r >= 0) {
-                              r = sd_bus_message_open_container(m, 'a', "v");
-                          }
+                          r = r < 0 ? r : sd_bus_message_open_container(m, 'a', "v");
                       }
                       for (std::size_t level = 0; level <= kMaxValueDepth && r >= 0; ++level) {
                           r = sd_bus_message_close_container(m);
-                          if (r >= 0) {
-                              r = sd_bus_message_close_container(m);
-                          }
+                          r = r < 0 ? r : sd_bus_message_close_container(m);
                       }
                       return r;
                   },

@@ -15,15 +15,9 @@ namespace {
 
 namespace fs = std::filesystem;
 
-using ToolRun = CommandResult;
-
-ToolRun runTool(const char* tool, std::vector<std::string> arguments) {
-    arguments.insert(arguments.begin(), tool);
+CommandResult runCatalogTool(std::vector<std::string> arguments) {
+    arguments.insert(arguments.begin(), TAVRIX_CATALOG_TOOL);
     return runCommand(arguments, true);
-}
-
-ToolRun runCatalogTool(const std::vector<std::string>& arguments) {
-    return runTool(TAVRIX_CATALOG_TOOL, arguments);
 }
 
 class CatalogToolTest : public testing::Test {
@@ -36,7 +30,7 @@ class CatalogToolTest : public testing::Test {
 
     int publish(std::vector<std::string> arguments) {
         arguments.insert(arguments.begin(), {"publish", work / "out"});
-        ToolRun run = runCatalogTool(arguments);
+        CommandResult run = runCatalogTool(arguments);
         EXPECT_EQ(run.errors.empty(), run.status == 0) << run.errors;
         return run.status;
     }
@@ -53,7 +47,7 @@ class CatalogToolTest : public testing::Test {
     }
 
     // The tool's own check, as a device would make it.
-    ToolRun verify(std::vector<std::string> arguments = {}) {
+    CommandResult verify(std::vector<std::string> arguments = {}) {
         arguments.insert(arguments.begin(), {"verify", work / "out", "--key", work / "public.key"});
         return runCatalogTool(arguments);
     }
@@ -125,11 +119,11 @@ TEST_F(CatalogToolTest, VerifyTellsGoodWarningAndBadApart) {
     ASSERT_EQ(
         publish({"--key", work / "secret.key", "--expires-in", "10", work / "b/Default.bundle"}),
         0);
-    ToolRun good = verify({"--json"});
+    CommandResult good = verify({"--json"});
     EXPECT_EQ(good.status, 0) << good.errors;
     EXPECT_EQ(good.errors, "");
     EXPECT_NE(good.output.find("\"verdict\": \"good\""), std::string::npos) << good.output;
-    ToolRun soon = verify({"--warn-days", "11"});
+    CommandResult soon = verify({"--warn-days", "11"});
     EXPECT_EQ(soon.status, 3);
     EXPECT_TRUE(soon.errors.starts_with("tavrix-catalog: warning: expires within 11 days"))
         << soon.errors;
@@ -138,7 +132,7 @@ TEST_F(CatalogToolTest, VerifyTellsGoodWarningAndBadApart) {
     std::string tampered = readText(work / ("out/" + archiveOf("2.0")));
     tampered[tampered.size() / 2] ^= 0x20;
     writeText(work / ("out/" + archiveOf("2.0")), tampered);
-    ToolRun bad = verify({"--json"});
+    CommandResult bad = verify({"--json"});
     EXPECT_EQ(bad.status, 1);
     EXPECT_NE(bad.errors.find("tavrix-catalog: problem: archives/Default-2.0-"), std::string::npos)
         << bad.errors;
@@ -155,7 +149,7 @@ TEST_F(CatalogToolTest, StagedCatalogsGoLiveOnlyWithAVerifiedSignature) {
     EXPECT_EQ(readText(work / "out/catalog.plist"), served);
     EXPECT_EQ(
         runCatalogTool({"withdraw", work / "out", "1.0", "--key", work / "secret.key"}).status, 1);
-    ToolRun shown = runCatalogTool({"show", work / "out"});
+    CommandResult shown = runCatalogTool({"show", work / "out"});
     EXPECT_NE(shown.output.find("version 1.0: rollout 5 %"), std::string::npos) << shown.output;
     EXPECT_NE(shown.output.find("waiting for its signature"), std::string::npos) << shown.output;
 
@@ -165,7 +159,7 @@ TEST_F(CatalogToolTest, StagedCatalogsGoLiveOnlyWithAVerifiedSignature) {
     for (const std::string& signer : {std::string("head -c 64 /dev/zero"), otherSigner,
                                       std::string("cat >/dev/null; exit 4")}) {
         SCOPED_TRACE(signer);
-        ToolRun run = runCatalogTool(
+        CommandResult run = runCatalogTool(
             {"sign", work / "out", "--signer", signer, "--public-key", work / "public.key"});
         EXPECT_EQ(run.status, 1);
         EXPECT_EQ(readText(work / "out/catalog.plist"), served);
@@ -214,7 +208,7 @@ TEST_F(CatalogToolTest, OptionsParseAlikeAndMistakesChangeNothing) {
     };
     for (const auto& [name, arguments, status] : cases) {
         SCOPED_TRACE(name);
-        ToolRun run = runCatalogTool(arguments);
+        CommandResult run = runCatalogTool(arguments);
         EXPECT_EQ(run.status, status);
         EXPECT_EQ(std::count(run.errors.begin(), run.errors.end(), '\n'), status == 2 ? 2 : 1)
             << run.errors;
@@ -260,12 +254,12 @@ TEST_F(CatalogToolTest, PackAndPublishRefuseADirectoryThatIsNoBundle) {
         writeBundle(bundle, "3.0", {}, {{"a.plist", "a"}});
         c.spoil(bundle);
         const std::string payload = work / "payload.tgz";
-        ToolRun pack = runTool(TAVRIX_CTL_TOOL, {"pack", bundle, "-o", payload});
+        CommandResult pack = runCommand({TAVRIX_CTL_TOOL, "pack", bundle, "-o", payload}, true);
         EXPECT_EQ(pack.status, 1);
         EXPECT_NE(pack.errors.find(c.named), std::string::npos) << pack.errors;
         EXPECT_EQ(std::count(pack.errors.begin(), pack.errors.end(), '\n'), 1) << pack.errors;
         EXPECT_FALSE(fs::exists(payload));
-        ToolRun published = runCatalogTool({"publish", work / "out", "--unsigned", bundle});
+        CommandResult published = runCatalogTool({"publish", work / "out", "--unsigned", bundle});
         EXPECT_EQ(published.status, 1);
         EXPECT_NE(published.errors.find(c.named), std::string::npos) << published.errors;
         EXPECT_FALSE(fs::exists(work / "out/catalog.plist"));

@@ -60,10 +60,6 @@ class OverrideGenerationTest : public testing::Test {
         test::writeDeviceTable(table);
     }
 
-    static void writeBundle(const Dictionary& carrier) {
-        test::writeBundle(bundle(), "1.0", carrier);
-    }
-
     // The device decision leaves the base bundle in the record, as the reset flow would have it.
     CarrierBundle baseBundle() {
         CarrierBundle record;
@@ -82,13 +78,13 @@ TEST_F(OverrideGenerationTest, WithoutAMatchTheRecordKeepsTheBaseFile) {
     EXPECT_EQ(makeDeviceOverlayDecision(record, std::nullopt), kCarrierInfoNotPresent);
     EXPECT_TRUE(record.bundlePath.empty());
     // A base carrier file that holds no dictionary.
-    writeBundle({});
+    test::writeBundle(bundle(), "1.0");
     ASSERT_TRUE(plist::writeFile(baseFile(), Value(Array{"ABC"})));
     record = baseBundle();
     EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kCarrierInfoNotPresent);
     EXPECT_EQ(record.carrierFilePath, baseFile());
 
-    writeBundle(baseCarrier());
+    test::writeBundle(bundle(), "1.0", baseCarrier());
     record.carrierFilePath = "/stale";
     EXPECT_EQ(makeDeviceOverlayDecision(record, std::nullopt), kNoMatchForOverlay);
     EXPECT_EQ(record.bundlePath, bundle());
@@ -98,7 +94,7 @@ TEST_F(OverrideGenerationTest, WithoutAMatchTheRecordKeepsTheBaseFile) {
     EXPECT_EQ(applyMultimodeOverlay(record, std::string("")), kOverrideNotRequired);
     EXPECT_EQ(applyMultimodeOverlay(record, std::nullopt), kOverrideNotRequired);
 
-    writeBundle(Dictionary{{"Name", "Base"}});
+    test::writeBundle(bundle(), "1.0", Dictionary{{"Name", "Base"}});
     EXPECT_EQ(applyMultimodeOverlay(record, std::string("abc")), kOverrideNotRequired);
     EXPECT_EQ(record.carrierFilePath, baseFile());
     EXPECT_EQ(record.overlayType, kNoOverlay);
@@ -109,7 +105,7 @@ TEST_F(OverrideGenerationTest, WithoutAMatchTheRecordKeepsTheBaseFile) {
 // overlay built on it shows on the real daemon.)
 TEST_F(OverrideGenerationTest, DeviceOverlayIsFoundByTheModelAsAWholeField) {
     writeDevice("T12AP");
-    writeBundle(baseCarrier());
+    test::writeBundle(bundle(), "1.0", baseCarrier());
     ASSERT_TRUE(plist::writeFile(bundle() + "/overrides_T12.plist", Value(Dictionary{})));
     ASSERT_TRUE(plist::writeFile(bundle() + "/overrides_T12AP.txt", Value(Dictionary{})));
     ASSERT_TRUE(plist::writeFile(bundle() + "/overrides_X1_T12AP.plist",
@@ -127,7 +123,7 @@ TEST_F(OverrideGenerationTest, DeviceOverlayIsFoundByTheModelAsAWholeField) {
 // The hardware model is read once per process: an unknown one needs a test of its own.
 TEST_F(OverrideGenerationTest, AnUnknownModelNeedsNoOverride) {
     writeDevice(std::nullopt);
-    writeBundle(baseCarrier());
+    test::writeBundle(bundle(), "1.0", baseCarrier());
     CarrierBundle record;
     EXPECT_EQ(makeDeviceOverlayDecision(record, std::nullopt), kOverrideNotRequired);
     EXPECT_EQ(record.carrierFilePath, baseFile());
@@ -147,7 +143,7 @@ TEST_F(OverrideGenerationTest, EveryBehaviorIDGetsItsOwnFileInsideTheOverlayDire
         Dictionary{{"g", Dictionary{{"SupportedBehaviorIDs",
                                      Array{"abc", escaping, lookalike, withFields, tooLong}},
                                     {"OverrideConfiguration", Dictionary{{"Name", "X"}}}}}});
-    writeBundle(carrier);
+    test::writeBundle(bundle(), "1.0", carrier);
 
     std::set<std::string> files;
     for (const std::string& id : {escaping, lookalike, withFields}) {
@@ -205,19 +201,6 @@ Value group(Array ids, Dictionary configuration) {
                       {"OverrideConfiguration", std::move(configuration)}};
 }
 
-// The map with each shared configuration resolved, for comparison.
-std::optional<Dictionary> resolvedOverrides(const Value& base) {
-    std::optional<BehaviorOverrideMap> map = copyBehaviorOverrides(base);
-    if (!map) {
-        return std::nullopt;
-    }
-    Dictionary resolved;
-    for (const auto& [id, configuration] : *map) {
-        resolved.emplace(id, *configuration);
-    }
-    return resolved;
-}
-
 Value baseWith(Dictionary overrides) {
     return Dictionary{{"CarrierName", "Base"}, {"BehaviorOverrides", std::move(overrides)}};
 }
@@ -245,14 +228,19 @@ TEST_F(OverlayConfigurationTest, MapsEveryListedIDLowercasedToItsGroupsConfigura
         {"m4", Dictionary{{"SupportedBehaviorIDs", Array{"abc"}}}},
         {"m5", Dictionary{{"SupportedBehaviorIDs", Array{"abc"}}, {"OverrideConfiguration", 1}}},
     });
-    std::optional<Dictionary> map = resolvedOverrides(base);
+    std::optional<BehaviorOverrideMap> map = copyBehaviorOverrides(base);
     ASSERT_TRUE(map);
+    // Each shared configuration resolved, for comparison.
+    Dictionary resolved;
+    for (const auto& [id, configuration] : *map) {
+        resolved.emplace(id, *configuration);
+    }
     // Letters outside ASCII are lowered like the stored ID; non-string IDs are rendered as text.
-    EXPECT_EQ(*map, (Dictionary{{"abc", first},
-                                {"mixed-\xC3\xA9t\xC3\xA9", first},
-                                {"shared", second},
-                                {"42", second},
-                                {"true", second}}));
+    EXPECT_EQ(resolved, (Dictionary{{"abc", first},
+                                    {"mixed-\xC3\xA9t\xC3\xA9", first},
+                                    {"shared", second},
+                                    {"42", second},
+                                    {"true", second}}));
     EXPECT_EQ(sink.messages().size(), 5u) << "one line for each malformed group only";
 }
 

@@ -4,7 +4,6 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <cerrno>
 #include <filesystem>
 #include <string>
 
@@ -12,11 +11,9 @@
 #include "TestDoubles.h"
 #include "TestSupport.h"
 #include "UnitTestRoot.h"
-#include "bundle/BundleLocations.h"
 #include "bundle/BundleManager.h"
 #include "bus/HandedPayload.h"
 #include "io/UniqueFd.h"
-#include "payload/Archive.h"
 #include "payload/PayloadUnpack.h"
 
 namespace tavrix::payload {
@@ -38,10 +35,6 @@ struct stat statOf(const std::string& path) {
     struct stat info {};
     EXPECT_EQ(::lstat(path.c_str(), &info), 0) << path;
     return info;
-}
-
-std::string currentDirectory() {
-    return fs::current_path().string();
 }
 
 class PayloadExtraction : public testing::Test {
@@ -72,7 +65,7 @@ class PayloadFormats : public PayloadExtraction, public testing::WithParamInterf
 // point, outside the destination too.
 TEST_P(PayloadFormats, ExtractLayoutBytesModesAndTimes) {
     const std::string binary = randomBytes(70000, 7);
-    const std::string before = currentDirectory();
+    const fs::path before = fs::current_path();
     const std::string absolute = dir / "absolute/placed.txt";
     ASSERT_TRUE(extract(buildArchive(GetParam().container, GetParam().compression,
                                      {
@@ -103,7 +96,7 @@ TEST_P(PayloadFormats, ExtractLayoutBytesModesAndTimes) {
     // Directory times are restored after their contents were written.
     EXPECT_EQ(statOf(dir / "dest/sub").st_mode & 07777, 0750u);
     EXPECT_EQ(statOf(dir / "dest/sub").st_mtime, 1400000000);
-    EXPECT_EQ(currentDirectory(), before);
+    EXPECT_EQ(fs::current_path(), before);
 }
 
 INSTANTIATE_TEST_SUITE_P(
@@ -118,7 +111,7 @@ INSTANTIATE_TEST_SUITE_P(
 // keeps the entries before it (false); an entry that cannot be created is skipped (true). The
 // working directory stays where it was.
 TEST_F(PayloadExtraction, DamagedPayloadsKeepWhatCameBeforeTheDamage) {
-    const std::string before = currentDirectory();
+    const fs::path before = fs::current_path();
     std::string truncated = buildArchive(
         Container::Tar, Compression::Gzip,
         {test::fileItem("first.txt", "first"), test::fileItem("large.bin", randomBytes(300000, 3)),
@@ -148,7 +141,7 @@ TEST_F(PayloadExtraction, DamagedPayloadsKeepWhatCameBeforeTheDamage) {
         EXPECT_EQ(tree, kept);
     }
     EXPECT_FALSE(extractArchive(dir / "missing.tgz", destination));
-    EXPECT_EQ(currentDirectory(), before);
+    EXPECT_EQ(fs::current_path(), before);
 }
 
 // Network archives hold only files, directories and links that stay inside. The first entry that
@@ -326,10 +319,6 @@ TEST(StagePayload, WritesItsOwnFileAndRefusesAnUnsafeDirectory) {
     EXPECT_FALSE(fs::exists(path));
 }
 
-std::string text(const std::vector<std::uint8_t>& bytes) {
-    return {bytes.begin(), bytes.end()};
-}
-
 // A regular file is read whole whatever the client's offset, and leaves that offset alone; the
 // bound holds for files and pipes alike, to the byte; a descriptor open only for writing is
 // refused rather than failing half-way.
@@ -343,7 +332,7 @@ TEST(HandedPayload, FilesAreReadWholeAndEveryDescriptorWithinTheBound) {
 
     auto whole = bus::readHandedPayload(file.get(), 10);
     ASSERT_TRUE(whole) << whole.reason();
-    EXPECT_EQ(text(*whole), "0123456789");
+    EXPECT_EQ(std::string(whole->begin(), whole->end()), "0123456789");
     EXPECT_EQ(::lseek(file.get(), 0, SEEK_CUR), 4);
     EXPECT_EQ(bus::readHandedPayload(file.get(), 9).reason(), "the bundle is larger than 9 bytes");
 

@@ -1,11 +1,9 @@
-#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <atomic>
-#include <cstdint>
 #include <filesystem>
 #include <functional>
 #include <thread>

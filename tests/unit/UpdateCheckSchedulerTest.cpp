@@ -5,7 +5,6 @@
 #include <cmath>
 #include <optional>
 #include <string>
-#include <vector>
 
 #include "TestDoubles.h"
 #include "TestSupport.h"
@@ -48,18 +47,12 @@ class UpdateCheckSchedulerTest : public testing::Test {
         auto next = nextUpdate();
         ASSERT_TRUE(next);
         EXPECT_LT(std::fabs(*next - (Clock::absoluteTimeNow() + 1296000.0)), 60.0);
-        plist::Dictionary jobs = registeredJobs();
-        ASSERT_EQ(jobs.size(), 1u);
-        EXPECT_EQ(jobs.begin()->first, "Behavior Bundle Update Check");
-        const plist::Value& job = jobs.begin()->second;
-        auto criterion = [&](std::string_view key) {
-            const plist::Value* value = job.find(key);
-            return value != nullptr ? std::optional<plist::Value>(*value) : std::nullopt;
-        };
-        EXPECT_EQ(criterion(bus::kJobWindowStartDate), plist::Value(*next));
-        EXPECT_EQ(criterion(bus::kJobWindowEndDate), plist::Value(*next + 3600.0));
-        EXPECT_EQ(criterion(bus::kJobPowerOptimizationLevel), plist::Value(plist::Integer(1)));
-        EXPECT_EQ(criterion(bus::kJobAllowedDuringVoiceCall), plist::Value(true));
+        const plist::Dictionary job{
+            {std::string(bus::kJobWindowStartDate), *next},
+            {std::string(bus::kJobWindowEndDate), *next + 3600.0},
+            {std::string(bus::kJobPowerOptimizationLevel), plist::Integer(1)},
+            {std::string(bus::kJobAllowedDuringVoiceCall), true}};
+        EXPECT_EQ(registeredJobs(), (plist::Dictionary{{"Behavior Bundle Update Check", job}}));
     }
 };
 
