@@ -50,8 +50,9 @@ inline ArchiveItem fifoItem(std::string path) {
 }
 
 // The archive holding items, in order, as a file's bytes.
-inline std::string buildArchive(Container container, Compression compression,
-                                const std::vector<ArchiveItem>& items) {
+inline std::string buildArchive(const std::vector<ArchiveItem>& items,
+                                Container container = Container::Tar,
+                                Compression compression = Compression::Gzip) {
     payload::ArchiveWriter writer(archive_write_new());
     archive* handle = writer.get();
     if (container == Container::Tar) {

@@ -506,8 +506,7 @@ TEST_F(AssetCatalogTest, FailedDownloadsReportFailureAndLeaveNothingBehind) {
     }
     const std::vector<test::ArchiveItem> plain{test::fileItem("a", test::randomBytes(8192, 7))};
     const std::string archive =
-        test::buildArchive(test::Container::Tar, test::Compression::Gzip,
-                           {test::fileItem("Info.plist", "<plist/>"), plain.front()});
+        test::buildArchive({test::fileItem("Info.plist", "<plist/>"), plain.front()});
     std::string flipped = archive;
     flipped[flipped.size() / 2] ^= 0x55;
     struct Case {
@@ -555,7 +554,7 @@ TEST_F(AssetCatalogTest, FailedDownloadsReportFailureAndLeaveNothingBehind) {
         writeSettings(std::nullopt, c.settings);
         std::vector<test::ArchiveItem> items{test::fileItem("Info.plist", "<plist/>")};
         items.insert(items.end(), c.items.begin(), c.items.end());
-        publishArchive(test::buildArchive(test::Container::Tar, test::Compression::Gzip, items));
+        publishArchive(test::buildArchive(items));
         if (c.response) {
             server.serve("/catalog/archive.tgz", *c.response);
         }

@@ -28,36 +28,28 @@ using plist::Dictionary;
 using plist::Value;
 using Line = std::pair<int, std::string>;
 
-// A device in the test's own root with one system bundle (version 1.0) whose base carrier file
-// lists behavior overrides for "ABC".
+// A device in the test's own root (model T12AP) with one system bundle (version 1.0) whose base
+// carrier file lists behavior overrides for "ABC".
 class OverrideGenerationTest : public testing::Test {
   protected:
+    void SetUp() override {
+        test::writeDeviceTable({{"DeviceClass", "Phone"}, {"HWModelStr", "T12AP"}});
+    }
     static std::string home() { return test::unitTestRoot().string() + "/var/mobile"; }
     static std::string bundle() {
         return device::resolvePath("/System/Library/TavrixBundles/Phone/Default.bundle");
     }
     static std::string baseFile() { return bundle() + "/behavior.plist"; }
 
-    static Dictionary behaviorSection() {
-        return Dictionary{{"abc-group", Dictionary{{"SupportedBehaviorIDs", Array{"ABC"}},
-                                                   {"OverrideConfiguration",
-                                                    Dictionary{{"Name", "Abc"},
-                                                               {"_Exclude", Array{"Dropped"}}}}}}};
-    }
-
     static Dictionary baseCarrier() {
-        return Dictionary{{"Name", "Base"},
-                          {"Dropped", true},
-                          {"Model", "generic"},
-                          {"BehaviorOverrides", behaviorSection()}};
-    }
-
-    static void writeDevice(const std::optional<std::string>& model) {
-        Dictionary table{{"DeviceClass", "Phone"}};
-        if (model) {
-            table.emplace("HWModelStr", *model);
-        }
-        test::writeDeviceTable(table);
+        const Dictionary abc{{"Name", "Abc"}, {"_Exclude", Array{"Dropped"}}};
+        return Dictionary{
+            {"Name", "Base"},
+            {"Dropped", true},
+            {"Model", "generic"},
+            {"BehaviorOverrides",
+             Dictionary{{"abc-group", Dictionary{{"SupportedBehaviorIDs", Array{"ABC"}},
+                                                 {"OverrideConfiguration", abc}}}}}};
     }
 
     // The device decision leaves the base bundle in the record, as the reset flow would have it.
@@ -72,7 +64,6 @@ class OverrideGenerationTest : public testing::Test {
 // without a listed ID, so does the behavior overlay. Without a readable base there is no carrier
 // info.
 TEST_F(OverrideGenerationTest, WithoutAMatchTheRecordKeepsTheBaseFile) {
-    writeDevice("T12AP");
     // No bundle at all: the empty carrier path cannot be loaded.
     CarrierBundle record;
     EXPECT_EQ(makeDeviceOverlayDecision(record, std::nullopt), kCarrierInfoNotPresent);
@@ -104,7 +95,6 @@ TEST_F(OverrideGenerationTest, WithoutAMatchTheRecordKeepsTheBaseFile) {
 // The device overlay file is found by the model as a whole '_' field of its name. (The behavior
 // overlay built on it shows on the real daemon.)
 TEST_F(OverrideGenerationTest, DeviceOverlayIsFoundByTheModelAsAWholeField) {
-    writeDevice("T12AP");
     test::writeBundle(bundle(), "1.0", baseCarrier());
     ASSERT_TRUE(plist::writeFile(bundle() + "/overrides_T12.plist", Value(Dictionary{})));
     ASSERT_TRUE(plist::writeFile(bundle() + "/overrides_T12AP.txt", Value(Dictionary{})));
@@ -122,7 +112,7 @@ TEST_F(OverrideGenerationTest, DeviceOverlayIsFoundByTheModelAsAWholeField) {
 
 // The hardware model is read once per process: an unknown one needs a test of its own.
 TEST_F(OverrideGenerationTest, AnUnknownModelNeedsNoOverride) {
-    writeDevice(std::nullopt);
+    test::writeDeviceTable({{"DeviceClass", "Phone"}});
     test::writeBundle(bundle(), "1.0", baseCarrier());
     CarrierBundle record;
     EXPECT_EQ(makeDeviceOverlayDecision(record, std::nullopt), kOverrideNotRequired);
@@ -132,7 +122,6 @@ TEST_F(OverrideGenerationTest, AnUnknownModelNeedsNoOverride) {
 // Behavior IDs are chosen by others: whatever they hold, each gets a file of its own inside the
 // overlay directory, and one that no file name can hold leaves the record alone.
 TEST_F(OverrideGenerationTest, EveryBehaviorIDGetsItsOwnFileInsideTheOverlayDirectory) {
-    writeDevice("T12AP");
     const std::string escaping = "x/../../../escape";
     const std::string lookalike = "x%2f..%2f..%2f..%2fescape";
     const std::string withFields = "a+b\n<0>";

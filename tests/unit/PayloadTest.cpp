@@ -67,17 +67,14 @@ TEST_P(PayloadFormats, ExtractLayoutBytesModesAndTimes) {
     const std::string binary = randomBytes(70000, 7);
     const fs::path before = fs::current_path();
     const std::string absolute = dir / "absolute/placed.txt";
-    ASSERT_TRUE(extract(buildArchive(GetParam().container, GetParam().compression,
-                                     {
-                                         test::directoryItem("sub", 0750, 1400000000),
-                                         test::fileItem("sub/data.bin", binary, 0600, 1300000000),
-                                         test::fileItem("Info.plist", "<plist/>", 0644),
-                                         test::fileItem("run.sh", "#!/bin/sh\n", 0755),
-                                         test::fileItem("deep/er/empty", "", 0640),
-                                         test::symlinkItem("link", "Info.plist"),
-                                         test::fileItem("../beside.txt", "beside"),
-                                         test::fileItem(absolute, "absolute"),
-                                     })));
+    ASSERT_TRUE(extract(buildArchive(
+        {test::directoryItem("sub", 0750, 1400000000),
+         test::fileItem("sub/data.bin", binary, 0600, 1300000000),
+         test::fileItem("Info.plist", "<plist/>", 0644),
+         test::fileItem("run.sh", "#!/bin/sh\n", 0755), test::fileItem("deep/er/empty", "", 0640),
+         test::symlinkItem("link", "Info.plist"), test::fileItem("../beside.txt", "beside"),
+         test::fileItem(absolute, "absolute")},
+        GetParam().container, GetParam().compression)));
 
     EXPECT_EQ(snapshotTree(destination), (Tree{{"sub", "/"},
                                                {"sub/data.bin", binary},
@@ -112,10 +109,9 @@ INSTANTIATE_TEST_SUITE_P(
 // working directory stays where it was.
 TEST_F(PayloadExtraction, DamagedPayloadsKeepWhatCameBeforeTheDamage) {
     const fs::path before = fs::current_path();
-    std::string truncated = buildArchive(
-        Container::Tar, Compression::Gzip,
-        {test::fileItem("first.txt", "first"), test::fileItem("large.bin", randomBytes(300000, 3)),
-         test::fileItem("last.txt", "last")});
+    std::string truncated = buildArchive({test::fileItem("first.txt", "first"),
+                                          test::fileItem("large.bin", randomBytes(300000, 3)),
+                                          test::fileItem("last.txt", "last")});
     truncated.resize(truncated.size() / 2);
     const std::vector<std::tuple<const char*, std::string, bool, Tree>> cases{
         {"empty", "", false, {}},
@@ -123,8 +119,7 @@ TEST_F(PayloadExtraction, DamagedPayloadsKeepWhatCameBeforeTheDamage) {
         {"gzip header alone", "\x1f\x8b\x08", false, {}},
         {"truncated", truncated, false, {{"first.txt", "first"}}},
         {"entry that cannot be created",
-         buildArchive(Container::Tar, Compression::Gzip,
-                      {test::fileItem("before.txt", "before"),
+         buildArchive({test::fileItem("before.txt", "before"),
                        test::hardlinkItem("orphan", "no-such-target"),
                        test::hardlinkItem("linked.txt", "before.txt"),
                        test::fileItem("after.txt", "after")}),
@@ -170,8 +165,7 @@ TEST_F(PayloadExtraction, PathSafeStopsAtTheFirstEntryThatCouldLeave) {
         items.insert(items.end(), hostile.begin(), hostile.end());
         items.push_back(test::fileItem("last.txt", "last"));
 
-        EXPECT_FALSE(extract(buildArchive(Container::Tar, Compression::Gzip, items),
-                             ExtractionSafety::PathSafe));
+        EXPECT_FALSE(extract(buildArchive(items), ExtractionSafety::PathSafe));
         EXPECT_EQ(snapshotTree(outside), (Tree{{"secret", "secret"}}));
         EXPECT_EQ(snapshotTree(dir.path()).count("up.txt"), 0u);
         EXPECT_EQ(readText(dir / "dest/first.txt"), "first");
@@ -183,10 +177,10 @@ TEST_F(PayloadExtraction, PathSafeStopsAtTheFirstEntryThatCouldLeave) {
     fs::create_directory_symlink(dir / "real", dir / "via");
     destination = dir / "via/bundle";
     EXPECT_TRUE(extract(
-        buildArchive(Container::Cpio, Compression::Gzip,
-                     {test::fileItem("data.txt", "data"), test::directoryItem("a/b"),
+        buildArchive({test::fileItem("data.txt", "data"), test::directoryItem("a/b"),
                       test::symlinkItem("a/b/up", "../../data.txt"),
-                      test::symlinkItem("a/here", "./b/."), test::symlinkItem("top", "a/here/up")}),
+                      test::symlinkItem("a/here", "./b/."), test::symlinkItem("top", "a/here/up")},
+                     Container::Cpio),
         ExtractionSafety::PathSafe));
     EXPECT_EQ(readText(dir / "real/bundle/top"), "data");
 }
@@ -225,7 +219,7 @@ TEST_F(PayloadExtraction, LimitsCutBombsShortWithOneLine) {
             SCOPED_TRACE(name);
             fs::remove_all(destination);
             log.clear();
-            writeText(dir / "payload", buildArchive(Container::Tar, Compression::Gzip, items));
+            writeText(dir / "payload", buildArchive(items));
             EXPECT_FALSE(extractArchive(dir / "payload", destination, safety, limits));
             std::uintmax_t written = 0;
             std::size_t entries = 0;
@@ -258,8 +252,7 @@ class BundleInstall : public testing::Test {
 // Each payload replaces the user bundle completely and the staged file is gone afterwards.
 TEST_F(BundleInstall, EachPayloadReplacesTheUserBundle) {
     // A client's payload may hold a FIFO: it is created, and neither opened nor refused.
-    install(buildArchive(Container::Tar, Compression::Gzip,
-                         {test::fileItem("Info.plist", "two"), test::fifoItem("pipe")}));
+    install(buildArchive({test::fileItem("Info.plist", "two"), test::fifoItem("pipe")}));
     EXPECT_EQ(readText(bundle / "Info.plist"), "two");
     EXPECT_TRUE(fs::is_fifo(bundle / "pipe"));
 
@@ -275,15 +268,13 @@ TEST_F(BundleInstall, EachPayloadReplacesTheUserBundle) {
 // or mixed into the next payload.
 TEST_F(BundleInstall, TheOldBundleNeverStaysInPart) {
     const fs::path staging = bundle.parent_path() / ".Default.bundle.incoming";
-    install(buildArchive(Container::Tar, Compression::Gzip,
-                         {test::fileItem("Info.plist", "one"), test::fileItem("a/old", "old"),
+    install(buildArchive({test::fileItem("Info.plist", "one"), test::fileItem("a/old", "old"),
                           test::directoryItem("busy")}));
     test::TmpfsMount busy(bundle / "busy", "size=64k");
     if (!busy.mounted) {
         GTEST_SKIP() << "mounting needs root";
     }
-    const std::string second =
-        buildArchive(Container::Tar, Compression::Gzip, {test::fileItem("Info.plist", "two")});
+    const std::string second = buildArchive({test::fileItem("Info.plist", "two")});
     install(second);
     EXPECT_EQ(snapshotTree(bundle), (Tree{{"Info.plist", "two"}}));
 
@@ -291,7 +282,7 @@ TEST_F(BundleInstall, TheOldBundleNeverStaysInPart) {
     install(second);
     EXPECT_EQ(snapshotTree(bundle), (Tree{{"Info.plist", "two"}}));
     ::umount2((staging / "busy").c_str(), MNT_DETACH);
-    install(buildArchive(Container::Tar, Compression::Gzip, {test::fileItem("Info.plist", "3")}));
+    install(buildArchive({test::fileItem("Info.plist", "3")}));
     EXPECT_EQ(snapshotTree(bundle), (Tree{{"Info.plist", "3"}}));
     EXPECT_FALSE(fs::exists(staging));
 }

@@ -113,11 +113,15 @@ TEST(TavrixClient, ConnectingWhereNothingListensNamesTheProblem) {
     EXPECT_NO_THROW(TavrixClient::connectToSystemBus());
 }
 
-TEST(TavrixClient, DecodesRepliesAndRefusesMalformedOnes) {
+// A client of the stub on a bus of its own.
+class ClientOfStub : public testing::Test {
+  protected:
     test::PrivateBus bus;
-    StubService stub(bus);
+    StubService stub{bus};
     TavrixClient client = TavrixClient::connectToAddress(bus.address());
+};
 
+TEST_F(ClientOfStub, DecodesRepliesAndRefusesMalformedOnes) {
     EXPECT_TRUE(client.setClientType(7));
     EXPECT_FALSE(client.setClientType(-7));
 
@@ -146,11 +150,7 @@ TEST(TavrixClient, DecodesRepliesAndRefusesMalformedOnes) {
 
 // The asynchronous forms give the same answers and errors, delivered from an application's own
 // poll loop over fd(), events() and timeout(); a call dropped before its reply never calls back.
-TEST(TavrixClient, AsyncCallsAnswerThroughTheApplicationsOwnLoop) {
-    test::PrivateBus bus;
-    StubService stub(bus);
-    TavrixClient client = TavrixClient::connectToAddress(bus.address());
-
+TEST_F(ClientOfStub, AsyncCallsAnswerThroughTheApplicationsOwnLoop) {
     std::optional<AsyncResult<bool>> known;
     std::optional<AsyncResult<bool>> refused;
     bool droppedRan = false;
@@ -177,10 +177,7 @@ TEST(TavrixClient, AsyncCallsAnswerThroughTheApplicationsOwnLoop) {
     EXPECT_FALSE(droppedRan);
 }
 
-TEST(TavrixClient, DeliversNotificationsWhileSubscribedAndHandlerExceptions) {
-    test::PrivateBus bus;
-    StubService stub(bus);
-    TavrixClient client = TavrixClient::connectToAddress(bus.address());
+TEST_F(ClientOfStub, DeliversNotificationsWhileSubscribedAndHandlerExceptions) {
     std::vector<std::string> names;
     auto subscription = client.subscribe([&](const std::string& name) { names.push_back(name); });
 
