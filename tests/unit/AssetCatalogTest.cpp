@@ -31,6 +31,8 @@ namespace tavrix::catalog {
 namespace {
 
 namespace fs = std::filesystem;
+using plist::Dictionary;
+using plist::Value;
 using test::LocalHttpServer;
 using test::readText;
 using test::writeText;
@@ -57,7 +59,7 @@ struct ProgressLog {
     // A handler that captures its asset, as an update client's does, so that a kept cycle shows.
     static Asset::ProgressHandler handler(std::shared_ptr<ProgressLog> log,
                                           std::shared_ptr<Asset> asset) {
-        return [log, asset](const plist::Dictionary& progress) {
+        return [log, asset](const Dictionary& progress) {
             std::lock_guard lock(log->mutex);
             log->operations.push_back(*progress.at(kAssetProgressOperationKey).asString());
             if (log->operations.back() == kAssetOperationDownloading) {
@@ -108,48 +110,45 @@ class AssetCatalogTest : public testing::Test {
 
     // The type trusts key in the single-key form, or without a key takes catalogs unsigned;
     // extra: top-level settings such as limits.
-    void writeSettings(const std::optional<std::string>& key, plist::Dictionary extra = {}) {
-        writeTypeSettings(key ? plist::Dictionary{{kSettingsPublicKeyKey, plist::Value(*key)}}
-                              : plist::Dictionary{{kSettingsAllowUnsignedKey, plist::Value(true)}},
+    void writeSettings(const std::optional<std::string>& key, Dictionary extra = {}) {
+        writeTypeSettings(key ? Dictionary{{kSettingsPublicKeyKey, Value(*key)}}
+                              : Dictionary{{kSettingsAllowUnsignedKey, Value(true)}},
                           std::move(extra));
     }
 
-    void writeTypeSettings(plist::Dictionary type, plist::Dictionary extra = {},
+    void writeTypeSettings(Dictionary type, Dictionary extra = {},
                            const char* typeName = kAssetType) {
-        type.emplace(kSettingsCatalogURLKey, plist::Value(server.url("/catalog/catalog.plist")));
-        extra.insert_or_assign(kSettingsAssetTypesKey,
-                               plist::Value(plist::Dictionary{{typeName, type}}));
+        type.emplace(kSettingsCatalogURLKey, Value(server.url("/catalog/catalog.plist")));
+        extra.insert_or_assign(kSettingsAssetTypesKey, Value(Dictionary{{typeName, type}}));
         std::string path = device::resolvePath(kAssetCatalogSettingsPath);
         fs::create_directories(fs::path(path).parent_path());
-        ASSERT_TRUE(plist::writeFile(path, plist::Value(std::move(extra))));
+        ASSERT_TRUE(plist::writeFile(path, Value(std::move(extra))));
     }
 
     // An unsigned catalog of serial 1 (none when serial is 0) valid for an hour, or until expires.
     static std::string catalogBytes(plist::Value assets, const char* type = kAssetType,
                                     int serial = 1, std::optional<plist::Date> expires = {}) {
-        plist::Dictionary catalog{
-            {"AssetType", plist::Value(type)},
-            {"Expires",
-             plist::Value(expires.value_or(plist::Date{Clock::absoluteTimeNow() + 3600}))},
+        Dictionary catalog{
+            {"AssetType", Value(type)},
+            {"Expires", Value(expires.value_or(plist::Date{Clock::absoluteTimeNow() + 3600}))},
             {"Assets", std::move(assets)}};
         if (serial != 0) {
-            catalog.emplace("Serial", plist::Value(serial));
+            catalog.emplace("Serial", Value(serial));
         }
-        return *plist::serialize(plist::Value(std::move(catalog)));
+        return *plist::serialize(Value(std::move(catalog)));
     }
 
     // Serves bytes as the catalog's only archive, listed unsigned with their size and digest.
     void publishArchive(const std::string& bytes) {
         Sha256Digest digest;
         digest.update(bytes);
-        plist::Dictionary entry{
-            {"ArchiveURL", plist::Value("archive.tgz")},
-            {"ArchiveSize", plist::Value(static_cast<long long>(bytes.size()))},
-            {"ArchiveSHA256", plist::Value(digest.finishHex())},
-            {"Attributes", plist::Value(plist::Dictionary{{"Version", plist::Value("1.0")}})}};
+        Dictionary entry{{"ArchiveURL", Value("archive.tgz")},
+                         {"ArchiveSize", Value(static_cast<long long>(bytes.size()))},
+                         {"ArchiveSHA256", Value(digest.finishHex())},
+                         {"Attributes", Value(Dictionary{{"Version", Value("1.0")}})}};
         server.serve("/catalog/archive.tgz", {.body = bytes});
         server.serve("/catalog/catalog.plist",
-                     {.body = catalogBytes(plist::Value(plist::Array{plist::Value(entry)}))});
+                     {.body = catalogBytes(Value(plist::Array{Value(entry)}))});
     }
 
     std::string out(const std::string& relative) const { return work / ("out/" + relative); }
@@ -179,23 +178,17 @@ class AssetCatalogTest : public testing::Test {
     }
 
     std::size_t logLinesContaining(std::string_view text) const {
-        auto lines = sink.messages();
-        return std::count_if(lines.begin(), lines.end(), [&](const std::string& line) {
+        return std::ranges::count_if(sink.messages(), [&](const std::string& line) {
             return line.find(text) != std::string::npos;
         });
     }
 
-    // What the cache holds for the type besides the kept catalog.
-    std::vector<std::string> cachedAssetEntries() const {
-        std::vector<std::string> names;
+    // How many entries the cache holds for the type besides the kept catalog.
+    std::size_t cachedAssetEntries() const {
         std::error_code ignored;
-        for (const auto& entry : fs::directory_iterator(typeCache(), ignored)) {
-            std::string name = entry.path().filename().string();
-            if (!name.starts_with("catalog.plist")) {
-                names.push_back(name);
-            }
-        }
-        return names;
+        return std::ranges::count_if(fs::directory_iterator(typeCache(), ignored), [](auto& entry) {
+            return !entry.path().filename().string().starts_with("catalog.plist");
+        });
     }
 
     test::TempDir work;
@@ -216,12 +209,12 @@ TEST_F(AssetCatalogTest, WithoutUsableSettingsQueriesAnswerNoAssetsAndSayWhyOnce
          "no settings for this asset type"},
         {"URL of the wrong type",
          [this] {
-             writeTypeSettings({{kSettingsCatalogURLKey, plist::Value(3)}});
+             writeTypeSettings({{kSettingsCatalogURLKey, Value(3)}});
          },
          "no CatalogURL"},
         {"negative limit",
          [this] {
-             writeSettings(std::nullopt, {{kSettingsMaxArchiveEntriesKey, plist::Value(-1)}});
+             writeSettings(std::nullopt, {{kSettingsMaxArchiveEntriesKey, Value(-1)}});
          },
          "MaxArchiveEntries is not an integer"},
         // A key that cannot be read must not quietly turn verification off.
@@ -230,8 +223,7 @@ TEST_F(AssetCatalogTest, WithoutUsableSettingsQueriesAnswerNoAssetsAndSayWhyOnce
          [this] {
              writeTypeSettings(
                  {{kSettingsTrustedKeysKey,
-                   plist::Value(plist::Dictionary{{"good", plist::Value(publicKey)},
-                                                  {"bad", plist::Value("c2hvcnQ=")}})}});
+                   Value(Dictionary{{"good", Value(publicKey)}, {"bad", Value("c2hvcnQ=")}})}});
          },
          "TrustedKeys entry \"bad\""},
     };
@@ -254,13 +246,13 @@ TEST_F(AssetCatalogTest, WithoutUsableSettingsQueriesAnswerNoAssetsAndSayWhyOnce
 // rotating on a device: the release train's test.)
 TEST_F(AssetCatalogTest, UntrustworthyCatalogsAreRefusedWithTheirReason) {
     std::string newKey = keygen("new.key", "new.pub");
-    auto trusting = [](plist::Dictionary keys) {
-        return plist::Dictionary{{kSettingsTrustedKeysKey, plist::Value(std::move(keys))}};
+    auto trusting = [](Dictionary keys) {
+        return Dictionary{{kSettingsTrustedKeysKey, Value(std::move(keys))}};
     };
     auto publishWith = [&](const char* version, const char* key, const char* id) {
         publish(version, {"--key", work / key, "--key-id", id, "--fresh"});
     };
-    writeTypeSettings(trusting({{"new", plist::Value(newKey)}}));
+    writeTypeSettings(trusting({{"new", Value(newKey)}}));
     publishWith("2.0", "new.key", "new");
     EXPECT_TRUE(query(true).value_or(Assets{nullptr}).empty()) << "nothing is kept before a fetch";
     ASSERT_EQ(query().value_or(Assets()).size(), 1u);
@@ -295,7 +287,7 @@ TEST_F(AssetCatalogTest, UntrustworthyCatalogsAreRefusedWithTheirReason) {
         // Only the URL's own scheme is followed.
         {"redirect to another scheme",
          [&] {
-             writeTypeSettings(trusting({{"new", plist::Value(newKey)}}));
+             writeTypeSettings(trusting({{"new", Value(newKey)}}));
              server.serve(
                  "/catalog/catalog.plist",
                  {.status = 302,
@@ -317,7 +309,7 @@ TEST_F(AssetCatalogTest, UntrustworthyCatalogsAreRefusedWithTheirReason) {
     std::optional<Assets> kept = query(true);
     ASSERT_TRUE(kept.has_value());
     ASSERT_EQ(kept->size(), 1u);
-    EXPECT_EQ(kept->front()->attributes(), (plist::Dictionary{{"Version", plist::Value("2.1")}}));
+    EXPECT_EQ(kept->front()->attributes(), (Dictionary{{"Version", Value("2.1")}}));
     EXPECT_EQ(server.requests().size(), requests) << "local queries do not ask the server";
 
     // A device whose view is frozen notices once the catalog expires, even the kept copy.
@@ -344,10 +336,9 @@ TEST_F(AssetCatalogTest, ASecondTryTakesANewPairWithinWhatIsLeftOfTheBudget) {
     std::optional<Assets> answered = assets.get();
     ASSERT_TRUE(answered.has_value());
     ASSERT_EQ(answered->size(), 2u);
-    EXPECT_EQ(answered->back()->attributes(),
-              (plist::Dictionary{{"Version", plist::Value("2.0")}}));
+    EXPECT_EQ(answered->back()->attributes(), (Dictionary{{"Version", Value("2.0")}}));
 
-    writeSettings(publicKey, {{kSettingsCatalogTimeoutKey, plist::Value(3)}});
+    writeSettings(publicKey, {{kSettingsCatalogTimeoutKey, Value(3)}});
     const std::string slow = readText(out("catalog.plist")) + "\n";
     // About two seconds.
     server.serve("/catalog/catalog.plist",
@@ -369,27 +360,27 @@ TEST_F(AssetCatalogTest, RolloutsFollowTheDevicesSerialNumber) {
 }
 
 TEST_F(AssetCatalogTest, DamagedCatalogsAreRefusedAndMalformedEntriesSkipped) {
-    writeSettings(std::nullopt, {{kSettingsCatalogTimeoutKey, plist::Value(1)}});
-    plist::Dictionary good{{"ArchiveURL", plist::Value("a.tgz")},
-                           {"ArchiveSize", plist::Value(10)},
-                           {"ArchiveSHA256", plist::Value(std::string(64, 'A'))},
-                           {"Attributes", plist::Value(plist::Dictionary{{"Version", "1"}})}};
+    writeSettings(std::nullopt, {{kSettingsCatalogTimeoutKey, Value(1)}});
+    Dictionary good{{"ArchiveURL", Value("a.tgz")},
+                    {"ArchiveSize", Value(10)},
+                    {"ArchiveSHA256", Value(std::string(64, 'A'))},
+                    {"Attributes", Value(Dictionary{{"Version", "1"}})}};
     auto with = [&](const char* key, plist::Value value) {
-        plist::Dictionary entry = good;
+        Dictionary entry = good;
         entry.insert_or_assign(key, std::move(value));
-        return plist::Value(entry);
+        return Value(entry);
     };
     plist::Array entries{
-        plist::Value(good),
-        plist::Value("not a dictionary"),
-        with("ArchiveSize", plist::Value("10")),
-        with("ArchiveSize", plist::Value(plist::Integer::fromUnsigned(UINT64_MAX))),
-        with("ArchiveSize", plist::Value(0)),
-        with("ArchiveSHA256", plist::Value("abc")),
-        with("ArchiveURL", plist::Value("file:///etc/passwd")),
-        with("ArchiveURL", plist::Value(plist::Data{1, 2})),
-        with("Attributes", plist::Value(plist::Array{})),
-        with("RolloutPercent", plist::Value(101)),
+        Value(good),
+        Value("not a dictionary"),
+        with("ArchiveSize", Value("10")),
+        with("ArchiveSize", Value(plist::Integer::fromUnsigned(UINT64_MAX))),
+        with("ArchiveSize", Value(0)),
+        with("ArchiveSHA256", Value("abc")),
+        with("ArchiveURL", Value("file:///etc/passwd")),
+        with("ArchiveURL", Value(plist::Data{1, 2})),
+        with("Attributes", Value(plist::Array{})),
+        with("RolloutPercent", Value(101)),
     };
     server.serve("/catalog/catalog.plist", {.body = catalogBytes(entries)});
     std::optional<Assets> assets = query();
@@ -401,7 +392,7 @@ TEST_F(AssetCatalogTest, DamagedCatalogsAreRefusedAndMalformedEntriesSkipped) {
     const std::vector<std::tuple<const char*, LocalHttpServer::Response, const char*>> refused{
         {"not a property list", {.body = "\x89PNG garbage"}, "not a property list"},
         {"another type", {.body = catalogBytes(entries, "other.type")}, "AssetType is not"},
-        {"assets of the wrong type", {.body = catalogBytes(plist::Value("x"))}, "no Assets array"},
+        {"assets of the wrong type", {.body = catalogBytes(Value("x"))}, "no Assets array"},
         {"over the size cap", {.body = std::string(9u << 20, ' ')}, "cannot fetch it"},
         {"no serial", {.body = catalogBytes(entries, kAssetType, 0)}, "no Serial"},
         {"server error", {.status = 500, .reason = "Oops"}, "HTTP status 500"},
@@ -473,7 +464,7 @@ TEST_F(AssetCatalogTest, DownloadReportsStepsInOrderInstallsIdenticalFilesAndPur
     EXPECT_EQ(readText(*local + "/b/deep/payload.bin"), payload);
     EXPECT_EQ(readText(*local + "/a.plist"), "<plist/>");
     EXPECT_EQ(readText(*local + "/Info.plist"), readText(work / "b/Default.bundle/Info.plist"));
-    EXPECT_EQ(cachedAssetEntries().size(), 1u) << "no staging files are left";
+    EXPECT_EQ(cachedAssetEntries(), 1u) << "no staging files are left";
 
     // A second download of the asset has its own directory: purging the first leaves it.
     std::shared_ptr<Asset> second = onlyAsset();
@@ -514,10 +505,10 @@ TEST_F(AssetCatalogTest, FailedDownloadsReportFailureAndLeaveNothingBehind) {
         std::vector<test::ArchiveItem> items;
         std::optional<LocalHttpServer::Response> response;
         const char* reason;
-        plist::Dictionary settings = {};
+        Dictionary settings = {};
     };
-    const plist::Dictionary small{{kSettingsMaxExpandedBytesKey, plist::Value(1 << 20)},
-                                  {kSettingsMaxArchiveEntriesKey, plist::Value(20)}};
+    const Dictionary small{{kSettingsMaxExpandedBytesKey, Value(1 << 20)},
+                           {kSettingsMaxArchiveEntriesKey, Value(20)}};
     const std::vector<Case> cases{
         {"altered archive", plain, {{.body = flipped}}, "SHA-256"},
         {"cut connection",
@@ -529,7 +520,7 @@ TEST_F(AssetCatalogTest, FailedDownloadsReportFailureAndLeaveNothingBehind) {
          plain,
          {{.body = archive, .trickleBytesPerSecond = 2}},
          "cannot download",
-         {{kSettingsLowSpeedSecondsKey, plist::Value(1)}}},
+         {{kSettingsLowSpeedSecondsKey, Value(1)}}},
         {"absolute symlink",
          {test::symlinkItem("escape", outside), test::fileItem("escape/planted", "p")},
          std::nullopt,
@@ -545,8 +536,7 @@ TEST_F(AssetCatalogTest, FailedDownloadsReportFailureAndLeaveNothingBehind) {
          plain,
          std::nullopt,
          "bytes free",
-         {{kSettingsFreeSpaceReserveKey,
-           plist::Value(plist::Integer::fromUnsigned(UINT64_MAX / 2))}}},
+         {{kSettingsFreeSpaceReserveKey, Value(plist::Integer::fromUnsigned(UINT64_MAX / 2))}}},
     };
     for (const Case& c : cases) {
         SCOPED_TRACE(c.name);
@@ -564,7 +554,7 @@ TEST_F(AssetCatalogTest, FailedDownloadsReportFailureAndLeaveNothingBehind) {
         EXPECT_EQ(download(asset).back(), kAssetOperationFailed);
         EXPECT_EQ(logLinesContaining(c.reason), 1u);
         EXPECT_FALSE(asset->localURL().has_value());
-        EXPECT_TRUE(cachedAssetEntries().empty());
+        EXPECT_EQ(cachedAssetEntries(), 0u);
         EXPECT_EQ(test::snapshotTree(outside), (test::Tree{{"secret", "secret"}}));
     }
 }
@@ -636,7 +626,7 @@ void listFirstTwiceBoundedFirst(plist::Value& catalog) {
     bounded.asDictionary()
         ->at("Attributes")
         .asDictionary()
-        ->insert_or_assign("MaximumOSVersion", plist::Value("9.9"));
+        ->insert_or_assign("MaximumOSVersion", Value("9.9"));
     assets.insert(assets.begin(), std::move(bounded));
 }
 
@@ -674,7 +664,7 @@ TEST_F(AssetSelectionTest, ChoosesTheHighestFittingVersionAboveTheInstalledOne) 
         if (c.chosen < 0 || best == nullptr) {
             EXPECT_EQ(best == nullptr, c.chosen < 0);
         } else {
-            EXPECT_EQ(plist::Value(best->attributes()),
+            EXPECT_EQ(Value(best->attributes()),
                       *catalog->find("Assets")->asArray()->at(c.chosen).find("Attributes"));
         }
     }
