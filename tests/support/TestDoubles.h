@@ -1,12 +1,8 @@
-// What the tests put behind the platform's seams: a log sink that keeps every line, a wall clock
-// shifted ahead so that a schedule days away can be reached without waiting, and an environment
-// variable set for one test (all unit tests share one process).
+// What the tests put behind the platform's seams: a log sink that keeps every line and a wall
+// clock shifted ahead, so that a schedule days away can be reached without waiting.
 #pragma once
 
-#include <stdlib.h>
-
 #include <mutex>
-#include <optional>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -54,23 +50,6 @@ class ScopedClockOffset : private ClockSource {
 
     Clock::Duration offset_;
     Clock::ScopedSource installed_;
-};
-
-class ScopedEnvironment {
-  public:
-    ScopedEnvironment(const char* name, const char* value) : name_(name) {
-        if (const char* old = ::getenv(name)) {
-            saved_ = old;
-        }
-        ::setenv(name, value, 1);
-    }
-    ~ScopedEnvironment() { saved_ ? ::setenv(name_, saved_->c_str(), 1) : ::unsetenv(name_); }
-    ScopedEnvironment(const ScopedEnvironment&) = delete;
-    ScopedEnvironment& operator=(const ScopedEnvironment&) = delete;
-
-  private:
-    const char* name_;
-    std::optional<std::string> saved_;
 };
 
 }  // namespace tavrix

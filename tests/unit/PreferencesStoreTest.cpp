@@ -1,5 +1,4 @@
 #include <gtest/gtest.h>
-#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -56,11 +55,8 @@ TEST_F(PreferencesStoreTest, PendingValuesShadowTheFileUntilSynchronized) {
     ASSERT_TRUE(store.synchronize(domain, kUser));
     EXPECT_EQ(readFresh("a", domain), Value(1));
     EXPECT_EQ(test::readText(domainPath(domain)).rfind("<?xml", 0), 0u);
-    struct stat info {};
-    ASSERT_EQ(::stat(domainPath(domain).c_str(), &info), 0);
-    EXPECT_EQ(info.st_mode & 07777, 0644u);
-    ASSERT_EQ(::stat(preferencesDirectory().c_str(), &info), 0);
-    EXPECT_EQ(info.st_mode & 07777, 0755u);
+    EXPECT_EQ(fs::status(domainPath(domain)).permissions(), fs::perms(0644));
+    EXPECT_EQ(fs::status(preferencesDirectory()).permissions(), fs::perms(0755));
 
     // A pending removal hides the stored value at once and deletes it on synchronize.
     store.setValue("a", std::nullopt, domain, kUser);

@@ -1,5 +1,4 @@
 #include <gtest/gtest.h>
-#include <sys/stat.h>
 
 #include <algorithm>
 #include <atomic>
@@ -84,9 +83,7 @@ TEST_F(BackgroundJobSchedulerTest, JobsOutliveTheBindingPerClientUnlessTheFileIs
 
     EXPECT_EQ(launch()->copyJobs(), (plist::Dictionary{{"kept", criteria}}));
     EXPECT_TRUE(launch("com.example.b")->copyJobs().empty());
-    struct stat info {};
-    ASSERT_EQ(::stat(jobsFile().c_str(), &info), 0);
-    EXPECT_EQ(info.st_mode & 0777, 0600u);
+    EXPECT_EQ(std::filesystem::status(jobsFile()).permissions(), std::filesystem::perms(0600));
 
     // Damaged files read as no jobs, and bad entries are skipped.
     for (const std::string& damaged :

@@ -3,6 +3,7 @@
 #include <poll.h>
 
 #include <atomic>
+#include <cstdlib>
 #include <functional>
 #include <mutex>
 #include <optional>
@@ -11,7 +12,6 @@
 #include <vector>
 
 #include "PrivateBus.h"
-#include "TestDoubles.h"
 #include "client/TavrixClient.h"
 
 namespace tavrix::client {
@@ -104,13 +104,14 @@ TEST(TavrixClient, ConnectingWhereNothingListensNamesTheProblem) {
     test::PrivateBus bus;
     EXPECT_THAT(failureOf([&] { TavrixClient::connectToAddress(bus.deadAddress()); }).what(),
                 HasSubstr("cannot connect to " + bus.deadAddress() + ": No such file"));
-    std::optional<ScopedEnvironment> systemBus(std::in_place, "DBUS_SYSTEM_BUS_ADDRESS",
-                                               bus.deadAddress().c_str());
+    // The system bus is the one the variable names; what main set there is put back.
+    const std::string nowhere = ::getenv("DBUS_SYSTEM_BUS_ADDRESS");
+    ::setenv("DBUS_SYSTEM_BUS_ADDRESS", bus.deadAddress().c_str(), 1);
     EXPECT_THAT(failureOf([] { TavrixClient::connectToSystemBus(); }).what(),
                 HasSubstr("cannot connect to the system bus: No such file"));
-    // And the system bus is the one the variable names.
-    systemBus.emplace("DBUS_SYSTEM_BUS_ADDRESS", bus.address().c_str());
+    ::setenv("DBUS_SYSTEM_BUS_ADDRESS", bus.address().c_str(), 1);
     EXPECT_NO_THROW(TavrixClient::connectToSystemBus());
+    ::setenv("DBUS_SYSTEM_BUS_ADDRESS", nowhere.c_str(), 1);
 }
 
 // A client of the stub on a bus of its own.

@@ -22,22 +22,6 @@ const std::filesystem::path& unitTestRoot() {
     return root->path();
 }
 
-namespace {
-// Empties the root and lays out what every test starts from.
-void freshUnitTestRoot() {
-    const std::filesystem::path& root = unitTestRoot();
-    for (const auto& entry : std::filesystem::directory_iterator(root)) {
-        std::filesystem::remove_all(entry.path());
-    }
-    writeText((root / "etc/passwd").string(),
-              "root:x:0:0:root:/root:/bin/sh\n"
-              "mobile:x:" +
-                  std::to_string(::getuid()) + ":" + std::to_string(::getgid()) +
-                  ":Mobile User:/var/mobile:/usr/sbin/nologin\n");
-    std::filesystem::create_directories(root / "var/mobile");
-}
-}  // namespace
-
 void writeDeviceTable(const plist::Dictionary& table) {
     const std::filesystem::path path = unitTestRoot() / "etc/tavrix/DeviceInfo.plist";
     std::filesystem::create_directories(path.parent_path());
@@ -55,8 +39,18 @@ class DiscardingSink : public LogSink {
 
 class RootPerTest : public testing::EmptyTestEventListener {
   public:
+    // Empties the root and lays out what every test starts from.
     void OnTestStart(const testing::TestInfo&) override {
-        freshUnitTestRoot();
+        const std::filesystem::path& root = unitTestRoot();
+        for (const auto& entry : std::filesystem::directory_iterator(root)) {
+            std::filesystem::remove_all(entry.path());
+        }
+        writeText((root / "etc/passwd").string(),
+                  "root:x:0:0:root:/root:/bin/sh\n"
+                  "mobile:x:" +
+                      std::to_string(::getuid()) + ":" + std::to_string(::getgid()) +
+                      ":Mobile User:/var/mobile:/usr/sbin/nologin\n");
+        std::filesystem::create_directories(root / "var/mobile");
         root_ = std::make_unique<Daemon>();
     }
     void OnTestEnd(const testing::TestInfo&) override { root_.reset(); }
