@@ -56,32 +56,25 @@ using BundleLocationsTest = BundleDevice;
 TEST_F(BundleLocationsTest, FindBundleTakesTheNewerAndTheUserOneOnATie) {
     writeDeviceTable();
     BundleManager& manager = BundleManager::sharedInstance();
-    struct Case {
-        const char* name;
-        Value system;
-        std::optional<Value> user;
-        bool userUsable;
-        bool userChosen;
-    };
-    const Case cases[] = {
+    const std::tuple<const char*, Value, std::optional<Value>, bool, bool> cases[] = {
         {"system newer", Value("1.10"), Value("1.9"), true, false},
         {"tie", Value("2.0"), Value("2.0"), true, true},
         {"a version that is no string counts by its text", Value("2"), Value(3), true, true},
         {"no base carrier file", Value("9"), Value("10"), false, false},
         {"no version", Value("9"), std::nullopt, true, false},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.name);
-        test::writeBundle(systemBundle(), c.system);
-        test::writeBundle(userBundle(), c.user, {}, {}, plist::Format::Binary);
-        if (!c.userUsable) {
+    for (const auto& [name, system, user, userUsable, userChosen] : cases) {
+        SCOPED_TRACE(name);
+        test::writeBundle(systemBundle(), system);
+        test::writeBundle(userBundle(), user, {}, {}, plist::Format::Binary);
+        if (!userUsable) {
             fs::remove(userBundle() + "/behavior.plist");
         }
         CarrierBundle found;
         ASSERT_TRUE(manager.findBundle(found));
-        EXPECT_EQ(found.bundlePath, c.userChosen ? userBundle() : systemBundle());
+        EXPECT_EQ(found.bundlePath, userChosen ? userBundle() : systemBundle());
         EXPECT_EQ(found.bundleRealPath, fs::canonical(found.bundlePath).string());
-        EXPECT_EQ(found.bundleVersion, (c.userChosen ? *c.user : c.system).description());
+        EXPECT_EQ(found.bundleVersion, (userChosen ? *user : system).description());
         EXPECT_EQ(found.carrierFilePath, "");
     }
     test::writeText(userBundle() + "/Info.plist", "<plist><dict><key>QZBundle");

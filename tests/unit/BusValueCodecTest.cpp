@@ -15,7 +15,6 @@ namespace {
 
 using plist::Array;
 using plist::Data;
-using plist::Date;
 using plist::Dictionary;
 using plist::Integer;
 using plist::Value;
@@ -82,7 +81,7 @@ TEST_F(BusValueCodec, ScalarsTravelWithTheDocumentedSignatures) {
         {Value(12.5), "d"},
         {Value(false), "b"},
         {Value(Data{0x00, 0xff, 0x80}), "ay"},
-        {Value(Date{12.5}), "(d)"},
+        {Value(plist::Date{12.5}), "(d)"},
         {Value(Array{}), "av"},
         {Value(Dictionary{}), "a{sv}"},
     };

@@ -4,7 +4,7 @@
 #include <algorithm>
 #include <chrono>
 #include <filesystem>
-#include <functional>
+#include <tuple>
 
 #include "PrivateBus.h"
 #include "TestSupport.h"
@@ -227,41 +227,30 @@ TEST_F(CatalogToolTest, PackAndPublishRefuseADirectoryThatIsNoBundle) {
     auto infoWith = [](const std::string& entries) {
         return "<plist version=\"1.0\"><dict>" + entries + "</dict></plist>";
     };
-    struct Case {
-        const char* name;
-        std::function<void(const std::string& bundle)> spoil;
-        std::string named;
-    };
-    const std::vector<Case> cases{
-        {"Info.plist damaged", [&](const std::string& b) { writeText(b + info, "<plist"); }, info},
-        {"no identifier",
-         [&](const std::string& b) {
-             writeText(b + info, infoWith("<key>QZBundleVersion</key><string>1</string>"));
-         },
+    const std::tuple<const char*, std::string, std::string, std::string> cases[] = {
+        {"Info.plist damaged", info, "<plist", info},
+        {"no identifier", info, infoWith("<key>QZBundleVersion</key><string>1</string>"),
          "QZBundleIdentifier"},
-        {"version not a string",
-         [&](const std::string& b) {
-             writeText(b + info, infoWith("<key>QZBundleIdentifier</key><string>x</string>"
-                                          "<key>QZBundleVersion</key><integer>1</integer>"));
-         },
+        {"version not a string", info,
+         infoWith("<key>QZBundleIdentifier</key><string>x</string>"
+                  "<key>QZBundleVersion</key><integer>1</integer>"),
          "QZBundleVersion"},
-        {"behavior.plist damaged",
-         [&](const std::string& b) { writeText(b + carrier, "not a plist"); }, carrier},
+        {"behavior.plist damaged", carrier, "not a plist", carrier},
     };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.name);
-        const std::string bundle = work / ("spoiled/" + std::string(c.name));
+    for (const auto& [name, file, content, named] : cases) {
+        SCOPED_TRACE(name);
+        const std::string bundle = work / ("spoiled/" + std::string(name));
         writeBundle(bundle, "3.0", {}, {{"a.plist", "a"}});
-        c.spoil(bundle);
+        writeText(bundle + file, content);
         const std::string payload = work / "payload.tgz";
         CommandResult pack = runCommand({TAVRIX_CTL_TOOL, "pack", bundle, "-o", payload}, true);
         EXPECT_EQ(pack.status, 1);
-        EXPECT_NE(pack.errors.find(c.named), std::string::npos) << pack.errors;
+        EXPECT_NE(pack.errors.find(named), std::string::npos) << pack.errors;
         EXPECT_EQ(std::count(pack.errors.begin(), pack.errors.end(), '\n'), 1) << pack.errors;
         EXPECT_FALSE(fs::exists(payload));
         CommandResult published = runCatalogTool({"publish", work / "out", "--unsigned", bundle});
         EXPECT_EQ(published.status, 1);
-        EXPECT_NE(published.errors.find(c.named), std::string::npos) << published.errors;
+        EXPECT_NE(published.errors.find(named), std::string::npos) << published.errors;
         EXPECT_FALSE(fs::exists(work / "out/catalog.plist"));
     }
 }

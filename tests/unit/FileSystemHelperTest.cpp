@@ -14,10 +14,7 @@ namespace tavrix::payload {
 namespace {
 
 namespace fs = std::filesystem;
-using test::readText;
-using test::snapshotTree;
 using test::TempDir;
-using test::Tree;
 using test::writeText;
 
 mode_t modeOf(const std::string& path) {
@@ -34,14 +31,15 @@ TEST(FileSystemPrimitives, CopyKeepsModesAndLinksAndNeverReplaces) {
     ::chmod((dir / "tree").c_str(), 0705);
     fs::create_symlink("script", dir / "tree/l");
     EXPECT_EQ(copyItemTree(dir / "tree", dir / "copy"), 0);
-    EXPECT_EQ(snapshotTree(dir / "copy"), (Tree{{"script", "#!/bin/sh\n"}, {"l", "-> script"}}));
+    EXPECT_EQ(test::snapshotTree(dir / "copy"),
+              (test::Tree{{"script", "#!/bin/sh\n"}, {"l", "-> script"}}));
     EXPECT_EQ(modeOf(dir / "copy/script"), 0750u);
     EXPECT_EQ(modeOf(dir / "copy"), 0705u);
 
     writeText(dir / "a", "a");
     writeText(dir / "b", "b");
     EXPECT_EQ(copyItemTree(dir / "a", dir / "b"), EEXIST);
-    EXPECT_EQ(readText(dir / "b"), "b");
+    EXPECT_EQ(test::readText(dir / "b"), "b");
 }
 
 TEST(FileSystemHelper, ListCreateAndRemove) {

@@ -18,7 +18,6 @@ namespace tavrix::client {
 namespace {
 
 using namespace std::chrono_literals;
-using bus::BusMessagePtr;
 using bus::BusPtr;
 using testing::HasSubstr;
 
@@ -54,7 +53,7 @@ class StubService {
             std::unique_lock lock(mutex_);
             sd_bus_message* raw = nullptr;
             int r = sd_bus_process(bus_.get(), &raw);
-            BusMessagePtr call(raw);
+            bus::BusMessagePtr call(raw);
             if (call && sd_bus_message_is_method_call(call.get(), kServerInterface, nullptr)) {
                 answer(call.get());
             }
