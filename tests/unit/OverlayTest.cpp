@@ -26,7 +26,6 @@ namespace fs = std::filesystem;
 using plist::Array;
 using plist::Dictionary;
 using plist::Value;
-using Line = std::pair<int, std::string>;
 
 // A device in the test's own root (model T12AP) with one system bundle (version 1.0) whose base
 // carrier file lists behavior overrides for "ABC".
@@ -306,35 +305,19 @@ TEST(MergeDictionariesTest, FollowsTheMergeRulesAndLeavesInputsAlone) {
     }
 }
 
-const plist::Value kCarrier(plist::Dictionary{
-    {"CarrierName", "Zed"},
-    {"Nested", plist::Dictionary{{"List", plist::Array{1, 2, 3}}}},
-});
-
-// The loader's lines carry their own priorities.
-class CarrierFileLoaderTest : public testing::Test {
-  protected:
-    std::vector<Line> lines() const {
-        std::vector<Line> lines;
-        for (std::size_t i = 0; i < sink.messages().size(); ++i) {
-            lines.emplace_back(sink.priorities()[i], sink.messages()[i]);
-        }
-        return lines;
-    }
-
-    test::TempDir dir;
-    CapturingLogSink sink;
-    ScopedLogSink guard{sink};
-};
-
 // Dictionaries load from any path (either format: the reader's own test); other content yields
 // nothing silently, and only a file that cannot be read is logged, at error priority.
-TEST_F(CarrierFileLoaderTest, LocalFilesLoadOnlyWhenTheyHoldADictionary) {
+TEST(CarrierFileLoaderTest, LocalFilesLoadOnlyWhenTheyHoldADictionary) {
+    test::TempDir dir;
+    CapturingLogSink sink;
+    ScopedLogSink guard(sink);
+    const Value carrier(
+        Dictionary{{"CarrierName", "Zed"}, {"Nested", Dictionary{{"List", Array{1, 2, 3}}}}});
     // Spaces, '%', '+' and non-ASCII bytes must survive the trip through a file URL.
     for (const std::string name :
          {"behavior.plist", "dir with space/a%20b+c.plist", "d\xC3\xA9j\xC3\xA0/x#y?.plist"}) {
-        test::writeText(dir / name, *plist::serialize(kCarrier, plist::Format::Binary));
-        EXPECT_EQ(copyDictionaryFromFile(dir / name), kCarrier) << name;
+        test::writeText(dir / name, *plist::serialize(carrier, plist::Format::Binary));
+        EXPECT_EQ(copyDictionaryFromFile(dir / name), carrier) << name;
     }
     for (const std::string& content :
          {*plist::serialize(plist::Value(plist::Array{"a", "b"})),
@@ -343,14 +326,15 @@ TEST_F(CarrierFileLoaderTest, LocalFilesLoadOnlyWhenTheyHoldADictionary) {
         test::writeText(dir / "carrier.plist", content);
         EXPECT_FALSE(copyDictionaryFromFile(dir / "carrier.plist")) << content;
     }
-    EXPECT_TRUE(lines().empty());
+    EXPECT_TRUE(sink.messages().empty());
 
     EXPECT_FALSE(copyDictionaryFromFile(dir / "missing.plist"));
     EXPECT_FALSE(copyDictionaryFromFile(dir.path().string()));  // a directory
     EXPECT_FALSE(copyDictionaryFromFile(""));
-    EXPECT_EQ(lines(), (std::vector<Line>{{LOG_ERR, "Failed to load the file\n"},
-                                          {LOG_ERR, "Failed to load the file\n"},
-                                          {LOG_ERR, "Failed to get the URL for the file \n"}}));
+    EXPECT_EQ(sink.messages(),
+              (std::vector<std::string>{"Failed to load the file\n", "Failed to load the file\n",
+                                        "Failed to get the URL for the file \n"}));
+    EXPECT_EQ(sink.priorities(), (std::vector<int>{LOG_ERR, LOG_ERR, LOG_ERR}));
 }
 
 }  // namespace
