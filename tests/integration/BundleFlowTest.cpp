@@ -1,7 +1,6 @@
 // The daemon's main job as clients see it: a behavior ID set with a packed bundle ends with the
 // right carrier file linked into the mobile home and one notification, nothing changes when nothing
 // changed, and payloads chosen to hurt leave it serving.
-#include <signal.h>
 #include <sys/stat.h>
 #include <sys/types.h>
 
@@ -263,6 +262,8 @@ TEST_F(BundleFlowTest, KilledAnywhereInSetTavrixIDTheNextLaunchFindsOneWholeStat
     const unsigned seed = static_cast<unsigned>(std::random_device{}());
     SCOPED_TRACE("seed " + std::to_string(seed));
     std::mt19937 random(seed);
+    std::uniform_int_distribution<std::int64_t> pause(
+        0, std::chrono::duration_cast<std::chrono::microseconds>(callTime * 5 / 4).count());
     std::map<std::string, int> statesFound;
     for (int iteration = 0; iteration < crashLoopIterations(); ++iteration) {
         SCOPED_TRACE("iteration " + std::to_string(iteration));
@@ -276,11 +277,7 @@ TEST_F(BundleFlowTest, KilledAnywhereInSetTavrixIDTheNextLaunchFindsOneWholeStat
                 // The daemon died under the call: that is the point.
             }
         });
-        std::this_thread::sleep_for(
-            std::uniform_int_distribution<std::int64_t>(
-                0, std::chrono::duration_cast<std::chrono::microseconds>(callTime).count() * 5 /
-                       4)(random) *
-            1us);
+        std::this_thread::sleep_for(pause(random) * 1us);
         ASSERT_TRUE(killDaemon(*pid));
         victim.join();
         ++statesFound[linkState()];
@@ -455,18 +452,16 @@ TEST_P(HostilePayloadTest, DaemonKeepsServingAndSoDoesItsNextLaunch) {
     writeBundle(previous, "5", {{"CarrierName", "5"}});
     ASSERT_TRUE(client().setTavrixID("id-7", pack(previous)));
     ASSERT_TRUE(client().setTavrixID("id-7", hostilePayload(hostile)));
-    const std::optional<pid_t> pid = daemonPid();
-    ASSERT_TRUE(pid);
     expectServing("after the payload");
     if (hostile.zeroFileBytes != 0) {
         // Stopped at a limit before it filled the disk: the bundle before it stays linked.
         EXPECT_EQ(linkedVersion(), "5");
     }
 
-    ASSERT_EQ(::kill(*pid, SIGTERM), 0);
-    EXPECT_EQ(waitForDaemonExit(*pid), std::optional<int>(0));
+    const std::optional<pid_t> stopped = stopDaemon();
+    ASSERT_TRUE(stopped);
     expectServing("at the next launch");
-    EXPECT_NE(daemonPid(), pid);
+    EXPECT_NE(daemonPid(), stopped);
     // Nothing appeared beside the device root but the payload sources made here.
     for (const auto& entry : fs::directory_iterator(device().base())) {
         const std::string name = entry.path().filename().string();

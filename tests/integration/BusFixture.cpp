@@ -22,29 +22,19 @@ DeviceRoot::DeviceRoot() {
                         ":Mobile User:/var/mobile:/usr/sbin/nologin\n");
     fs::create_directories(path("/var/mobile/Library/Preferences"));
     fs::create_directories(runtimeDirectory());
-    setCellularRadio(false);
+    writeDeviceInfo();
 }
 
-void DeviceRoot::setSerialNumber(const std::string& serialNumber) {
-    serialNumber_ = serialNumber;
-    setCellularRadio(cellularRadio_);
-}
-
-void DeviceRoot::setCellularRadio(bool present) {
-    cellularRadio_ = present;
-    // Everything the device information service is asked for, so that no answer comes from the
-    // machine running the tests.
-    writePropertyList("/etc/tavrix/DeviceInfo.plist", {
-                                                          {"contains-cellular-radio", present},
-                                                          {"wi-fi", true},
-                                                          {"DeviceClass", "Tablet"},
-                                                          {"ProductType", "Tablet7,1"},
-                                                          {"ProductVersion", "9.1"},
-                                                          {"BuildVersion", "13B100"},
-                                                          {"ReleaseType", "User"},
-                                                          {"HWModelStr", "T71AP"},
-                                                          {"SerialNumber", serialNumber_},
-                                                      });
+void DeviceRoot::writeDeviceInfo(bool cellularRadio, const std::string& serialNumber) {
+    writePropertyList("/etc/tavrix/DeviceInfo.plist", {{"contains-cellular-radio", cellularRadio},
+                                                       {"wi-fi", true},
+                                                       {"DeviceClass", "Tablet"},
+                                                       {"ProductType", "Tablet7,1"},
+                                                       {"ProductVersion", "9.1"},
+                                                       {"BuildVersion", "13B100"},
+                                                       {"ReleaseType", "User"},
+                                                       {"HWModelStr", "T71AP"},
+                                                       {"SerialNumber", serialNumber}});
 }
 
 Result<plist::Value> DeviceRoot::readDaemonPreferences() const {
@@ -242,6 +232,12 @@ std::optional<pid_t> BusFixture::daemonPid() {
     bus::BusMessagePtr owned(reply);
     std::uint32_t pid = 0;
     return sd_bus_message_read(reply, "u", &pid) >= 0 ? std::optional<pid_t>(pid) : std::nullopt;
+}
+
+std::optional<pid_t> BusFixture::stopDaemon(std::chrono::milliseconds timeout) {
+    const std::optional<pid_t> pid = daemonPid();
+    const bool left = pid && ::kill(*pid, SIGTERM) == 0 && waitForDaemonExit(*pid, timeout) == 0;
+    return left ? pid : std::nullopt;
 }
 
 std::string BusFixture::linkTarget(std::string_view absolutePath) const {

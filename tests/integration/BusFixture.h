@@ -74,8 +74,10 @@ class DeviceRoot {
         return root() / std::filesystem::path(absolutePath).relative_path();
     }
 
-    void setCellularRadio(bool present);
-    void setSerialNumber(const std::string& serialNumber);
+    // Everything the device information service is asked for, so that no answer comes from the
+    // machine running the tests.
+    void writeDeviceInfo(bool cellularRadio = false,
+                         const std::string& serialNumber = "TESTSERIAL01");
     // The daemon's own preferences and the behavior settings domain of the mobile user.
     void writeDaemonPreferences(const plist::Dictionary& values) {
         writePropertyList(kDaemonPreferences, values);
@@ -100,8 +102,6 @@ class DeviceRoot {
     void writePropertyList(std::string_view absolutePath, const plist::Dictionary& values);
 
     test::TempDir base_;
-    bool cellularRadio_ = false;
-    std::string serialNumber_ = "TESTSERIAL01";
 };
 
 // The test's own connection: who owns the daemon's name, which notifications were posted, and the
@@ -206,6 +206,8 @@ class BusFixture : public ::testing::Test {
     }
     // The process that owns the daemon's name now.
     std::optional<pid_t> daemonPid();
+    // SIGTERM to the daemon that owns the name: its pid once it has left with 0, else nothing.
+    std::optional<pid_t> stopDaemon(std::chrono::milliseconds timeout = 10s);
 
     // The log's lines, in order.
     std::vector<std::string> daemonLogLines() const;

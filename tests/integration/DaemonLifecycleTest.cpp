@@ -29,7 +29,7 @@ constexpr const char* kStartedNotification = "TXDaemonStartedNotification";
 
 class DaemonLifecycleTest : public BusFixture {
   protected:
-    DaemonLifecycleTest() { idleExitSeconds = 1; }
+    DaemonLifecycleTest() { idleExitSeconds = 2; }
 
     // Position of the first whole line equal to text, or the line count when there is none.
     std::size_t lineIndex(const std::string& text) const {
@@ -39,9 +39,12 @@ class DaemonLifecycleTest : public BusFixture {
     }
 };
 
-// Activation, the start-up order, staying for the launch transaction although idle exit is 1 s,
-// and leaving with 0.
-TEST_F(DaemonLifecycleTest, StartsOnCallStaysForLaunchTransactionAndLeavesWhenIdle) {
+// Activation, the start-up order, staying for the launch transaction although idle exit is 2 s,
+// and leaving with 0. Then calls once a second keep one daemon past the launch transaction: the
+// grace runs from the last call. A keep-alive flag left set by an earlier run is seen at start and
+// cleared once started. A daemon whose bus goes can be called no more: it leaves at once, with 0,
+// rather than after its launch transaction and grace.
+TEST_F(DaemonLifecycleTest, StartsOnCallStaysWhileNeededAndLeavesWhenIdleOrItsBusGoes) {
     ASSERT_TRUE(watcher().nameOwner().empty());
     auto caller = client();
     EXPECT_FALSE(caller.isTavrixBundleSupported());
@@ -60,29 +63,8 @@ TEST_F(DaemonLifecycleTest, StartsOnCallStaysForLaunchTransactionAndLeavesWhenId
 
     ASSERT_TRUE(waitForNoNameOwner(10s));
     EXPECT_EQ(waitForDaemonExit(*firstPid), std::optional<int>(0));
-}
 
-// A daemon whose bus goes can be called no more: it leaves at once, with 0, rather than after its
-// launch transaction and grace.
-TEST_F(DaemonLifecycleTest, LeavesWhenItsBusGoes) {
-    client().isTavrixBundleSupported();
-    const auto pid = daemonPid();
-    ASSERT_TRUE(pid);
-    stopBus();
-    EXPECT_EQ(waitForDaemonExit(*pid, 5s), std::optional<int>(0));
-    EXPECT_EQ(countLogLines("The bus connection is gone; leaving"), 1);
-}
-
-class DaemonActivityTest : public DaemonLifecycleTest {
-  protected:
-    DaemonActivityTest() { idleExitSeconds = 2; }
-};
-
-// Calls once a second keep the one daemon past the launch transaction: the grace runs from the last
-// call. A keep-alive flag left set by an earlier run is seen at start and cleared once started.
-TEST_F(DaemonActivityTest, CallsOnceASecondKeepOneDaemonAlivePastTheGrace) {
     test::writeText(device().runtimeDirectory() / "keep-alive", "1");
-    auto caller = client();
     EXPECT_FALSE(caller.isTavrixBundleSupported());
     const auto pid = daemonPid();
     ASSERT_TRUE(pid);
@@ -90,14 +72,20 @@ TEST_F(DaemonActivityTest, CallsOnceASecondKeepOneDaemonAlivePastTheGrace) {
         std::this_thread::sleep_for(1s);
         EXPECT_TRUE(caller.setClientType(second));
     }
-    EXPECT_EQ(countLogLines(kLaunchEnded), 1);
+    EXPECT_EQ(countLogLines(kLaunchEnded), 2);
     EXPECT_EQ(countLogLines("Starting the server: keepAlive = ENABLED"), 1);
     EXPECT_EQ(device().keepAliveFlag(), "0\n");
     EXPECT_EQ(daemonPid(), pid);
-    EXPECT_EQ(daemonLaunches().size(), 1u);
-
+    EXPECT_EQ(daemonLaunches().size(), 2u);
     EXPECT_TRUE(waitForNoNameOwner(10s));
     EXPECT_EQ(waitForDaemonExit(*pid), std::optional<int>(0));
+
+    caller.isTavrixBundleSupported();
+    const auto last = daemonPid();
+    ASSERT_TRUE(last);
+    stopBus();
+    EXPECT_EQ(waitForDaemonExit(*last, 5s), std::optional<int>(0));
+    EXPECT_EQ(countLogLines("The bus connection is gone; leaving"), 1);
 }
 
 // A daemon that cannot serve logs why and exits with a failure, so that the service manager's

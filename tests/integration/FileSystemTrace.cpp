@@ -75,9 +75,6 @@ std::vector<Call> parseTrace(const std::string& trace) {
         }
         const std::string thread = line.substr(0, space);
         std::string text = line.substr(line.find_first_not_of(' ', space));
-        if (text.starts_with("+++") || text.starts_with("---")) {
-            continue;
-        }
         constexpr std::string_view kUnfinished = " <unfinished ...>";
         if (text.ends_with(kUnfinished)) {
             unfinished[thread] = text.substr(0, text.size() - kUnfinished.size());

@@ -4,7 +4,6 @@
 // relaunches and a signed update installs. Starting processes as other users needs root.
 #include <gmock/gmock.h>
 #include <pwd.h>
-#include <signal.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -206,10 +205,7 @@ TEST_P(MobileHomeAttackTest, TheDaemonInstallsAndTrustsOnlyItsOwn) {
         EXPECT_THAT(*payload->find("Reason")->asString(), HasSubstr("could not be staged"));
     }
 
-    std::optional<pid_t> pid = daemonPid();
-    ASSERT_TRUE(pid);
-    ::kill(*pid, SIGTERM);
-    ASSERT_TRUE(waitForDaemonExit(*pid));
+    ASSERT_TRUE(stopDaemon());
     client().isTavrixBundleSupported();
     expectLinked(payloadVersion);
 

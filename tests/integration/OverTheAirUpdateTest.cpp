@@ -38,6 +38,8 @@ using ::testing::StartsWith;
 constexpr const char* kAssetCache = "/var/cache/tavrixservicesd/com.zandor.Grellas.TavrixBundles";
 constexpr const char* kBehaviorID = "acme.default";
 constexpr const char* kPendingInstall = "/var/lib/tavrixservicesd/pending-install.plist";
+// Logged once a check's download is done with, installed or not.
+constexpr const char* kPurged = "Best candidate asset has been purged";
 
 constexpr double kOneDay = 86400.0;
 constexpr double kFifteenDays = 1296000.0;
@@ -212,10 +214,7 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
               nlohmann::json({"catalog-refused", textAt(check, "Reason")}));
     EXPECT_TRUE(waitForNextUpdateIn(kFifteenDays, 1s)) << "a refused catalog re-arms nothing";
     // What the daemon recorded is still there after it left and was started again.
-    const auto pid = daemonPid();
-    ASSERT_TRUE(pid);
-    ::kill(*pid, SIGTERM);
-    EXPECT_EQ(waitForDaemonExit(*pid, 90s), std::optional<int>(0));
+    ASSERT_TRUE(stopDaemon(90s));
     expectFields(tavrixctlJson({"status"}),
                  {{"LastCheck.Outcome", "catalog-refused"}, {"LinkedBundle.Version", "2"}});
 }
@@ -235,7 +234,6 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheNextOneInstallsAsTh
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
     const auto installedFiles = userBundleFiles();
     const std::string carrierFile = linkTarget(kPreferencesLink);
-    constexpr const char* kPurged = "Best candidate asset has been purged";
     auto expectNothingChanged = [&](const std::string& waitedLine, int seen, double rearmedIn) {
         EXPECT_TRUE(client().checkForTavrixBundleUpdate());
         EXPECT_TRUE(waitForLogLine(waitedLine, 30s, seen + 1));
@@ -298,7 +296,6 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheNextOneInstallsAsTh
 // from the cached download or the next check installs it; nothing is left in the cache.
 TEST_F(OverTheAirUpdateTest, KilledAnywhereInAnUpdateTheNextLaunchCompletesOrRedoesIt) {
     constexpr std::size_t kBulk = 2 << 20;
-    constexpr const char* kPurged = "Best candidate asset has been purged";
     setIDWithBundle("1");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
     publish("2", kBulk);
@@ -311,6 +308,8 @@ TEST_F(OverTheAirUpdateTest, KilledAnywhereInAnUpdateTheNextLaunchCompletesOrRed
     const unsigned seed = static_cast<unsigned>(std::random_device{}());
     SCOPED_TRACE("seed " + std::to_string(seed));
     std::mt19937 random(seed);
+    std::uniform_int_distribution<std::int64_t> pause(
+        0, std::chrono::duration_cast<std::chrono::microseconds>(updateTime * 5 / 4).count());
     std::map<std::string, int> statesFound;
     for (int iteration = 0; iteration < iterations; ++iteration) {
         const std::string version = std::to_string(iteration + 3);
@@ -319,11 +318,7 @@ TEST_F(OverTheAirUpdateTest, KilledAnywhereInAnUpdateTheNextLaunchCompletesOrRed
         auto pid = daemonPid();
         ASSERT_TRUE(pid);
         EXPECT_TRUE(client().checkForTavrixBundleUpdate());
-        std::this_thread::sleep_for(
-            std::uniform_int_distribution<std::int64_t>(
-                0, std::chrono::duration_cast<std::chrono::microseconds>(updateTime).count() * 5 /
-                       4)(random) *
-            1us);
+        std::this_thread::sleep_for(pause(random) * 1us);
         ASSERT_TRUE(killDaemon(*pid));
         const bool marked = fs::exists(device().path(kPendingInstall));
         ++statesFound[linkedVersion() == version ? "installed"
@@ -455,7 +450,7 @@ TEST_F(DurabilityProtocolTest, PayloadUpdateAndResetWriteInTheDurableOrder) {
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 10s));
     publish("2");
     ASSERT_TRUE(client().checkForTavrixBundleUpdate());
-    ASSERT_TRUE(waitForLogLine("Best candidate asset has been purged", 30s));
+    ASSERT_TRUE(waitForLogLine(kPurged, 30s));
     EXPECT_EQ(linkedVersion(), "2");
     test::writeBundle(at(kSystemBundle), "9", {{"CarrierName", "System"}});
     ASSERT_TRUE(client().setTavrixID("acme.other", std::nullopt));
@@ -500,10 +495,7 @@ class OverTheAirKeepAliveTest : public OverTheAirUpdateTest {
 TEST_F(OverTheAirKeepAliveTest, ScheduledCheckKeepsTheDaemonUntilTheDownloadIsInstalled) {
     setIDWithBundle("1");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
-    auto first = daemonPid();
-    ASSERT_TRUE(first);
-    ASSERT_EQ(::kill(*first, SIGTERM), 0);
-    ASSERT_EQ(waitForDaemonExit(*first), std::optional<int>(0));
+    ASSERT_TRUE(stopDaemon());
 
     const std::string archive = publish("2");
     holdPublished(archive, 1.0 / 3);
@@ -643,7 +635,7 @@ TEST_F(ReleaseTrainTest, TheDocumentedReleaseTrainRunsAgainstADevice) {
     const std::string serialNumber =
         bucketBlock.substr(bucketBlock.find("bucket ") + 7,
                            bucketBlock.find(" 2\n") - bucketBlock.find("bucket ") - 7);
-    device().setSerialNumber(serialNumber);
+    device().writeDeviceInfo(false, serialNumber);
     CommandResult formula = runCommand(
         {"/usr/bin/python3", "-c",
          "import hashlib, sys; d = hashlib.sha256((sys.argv[1] + '\\n2').encode()).digest(); "
@@ -699,10 +691,7 @@ TEST_F(ReleaseTrainTest, TheDocumentedReleaseTrainRunsAgainstADevice) {
     // fresh one reads version 2 from the link.)
     setIDWithBundle("2");
     ASSERT_EQ(linkedVersion(), "2");
-    const auto pid = daemonPid();
-    ASSERT_TRUE(pid);
-    ::kill(*pid, SIGTERM);
-    ASSERT_EQ(waitForDaemonExit(*pid, 90s), std::optional<int>(0));
+    ASSERT_TRUE(stopDaemon(90s));
     EXPECT_EQ(checkReason(), "up to date (version 2 installed)");
     EXPECT_TRUE(fs::exists(site() / archive3)) << "the previous catalog still names it";
 
