@@ -278,6 +278,17 @@ std::vector<std::uint8_t> BusFixture::pack(const fs::path& directory,
     return {bytes.begin(), bytes.end()};
 }
 
+fs::path BusFixture::writeVersionedBundle(const std::string& version, std::size_t bulkBytes) const {
+    const fs::path directory = device_.base() / ("bundles/" + version + "/Default.bundle");
+    writeBundle(directory, version, {{"CarrierName", "Bundle " + version}},
+                {{"Resources/only-in-" + version + ".txt", version}});
+    if (bulkBytes > 0) {
+        test::writeText(directory / "Resources/bulk.bin",
+                        test::randomBytes(bulkBytes, std::hash<std::string>()(version)));
+    }
+    return directory;
+}
+
 test::LocalHttpServer& BusFixture::catalogServer() {
     if (!catalogServer_) {
         const fs::path keys = device_.base() / "keys";

@@ -173,6 +173,10 @@ class BusFixture : public ::testing::Test {
     // The directory's content packed by bsdtar with these options, as a sender packs a bundle.
     std::vector<std::uint8_t> pack(const std::filesystem::path& directory,
                                    const std::vector<std::string>& options = {"-z"}) const;
+    // A bundle of this version under the test's directory: "Bundle <version>" its carrier name,
+    // one file of its own and, when asked, a large file of bulkBytes that does not compress.
+    std::filesystem::path writeVersionedBundle(const std::string& version,
+                                               std::size_t bulkBytes = 0) const;
     // The catalog site the device trusts, made on first use: a signing key of its own, the site
     // directory served on 127.0.0.1 under /updates/, and the device's catalog settings naming it
     // with the key in the single-key form.

@@ -134,12 +134,6 @@ class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInter
         return runCommand(asUser(mobile_, {"/bin/sh", "-c", "exec 2>/dev/null; " + script}));
     }
 
-    void setIDWithBundle(const std::string& version) {
-        const fs::path bundle = device().base() / ("bundles/" + version + "/Default.bundle");
-        writeBundle(bundle, version, {{"CarrierName", "Bundle " + version}});
-        ASSERT_TRUE(client().setTavrixID("ACME.default", pack(bundle)));
-    }
-
     // Both links are the daemon's own and lead into the user bundle of this version.
     void expectLinked(const std::string& version) {
         EXPECT_EQ(linkedVersion(), version);
@@ -189,8 +183,8 @@ TEST_P(MobileHomeAttackTest, TheDaemonInstallsAndTrustsOnlyItsOwn) {
     auto repeated =
         std::make_unique<RepeatedAttack>(stop, std::jthread([this, stop] { attack(stop); }));
 
-    setIDWithBundle("11");
-    setIDWithBundle("12");
+    ASSERT_TRUE(client().setTavrixID("ACME.default", pack(writeVersionedBundle("11"))));
+    ASSERT_TRUE(client().setTavrixID("ACME.default", pack(writeVersionedBundle("12"))));
     const std::string payloadVersion = GetParam().blocksPayloads ? "10" : "12";
     expectLinked(payloadVersion);
     // No support the device's configuration did not give, no update date of the attacker's.
@@ -216,9 +210,7 @@ TEST_P(MobileHomeAttackTest, TheDaemonInstallsAndTrustsOnlyItsOwn) {
         stored && stored->asDictionary() ? *stored->asDictionary() : plist::Dictionary();
     values.insert_or_assign("EnableSupport", true);
     device().writeDaemonPreferences(values);
-    const fs::path bundle = device().base() / "bundles/13/Default.bundle";
-    writeBundle(bundle, "13", {{"CarrierName", "Bundle 13"}});
-    publishSigned(bundle);
+    publishSigned(writeVersionedBundle("13"));
     client().checkForTavrixBundleUpdate();
     // The carrier file link follows the bundle link: both must have moved.
     EXPECT_TRUE(

@@ -55,26 +55,13 @@ class OverTheAirUpdateTest : public BusFixture {
 
     static double now() { return Clock::absoluteTimeNow(); }
 
-    // A bundle: its Info.plist, the base carrier file naming the version, one file of its own and,
-    // when asked, a large file of bulkBytes that does not compress.
-    fs::path writeBundle(const std::string& version, std::size_t bulkBytes = 0) {
-        const fs::path directory = device().base() / ("bundles/" + version + "/Default.bundle");
-        test::writeBundle(directory, version, {{"CarrierName", "Bundle " + version}},
-                          {{"Resources/only-in-" + version + ".txt", version}});
-        if (bulkBytes > 0) {
-            writeText(directory / "Resources/bulk.bin",
-                      test::randomBytes(bulkBytes, std::hash<std::string>()(version)));
-        }
-        return directory;
-    }
-
     void setIDWithBundle(const std::string& version) {
-        ASSERT_TRUE(client().setTavrixID(kBehaviorID, pack(writeBundle(version))));
+        ASSERT_TRUE(client().setTavrixID(kBehaviorID, pack(writeVersionedBundle(version))));
     }
 
     // Answers the archive's URL path.
     std::string publish(const std::string& version, std::size_t bulkBytes = 0) {
-        return publishSigned(writeBundle(version, bulkBytes));
+        return publishSigned(writeVersionedBundle(version, bulkBytes));
     }
 
     test::Tree userBundleFiles() { return test::snapshotTree(at(kUserBundle)); }
@@ -372,7 +359,7 @@ TEST_F(OverTheAirUpdateTest, DaemonStartedWhileTheLastOneDrainsActsAfterIt) {
         ASSERT_EQ(::kill(*pid, SIGTERM), 0);
         ASSERT_TRUE(waitForNoNameOwner());
 
-        const std::vector<std::uint8_t> packed = pack(writeBundle(payload, kBulk));
+        const std::vector<std::uint8_t> packed = pack(writeVersionedBundle(payload, kBulk));
         auto answer = std::async(std::launch::async, [&] {
             if (round % 2 == 0) {
                 return client().setTavrixID(kBehaviorID, packed);
@@ -624,8 +611,8 @@ TEST_F(ReleaseTrainTest, TheDocumentedReleaseTrainRunsAgainstADevice) {
     const fs::path base = device().base();
     setIDWithBundle("1");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
-    writeBundle("2");
-    writeBundle("3");
+    writeVersionedBundle("2");
+    writeVersionedBundle("3");
 
     runStep("keygen");
     trustKeys({{"release-2026", base / "release-2026.pub"}});

@@ -86,11 +86,7 @@ TEST_F(StatusPropertiesTest, PropertiesAnnounceEachChangeAndTakeABundleByDescrip
     EXPECT_THAT(unknown.output, HasSubstr("NoSuchProperty"));
 
     const fs::path bundle = device().base() / "bundle.tgz";
-    const auto packed = pack([&] {
-        const fs::path source = device().base() / "src";
-        writeBundle(source, "1", {{"CarrierName", "Bundle 1"}});
-        return source;
-    }());
+    const auto packed = pack(writeVersionedBundle("1"));
     test::writeText(bundle, std::string(packed.begin(), packed.end()));
     CommandResult set = sendBundle("ACME.Default", "file", bundle);
     EXPECT_EQ(set.status, 0) << set.output;
@@ -188,11 +184,7 @@ print("same" if documented == live else "documented %s\nlive %s" % (documented, 
 // tavrixctl as scripts use it: exit statuses, and its one JSON form read by Python's json module,
 // where a date, data, an integer, a real and the same digits as text all stay apart.
 TEST_F(StatusPropertiesTest, ScriptsGetExitStatusesAndTypedJson) {
-    ASSERT_TRUE(client().setTavrixID("acme.default", pack([&] {
-                                         const auto source = device().base() / "src";
-                                         writeBundle(source, "1", {{"CarrierName", "One"}});
-                                         return source;
-                                     }())));
+    ASSERT_TRUE(client().setTavrixID("acme.default", pack(writeVersionedBundle("1"))));
     // Binary, which keeps a date's fraction; in one step, as the daemon caches by identity.
     const plist::Dictionary settings = {{"Count", 1500},
                                         {"Text", "1500"},
