@@ -7,7 +7,6 @@
 #include <iostream>
 #include <sstream>
 #include <stdexcept>
-#include <tuple>
 
 #include "plist/PropertyListFormat.h"
 
@@ -37,10 +36,6 @@ void DeviceRoot::writeDeviceInfo(bool cellularRadio, const std::string& serialNu
                                                        {"SerialNumber", serialNumber}});
 }
 
-Result<plist::Value> DeviceRoot::readDaemonPreferences() const {
-    return plist::readFile(path(kDaemonPreferences).string());
-}
-
 void DeviceRoot::writePropertyList(std::string_view absolutePath, const plist::Dictionary& values) {
     fs::path target = path(absolutePath);
     fs::create_directories(target.parent_path());
@@ -54,19 +49,16 @@ void DeviceRoot::writePropertyList(std::string_view absolutePath, const plist::D
 
 BusWatcher::BusWatcher(const std::string& address) : bus_(test::connectToBus(address)) {
     // The bus is new: nobody owns the name yet.
-    for (auto [slot, match, handler] :
-         {std::tuple{&ownerSlot_,
-                     "type='signal',sender='org.freedesktop.DBus',interface='org.freedesktop.DBus',"
-                     "member='NameOwnerChanged',arg0='com.zandor.tavrixservicesd'",
-                     &onNameOwnerChanged},
-          std::tuple{&postedSlot_,
-                     "type='signal',interface='com.zandor.NotificationCenter',member='Posted'",
-                     &onPosted},
-          std::tuple{&statusSlot_, "type='signal',path='/com/zandor/tavrixservicesd'",
-                     &onStatusSignal}}) {
+    for (auto [match, handler] :
+         {std::pair{"type='signal',sender='org.freedesktop.DBus',interface='org.freedesktop.DBus',"
+                    "member='NameOwnerChanged',arg0='com.zandor.tavrixservicesd'",
+                    &onNameOwnerChanged},
+          std::pair{"type='signal',interface='com.zandor.NotificationCenter',member='Posted'",
+                    &onPosted},
+          std::pair{"type='signal',path='/com/zandor/tavrixservicesd'", &onStatusSignal}}) {
         sd_bus_slot* made = nullptr;
         test::check(sd_bus_add_match(bus_.get(), &made, match, handler, this), "sd_bus_add_match");
-        slot->reset(made);
+        slots_.emplace_back(made);
     }
 }
 

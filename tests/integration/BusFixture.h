@@ -82,7 +82,9 @@ class DeviceRoot {
     void writeDaemonPreferences(const plist::Dictionary& values) {
         writePropertyList(kDaemonPreferences, values);
     }
-    Result<plist::Value> readDaemonPreferences() const;
+    Result<plist::Value> readDaemonPreferences() const {
+        return plist::readFile(path(kDaemonPreferences).string());
+    }
     // One key of the daemon's preferences, or nothing.
     std::optional<plist::Value> daemonPreference(const std::string& key) const {
         auto preferences = readDaemonPreferences();
@@ -143,9 +145,7 @@ class BusWatcher {
     std::optional<nlohmann::json> takeStatusSignal(bool checkFinished);
 
     bus::BusPtr bus_;
-    bus::BusSlotPtr ownerSlot_;
-    bus::BusSlotPtr postedSlot_;
-    bus::BusSlotPtr statusSlot_;
+    std::vector<bus::BusSlotPtr> slots_;
     std::string owner_;
     int releases_ = 0;
     std::map<std::string, int> notifications_;
@@ -215,8 +215,8 @@ class BusFixture : public ::testing::Test {
 
     // The log's lines, in order.
     std::vector<std::string> daemonLogLines() const;
-    // How often line appears in the log as a whole line, or contains text.
-    int countLogLines(const std::string& line) const { return countLogLines(line, true); }
+    // How often text is a whole line of the log, or (whole false) part of one.
+    int countLogLines(const std::string& text, bool whole = true) const;
     int countLogLinesContaining(const std::string& text) const {
         return countLogLines(text, false);
     }
@@ -237,8 +237,6 @@ class BusFixture : public ::testing::Test {
     std::vector<std::string> daemonLaunchPrefix;
 
   private:
-    int countLogLines(const std::string& text, bool whole) const;
-
     DeviceRoot device_;
     std::set<pid_t> killed_;
     std::unique_ptr<test::PrivateBus> bus_;
