@@ -19,8 +19,6 @@ namespace {
 
 using ::testing::HasSubstr;
 
-using DaemonClientsTest = BusFixture;
-
 constexpr const char* kLaunchBegun =
     "*********** Beginning Corvex transaction : TXMinimumLaunchTransaction ***********";
 constexpr const char* kLaunchEnded =
@@ -126,13 +124,15 @@ TEST_F(DaemonLifecycleTest, DaemonThatCannotServeExitsWithAFailure) {
     EXPECT_EQ(daemonLaunches().size(), 0u);
 }
 
-// Peers are accepted on their first call and removed when they leave the bus.
-TEST_F(DaemonClientsTest, ClientsAreCountedInOnFirstCallAndOutWhenTheyLeave) {
+// Peers are accepted on their first call and removed when they leave the bus. Clients calling back
+// to back while the daemon leaves (SIGTERM, as an idle exit leaves) and the bus starts the next
+// one: every call gets its answer, whichever daemon gives it.
+TEST_F(DaemonLifecycleTest, ClientsAreCountedInAndOutAndNoCallIsLostWhileTheDaemonLeaves) {
     // Clients have no identifier the platform vouches for: nothing a caller chooses reaches the
     // log.
     const std::string name = "(null)";
-    std::optional<client::TavrixClient> first(client());
-    EXPECT_TRUE(first->setClientType(0));
+    std::optional<client::TavrixClient> firstClient(client());
+    EXPECT_TRUE(firstClient->setClientType(0));
     EXPECT_TRUE(waitForLogLine("Added client: " + name + ", count: 1"));
     {
         auto second = client();
@@ -141,18 +141,14 @@ TEST_F(DaemonClientsTest, ClientsAreCountedInOnFirstCallAndOutWhenTheyLeave) {
         EXPECT_TRUE(waitForLogLine("Added client: " + name + ", count: 2"));
     }
     EXPECT_TRUE(waitForLogLine("Removed client: " + name + ", count: 1"));
-    first.reset();
+    firstClient.reset();
     EXPECT_TRUE(waitForLogLine("Removed client: " + name + ", count: 0"));
     // A later call of a known client is not a new acceptance.
     EXPECT_EQ(countLogLines("Added client: " + name + ", count: 3"), 0);
     EXPECT_EQ(countLogLines("*********** Beginning Corvex transaction : TXAddClientTransaction "
                             "***********"),
               2);
-}
 
-// Clients calling back to back while the daemon leaves (SIGTERM, as an idle exit leaves) and the
-// bus starts the next one: every call gets its answer, whichever daemon gives it.
-TEST_F(DaemonLifecycleTest, NoCallIsLostWhileTheDaemonLeaves) {
     constexpr int kClients = 8;
     constexpr int kCallsAfterRestart = 20;
     std::atomic<bool> go{false};         // the daemon is about to leave: call without pause
