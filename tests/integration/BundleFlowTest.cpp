@@ -178,13 +178,9 @@ TEST_F(BundleFlowTest, FirstSetLinksTheOverlaidCarrierFileAndRepeatingItChangesN
 
     // A payload that is no archive, piped in: the ID is accepted, the payload reported as not
     // extracted and the exit status says so (Python reads the JSON).
-    CommandResult broken = runCommand(
-        {"/bin/bash", "-c",
-         "set -o pipefail; echo garbage | '" + std::string(TAVRIX_CTL_PATH) + "' --address '" +
-             busAddress() +
-             "' set-id AbC --bundle - --json | /usr/bin/python3 -c 'import json, sys; answer = "
-             "json.load(sys.stdin); print(answer[\"Accepted\"], answer[\"Extracted\"], "
-             "len(answer[\"Reason\"]) > 0)'"});
+    CommandResult broken = throughPython(
+        {"set-id", "AbC", "--bundle", "-", "--json"},
+        "answer[\"Accepted\"], answer[\"Extracted\"], len(answer[\"Reason\"]) > 0", "garbage");
     EXPECT_EQ(broken.status, 1) << broken.output;
     EXPECT_EQ(broken.output, "True False True\n");
 }

@@ -201,6 +201,20 @@ class BusFixture : public ::testing::Test {
         arguments.insert(arguments.begin(), {TAVRIX_CTL_PATH, "--address", busAddress()});
         return runCommand(arguments);
     }
+    // tavrixctl's answer, with the line input (if any) as its standard input, and Python's
+    // expression applied to the parsed JSON as "answer"; the exit status is tavrixctl's.
+    CommandResult throughPython(const std::vector<std::string>& arguments,
+                                const std::string& expression,
+                                const std::string& input = "") const {
+        std::string line = "set -o pipefail; " + (input.empty() ? "" : "echo '" + input + "' | ") +
+                           "'" + TAVRIX_CTL_PATH + "' --address='" + busAddress() + "'";
+        for (const std::string& argument : arguments) {
+            line += " '" + argument + "'";
+        }
+        line += " | /usr/bin/python3 -c 'import json, sys; answer = json.load(sys.stdin); print(" +
+                expression + ")'";
+        return runCommand({"/bin/bash", "-c", line});
+    }
 
     bool waitForNameOwner(std::chrono::milliseconds timeout = 10s) {
         return watcher_->waitUntil([this] { return !watcher_->nameOwner().empty(); }, timeout);

@@ -60,19 +60,6 @@ except dbus.exceptions.DBusException as error:
 print(json.dumps([bool(answer[0]), bool(answer[1]), str(answer[2])])))",
                            busAddress(), id, how, file.string()});
     }
-    // tavrixctl's answer with Python's expression applied to the parsed JSON as "answer"; the
-    // exit status is tavrixctl's.
-    CommandResult throughPython(const std::vector<std::string>& arguments,
-                                const std::string& expression) {
-        std::string line = "set -o pipefail; '" + std::string(TAVRIX_CTL_PATH) + "' --address='" +
-                           busAddress() + "'";
-        for (const std::string& argument : arguments) {
-            line += " '" + argument + "'";
-        }
-        line += " | /usr/bin/python3 -c 'import json, sys; answer = json.load(sys.stdin); print(" +
-                expression + ")'";
-        return runCommand({"/bin/bash", "-c", line});
-    }
 };
 
 // Read before any set, then a bundle by descriptor: the properties and GetAll agree with what
