@@ -69,23 +69,8 @@ class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInter
                 GTEST_SKIP() << tool << " is missing";
             }
         }
-        layOutAsPackaged();
-        daemon_ = userIn(at("/etc/passwd"), "tavrixservicesd");
-        mobile_ = userIn(at("/etc/passwd"), "mobile");
-        if (runCommand(asUser(daemon_, {"/usr/bin/test", "-x", TAVRIX_DAEMON_PATH})).status != 0) {
-            GTEST_SKIP() << "the daemon's user cannot reach " << TAVRIX_DAEMON_PATH;
-        }
-        fs::permissions(device().base(), fs::perms::others_read | fs::perms::others_exec,
-                        fs::perm_options::add);
-        ASSERT_EQ(::chown(device().runtimeDirectory().c_str(), daemon_.first, daemon_.second), 0);
-        daemonLaunchPrefix = asUser(daemon_, {});
-        prepareAttackerFiles();
-        BusFixture::SetUp();
-    }
-
-    // The device root as the package lays it out: its users and directories made by the
-    // packaged snippets, a system bundle of version 10 and a shared /tmp.
-    void layOutAsPackaged() {
+        // The device root as the package lays it out: its users and directories made by the
+        // packaged snippets, a system bundle of version 10 and a shared /tmp.
         fs::remove(at("/etc/passwd"));
         fs::remove_all(at("/var/mobile"));
         const std::string root = device().root().string();
@@ -99,11 +84,17 @@ class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInter
         fs::create_directories(at("/tmp"));
         fs::permissions(at("/tmp"), fs::perms::all | fs::perms::sticky_bit);
         writeBundle(at(kSystemBundle), "10", {{"CarrierName", "System"}});
-    }
-
-    // A bundle of version 99 and a packed one whose entries reach for the daemon's state
-    // directory, plus preferences the attacker would like the daemon to take.
-    void prepareAttackerFiles() {
+        daemon_ = userIn(at("/etc/passwd"), "tavrixservicesd");
+        mobile_ = userIn(at("/etc/passwd"), "mobile");
+        if (runCommand(asUser(daemon_, {"/usr/bin/test", "-x", TAVRIX_DAEMON_PATH})).status != 0) {
+            GTEST_SKIP() << "the daemon's user cannot reach " << TAVRIX_DAEMON_PATH;
+        }
+        fs::permissions(device().base(), fs::perms::others_read | fs::perms::others_exec,
+                        fs::perm_options::add);
+        ASSERT_EQ(::chown(device().runtimeDirectory().c_str(), daemon_.first, daemon_.second), 0);
+        daemonLaunchPrefix = asUser(daemon_, {});
+        // A bundle of version 99 and a packed one whose entries reach for the daemon's state
+        // directory, plus preferences the attacker would like the daemon to take.
         const fs::path evil = device().base() / "evil";
         writeBundle(evil / "Default.bundle", "99", {{"CarrierName", "PWNED"}});
         test::writeText(evil / "Default.bundle/PWNED", "x");
@@ -121,6 +112,7 @@ class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInter
                                            {"NextUpdate", plist::Date{2'000'000'000.0}}})));
         CommandResult opened = runCommand({"/bin/chmod", "-R", "a+rX", evil.string()});
         ASSERT_EQ(opened.status, 0) << opened.output;
+        BusFixture::SetUp();
     }
 
     // Once, or repeated until the file stop exists.

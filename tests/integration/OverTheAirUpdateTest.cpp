@@ -450,12 +450,9 @@ TEST_F(DurabilityProtocolTest, PayloadUpdateAndResetWriteInTheDurableOrder) {
     ASSERT_EQ(::kill(*pid, SIGTERM), 0);
     ASSERT_TRUE(pollUntil(
         [&] {
-            for (const test::DaemonLaunch& launch : daemonLaunches()) {
-                if (!launch.exitStatus) {
-                    return false;
-                }
-            }
-            return true;
+            const auto launches = daemonLaunches();
+            return std::all_of(launches.begin(), launches.end(),
+                               [](const auto& launch) { return launch.exitStatus.has_value(); });
         },
         30s));
 
