@@ -354,12 +354,6 @@ void replaceWithFifo(const fs::path& file) {
 const HostileCase kCases[] = {
     {"FifoAsCarrierFile", [](const fs::path& b) { replaceWithFifo(b / "behavior.plist"); }},
     {"FifoAsInfo", [](const fs::path& b) { replaceWithFifo(b / "Info.plist"); }},
-    {"DeepXmlCarrierFile",
-     [](const fs::path& b) { test::writeText(b / "behavior.plist", test::nestedXml(200000)); }},
-    {"DeepBinaryCarrierFile",
-     [](const fs::path& b) {
-         test::writeText(b / "behavior.plist", test::nestedBinaryList(30000, 1));
-     }},
     {"DeepBinaryInfo",
      [](const fs::path& b) {
          test::writeText(b / "Info.plist", test::nestedBinaryList(30000, 1));
