@@ -4,7 +4,6 @@
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <signal.h>
-#include <sys/statvfs.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -241,9 +240,7 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheNextOneInstallsAsTh
 
     if (smallHome.mounted) {
         // Room for the payload's extraction reserve was needed above; now leave 2 MB free.
-        struct statvfs space {};
-        ASSERT_EQ(::statvfs(home.c_str(), &space), 0);
-        const off_t filler = static_cast<off_t>(space.f_bavail * space.f_frsize) - (2 << 20);
+        const off_t filler = static_cast<off_t>(fs::space(home).available) - (2 << 20);
         io::UniqueFd fd(::open((home / "filler").c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600));
         ASSERT_TRUE(fd);
         ASSERT_EQ(::posix_fallocate(fd.get(), 0, filler), 0);
