@@ -214,16 +214,13 @@ void BusFixture::TearDown() {
 }
 
 std::optional<pid_t> BusFixture::daemonPid() {
-    sd_bus_message* reply = nullptr;
-    bus::BusError error;
-    if (sd_bus_call_method(watcher_->bus(), "org.freedesktop.DBus", "/org/freedesktop/DBus",
-                           "org.freedesktop.DBus", "GetConnectionUnixProcessID", error.get(),
-                           &reply, "s", kDaemonBusName) < 0) {
-        return std::nullopt;
-    }
-    bus::BusMessagePtr owned(reply);
-    std::uint32_t pid = 0;
-    return sd_bus_message_read(reply, "u", &pid) >= 0 ? std::optional<pid_t>(pid) : std::nullopt;
+    sd_bus_creds* creds = nullptr;
+    pid_t pid = 0;
+    const bool known =
+        sd_bus_get_name_creds(watcher_->bus(), kDaemonBusName, SD_BUS_CREDS_PID, &creds) >= 0 &&
+        sd_bus_creds_get_pid(creds, &pid) >= 0;
+    sd_bus_creds_unref(creds);
+    return known ? std::optional(pid) : std::nullopt;
 }
 
 std::optional<pid_t> BusFixture::stopDaemon(std::chrono::milliseconds timeout) {

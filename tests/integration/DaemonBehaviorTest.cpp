@@ -136,7 +136,7 @@ class DaemonPolicyTest : public BusFixture {
         ctl_ = directory / "tavrixctl";
         fs::copy_file(TAVRIX_CTL_PATH, ctl_);
         fs::copy_file(TAVRIX_CLIENT_LIBRARY_PATH, directory / TAVRIX_CLIENT_LIBRARY_NAME);
-        if (asNobody(kNobody, {"/usr/bin/test", "-x", ctl_.string()}).status != 0) {
+        if (runCommand(asUser({kNobody, kNobody}, {"/usr/bin/test", "-x", ctl_})).status != 0) {
             GTEST_SKIP() << "nobody cannot reach " << ctl_ << " (is $TMPDIR private?)";
         }
         // The packaged policy, with the daemon's user being whoever runs the tests (the bus starts
@@ -151,17 +151,12 @@ class DaemonPolicyTest : public BusFixture {
         BusFixture::SetUp();
     }
 
-    // command run as the user nobody with the given primary group and no other groups.
-    static CommandResult asNobody(gid_t gid, const std::vector<std::string>& command) {
-        return runCommand(asUser({kNobody, gid}, command));
-    }
-
     CommandResult tavrixctlAs(gid_t gid, const std::vector<std::string>& arguments) {
         std::vector<std::string> command = {"/usr/bin/env",
                                             "LD_LIBRARY_PATH=" + ctl_.parent_path().string(),
                                             ctl_.string(), "--address", busAddress()};
         command.insert(command.end(), arguments.begin(), arguments.end());
-        return asNobody(gid, command);
+        return runCommand(asUser({kNobody, gid}, command));
     }
 
     gid_t standInGid_ = 0;
@@ -181,7 +176,7 @@ TEST_F(DaemonPolicyTest, AnyoneMayAskButOnlyPrivilegedCallersMayChange) {
         "call org.freedesktop.DBus /org/freedesktop/DBus org.freedesktop.DBus RequestName su " +
         std::string(kDaemonBusName) + " 0");
 
-    auto refused = asNobody(kNobody, requestName);
+    auto refused = runCommand(asUser({kNobody, kNobody}, requestName));
     EXPECT_NE(refused.status, 0) << refused.output;
     EXPECT_THAT(refused.output, HasSubstr("Access denied"));
 
@@ -196,7 +191,7 @@ TEST_F(DaemonPolicyTest, AnyoneMayAskButOnlyPrivilegedCallersMayChange) {
         return busctl("emit /com/zandor/tavrixservicesd com.zandor.NotificationCenter Posted s " +
                       name);
     };
-    asNobody(kNobody, post("kTVXBehaviorBundleChangedNotification"));
+    runCommand(asUser({kNobody, kNobody}, post("kTVXBehaviorBundleChangedNotification")));
     EXPECT_EQ(runCommand(post("PolicyTestMarker")).status, 0);
     EXPECT_TRUE(watcher().waitForNotification("PolicyTestMarker", 1, std::chrono::seconds(10)));
     EXPECT_EQ(watcher().notificationCount("kTVXBehaviorBundleChangedNotification"), 0);
