@@ -4,7 +4,6 @@
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <signal.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cmath>
