@@ -7,7 +7,6 @@
 #include <iostream>
 #include <sstream>
 #include <stdexcept>
-#include <tuple>
 
 #include "plist/PropertyListFormat.h"
 
@@ -22,33 +21,19 @@ DeviceRoot::DeviceRoot() {
                         ":Mobile User:/var/mobile:/usr/sbin/nologin\n");
     fs::create_directories(path("/var/mobile/Library/Preferences"));
     fs::create_directories(runtimeDirectory());
-    setCellularRadio(false);
+    writeDeviceInfo();
 }
 
-void DeviceRoot::setSerialNumber(const std::string& serialNumber) {
-    serialNumber_ = serialNumber;
-    setCellularRadio(cellularRadio_);
-}
-
-void DeviceRoot::setCellularRadio(bool present) {
-    cellularRadio_ = present;
-    // Everything the device information service is asked for, so that no answer comes from the
-    // machine running the tests.
-    writePropertyList("/etc/tavrix/DeviceInfo.plist", {
-                                                          {"contains-cellular-radio", present},
-                                                          {"wi-fi", true},
-                                                          {"DeviceClass", "Tablet"},
-                                                          {"ProductType", "Tablet7,1"},
-                                                          {"ProductVersion", "9.1"},
-                                                          {"BuildVersion", "13B100"},
-                                                          {"ReleaseType", "User"},
-                                                          {"HWModelStr", "T71AP"},
-                                                          {"SerialNumber", serialNumber_},
-                                                      });
-}
-
-Result<plist::Value> DeviceRoot::readDaemonPreferences() const {
-    return plist::readFile(path(kDaemonPreferences).string());
+void DeviceRoot::writeDeviceInfo(bool cellularRadio, const std::string& serialNumber) {
+    writePropertyList("/etc/tavrix/DeviceInfo.plist", {{"contains-cellular-radio", cellularRadio},
+                                                       {"wi-fi", true},
+                                                       {"DeviceClass", "Tablet"},
+                                                       {"ProductType", "Tablet7,1"},
+                                                       {"ProductVersion", "9.1"},
+                                                       {"BuildVersion", "13B100"},
+                                                       {"ReleaseType", "User"},
+                                                       {"HWModelStr", "T71AP"},
+                                                       {"SerialNumber", serialNumber}});
 }
 
 void DeviceRoot::writePropertyList(std::string_view absolutePath, const plist::Dictionary& values) {
@@ -64,19 +49,16 @@ void DeviceRoot::writePropertyList(std::string_view absolutePath, const plist::D
 
 BusWatcher::BusWatcher(const std::string& address) : bus_(test::connectToBus(address)) {
     // The bus is new: nobody owns the name yet.
-    for (auto [slot, match, handler] :
-         {std::tuple{&ownerSlot_,
-                     "type='signal',sender='org.freedesktop.DBus',interface='org.freedesktop.DBus',"
-                     "member='NameOwnerChanged',arg0='com.zandor.tavrixservicesd'",
-                     &onNameOwnerChanged},
-          std::tuple{&postedSlot_,
-                     "type='signal',interface='com.zandor.NotificationCenter',member='Posted'",
-                     &onPosted},
-          std::tuple{&statusSlot_, "type='signal',path='/com/zandor/tavrixservicesd'",
-                     &onStatusSignal}}) {
+    for (auto [match, handler] :
+         {std::pair{"type='signal',sender='org.freedesktop.DBus',interface='org.freedesktop.DBus',"
+                    "member='NameOwnerChanged',arg0='com.zandor.tavrixservicesd'",
+                    &onNameOwnerChanged},
+          std::pair{"type='signal',interface='com.zandor.NotificationCenter',member='Posted'",
+                    &onPosted},
+          std::pair{"type='signal',path='/com/zandor/tavrixservicesd'", &onStatusSignal}}) {
         sd_bus_slot* made = nullptr;
         test::check(sd_bus_add_match(bus_.get(), &made, match, handler, this), "sd_bus_add_match");
-        slot->reset(made);
+        slots_.emplace_back(made);
     }
 }
 
@@ -232,16 +214,19 @@ void BusFixture::TearDown() {
 }
 
 std::optional<pid_t> BusFixture::daemonPid() {
-    sd_bus_message* reply = nullptr;
-    bus::BusError error;
-    if (sd_bus_call_method(watcher_->bus(), "org.freedesktop.DBus", "/org/freedesktop/DBus",
-                           "org.freedesktop.DBus", "GetConnectionUnixProcessID", error.get(),
-                           &reply, "s", kDaemonBusName) < 0) {
-        return std::nullopt;
-    }
-    bus::BusMessagePtr owned(reply);
-    std::uint32_t pid = 0;
-    return sd_bus_message_read(reply, "u", &pid) >= 0 ? std::optional<pid_t>(pid) : std::nullopt;
+    sd_bus_creds* creds = nullptr;
+    pid_t pid = 0;
+    const bool known =
+        sd_bus_get_name_creds(watcher_->bus(), kDaemonBusName, SD_BUS_CREDS_PID, &creds) >= 0 &&
+        sd_bus_creds_get_pid(creds, &pid) >= 0;
+    sd_bus_creds_unref(creds);
+    return known ? std::optional(pid) : std::nullopt;
+}
+
+std::optional<pid_t> BusFixture::stopDaemon(std::chrono::milliseconds timeout) {
+    const std::optional<pid_t> pid = daemonPid();
+    const bool left = pid && ::kill(*pid, SIGTERM) == 0 && waitForDaemonExit(*pid, timeout) == 0;
+    return left ? pid : std::nullopt;
 }
 
 std::string BusFixture::linkTarget(std::string_view absolutePath) const {
@@ -280,6 +265,17 @@ std::vector<std::uint8_t> BusFixture::pack(const fs::path& directory,
     EXPECT_EQ(packed.status, 0) << packed.output;
     const std::string bytes = test::readText(archive);
     return {bytes.begin(), bytes.end()};
+}
+
+fs::path BusFixture::writeVersionedBundle(const std::string& version, std::size_t bulkBytes) const {
+    const fs::path directory = device_.base() / ("bundles/" + version + "/Default.bundle");
+    writeBundle(directory, version, {{"CarrierName", "Bundle " + version}},
+                {{"Resources/only-in-" + version + ".txt", version}});
+    if (bulkBytes > 0) {
+        test::writeText(directory / "Resources/bulk.bin",
+                        test::randomBytes(bulkBytes, std::hash<std::string>()(version)));
+    }
+    return directory;
 }
 
 test::LocalHttpServer& BusFixture::catalogServer() {

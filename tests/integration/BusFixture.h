@@ -74,13 +74,17 @@ class DeviceRoot {
         return root() / std::filesystem::path(absolutePath).relative_path();
     }
 
-    void setCellularRadio(bool present);
-    void setSerialNumber(const std::string& serialNumber);
+    // Everything the device information service is asked for, so that no answer comes from the
+    // machine running the tests.
+    void writeDeviceInfo(bool cellularRadio = false,
+                         const std::string& serialNumber = "TESTSERIAL01");
     // The daemon's own preferences and the behavior settings domain of the mobile user.
     void writeDaemonPreferences(const plist::Dictionary& values) {
         writePropertyList(kDaemonPreferences, values);
     }
-    Result<plist::Value> readDaemonPreferences() const;
+    Result<plist::Value> readDaemonPreferences() const {
+        return plist::readFile(path(kDaemonPreferences).string());
+    }
     // One key of the daemon's preferences, or nothing.
     std::optional<plist::Value> daemonPreference(const std::string& key) const {
         auto preferences = readDaemonPreferences();
@@ -100,8 +104,6 @@ class DeviceRoot {
     void writePropertyList(std::string_view absolutePath, const plist::Dictionary& values);
 
     test::TempDir base_;
-    bool cellularRadio_ = false;
-    std::string serialNumber_ = "TESTSERIAL01";
 };
 
 // The test's own connection: who owns the daemon's name, which notifications were posted, and the
@@ -143,9 +145,7 @@ class BusWatcher {
     std::optional<nlohmann::json> takeStatusSignal(bool checkFinished);
 
     bus::BusPtr bus_;
-    bus::BusSlotPtr ownerSlot_;
-    bus::BusSlotPtr postedSlot_;
-    bus::BusSlotPtr statusSlot_;
+    std::vector<bus::BusSlotPtr> slots_;
     std::string owner_;
     int releases_ = 0;
     std::map<std::string, int> notifications_;
@@ -173,6 +173,10 @@ class BusFixture : public ::testing::Test {
     // The directory's content packed by bsdtar with these options, as a sender packs a bundle.
     std::vector<std::uint8_t> pack(const std::filesystem::path& directory,
                                    const std::vector<std::string>& options = {"-z"}) const;
+    // A bundle of this version under the test's directory: "Bundle <version>" its carrier name,
+    // one file of its own and, when asked, a large file of bulkBytes that does not compress.
+    std::filesystem::path writeVersionedBundle(const std::string& version,
+                                               std::size_t bulkBytes = 0) const;
     // The catalog site the device trusts, made on first use: a signing key of its own, the site
     // directory served on 127.0.0.1 under /updates/, and the device's catalog settings naming it
     // with the key in the single-key form.
@@ -197,6 +201,20 @@ class BusFixture : public ::testing::Test {
         arguments.insert(arguments.begin(), {TAVRIX_CTL_PATH, "--address", busAddress()});
         return runCommand(arguments);
     }
+    // tavrixctl's answer, with the line input (if any) as its standard input, and Python's
+    // expression applied to the parsed JSON as "answer"; the exit status is tavrixctl's.
+    CommandResult throughPython(const std::vector<std::string>& arguments,
+                                const std::string& expression,
+                                const std::string& input = "") const {
+        std::string line = "set -o pipefail; " + (input.empty() ? "" : "echo '" + input + "' | ") +
+                           "'" + TAVRIX_CTL_PATH + "' --address='" + busAddress() + "'";
+        for (const std::string& argument : arguments) {
+            line += " '" + argument + "'";
+        }
+        line += " | /usr/bin/python3 -c 'import json, sys; answer = json.load(sys.stdin); print(" +
+                expression + ")'";
+        return runCommand({"/bin/bash", "-c", line});
+    }
 
     bool waitForNameOwner(std::chrono::milliseconds timeout = 10s) {
         return watcher_->waitUntil([this] { return !watcher_->nameOwner().empty(); }, timeout);
@@ -206,11 +224,13 @@ class BusFixture : public ::testing::Test {
     }
     // The process that owns the daemon's name now.
     std::optional<pid_t> daemonPid();
+    // SIGTERM to the daemon that owns the name: its pid once it has left with 0, else nothing.
+    std::optional<pid_t> stopDaemon(std::chrono::milliseconds timeout = 10s);
 
     // The log's lines, in order.
     std::vector<std::string> daemonLogLines() const;
-    // How often line appears in the log as a whole line, or contains text.
-    int countLogLines(const std::string& line) const { return countLogLines(line, true); }
+    // How often text is a whole line of the log, or (whole false) part of one.
+    int countLogLines(const std::string& text, bool whole = true) const;
     int countLogLinesContaining(const std::string& text) const {
         return countLogLines(text, false);
     }
@@ -231,8 +251,6 @@ class BusFixture : public ::testing::Test {
     std::vector<std::string> daemonLaunchPrefix;
 
   private:
-    int countLogLines(const std::string& text, bool whole) const;
-
     DeviceRoot device_;
     std::set<pid_t> killed_;
     std::unique_ptr<test::PrivateBus> bus_;

@@ -18,13 +18,15 @@
 namespace tavrix::integration {
 namespace {
 
+namespace fs = std::filesystem;
 using DaemonBehaviorTest = BusFixture;
 using ::testing::HasSubstr;
 using ::testing::Not;
 
 // An ID longer than the limit, or one that cannot be written, is refused: the client hears NO, and
-// the stored ID is what the status view, the next call and the next launch see.
-TEST_F(DaemonBehaviorTest, IdsThatCannotBeStoredAreRefusedAndTheStoredOneStays) {
+// the stored ID is what the status view, the next call and the next launch see. EnableSupport
+// decides support once an ID is set, and with it the behavior settings.
+TEST_F(DaemonBehaviorTest, IdsThatCannotBeStoredAreRefusedAndEnableSupportDecidesSupport) {
     device().writeDaemonPreferences({{"TavrixID", "abc"}, {"EnableSupport", true}});
     auto caller = client();
     EXPECT_FALSE(caller.setTavrixID(std::string(1025, 'x'), std::nullopt));
@@ -47,7 +49,7 @@ except dbus.DBusException as error:
 
     // A directory where the lock file goes fails the write, as a full disk would.
     const auto lock = at("/var/mobile/Library/Preferences/.com.zandor.tavrixservices.plist.lock");
-    std::filesystem::remove(lock);
+    fs::remove(lock);
     test::writeText(lock / "in-the-way", "");
     // Asked with a bundle by descriptor, the caller also hears why nothing was extracted.
     const auto payloadFile = device().base() / "payload";
@@ -60,16 +62,14 @@ except dbus.DBusException as error:
     EXPECT_EQ(*status.find("BehaviorID"), plist::Value("abc"));
     EXPECT_TRUE(caller.isTavrixBundleSupported());
 
-    std::filesystem::remove_all(lock);
+    fs::remove_all(lock);
     // An empty bundle is no failure.
     EXPECT_TRUE(caller.setTavrixID(std::string(1024, 'y'), std::vector<std::uint8_t>{}));
     EXPECT_EQ(device().daemonPreference("TavrixID"),
               std::optional<plist::Value>(std::string(1024, 'y')));
-}
 
-// Behavior settings (any value, as it is in the file) are read exactly while supported. Everything
-// else in place, a cellular radio alone refuses the ID and supports nothing.
-TEST_F(DaemonBehaviorTest, EnableSupportDecidesSupportOnceAnIdIsSetAndWithItTheSettings) {
+    // Behavior settings (any value, as it is in the file) are read exactly while supported.
+    // Everything else in place, a cellular radio alone refuses the ID and supports nothing.
     const plist::Value limits(plist::Dictionary{{"daily", 10}, {"since", plist::Date{123456}}});
     device().writeBehaviorSettings({{"Limits", limits}});
     const std::tuple<const char*, std::optional<plist::Value>, bool, bool> cases[] = {
@@ -80,9 +80,6 @@ TEST_F(DaemonBehaviorTest, EnableSupportDecidesSupportOnceAnIdIsSetAndWithItTheS
         {"the integer 0", plist::Value(0), true, true},
         {"true without an ID", plist::Value(true), false, false},
     };
-    auto caller = client();
-    // Started first, so that each case's preferences are read by a running daemon.
-    ASSERT_TRUE(caller.setClientType(0));
     for (const auto& [what, enableSupport, withID, supported] : cases) {
         plist::Dictionary preferences;
         if (enableSupport) {
@@ -99,7 +96,7 @@ TEST_F(DaemonBehaviorTest, EnableSupportDecidesSupportOnceAnIdIsSetAndWithItTheS
     }
 
     device().writeDaemonPreferences({{"TavrixID", "abc"}, {"EnableSupport", true}});
-    device().setCellularRadio(true);
+    device().writeDeviceInfo(true);
     EXPECT_FALSE(caller.setTavrixID("xyz", std::nullopt));
     EXPECT_EQ(device().daemonPreference("TavrixID"), std::optional<plist::Value>("abc"));
     EXPECT_FALSE(caller.isTavrixBundleSupported());
@@ -131,43 +128,27 @@ class DaemonPolicyTest : public BusFixture {
             GTEST_SKIP() << "no group \"" << kStandInGroup << "\" to stand in for \"tavrix\"";
         }
         standInGid_ = standIn->gr_gid;
-        copyClientForOthers();
-        if (asNobody(kNobody, {"/usr/bin/test", "-x", ctl_.string()}).status != 0) {
-            GTEST_SKIP() << "nobody cannot reach " << ctl_ << " (is $TMPDIR private?)";
-        }
-        policyFile = adaptedPolicy();
-        BusFixture::SetUp();
-    }
-
-    // The packaged policy, with the daemon's user being whoever runs the tests (the bus starts
-    // the daemon as that user) and the stand-in group for "tavrix".
-    std::filesystem::path adaptedPolicy() {
-        std::string policy = test::readText(TAVRIX_POLICY_PATH);
-        const passwd* self = ::getpwuid(::geteuid());
-        policy = replaceOnce(policy, "user=\"tavrixservicesd\"",
-                             std::string("user=\"") + self->pw_name + "\"");
-        policy =
-            replaceOnce(policy, "group=\"tavrix\"", std::string("group=\"") + kStandInGroup + "\"");
-        std::filesystem::path path = device().base() / "policy.conf";
-        test::writeText(path, policy);
-        return path;
-    }
-
-    // tavrixctl and the client library in a directory anyone may enter; the library path
-    // comes first, so the copy never reaches back into the build tree.
-    void copyClientForOthers() {
-        namespace fs = std::filesystem;
+        // tavrixctl and the client library in a directory anyone may enter; the library path
+        // comes first, so the copy never reaches back into the build tree.
         const fs::path directory = clientCopy_.path();
         fs::permissions(directory, fs::perms::others_read | fs::perms::others_exec,
                         fs::perm_options::add);
         ctl_ = directory / "tavrixctl";
         fs::copy_file(TAVRIX_CTL_PATH, ctl_);
         fs::copy_file(TAVRIX_CLIENT_LIBRARY_PATH, directory / TAVRIX_CLIENT_LIBRARY_NAME);
-    }
-
-    // command run as the user nobody with the given primary group and no other groups.
-    static CommandResult asNobody(gid_t gid, const std::vector<std::string>& command) {
-        return runCommand(asUser({kNobody, gid}, command));
+        if (runCommand(asUser({kNobody, kNobody}, {"/usr/bin/test", "-x", ctl_})).status != 0) {
+            GTEST_SKIP() << "nobody cannot reach " << ctl_ << " (is $TMPDIR private?)";
+        }
+        // The packaged policy, with the daemon's user being whoever runs the tests (the bus starts
+        // the daemon as that user) and the stand-in group for "tavrix".
+        std::string policy = test::readText(TAVRIX_POLICY_PATH);
+        policy = replaceOnce(policy, "user=\"tavrixservicesd\"",
+                             std::string("user=\"") + ::getpwuid(::geteuid())->pw_name + "\"");
+        policy =
+            replaceOnce(policy, "group=\"tavrix\"", std::string("group=\"") + kStandInGroup + "\"");
+        policyFile = device().base() / "policy.conf";
+        test::writeText(*policyFile, policy);
+        BusFixture::SetUp();
     }
 
     CommandResult tavrixctlAs(gid_t gid, const std::vector<std::string>& arguments) {
@@ -175,12 +156,12 @@ class DaemonPolicyTest : public BusFixture {
                                             "LD_LIBRARY_PATH=" + ctl_.parent_path().string(),
                                             ctl_.string(), "--address", busAddress()};
         command.insert(command.end(), arguments.begin(), arguments.end());
-        return asNobody(gid, command);
+        return runCommand(asUser({kNobody, gid}, command));
     }
 
     gid_t standInGid_ = 0;
     test::TempDir clientCopy_;
-    std::filesystem::path ctl_;
+    fs::path ctl_;
 };
 
 TEST_F(DaemonPolicyTest, AnyoneMayAskButOnlyPrivilegedCallersMayChange) {
@@ -195,7 +176,7 @@ TEST_F(DaemonPolicyTest, AnyoneMayAskButOnlyPrivilegedCallersMayChange) {
         "call org.freedesktop.DBus /org/freedesktop/DBus org.freedesktop.DBus RequestName su " +
         std::string(kDaemonBusName) + " 0");
 
-    auto refused = asNobody(kNobody, requestName);
+    auto refused = runCommand(asUser({kNobody, kNobody}, requestName));
     EXPECT_NE(refused.status, 0) << refused.output;
     EXPECT_THAT(refused.output, HasSubstr("Access denied"));
 
@@ -210,7 +191,7 @@ TEST_F(DaemonPolicyTest, AnyoneMayAskButOnlyPrivilegedCallersMayChange) {
         return busctl("emit /com/zandor/tavrixservicesd com.zandor.NotificationCenter Posted s " +
                       name);
     };
-    asNobody(kNobody, post("kTVXBehaviorBundleChangedNotification"));
+    runCommand(asUser({kNobody, kNobody}, post("kTVXBehaviorBundleChangedNotification")));
     EXPECT_EQ(runCommand(post("PolicyTestMarker")).status, 0);
     EXPECT_TRUE(watcher().waitForNotification("PolicyTestMarker", 1, std::chrono::seconds(10)));
     EXPECT_EQ(watcher().notificationCount("kTVXBehaviorBundleChangedNotification"), 0);

@@ -75,9 +75,6 @@ std::vector<Call> parseTrace(const std::string& trace) {
         }
         const std::string thread = line.substr(0, space);
         std::string text = line.substr(line.find_first_not_of(' ', space));
-        if (text.starts_with("+++") || text.starts_with("---")) {
-            continue;
-        }
         constexpr std::string_view kUnfinished = " <unfinished ...>";
         if (text.ends_with(kUnfinished)) {
             unfinished[thread] = text.substr(0, text.size() - kUnfinished.size());
@@ -171,7 +168,7 @@ class Checker {
         } else if (name == "openat") {
             opened(call, decoratedPath(call.result), argument(call, 2));
         } else if (name == "write" || name == "pwrite64" || name == "writev" || name == "pwritev" ||
-                   name == "pwritev2" || name == "ftruncate") {
+                   name == "pwritev2" || name == "ftruncate" || name == "sendfile") {
             // The daemon's own output (the log) is no file it keeps.
             if (argument(call, 0).starts_with("1<") || argument(call, 0).starts_with("2<")) {
                 return;
@@ -181,8 +178,6 @@ class Checker {
             written(call, quotedText(argument(call, 0)));
         } else if (name == "copy_file_range") {
             written(call, decoratedPath(argument(call, 2)));
-        } else if (name == "sendfile") {
-            written(call, decoratedPath(argument(call, 0)));
         } else if (name == "fsync" || name == "fdatasync") {
             flushed(call, decoratedPath(argument(call, 0)));
         } else if (name == "sync" || name == "syncfs") {

@@ -4,7 +4,6 @@
 // relaunches and a signed update installs. Starting processes as other users needs root.
 #include <gmock/gmock.h>
 #include <pwd.h>
-#include <signal.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -70,23 +69,8 @@ class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInter
                 GTEST_SKIP() << tool << " is missing";
             }
         }
-        layOutAsPackaged();
-        daemon_ = userIn(at("/etc/passwd"), "tavrixservicesd");
-        mobile_ = userIn(at("/etc/passwd"), "mobile");
-        if (runCommand(asUser(daemon_, {"/usr/bin/test", "-x", TAVRIX_DAEMON_PATH})).status != 0) {
-            GTEST_SKIP() << "the daemon's user cannot reach " << TAVRIX_DAEMON_PATH;
-        }
-        fs::permissions(device().base(), fs::perms::others_read | fs::perms::others_exec,
-                        fs::perm_options::add);
-        ASSERT_EQ(::chown(device().runtimeDirectory().c_str(), daemon_.first, daemon_.second), 0);
-        daemonLaunchPrefix = asUser(daemon_, {});
-        prepareAttackerFiles();
-        BusFixture::SetUp();
-    }
-
-    // The device root as the package lays it out: its users and directories made by the
-    // packaged snippets, a system bundle of version 10 and a shared /tmp.
-    void layOutAsPackaged() {
+        // The device root as the package lays it out: its users and directories made by the
+        // packaged snippets, a system bundle of version 10 and a shared /tmp.
         fs::remove(at("/etc/passwd"));
         fs::remove_all(at("/var/mobile"));
         const std::string root = device().root().string();
@@ -100,11 +84,17 @@ class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInter
         fs::create_directories(at("/tmp"));
         fs::permissions(at("/tmp"), fs::perms::all | fs::perms::sticky_bit);
         writeBundle(at(kSystemBundle), "10", {{"CarrierName", "System"}});
-    }
-
-    // A bundle of version 99 and a packed one whose entries reach for the daemon's state
-    // directory, plus preferences the attacker would like the daemon to take.
-    void prepareAttackerFiles() {
+        daemon_ = userIn(at("/etc/passwd"), "tavrixservicesd");
+        mobile_ = userIn(at("/etc/passwd"), "mobile");
+        if (runCommand(asUser(daemon_, {"/usr/bin/test", "-x", TAVRIX_DAEMON_PATH})).status != 0) {
+            GTEST_SKIP() << "the daemon's user cannot reach " << TAVRIX_DAEMON_PATH;
+        }
+        fs::permissions(device().base(), fs::perms::others_read | fs::perms::others_exec,
+                        fs::perm_options::add);
+        ASSERT_EQ(::chown(device().runtimeDirectory().c_str(), daemon_.first, daemon_.second), 0);
+        daemonLaunchPrefix = asUser(daemon_, {});
+        // A bundle of version 99 and a packed one whose entries reach for the daemon's state
+        // directory, plus preferences the attacker would like the daemon to take.
         const fs::path evil = device().base() / "evil";
         writeBundle(evil / "Default.bundle", "99", {{"CarrierName", "PWNED"}});
         test::writeText(evil / "Default.bundle/PWNED", "x");
@@ -122,6 +112,7 @@ class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInter
                                            {"NextUpdate", plist::Date{2'000'000'000.0}}})));
         CommandResult opened = runCommand({"/bin/chmod", "-R", "a+rX", evil.string()});
         ASSERT_EQ(opened.status, 0) << opened.output;
+        BusFixture::SetUp();
     }
 
     // Once, or repeated until the file stop exists.
@@ -133,12 +124,6 @@ class MobileHomeAttackTest : public BusFixture, public ::testing::WithParamInter
                              (stop ? "while [ ! -e '" + stop->string() + "' ]; do " : "") +
                              GetParam().script + (stop ? "; sleep 0.05; done" : "");
         return runCommand(asUser(mobile_, {"/bin/sh", "-c", "exec 2>/dev/null; " + script}));
-    }
-
-    void setIDWithBundle(const std::string& version) {
-        const fs::path bundle = device().base() / ("bundles/" + version + "/Default.bundle");
-        writeBundle(bundle, version, {{"CarrierName", "Bundle " + version}});
-        ASSERT_TRUE(client().setTavrixID("ACME.default", pack(bundle)));
     }
 
     // Both links are the daemon's own and lead into the user bundle of this version.
@@ -190,8 +175,8 @@ TEST_P(MobileHomeAttackTest, TheDaemonInstallsAndTrustsOnlyItsOwn) {
     auto repeated =
         std::make_unique<RepeatedAttack>(stop, std::jthread([this, stop] { attack(stop); }));
 
-    setIDWithBundle("11");
-    setIDWithBundle("12");
+    ASSERT_TRUE(client().setTavrixID("ACME.default", pack(writeVersionedBundle("11"))));
+    ASSERT_TRUE(client().setTavrixID("ACME.default", pack(writeVersionedBundle("12"))));
     const std::string payloadVersion = GetParam().blocksPayloads ? "10" : "12";
     expectLinked(payloadVersion);
     // No support the device's configuration did not give, no update date of the attacker's.
@@ -206,10 +191,7 @@ TEST_P(MobileHomeAttackTest, TheDaemonInstallsAndTrustsOnlyItsOwn) {
         EXPECT_THAT(*payload->find("Reason")->asString(), HasSubstr("could not be staged"));
     }
 
-    std::optional<pid_t> pid = daemonPid();
-    ASSERT_TRUE(pid);
-    ::kill(*pid, SIGTERM);
-    ASSERT_TRUE(waitForDaemonExit(*pid));
+    ASSERT_TRUE(stopDaemon());
     client().isTavrixBundleSupported();
     expectLinked(payloadVersion);
 
@@ -220,9 +202,7 @@ TEST_P(MobileHomeAttackTest, TheDaemonInstallsAndTrustsOnlyItsOwn) {
         stored && stored->asDictionary() ? *stored->asDictionary() : plist::Dictionary();
     values.insert_or_assign("EnableSupport", true);
     device().writeDaemonPreferences(values);
-    const fs::path bundle = device().base() / "bundles/13/Default.bundle";
-    writeBundle(bundle, "13", {{"CarrierName", "Bundle 13"}});
-    publishSigned(bundle);
+    publishSigned(writeVersionedBundle("13"));
     client().checkForTavrixBundleUpdate();
     // The carrier file link follows the bundle link: both must have moved.
     EXPECT_TRUE(

@@ -4,8 +4,6 @@
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <signal.h>
-#include <sys/statvfs.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <cmath>
@@ -38,6 +36,8 @@ using ::testing::StartsWith;
 constexpr const char* kAssetCache = "/var/cache/tavrixservicesd/com.zandor.Grellas.TavrixBundles";
 constexpr const char* kBehaviorID = "acme.default";
 constexpr const char* kPendingInstall = "/var/lib/tavrixservicesd/pending-install.plist";
+// Logged once a check's download is done with, installed or not.
+constexpr const char* kPurged = "Best candidate asset has been purged";
 
 constexpr double kOneDay = 86400.0;
 constexpr double kFifteenDays = 1296000.0;
@@ -53,26 +53,13 @@ class OverTheAirUpdateTest : public BusFixture {
 
     static double now() { return Clock::absoluteTimeNow(); }
 
-    // A bundle: its Info.plist, the base carrier file naming the version, one file of its own and,
-    // when asked, a large file of bulkBytes that does not compress.
-    fs::path writeBundle(const std::string& version, std::size_t bulkBytes = 0) {
-        const fs::path directory = device().base() / ("bundles/" + version + "/Default.bundle");
-        test::writeBundle(directory, version, {{"CarrierName", "Bundle " + version}},
-                          {{"Resources/only-in-" + version + ".txt", version}});
-        if (bulkBytes > 0) {
-            writeText(directory / "Resources/bulk.bin",
-                      test::randomBytes(bulkBytes, std::hash<std::string>()(version)));
-        }
-        return directory;
-    }
-
     void setIDWithBundle(const std::string& version) {
-        ASSERT_TRUE(client().setTavrixID(kBehaviorID, pack(writeBundle(version))));
+        ASSERT_TRUE(client().setTavrixID(kBehaviorID, pack(writeVersionedBundle(version))));
     }
 
     // Answers the archive's URL path.
     std::string publish(const std::string& version, std::size_t bulkBytes = 0) {
-        return publishSigned(writeBundle(version, bulkBytes));
+        return publishSigned(writeVersionedBundle(version, bulkBytes));
     }
 
     test::Tree userBundleFiles() { return test::snapshotTree(at(kUserBundle)); }
@@ -212,10 +199,7 @@ TEST_F(OverTheAirUpdateTest, StatusViewFollowsEachStepAndOutlivesTheDaemon) {
               nlohmann::json({"catalog-refused", textAt(check, "Reason")}));
     EXPECT_TRUE(waitForNextUpdateIn(kFifteenDays, 1s)) << "a refused catalog re-arms nothing";
     // What the daemon recorded is still there after it left and was started again.
-    const auto pid = daemonPid();
-    ASSERT_TRUE(pid);
-    ::kill(*pid, SIGTERM);
-    EXPECT_EQ(waitForDaemonExit(*pid, 90s), std::optional<int>(0));
+    ASSERT_TRUE(stopDaemon(90s));
     expectFields(tavrixctlJson({"status"}),
                  {{"LastCheck.Outcome", "catalog-refused"}, {"LinkedBundle.Version", "2"}});
 }
@@ -235,7 +219,6 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheNextOneInstallsAsTh
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
     const auto installedFiles = userBundleFiles();
     const std::string carrierFile = linkTarget(kPreferencesLink);
-    constexpr const char* kPurged = "Best candidate asset has been purged";
     auto expectNothingChanged = [&](const std::string& waitedLine, int seen, double rearmedIn) {
         EXPECT_TRUE(client().checkForTavrixBundleUpdate());
         EXPECT_TRUE(waitForLogLine(waitedLine, 30s, seen + 1));
@@ -256,9 +239,7 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheNextOneInstallsAsTh
 
     if (smallHome.mounted) {
         // Room for the payload's extraction reserve was needed above; now leave 2 MB free.
-        struct statvfs space {};
-        ASSERT_EQ(::statvfs(home.c_str(), &space), 0);
-        const off_t filler = static_cast<off_t>(space.f_bavail * space.f_frsize) - (2 << 20);
+        const off_t filler = static_cast<off_t>(fs::space(home).available) - (2 << 20);
         io::UniqueFd fd(::open((home / "filler").c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600));
         ASSERT_TRUE(fd);
         ASSERT_EQ(::posix_fallocate(fd.get(), 0, filler), 0);
@@ -298,7 +279,6 @@ TEST_F(OverTheAirUpdateTest, FailedUpdatesChangeNothingAndTheNextOneInstallsAsTh
 // from the cached download or the next check installs it; nothing is left in the cache.
 TEST_F(OverTheAirUpdateTest, KilledAnywhereInAnUpdateTheNextLaunchCompletesOrRedoesIt) {
     constexpr std::size_t kBulk = 2 << 20;
-    constexpr const char* kPurged = "Best candidate asset has been purged";
     setIDWithBundle("1");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
     publish("2", kBulk);
@@ -311,6 +291,8 @@ TEST_F(OverTheAirUpdateTest, KilledAnywhereInAnUpdateTheNextLaunchCompletesOrRed
     const unsigned seed = static_cast<unsigned>(std::random_device{}());
     SCOPED_TRACE("seed " + std::to_string(seed));
     std::mt19937 random(seed);
+    std::uniform_int_distribution<std::int64_t> pause(
+        0, std::chrono::duration_cast<std::chrono::microseconds>(updateTime * 5 / 4).count());
     std::map<std::string, int> statesFound;
     for (int iteration = 0; iteration < iterations; ++iteration) {
         const std::string version = std::to_string(iteration + 3);
@@ -319,11 +301,7 @@ TEST_F(OverTheAirUpdateTest, KilledAnywhereInAnUpdateTheNextLaunchCompletesOrRed
         auto pid = daemonPid();
         ASSERT_TRUE(pid);
         EXPECT_TRUE(client().checkForTavrixBundleUpdate());
-        std::this_thread::sleep_for(
-            std::uniform_int_distribution<std::int64_t>(
-                0, std::chrono::duration_cast<std::chrono::microseconds>(updateTime).count() * 5 /
-                       4)(random) *
-            1us);
+        std::this_thread::sleep_for(pause(random) * 1us);
         ASSERT_TRUE(killDaemon(*pid));
         const bool marked = fs::exists(device().path(kPendingInstall));
         ++statesFound[linkedVersion() == version ? "installed"
@@ -377,7 +355,7 @@ TEST_F(OverTheAirUpdateTest, DaemonStartedWhileTheLastOneDrainsActsAfterIt) {
         ASSERT_EQ(::kill(*pid, SIGTERM), 0);
         ASSERT_TRUE(waitForNoNameOwner());
 
-        const std::vector<std::uint8_t> packed = pack(writeBundle(payload, kBulk));
+        const std::vector<std::uint8_t> packed = pack(writeVersionedBundle(payload, kBulk));
         auto answer = std::async(std::launch::async, [&] {
             if (round % 2 == 0) {
                 return client().setTavrixID(kBehaviorID, packed);
@@ -393,13 +371,7 @@ TEST_F(OverTheAirUpdateTest, DaemonStartedWhileTheLastOneDrainsActsAfterIt) {
         EXPECT_TRUE(client().isTavrixBundleSupported());
         expectFields(tavrixctlJson({"status"}),
                      {{"WaitingForPreviousDaemon", "true"}, {"LinkedBundle", "(absent)"}});
-        char* versionProperty = nullptr;
-        ASSERT_GE(sd_bus_get_property_string(watcher().bus(), kDaemonBusName, kDaemonObjectPath,
-                                             kStatusInterface, "LinkedBundleVersion", nullptr,
-                                             &versionProperty),
-                  0);
-        EXPECT_STREQ(versionProperty, "");
-        std::free(versionProperty);
+        EXPECT_EQ(tavrixctl({"show", "-p", "LinkedBundleVersion", "--value"}).output, "\n");
         server.releaseHeldResponses();
         EXPECT_TRUE(answer.get());
         ASSERT_EQ(waitForDaemonExit(*pid, 70s), std::optional<int>(0));
@@ -455,7 +427,7 @@ TEST_F(DurabilityProtocolTest, PayloadUpdateAndResetWriteInTheDurableOrder) {
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 10s));
     publish("2");
     ASSERT_TRUE(client().checkForTavrixBundleUpdate());
-    ASSERT_TRUE(waitForLogLine("Best candidate asset has been purged", 30s));
+    ASSERT_TRUE(waitForLogLine(kPurged, 30s));
     EXPECT_EQ(linkedVersion(), "2");
     test::writeBundle(at(kSystemBundle), "9", {{"CarrierName", "System"}});
     ASSERT_TRUE(client().setTavrixID("acme.other", std::nullopt));
@@ -468,12 +440,9 @@ TEST_F(DurabilityProtocolTest, PayloadUpdateAndResetWriteInTheDurableOrder) {
     ASSERT_EQ(::kill(*pid, SIGTERM), 0);
     ASSERT_TRUE(pollUntil(
         [&] {
-            for (const test::DaemonLaunch& launch : daemonLaunches()) {
-                if (!launch.exitStatus) {
-                    return false;
-                }
-            }
-            return true;
+            const auto launches = daemonLaunches();
+            return std::all_of(launches.begin(), launches.end(),
+                               [](const auto& launch) { return launch.exitStatus.has_value(); });
         },
         30s));
 
@@ -500,10 +469,7 @@ class OverTheAirKeepAliveTest : public OverTheAirUpdateTest {
 TEST_F(OverTheAirKeepAliveTest, ScheduledCheckKeepsTheDaemonUntilTheDownloadIsInstalled) {
     setIDWithBundle("1");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
-    auto first = daemonPid();
-    ASSERT_TRUE(first);
-    ASSERT_EQ(::kill(*first, SIGTERM), 0);
-    ASSERT_EQ(waitForDaemonExit(*first), std::optional<int>(0));
+    ASSERT_TRUE(stopDaemon());
 
     const std::string archive = publish("2");
     holdPublished(archive, 1.0 / 3);
@@ -632,25 +598,19 @@ TEST_F(ReleaseTrainTest, TheDocumentedReleaseTrainRunsAgainstADevice) {
     const fs::path base = device().base();
     setIDWithBundle("1");
     ASSERT_TRUE(watcher().waitForNotification(kChanged, 1, 5s));
-    writeBundle("2");
-    writeBundle("3");
+    writeVersionedBundle("2");
+    writeVersionedBundle("3");
 
     runStep("keygen");
     trustKeys({{"release-2026", base / "release-2026.pub"}});
     runStep("publish");
-    // The device of the bucket step, whose bucket the documented formula gives.
+    // The device of the bucket step: 37 by the documented formula (the SHA-256 of "TX-00002\n2").
     const std::string bucketBlock = steps_[2].second;
     const std::string serialNumber =
         bucketBlock.substr(bucketBlock.find("bucket ") + 7,
                            bucketBlock.find(" 2\n") - bucketBlock.find("bucket ") - 7);
-    device().setSerialNumber(serialNumber);
-    CommandResult formula = runCommand(
-        {"/usr/bin/python3", "-c",
-         "import hashlib, sys; d = hashlib.sha256((sys.argv[1] + '\\n2').encode()).digest(); "
-         "print(int.from_bytes(d[:8], 'big') % 100)",
-         serialNumber});
-    EXPECT_EQ(runStep("bucket"), formula.output);
-    EXPECT_EQ(formula.output, "37\n") << "the train needs a device between 5 and 50 %";
+    device().writeDeviceInfo(false, serialNumber);
+    EXPECT_EQ(runStep("bucket"), "37\n") << "the train needs a device between 5 and 50 %";
     expectFields(tavrixctlJson({"check-update"}),
                  {{"Outcome", "held-back"},
                   {"Reason",
@@ -699,10 +659,7 @@ TEST_F(ReleaseTrainTest, TheDocumentedReleaseTrainRunsAgainstADevice) {
     // fresh one reads version 2 from the link.)
     setIDWithBundle("2");
     ASSERT_EQ(linkedVersion(), "2");
-    const auto pid = daemonPid();
-    ASSERT_TRUE(pid);
-    ::kill(*pid, SIGTERM);
-    ASSERT_EQ(waitForDaemonExit(*pid, 90s), std::optional<int>(0));
+    ASSERT_TRUE(stopDaemon(90s));
     EXPECT_EQ(checkReason(), "up to date (version 2 installed)");
     EXPECT_TRUE(fs::exists(site() / archive3)) << "the previous catalog still names it";
 

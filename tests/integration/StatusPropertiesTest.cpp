@@ -60,26 +60,6 @@ except dbus.exceptions.DBusException as error:
 print(json.dumps([bool(answer[0]), bool(answer[1]), str(answer[2])])))",
                            busAddress(), id, how, file.string()});
     }
-    // tavrixctl's answer with Python's expression applied to the parsed JSON as "answer"; the
-    // exit status is tavrixctl's.
-    CommandResult throughPython(const std::vector<std::string>& arguments,
-                                const std::string& expression) {
-        std::string line = "set -o pipefail; '" + std::string(TAVRIX_CTL_PATH) + "' --address='" +
-                           busAddress() + "'";
-        for (const std::string& argument : arguments) {
-            line += " '" + argument + "'";
-        }
-        line += " | /usr/bin/python3 -c 'import json, sys; answer = json.load(sys.stdin); print(" +
-                expression + ")'";
-        return runCommand({"/bin/bash", "-c", line});
-    }
-    json getAll() {
-        CommandResult all =
-            busctl("--json=short call " + std::string(kDaemonBusName) + " " + kDaemonObjectPath +
-                   " org.freedesktop.DBus.Properties GetAll s " + kStatusInterface);
-        EXPECT_EQ(all.status, 0) << all.output;
-        return json::parse(all.output)["data"][0];
-    }
 };
 
 // Read before any set, then a bundle by descriptor: the properties and GetAll agree with what
@@ -93,11 +73,7 @@ TEST_F(StatusPropertiesTest, PropertiesAnnounceEachChangeAndTakeABundleByDescrip
     EXPECT_THAT(unknown.output, HasSubstr("NoSuchProperty"));
 
     const fs::path bundle = device().base() / "bundle.tgz";
-    const auto packed = pack([&] {
-        const fs::path source = device().base() / "src";
-        writeBundle(source, "1", {{"CarrierName", "Bundle 1"}});
-        return source;
-    }());
+    const auto packed = pack(writeVersionedBundle("1"));
     test::writeText(bundle, std::string(packed.begin(), packed.end()));
     CommandResult set = sendBundle("ACME.Default", "file", bundle);
     EXPECT_EQ(set.status, 0) << set.output;
@@ -114,7 +90,11 @@ TEST_F(StatusPropertiesTest, PropertiesAnnounceEachChangeAndTakeABundleByDescrip
     EXPECT_GT((*announced)["LastPayloadUSec"].get<std::uint64_t>(), 0u);
     EXPECT_EQ((*announced)["LinkedBundlePath"], at(kUserBundle).string());
 
-    json all = getAll();
+    CommandResult getAll =
+        busctl("--json=short call " + std::string(kDaemonBusName) + " " + kDaemonObjectPath +
+               " org.freedesktop.DBus.Properties GetAll s " + kStatusInterface);
+    EXPECT_EQ(getAll.status, 0) << getAll.output;
+    json all = json::parse(getAll.output)["data"][0];
     EXPECT_EQ(all.size(), 18u) << all.dump();
     for (const auto& [name, value] : announced->items()) {
         EXPECT_EQ(all[name]["data"], value) << name;
@@ -157,11 +137,9 @@ TEST_F(StatusPropertiesTest, PropertiesAnnounceEachChangeAndTakeABundleByDescrip
     EXPECT_EQ(check.output, "b false\n");
     ASSERT_TRUE(watcher().waitForStatus({{"LastCheckOutcome", "no-catalog"}}));
     EXPECT_EQ(watcher().nextCheckFinished(10s), json({"no-catalog", "no catalog configured"}));
-}
 
-// The interface XML kept in docs/ is what the daemon introspects as: the same methods with the
-// same arguments, properties and signals, compared by Python's XML parser.
-TEST_F(StatusPropertiesTest, IntrospectionMatchesTheDocumentedInterface) {
+    // The interface XML kept in docs/ is what the daemon introspects as: the same methods with the
+    // same arguments, properties and signals, compared by Python's XML parser.
     CommandResult compared = runCommand(
         {"/bin/bash", "-c",
          "set -o pipefail; /usr/bin/busctl --address='" + busAddress() +
@@ -193,11 +171,7 @@ print("same" if documented == live else "documented %s\nlive %s" % (documented, 
 // tavrixctl as scripts use it: exit statuses, and its one JSON form read by Python's json module,
 // where a date, data, an integer, a real and the same digits as text all stay apart.
 TEST_F(StatusPropertiesTest, ScriptsGetExitStatusesAndTypedJson) {
-    ASSERT_TRUE(client().setTavrixID("acme.default", pack([&] {
-                                         const auto source = device().base() / "src";
-                                         writeBundle(source, "1", {{"CarrierName", "One"}});
-                                         return source;
-                                     }())));
+    ASSERT_TRUE(client().setTavrixID("acme.default", pack(writeVersionedBundle("1"))));
     // Binary, which keeps a date's fraction; in one step, as the daemon caches by identity.
     const plist::Dictionary settings = {{"Count", 1500},
                                         {"Text", "1500"},

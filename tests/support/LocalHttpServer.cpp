@@ -46,23 +46,6 @@ std::optional<std::string> readRequestHead(int fd) {
     return head.substr(0, head.find("\r\n\r\n"));
 }
 
-LocalHttpServer::Request parseRequest(const std::string& head) {
-    LocalHttpServer::Request request;
-    std::istringstream lines(head);
-    lines >> request.method >> request.target;
-    return request;
-}
-
-std::string responseHead(const LocalHttpServer::Response& response) {
-    std::string head =
-        "HTTP/1.0 " + std::to_string(response.status) + " " + response.reason +
-        "\r\nConnection: close\r\nContent-Length: " + std::to_string(response.body.size()) + "\r\n";
-    for (const auto& [name, value] : response.headers) {
-        head += name + ": " + value + "\r\n";
-    }
-    return head + "\r\n";
-}
-
 }  // namespace
 
 LocalHttpServer::LocalHttpServer() {
@@ -159,17 +142,20 @@ void LocalHttpServer::handleConnection(int rawFd) {
     if (!head) {
         return;
     }
-    Request request = parseRequest(*head);
-    {
-        std::lock_guard lock(mutex_);
-        requests_.push_back(request);
-    }
+    Request request;
+    std::istringstream(*head) >> request.method >> request.target;
     const Response response = responseFor(request);
     std::string_view body = response.body;
     body = body.substr(0, response.cutAfterBodyBytes.value_or(body.size()));
     const std::size_t holdAt =
         std::min(response.holdAfterBodyBytes.value_or(body.size()), body.size());
-    if (!sendAll(fd.get(), responseHead(response))) {
+    std::string answer =
+        "HTTP/1.0 " + std::to_string(response.status) + " " + response.reason +
+        "\r\nConnection: close\r\nContent-Length: " + std::to_string(response.body.size()) + "\r\n";
+    for (const auto& [name, value] : response.headers) {
+        answer += name + ": " + value + "\r\n";
+    }
+    if (!sendAll(fd.get(), answer + "\r\n")) {
         return;
     }
     if (response.trickleBytesPerSecond) {
@@ -198,8 +184,9 @@ void LocalHttpServer::handleConnection(int rawFd) {
     ::shutdown(fd.get(), SHUT_WR);
 }
 
-LocalHttpServer::Response LocalHttpServer::responseFor(const Request& request) const {
+LocalHttpServer::Response LocalHttpServer::responseFor(const Request& request) {
     std::lock_guard lock(mutex_);
+    requests_.push_back(request);
     if (auto canned = responses_.find(request.target); canned != responses_.end()) {
         return canned->second;
     }

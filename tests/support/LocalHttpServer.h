@@ -77,7 +77,8 @@ class LocalHttpServer {
   private:
     void acceptLoop();
     void handleConnection(int fd);
-    Response responseFor(const Request& request) const;
+    // Records the request and chooses its answer.
+    Response responseFor(const Request& request);
 
     io::UniqueFd listenFd_;
     std::uint16_t port_ = 0;

@@ -8,9 +8,6 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <cstdio>
-#include <cstring>
-#include <memory>
 #include <sstream>
 #include <stdexcept>
 
@@ -199,12 +196,12 @@ PrivateBus::PrivateBus(const std::optional<ActivatedDaemon>& daemon,
                  logFile.get(), logFile.get(), addressWrite.get(), environment.data());
     addressWrite.reset();
     // The first line it prints, or nothing when it ends (or never started) first.
-    std::unique_ptr<FILE, int (*)(FILE*)> in(::fdopen(addressRead.release(), "r"), &std::fclose);
-    char line[512] = "";
-    if (pid_ > 0 && in && std::fgets(line, sizeof line, in.get()) != nullptr &&
-        std::strchr(line, '\n')) {
-        address_.assign(line, std::strcspn(line, "\n"));
+    std::string line;
+    char c = 0;
+    while (pid_ > 0 && ::read(addressRead.get(), &c, 1) == 1 && c != '\n') {
+        line += c;
     }
+    address_ = c == '\n' ? line : "";
     if (address_.empty()) {
         stop();
         throw std::runtime_error("dbus-daemon did not report its address:\n" + log());
